@@ -1,0 +1,181 @@
+#include "ZEL/log.h"
+
+#include <errno.h>
+#include <stdarg.h>
+#include <syslog.h>
+#include <time.h>
+
+namespace ZEL {
+
+namespace {
+
+constexpr int kDefaultLevel = Logger::LEVEL_ERROR;
+constexpr int kDefaultRotateCount = 50;
+constexpr int32_t kRotateAbove = 0x100000;  // bytes; small enough to read, large enough for a day
+
+// Where the two rotation complaints are said to come from.
+constexpr char kSource[] = "ZEL/log";
+constexpr int kRenameLine = 145;
+constexpr int kRemoveLine = 152;
+
+class MutexGuard {
+public:
+    explicit MutexGuard(pthread_mutex_t* mutex) : mutex_(mutex) { pthread_mutex_lock(mutex_); }
+    ~MutexGuard() { pthread_mutex_unlock(mutex_); }
+    MutexGuard(const MutexGuard&) = delete;
+    MutexGuard& operator=(const MutexGuard&) = delete;
+
+private:
+    pthread_mutex_t* mutex_;
+};
+
+// A caller that logs between a failed call and its own look at errno finds errno as it was.
+class ErrnoKeeper {
+public:
+    ErrnoKeeper() : saved_(errno) {}
+    ~ErrnoKeeper() { errno = saved_; }
+    ErrnoKeeper(const ErrnoKeeper&) = delete;
+    ErrnoKeeper& operator=(const ErrnoKeeper&) = delete;
+
+private:
+    int saved_;
+};
+
+// "path_number", cut at 1023 characters.
+std::string RotatedName(const std::string& path, int number) {
+    char name[1024];
+    snprintf(name, sizeof name, "%s_%d", path.c_str(), number);
+    return name;
+}
+
+int WriteTimePrefix(FILE* stream) {
+    char prefix[512] = "";
+    const time_t now = time(nullptr);
+    struct tm local = {};
+    if (localtime_r(&now, &local) != nullptr) {
+        strftime(prefix, sizeof prefix, "%b %d %H:%M:%S ", &local);
+    }
+    return fprintf(stream, "%s", prefix);
+}
+
+}  // namespace
+
+Logger::Type Logger::log_type = Logger::SYSLOG;
+std::atomic<int> Logger::log_level{kDefaultLevel};
+FILE* Logger::log_fp = nullptr;
+std::string Logger::log_path;
+int32_t Logger::log_size = -1;
+int Logger::rotate_cnt = kDefaultRotateCount;
+pthread_mutex_t Logger::log_mutex = PTHREAD_MUTEX_INITIALIZER;
+
+int Logger::Initialize(Type type, int level, const std::string& path, int rotate_count) {
+    log_level = level;
+    log_type = type;
+    if (type == SYSLOG || type == STDOUT || type == STDERR) {
+        log_fp = type == SYSLOG ? nullptr : type == STDOUT ? stdout : stderr;
+        log_path.clear();
+        log_size = -1;
+        return 0;
+    }
+    if (path.empty()) {
+        return -1;
+    }
+    FILE* file = fopen64(path.c_str(), "ae");
+    if (file == nullptr) {
+        return -1;
+    }
+    log_type = LOGFILE;
+    log_fp = file;
+    log_size = 0;
+    log_path = path;
+    rotate_cnt = rotate_count;
+    return 0;
+}
+
+void Logger::LogMsg(Level level, const char* format, ...) {
+    // The level is looked at without the lock first: most calls are filtered, and those cost a compare.
+    // The level moves only while nobody logs, so the look under the lock below cannot differ.
+    if (level > log_level.load(std::memory_order_relaxed)) {
+        return;
+    }
+    const ErrnoKeeper keep;
+    va_list arguments;
+    va_start(arguments, format);
+    {
+        const MutexGuard lock(&log_mutex);
+        // No stream: a failed rotation has silenced the log.
+        if (level <= log_level.load(std::memory_order_relaxed) &&
+            (log_type == SYSLOG || log_fp != nullptr)) {
+            switch (log_type) {
+                case SYSLOG:
+                    vsyslog(LOG_ERR, format, arguments);
+                    break;
+                case STDOUT:
+                case STDERR:
+                case LOGFILE: {
+                    const int prefix = WriteTimePrefix(log_fp);
+                    const int message = vfprintf(log_fp, format, arguments);
+                    fflush(log_fp);
+                    if (log_type == LOGFILE && log_size >= 0 && prefix >= 0 && message >= 0) {
+                        // 64 bits: one message may be up to INT_MAX bytes long.
+                        const int64_t size = int64_t{log_size} + prefix + message;
+                        if (size > kRotateAbove) {
+                            Rotate();
+                            log_size = 0;
+                        } else {
+                            log_size = static_cast<int32_t>(size);
+                        }
+                    }
+                    break;
+                }
+                default:
+                    vfprintf(stderr, format, arguments);
+            }
+        }
+    }
+    va_end(arguments);
+}
+
+void Logger::Destroy() {
+    if (log_type != LOGFILE) {
+        return;
+    }
+    if (log_fp != nullptr) {
+        fclose(log_fp);
+    }
+    // The type says standard error while the stream is standard output: lines go to standard output.
+    log_type = STDERR;
+    log_level = kDefaultLevel;
+    log_fp = stdout;
+    log_size = -1;
+    log_path.clear();
+    rotate_cnt = kDefaultRotateCount;
+}
+
+int Logger::Rotate() {
+    // 64 bits, so that no count given to Initialize can overflow here.
+    for (int64_t i = int64_t{rotate_cnt} - 2; i >= 0; --i) {
+        const std::string from = RotatedName(log_path, static_cast<int>(i));
+        const std::string to = RotatedName(log_path, static_cast<int>(i + 1));
+        if (rename(from.c_str(), to.c_str()) != 0) {
+            syslog(LOG_ERR, "%s:%d failed to rename old_name '%s' to new_name '%s'.", kSource, kRenameLine,
+                   from.c_str(), to.c_str());
+        }
+    }
+    // The removal comes after the shift, so one file fewer survives than the count says.
+    const std::string oldest = RotatedName(log_path, static_cast<int>(int64_t{rotate_cnt} - 1));
+    if (remove(oldest.c_str()) != 0) {
+        syslog(LOG_ERR, "%s:%d failed to remove old_name '%s'.", kSource, kRemoveLine, oldest.c_str());
+    }
+    if (log_fp != nullptr) {
+        fclose(log_fp);
+        log_fp = nullptr;
+    }
+    if (rename(log_path.c_str(), RotatedName(log_path, 0).c_str()) != 0) {
+        return -1;
+    }
+    log_fp = fopen64(log_path.c_str(), "ae");
+    return log_fp == nullptr ? -1 : 0;
+}
+
+}  // namespace ZEL

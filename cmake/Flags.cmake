@@ -1,0 +1,19 @@
+# Flags that every target is compiled with, carried by the interface target zel_flags.
+add_library(zel_flags INTERFACE)
+target_compile_options(zel_flags INTERFACE
+    -Wall -Wextra -Wshadow -Wconversion -Wnon-virtual-dtor -Woverloaded-virtual -Wformat=2
+    -Werror)
+if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
+    # i386 passes doubles of a struct differently since GCC 4.6; the note is about other people's code.
+    target_compile_options(zel_flags INTERFACE -Wno-psabi)
+endif()
+# Large files on 32-bit hosts; time_t and long stay as wide as the host has them.
+target_compile_definitions(zel_flags INTERFACE _FILE_OFFSET_BITS=64)
+
+if(ZEL_SANITIZE)
+    target_compile_options(zel_flags INTERFACE
+        -fsanitize=${ZEL_SANITIZE} -fno-omit-frame-pointer -fno-sanitize-recover=all)
+    target_link_options(zel_flags INTERFACE -fsanitize=${ZEL_SANITIZE})
+else()
+    target_link_options(zel_flags INTERFACE -Wl,--no-undefined)
+endif()

@@ -1,0 +1,1 @@
+// The first operation lands with the library's own source.

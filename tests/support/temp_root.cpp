@@ -1,0 +1,53 @@
+#include "tests/support/temp_root.h"
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <stdexcept>
+
+namespace test {
+
+namespace fs = std::filesystem;
+
+TempFolder::TempFolder() {
+    std::string pattern = fs::temp_directory_path() / "zel_test.XXXXXX";
+    if (mkdtemp(pattern.data()) == nullptr) {
+        throw std::runtime_error("cannot make " + pattern);
+    }
+    path_ = pattern;
+}
+
+TempFolder::~TempFolder() {
+    std::error_code ignored;
+    fs::remove_all(path_, ignored);
+}
+
+std::string TempFolder::Path(const std::string& name) const {
+    return name.empty() ? path_ : path_ + "/" + name;
+}
+
+std::string TempFolder::Write(const std::string& name, const std::string& content) const {
+    const fs::path file = Path(name);
+    fs::create_directories(file.parent_path());
+    std::ofstream(file, std::ios::binary) << content;
+    return file;
+}
+
+TempRoot::TempRoot() {
+    for (const char* folder : {"usr/tarq/etc", "var/run", "var/log", "tmp/ZEL"}) {
+        fs::create_directories(Path(folder));
+    }
+    setenv("TARQ_ROOT", Path().c_str(), 1);
+}
+
+TempRoot::~TempRoot() {
+    unsetenv("TARQ_ROOT");
+}
+
+std::string ReadFile(const std::string& path) {
+    std::ifstream file(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(file), {}};
+}
+
+}  // namespace test
