@@ -108,6 +108,11 @@ std::optional<Candidate> Examine(const fs::path& folder, const std::string& name
     return candidate;
 }
 
+/// Digits that stand together count as one number: "eth2" comes before "eth10".
+bool NaturalLess(const std::string& a, const std::string& b) {
+    return strverscmp(a.c_str(), b.c_str()) < 0;
+}
+
 bool ComesBefore(const Candidate& a, const Candidate& b) {
     const auto rank = [](const Candidate& c) { return std::tie(c.kind, c.random, c.local, c.usb); };
     if (rank(a) != rank(b)) {
@@ -120,10 +125,6 @@ bool ComesBefore(const Candidate& a, const Candidate& b) {
 }
 
 }  // namespace
-
-bool NaturalLess(const std::string& a, const std::string& b) {
-    return strverscmp(a.c_str(), b.c_str()) < 0;
-}
 
 std::optional<std::vector<Interface>> ListInterfaces(const std::string& sys) {
     std::error_code error;

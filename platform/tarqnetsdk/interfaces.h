@@ -18,8 +18,4 @@ struct Interface {
 /// listed.
 std::optional<std::vector<Interface>> ListInterfaces(const std::string& sys);
 
-/// Whether `a` comes before `b` when digits that stand together count as one number: "eth2" before
-/// "eth10".
-bool NaturalLess(const std::string& a, const std::string& b);
-
 }  // namespace tarq_net
