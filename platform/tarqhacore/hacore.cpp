@@ -6,24 +6,24 @@
 #include <string>
 
 #include "platform/internal/config.h"
+#include "platform/internal/error.h"
 
 namespace {
 
 using tarq_internal::CopyOut;
+using tarq_internal::Guarded;
 using tarq_internal::ReadResult;
 using tarq_internal::ReadSection;
 using tarq_internal::Section;
 using tarq_internal::ValueOf;
 
-constexpr char kSource[] = "tarq/hacore";
 constexpr char kConfiguration[] = "/usr/tarq/etc/tarqha.conf";
 constexpr char kSection[] = "pair";
 constexpr size_t kMacBytes = 6;
 constexpr size_t kMacText = 3 * kMacBytes - 1;
 
-int Fail(int code, int line) {
-    KAPICErrSetEx(code, kSource, line);
-    return -1;
+int Fail(int code, int line = __builtin_LINE()) {
+    return tarq_internal::Fail(code, "tarq/hacore", line);
 }
 
 ReadResult ReadPair(Section* pair) {
@@ -61,27 +61,31 @@ std::string NormalMac(const std::string& text) {
 }  // namespace
 
 int TARQHAIsRunning(void) {
-    Section pair;
-    return ReadPair(&pair) == ReadResult::kFound && ValueOf(pair, "running") == "yes" ? 1 : 0;
+    return Guarded(0, [&] {
+        Section pair;
+        return ReadPair(&pair) == ReadResult::kFound && ValueOf(pair, "running") == "yes" ? 1 : 0;
+    });
 }
 
 int TARQHAGetMac(int index, char* buffer, int size) {
-    if (!CopyOut("", buffer, size) || index < 0) {
-        return Fail(TARQ_ERR_BAD_PARAMETER, __LINE__);
-    }
-    Section pair;
-    switch (ReadPair(&pair)) {
-        case ReadResult::kFailed:
-            return -1;
-        case ReadResult::kAbsent:
-            return Fail(TARQ_ERR_NO_SECTION, __LINE__);
-        case ReadResult::kFound:
-            break;
-    }
-    const auto configured = pair.find("mac" + std::to_string(index));
-    if (configured == pair.end()) {
-        return Fail(TARQ_ERR_NO_KEY, __LINE__);
-    }
-    const std::string mac = NormalMac(configured->second);
-    return !mac.empty() && CopyOut(mac, buffer, size) ? 0 : Fail(TARQ_ERR_BAD_PARAMETER, __LINE__);
+    return Guarded(-1, [&] {
+        if (!CopyOut("", buffer, size) || index < 0) {
+            return Fail(TARQ_ERR_BAD_PARAMETER);
+        }
+        Section pair;
+        switch (ReadPair(&pair)) {
+            case ReadResult::kFailed:
+                return -1;
+            case ReadResult::kAbsent:
+                return Fail(TARQ_ERR_NO_SECTION);
+            case ReadResult::kFound:
+                break;
+        }
+        const auto configured = pair.find("mac" + std::to_string(index));
+        if (configured == pair.end()) {
+            return Fail(TARQ_ERR_NO_KEY);
+        }
+        const std::string mac = NormalMac(configured->second);
+        return !mac.empty() && CopyOut(mac, buffer, size) ? 0 : Fail(TARQ_ERR_BAD_PARAMETER);
+    });
 }

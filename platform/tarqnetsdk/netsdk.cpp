@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "platform/internal/config.h"
+#include "platform/internal/error.h"
 #include "platform/tarqnetsdk/interfaces.h"
 
 static_assert(sizeof(TARQNetAddress) == 52, "callers lay out arrays of 52-byte records");
@@ -20,12 +21,10 @@ static_assert(sizeof(TARQNetAddress) == 52, "callers lay out arrays of 52-byte r
 namespace {
 
 using tarq_internal::CopyOut;
+using tarq_internal::Guarded;
 
-constexpr char kSource[] = "tarq/netsdk";
-
-int Fail(int code, int line) {
-    KAPICErrSetEx(code, kSource, line);
-    return -1;
+int Fail(int code, int line = __builtin_LINE()) {
+    return tarq_internal::Fail(code, "tarq/netsdk", line);
 }
 
 struct AddressListFree {
@@ -56,68 +55,72 @@ std::string TextOf(const addrinfo& info) {
 }  // namespace
 
 int KAPINetGetInterfaceInfo(KAPINetInterface* records, int count, int flags) {
-    if (records == nullptr || count < 0) {
-        return Fail(TARQ_ERR_BAD_PARAMETER, __LINE__);
-    }
-    const std::optional<std::vector<tarq_net::Interface>> interfaces =
-        tarq_net::ListInterfaces("/sys");
-    if (!interfaces) {
-        return Fail(TARQ_ERR_READ_FILE, __LINE__);
-    }
-    int filled = 0;
-    for (const tarq_net::Interface& interface : *interfaces) {
-        if (filled == count) {
-            break;
+    return Guarded(-1, [&] {
+        if (records == nullptr || count < 0) {
+            return Fail(TARQ_ERR_BAD_PARAMETER);
         }
-        if (!interface.up && (flags & TARQ_NET_INCLUDE_DOWN) == 0) {
-            continue;
+        const std::optional<std::vector<tarq_net::Interface>> interfaces =
+            tarq_net::ListInterfaces("/sys");
+        if (!interfaces) {
+            return Fail(TARQ_ERR_READ_FILE);
         }
-        KAPINetInterface& record = records[filled++];
-        record = {};
-        CopyOut(interface.name, record.name, sizeof record.name);
-        std::copy(interface.mac.begin(), interface.mac.end(), record.mac);
-    }
-    return filled;
+        int filled = 0;
+        for (const tarq_net::Interface& interface : *interfaces) {
+            if (filled == count) {
+                break;
+            }
+            if (!interface.up && (flags & TARQ_NET_INCLUDE_DOWN) == 0) {
+                continue;
+            }
+            KAPINetInterface& record = records[filled++];
+            record = {};
+            CopyOut(interface.name, record.name, sizeof record.name);
+            std::copy(interface.mac.begin(), interface.mac.end(), record.mac);
+        }
+        return filled;
+    });
 }
 
 int TARQNetLookupIP(const char* name, TARQNetAddress* records, int count, int /*flags*/) {
-    if (name == nullptr || *name == '\0' || records == nullptr || count < 0) {
-        return Fail(TARQ_ERR_BAD_PARAMETER, __LINE__);
-    }
-    addrinfo hints{};
-    hints.ai_family = AF_UNSPEC;
-    hints.ai_socktype = SOCK_STREAM;
-    addrinfo* found = nullptr;
-    const int result = getaddrinfo(name, nullptr, &hints, &found);
-    if (result != 0) {
-        return IsUnknownName(result) ? 0 : Fail(TARQ_ERR_LOOKUP, __LINE__);
-    }
-    const AddressList list(found);
+    return Guarded(-1, [&] {
+        if (name == nullptr || *name == '\0' || records == nullptr || count < 0) {
+            return Fail(TARQ_ERR_BAD_PARAMETER);
+        }
+        addrinfo hints{};
+        hints.ai_family = AF_UNSPEC;
+        hints.ai_socktype = SOCK_STREAM;
+        addrinfo* found = nullptr;
+        const int result = getaddrinfo(name, nullptr, &hints, &found);
+        if (result != 0) {
+            return IsUnknownName(result) ? 0 : Fail(TARQ_ERR_LOOKUP);
+        }
+        const AddressList list(found);
 
-    std::vector<std::string> addresses;
-    for (const int family : {AF_INET, AF_INET6}) {
-        for (const addrinfo* info = list.get(); info != nullptr; info = info->ai_next) {
-            if (info->ai_family != family) {
-                continue;
+        std::vector<std::string> addresses;
+        for (const int family : {AF_INET, AF_INET6}) {
+            for (const addrinfo* info = list.get(); info != nullptr; info = info->ai_next) {
+                if (info->ai_family != family) {
+                    continue;
+                }
+                std::string text = TextOf(*info);
+                if (!text.empty() &&
+                    std::find(addresses.begin(), addresses.end(), text) == addresses.end()) {
+                    addresses.push_back(std::move(text));
+                }
             }
-            std::string text = TextOf(*info);
-            if (!text.empty() &&
-                std::find(addresses.begin(), addresses.end(), text) == addresses.end()) {
-                addresses.push_back(std::move(text));
+        }
+        int filled = 0;
+        for (const std::string& address : addresses) {
+            if (filled == count) {
+                break;
+            }
+            TARQNetAddress record{};
+            // A zone's long name can make the text too long for the record; such an address is
+            // passed over.
+            if (CopyOut(address, record.address, sizeof record.address)) {
+                records[filled++] = record;
             }
         }
-    }
-    int filled = 0;
-    for (const std::string& address : addresses) {
-        if (filled == count) {
-            break;
-        }
-        TARQNetAddress record{};
-        // A zone's long name can make the text too long for the record; such an address is passed
-        // over.
-        if (CopyOut(address, record.address, sizeof record.address)) {
-            records[filled++] = record;
-        }
-    }
-    return filled;
+        return filled;
+    });
 }

@@ -15,6 +15,7 @@
 #include <memory>
 
 #include "platform/internal/config.h"
+#include "platform/internal/error.h"
 #include "platform/internal/utf8.h"
 
 namespace tarq_share {
@@ -25,7 +26,6 @@ using tarq_internal::ReadSection;
 using tarq_internal::Section;
 using tarq_internal::ValueOf;
 
-constexpr char kSource[] = "tarq/share_catalogue";
 constexpr char kCatalogue[] = "/usr/tarq/etc/tarqshare.conf";
 constexpr char kLockFile[] = "/usr/tarq/etc/tarqshare.conf.lock";
 constexpr char kKeyFolder[] = "/usr/tarq/etc/.encrypt/";
@@ -55,13 +55,13 @@ struct HashFree {
     void operator()(KAPICSzHash hash) const { KAPICSzHashFree(hash); }
 };
 
-std::nullopt_t Nothing(int code, int line) {
-    KAPICErrSetEx(code, kSource, line);
+std::nullopt_t Nothing(int code, int line = __builtin_LINE()) {
+    tarq_internal::Fail(code, "tarq/share_catalogue", line);
     return std::nullopt;
 }
 
-bool Refuse(int code, int line) {
-    KAPICErrSetEx(code, kSource, line);
+bool Refuse(int code, int line = __builtin_LINE()) {
+    Nothing(code, line);
     return false;
 }
 
@@ -166,7 +166,7 @@ std::optional<Share> ReadShare(const std::string& name) {
         case ReadResult::kFailed:
             return std::nullopt;
         case ReadResult::kAbsent:
-            return Nothing(TARQ_ERR_NO_SHARE, __LINE__);
+            return Nothing(TARQ_ERR_NO_SHARE);
         case ReadResult::kFound:
             break;
     }
@@ -180,7 +180,7 @@ std::optional<Share> ReadShare(const std::string& name) {
     const std::string key_length = ValueOf(section, "key_length");
     if (!flags || (!key_length.empty() && !ParseWhole(key_length, 10, &share.key_length)) ||
         share.key_length < 0 || !IsAbsoluteOrEmpty(share.path)) {
-        return Nothing(TARQ_ERR_BAD_PARAMETER, __LINE__);
+        return Nothing(TARQ_ERR_BAD_PARAMETER);
     }
     share.flags = *flags;
     if (share.IsEncrypted() && !share.path.empty()) {
@@ -193,7 +193,7 @@ std::optional<Share> ReadShare(const std::string& name) {
     share.key_file = Or(ValueOf(section, "key_file"), keys + "@" + name);
     if (!IsAbsoluteOrEmpty(share.encrypted_path) || share.auto_key_file.front() != '/' ||
         share.key_file.front() != '/') {
-        return Nothing(TARQ_ERR_BAD_PARAMETER, __LINE__);
+        return Nothing(TARQ_ERR_BAD_PARAMETER);
     }
     share.volume = {ValueOf(section, "volume"), ValueOf(section, "volume_fs"),
                     ValueOf(section, "volume_uuid"), TARQ_VOLUME_UNKNOWN};
@@ -241,7 +241,7 @@ bool EraseShare(const std::string& name) {
     const std::string path = CataloguePath();
     const int result =
         KAPICFileExist(path.c_str()) == 0 ? 0 : KAPICFileRemoveSection(path.c_str(), name.c_str());
-    return result > 0 || (result == 0 && Refuse(TARQ_ERR_NO_SHARE, __LINE__));
+    return result > 0 || (result == 0 && Refuse(TARQ_ERR_NO_SHARE));
 }
 
 CatalogueLock::CatalogueLock()
@@ -249,14 +249,14 @@ CatalogueLock::CatalogueLock()
     : file_(open(TARQ::RootPath(kLockFile).c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW,
                  0600)) {
     if (!file_) {
-        Refuse(TARQ_ERR_OPEN_FILE, __LINE__);
+        Refuse(TARQ_ERR_OPEN_FILE);
         return;
     }
     int result = 0;
     do {
         result = flock(file_.Get(), LOCK_EX);
     } while (result != 0 && errno == EINTR);
-    locked_ = result == 0 || Refuse(TARQ_ERR_OPEN_FILE, __LINE__);
+    locked_ = result == 0 || Refuse(TARQ_ERR_OPEN_FILE);
 }
 
 }  // namespace tarq_share

@@ -30,7 +30,7 @@ std::string FullName(const std::string& unit) {
 Status BusUnits::StatusOf(const std::string& unit) {
     UnitState state;
     if (!GetState(unit, &state)) {
-        Failed(TARQ_ERR_SERVICE, __LINE__);
+        Failed(TARQ_ERR_SERVICE);
         return Status::kUnknown;
     }
     return state.active == "active" || state.active == "reloading" ? Status::kActive
@@ -40,7 +40,7 @@ Status BusUnits::StatusOf(const std::string& unit) {
 Outcome BusUnits::Start(const std::string& unit) {
     UnitState state;
     if (!GetState(unit, &state)) {
-        return Failed(TARQ_ERR_SERVICE, __LINE__);
+        return Failed(TARQ_ERR_SERVICE);
     }
     // A unit that waits for its next attempt after a failure is "activating" too, and may be
     // started at once.
@@ -70,7 +70,7 @@ Outcome BusUnits::Run(const char* method, const std::string& unit) {
     const int error = bus_ ? bus_->RunJob(method, FullName(unit), kJobLimit, &result) : -ENOTCONN;
     if (error < 0 || result != "done") {
         errno = error < 0 ? -error : EIO;
-        return Failed(TARQ_ERR_SERVICE, __LINE__);
+        return Failed(TARQ_ERR_SERVICE);
     }
     return Outcome::kDone;
 }

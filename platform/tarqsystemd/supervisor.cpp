@@ -98,13 +98,13 @@ std::vector<std::string> ReadCommand(const std::string& unit) {
         return {};
     }
     if (command == section.end()) {
-        Failed(result == ReadResult::kFound ? TARQ_ERR_NO_KEY : TARQ_ERR_NO_SECTION, __LINE__);
+        Failed(result == ReadResult::kFound ? TARQ_ERR_NO_KEY : TARQ_ERR_NO_SECTION);
         return {};
     }
     std::vector<std::string> words =
         SplitCommand(command->second).value_or(std::vector<std::string>());
     if (words.empty() || words[0].empty() || words[0][0] != '/') {
-        Failed(TARQ_ERR_BAD_PARAMETER, __LINE__);
+        Failed(TARQ_ERR_BAD_PARAMETER);
         return {};
     }
     return words;
@@ -126,7 +126,7 @@ bool ReadStopLimit(const std::string& unit, seconds* limit) {
     const char* end = text.data() + text.size();
     const auto [stop, error] = std::from_chars(text.data(), end, number);
     if (error != std::errc() || stop != end || number < 0 || number > kLongestStopLimit) {
-        Failed(TARQ_ERR_BAD_PARAMETER, __LINE__);
+        Failed(TARQ_ERR_BAD_PARAMETER);
         return false;
     }
     *limit = seconds(number);
@@ -138,7 +138,7 @@ bool ReadStopLimit(const std::string& unit, seconds* limit) {
 Status Supervisor::StatusOf(const std::string& unit) {
     std::optional<Process> process;
     if (!FindProcess(unit, &process)) {
-        Failed(TARQ_ERR_SERVICE, __LINE__);
+        Failed(TARQ_ERR_SERVICE);
         return Status::kUnknown;
     }
     return process ? Status::kActive : Status::kInactive;
@@ -148,7 +148,7 @@ Outcome Supervisor::Start(const std::string& unit) {
     const UnitLock lock(unit);
     std::optional<Process> process;
     if (!lock || !FindProcess(unit, &process)) {
-        return Failed(TARQ_ERR_SERVICE, __LINE__);
+        return Failed(TARQ_ERR_SERVICE);
     }
     if (process) {
         return Outcome::kDone;
@@ -161,13 +161,13 @@ Outcome Supervisor::Start(const std::string& unit) {
     // nobody can stop.
     auto launch = BackgroundLaunch::Prepare(command);
     if (!launch || !WritePidFile(unit, launch->Id())) {
-        return Failed(TARQ_ERR_SERVICE, __LINE__);
+        return Failed(TARQ_ERR_SERVICE);
     }
     if (!launch->Release()) {
         const int reason = errno;
         unlink(PidFile(unit).c_str());
         errno = reason;
-        return Failed(TARQ_ERR_SERVICE, __LINE__);
+        return Failed(TARQ_ERR_SERVICE);
     }
     return Outcome::kDone;
 }
@@ -176,7 +176,7 @@ Outcome Supervisor::Stop(const std::string& unit) {
     const UnitLock lock(unit);
     std::optional<Process> process;
     if (!lock || !FindProcess(unit, &process)) {
-        return Failed(TARQ_ERR_SERVICE, __LINE__);
+        return Failed(TARQ_ERR_SERVICE);
     }
     if (process) {
         seconds limit;
@@ -184,12 +184,12 @@ Outcome Supervisor::Stop(const std::string& unit) {
             return Outcome::kFailed;
         }
         if (!process->Signal(SIGTERM)) {
-            return Failed(TARQ_ERR_SERVICE, __LINE__);
+            return Failed(TARQ_ERR_SERVICE);
         }
         if (!process->WaitForEnd(limit) &&
             (!process->KillGroup() || !process->WaitForEnd(kKillLimit))) {
             errno = ETIMEDOUT;
-            return Failed(TARQ_ERR_SERVICE, __LINE__);
+            return Failed(TARQ_ERR_SERVICE);
         }
     }
     unlink(PidFile(unit).c_str());

@@ -15,11 +15,11 @@
 
 namespace {
 
+using tarq_internal::Guarded;
 using tarq_systemd::Outcome;
 using tarq_systemd::Status;
 using tarq_systemd::UnitManager;
 
-constexpr char kSource[] = "tarq/systemd";
 constexpr size_t kMaxUnitName = 200;  // with a suffix of ours it still is a file's name
 
 std::unique_ptr<UnitManager> Manager() {
@@ -38,7 +38,7 @@ bool IsUnitName(const char* unit) {
     const std::string name = unit == nullptr ? "" : unit;
     if (name.empty() || name.size() > kMaxUnitName || name.front() == '.' ||
         !std::all_of(name.begin(), name.end(), allowed)) {
-        KAPICErrSetEx(TARQ_ERR_BAD_PARAMETER, kSource, __LINE__);
+        tarq_systemd::Failed(TARQ_ERR_BAD_PARAMETER);
         return false;
     }
     return true;
@@ -46,37 +46,34 @@ bool IsUnitName(const char* unit) {
 
 int Verdict(Outcome outcome) {
     if (outcome == Outcome::kBusy) {
-        KAPICErrSetEx(TARQ_ERR_SERVICE_BUSY, kSource, __LINE__);
+        tarq_systemd::Failed(TARQ_ERR_SERVICE_BUSY);
     }
     return outcome == Outcome::kDone ? 1 : 0;
 }
 
 }  // namespace
 
-tarq_systemd::Outcome tarq_systemd::Failed(int code, int line) {
-    KAPICErrSetEx(code, kSource, line);
-    return Outcome::kFailed;
-}
-
 int TARQSystemdActiveStatusGet(const char* unit) {
-    if (!IsUnitName(unit)) {
+    return Guarded(-1, [&] {
+        if (!IsUnitName(unit)) {
+            return -1;
+        }
+        switch (Manager()->StatusOf(unit)) {
+            case Status::kActive:
+                return 1;
+            case Status::kInactive:
+                return 0;
+            case Status::kUnknown:
+                break;
+        }
         return -1;
-    }
-    switch (Manager()->StatusOf(unit)) {
-        case Status::kActive:
-            return 1;
-        case Status::kInactive:
-            return 0;
-        case Status::kUnknown:
-            break;
-    }
-    return -1;
+    });
 }
 
 int TARQSystemdStart(const char* unit) {
-    return IsUnitName(unit) ? Verdict(Manager()->Start(unit)) : 0;
+    return Guarded(0, [&] { return IsUnitName(unit) ? Verdict(Manager()->Start(unit)) : 0; });
 }
 
 int TARQSystemdStop(const char* unit) {
-    return IsUnitName(unit) ? Verdict(Manager()->Stop(unit)) : 0;
+    return Guarded(0, [&] { return IsUnitName(unit) ? Verdict(Manager()->Stop(unit)) : 0; });
 }

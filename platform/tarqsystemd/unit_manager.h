@@ -1,8 +1,9 @@
 // What starts and stops units: the system manager, or the supervisor where there is none.
 #pragma once
 
-#include <memory>
 #include <string>
+
+#include "platform/internal/error.h"
 
 namespace tarq_systemd {
 
@@ -23,7 +24,10 @@ public:
     virtual Outcome Stop(const std::string& unit) = 0;
 };
 
-/// Sets the error code to `code` with a position in this library, and gives kFailed.
-Outcome Failed(int code, int line);
+/// Sets the error code, errno kept, and gives kFailed.
+inline Outcome Failed(int code, int line = __builtin_LINE()) {
+    tarq_internal::Fail(code, "tarq/systemd", line);
+    return Outcome::kFailed;
+}
 
 }  // namespace tarq_systemd
