@@ -3,10 +3,13 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
-#include <sys/pidfd.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+extern "C" {  // the header has no such thing of its own
+#include <sys/pidfd.h>
+}
 
 #include <array>
 #include <cerrno>
