@@ -21,7 +21,8 @@ private:
     std::string path_;
 };
 
-/// A TempFolder that is the system's root (TARQ_ROOT) while it lives, with the folders that the system expects.
+/// A TempFolder that is the system's root (TARQ_ROOT) while it lives, with the folders that the system expects. Takes the
+/// registry's semaphore with it.
 class TempRoot : public TempFolder {
 public:
     TempRoot();
