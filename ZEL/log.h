@@ -48,8 +48,8 @@ public:
     /// file already holds does not count towards its size. Any type but 0, 1 and 2 means a file.
     ///
     /// Returns 0, or -1 when the path is empty or the file cannot be opened; type and level are set
-    /// all the same. May be called again to switch; a file of an earlier call stays open until
-    /// Destroy or the next rotation of its own.
+    /// all the same, and the stream of an earlier call stays in use. May be called again to switch;
+    /// a file that an earlier call opened is not closed then.
     static int Initialize(Type type, int level, const std::string& path, int rotate_cnt);
 
     /// Writes one message, formatted as printf does it, when `level` is not above the chosen one.

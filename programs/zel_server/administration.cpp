@@ -138,7 +138,8 @@ int Setup(const SetupOptions& options) {
         }
         config.volumes[name] = volume.substr(equals + 1);
     }
-    if (geteuid() == 0) {
+    // A server in a folder of its own leaves the machine's users alone.
+    if (is_system) {
         config.user = options.user.empty() ? kStorageUser : options.user;
         if (!HaveStorageUser(config.user)) {
             return Fail("cannot make the system user '" + config.user + "' that owns the copies");

@@ -105,7 +105,7 @@ bool WriteShareModule(const ServerConfig& config, const std::string& share,
         text << "    refuse options = acls xattrs\n";
     }
     if (IsRoot()) {
-        const std::string user = config.user.empty() ? "nobody" : config.user;
+        const std::string user = config.user.empty() ? "root" : config.user;
         text << "    uid = " << user << "\n    gid = *\n    use chroot = yes\n";
     } else {
         text << "    use chroot = no\n";
