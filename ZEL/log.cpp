@@ -93,8 +93,9 @@ int Logger::Initialize(Type type, int level, const std::string& path, int rotate
 }
 
 void Logger::LogMsg(Level level, const char* format, ...) {
-    // The level is looked at without the lock first: most calls are filtered, and those cost a compare.
-    // The level moves only while nobody logs, so the look under the lock below cannot differ.
+    // The level is looked at without the lock first: most calls are filtered, and those cost a
+    // compare. The level moves only while nobody logs, so the look under the lock below cannot
+    // differ.
     if (level > log_level.load(std::memory_order_relaxed)) {
         return;
     }
@@ -143,7 +144,8 @@ void Logger::Destroy() {
     if (log_fp != nullptr) {
         fclose(log_fp);
     }
-    // The type says standard error while the stream is standard output: lines go to standard output.
+    // The type says standard error while the stream is standard output: lines go to standard
+    // output.
     log_type = STDERR;
     log_level = kDefaultLevel;
     log_fp = stdout;
@@ -158,14 +160,15 @@ int Logger::Rotate() {
         const std::string from = RotatedName(log_path, static_cast<int>(i));
         const std::string to = RotatedName(log_path, static_cast<int>(i + 1));
         if (rename(from.c_str(), to.c_str()) != 0) {
-            syslog(LOG_ERR, "%s:%d failed to rename old_name '%s' to new_name '%s'.", kSource, kRenameLine,
-                   from.c_str(), to.c_str());
+            syslog(LOG_ERR, "%s:%d failed to rename old_name '%s' to new_name '%s'.", kSource,
+                   kRenameLine, from.c_str(), to.c_str());
         }
     }
     // The removal comes after the shift, so one file fewer survives than the count says.
     const std::string oldest = RotatedName(log_path, static_cast<int>(int64_t{rotate_cnt} - 1));
     if (remove(oldest.c_str()) != 0) {
-        syslog(LOG_ERR, "%s:%d failed to remove old_name '%s'.", kSource, kRemoveLine, oldest.c_str());
+        syslog(LOG_ERR, "%s:%d failed to remove old_name '%s'.", kSource, kRemoveLine,
+               oldest.c_str());
     }
     if (log_fp != nullptr) {
         fclose(log_fp);

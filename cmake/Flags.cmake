@@ -12,7 +12,8 @@ target_compile_definitions(zel_flags INTERFACE _FILE_OFFSET_BITS=64)
 
 if(ZEL_SANITIZE)
     target_compile_options(zel_flags INTERFACE
-        -fsanitize=${ZEL_SANITIZE} -fno-omit-frame-pointer -fno-sanitize-recover=all)
+        -fsanitize=${ZEL_SANITIZE} -fno-omit-frame-pointer -fno-sanitize-recover=all
+        $<$<CXX_COMPILER_ID:GNU>:-Wno-maybe-uninitialized>)  # sees ghosts in instrumented code
     target_link_options(zel_flags INTERFACE -fsanitize=${ZEL_SANITIZE})
 else()
     target_link_options(zel_flags INTERFACE -Wl,--no-undefined)

@@ -1,0 +1,72 @@
+#include "platform/tarqcore/error.h"
+
+#include <cerrno>
+
+namespace {
+
+// Nothing reads the position back: it is there for whoever looks at a core file or a debugger.
+struct ErrorState {
+    int code = TARQ_ERR_NONE;
+    const char* file = "";
+    int line = 0;
+};
+
+thread_local ErrorState error_state;
+
+}  // namespace
+
+int KAPICErrGet(void) {
+    return error_state.code;
+}
+
+void KAPICErrSetEx(int code, const char* file, int line) {
+    error_state = {code, file, line};
+}
+
+const char* KAPICErrText(int code) {
+    switch (code) {
+        case TARQ_ERR_NONE:
+            return "no error";
+        case TARQ_ERR_NO_MEMORY:
+            return "out of memory";
+        case TARQ_ERR_OPEN_FILE:
+            return "cannot open the file";
+        case TARQ_ERR_READ_FILE:
+            return "cannot read the file";
+        case TARQ_ERR_WRITE_FILE:
+            return "cannot write the file";
+        case TARQ_ERR_BAD_PARAMETER:
+            return "bad parameter";
+        case TARQ_ERR_SEMAPHORE:
+            return "semaphore failure";
+        case TARQ_ERR_NO_SHARE:
+            return "no such share";
+        case TARQ_ERR_SHARE_VOLUME:
+            return "the share's volume is not mounted";
+        case TARQ_ERR_SHARE_EXISTS:
+            return "the share exists already";
+        case TARQ_ERR_NO_KEY:
+            return "no such key";
+        case TARQ_ERR_NO_SECTION:
+            return "no such section";
+        case TARQ_ERR_NO_VOLUME:
+            return "no such volume";
+        case TARQ_ERR_SERVICE:
+            return "the service manager refused or cannot be reached";
+        case TARQ_ERR_SERVICE_BUSY:
+            return "the service is being started already";
+        default:
+            return "unknown error";
+    }
+}
+
+namespace tarqcore {
+
+int Fail(TARQErrorCode code, int line, const char* file) {
+    const int saved = errno;
+    KAPICErrSetEx(code, file, line);
+    errno = saved;  // a test or another host may have put its own KAPICErrSetEx in front
+    return -1;
+}
+
+}  // namespace tarqcore

@@ -1,0 +1,181 @@
+#include "platform/tarqcore/section_image.h"
+
+#include <string.h>
+
+#include <algorithm>
+#include <numeric>
+
+namespace tarqcore {
+namespace {
+
+constexpr std::string_view kByteOrderMark = "\xEF\xBB\xBF";
+constexpr size_t kNone = std::string_view::npos;
+
+// Look-ups that scan before an index is made: it costs about as much as these together, and a
+// process that asks for two or three keys and ends never needs it.
+constexpr unsigned kScansBeforeIndex = 8;
+
+bool IsBlank(char c) {
+    return c == ' ' || c == '\t' || c == '\r';
+}
+
+std::string_view Trimmed(std::string_view text) {
+    while (!text.empty() && IsBlank(text.front())) {
+        text.remove_prefix(1);
+    }
+    while (!text.empty() && IsBlank(text.back())) {
+        text.remove_suffix(1);
+    }
+    return text;
+}
+
+}  // namespace
+
+std::optional<KeyLine> ParseKeyLine(std::string_view line) {
+    const std::string_view trimmed = Trimmed(line);
+    const size_t equals = trimmed.find('=');
+    if (equals == kNone || trimmed.front() == '#' || trimmed.front() == '[' ||
+        trimmed.find('\0') != kNone) {
+        return std::nullopt;
+    }
+    const std::string_view key = Trimmed(trimmed.substr(0, equals));
+    if (key.empty() || key.find('"') != kNone) {
+        return std::nullopt;
+    }
+    std::string_view value = Trimmed(trimmed.substr(equals + 1));
+    if (value.size() >= 2 && value.front() == '"') {
+        const size_t last_quote = value.rfind('"');
+        if (last_quote > 0) {
+            value = value.substr(1, last_quote - 1);
+        }
+    }
+    const auto indent = static_cast<size_t>(trimmed.data() - line.data());
+    return KeyLine{line.substr(0, indent), key, value};
+}
+
+bool TakeLine(std::string_view& text, std::string_view& line) {
+    if (text.empty()) {
+        return false;
+    }
+    const size_t line_break = text.find('\n');
+    line = text.substr(0, line_break);
+    text.remove_prefix(line_break == kNone ? text.size() : line_break + 1);
+    return true;
+}
+
+SectionImage::SectionImage(std::unique_ptr<char[]> text, size_t size)
+    : text_(std::move(text)), size_(size) {
+    const bool marked = Text().substr(0, kByteOrderMark.size()) == kByteOrderMark;
+    first_ = marked ? kByteOrderMark.size() : 0;
+}
+
+std::string_view SectionImage::Body(const Section& section) const {
+    std::string_view body = Text().substr(section.begin, section.end - section.begin);
+    std::string_view header;
+    TakeLine(body, header);
+    return body;
+}
+
+std::optional<Section> SectionImage::Find(std::string_view name) const {
+    if (scans_.load(std::memory_order_relaxed) < kScansBeforeIndex) {
+        scans_.fetch_add(1, std::memory_order_relaxed);
+        return FindFrom(name, 0);
+    }
+    const std::vector<uint32_t>& by_name = ByName();
+    const auto found = std::lower_bound(
+        by_name.begin(), by_name.end(), name,
+        [this](uint32_t at, std::string_view wanted) { return Name(sections_[at]) < wanted; });
+    if (found == by_name.end() || Name(sections_[*found]) != name) {
+        return std::nullopt;
+    }
+    return sections_[*found];
+}
+
+std::optional<Section> SectionImage::FindFrom(std::string_view name, size_t from) const {
+    if (name.find_first_of(std::string_view("]\n\0", 3)) != kNone) {
+        return std::nullopt;  // no header can say that
+    }
+    std::string needle = "[";
+    needle.append(name).append("]");
+    for (size_t at = std::max(from, first_); at < size_; ++at) {
+        const void* found = memmem(text_.get() + at, size_ - at, needle.data(), needle.size());
+        if (found == nullptr) {
+            break;
+        }
+        at = static_cast<size_t>(static_cast<const char*>(found) - text_.get());
+        const size_t begin = LineBegin(at);
+        if (begin != kNone) {
+            return Section{static_cast<uint32_t>(begin), static_cast<uint32_t>(at + 1),
+                           static_cast<uint32_t>(name.size()),
+                           static_cast<uint32_t>(NextHeaderBegin(at + needle.size()))};
+        }
+    }
+    return std::nullopt;
+}
+
+const std::vector<Section>& SectionImage::Sections() const {
+    std::call_once(sections_once_, [this] {
+        std::vector<Section> sections;
+        for (std::optional<Section> header = NextHeader(first_); header;
+             header = NextHeader(header->name + header->name_size)) {
+            if (!sections.empty()) {
+                sections.back().end = header->begin;
+            }
+            sections.push_back(*header);
+        }
+        sections_ = std::move(sections);
+    });
+    return sections_;
+}
+
+// Where the line begins whose first character but blanks is at `at`; kNone when others stand before
+// it.
+size_t SectionImage::LineBegin(size_t at) const {
+    while (at > first_ && IsBlank(text_[at - 1])) {
+        --at;
+    }
+    return at == first_ || text_[at - 1] == '\n' ? at : kNone;
+}
+
+// The first header at or behind `from`, as if its section ran to the end of the text. Goes from
+// bracket to bracket rather than from line to line. Each byte is looked at a bounded number of
+// times, whatever the text: the search back stops at the bracket before, the search for the name's
+// end at the line's.
+std::optional<Section> SectionImage::NextHeader(size_t from) const {
+    const std::string_view text = Text();
+    for (size_t at = text.find('[', from); at != kNone; at = text.find('[', at + 1)) {
+        const size_t begin = LineBegin(at);
+        if (begin == kNone) {
+            continue;
+        }
+        const std::string_view rest = text.substr(at + 1);
+        const std::string_view line = rest.substr(0, rest.find('\n'));
+        const size_t name_size = line.find(']');
+        if (name_size != kNone && line.substr(0, name_size).find('\0') == kNone) {
+            return Section{static_cast<uint32_t>(begin), static_cast<uint32_t>(at + 1),
+                           static_cast<uint32_t>(name_size), static_cast<uint32_t>(size_)};
+        }
+    }
+    return std::nullopt;
+}
+
+size_t SectionImage::NextHeaderBegin(size_t from) const {
+    const std::optional<Section> next = NextHeader(from);
+    return next ? next->begin : size_;
+}
+
+const std::vector<uint32_t>& SectionImage::ByName() const {
+    std::call_once(by_name_once_, [this] {
+        const std::vector<Section>& sections = Sections();
+        std::vector<uint32_t> by_name(sections.size());
+        std::iota(by_name.begin(), by_name.end(), 0U);
+        std::sort(by_name.begin(), by_name.end(), [&](uint32_t a, uint32_t b) {
+            const int order = Name(sections[a]).compare(Name(sections[b]));
+            return order != 0 ? order < 0 : a < b;
+        });
+        by_name_ = std::move(by_name);
+    });
+    return by_name_;
+}
+
+}  // namespace tarqcore

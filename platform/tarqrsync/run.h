@@ -1,0 +1,55 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <string>
+
+#include "platform/tarqrsync/arguments.h"
+#include "platform/tarqrsync/config.h"
+#include "platform/tarqrsync/explain.h"
+#include "platform/tarqrsync/output_parser.h"
+#include "platform/tarqrsync/private_folder.h"
+#include "platform/tarqrsync/settings.h"
+#include "tarq/rsync_wrapper.h"
+
+namespace TARQ {
+namespace Backup {
+
+/// One execute(): from settings to an outcome.
+class Run {
+public:
+    /// Settings and options must outlive the run.
+    Run(const Settings& settings, const RunOptions& options)
+        : settings_(settings), options_(options) {}
+
+    /// Runs, and returns execute()'s status. Call once. Throws only what a function of the caller's
+    /// throws.
+    int Execute(const std::function<bool()>& cancelled);
+
+    /// Why it failed; empty after success.
+    const std::string& Explanation() const { return explanation_; }
+    /// The figures of a copy, when the options ask for a report.
+    const RunReport& Figures() const { return figures_; }
+
+private:
+    int Attempt(const std::function<bool()>& cancelled);
+    int RunCommand(const std::function<bool()>& cancelled);
+    int TakeAnswer(const std::string& answer_file);
+    int RunCopy(const std::function<bool()>& cancelled);
+    int RunRsync(const std::function<bool()>& cancelled, const Invocation& invocation,
+                 OutputParser* parser, uint64_t max_file_bytes);
+    int Fail(int status, const std::string& first_line);
+    RunFacts Facts(int exit_code) const { return {settings_, config_, exit_code, messages_}; }
+
+    const Settings& settings_;
+    const RunOptions& options_;
+    Config config_;
+    PrivateFolder folder_;
+    std::string log_file_;
+    std::string messages_;  // what rsync and ssh wrote
+    std::string explanation_;
+    RunReport figures_;
+};
+
+}  // namespace Backup
+}  // namespace TARQ

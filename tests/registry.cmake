@@ -1,0 +1,1 @@
+zel_test(tarqcore_test tarqcore_test.cpp LIBRARIES tarqcore dl)

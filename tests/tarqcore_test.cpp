@@ -1,0 +1,534 @@
+#include <dlfcn.h>
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/ipc.h>
+#include <sys/sem.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "tarq/core.h"
+#include "tests/support/temp_root.h"
+
+// System calls that fail on demand, in front of the C library's.
+namespace {
+
+std::string failing_call;   // the call that fails
+int failing_errno = 0;      // with what
+std::atomic<int> reads{0};  // how often a file was read
+size_t write_limit = 0;     // bytes that one write takes; 0: all
+
+bool Fails(const char* call) {
+    if (failing_call != call) {
+        return false;
+    }
+    errno = failing_errno;
+    return true;
+}
+
+template <typename Function>
+Function Next(const char* name) {
+    return reinterpret_cast<Function>(dlsym(RTLD_NEXT, name));
+}
+
+}  // namespace
+
+#define FRONT extern "C" __attribute__((visibility("default")))
+
+FRONT int fsync(int fd) {
+    struct stat status {};
+    fstat(fd, &status);
+    return Fails(S_ISDIR(status.st_mode) ? "fsync folder" : "fsync")
+               ? -1
+               : Next<int (*)(int)>("fsync")(fd);
+}
+FRONT int fchmod(int fd, mode_t mode) {
+    return Fails("fchmod") ? -1 : Next<int (*)(int, mode_t)>("fchmod")(fd, mode);
+}
+FRONT int renameat(int from_folder, const char* from, int to_folder, const char* to) {
+    return Fails("renameat") ? -1
+                             : Next<int (*)(int, const char*, int, const char*)>("renameat")(
+                                   from_folder, from, to_folder, to);
+}
+FRONT ssize_t write(int fd, const void* bytes, size_t size) {
+    const size_t part = write_limit != 0 ? std::min(size, write_limit) : size;
+    return Fails("write") ? -1
+                          : Next<ssize_t (*)(int, const void*, size_t)>("write")(fd, bytes, part);
+}
+FRONT ssize_t pread64(int fd, void* bytes, size_t size, off64_t at) {
+    ++reads;
+    return Fails("pread")
+               ? -1
+               : Next<ssize_t (*)(int, void*, size_t, off64_t)>("pread64")(fd, bytes, size, at);
+}
+
+namespace {
+
+using testing::ElementsAre;
+using testing::HasSubstr;
+using Pairs = std::vector<std::pair<std::string, std::string>>;
+
+/// A string hash with some values, freed at the end.
+struct Hash {
+    KAPICSzHash hash = KAPICSzHashAlloc(16);
+    Hash(std::initializer_list<std::pair<const char*, const char*>> values = {}) {
+        for (const auto& [key, value] : values) {
+            KAPICSzHashSetValue(hash, key, value);
+        }
+    }
+    Hash(const Hash&) = delete;
+    Hash& operator=(const Hash&) = delete;
+    ~Hash() { KAPICSzHashFree(hash); }
+    operator KAPICSzHash() const { return hash; }
+
+    Pairs All() const {
+        Pairs all;
+        const char *key = nullptr, *value = nullptr;
+        for (int at = 0; KAPICSzHashNext(hash, &at, &key, &value) != 0;) {
+            all.emplace_back(key, value);
+        }
+        return all;
+    }
+};
+
+std::vector<std::string> Sections(const std::string& path) {
+    KAPICSzList list = KAPICSzListAlloc(16);
+    std::vector<std::string> names;
+    EXPECT_GE(KAPICFileEnumSection(path.c_str(), list), 0);
+    for (int i = 0; i < KAPICSzListCount(list); ++i) {
+        names.emplace_back(KAPICSzListGet(list, i));
+    }
+    KAPICSzListFree(list);
+    return names;
+}
+
+/// The value, or the error code as text.
+std::string Value(const std::string& path, const char* section, const char* key) {
+    char buffer[256] = "untouched";
+    KAPICErrSetEx(0, "", 0);
+    if (KAPICFileGetSectionValue(path.c_str(), section, key, buffer, sizeof buffer) == 0) {
+        return buffer;
+    }
+    EXPECT_STREQ(buffer, "untouched");
+    return KAPICErrText(KAPICErrGet());
+}
+
+class SectionFile : public testing::Test {
+protected:
+    void TearDown() override {
+        failing_call.clear();
+        write_limit = 0;
+    }
+    std::vector<std::string> Entries() const {
+        std::vector<std::string> names;
+        for (const auto& entry : std::filesystem::directory_iterator(folder_.Path())) {
+            names.push_back(entry.path().filename());
+        }
+        return names;
+    }
+    test::TempFolder folder_;
+    const std::string file_ = folder_.Path("file");
+};
+
+TEST(StringHash, KeepsOneValueAKeyAndWalksInByteOrder) {
+    Hash hash{{"b", "1"}, {"\xff", "2"}, {"B", "3"}, {"", "4"}, {"b", "5"}};
+    EXPECT_THAT(hash.All(), ElementsAre(std::pair("", "4"), std::pair("B", "3"),
+                                        std::pair("b", "5"), std::pair("\xff", "2")));
+    EXPECT_EQ(KAPICSzHashSetValue(hash, "b", KAPICSzHashGetValue(hash, "b")), 0) << "its own value";
+    EXPECT_STREQ(KAPICSzHashGetValue(hash, "b"), "5");
+    EXPECT_EQ(KAPICSzHashGetValue(hash, "c"), nullptr);
+    EXPECT_EQ(KAPICSzHashSetValue(hash, nullptr, "x"), -1);
+    KAPICHashRemoveAll(hash);
+    EXPECT_TRUE(hash.All().empty());
+}
+
+TEST(StringList, EntriesStayInPlaceWhileOthersArePushed) {
+    KAPICSzList list = KAPICSzListAlloc(1);
+    KAPICSzListPush(list, "first");
+    const char* first = KAPICSzListGet(list, 0);
+    for (int i = 0; i < 1000; ++i) {
+        ASSERT_EQ(KAPICSzListPush(list, "more"), 0);
+    }
+    EXPECT_STREQ(first, "first");
+    EXPECT_EQ(KAPICSzListCount(list), 1001);
+    EXPECT_EQ(KAPICSzListGet(list, 1001), nullptr);
+    EXPECT_EQ(KAPICSzListGet(list, -1), nullptr);
+    EXPECT_EQ(KAPICSzListPush(list, nullptr), -1);
+    KAPICSzListFree(list);
+}
+
+TEST(FormattedString, TakesOneStringAndPerCentSignsAlone) {
+    const std::vector<std::tuple<const char*, const char*, const char*>> cases{
+        {"SHARE_%s", "a%sb", "SHARE_a%sb"},
+        {"100%% %s", "x", "100% x"},
+        {"%s", "", ""},
+        {"none", "x", nullptr},
+        {"%s%s", "x", nullptr},
+        {"%d", "x", nullptr},
+        {"%n%s", "x", nullptr},
+        {"%10s", "x", nullptr},
+        {"%s%", "x", nullptr},
+        {nullptr, "x", nullptr},
+        {"%s", nullptr, nullptr}};
+    for (const auto& [format, argument, expected] : cases) {
+        char* text = KAPICStrGet(format, argument);
+        EXPECT_EQ(text == nullptr, expected == nullptr) << format;
+        EXPECT_STREQ(text, expected);
+        KAPICStrPut(text);
+    }
+}
+
+TEST(ErrorState, IsTheThreadsOwn) {
+    KAPICErrSetEx(0x2200, "here", 1);
+    std::thread([] {
+        EXPECT_EQ(KAPICErrGet(), 0);
+        KAPICErrSetEx(0xD00, "there", 2);
+    }).join();
+    EXPECT_EQ(KAPICErrGet(), 0x2200);
+}
+
+TEST_F(SectionFile, ReadsWhatPeopleAndOtherSystemsWrite) {
+    using namespace std::string_literals;
+    const std::vector<std::tuple<std::string, std::string>> cases{
+        {"[s]\nk=\"v\"\n", "v"},
+        {"[s]\n\tk = \"v\" \r\n", "v"},
+        {"\xEF\xBB\xBF[s]\r\nk=\"v\"\r\n", "v"},
+        {"[s]\nk=\"v\"", "v"},
+        {"[s]\nk=v", "v"},
+        {"[s]\nk=", ""},
+        {"[s]\nk=\"", "\""},
+        {"[s]\nk=\"a\"b\"\n", "a\"b"},
+        {"[s]\nk=\"a\\\"\n", "a\\"},
+        {"[s]\nk=\" a=[b] \"\n", " a=[b] "},
+        {"  [s] # mine\n#k=\"no\"\n\n;\nk=\"v\"\n", "v"},
+        {"k=\"outside\"\n[s]\nk=\"v\"\n", "v"},
+        {"[s]\nk=\"first\"\nk=\"second\"\n[s]\nk=\"third\"\n", "first"},
+        {"[t]\nx=\"[s]\"\n[s]x]\nk=\"v\"\n", "v"},
+        {"[s\nk=\"lost\"\n[s]\nk=\"v\"\n", "v"},
+        {"[s]\nk=\"a\0b\"\nk=\"v\"\n"s, "v"},
+        {"[s\0]\nk=\"lost\"\n"s, "no such section"},
+        {"[S]\nk=\"v\"\n", "no such section"},
+        {"", "no such section"},
+        {"[s]\n[t]\nk=\"v\"\n", "no such key"},
+        {"[s]\nk\n=\"v\"\n\"k\"=\"v\"\n[k=\"v\"\n", "no such key"},
+    };
+    for (const auto& [text, expected] : cases) {
+        folder_.Write("file", text);
+        EXPECT_EQ(Value(file_, "s", "k"), expected) << text;
+        Hash hash{{"k", "before"}};
+        const int result = KAPICFileGetSection(file_.c_str(), "s", hash);
+        EXPECT_EQ(result, expected == "no such section" ? 0 : 1) << text;
+        const bool absent = expected.substr(0, 7) == "no such";
+        EXPECT_EQ(KAPICSzHashGetValue(hash, "k"), absent ? "before" : expected) << text;
+    }
+    folder_.Write("file", "[b]\n[a]\n[]\n  [a]\n[a[]\nx[y]\n[z");
+    EXPECT_THAT(Sections(file_), ElementsAre("b", "a", "", "a", "a["));
+}
+
+TEST_F(SectionFile, TheIndexFindsWhatTheScanFinds) {
+    std::string text = "[ ]\n";
+    for (int i = 0; i < 300; ++i) {  // each name twice
+        const std::string number = std::to_string(i);
+        text += "[n" + std::to_string(i * 7 % 150) + "]\nk=\"" + number + "\"\n";
+    }
+    folder_.Write("file", text);
+    const auto all = [this] {
+        std::string values;
+        for (int i = -1; i <= 150; ++i) {
+            values += Value(file_, ("n" + std::to_string(i)).c_str(), "k") + "\n";
+        }
+        return values;
+    };
+    const std::string scanned = all();  // changed just now: read again each time
+    EXPECT_THAT(scanned, HasSubstr("\n149\n"));
+    usleep(50'000);
+    const int before = reads;
+    EXPECT_EQ(all(), scanned);
+    EXPECT_EQ(all(), scanned);
+    EXPECT_EQ(reads - before, 1) << "an unchanged file is read once";
+}
+
+TEST_F(SectionFile, AnEditInPlaceIsSeenAtOnce) {
+    folder_.Write("file", "[s]\nk=\"000\"\n");
+    const int fd = open(file_.c_str(), O_WRONLY);
+    for (int i = 1; i < 500; ++i) {
+        char digits[16];
+        snprintf(digits, sizeof digits, "%03d", i);
+        ASSERT_EQ(pwrite(fd, digits, 3, 7), 3);
+        ASSERT_EQ(Value(file_, "s", "k"), digits);
+        if (i % 100 == 0) {
+            usleep(30'000);  // long enough for the file to be kept in memory
+            ASSERT_EQ(Value(file_, "s", "k"), digits);
+        }
+    }
+    close(fd);
+}
+
+TEST_F(SectionFile, WhatIsWrittenReadsBack) {
+    const Hash values{{"a", "say \"hi\""},       {"b", "c:\\"}, {"c d", " two  blanks "},
+                      {"e", "\"quoted\""},       {"f", ""},     {"g", "a=b]#[c"},
+                      {"h", "\xc3\xa4\xff%s%n"}, {"i", "\""}};
+    for (const char* format : {static_cast<const char*>(nullptr), "\t%s=\"%s\"\n"}) {
+        ASSERT_GT(KAPICFileSetSection(file_.c_str(), "x [y", 0, values, format), 0);
+        Hash read;
+        ASSERT_GT(KAPICFileGetSection(file_.c_str(), "x [y", read), 0);
+        EXPECT_EQ(read.All(), values.All());
+    }
+}
+
+TEST_F(SectionFile, WritesChangeTheirSectionAlone) {
+    const std::string base = "# top\n[a]\n\tk=\"1\"\n\tl=\"2\"\n\n# about b\n[b]\nk=\"3\"";
+    const Hash k{{"k", "9"}};
+    const Hash both{{"l", "8"}, {"m", "7"}};
+    const auto expect = [this](int result, int expected_result, const std::string& expected,
+                               int line) {
+        EXPECT_EQ(result, expected_result) << "line " << line;
+        EXPECT_EQ(test::ReadFile(file_), expected) << "line " << line;
+    };
+    const char* path = file_.c_str();
+    folder_.Write("file", base);
+    expect(KAPICFileSetSection(path, "a", 0, k, "\t%s=\"%s\"\n"), 1,
+           "# top\n[a]\n\tk=\"9\"\n\n# about b\n[b]\nk=\"3\"", __LINE__);
+    folder_.Write("file", base);
+    expect(KAPICIFileModifySection(path, "a", 0, both, 1, 0), 1,
+           "# top\n[a]\n\tk=\"1\"\n\tl=\"8\"\nm=\"7\"\n\n# about b\n[b]\nk=\"3\"", __LINE__);
+    folder_.Write("file", base);
+    expect(KAPICIFileModifySection(path, "b", 0, k, 1, 0), 1,
+           "# top\n[a]\n\tk=\"1\"\n\tl=\"2\"\n\n# about b\n[b]\nk=\"9\"\n", __LINE__);
+    folder_.Write("file", base);
+    expect(KAPICIFileModifySection(path, "c", 0, k, 1, 0), 0, base, __LINE__);
+    expect(KAPICFileRemoveSection(path, "c"), 0, base, __LINE__);
+    expect(KAPICFileSetSection(path, "c", 0, k, nullptr), 1, base + "\n[c]\nk=\"9\"\n", __LINE__);
+    expect(KAPICFileAddSection(path, "a", both, nullptr), 1,
+           base + "\n[c]\nk=\"9\"\n[a]\nl=\"8\"\nm=\"7\"\n", __LINE__);
+    expect(KAPICFileSetSection(path, "a", 0, Hash{}, nullptr), 1,
+           "# top\n[a]\n\n# about b\n[b]\nk=\"3\"\n[c]\nk=\"9\"\n", __LINE__);
+    folder_.Write("file", "[a]\nk=\"1\"\nx\nk=\"2\"\n[a]\n");
+    expect(KAPICIFileModifySection(path, "a", 0, k, 1, 0), 1, "[a]\nk=\"9\"\nx\n[a]\n", __LINE__);
+    expect(KAPICFileRemoveSection(path, "a"), 1, "", __LINE__);
+}
+
+TEST_F(SectionFile, WhatCouldBreakTheFormatIsRefused) {
+    struct Case {
+        const char *section, *key, *value, *format;
+    };
+    for (const Case& c : {Case{"a\nb", "k", "v", nullptr},  {"a\rb", "k", "v", nullptr},
+                          {"a]b", "k", "v", nullptr},       {"s", "", "v", nullptr},
+                          {"s", "k=", "v", nullptr},        {"s", "\"k", "v", nullptr},
+                          {"s", "k\nl", "v", nullptr},      {"s", "k\r", "v", nullptr},
+                          {"s", "#k", "v", nullptr},        {"s", "[k", "v", nullptr},
+                          {"s", " k", "v", nullptr},        {"s", "k", "v\nw", nullptr},
+                          {"s", "k", "v\r", nullptr},       {"s", "k", "v", "%s=%d\n"},
+                          {"s", "k", "v", "%s=\"%s\""},     {"s", "k", "v", "%s\n"},
+                          {"s", "k", "v", "\n%s=\"%s\"\n"}, {"s", "k", "v", ""},
+                          {"s", "k", "\"v\"", "%s=%s\n"},   {"s", "k", "v", "x%s=\"%s\"\n"}}) {
+        folder_.Write("file", "[s]\nold=\"1\"\n");
+        const Hash values{{c.key, c.value}};
+        for (int operation = 0; operation < (c.format == nullptr ? 3 : 2); ++operation) {
+            KAPICErrSetEx(0, "", 0);
+            const int result =
+                operation == 0 ? KAPICFileSetSection(file_.c_str(), c.section, 0, values, c.format)
+                : operation == 1
+                    ? KAPICFileAddSection(file_.c_str(), c.section, values, c.format)
+                    : KAPICIFileModifySection(file_.c_str(), c.section, 0, values, 1, 0);
+            EXPECT_EQ(result, -1) << c.section << c.key << c.value;
+            EXPECT_EQ(KAPICErrGet(), 0xD00);
+            EXPECT_EQ(test::ReadFile(file_), "[s]\nold=\"1\"\n");
+        }
+    }
+}
+
+TEST_F(SectionFile, AFailureIsNotAbsence) {
+    Hash hash;
+    const std::string missing = folder_.Path("missing");
+    EXPECT_EQ(KAPICFileExist(missing.c_str()), 0);
+    EXPECT_EQ(KAPICFileGetSection(missing.c_str(), "s", hash), 0);
+    EXPECT_EQ(Value(missing, "s", "k"), "no such section");
+
+    std::filesystem::create_symlink("loop", folder_.Path("loop"));
+    ASSERT_EQ(mkfifo(folder_.Path("pipe").c_str(), 0600), 0);
+    std::ofstream(folder_.Path("huge")) << "[s]\n";
+    std::filesystem::resize_file(folder_.Path("huge"), (8U << 20) + 1);
+    folder_.Write("file", "[s]\nk=\"v\"\n");
+    const std::string below = file_ + "/below";
+    for (const auto& [path, error] :
+         std::vector<std::pair<std::string, int>>{{folder_.Path(), EISDIR},
+                                                  {folder_.Path("loop"), ELOOP},
+                                                  {folder_.Path("pipe"), EINVAL},
+                                                  {folder_.Path("huge"), EFBIG},
+                                                  {below, ENOTDIR},
+                                                  {file_, EIO}}) {
+        failing_call = path == file_ ? "pread" : "";
+        failing_errno = EIO;
+        EXPECT_LT(KAPICFileGetSection(path.c_str(), "s", hash), 0) << path;
+        EXPECT_EQ(errno, error) << path;
+        EXPECT_THAT(Value(path, "s", "k"), HasSubstr("cannot")) << path;
+        KAPICSzList list = KAPICSzListAlloc(1);
+        EXPECT_LT(KAPICFileEnumSection(path.c_str(), list), 0) << path;
+        KAPICSzListFree(list);
+        EXPECT_LT(KAPICFileSetSection(path.c_str(), "s", 0, hash, nullptr), 0) << path;
+    }
+}
+
+TEST_F(SectionFile, AWriteThatFailsLeavesTheOldFileAndNothingElse) {
+    const std::string old = "[s]\nk=\"old\"\n";
+    folder_.Write("file", old);
+    for (const char* call : {"write", "fchmod", "fsync", "renameat"}) {
+        failing_call = call;
+        failing_errno = ENOSPC;
+        EXPECT_EQ(KAPICFileSetSection(file_.c_str(), "s", 0, Hash{{"k", "new"}}, nullptr), -1)
+            << call;
+        EXPECT_EQ(errno, ENOSPC) << call;
+        EXPECT_EQ(KAPICErrGet(), TARQ_ERR_WRITE_FILE) << call;
+        EXPECT_EQ(test::ReadFile(file_), old) << call;
+        EXPECT_THAT(Entries(), ElementsAre("file")) << call;
+    }
+    failing_call = "fsync folder";
+    failing_errno = EIO;
+    EXPECT_EQ(KAPICFileSetSection(file_.c_str(), "s", 0, Hash{{"k", "new"}}, nullptr), -1);
+    EXPECT_EQ(test::ReadFile(file_), "[s]\nk=\"new\"\n") << "in place, though not sure to last";
+    failing_errno = EINVAL;
+    write_limit = 3;
+    EXPECT_EQ(KAPICFileSetSection(file_.c_str(), "s", 0, Hash{{"k", "newer"}}, nullptr), 1);
+    EXPECT_EQ(test::ReadFile(file_), "[s]\nk=\"newer\"\n") << "short writes are carried on";
+}
+
+TEST_F(SectionFile, ModeOwnerAndLinksAreKept) {
+    std::filesystem::create_directory(folder_.Path("real"));
+    std::filesystem::create_symlink("real/target", folder_.Path("link"));
+    std::filesystem::create_symlink("link", file_);
+    const mode_t mask = umask(022);
+    ASSERT_EQ(KAPICFileAddSection(file_.c_str(), "s", Hash{}, nullptr), 1) << "the target is made";
+    const std::string target = folder_.Path("real/target");
+    struct stat status {};
+    ASSERT_EQ(stat(target.c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 07777, 0644U);
+    umask(077);
+    ASSERT_EQ(chmod(target.c_str(), 0666), 0);
+    const bool root = geteuid() == 0;
+    ASSERT_EQ(root ? chown(target.c_str(), 12345, 23456) : 0, 0);
+    ASSERT_EQ(KAPICFileAddSection(file_.c_str(), "t", Hash{}, nullptr), 1);
+    umask(mask);
+    ASSERT_EQ(stat(target.c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 07777, 0666U);
+    EXPECT_EQ(status.st_uid, root ? 12345U : geteuid());
+    EXPECT_EQ(status.st_gid, root ? 23456U : getegid());
+    EXPECT_TRUE(std::filesystem::is_symlink(file_) &&
+                std::filesystem::is_symlink(folder_.Path("link")));
+    EXPECT_EQ(test::ReadFile(target), "[s]\n[t]\n");
+}
+
+TEST(Semaphore, IsGivenBackByItsHolderOrByItsDeathAlone) {
+    const int key = 0x5a000000 | (getpid() & 0xffffff);
+    const int id = KAPICSemOpen(key);
+    ASSERT_GE(id, 0);
+    EXPECT_EQ(KAPICSemOpen(key), id);
+    ASSERT_EQ(KAPICSemLock(id), 0);
+    const pid_t other = fork();
+    if (other == 0) {
+        const bool refused = KAPICSemUnlock(id) != 0 && errno == EPERM;
+        KAPICSemLock(id);  // until the parent gives it back
+        raise(refused ? SIGKILL : SIGABRT);
+    }
+    while (semctl(id, 0, GETZCNT) == 0 && waitpid(other, nullptr, WNOHANG) == 0) {
+        usleep(1000);
+    }
+    EXPECT_EQ(KAPICSemUnlock(id), 0);
+    int status = 0;
+    ASSERT_EQ(waitpid(other, &status, 0), other);
+    EXPECT_EQ(WTERMSIG(status), SIGKILL);
+    EXPECT_EQ(KAPICSemLock(id), 0) << "the dead holder's is free again";
+    EXPECT_EQ(KAPICSemUnlock(id), 0);
+    EXPECT_EQ(KAPICSemUnlock(id), -1) << "not held";
+    EXPECT_EQ(KAPICSemClose(id), 0);
+    semctl(id, 0, IPC_RMID);
+    EXPECT_EQ(KAPICSemLock(id), -1);
+    EXPECT_EQ(KAPICErrGet(), TARQ_ERR_SEMAPHORE);
+    EXPECT_EQ(KAPICSemOpen(IPC_PRIVATE), -1);
+}
+
+std::string ReadAll(FILE* stream) {
+    std::string text;
+    for (int c = 0; stream != nullptr && (c = fgetc(stream)) != EOF;) {
+        text += static_cast<char>(c);
+    }
+    return text;
+}
+
+TEST(ProgramStream, RunsWithoutAShellAndWaitsForItsOwnProgram) {
+    FILE* first = KAPICPopen("/bin/sh", "r", "-c", "printf '%s|' \"$@\"; exit 3", "sh", "a b",
+                             "$HOME;", "", nullptr);
+    FILE* second = KAPICPopen("/bin/sh", "r", "-c", "exec kill -9 $$", nullptr);
+    ASSERT_TRUE(first != nullptr && second != nullptr);
+    EXPECT_EQ(ReadAll(first), "a b|$HOME;||");
+    EXPECT_EQ(KAPICPclose(second), SIGKILL);
+    EXPECT_EQ(WEXITSTATUS(KAPICPclose(first)), 3);
+    EXPECT_EQ(KAPICPclose(first), -1) << "closed already";
+
+    const int left_open = dup(STDIN_FILENO);  // not close-on-exec
+    FILE* writer = KAPICPopen("/bin/sh", "w", "-c", "read l; [ \"$l\" = hello ]", nullptr);
+    FILE* list = KAPICPopen("/bin/ls", "r", "/proc/self/fd", nullptr);
+    EXPECT_EQ(ReadAll(list), "0\n1\n2\n3\n") << "3 is the folder that ls reads";
+    EXPECT_EQ(KAPICPclose(list), 0);
+    fputs("hello\n", writer);
+    EXPECT_EQ(KAPICPclose(writer), 0);
+    close(left_open);
+
+    EXPECT_EQ(KAPICPopen("/nonexistent", "r", nullptr), nullptr);
+    EXPECT_EQ(errno, ENOENT);
+    EXPECT_EQ(KAPICPopen("/bin/true", "rw", nullptr), nullptr);
+}
+
+TEST(PidFile, NamesALiveProcessOrNone) {
+    const test::TempFolder folder;
+    const pid_t zombie = fork();
+    if (zombie == 0) {
+        _exit(0);
+    }
+    siginfo_t info{};
+    waitid(P_PID, static_cast<id_t>(zombie), &info, WEXITED | WNOWAIT);
+    const std::string own = std::to_string(getpid());
+    for (const auto& [text, alive] :
+         std::vector<std::pair<std::string, int>>{{own + "\n", 1},
+                                                  {own, 1},
+                                                  {" " + own + " \r\nmore\n", 1},
+                                                  {"1\n", 1},
+                                                  {std::to_string(zombie), 0},
+                                                  {"", 0},
+                                                  {"\n" + own, 0},
+                                                  {own + "x", 0},
+                                                  {"-" + own, 0},
+                                                  {"0", 0},
+                                                  {"4194305", 0},
+                                                  {"99999999999999999999", 0},
+                                                  {own + std::string(1 << 20, ' ') + "x", 0},
+                                                  {std::string(1, '\0') + own, 0}}) {
+        EXPECT_EQ(KAPICProcAliveByPidFile(folder.Write("pid", text).c_str()), alive)
+            << text.substr(0, 40);
+    }
+    EXPECT_EQ(KAPICProcAliveByPidFile(folder.Path("missing").c_str()), 0);
+    EXPECT_EQ(KAPICProcAliveByPidFile(folder.Path().c_str()), 0);
+    waitpid(zombie, nullptr, 0);
+}
+
+TEST(Device, IsTheSmallFamilyOnlyWhenTheConfigurationSaysYes) {
+    const test::TempRoot root;
+    KAPICErrSetEx(0x123, "", 0);
+    EXPECT_EQ(KAPICIsMiniUnit(), 0);
+    EXPECT_EQ(KAPICErrGet(), 0x123);
+    for (const auto& [value, expected] :
+         {std::pair("yes", 1), std::pair("yesterday", 0), std::pair("no", 0)}) {
+        root.Write("usr/tarq/etc/tarqcore.conf",
+                   std::string("[device]\nmini_unit=\"") + value + "\"\n");
+        EXPECT_EQ(KAPICIsMiniUnit(), expected) << value;
+    }
+}
+
+}  // namespace
