@@ -313,11 +313,16 @@ std::string OutcomeOf(const ShareState& state) {
     if (!state.running_id.empty()) {
         return "being pushed";
     }
+    if (state.last_result.empty()) {
+        return "never pushed";
+    }
     const auto time = programs::ParseNumber(state.last_time, INT32_MAX);
     const std::string when = time ? " " + programs::HumanTime(static_cast<int64_t>(*time)) : "";
-    return state.last_result.empty()
-               ? "never pushed"
-               : (state.last_result == "0" ? "complete" : "rsync " + state.last_result) + when;
+    if (state.last_result == "0") {
+        return "complete" + when;
+    }
+    return (state.last_result == kEndedByClient ? "not complete" : "not complete (rsync " + state.last_result + ")") +
+           when;
 }
 
 int ListShares(bool as_json) {
