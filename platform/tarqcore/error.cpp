@@ -45,12 +45,18 @@ const char* KAPICErrText(int code) {
             return "the share's volume is not mounted";
         case TARQ_ERR_SHARE_EXISTS:
             return "the share exists already";
+        case TARQ_ERR_SHARE_OVERLAP:
+            return "the folder holds, or lies in, another share's";
+        case TARQ_ERR_SHARE_FOLDER:
+            return "the share's folder is not there";
         case TARQ_ERR_NO_KEY:
             return "no such key";
         case TARQ_ERR_NO_SECTION:
             return "no such section";
         case TARQ_ERR_NO_VOLUME:
             return "no such volume";
+        case TARQ_ERR_LOOKUP:
+            return "the name service failed";
         case TARQ_ERR_SERVICE:
             return "the service manager refused or cannot be reached";
         case TARQ_ERR_SERVICE_BUSY:
