@@ -37,11 +37,13 @@ protected:
         Logger::LogMsg(Logger::LEVEL_ERROR, "%s\n", text.c_str());
     }
     static void WriteMoreThanOneFile(char fill) { WriteLine(0x100001, fill); }
-    // The first letter behind the time of each file: of the log, then of log_0, log_1, ... and '-' where there is none.
+    // The first letter behind the time of each file: of the log, then of log_0, log_1, ... and '-'
+    // where there is none.
     std::string FirstLetters(int count) const {
         std::string letters;
         for (int i = -1; i < count; ++i) {
-            const std::string text = test::ReadFile(i < 0 ? path_ : path_ + "_" + std::to_string(i));
+            const std::string text =
+                test::ReadFile(i < 0 ? path_ : path_ + "_" + std::to_string(i));
             letters += text.size() > kTimeSize ? text[kTimeSize] : '-';
         }
         return letters;
@@ -77,7 +79,8 @@ TEST_F(Log, StandardStreamsGetTheTimeInFront) {
         EXPECT_EQ(errno, 4711);
         const std::string out = testing::internal::GetCapturedStdout();
         const std::string err = testing::internal::GetCapturedStderr();
-        EXPECT_THAT(type == Logger::STDOUT ? out : err, MatchesRegex(kTime + std::string("\\[NOTE\\] a%b")));
+        EXPECT_THAT(type == Logger::STDOUT ? out : err,
+                    MatchesRegex(kTime + std::string("\\[NOTE\\] a%b")));
         EXPECT_THAT(type == Logger::STDOUT ? err : out, IsEmpty());
     }
 }
@@ -135,8 +138,8 @@ TEST_F(Log, ComplaintsOfARotationGoToTheSystemLog) {
     ASSERT_EQ(OpenFile(2), 0);
     WriteMoreThanOneFile('a');
     EXPECT_THAT(test::TakeSyslogTexts(),
-                ElementsAre("ZEL/log:145 failed to rename old_name '" + path_ + "_0' to new_name '" +
-                                path_ + "_1'.",
+                ElementsAre("ZEL/log:145 failed to rename old_name '" + path_ +
+                                "_0' to new_name '" + path_ + "_1'.",
                             "ZEL/log:152 failed to remove old_name '" + path_ + "_1'."));
 }
 
