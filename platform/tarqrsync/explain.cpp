@@ -26,6 +26,8 @@ constexpr int kExitSsh = 255;
 
 constexpr int kKeepStatus = -1;
 
+constexpr std::string_view kUnknownModule = "@ERROR: Unknown module";
+
 enum Where : unsigned int {
     DAEMON = 1U,
     COMMAND = 2U,  // a server command
@@ -80,9 +82,9 @@ constexpr Clue kClues[] = {
      "{host} does not let this machine reach the module {module}"},
     {"@ERROR: max connections", ANYWHERE, kKeepStatus,
      "{host} serves as many connections as it takes: try again later"},
-    {"@ERROR: Unknown module", COMMAND, STATUS_UNKNOWN_COMMAND,
+    {kUnknownModule, COMMAND, STATUS_UNKNOWN_COMMAND,
      "{host} takes no server commands: its rsync daemon has no module for them"},
-    {"@ERROR: Unknown module", COPY, kKeepStatus, "{host} has no module '{module}'"},
+    {kUnknownModule, COPY, kKeepStatus, "{host} has no module '{module}'"},
     {"@ERROR: early exec failed", ANYWHERE, kKeepStatus,
      "the program that takes commands at {host} failed"},
     {"@ERROR: Unknown command", COMMAND, STATUS_UNKNOWN_COMMAND,
@@ -226,11 +228,11 @@ Verdict FromWords(const RunFacts& facts, int status) {
     if ((where & SSH) != 0 && !connected) {
         if (Contains(messages, "Host key verification failed") ||
             Contains(messages, "HOST IDENTIFICATION HAS CHANGED")) {
-            return {STATUS_AUTHENTICATION, ChangedHostKey(facts)};
+            return {STATUS_AUTHENTICATION, RunCause::NONE, ChangedHostKey(facts)};
         }
         if (IsRefusedSshLogin(messages)) {
             return {
-                STATUS_AUTHENTICATION,
+                STATUS_AUTHENTICATION, RunCause::NONE,
                 Fill("the ssh login of '{user}' at {host} was refused: wrong account or password",
                      facts, "")};
         }
@@ -240,15 +242,16 @@ Verdict FromWords(const RunFacts& facts, int status) {
         if ((clue.where & where) != 0 && position != std::string_view::npos &&
             !(connected && clue.status != kKeepStatus)) {
             return {clue.status == kKeepStatus ? status : clue.status,
+                    clue.words == kUnknownModule ? RunCause::UNKNOWN_MODULE : RunCause::NONE,
                     Fill(clue.meaning, facts, LineAt(messages, position))};
         }
     }
     for (const ExitMeaning& meaning : kExitMeanings) {
         if (meaning.code == status) {
-            return {status, Fill(meaning.meaning, facts, "")};
+            return {status, RunCause::NONE, Fill(meaning.meaning, facts, "")};
         }
     }
-    return {status, "rsync failed with exit code " + std::to_string(status)};
+    return {status, RunCause::NONE, "rsync failed with exit code " + std::to_string(status)};
 }
 
 }  // namespace

@@ -118,10 +118,11 @@ bool IsMissing(const std::string& path) {
 
 int Run::Execute(const std::function<bool()>& cancelled) {
     try {
-        return Attempt(cancelled);
+        outcome_.status = Attempt(cancelled);
     } catch (const std::system_error& error) {
-        return Fail(kStatusFileIo, error.what());
+        outcome_.status = Fail(kStatusFileIo, error.what());
     }
+    return outcome_.status;
 }
 
 int Run::Attempt(const std::function<bool()>& cancelled) {
@@ -201,7 +202,7 @@ int Run::RunCopy(const std::function<bool()>& cancelled) {
         PrivateFolder files;
         const int status = RunRsync(cancelled, CopyInvocation(context, &files), &parser, 0);
         parser.Finish();
-        parser.FillReport(&figures_);
+        parser.FillReport(&outcome_);
         const RefusedAttributes refused = FindRefusedAttributes(Facts(status));
         const bool less = (context.acls && refused.acls) || (context.xattrs && refused.xattrs);
         if (status == STATUS_DONE || !less) {
@@ -219,7 +220,7 @@ int Run::RunCopy(const std::function<bool()>& cancelled) {
 // Runs one rsync; after a failure the explanation is there.
 int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invocation,
                   OutputParser* parser, uint64_t max_file_bytes) {
-    explanation_.clear();
+    outcome_.explanation.clear();
     messages_.clear();
     ChildSpec spec;
     spec.program = tarq_internal::FindProgram(config_.rsync, PathVariable(invocation.environment));
@@ -269,13 +270,14 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
         }
     }
     const Verdict verdict = Judge(Facts(exit_code));
+    outcome_.cause = verdict.cause;
     return Fail(verdict.status, verdict.first_line);
 }
 
 int Run::Fail(int status, const std::string& first_line) {
-    explanation_ = messages_.empty() ? first_line : first_line + "\n" + messages_;
-    while (!explanation_.empty() && explanation_.back() == '\n') {
-        explanation_.pop_back();
+    outcome_.explanation = messages_.empty() ? first_line : first_line + "\n" + messages_;
+    while (!outcome_.explanation.empty() && outcome_.explanation.back() == '\n') {
+        outcome_.explanation.pop_back();
     }
     return status;
 }
