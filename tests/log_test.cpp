@@ -28,41 +28,39 @@ protected:
         Logger::Initialize(Logger::SYSLOG, Logger::LEVEL_ERROR, "", 0);
     }
 
-    int OpenFile(int rotate_count, int level = Logger::LEVEL_DEBUG) {
-        return Logger::Initialize(Logger::LOGFILE, level, path_, rotate_count);
+    int OpenFile(int rotate_count) const {
+        return Logger::Initialize(Logger::LOGFILE, 3, path_, rotate_count);
     }
     // Writes one line that takes `size` bytes of the file, the time included.
     static void WriteLine(size_t size, char fill) {
-        const std::string text(size - kTimeSize - 1, fill);
-        Logger::LogMsg(Logger::LEVEL_ERROR, "%s\n", text.c_str());
+        Logger::LogMsg(Logger::LEVEL_ERROR, "%s\n",
+                       std::string(size - kTimeSize - 1, fill).c_str());
     }
-    static void WriteMoreThanOneFile(char fill) { WriteLine(0x100001, fill); }
-    // The first letter behind the time of each file: of the log, then of log_0, log_1, ... and '-' where there is none.
+    // The first letter behind the time of the log, log_0, log_1, ...; '-' where there is none.
     std::string FirstLetters(int count) const {
         std::string letters;
         for (int i = -1; i < count; ++i) {
-            const std::string text = test::ReadFile(i < 0 ? path_ : path_ + "_" + std::to_string(i));
+            const std::string text =
+                test::ReadFile(i < 0 ? path_ : path_ + "_" + std::to_string(i));
             letters += text.size() > kTimeSize ? text[kTimeSize] : '-';
         }
         return letters;
     }
 
-    test::TempFolder folder_;
-    std::string path_ = folder_.Path("log");
+    const test::TempFolder folder_;
+    const std::string path_ = folder_.Path("log");
 };
 
-TEST_F(Log, StartsWithErrorsToTheSystemLog) {
+TEST_F(Log, SystemLogGetsAllThatPassesTheLevelAtPriorityErrorAndAtFirstErrorsAlone) {
     Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] quiet\n");
     Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] %d\n", 7);
-    EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre("[ERROR] 7\n"));
-}
-
-TEST_F(Log, TheSystemLogGetsEveryLevelAtPriorityError) {
     Logger::Initialize(Logger::SYSLOG, Logger::LEVEL_DEBUG, path_, 1);
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] x\n");
     const std::vector<test::SyslogLine> lines = test::TakeSyslog();
-    ASSERT_EQ(lines.size(), 1U);
-    EXPECT_EQ(lines[0].priority, 3);
+    ASSERT_EQ(lines.size(), 2U);
+    EXPECT_EQ(lines[0].text, "[ERROR] 7\n");
+    EXPECT_EQ(lines[1].text, "[DEBUG] x\n");
+    EXPECT_EQ(lines[1].priority, 3);
     EXPECT_FALSE(std::filesystem::exists(path_));
 }
 
@@ -75,29 +73,29 @@ TEST_F(Log, StandardStreamsGetTheTimeInFront) {
         Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] a%%%s", "b");
         Logger::LogMsg(Logger::LEVEL_INFO, "[INFO] filtered");
         EXPECT_EQ(errno, 4711);
-        const std::string out = testing::internal::GetCapturedStdout();
-        const std::string err = testing::internal::GetCapturedStderr();
-        EXPECT_THAT(type == Logger::STDOUT ? out : err, MatchesRegex(kTime + std::string("\\[NOTE\\] a%b")));
-        EXPECT_THAT(type == Logger::STDOUT ? err : out, IsEmpty());
+        std::string written = testing::internal::GetCapturedStdout();
+        std::string other = testing::internal::GetCapturedStderr();
+        if (type == Logger::STDERR) {
+            std::swap(written, other);
+        }
+        EXPECT_THAT(written, MatchesRegex(kTime + std::string("\\[NOTE\\] a%b")));
+        EXPECT_THAT(other, IsEmpty());
     }
 }
 
-TEST_F(Log, AnUnknownTypeIsAFileOrElseUntimedLinesToStandardError) {
+TEST_F(Log, WithoutItsFileIsSilentAndOfAnUnknownTypeUntimed) {
+    EXPECT_EQ(Logger::Initialize(Logger::LOGFILE, 3, folder_.Path("missing/log"), 2), -1);
+    EXPECT_EQ(Logger::Initialize(Logger::LOGFILE, 3, "", 2), -1);
+    testing::internal::CaptureStdout();
+    WriteLine(100, 'x');
     EXPECT_EQ(Logger::Initialize(static_cast<Logger::Type>(9), 3, path_, 2), 0);
     WriteLine(100, 'f');
     EXPECT_EQ(FirstLetters(0), "f");
-
     EXPECT_EQ(Logger::Initialize(static_cast<Logger::Type>(9), 3, "", 2), -1);
     testing::internal::CaptureStderr();
     Logger::LogMsg(Logger::LEVEL_ERROR, "bare\n");
     EXPECT_EQ(testing::internal::GetCapturedStderr(), "bare\n");
-}
-
-TEST_F(Log, AFileThatCannotBeOpenedLeavesTheLogSilent) {
-    EXPECT_EQ(Logger::Initialize(Logger::LOGFILE, 3, folder_.Path("missing/log"), 2), -1);
-    EXPECT_EQ(Logger::Initialize(Logger::LOGFILE, 3, "", 2), -1);
-    WriteLine(100, 'x');
-    EXPECT_THAT(test::TakeSyslog(), IsEmpty());
+    EXPECT_EQ(testing::internal::GetCapturedStdout(), "");
 }
 
 TEST_F(Log, RotatesAboveOneMebibyteOfItsOwnLines) {
@@ -121,7 +119,7 @@ TEST_F(Log, KeepsOneRotatedFileFewerThanTheCount) {
     for (const auto& c : cases) {
         ASSERT_EQ(OpenFile(c.rotate_count), 0);
         for (const char fill : {'a', 'b', 'c', 'd'}) {
-            WriteMoreThanOneFile(fill);
+            WriteLine(0x100001, fill);
         }
         EXPECT_EQ(FirstLetters(4), c.letters) << c.rotate_count;
         Logger::Destroy();
@@ -133,17 +131,17 @@ TEST_F(Log, KeepsOneRotatedFileFewerThanTheCount) {
 
 TEST_F(Log, ComplaintsOfARotationGoToTheSystemLog) {
     ASSERT_EQ(OpenFile(2), 0);
-    WriteMoreThanOneFile('a');
+    WriteLine(0x100001, 'a');
     EXPECT_THAT(test::TakeSyslogTexts(),
-                ElementsAre("ZEL/log:145 failed to rename old_name '" + path_ + "_0' to new_name '" +
-                                path_ + "_1'.",
+                ElementsAre("ZEL/log:145 failed to rename old_name '" + path_ +
+                                "_0' to new_name '" + path_ + "_1'.",
                             "ZEL/log:152 failed to remove old_name '" + path_ + "_1'."));
 }
 
 TEST_F(Log, AFailedRotationSilencesTheLogUntilItIsSetUpAgain) {
     ASSERT_EQ(OpenFile(1), 0);
     std::filesystem::remove(path_);
-    WriteMoreThanOneFile('a');
+    WriteLine(0x100001, 'a');
     WriteLine(100, 'b');
     EXPECT_FALSE(std::filesystem::exists(path_));
     ASSERT_EQ(OpenFile(1), 0);
