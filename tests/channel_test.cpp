@@ -339,3 +339,13 @@ TEST(CertName, AWildcardCoversOneLabelAndTheParent) {
         EXPECT_EQ(ZEL::CertNameCovers(c.name, c.host), c.covers) << c.name << " / " << c.host;
     }
 }
+
+TEST(Channel, TlsFilesHaveTheirDefaultsBelowTheRootUntilTheyAreSet) {
+    const test::TempRoot root;
+    EXPECT_EQ(Channel::GetCertPath(), root.Path("tmp/.cloud_certs"));
+    EXPECT_EQ(Channel::GetKeyPath(), root.Path("tmp/.cloud_server.key"));
+    EXPECT_EQ(Channel::GetCAPath(), root.Path("certs.pem"));
+    Channel::SetVerifyCAPath("/other.pem");
+    EXPECT_EQ(Channel::GetCAPath(), "/other.pem");
+    EXPECT_TRUE(Channel(16).IsAllowingUntrust());
+}
