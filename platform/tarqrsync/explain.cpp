@@ -250,8 +250,9 @@ Verdict FromWords(const RunFacts& facts, int status) {
     }
     for (const Clue& clue : kClues) {
         const size_t position = messages.find(clue.words);
+        const bool about_connection = (clue.where & (DAEMON | SSH)) != 0;
         if ((clue.where & where) != 0 && position != std::string_view::npos &&
-            !(connected && clue.status != kKeepStatus)) {
+            !(connected && about_connection)) {
             return {clue.status == kKeepStatus ? status : clue.status,
                     clue.words == kUnknownModule ? RunCause::UNKNOWN_MODULE : RunCause::NONE,
                     Fill(clue.meaning, facts, LineAt(messages, position))};

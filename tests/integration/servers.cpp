@@ -137,7 +137,7 @@ std::string RsyncDaemon::AddModule(const std::string& name, const std::string& l
 void RsyncDaemon::AddCommandModule(const std::string& handler) {
     const std::string answers = folder_.Path("modules/zel_command");
     AddModule("zel_command",
-              "read only = yes\nlist = no\nearly exec = ANSWERS='" + answers + "' " + handler);
+              "read only = yes\nlist = no\nearly exec = ANSWERS='" + answers + "' exec " + handler);
 }
 
 bool SshServer::Available() {
