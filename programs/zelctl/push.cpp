@@ -288,8 +288,8 @@ private:
         if (ran != 0 || (status != 0 && status != kVanishedFiles)) {
             return Failed("share '" + share + "' cannot be compared", status);
         }
-        printf("%s: %llu files (%s) would be sent, %llu entries deleted.\n", share.c_str(),
-               static_cast<unsigned long long>(sends), programs::HumanBytes(bytes).c_str(),
+        printf("%s: %s (%s) would be sent, %llu deleted.\n", programs::Printable(share).c_str(),
+               programs::Count(sends, "file").c_str(), programs::HumanBytes(bytes).c_str(),
                static_cast<unsigned long long>(deletes));
         return kOk;
     }
