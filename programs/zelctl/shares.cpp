@@ -10,6 +10,7 @@
 #include "ZEL/zel.h"
 #include "programs/common/table.h"
 #include "programs/common/text.h"
+#include "programs/zelctl/prepare.h"
 #include "tarq/owners.h"
 #include "tarq/share.h"
 
@@ -61,6 +62,10 @@ ExitCode CheckShare(const std::string& name) {
 }  // namespace
 
 ExitCode AddShare(const std::string& name, const std::string& path, bool acl, bool windows) {
+    const ExitCode prepared = PrepareHost();
+    if (prepared != kOk) {
+        return prepared;
+    }
     std::error_code error;
     const std::string absolute = std::filesystem::absolute(path, error).lexically_normal();
     unsigned int flags = 0;
