@@ -225,6 +225,7 @@ std::vector<std::string> LookUp(int count) {
     std::vector<TARQNetAddress> records(20);
     const int filled = TARQNetLookupIP("server", records.data(), count, 0);
     std::vector<std::string> texts;
+    texts.reserve(records.size());
     for (int i = 0; i < filled; ++i) {
         texts.emplace_back(records[static_cast<size_t>(i)].address);
     }

@@ -52,6 +52,7 @@ std::vector<std::string> Names() {
     const TARQ::ListOwner list(KAPICSzListAlloc(0));
     EXPECT_EQ(TARQShareEnum(list.get()), 0);
     std::vector<std::string> names;
+    names.reserve(static_cast<size_t>(KAPICSzListCount(list.get())));
     for (int i = 0; i < KAPICSzListCount(list.get()); ++i) {
         names.emplace_back(KAPICSzListGet(list.get(), i));
     }
@@ -403,6 +404,7 @@ TEST_F(Catalogue, WritersDoNotLoseEachOthersShares) {
     constexpr int kWriters = 4;
     constexpr int kShares = 6;
     std::vector<std::thread> writers;
+    writers.reserve(kWriters);
     for (int writer = 0; writer < kWriters; ++writer) {
         writers.emplace_back([this, writer] {
             for (int i = 0; i < kShares; ++i) {

@@ -142,8 +142,10 @@ TEST_F(Supervised, CommandThatCannotRunIsAnErrorAndLeavesNothing) {
 
 TEST_F(Supervised, StartersDoNotStartItTwice) {
     ConfigureScript("echo x >> $TARQ_ROOT/starts\nexec sleep 1000\n");
+    constexpr int kStarters = 4;
     std::vector<std::thread> starters;
-    for (int i = 0; i < 4; ++i) {
+    starters.reserve(kStarters);
+    for (int i = 0; i < kStarters; ++i) {
         starters.emplace_back([] { EXPECT_EQ(TARQSystemdStart("unit"), 1); });
     }
     for (std::thread& starter : starters) {
