@@ -333,7 +333,7 @@ TEST_F(Zel, TempFilesAreNewEmptyAndPrivate) {
 }
 
 TEST_F(Zel, ALockIsHeldFromExLockToUnLockOrTheEnd) {
-    const std::string path = root_.Path("lock");
+    const std::string path = root_.Write("lock", "kept");
     const ZEL::LockFactory factory(path);
     const auto is_free = [&] {
         const int fd = open(path.c_str(), O_RDWR | O_CLOEXEC);
@@ -359,6 +359,7 @@ TEST_F(Zel, ALockIsHeldFromExLockToUnLockOrTheEnd) {
         EXPECT_EQ(holder.ExLock(), 0);
     }
     EXPECT_TRUE(is_free());
+    EXPECT_EQ(test::ReadFile(path), "kept");
     EXPECT_THAT(Faults(), IsEmpty());
 }
 
