@@ -92,9 +92,10 @@ public:
     /// otherwise. `setup`: lets close() linger for 1 s and makes the socket non-blocking. -4: the
     /// channel is open, or fd is no descriptor; -3: setup failed.
     virtual int Open(int fd, bool setup);
-    /// Connects to a dotted IPv4 address. -2: no connection; -3: setup failed. A null address or a
-    /// negative port opens nothing and gives 0: look at IsClosed(). A connection that the channel
-    /// still had is closed.
+    /// Connects to a dotted IPv4 address, in place of a connection that it still has. -2: no
+    /// connection; -3: setup failed. A null address or a negative port opens nothing and gives 0:
+    /// look at IsClosed(). The wait ends with the first answer of the other side, be it a refusal:
+    /// that one shows at the first transfer, as -2.
     virtual int Open(const char* ip, int port);
     /// Sends what the write ring holds, as long as that makes progress, ends TLS and closes the
     /// socket. The channel can be opened again.

@@ -13,9 +13,9 @@
 
 namespace ZEL {
 
-class PStream;
-
 #pragma GCC visibility push(default)
+
+class PStream;
 
 /// Null, an unsigned 64-bit integer, a string, a map from string to PObject in byte-wise key order,
 /// or an array of PObject. A value type: copies are deep, an object owns all that is below it.

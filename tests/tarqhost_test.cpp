@@ -30,7 +30,8 @@ int resolver_result = 0;
 }  // namespace
 
 // A name service of the test's own: the literal addresses above, in that order.
-int getaddrinfo(const char*, const char*, const addrinfo*, addrinfo** found) {
+__attribute__((visibility("default"))) int getaddrinfo(const char*, const char*, const addrinfo*,
+                                                       addrinfo** found) {
     *found = nullptr;
     for (auto text = resolver_answer.rbegin(); text != resolver_answer.rend(); ++text) {
         auto* storage = new sockaddr_storage{};
@@ -52,7 +53,7 @@ int getaddrinfo(const char*, const char*, const addrinfo*, addrinfo** found) {
     }
     return resolver_result;
 }
-void freeaddrinfo(addrinfo* list) noexcept {
+__attribute__((visibility("default"))) void freeaddrinfo(addrinfo* list) noexcept {
     while (list != nullptr) {
         addrinfo* next = list->ai_next;
         delete reinterpret_cast<sockaddr_storage*>(list->ai_addr);

@@ -115,7 +115,8 @@ TEST(MountTable, LongestMountPointHoldsThePathAndTheLastOfEqualOnes) {
 class FakeHost : public testing::Test {
 protected:
     FakeHost() {
-        host_.sys = folder_.Path("sys");
+        // The name of the bus stands above the folder, where it says nothing about any disk.
+        host_.sys = folder_.Path("usb9/sys");
         host_.dev = folder_.Path("dev");
         host_.udev_data = folder_.Path("udev");
         host_.mount_table = folder_.Path("mountinfo");
@@ -125,18 +126,19 @@ protected:
     /// A block device in /sys, such as a partition "devices/pci/ata1/block/sda/sda1" with the
     /// number "8:1".
     void MakeDevice(const std::string& path, const std::string& number) {
-        folder_.Write("sys/" + path + "/dev", number + "\n");
+        folder_.Write("usb9/sys/" + path + "/dev", number + "\n");
         for (const std::string& link :
-             {"sys/dev/block/" + number, "sys/class/block/" + fs::path(path).filename().string()}) {
+             {"usb9/sys/dev/block/" + number,
+              "usb9/sys/class/block/" + fs::path(path).filename().string()}) {
             fs::create_directories(fs::path(folder_.Path(link)).parent_path());
-            fs::create_directory_symlink(folder_.Path("sys/" + path), folder_.Path(link));
+            fs::create_directory_symlink(folder_.Path("usb9/sys/" + path), folder_.Path(link));
         }
     }
     void MakeSlave(const std::string& mapped, const std::string& disk) {
-        fs::create_directories(folder_.Path("sys/" + mapped + "/slaves"));
+        fs::create_directories(folder_.Path("usb9/sys/" + mapped + "/slaves"));
         fs::create_directory_symlink(
-            folder_.Path("sys/" + disk),
-            folder_.Path("sys/" + mapped + "/slaves/" + fs::path(disk).filename().string()));
+            folder_.Path("usb9/sys/" + disk),
+            folder_.Path("usb9/sys/" + mapped + "/slaves/" + fs::path(disk).filename().string()));
     }
     /// What is mounted at <folder>/<point>.
     void Mount(const std::string& point, const std::string& number, const std::string& type,
@@ -179,12 +181,12 @@ TEST_F(FakeHost, DisksAreToldApartByWhereTheyArePluggedIn) {
         MakeDevice(disk.path, number);
         Mount("m" + std::to_string(minor), number, "ext4", "/dev/x");
         if (std::string(disk.path).find("dm-") == std::string::npos) {
-            folder_.Write(std::string("sys/") + disk.path + "/partition", "1\n");
+            folder_.Write(std::string("usb9/sys/") + disk.path + "/partition", "1\n");
         }
     }
-    folder_.Write("sys/devices/pci/ata2/block/sdd/removable", "1\n");
-    folder_.Write("sys/devices/platform/mmc_host/mmc0/block/mmcblk0/device/type", "SD\n");
-    folder_.Write("sys/devices/platform/mmc_host/mmc1/block/mmcblk1/device/type", "MMC\n");
+    folder_.Write("usb9/sys/devices/pci/ata2/block/sdd/removable", "1\n");
+    folder_.Write("usb9/sys/devices/platform/mmc_host/mmc0/block/mmcblk0/device/type", "SD\n");
+    folder_.Write("usb9/sys/devices/platform/mmc_host/mmc1/block/mmcblk1/device/type", "MMC\n");
     MakeSlave("devices/virtual/block/dm-0", disks[0].path);
     MakeSlave("devices/virtual/block/dm-1", "devices/virtual/block/dm-0");
     MakeSlave("devices/virtual/block/dm-1", disks[1].path);
@@ -470,6 +472,14 @@ TEST_F(Catalogue, EmptyMountPointIsNeverAnEmptiedShare) {
         Folder("my volume/docs");
         EXPECT_EQ(ErrorOfGet("docs"), TARQ_ERR_SHARE_VOLUME);
         ASSERT_EQ(umount(volume.c_str()), 0);
+
+        // What a mount hides is not there, however well its mount point fits the path.
+        ASSERT_EQ(mount_at(Folder("my volume/all/deep"), "tmpfs"), 0);
+        ASSERT_EQ(mount_at(volume, "tmpfs"), 0);
+        EXPECT_EQ(VolumePathParseEx(Folder("my volume/all/deep").c_str(), &found), 0);
+        EXPECT_EQ(found.path, volume);
+        ASSERT_EQ(umount(volume.c_str()), 0);
+        ASSERT_EQ(umount(root_.Path("my volume/all/deep").c_str()), 0);
 
         // Another volume over the share's own folder hides its files just as well.
         ASSERT_EQ(mount_at(volume, "tmpfs"), 0);

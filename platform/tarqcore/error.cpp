@@ -55,6 +55,8 @@ const char* KAPICErrText(int code) {
             return "no such section";
         case TARQ_ERR_NO_VOLUME:
             return "the path lies on no volume, or cannot be examined";
+        case TARQ_ERR_LOOKUP:
+            return "the name service failed";
         case TARQ_ERR_SERVICE:
             return "the service manager refused or cannot be reached";
         case TARQ_ERR_SERVICE_BUSY:

@@ -19,7 +19,7 @@ struct RunFacts {
 
 /// What a failure comes to.
 struct Verdict {
-    int status;              ///< what execute() returns
+    int status;  ///< what execute() returns
     RunCause cause;
     std::string first_line;  ///< the failure in plain words, without a newline
 };

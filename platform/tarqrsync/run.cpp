@@ -11,7 +11,6 @@
 #include <cerrno>
 #include <charconv>
 #include <cstring>
-#include <system_error>
 
 #include "platform/internal/child_process.h"
 #include "platform/internal/unique_fd.h"
@@ -59,7 +58,7 @@ std::string RandomSession() {
     std::array<unsigned char, 16> bytes;
     // Up to 256 bytes come whole or not at all.
     if (getrandom(bytes.data(), bytes.size(), 0) != static_cast<ssize_t>(bytes.size())) {
-        throw std::system_error(errno, std::generic_category(), "no random numbers");
+        throw PrivateFileError("no random numbers for a session");
     }
     std::string session;
     for (const unsigned char byte : bytes) {
@@ -119,7 +118,7 @@ bool IsMissing(const std::string& path) {
 int Run::Execute(const std::function<bool()>& cancelled) {
     try {
         outcome_.status = Attempt(cancelled);
-    } catch (const std::system_error& error) {
+    } catch (const PrivateFileError& error) {
         outcome_.status = Fail(kStatusFileIo, error.what());
     }
     return outcome_.status;

@@ -105,7 +105,7 @@ protected:
     static std::set<std::string> Tree(const std::string& folder) {
         std::set<std::string> names;
         for (const auto& entry : fs::recursive_directory_iterator(folder)) {
-            names.insert(entry.path().string().substr(folder.size() + 1));
+            names.insert(entry.path().lexically_relative(folder));
         }
         return names;
     }
@@ -315,7 +315,7 @@ TEST_F(RsyncWrapperTest, APasswordIsInNoArgumentNoEnvironmentAndNoFileOfARun) {
         }
         for (const std::string& name : Leftovers()) {
             struct stat info;
-            if (stat(root_.Path("tmp/" + name).c_str(), &info) == 0) {
+            if (stat(root_.Path("tmp/" + name).c_str(), &info) == 0 && S_ISREG(info.st_mode)) {
                 EXPECT_EQ(info.st_mode & 077, 0U) << name;
                 EXPECT_THAT(test::ReadFile(root_.Path("tmp/" + name)), Not(HasSubstr(secret)));
             }
@@ -395,8 +395,7 @@ TEST_F(RsyncWrapperTest, ARelativeSubTreeDeletesNothingOutsideOfIt) {
 TEST_F(RsyncWrapperTest, ExcludeRulesAreTakenAsTheyStandAndProtectTheDestination) {
     const std::list<std::string> rules = {"#recycle", "+ x",   ";c",       "!",
                                           "- y",      "*.tmp", "new\nline"};
-    for (const std::string& name :
-         {"#recycle", "+ x", ";c", "!", "- y", "a.tmp", "new\nline", "copied"}) {
+    for (const char* name : {"#recycle", "+ x", ";c", "!", "- y", "a.tmp", "new\nline", "copied"}) {
         AddToSource(name);
     }
     std::list<std::string> many = rules;
@@ -518,11 +517,11 @@ TEST_F(RsyncWrapperTest, AKilledPushNeverLeavesHalfAFileUnderItsNameAndTheNextOn
         fs::remove_all(module_);
         fs::create_directories(module_);
         RunOptions slow;
-        slow.bandwidth_limit = 2048;
+        slow.bandwidth_limit = 1024;
         uint64_t done = 0;
         slow.on_progress = [&](const RunProgress& p) { done = p.bytes_done; };
         const auto set = [&](RsyncWrapper& w) { w.setDeltaCopy(delta); };
-        EXPECT_EQ(Copy(Source(), set, slow, [&] { return done > 1U << 20; }), 20);
+        EXPECT_EQ(Copy(Source(), set, slow, [&] { return done > 1U << 19; }), 20);
         EXPECT_FALSE(fs::exists(module_ + "/large"));
         // The daemon notices the broken connection by itself; what it keeps of the file it has in
         // hand lies apart.
@@ -533,7 +532,7 @@ TEST_F(RsyncWrapperTest, AKilledPushNeverLeavesHalfAFileUnderItsNameAndTheNextOn
         EXPECT_EQ(Copy(Source(), set), 0);
         EXPECT_EQ(test::ReadFile(module_ + "/large"), content);
         EXPECT_THAT(Tree(module_), UnorderedElementsAre("large"));
-        EXPECT_EQ(report_.bytes_sent < 3U << 20, delta);
+        EXPECT_EQ(report_.bytes_sent < content.size(), delta);
     }
 }
 
@@ -575,7 +574,7 @@ TEST_F(RsyncWrapperTest, AnRsyncThatIsMissingOrTooOldIsNamed) {
     EXPECT_EQ(Command({"command=\"X\""}), 1);
     EXPECT_THAT(report_.explanation, StartsWith(old + " is rsync 3.1.3, which is too old"));
 
-    Configure("port=\"many\"\n");
+    root_.Write("usr/tarq/etc/tarqrsync.conf", "[rsync]\nport=\"many\"\n");
     EXPECT_EQ(Copy(Source()), 1);
     EXPECT_THAT(report_.explanation, HasSubstr("port 'many'"));
 }
@@ -600,6 +599,7 @@ protected:
             GTEST_SKIP() << "this machine cannot run an ssh server for the test";
         }
         server_ = std::make_unique<test::SshServer>();
+        daemon_.AddAccount(server_->User(), test::SshServer::kPassphrase);
         UseKey(false);
     }
 
@@ -608,7 +608,7 @@ protected:
                   server_->ClientKey(with_passphrase) + "\"\n");
     }
 
-    /// The daemon's user is not the machine's: the login has its own name.
+    /// Login and daemon have an account of the same name; the module "open" asks for none.
     int Over(const std::string& password, const std::function<void(RsyncWrapper&)>& set,
              const std::function<bool()>& cancelled = nullptr) {
         RsyncWrapper wrapper;
@@ -635,6 +635,10 @@ TEST_F(RsyncWrapperSshTest, ModulesCommandsAndDirectoriesAreReached) {
                 HasSubstr("127.0.0.1"));
 
     UseKey(true);
+    EXPECT_EQ(Over(test::SshServer::kPassphrase,
+                   [](RsyncWrapper& w) { w.setTarqCustCmdRule({"command=\"X\""}); }),
+              214)
+        << report_.explanation;
     const std::string directory = root_.Path("far away 'dir'");
     fs::create_directories(directory);
     EXPECT_EQ(Over(test::SshServer::kPassphrase,
@@ -677,7 +681,7 @@ TEST_F(RsyncWrapperSshTest, FailuresSayWhichEndRefusedAndWhatToDo) {
 }
 
 TEST_F(RsyncWrapperSshTest, APassphraseIsSeenNowhereAndACancelledRunLeavesNoSsh) {
-    ServeCommands("sleep 20");
+    ServeCommands("cat > /dev/null; sleep 20");
     UseKey(true);
     const std::string secret = test::SshServer::kPassphrase;
     const std::string port = std::to_string(server_->Port());

@@ -107,9 +107,7 @@ int FreePort() {
 }
 
 RsyncDaemon::RsyncDaemon(const std::string& global_lines) : port_(FreePort()) {
-    const std::string secrets =
-        folder_.Write("secrets", std::string(kUser) + ":" + kPassword + "\n");
-    chmod(secrets.c_str(), 0600);
+    AddAccount(kUser, kPassword);
     const std::string configuration = folder_.Write(
         "rsyncd.conf", "use chroot = no\nsocket options = TCP_NODELAY\nreverse lookup = no\n" +
                            std::string(geteuid() == 0 ? "uid = 0\ngid = 0\n" : "") + global_lines +
@@ -120,12 +118,18 @@ RsyncDaemon::RsyncDaemon(const std::string& global_lines) : port_(FreePort()) {
                    folder_.Path("output"), port_);
 }
 
+void RsyncDaemon::AddAccount(const std::string& user, const std::string& password) {
+    const std::string secrets = folder_.Path("secrets");
+    std::ofstream(secrets, std::ios::app) << user << ":" << password << "\n";
+    chmod(secrets.c_str(), 0600);
+}
+
 std::string RsyncDaemon::AddModule(const std::string& name, const std::string& lines) {
     const std::string path = folder_.Path("modules/" + name);
     fs::create_directories(path);
     std::ofstream(folder_.Path("rsyncd.conf"), std::ios::app)
-        << "[" << name << "]\npath = " << path << "\nread only = no\nauth users = " << kUser
-        << "\nsecrets file = " << folder_.Path("secrets") << "\n"
+        << "[" << name << "]\npath = " << path
+        << "\nread only = no\nauth users = *\nsecrets file = " << folder_.Path("secrets") << "\n"
         << lines << "\n";
     return path;
 }
@@ -133,7 +137,7 @@ std::string RsyncDaemon::AddModule(const std::string& name, const std::string& l
 void RsyncDaemon::AddCommandModule(const std::string& handler) {
     const std::string answers = folder_.Path("modules/zel_command");
     AddModule("zel_command",
-              "read only = yes\nlist = no\nearly exec = ANSWERS='" + answers + "' " + handler);
+              "read only = yes\nlist = no\nearly exec = ANSWERS='" + answers + "' exec " + handler);
 }
 
 bool SshServer::Available() {

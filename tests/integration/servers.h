@@ -43,8 +43,11 @@ public:
     /// `global_lines`: added to the global part of the configuration.
     explicit RsyncDaemon(const std::string& global_lines = "");
 
-    /// Adds a module for kUser with a folder of its own, writable, below Folder(). `lines` are put
-    /// behind the module's other lines, where they count in their place. Returns the folder.
+    /// Lets one more account log in.
+    void AddAccount(const std::string& user, const std::string& password);
+    /// Adds a module for all accounts with a folder of its own, writable, below Folder(). `lines`
+    /// are put behind the module's other lines, where they count in their place. Returns the
+    /// folder.
     std::string AddModule(const std::string& name, const std::string& lines = "");
     /// Adds the module of server commands: `handler` (a program with arguments) gets each command
     /// on its standard input, with the folder of the answers in $ANSWERS and the module's variables
