@@ -26,14 +26,9 @@ private:
     }
 };
 
-struct tm Parse(const char* text) {
+long Utc(const char* text) {
     struct tm time = {};
     EXPECT_NE(strptime(text, "%Y-%m-%d %H:%M:%S", &time), nullptr) << text;
-    return time;
-}
-
-long Utc(const char* text) {
-    struct tm time = Parse(text);
     return timegm(&time);
 }
 
@@ -70,9 +65,6 @@ TEST(Schedule, DefaultIsManualAndValid) {
     EXPECT_TRUE(schedule.Validate());
     EXPECT_EQ(schedule.GetModeStr(), "manual");
     EXPECT_EQ(schedule.GetNextScheduledSeconds(1), 0);
-    const struct tm begin = schedule.GetScheduleBegin();
-    EXPECT_THAT((std::vector<int>{begin.tm_year, begin.tm_mon, begin.tm_mday}),
-                ElementsAre(114, 0, 1));
 }
 
 TEST(Schedule, SettersKeepModePeriodAndWeekSound) {
@@ -123,11 +115,9 @@ TEST(Schedule, ValidateLogsTheFirstFault) {
         {[](Schedule& s) { s.SetStartHour(23), s.SetStartMinute(59); }, {}},
         {[](Schedule& s) { s.SetStartHour(24), s.SetStartMinute(60); }, {"Invalid begin hour"}},
         {[](Schedule& s) { s.SetStartHour(-1); }, {"Invalid begin hour"}},
-        {[](Schedule& s) { s.SetStartMinute(60); }, {"Invalid begin minute"}},
         {[](Schedule& s) { s.SetStartMinute(INT_MIN); }, {"Invalid begin minute"}},
         {[](Schedule& s) { s.SetPeriod(86399); }, {}},
         {[](Schedule& s) { s.SetPeriod(86400); }, {"Invalid period or repeat"}},
-        {[](Schedule& s) { s.SetPeriod(-1); }, {"Invalid period or repeat"}},
         {[](Schedule& s) { s.SetPeriod(LONG_MAX / 3600 + 1, 0); }, {"Invalid period or repeat"}},
         {[](Schedule& s) { s.SetPeriod(900), s.SetRepeatTimesInDay(95); }, {}},
         {[](Schedule& s) { s.SetPeriod(1), s.SetRepeatTimesInDay(96); }, {"Invalid period"}},
@@ -135,12 +125,10 @@ TEST(Schedule, ValidateLogsTheFirstFault) {
         {[](Schedule& s) { s = Make("weekly", "", 23, 1800, 1); }, {}},
         {[](Schedule& s) { s = Make("weekly", "", 23, 1800, 2); },
          {"Invalid repeat in day [82800 + 1800 * 2]"}},
-        {[](Schedule& s) { s.SetBeginYear(1950); }, {"Invalid begin", "50 0 1 12 0 0"}},
         {[](Schedule& s) { s.SetBeginYear(INT_MIN), s.SetBeginMonth(INT_MIN); },
          {"Invalid begin", "-2147483648 -2147483648 1 12 0 0"}},
         {[](Schedule& s) { s = Make("once", "2015-2-29", 0); }, {"Invalid begin date"}},
-        {[](Schedule& s) { s = Make("once", "2016-2-29", 0); }, {}},
-        {[](Schedule& s) { s = Make("once", "2025-3-30", 2); }, {}},
+        {[](Schedule& s) { s = Make("once", "2016-2-29", 2); }, {}},
         {[](Schedule& s) { s.SetBeginMonth(13); }, {"Invalid begin date"}},
         {[](Schedule& s) { const Schedule taken = std::move(s); }, {"Wrong length of weekday ''"}},
         {[](Schedule& s) { s.SetMode(static_cast<ZEL::SCHD_MODE>(6)); },
@@ -248,44 +236,42 @@ TEST(Schedule, TheEndOfA32BitClockIsAFailureThereAloneAndIsLogged) {
         return;
     }
     EXPECT_EQ(next, -1);
-    EXPECT_THAT(
-        log.Lines(),
-        ElementsAre("[ERROR] ZEL/sync_obj(N): Fail to get scheduled seconds, year:[138], mon:[0], "
-                    "mday:[19], hour:[8], min:[0], sec:[0], dst:[0]",
-                    "[WARNING] ZEL/sync_obj(N): Fail to mktime.",
-                    "[ERROR] ZEL/sync_obj(N): Fail to get reference seconds, year:[138], mon:[0], "
-                    "mday:[20], hour:[0], min:[0], sec:[0], dst:[0]"));
+    const std::string zeros = "min:[0], sec:[0], dst:[0]";
+    EXPECT_EQ(log.Text(),
+              "[ERROR] ZEL/sync_obj(N): Fail to get scheduled seconds, year:[138], mon:[0], "
+              "mday:[19], hour:[8], " +
+                  zeros +
+                  "\n[WARNING] ZEL/sync_obj(N): Fail to mktime.\n"
+                  "[ERROR] ZEL/sync_obj(N): Fail to get reference seconds, year:[138], mon:[0], "
+                  "mday:[20], hour:[0], " +
+                  zeros + "\n");
 }
 
-// ---- Against a walk over the calendar ----
-
-int DaysInMonth(int year, int month) {
-    const int days[] = {31, 28, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
-    const bool leap = (year % 4 == 0 && year % 100 != 0) || year % 400 == 0;
-    return month == 2 && leap ? 29 : days[month - 1];
-}
-
-// Whether the schedule's day of a month from `since` (months since year 0) on is the date of
-// `time`.
+// Whether the date of `time` is a day of the schedule: of months from `since` (counted from 1900)
+// on.
 bool IsRunDay(const Schedule& schedule, const struct tm& time, int since) {
-    const int year = time.tm_year + 1900;
-    const int month = time.tm_mon + 1;
-    const int day = schedule.GetBeginDay();
-    const auto is_run_month = [&](int y, int m) {
-        return y * 12 + m >= since &&
-               (schedule.GetMode() == ZEL::SCHD_MODE_MONTHLY || m == schedule.GetBeginMonth()) &&
-               (schedule.GetMode() != ZEL::SCHD_MODE_ONCE || y == schedule.GetBeginYear());
-    };
     if (schedule.GetMode() == ZEL::SCHD_MODE_WEEKLY) {
         return schedule.GetWeekSchedule()[static_cast<size_t>(time.tm_wday)] == '1';
     }
-    if (time.tm_mday == day && is_run_month(year, month)) {
-        return true;
+    for (const int months_back : {0, 1}) {  // a day that last month lacks falls into this one
+        struct tm day = {};
+        day.tm_year = time.tm_year;
+        day.tm_mon = time.tm_mon - months_back;
+        day.tm_mday = 1;
+        timegm(&day);
+        const struct tm month = day;
+        day.tm_mday = schedule.GetBeginDay();
+        timegm(&day);
+        if (day.tm_mon == time.tm_mon && day.tm_mday == time.tm_mday &&
+            month.tm_year * 12 + month.tm_mon >= since &&
+            (schedule.GetMode() == ZEL::SCHD_MODE_MONTHLY ||
+             month.tm_mon + 1 == schedule.GetBeginMonth()) &&
+            (schedule.GetMode() != ZEL::SCHD_MODE_ONCE ||
+             month.tm_year + 1900 == schedule.GetBeginYear())) {
+            return true;
+        }
     }
-    const int last_year = month == 1 ? year - 1 : year;
-    const int last_month = month == 1 ? 12 : month - 1;
-    return time.tm_mday + DaysInMonth(last_year, last_month) == day &&
-           is_run_month(last_year, last_month);
+    return false;
 }
 
 // Looks at every local minute after `reference`; `steady` tells whether daylight saving stayed as
@@ -293,7 +279,7 @@ bool IsRunDay(const Schedule& schedule, const struct tm& time, int since) {
 long WalkToNextRun(const Schedule& schedule, long reference, bool& steady) {
     struct tm now = {};
     localtime_r(&reference, &now);
-    const int since = (now.tm_year + 1900) * 12 + now.tm_mon + 1;
+    const int since = now.tm_year * 12 + now.tm_mon;
     const long month_start = reference - (now.tm_mday + 1) * 86400L;
     long time = reference - reference % 60 + 60;
     for (; time < reference + 400 * 86400L;) {
@@ -345,9 +331,8 @@ TEST(Schedule, AgreesWithAWalkOverTheCalendar) {
             const test::LogCapture quiet(0);
             const bool leap_day = schedule.GetMode() == ZEL::SCHD_MODE_YEARLY &&
                                   schedule.GetBeginMonth() == 2 && schedule.GetBeginDay() == 29;
-            if (leap_day ||
-                !schedule.Validate()) {  // where a leap day comes from counts: see NextRun
-                continue;
+            if (leap_day || !schedule.Validate()) {
+                continue;  // a leap day depends on where it is reached from: see NextRun
             }
             struct tm begin = schedule.GetScheduleBegin();
             const long reference = mktime(&begin) + pick(-40 * 86400L, 3 * 86400L);
