@@ -72,7 +72,7 @@ void Compare(const char* name, const ZEL::Schedule& schedule, int from_hour) {
     // About the same hour (UTC) of most days over three and a half years.
     std::vector<long> references;
     for (long i = 0; i < kReferences; ++i) {
-        references.push_back(1735689600 + i * 31 / 24 * 86400 + from_hour * 3600 + i % 1800);
+        references.push_back(1735689600 + i * 31 / 24 * 86400 + from_hour * 3600L + i % 1800);
     }
     const auto runs = [&] {
         for (const long reference : references) {

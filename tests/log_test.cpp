@@ -129,19 +129,14 @@ TEST_F(Log, KeepsOneRotatedFileFewerThanTheCount) {
     }
 }
 
-TEST_F(Log, ComplaintsOfARotationGoToTheSystemLog) {
+TEST_F(Log, AFailedRotationIsReportedAndSilencesTheLogUntilItIsSetUpAgain) {
     ASSERT_EQ(OpenFile(2), 0);
+    std::filesystem::remove(path_);
     WriteLine(0x100001, 'a');
     EXPECT_THAT(test::TakeSyslogTexts(),
                 ElementsAre("ZEL/log:145 failed to rename old_name '" + path_ +
                                 "_0' to new_name '" + path_ + "_1'.",
                             "ZEL/log:152 failed to remove old_name '" + path_ + "_1'."));
-}
-
-TEST_F(Log, AFailedRotationSilencesTheLogUntilItIsSetUpAgain) {
-    ASSERT_EQ(OpenFile(1), 0);
-    std::filesystem::remove(path_);
-    WriteLine(0x100001, 'a');
     WriteLine(100, 'b');
     EXPECT_FALSE(std::filesystem::exists(path_));
     ASSERT_EQ(OpenFile(1), 0);

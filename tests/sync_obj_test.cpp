@@ -27,7 +27,6 @@ int TARQShareIsInSharebin(const char* name) {
 namespace {
 
 using testing::ElementsAre;
-using testing::IsEmpty;
 using ZEL::SyncInfo;
 using ZEL::TaskInfo;
 
@@ -45,12 +44,9 @@ TEST(SyncInfo, SwitchesTouchTheirOwnBitAlone) {
     EXPECT_EQ(info.GetSyncConfigFlag(), 0x13U);
     info.SetCompression(false);
     EXPECT_EQ(info.GetSyncConfigFlag(), 0x12U);
-    EXPECT_TRUE(info.UseSSH());
-    EXPECT_FALSE(info.UseCompression());
-    EXPECT_FALSE(info.UseBlockLevelSync());
+    EXPECT_TRUE(info.UseSSH() && !info.UseCompression() && !info.UseBlockLevelSync());
     info.SetBlockLevelSync(true);
     EXPECT_EQ(info.GetSyncConfigFlag(), 0x16U);
-    EXPECT_TRUE(info.UseBlockLevelSync());
 }
 
 TEST(SyncInfo, ValidateLogsTheFirstFault) {
@@ -108,15 +104,12 @@ TEST(TaskInfo, ValidateLogsTheFirstFaultAndAsksNoFurther) {
 
 TEST(Event, RelativePathBeginsWithASlashOnceSet) {
     ZEL::Event event;
-    EXPECT_THAT(event.GetRelativePath(), IsEmpty());
-    struct {
-        const char* given;
-        const char* kept;
-    } const cases[] = {
+    EXPECT_EQ(event.GetRelativePath(), "");
+    const std::pair<const char*, const char*> cases[] = {
         {"a/b", "/a/b"}, {"/a/b", "/a/b"}, {"", "/"}, {"//x/", "//x/"}, {"../x", "/../x"}};
-    for (const auto& c : cases) {
-        event.SetRelativePath(c.given);
-        EXPECT_EQ(event.GetRelativePath(), c.kept);
+    for (const auto& [given, kept] : cases) {
+        event.SetRelativePath(given);
+        EXPECT_EQ(event.GetRelativePath(), kept);
     }
 }
 
