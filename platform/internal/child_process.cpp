@@ -33,6 +33,10 @@ constexpr milliseconds kTermGrace(300);
 // What the kernel gets to bury the rest of a killed group: it needs far less.
 constexpr milliseconds kBurialGrace(200);
 
+// How long and how often a program is watched that has done its work.
+constexpr milliseconds kEarlyEndWatch(100);
+constexpr milliseconds kEarlyEndStep(1);
+
 constexpr int kFirstFreeFd = 3;
 
 struct Pipe {
@@ -165,6 +169,8 @@ public:
     ProcessGroup(const ProcessGroup&) = delete;
     ProcessGroup& operator=(const ProcessGroup&) = delete;
 
+    pid_t Leader() const { return leader_; }
+
     // Readable once the leader has ended; -1 on a kernel that has no such descriptor.
     int ExitFd() const { return exit_fd_.Get(); }
 
@@ -278,25 +284,61 @@ int Start(const ChildSpec& spec, std::optional<ProcessGroup>* group, Stream* out
     return 0;
 }
 
-// Waits until something happens or the time is up; a negative time never is.
+// Follows an EarlyEnd: sleeps until its descriptor is readable, then asks for a while.
+class EarlyEndWatch {
+public:
+    explicit EarlyEndWatch(const EarlyEnd& early_end)
+        : early_end_(early_end), fd_(early_end.reached ? early_end.ready_fd : -1) {}
+
+    // What to wait for; -1 when there is nothing.
+    int Fd() const { return fd_; }
+    bool IsAsking() const { return asking_; }
+
+    void FdIsReadable() {
+        fd_ = -1;
+        asking_ = true;
+        until_ = Clock::now() + kEarlyEndWatch;
+    }
+
+    bool IsReached(pid_t leader) {
+        asking_ = asking_ && Clock::now() <= until_;
+        return asking_ && early_end_.reached(leader);
+    }
+
+private:
+    const EarlyEnd& early_end_;
+    int fd_;
+    bool asking_ = false;
+    Clock::time_point until_;
+};
+
+// Waits until something happens or the time is up; without a time, for as long as it takes.
 void Wait(const ProcessGroup& group, const Stream& output, const Stream& error,
-          std::optional<Clock::time_point> until) {
+          EarlyEndWatch* watch, std::optional<Clock::time_point> until) {
     // poll() skips descriptors of -1, which is what a closed stream and a kernel without pidfds
     // have.
-    std::array<pollfd, 3> fds = {
-        {{group.ExitFd(), POLLIN, 0}, {output.fd.Get(), POLLIN, 0}, {error.fd.Get(), POLLIN, 0}}};
+    std::array<pollfd, 4> fds = {{{group.ExitFd(), POLLIN, 0},
+                                  {output.fd.Get(), POLLIN, 0},
+                                  {error.fd.Get(), POLLIN, 0},
+                                  {watch->Fd(), POLLIN, 0}}};
     int timeout = group.ExitFd() >= 0 ? -1 : static_cast<int>(kAskInterval.count());
     if (until) {
         const auto left = std::chrono::ceil<milliseconds>(*until - Clock::now()).count();
         timeout = static_cast<int>(std::clamp<long long>(left, 0, kAskInterval.count()));
     }
-    poll(fds.data(), fds.size(), timeout);
+    if (watch->IsAsking()) {
+        timeout = static_cast<int>(kEarlyEndStep.count());
+    }
+    if (poll(fds.data(), fds.size(), timeout) > 0 && fds[3].revents != 0) {
+        watch->FdIsReadable();
+    }
 }
 
 }  // namespace
 
 ChildResult RunChild(const ChildSpec& spec, const std::function<bool()>& cancelled,
-                     const OutputHandler& on_output, const OutputHandler& on_error) {
+                     const OutputHandler& on_output, const OutputHandler& on_error,
+                     const EarlyEnd& early_end) {
     const OutputHandler nowhere = [](const char*, size_t) {};
     Stream output = {UniqueFd(), on_output ? &on_output : &nowhere};
     Stream error = {UniqueFd(), on_error ? &on_error : &nowhere};
@@ -315,12 +357,17 @@ ChildResult RunChild(const ChildSpec& spec, const std::function<bool()>& cancell
     if (cancelled) {
         next_step = Clock::now() + kAskInterval;
     }
+    EarlyEndWatch watch(early_end);
     while (!group->LeaderHasEnded()) {
-        Wait(*group, output, error, next_step);
+        Wait(*group, output, error, &watch, next_step);
         for (Stream* stream : {&output, &error}) {
             if (stream->fd) {
                 stream->ReadOnce();
             }
+        }
+        if (!result.cancelled && watch.IsReached(group->Leader())) {
+            result.ended_early = true;
+            break;
         }
         if (!next_step || Clock::now() < *next_step) {
             continue;

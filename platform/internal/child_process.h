@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/types.h>
+
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -23,9 +25,17 @@ struct ChildSpec {
 constexpr size_t kMaxChildInput = 4096;
 
 struct ChildResult {
-    int start_error = 0;     ///< errno when the program could not be started, else 0
-    bool cancelled = false;  ///< `cancelled` said true
-    int wait_status = 0;     ///< as waitpid() gives it; -1 when somebody else has taken it
+    int start_error = 0;       ///< errno when the program could not be started, else 0
+    bool cancelled = false;    ///< `cancelled` said true
+    bool ended_early = false;  ///< EarlyEnd::reached said true
+    int wait_status = 0;       ///< as waitpid() gives it; -1 when somebody else has taken it
+};
+
+/// For a program whose work is done some time before it ends by itself.
+struct EarlyEnd {
+    int ready_fd =
+        -1;  ///< from when it is readable, `reached` is asked each millisecond for a while
+    std::function<bool(pid_t leader)> reached;  ///< true: the rest of the program is not needed
 };
 
 using OutputHandler = std::function<void(const char* bytes, size_t size)>;
@@ -41,7 +51,8 @@ using OutputHandler = std::function<void(const char* bytes, size_t size)>;
 /// May be called from any thread. The process's signal dispositions are neither used nor changed; a
 /// process that ignores SIGCHLD, or reaps every child it finds, gets wait_status -1.
 ChildResult RunChild(const ChildSpec& spec, const std::function<bool()>& cancelled,
-                     const OutputHandler& on_output, const OutputHandler& on_error);
+                     const OutputHandler& on_output, const OutputHandler& on_error,
+                     const EarlyEnd& early_end = {});
 
 /// The path of the executable `name`: itself when it holds a slash, else the first of that name
 /// along `search_path` (folders joined by ":"). Empty when there is none.

@@ -1,6 +1,7 @@
 #include "platform/tarqrsync/run.h"
 
 #include <fcntl.h>
+#include <sys/inotify.h>
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -13,6 +14,7 @@
 #include <cstring>
 
 #include "platform/internal/child_process.h"
+#include "platform/internal/proc_stat.h"
 #include "platform/internal/unique_fd.h"
 #include "platform/tarqrsync/answer_file.h"
 #include "platform/tarqrsync/message_keeper.h"
@@ -113,6 +115,55 @@ bool IsMissing(const std::string& path) {
     return lstat(path.c_str(), &info) != 0 && (errno == ENOENT || errno == ENOTDIR);
 }
 
+// The first child of `parent`, if it was made soon after its parent; else -1.
+pid_t FindChild(pid_t parent) {
+    constexpr pid_t kSoon = 256;
+    for (pid_t pid = parent + 1; pid <= parent + kSoon; ++pid) {
+        const auto stat = tarq_internal::ReadProcStat(pid);
+        if (stat && stat->parent == parent) {
+            return pid;
+        }
+    }
+    return -1;
+}
+
+// rsync receives in a child, which renames the answer into place once it has checked it, and ends
+// when the connection's last words are said. The parent then sleeps for 20 ms before it looks
+// whether the child is gone: half of what a command costs. The watch sees both and lets the
+// run end there. Where it cannot see them the run ends by itself.
+class AnswerWatch {
+public:
+    AnswerWatch(const std::string& folder, const std::string& answer_file)
+        : answer_file_(answer_file), notify_(inotify_init1(IN_CLOEXEC | IN_NONBLOCK)) {
+        if (notify_ && inotify_add_watch(notify_.Get(), folder.c_str(), IN_MOVED_TO) < 0) {
+            notify_.Reset();
+        }
+    }
+
+    tarq_internal::EarlyEnd End() {
+        return {notify_.Get(), [this](pid_t rsync) { return IsOver(rsync); }};
+    }
+
+private:
+    bool IsOver(pid_t rsync) {
+        if (IsMissing(answer_file_)) {
+            return false;
+        }
+        if (receiver_ < 0) {
+            receiver_ = FindChild(rsync);
+        }
+        if (receiver_ < 0) {
+            return false;
+        }
+        const auto stat = tarq_internal::ReadProcStat(receiver_);
+        return !stat || stat->state == 'Z';
+    }
+
+    std::string answer_file_;
+    tarq_internal::UniqueFd notify_;
+    pid_t receiver_ = -1;
+};
+
 }  // namespace
 
 int Run::Execute(const std::function<bool()>& cancelled) {
@@ -159,7 +210,12 @@ int Run::RunCommand(const std::function<bool()>& cancelled) {
     const InvocationContext context = {settings_, config_, no_options, false, false, log_file_};
     const Invocation invocation =
         CommandInvocation(context, folder_.Write("command", text), session, answer_file, &folder_);
-    const int status = RunRsync(cancelled, invocation, &parser, kMaxCommandFileBytes);
+    AnswerWatch watch(folder_.Path(""), answer_file);
+    ChildLimits limits = {kMaxCommandFileBytes, {}};
+    if (TransportOf(settings_) == Transport::DAEMON) {  // else rsync has other children
+        limits.early_end = watch.End();
+    }
+    const int status = RunRsync(cancelled, invocation, &parser, limits);
     // rsync tells on its standard output what it did not take for an answer, a link for example.
     messages_ += parser.OtherText();
     return status == STATUS_DONE ? TakeAnswer(answer_file) : status;
@@ -199,7 +255,7 @@ int Run::RunCopy(const std::function<bool()>& cancelled) {
     while (true) {
         OutputParser parser(options_, settings_.list_only);
         PrivateFolder files;
-        const int status = RunRsync(cancelled, CopyInvocation(context, &files), &parser, 0);
+        const int status = RunRsync(cancelled, CopyInvocation(context, &files), &parser, {});
         parser.Finish();
         parser.FillReport(&outcome_);
         const RefusedAttributes refused = FindRefusedAttributes(Facts(status));
@@ -218,7 +274,7 @@ int Run::RunCopy(const std::function<bool()>& cancelled) {
 
 // Runs one rsync; after a failure the explanation is there.
 int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invocation,
-                  OutputParser* parser, uint64_t max_file_bytes) {
+                  OutputParser* parser, const ChildLimits& limits) {
     outcome_.explanation.clear();
     messages_.clear();
     ChildSpec spec;
@@ -227,7 +283,7 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     spec.arguments.insert(spec.arguments.begin(), config_.rsync);
     spec.environment = invocation.environment;
     spec.input = invocation.input;
-    spec.max_file_bytes = max_file_bytes;
+    spec.max_file_bytes = limits.max_file_bytes;
     if (spec.program.empty()) {
         return Fail(STATUS_RSYNC_MISSING, "the program " + config_.rsync + " is not installed");
     }
@@ -240,7 +296,8 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
         },
         [&keeper](const char* bytes, size_t size) {
             keeper.Feed({bytes, size});
-        });
+        },
+        limits.early_end);
     messages_ = keeper.Text();
     if (result.start_error != 0) {
         return Fail(STATUS_RSYNC_MISSING, "the program " + spec.program + " cannot be started: " +
@@ -248,6 +305,9 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     }
     if (result.cancelled) {
         return Fail(STATUS_CANCELLED, "the run was cancelled");
+    }
+    if (result.ended_early) {
+        return STATUS_DONE;
     }
     if (result.wait_status == -1) {
         return Fail(kStatusLostChild,

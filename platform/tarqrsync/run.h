@@ -4,6 +4,7 @@
 #include <functional>
 #include <string>
 
+#include "platform/internal/child_process.h"
 #include "platform/tarqrsync/arguments.h"
 #include "platform/tarqrsync/config.h"
 #include "platform/tarqrsync/explain.h"
@@ -30,12 +31,18 @@ public:
     const RunReport& Outcome() const { return outcome_; }
 
 private:
+    /// What a command's rsync may do, beyond what a copy's may.
+    struct ChildLimits {
+        uint64_t max_file_bytes = 0;
+        tarq_internal::EarlyEnd early_end;
+    };
+
     int Attempt(const std::function<bool()>& cancelled);
     int RunCommand(const std::function<bool()>& cancelled);
     int TakeAnswer(const std::string& answer_file);
     int RunCopy(const std::function<bool()>& cancelled);
     int RunRsync(const std::function<bool()>& cancelled, const Invocation& invocation,
-                 OutputParser* parser, uint64_t max_file_bytes);
+                 OutputParser* parser, const ChildLimits& limits);
     int Fail(int status, const std::string& first_line);
     RunFacts Facts(int exit_code) const { return {settings_, config_, exit_code, messages_}; }
 
