@@ -5,6 +5,7 @@
 #include <fcntl.h>
 #include <limits.h>
 #include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <string.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -128,6 +129,14 @@ bool IsPlainClosed(void* handle) {
     return SocketOf(handle) == -1;
 }
 
+// Writes are gathered here already: a message's last small packet must not wait for the
+// acknowledgement of those before it. Sockets that are no TCP have no such delay, and refuse the
+// option.
+void SendWithoutDelay(int fd) {
+    const int on = 1;
+    setsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
+}
+
 constexpr ChannelOps kPlainOps = {ReadFd, WriteFd, SocketOf, ClosePlain, IsPlainClosed};
 
 }  // namespace
@@ -197,6 +206,9 @@ int Channel::Open(int fd, bool setup) {
     if (fd < 0) {
         return RESULT_INVALID_ARGUMENT;
     }
+    if (setup) {
+        SendWithoutDelay(fd);
+    }
     AdoptSocket(fd);
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): Channel: opening socket %d\n",
                    __LINE__, fd);
@@ -214,6 +226,7 @@ int Channel::Open(const char* ip, int port) {
     if (SetLinger(fd.Get(), kLingerSeconds) != 0 || SetNonBlock(fd.Get()) != 0) {
         return RESULT_SYSTEM;
     }
+    SendWithoutDelay(fd.Get());
     if (ConnectWithTimeout(fd.Get(), ip, port) != 0) {
         return RESULT_IO;
     }

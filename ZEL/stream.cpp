@@ -274,6 +274,11 @@ int PStream::Skip(Channel&, unsigned char) {
 }
 
 void PStream::UpdateStatus(unsigned long long done, unsigned long long total) {
+    // Every scalar comes here. Only the thread that transfers writes the counters, so it may look
+    // at them unlocked.
+    if (status_done_ == done && status_total_ == total) {
+        return;
+    }
     const std::lock_guard<std::mutex> lock(mutex_);
     status_done_ = done;
     status_total_ = total;
