@@ -11,7 +11,7 @@ namespace ZEL {
 
 namespace {
 
-constexpr unsigned int kIndentLevels = 11;  // deeper levels of the trace are not indented further
+constexpr size_t kIndentLevels = 11;  // deeper levels of the trace are not indented further
 constexpr char kIndent[] = "                      ";
 static_assert(sizeof kIndent - 1 == 2 * kIndentLevels);
 
@@ -336,7 +336,7 @@ void PStream::PopKey(std::string& key) {
 }
 
 const char* PStream::Indent() const {
-    return kIndent + 2 * (kIndentLevels - std::min(depth_, kIndentLevels));
+    return kIndent + 2 * (kIndentLevels - std::min<size_t>(depth_, kIndentLevels));
 }
 
 // A loop with a stack of its own: a sender's value may be nested deeper than the thread's stack
