@@ -64,6 +64,7 @@ struct TlsPair {
         EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
         client.Open(fds[0], true);
         server.Open(fds[1], true);
+        client_fd = fds[0];
         server_fd = fds[1];
     }
     int Convert() {
@@ -74,7 +75,7 @@ struct TlsPair {
         return result;
     }
     Channel client, server;
-    int server_result = 1, server_fd = -1;
+    int server_result = 1, client_fd = -1, server_fd = -1;
 };
 
 std::string Pattern(size_t size) {
@@ -232,6 +233,8 @@ TEST_F(Tls, AnInterruptedFlushGoesOnWhereItStopped) {
     TlsPair pair;
     ASSERT_EQ(pair.Convert(), 0);
     const std::string sent = Pattern(3000000);
+    const int size = 1;  // so little that each record leaves in parts
+    setsockopt(pair.client_fd, SOL_SOCKET, SO_SNDBUF, &size, sizeof size);
     int flag = 0;
     pair.client.SetFlag(&flag);
     pair.client.SetTimeout(1);
@@ -251,6 +254,7 @@ TEST_F(Tls, AnInterruptedFlushGoesOnWhereItStopped) {
     std::string received(sent.size(), 0);
     std::thread reader([&] {
         for (size_t at = 0; at < received.size(); at += 100000) {
+            LeaveAnError();
             EXPECT_EQ(pair.server.Read(&received[at], 100000), 0);
         }
     });
