@@ -1,5 +1,6 @@
 #include "platform/tarqrsync/arguments.h"
 
+#include <algorithm>
 #include <cstdlib>
 
 #include "platform/tarqrsync/answer_file.h"
@@ -14,9 +15,10 @@ constexpr char kKnownHostsPath[] = "/usr/tarq/etc/tarqrsync_known_hosts";
 constexpr char kLoopback[] = "127.0.0.1";
 constexpr char kDefaultPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
 
-// Seconds that ssh waits for a connection when the caller has set no time-out, and after which it
-// asks a silent server whether it is still there.
-constexpr int kSshConnectTimeout = 60;
+// Seconds that a connection may take to come up: a server that has not answered by then is not
+// there, however patient the caller is with a slow copy.
+constexpr int kConnectTimeout = 60;
+// Seconds after which ssh asks a silent server whether it is still there.
 constexpr int kSshAliveInterval = 15;
 
 // Where the receiver keeps what it has of a file when a run breaks off. The name is reserved: rsync
@@ -64,6 +66,10 @@ std::string DoubledPercent(const std::string& text) {
     return result;
 }
 
+int ConnectTimeout(const Settings& settings) {
+    return settings.timeout > 0 ? std::min(settings.timeout, kConnectTimeout) : kConnectTimeout;
+}
+
 // The ssh command line up to the host. The configured words come first, as the first value that ssh
 // meets is the one that holds.
 Words SshWords(const InvocationContext& context) {
@@ -76,14 +82,13 @@ Words SshWords(const InvocationContext& context) {
     if (!settings.user.empty()) {
         Append(&words, {"-l", settings.user});
     }
-    const int timeout = settings.timeout > 0 ? settings.timeout : kSshConnectTimeout;
     const std::string known_hosts = DoubledPercent(RootPath(kKnownHostsPath));
     for (const std::string& option : {
              std::string("StrictHostKeyChecking=accept-new"),
              "UserKnownHostsFile=\"" + known_hosts + "\"",
              "BatchMode=" + std::string(settings.password.empty() ? "yes" : "no"),
              std::string("NumberOfPasswordPrompts=1"),
-             "ConnectTimeout=" + std::to_string(timeout),
+             "ConnectTimeout=" + std::to_string(ConnectTimeout(settings)),
              "ServerAliveInterval=" + std::to_string(kSshAliveInterval),
              std::string("ForwardX11=no"),
              std::string("ForwardAgent=no"),
@@ -142,10 +147,8 @@ std::string AddTransport(const InvocationContext& context, PrivateFolder* folder
 
     if (transport == Transport::DAEMON) {
         const int port = settings.port != 0 ? settings.port : context.config.daemon_port;
-        Append(arguments, {"--port=" + std::to_string(port), "--sockopts=TCP_NODELAY"});
-        if (settings.timeout > 0) {
-            arguments->push_back("--contimeout=" + std::to_string(settings.timeout));
-        }
+        Append(arguments, {"--port=" + std::to_string(port), "--sockopts=TCP_NODELAY",
+                           "--contimeout=" + std::to_string(ConnectTimeout(settings))});
     } else {
         Words words = SshWords(context);
         Append(&words, {"-W", kLoopback + (":" + std::to_string(context.config.daemon_port)), "--",

@@ -32,7 +32,7 @@ struct InvocationContext {
 };
 
 /// A copy, or a listing, of files. Long lists of rules and what ssh needs to log in go to files in
-/// `folder`. Throws std::system_error when one cannot be written.
+/// `folder`. Throws PrivateFileError.
 Invocation CopyInvocation(const InvocationContext& context, PrivateFolder* folder);
 
 /// A server command, whose bytes lie in `command_file`: the answer `session` comes to

@@ -1,10 +1,9 @@
 #include "platform/tarqrsync/config.h"
 
 #include <charconv>
-#include <memory>
 #include <sstream>
 
-#include "tarq/core.h"
+#include "tarq/owners.h"
 #include "tarq/root_path.h"
 
 namespace TARQ {
@@ -15,11 +14,6 @@ namespace {
 constexpr char kConfigPath[] = "/usr/tarq/etc/tarqrsync.conf";
 constexpr char kSection[] = "rsync";
 constexpr int kMaxPort = 65535;
-
-struct HashFree {
-    void operator()(KAPICSzHash hash) const { KAPICSzHashFree(hash); }
-};
-using Hash = std::unique_ptr<KAPICSzHashRec, HashFree>;
 
 bool ParsePort(const std::string& text, int* port) {
     const char* end = text.data() + text.size();
@@ -34,7 +28,7 @@ std::string ReadConfig(Config* config) {
     if (!KAPICFileExist(path.c_str())) {
         return "";
     }
-    const Hash values(KAPICSzHashAlloc(4));
+    const HashOwner values(KAPICSzHashAlloc(4));
     if (!values || KAPICFileGetSection(path.c_str(), kSection, values.get()) < 0) {
         return "cannot read " + path;
     }

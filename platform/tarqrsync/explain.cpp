@@ -26,6 +26,8 @@ constexpr int kExitSsh = 255;
 
 constexpr int kKeepStatus = -1;
 
+constexpr std::string_view kUnknownModule = "@ERROR: Unknown module";
+
 enum Where : unsigned int {
     DAEMON = 1U,
     COMMAND = 2U,  // a server command
@@ -50,10 +52,9 @@ constexpr Clue kClues[] = {
      "ssh refuses the private key: others may read its file"},
     {"ssh_askpass: exec", SSH, STATUS_AUTHENTICATION,
      "the program that hands the password to ssh cannot be run: is /tmp mounted with noexec?"},
-    {"administratively prohibited", SSH, STATUS_SOCKET,
-     "the ssh server at {host} forbids forwarded connections (AllowTcpForwarding)"},
-    {"open failed: connect failed", SSH, STATUS_SOCKET,
-     "the ssh login at {host} works, but no rsync daemon answers there on port {daemon_port}"},
+    {"stdio forwarding failed", SSH, STATUS_SOCKET,
+     "the ssh login at {host} works, but no rsync daemon answers there on port {daemon_port}, or "
+     "its ssh server forbids the way to it (AllowTcpForwarding)"},
     {"Connection timed out", SSH, kExitConnectTimeout,
      "{host} did not answer on ssh port {port} in time"},
     {"Operation timed out", SSH, kExitConnectTimeout,
@@ -80,9 +81,9 @@ constexpr Clue kClues[] = {
      "{host} does not let this machine reach the module {module}"},
     {"@ERROR: max connections", ANYWHERE, kKeepStatus,
      "{host} serves as many connections as it takes: try again later"},
-    {"@ERROR: Unknown module", COMMAND, STATUS_UNKNOWN_COMMAND,
+    {kUnknownModule, COMMAND, STATUS_UNKNOWN_COMMAND,
      "{host} takes no server commands: its rsync daemon has no module for them"},
-    {"@ERROR: Unknown module", COPY, kKeepStatus, "{host} has no module '{module}'"},
+    {kUnknownModule, COPY, kKeepStatus, "{host} has no module '{module}'"},
     {"@ERROR: early exec failed", ANYWHERE, kKeepStatus,
      "the program that takes commands at {host} failed"},
     {"@ERROR: Unknown command", COMMAND, STATUS_UNKNOWN_COMMAND,
@@ -96,14 +97,8 @@ constexpr Clue kClues[] = {
      "the disk quota of the account at {host} is used up"},
     {"Read-only file system", COPY, kKeepStatus, "the file system at {host} is read-only"},
     {"No space left on device", COMMAND, kKeepStatus, "the local disk is full"},
-    {"open_noatime", COPY, kKeepStatus, "a file of the source cannot be read: {line}"},
-    {"opendir", COPY, kKeepStatus, "a folder of the source cannot be read: {line}"},
-    {"send_files failed to open", COPY, kKeepStatus, "a file of the source cannot be read: {line}"},
-    {"[sender] readlink", COPY, kKeepStatus, "a link of the source cannot be read: {line}"},
     {"[sender] link_stat", COMMAND, kKeepStatus,
      "{host} took the command and left no answer to it"},
-    {"[sender] link_stat", COPY, kKeepStatus, "the source cannot be read: {line}"},
-    {"[sender] read errors", COPY, kKeepStatus, "a file of the source cannot be read: {line}"},
 };
 
 // What the exit code alone says.
@@ -219,6 +214,24 @@ bool CameToFiles(int exit_code) {
     return exit_code == kExitFileIo || exit_code == kExitPartial || exit_code == kExitVanished;
 }
 
+// In a copy that ran to its end every complaint of the sending half is about the source.
+constexpr std::string_view kSourceComplaint = "[sender] ";
+
+bool IsUnreadableSource(const RunFacts& facts) {
+    return facts.exit_code == kExitPartial && !facts.settings.is_command &&
+           !facts.settings.list_only && Contains(facts.messages, kSourceComplaint);
+}
+
+Verdict UnreadableSource(const RunFacts& facts) {
+    const std::string_view messages = facts.messages;
+    std::string line = "the source cannot be read in full: " +
+                       std::string(LineAt(messages, messages.find(kSourceComplaint)));
+    if (facts.settings.delete_missing) {
+        line += "; nothing was deleted at the destination";
+    }
+    return {facts.exit_code, RunCause::NONE, line};
+}
+
 Verdict FromWords(const RunFacts& facts, int status) {
     const unsigned int where = WhereOf(facts.settings);
     const std::string_view messages = facts.messages;
@@ -226,43 +239,43 @@ Verdict FromWords(const RunFacts& facts, int status) {
     if ((where & SSH) != 0 && !connected) {
         if (Contains(messages, "Host key verification failed") ||
             Contains(messages, "HOST IDENTIFICATION HAS CHANGED")) {
-            return {STATUS_AUTHENTICATION, ChangedHostKey(facts)};
+            return {STATUS_AUTHENTICATION, RunCause::NONE, ChangedHostKey(facts)};
         }
         if (IsRefusedSshLogin(messages)) {
             return {
-                STATUS_AUTHENTICATION,
+                STATUS_AUTHENTICATION, RunCause::NONE,
                 Fill("the ssh login of '{user}' at {host} was refused: wrong account or password",
                      facts, "")};
         }
     }
     for (const Clue& clue : kClues) {
         const size_t position = messages.find(clue.words);
+        const bool about_connection = (clue.where & (DAEMON | SSH)) != 0;
         if ((clue.where & where) != 0 && position != std::string_view::npos &&
-            !(connected && clue.status != kKeepStatus)) {
+            !(connected && about_connection)) {
             return {clue.status == kKeepStatus ? status : clue.status,
+                    clue.words == kUnknownModule ? RunCause::UNKNOWN_MODULE : RunCause::NONE,
                     Fill(clue.meaning, facts, LineAt(messages, position))};
         }
     }
     for (const ExitMeaning& meaning : kExitMeanings) {
         if (meaning.code == status) {
-            return {status, Fill(meaning.meaning, facts, "")};
+            return {status, RunCause::NONE, Fill(meaning.meaning, facts, "")};
         }
     }
-    return {status, "rsync failed with exit code " + std::to_string(status)};
+    return {status, RunCause::NONE, "rsync failed with exit code " + std::to_string(status)};
 }
 
 }  // namespace
 
 Verdict Judge(const RunFacts& facts) {
+    if (IsUnreadableSource(facts)) {
+        return UnreadableSource(facts);
+    }
     // These two say all by their number: what else was written has no part in it.
     const bool plain = facts.exit_code == kExitVanished || facts.exit_code == STATUS_TIMEOUT;
-    Verdict verdict =
-        FromWords(plain ? RunFacts{facts.settings, facts.config, facts.exit_code, ""} : facts,
-                  facts.exit_code == kExitSsh ? STATUS_SOCKET : facts.exit_code);
-    if (Contains(facts.messages, "skipping file deletion")) {
-        verdict.first_line += "; nothing was deleted at the destination";
-    }
-    return verdict;
+    return FromWords(plain ? RunFacts{facts.settings, facts.config, facts.exit_code, ""} : facts,
+                     facts.exit_code == kExitSsh ? STATUS_SOCKET : facts.exit_code);
 }
 
 RefusedAttributes FindRefusedAttributes(const RunFacts& facts) {

@@ -4,6 +4,7 @@
 
 #include "platform/tarqrsync/config.h"
 #include "platform/tarqrsync/settings.h"
+#include "tarq/rsync_wrapper.h"
 
 namespace TARQ {
 namespace Backup {
@@ -18,7 +19,8 @@ struct RunFacts {
 
 /// What a failure comes to.
 struct Verdict {
-    int status;              ///< what execute() returns
+    int status;  ///< what execute() returns
+    RunCause cause;
     std::string first_line;  ///< the failure in plain words, without a newline
 };
 

@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <system_error>
 
@@ -15,6 +16,9 @@
 
 namespace TARQ {
 namespace Backup {
+
+PrivateFileError::PrivateFileError(const std::string& what)
+    : std::runtime_error(what + ": " + strerror(errno)) {}
 
 PrivateFolder::~PrivateFolder() {
     if (!folder_.empty()) {
@@ -29,8 +33,7 @@ std::string PrivateFolder::Path(const std::string& name) {
         mkdir(parent.c_str(), 0700);  // a root folder of somebody's own may lack it
         std::string pattern = parent + "/tarqrsync.XXXXXX";
         if (mkdtemp(pattern.data()) == nullptr) {
-            throw std::system_error(errno, std::generic_category(),
-                                    "cannot make a folder in " + parent);
+            throw PrivateFileError("cannot make a folder in " + parent);
         }
         folder_ = pattern;
     }
@@ -43,7 +46,7 @@ std::string PrivateFolder::Write(const std::string& name, const std::string& con
     const tarq_internal::UniqueFd fd(
         open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, executable ? 0700 : 0600));
     if (!fd || !tarq_internal::WriteAll(fd.Get(), content)) {
-        throw std::system_error(errno, std::generic_category(), "cannot write " + path);
+        throw PrivateFileError("cannot write " + path);
     }
     return path;
 }

@@ -124,11 +124,9 @@ int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
     const RunOptions& options = current_options != nullptr ? *current_options : no_options;
     Run run(impl_->settings, options);
     const int status = run.Execute(cancelled);
-    impl_->explanation = run.Explanation();
+    impl_->explanation = run.Outcome().explanation;
     if (options.report != nullptr) {
-        *options.report = run.Figures();
-        options.report->status = status;
-        options.report->explanation = run.Explanation();
+        *options.report = run.Outcome();
     }
     return status;
 }

@@ -11,7 +11,6 @@
 #include <cerrno>
 #include <charconv>
 #include <cstring>
-#include <system_error>
 
 #include "platform/internal/child_process.h"
 #include "platform/internal/unique_fd.h"
@@ -59,7 +58,7 @@ std::string RandomSession() {
     std::array<unsigned char, 16> bytes;
     // Up to 256 bytes come whole or not at all.
     if (getrandom(bytes.data(), bytes.size(), 0) != static_cast<ssize_t>(bytes.size())) {
-        throw std::system_error(errno, std::generic_category(), "no random numbers");
+        throw PrivateFileError("no random numbers for a session");
     }
     std::string session;
     for (const unsigned char byte : bytes) {
@@ -118,10 +117,11 @@ bool IsMissing(const std::string& path) {
 
 int Run::Execute(const std::function<bool()>& cancelled) {
     try {
-        return Attempt(cancelled);
-    } catch (const std::system_error& error) {
-        return Fail(kStatusFileIo, error.what());
+        outcome_.status = Attempt(cancelled);
+    } catch (const PrivateFileError& error) {
+        outcome_.status = Fail(kStatusFileIo, error.what());
     }
+    return outcome_.status;
 }
 
 int Run::Attempt(const std::function<bool()>& cancelled) {
@@ -201,7 +201,7 @@ int Run::RunCopy(const std::function<bool()>& cancelled) {
         PrivateFolder files;
         const int status = RunRsync(cancelled, CopyInvocation(context, &files), &parser, 0);
         parser.Finish();
-        parser.FillReport(&figures_);
+        parser.FillReport(&outcome_);
         const RefusedAttributes refused = FindRefusedAttributes(Facts(status));
         const bool less = (context.acls && refused.acls) || (context.xattrs && refused.xattrs);
         if (status == STATUS_DONE || !less) {
@@ -219,7 +219,7 @@ int Run::RunCopy(const std::function<bool()>& cancelled) {
 // Runs one rsync; after a failure the explanation is there.
 int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invocation,
                   OutputParser* parser, uint64_t max_file_bytes) {
-    explanation_.clear();
+    outcome_.explanation.clear();
     messages_.clear();
     ChildSpec spec;
     spec.program = tarq_internal::FindProgram(config_.rsync, PathVariable(invocation.environment));
@@ -269,13 +269,14 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
         }
     }
     const Verdict verdict = Judge(Facts(exit_code));
+    outcome_.cause = verdict.cause;
     return Fail(verdict.status, verdict.first_line);
 }
 
 int Run::Fail(int status, const std::string& first_line) {
-    explanation_ = messages_.empty() ? first_line : first_line + "\n" + messages_;
-    while (!explanation_.empty() && explanation_.back() == '\n') {
-        explanation_.pop_back();
+    outcome_.explanation = messages_.empty() ? first_line : first_line + "\n" + messages_;
+    while (!outcome_.explanation.empty() && outcome_.explanation.back() == '\n') {
+        outcome_.explanation.pop_back();
     }
     return status;
 }

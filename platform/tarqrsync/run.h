@@ -26,10 +26,8 @@ public:
     /// throws.
     int Execute(const std::function<bool()>& cancelled);
 
-    /// Why it failed; empty after success.
-    const std::string& Explanation() const { return explanation_; }
-    /// The figures of a copy, when the options ask for a report.
-    const RunReport& Figures() const { return figures_; }
+    /// What it came to. The figures are there when the options ask for a report.
+    const RunReport& Outcome() const { return outcome_; }
 
 private:
     int Attempt(const std::function<bool()>& cancelled);
@@ -47,8 +45,7 @@ private:
     PrivateFolder folder_;
     std::string log_file_;
     std::string messages_;  // what rsync and ssh wrote
-    std::string explanation_;
-    RunReport figures_;
+    RunReport outcome_;
 };
 
 }  // namespace Backup
