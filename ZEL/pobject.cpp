@@ -106,14 +106,16 @@ PObject& PObject::operator=(const Map& value) {
     return copy<Map>(value);
 }
 
+// NOLINTNEXTLINE(bugprone-unhandled-self-assignment): copy() makes null of it, as is documented
 PObject& PObject::operator=(const PObject& other) {
     copy(other);
     return *this;
 }
 
 PObject& PObject::operator=(PObject&& other) noexcept {
+    const bool itself = this == &other;
     PObject taken(std::move(other));
-    if (this != &other) {
+    if (!itself) {
         swap(taken);
     }
     return *this;

@@ -11,7 +11,7 @@ namespace ZEL {
 
 namespace {
 
-constexpr unsigned int kIndentLevels = 11;  // deeper levels of the trace are not indented further
+constexpr size_t kIndentLevels = 11;  // deeper levels of the trace are not indented further
 constexpr char kIndent[] = "                      ";
 static_assert(sizeof kIndent - 1 == 2 * kIndentLevels);
 
@@ -274,6 +274,11 @@ int PStream::Skip(Channel&, unsigned char) {
 }
 
 void PStream::UpdateStatus(unsigned long long done, unsigned long long total) {
+    // Every scalar comes here. Only the thread that transfers writes the counters, so it may look
+    // at them unlocked.
+    if (status_done_ == done && status_total_ == total) {
+        return;
+    }
     const std::lock_guard<std::mutex> lock(mutex_);
     status_done_ = done;
     status_total_ = total;
@@ -331,7 +336,7 @@ void PStream::PopKey(std::string& key) {
 }
 
 const char* PStream::Indent() const {
-    return kIndent + 2 * (kIndentLevels - std::min(depth_, kIndentLevels));
+    return kIndent + 2 * (kIndentLevels - std::min<size_t>(depth_, kIndentLevels));
 }
 
 // A loop with a stack of its own: a sender's value may be nested deeper than the thread's stack

@@ -89,7 +89,8 @@ public:
     /// What an unknown tag comes to: always -5, it is never skipped.
     int Skip(Channel& channel, unsigned char tag);
 
-    /// Set the counters that GetStatus() gives. The start of each scalar sets both to 0.
+    /// Sets the counters that GetStatus() gives; only on the thread that transfers. The start of
+    /// each scalar sets both to 0.
     void UpdateStatus(unsigned long long done, unsigned long long total);
     /// The key path that is being transferred, and the counters. Any thread may call.
     void GetStatus(std::string& path, unsigned long long& done, unsigned long long& total);

@@ -64,6 +64,7 @@ BIO* NewTlsSocketBio(int fd) {
     static const BIO_METHOD* const method = MakeMethod();
     BIO* bio = fd < 0 || method == nullptr ? nullptr : BIO_new(method);
     if (bio != nullptr) {
+        // The number itself is the data. NOLINTNEXTLINE(performance-no-int-to-ptr)
         BIO_set_data(bio, reinterpret_cast<void*>(static_cast<intptr_t>(fd)));
         BIO_set_init(bio, 1);
     }

@@ -144,6 +144,38 @@ TEST(Channel, BytesKeepTheirOrderThroughSmallRings) {
     }
 }
 
+TEST(Channel, BytesKeepTheirOrderRoundTheEndOfTheRings) {
+    // A socket that takes a part of each send makes the write ring go round.
+    test::RawPeer peer(10007);
+    const int size = 1;
+    setsockopt(peer.channel_fd, SOL_SOCKET, SO_SNDBUF, &size, sizeof size);
+    std::string sent, received;
+    std::thread reader([&] {
+        char buffer[700];
+        for (ssize_t n; (n = read(peer.fd, buffer, sizeof buffer)) > 0;) {
+            received.append(buffer, static_cast<size_t>(n));
+        }
+    });
+    for (unsigned int i = 0; i < 3000; ++i) {
+        const std::string block(i % 997, static_cast<char>(i));
+        ASSERT_EQ(peer.channel.Write(block.data(), static_cast<unsigned int>(block.size())), 0);
+        sent += block;
+    }
+    peer.channel.Close();
+    reader.join();
+    EXPECT_TRUE(received == sent);
+
+    test::RawPeer ahead(8);
+    char buffer[9] = "";
+    ahead.Send("123456");
+    ASSERT_EQ(ahead.channel.Read(buffer, 4), 0);
+    ahead.Send("789abc");
+    EXPECT_EQ(ahead.channel.ReadMore(6), 0);
+    EXPECT_EQ(ahead.channel.ReadMore(1), ZEL::RESULT_INVALID_ARGUMENT) << "the ring is full";
+    ASSERT_EQ(ahead.channel.Read(buffer, 8), 0);
+    EXPECT_STREQ(buffer, "56789abc");
+}
+
 TEST(Channel, ABlockMayBeAsLargeAsTheRing) {
     test::RawPeer peer(8);
     EXPECT_EQ(peer.channel.Write("123456789", 9), ZEL::RESULT_INVALID_ARGUMENT);

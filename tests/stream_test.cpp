@@ -4,6 +4,9 @@
 #include <gtest/gtest.h>
 #include <pthread.h>
 
+#include <atomic>
+#include <cstdlib>
+#include <new>
 #include <thread>
 #include <utility>
 
@@ -17,6 +20,28 @@ using test::Unhex;
 using testing::HasSubstr;
 using ZEL::PObject;
 using ZEL::PStream;
+
+namespace {
+
+std::atomic<int> allocations{0};
+
+}  // namespace
+
+// The library's allocations, counted.
+__attribute__((visibility("default"), noinline)) void* operator new(size_t size) {
+    ++allocations;
+    if (void* memory = malloc(size)) {
+        return memory;
+    }
+    throw std::bad_alloc();
+}
+__attribute__((visibility("default"), noinline)) void operator delete(void* memory) noexcept {
+    free(memory);
+}
+__attribute__((visibility("default"), noinline)) void operator delete(void* memory,
+                                                                      size_t) noexcept {
+    free(memory);
+}
 
 namespace {
 
@@ -296,4 +321,31 @@ TEST(PStream, AFailedSendTellsItsKeyPathAndForgetsIt) {
     EXPECT_EQ(log.Text(), "[ERROR] ZEL/stream(N): Error stack: \n");
     stream.GetStatus(path, done, total);
     EXPECT_EQ(path + std::to_string(done) + std::to_string(total), "00");
+}
+
+TEST(PStream, OnlyTheValueItselfCostsAllocations) {
+    const auto flat = [](int entries) {
+        PObject map;
+        for (int i = 0; i < entries; ++i) {
+            map["a key that is longer than a string holds by itself" + std::to_string(i)] =
+                "a text that is longer than a string holds by itself";
+        }
+        return map;
+    };
+    const auto count = [](const auto& work) {
+        const int before = allocations;
+        work();
+        return allocations - before;
+    };
+    for (const int entries : {10, 500}) {
+        const PObject value = flat(entries);
+        RawPeer peer;
+        EXPECT_LT(count([&] { ASSERT_EQ(PStream().Send(peer.channel, value), 0); }), 10);
+        peer.Send(peer.Take());
+        PObject received, copied;
+        const int for_a_copy = count([&] { copied = value; });
+        EXPECT_LT(count([&] { ASSERT_EQ(PStream().Recv(peer.channel, received), 0); }),
+                  for_a_copy + 10);
+        EXPECT_EQ(received.toString(), value.toString());
+    }
 }

@@ -22,6 +22,7 @@ constexpr int kRequests = 100;
 constexpr int kRequests = 10000;
 #endif
 constexpr int kClients = 64;
+constexpr int kWatchedTransfers = 500;
 
 bool DiesEarly(int client) {
     return client % 8 == 0;
@@ -124,11 +125,11 @@ TEST(Stress, AnotherThreadCanWatchATransfer) {
         }
     });
     std::thread sender([&] {
-        for (int i = 0; i < kRequests / 10; ++i) {
+        for (int i = 0; i < kWatchedTransfers; ++i) {
             ASSERT_EQ(sending.Send(peer.channel, value), 0);
         }
     });
-    for (int i = 0; i < kRequests / 10; ++i) {
+    for (int i = 0; i < kWatchedTransfers; ++i) {
         PObject received;
         ASSERT_EQ(receiving.Recv(far_end, received), 0);
         ASSERT_EQ(received.toString(), value.toString());

@@ -20,6 +20,7 @@ public:
             channel.Open(fds[0], true) != 0) {
             throw std::runtime_error("no socket pair");
         }
+        channel_fd = fds[0];
         fd = fds[1];
     }
     ~RawPeer() { Close(); }
@@ -53,7 +54,8 @@ public:
     }
 
     ZEL::Channel channel;
-    int fd = -1;
+    int channel_fd = -1;  ///< the channel's own end
+    int fd = -1;          ///< the other end
 };
 
 /// "42 10 00" to the three bytes, and back.
