@@ -24,7 +24,6 @@ constexpr const char* kLineFormat = "\t%s=\"%s\"\n";
 
 constexpr int kUpdateEntries = 512;
 constexpr int kValueSize = 256;
-constexpr int kLowerCharacters = 32;  // how much of a name counts when letter case does not
 
 bool CreateFile(const std::string& path, int flags, mode_t mode) {
     const int fd = open(path.c_str(), flags | O_CREAT | O_CLOEXEC, mode);
@@ -261,8 +260,7 @@ int TARQZELIsSyncedShare(const char* share) {
 }
 
 void getLowerString(const char* source, char* target) {
-    for (int i = 0; i < kLowerCharacters && source[i] != '\0'; ++i) {
-        const char c = source[i];
-        target[i] = c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
+    for (int i = 0; i < kNameCharacters && source[i] != '\0'; ++i) {
+        target[i] = Lower(source[i]);
     }
 }

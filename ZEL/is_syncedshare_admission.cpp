@@ -14,17 +14,21 @@ constexpr size_t kSharePrefixLength = 6;
 
 constexpr int kIdentitySize = 36;           // of the buffers that identities are read into
 constexpr size_t kIdentityCharacters = 36;  // how much of two identities is compared
-constexpr size_t kNameCharacters = 32;      // how much of two share names is compared
 
 enum class Verdict { kFree, kHeld, kFailed };
 
-/// A share's name in lower case, as far as it counts.
-struct LowerName {
-    char text[kNameCharacters + 1] = "";
-
-    explicit LowerName(const char* name) { getLowerString(name, text); }
-    bool operator==(const LowerName& other) const { return strcmp(text, other.text) == 0; }
-};
+/// Whether `name` in lower case is `lowered`, as far as names count.
+bool IsSpelling(const char* name, const char (&lowered)[kNameCharacters + 1]) {
+    for (int i = 0; i < kNameCharacters; ++i) {
+        if (Lower(name[i]) != lowered[i]) {
+            return false;
+        }
+        if (name[i] == '\0') {
+            break;
+        }
+    }
+    return true;
+}
 
 bool ReadIdentity(const char* share, const char* key, char (&identity)[kIdentitySize]) {
     return ZELServerGetShare(share, key, identity, kIdentitySize) >= 0;
@@ -61,7 +65,8 @@ Verdict CheckAllSpellings(const char* share, const char* client) {
         syslog(LOG_ERR, "%s", message);
         return Verdict::kFailed;
     };
-    const LowerName wanted(share);
+    char wanted[kNameCharacters + 1] = "";
+    getLowerString(share, wanted);
     if (ZELCheckServerInfo() != 0) {
         return fail("Failed to check server info.\n");
     }
@@ -77,7 +82,7 @@ Verdict CheckAllSpellings(const char* share, const char* client) {
     for (int i = 0; i < count; ++i) {
         const char* section = KAPICSzListGet(sections.get(), i);
         if (strncmp(section, kSharePrefix, kSharePrefixLength) != 0 ||
-            !(LowerName(section + kSharePrefixLength) == wanted)) {
+            !IsSpelling(section + kSharePrefixLength, wanted)) {
             continue;
         }
         KAPICHashRemoveAll(values.get());
