@@ -5,6 +5,7 @@
 #pragma once
 
 #include <pthread.h>
+#include <stdarg.h>
 #include <stdio.h>
 
 #include <atomic>
@@ -67,6 +68,9 @@ public:
     static int Rotate();
 
 private:
+    // Writes one message that has passed the level; log_mutex is held.
+    static void Write(const char* format, va_list arguments) __attribute__((format(printf, 1, 0)));
+
     static Type log_type;               // current destination
     static std::atomic<int> log_level;  // highest level that is written
     static FILE* log_fp;                // open stream of types 1 to 3

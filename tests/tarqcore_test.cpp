@@ -15,6 +15,7 @@
 #include <thread>
 
 #include "tarq/core.h"
+#include "tests/support/string_hash.h"
 #include "tests/support/temp_root.h"
 
 // System calls that fail on demand, in front of the C library's.
@@ -71,32 +72,9 @@ FRONT ssize_t pread64(int fd, void* bytes, size_t size, off64_t at) {
 
 namespace {
 
+using test::Hash;
 using testing::ElementsAre;
 using testing::HasSubstr;
-using Pairs = std::vector<std::pair<std::string, std::string>>;
-
-/// A string hash with some values, freed at the end.
-struct Hash {
-    KAPICSzHash hash = KAPICSzHashAlloc(16);
-    Hash(std::initializer_list<std::pair<const char*, const char*>> values = {}) {
-        for (const auto& [key, value] : values) {
-            KAPICSzHashSetValue(hash, key, value);
-        }
-    }
-    Hash(const Hash&) = delete;
-    Hash& operator=(const Hash&) = delete;
-    ~Hash() { KAPICSzHashFree(hash); }
-    operator KAPICSzHash() const { return hash; }
-
-    Pairs All() const {
-        Pairs all;
-        const char *key = nullptr, *value = nullptr;
-        for (int at = 0; KAPICSzHashNext(hash, &at, &key, &value) != 0;) {
-            all.emplace_back(key, value);
-        }
-        return all;
-    }
-};
 
 std::vector<std::string> Sections(const std::string& path) {
     KAPICSzList list = KAPICSzListAlloc(16);

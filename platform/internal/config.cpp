@@ -2,22 +2,17 @@
 
 #include <fcntl.h>
 #include <tarq/core.h>
+#include <tarq/owners.h>
 #include <unistd.h>
 
 #include <array>
 #include <cerrno>
 #include <cstring>
-#include <memory>
 
 #include "platform/internal/unique_fd.h"
 
 namespace tarq_internal {
 namespace {
-
-struct HashFree {
-    void operator()(KAPICSzHash hash) const { KAPICSzHashFree(hash); }
-};
-using HashOwner = std::unique_ptr<KAPICSzHashRec, HashFree>;
 
 constexpr int kHashCapacity = 16;
 
@@ -27,7 +22,7 @@ ReadResult ReadSection(const std::string& path, const std::string& section, Sect
     if (KAPICFileExist(path.c_str()) == 0) {
         return ReadResult::kAbsent;
     }
-    const HashOwner hash(KAPICSzHashAlloc(kHashCapacity));
+    const TARQ::HashOwner hash(KAPICSzHashAlloc(kHashCapacity));
     if (!hash) {
         return ReadResult::kFailed;
     }

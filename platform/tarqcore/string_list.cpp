@@ -1,15 +1,40 @@
+#include <string.h>
+
+#include <algorithm>
 #include <climits>
-#include <deque>
-#include <string>
+#include <memory>
+#include <vector>
 
 #include "platform/tarqcore/error.h"
 
 using tarqcore::Fail;
 using tarqcore::Guarded;
 
-// A deque: its strings stay where they are while others are pushed.
+// The strings lie one behind the other in chunks, so that they stay in place while others are
+// pushed and a list of ten thousand section names costs a few allocations.
 struct KAPICSzListRec {
-    std::deque<std::string> items;
+    std::vector<const char*> items;
+    std::vector<std::unique_ptr<char[]>> chunks;
+    size_t free_bytes = 0;  // at the end of the last chunk
+    char* free_at = nullptr;
+    size_t next_chunk = 256;  // grows with the list, up to kMaxChunk
+
+    static constexpr size_t kMaxChunk = 64 << 10;
+
+    void Push(const char* item) {
+        const size_t size = strlen(item) + 1;
+        if (size > free_bytes) {
+            const size_t chunk = std::max(size, next_chunk);
+            chunks.emplace_back(new char[chunk]);
+            free_at = chunks.back().get();
+            free_bytes = chunk;
+            next_chunk = std::min(2 * next_chunk, kMaxChunk);
+        }
+        items.push_back(free_at);
+        memcpy(free_at, item, size);
+        free_at += size;
+        free_bytes -= size;
+    }
 };
 
 KAPICSzList KAPICSzListAlloc(int) {
@@ -28,14 +53,14 @@ int KAPICSzListPush(KAPICSzList list, const char* item) {
         return Fail(TARQ_ERR_NO_MEMORY);
     }
     return Guarded(-1, [&] {
-        list->items.emplace_back(item);
+        list->Push(item);
         return 0;
     });
 }
 
 void KAPICSzListRemoveAll(KAPICSzList list) {
     if (list != nullptr) {
-        list->items.clear();
+        *list = {};
     }
 }
 
@@ -47,5 +72,5 @@ const char* KAPICSzListGet(KAPICSzList list, int index) {
     if (index < 0 || index >= KAPICSzListCount(list)) {
         return nullptr;
     }
-    return list->items[static_cast<size_t>(index)].c_str();
+    return list->items[static_cast<size_t>(index)];
 }

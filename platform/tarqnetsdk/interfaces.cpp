@@ -141,6 +141,7 @@ std::optional<std::vector<Interface>> ListInterfaces(const std::string& sys) {
     }
     std::sort(candidates.begin(), candidates.end(), ComesBefore);
     std::vector<Interface> interfaces;
+    interfaces.reserve(candidates.size());
     for (Candidate& candidate : candidates) {
         interfaces.push_back(std::move(candidate.interface));
     }

@@ -4,6 +4,7 @@
 #include <strings.h>
 #include <sys/file.h>
 #include <tarq/core.h>
+#include <tarq/owners.h>
 #include <tarq/root_path.h>
 #include <tarq/share.h>
 
@@ -12,7 +13,6 @@
 #include <cerrno>
 #include <charconv>
 #include <cstdio>
-#include <memory>
 
 #include "platform/internal/config.h"
 #include "platform/internal/error.h"
@@ -46,13 +46,6 @@ constexpr FlagName kFlagNames[] = {
     {"acl", TARQ_SHARE_ACL},
     {"windows", TARQ_SHARE_WINDOWS},
     {"cluster", TARQ_SHARE_CLUSTER},
-};
-
-struct ListFree {
-    void operator()(KAPICSzList list) const { KAPICSzListFree(list); }
-};
-struct HashFree {
-    void operator()(KAPICSzHash hash) const { KAPICSzHashFree(hash); }
 };
 
 std::nullopt_t Nothing(int code, int line = __builtin_LINE()) {
@@ -206,7 +199,7 @@ std::optional<std::vector<std::string>> ReadShareNames() {
     if (KAPICFileExist(path.c_str()) == 0) {
         return names;
     }
-    const std::unique_ptr<KAPICSzListRec, ListFree> list(KAPICSzListAlloc(0));
+    const TARQ::ListOwner list(KAPICSzListAlloc(0));
     if (!list || KAPICFileEnumSection(path.c_str(), list.get()) < 0) {
         return std::nullopt;
     }
@@ -217,7 +210,7 @@ std::optional<std::vector<std::string>> ReadShareNames() {
 }
 
 bool WriteShare(const Share& share) {
-    const std::unique_ptr<KAPICSzHashRec, HashFree> values(KAPICSzHashAlloc(0));
+    const TARQ::HashOwner values(KAPICSzHashAlloc(0));
     const std::pair<const char*, std::string> lines[] = {
         {"path", share.path},
         {"flags", FormatFlags(share.flags)},

@@ -58,17 +58,6 @@ std::optional<std::string> ReadableFolder(const std::string& path) {
     return real.data();
 }
 
-/// Whether `now` is the volume that was recorded. Of a file system whose UUID is not known at one
-/// of the two times (none of its own, no device manager in sight) its kind and its place are all
-/// there is to go by.
-bool IsSameVolume(const Volume& recorded, const Volume& now) {
-    const auto agree = [](const std::string& a, const std::string& b) {
-        return a.empty() || b.empty() || a == b;
-    };
-    return recorded.mount_point == now.mount_point &&
-           agree(recorded.file_system, now.file_system) && agree(recorded.uuid, now.uuid);
-}
-
 /// 0 when the share's files are where they were when it was added.
 int CheckData(const Share& share) {
     const std::string& folder = share.DataFolder();

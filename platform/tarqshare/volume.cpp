@@ -235,4 +235,12 @@ std::optional<Volume> FindVolume(const std::string& path, const HostFolders& hos
     return finder.Describe(*mount);
 }
 
+bool IsSameVolume(const Volume& recorded, const Volume& now) {
+    const auto agree = [](const std::string& a, const std::string& b) {
+        return a.empty() || b.empty() || a == b;
+    };
+    return recorded.mount_point == now.mount_point &&
+           agree(recorded.file_system, now.file_system) && agree(recorded.uuid, now.uuid);
+}
+
 }  // namespace tarq_share

@@ -27,4 +27,9 @@ struct Volume {
 /// no mount.
 std::optional<Volume> FindVolume(const std::string& path, const HostFolders& host = {});
 
+/// Whether `now` is the volume that was recorded. Of a file system whose UUID is not known at one
+/// of the two times (it has none, or no device manager is in sight) its kind and its place are all
+/// there is to go by.
+bool IsSameVolume(const Volume& recorded, const Volume& now);
+
 }  // namespace tarq_share

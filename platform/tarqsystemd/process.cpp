@@ -205,6 +205,7 @@ std::optional<BackgroundLaunch> BackgroundLaunch::Prepare(const std::vector<std:
     UniqueFd mine(ends[0]);
     UniqueFd other(ends[1]);
     std::vector<char*> arguments;
+    arguments.reserve(words.size() + 1);
     for (const std::string& word : words) {
         arguments.push_back(const_cast<char*>(word.c_str()));
     }

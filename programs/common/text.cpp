@@ -44,6 +44,20 @@ std::string HumanDuration(uint64_t seconds) {
     return text;
 }
 
+std::string HumanElapsed(double seconds) {
+    char text[32];
+    if (seconds < 1) {
+        snprintf(text, sizeof text, "%.0f ms", seconds * 1000);
+    } else {
+        snprintf(text, sizeof text, "%.1f s", seconds);
+    }
+    return text;
+}
+
+std::string Count(uint64_t count, const std::string& noun) {
+    return std::to_string(count) + " " + noun + (count == 1 ? "" : "s");
+}
+
 std::string HumanTime(int64_t seconds_since_epoch) {
     const time_t moment = static_cast<time_t>(seconds_since_epoch);
     struct tm local = {};

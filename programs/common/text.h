@@ -15,6 +15,12 @@ std::string HumanBytes(uint64_t bytes);
 /// "1:05" or "2:01:05", from seconds.
 std::string HumanDuration(uint64_t seconds);
 
+/// "45 ms" or "1.2 s", from seconds.
+std::string HumanElapsed(double seconds);
+
+/// "1 file", "2 files": `noun` with an "s" where there is not just one.
+std::string Count(uint64_t count, const std::string& noun);
+
 /// A local date and time, "2026-11-21 08:30:00".
 std::string HumanTime(int64_t seconds_since_epoch);
 

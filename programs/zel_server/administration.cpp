@@ -9,6 +9,7 @@
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
+#include <limits>
 #include <nlohmann/json.hpp>
 
 #include "ZEL/is_syncedshare.h"
@@ -313,11 +314,18 @@ std::string OutcomeOf(const ShareState& state) {
     if (!state.running_id.empty()) {
         return "being pushed";
     }
-    const auto time = programs::ParseNumber(state.last_time, INT32_MAX);
+    if (state.last_result.empty()) {
+        return "never pushed";
+    }
+    const auto time = programs::ParseNumber(state.last_time, std::numeric_limits<time_t>::max());
     const std::string when = time ? " " + programs::HumanTime(static_cast<int64_t>(*time)) : "";
-    return state.last_result.empty()
-               ? "never pushed"
-               : (state.last_result == "0" ? "complete" : "rsync " + state.last_result) + when;
+    if (state.last_result == "0") {
+        return "complete" + when;
+    }
+    return (state.last_result == kEndedByClient
+                ? "not complete"
+                : "not complete (rsync " + state.last_result + ")") +
+           when;
 }
 
 int ListShares(bool as_json) {

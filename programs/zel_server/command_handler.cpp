@@ -258,6 +258,7 @@ Answer StartSync(const Request& request) {
     }
     state.running_id = request.Client();
     state.account = request.account;
+    state.last_result.clear();
     return {WriteShare(start->share, state) ? kDone : kRegistryWrite, ""};
 }
 
@@ -286,7 +287,11 @@ Answer FinishShare(const Request& request, const std::string& share, bool comple
     }
     if (completed) {
         state.complete_id = state.running_id;
+        state.last_result = "0";
+    } else if (state.last_result.empty()) {
+        state.last_result = kEndedByClient;
     }
+    state.last_time = std::to_string(time(nullptr));
     state.running_id.clear();
     return {WriteShare(share, state) ? kDone : kRegistryWrite, ""};
 }

@@ -12,6 +12,9 @@ namespace zel_server {
 
 using Section = std::map<std::string, std::string>;
 
+/// The client has said that its push ended without being complete; rsync's own word has not come yet.
+inline constexpr char kEndedByClient[] = "ended";
+
 /// A share's section. `RunningID` and `CompleteID` are the library's keys; the others are this
 /// program's own.
 struct ShareState {
@@ -20,7 +23,7 @@ struct ShareState {
     std::string account;      ///< account that it belongs to
     std::string module;       ///< its rsync module
     std::string path;         ///< its folder
-    std::string last_result;  ///< rsync's exit status of the last data run
+    std::string last_result;  ///< how the last push ended: rsync's exit status, or kEndedByClient
     std::string last_time;    ///< when that was, in seconds since the epoch
 
     /// The client that it belongs to; empty for a share that nobody has begun.

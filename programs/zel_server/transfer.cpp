@@ -97,7 +97,8 @@ int EndTransfer() {
     const char* const status = getenv("RSYNC_EXIT_STATUS");
     const RegistryLock lock;
     ShareState state;
-    // A connection that was not let in, or only read, says nothing about the copy.
+    // After a push is closed, later connections only read or ask: they say nothing about the copy.
+    // The client may have said that its push failed before the daemon, which knows why, comes here.
     if (!lock.Held() || status == nullptr || !programs::ParseNumber(status, 255) ||
         !IsShareName(share) || ReadShare(share, state) != ReadResult::kRead ||
         state.account != connection.account || state.running_id.empty()) {

@@ -68,13 +68,11 @@ void ProgressDisplay::Clear() {
 }
 
 std::string Summary(const TARQ::Backup::RunReport& report, double elapsed) {
-    char text[160];
-    snprintf(text, sizeof text, "%llu of %llu entries sent, %llu deleted, %s on the wire, %.1f s",
-             static_cast<unsigned long long>(report.files_sent),
-             static_cast<unsigned long long>(report.files_total),
-             static_cast<unsigned long long>(report.files_deleted),
-             programs::HumanBytes(report.bytes_sent + report.bytes_received).c_str(), elapsed);
-    return text;
+    return programs::Count(report.files_sent, "file") + " sent, " +
+           std::to_string(report.files_deleted) + " deleted, " +
+           std::to_string(report.files_total) + " compared, " +
+           programs::HumanBytes(report.bytes_sent + report.bytes_received) + " on the wire, " +
+           programs::HumanElapsed(elapsed);
 }
 
 }  // namespace zelctl

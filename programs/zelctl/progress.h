@@ -25,7 +25,7 @@ private:
     std::chrono::steady_clock::time_point last_;
 };
 
-/// "12 files (3.4 MiB) sent, 1 deleted, 5.0 KiB on the wire, 0.4 s"
+/// "12 files sent, 1 deleted, 40 compared, 5.0 KiB on the wire, 45 ms"
 std::string Summary(const TARQ::Backup::RunReport& report, double seconds);
 
 }  // namespace zelctl

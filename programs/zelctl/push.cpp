@@ -10,6 +10,7 @@
 #include "programs/common/server_status.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/interrupt.h"
+#include "programs/zelctl/prepare.h"
 #include "programs/zelctl/progress.h"
 #include "programs/zelctl/shares.h"
 
@@ -80,16 +81,28 @@ public:
         rsyncer_.SetCancelChecker(Interrupted);
     }
 
+    /// Finds the server and asks whether it would take the shares. Changes nothing there.
     ExitCode Connect() {
-        ZEL::SyncInfo info;
-        const ExitCode filled = options_.connection.ToSyncInfo(info);
-        if (filled != kOk) {
-            return filled;
+        ExitCode result = PrepareHost();
+        if (result == kOk) {
+            result = CheckShares(options_.shares);
         }
-        const ScopedRunOptions watched(Reporting());
-        const int status = rsyncer_.Initialize(info);
-        return status == 0 ? kOk
-                           : Failed("cannot use server " + options_.connection.server, status);
+        ZEL::SyncInfo info;
+        if (result == kOk) {
+            result = options_.connection.ToSyncInfo(info);
+        }
+        if (result != kOk) {
+            return result;
+        }
+        WatchForInterrupt();
+        {
+            const ScopedRunOptions watched(Reporting());
+            const int status = rsyncer_.Initialize(info);
+            if (status != 0) {
+                return Failed("cannot use server " + options_.connection.server, status);
+            }
+        }
+        return Pair(true);
     }
 
     /// Asks the server for these shares; `dry_run`: would it take them?
@@ -232,6 +245,10 @@ private:
         const int ran =
             rsyncer_.RunSync(0, share, options_.path, ToList(options_.excludes), status);
         display_.Clear();
+        if (ran == 0 && status == 0 && report_.status != 0) {
+            return Fail(kLocal, "share '%s' has no %s", programs::Printable(share).c_str(),
+                        programs::Printable(options_.path).c_str());
+        }
         if (ran == 0 && status == kVanishedFiles) {
             fprintf(stderr,
                     "zelctl: share '%s': some files vanished while they were being pushed\n",
@@ -288,8 +305,8 @@ private:
         if (ran != 0 || (status != 0 && status != kVanishedFiles)) {
             return Failed("share '" + share + "' cannot be compared", status);
         }
-        printf("%s: %llu files (%s) would be sent, %llu entries deleted.\n", share.c_str(),
-               static_cast<unsigned long long>(sends), programs::HumanBytes(bytes).c_str(),
+        printf("%s: %s (%s) would be sent, %llu deleted.\n", programs::Printable(share).c_str(),
+               programs::Count(sends, "file").c_str(), programs::HumanBytes(bytes).c_str(),
                static_cast<unsigned long long>(deletes));
         return kOk;
     }
@@ -303,16 +320,8 @@ private:
 }  // namespace
 
 ExitCode Push(const PushOptions& options) {
-    ExitCode result = CheckShares(options.shares);
-    if (result != kOk) {
-        return result;
-    }
-    WatchForInterrupt();
     Pusher pusher(options);
-    result = pusher.Connect();
-    if (result == kOk) {
-        result = pusher.Pair(true);
-    }
+    const ExitCode result = pusher.Connect();
     if (result != kOk) {
         return result;
     }
@@ -323,16 +332,8 @@ ExitCode CheckPairing(const ConnectionOptions& connection, const std::vector<std
     PushOptions options;
     options.connection = connection;
     options.shares = shares;
-    ExitCode result = CheckShares(shares);
-    if (result != kOk) {
-        return result;
-    }
-    WatchForInterrupt();
     Pusher pusher(options);
-    result = pusher.Connect();
-    if (result == kOk) {
-        result = pusher.Pair(true);
-    }
+    const ExitCode result = pusher.Connect();
     if (result == kOk) {
         puts("The server would take these shares from this client.");
     }

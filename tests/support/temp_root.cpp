@@ -1,10 +1,14 @@
 #include "tests/support/temp_root.h"
 
+#include <sys/sem.h>
+
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
 #include <stdexcept>
+
+#include "tarq/root_path.h"
 
 namespace test {
 
@@ -42,6 +46,11 @@ TempRoot::TempRoot() {
 }
 
 TempRoot::~TempRoot() {
+    // Semaphores outlive their users; the registry's key is the root folder's own.
+    const int semaphore = semget(TARQ::RootSemaphoreKey(0x2980298), 0, 0);
+    if (semaphore >= 0) {
+        semctl(semaphore, 0, IPC_RMID);
+    }
     unsetenv("TARQ_ROOT");
 }
 

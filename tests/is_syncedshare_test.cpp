@@ -1,0 +1,437 @@
+#include "ZEL/is_syncedshare.h"
+
+#include <dlfcn.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <filesystem>
+
+#include "tests/support/string_hash.h"
+#include "tests/support/syslog_capture.h"
+#include "tests/support/temp_root.h"
+
+namespace {
+
+const char* failing = "";  // the platform operation that fails
+int passes = 0;            // how many calls of it succeed first
+int failing_code = 0;      // the error code that it sets
+
+bool Fails(const char* operation) {
+    if (std::string(failing) != operation || passes-- > 0) {
+        return false;
+    }
+    KAPICErrSetEx(failing_code, "", 0);
+    return true;
+}
+
+}  // namespace
+
+// A platform operation that fails on demand, in front of the real one.
+#define FRONT(Result, Name, Parameters, Arguments, failed)                                        \
+    extern "C" __attribute__((visibility("default"))) Result Name Parameters {                    \
+        static const auto next = reinterpret_cast<Result(*) Parameters>(dlsym(RTLD_NEXT, #Name)); \
+        return Fails(#Name) ? (failed) : next Arguments;                                          \
+    }
+FRONT(int, KAPICSemOpen, (int key), (key), -1)
+FRONT(int, KAPICSemLock, (int id), (id), -1)
+FRONT(KAPICSzHash, KAPICSzHashAlloc, (int n), (n), nullptr)
+FRONT(KAPICSzList, KAPICSzListAlloc, (int n), (n), nullptr)
+FRONT(int, KAPICSzHashSetValue, (KAPICSzHash h, const char* k, const char* v), (h, k, v), -1)
+FRONT(int, KAPICSzListPush, (KAPICSzList l, const char* s), (l, s), -1)
+FRONT(char*, KAPICStrGet, (const char* f, const char* a), (f, a), nullptr)
+FRONT(int, KAPICProcAliveByPidFile, (const char* p), (p), 0)
+FRONT(int, KAPICFileExist, (const char* p), (p), 0)
+FRONT(int, KAPICFileEnumSection, (const char* p, KAPICSzList l), (p, l), -1)
+FRONT(int, KAPICFileGetSection, (const char* p, const char* s, KAPICSzHash h), (p, s, h), -3)
+FRONT(int, KAPICFileGetSectionValue, (const char* p, const char* s, const char* k, char* b, int n),
+      (p, s, k, b, n), -1)
+FRONT(int, KAPICFileSetSection, (const char* p, const char* s, int r, KAPICSzHash h, const char* f),
+      (p, s, r, h, f), -1)
+FRONT(int, KAPICFileAddSection, (const char* p, const char* s, KAPICSzHash h, const char* f),
+      (p, s, h, f), -1)
+FRONT(int, KAPICIFileModifySection,
+      (const char* p, const char* s, int r, KAPICSzHash h, int a, int b), (p, s, r, h, a, b), -1)
+
+namespace {
+
+using test::Hash;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+using testing::MatchesRegex;
+
+class Registry : public testing::Test {
+protected:
+    Registry() { test::TakeSyslog(); }
+    ~Registry() override { failing = ""; }
+
+    void Write(const std::string& text) const { root_.Write("usr/tarq/etc/tarqZEL.info", text); }
+    std::string Text() const { return test::ReadFile(path_); }
+    static void Fail(const char* operation, int after = 0, int code = 0x123) {
+        failing = operation;
+        passes = after;
+        failing_code = code;
+    }
+    /// The result of the check with the refused names, "214 photos music".
+    static std::string Admit(std::initializer_list<const char*> shares, const char* client) {
+        KAPICSzList list = KAPICSzListAlloc(4), refused = KAPICSzListAlloc(4);
+        KAPICSzListPush(refused, "left over");
+        for (const char* share : shares) {
+            KAPICSzListPush(list, share);
+        }
+        std::string result = std::to_string(ZELCheckIfSharePaired(list, client, &refused));
+        for (int i = 0; i < KAPICSzListCount(refused); ++i) {
+            result += std::string(" ") + KAPICSzListGet(refused, i);
+        }
+        KAPICSzListFree(list);
+        KAPICSzListFree(refused);
+        return result;
+    }
+    /// "enabled busy client server", with - for no text.
+    static std::string Status() {
+        zel_svr_status status{7, 7, nullptr, nullptr};
+        std::string text = std::to_string(zel_svr_get_status(&status)) + ":";
+        text += std::to_string(status.enabled) + std::to_string(status.busy);
+        for (const char* part : {status.client_id, status.server_name}) {
+            text += std::string(" ") + (part != nullptr ? part : "-");
+        }
+        zel_svr_put_status(&status);
+        return text;
+    }
+
+    test::TempRoot root_;
+    const std::string path_ = root_.Path("usr/tarq/etc/tarqZEL.info");
+    const std::string set_error_ = "Set section [SHARE_a ] value into [" + path_ + "] error.";
+};
+
+TEST_F(Registry, IsMadeEmptyByTheFirstReaderOrWriter) {
+    const mode_t mask = umask(022);
+    Hash hash;
+    EXPECT_EQ(ZELGetServerInfo("PairedClientInfo", hash), 0);
+    umask(mask);
+    struct stat status {};
+    ASSERT_EQ(stat(path_.c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 0777U, 0644U);
+    EXPECT_EQ(Text(), "");
+
+    unlink(path_.c_str());
+    char buffer[8] = "";
+    EXPECT_EQ(ZELServerGetShare("a", "k", buffer, 0), -1);
+    EXPECT_EQ(ZELServerGetShare("a", nullptr, buffer, 8), -1);
+    EXPECT_FALSE(std::filesystem::exists(path_)) << "bad arguments touch nothing";
+    EXPECT_EQ(ZELServerGetShare("a", "k", buffer, 8), -1);
+    EXPECT_EQ(KAPICErrGet(), 0x2200);
+    EXPECT_TRUE(std::filesystem::exists(path_));
+
+    std::filesystem::remove_all(root_.Path("usr"));
+    EXPECT_EQ(ZELCheckServerInfo(), -1);
+    EXPECT_LT(ZELGetServerInfo("PairedClientInfo", hash), 0);
+    EXPECT_EQ(TARQUISetZEL(1, nullptr, nullptr), -1);
+    EXPECT_EQ(zel_svr_reset_pair(), -1);
+    EXPECT_EQ(Status(), "-1:00 - -");
+}
+
+TEST_F(Registry, AWriteReplacesTheWholeSectionOrAppendsIt) {
+    EXPECT_EQ(ZELServerUpdateShare("a", Hash{{"RunningID", "A"}, {"CompleteID", "B"}}), 0);
+    EXPECT_EQ(ZELServerUpdateTask("7", Hash{{"status", "idle"}}), 0);
+    EXPECT_EQ(ZELServerUpdateShare("a", Hash{{"RunningID", ""}}), 0);
+    EXPECT_EQ(Text(), "[SHARE_a]\n\tRunningID=\"\"\n[TASK_7]\n\tstatus=\"idle\"\n");
+    Write("");
+    EXPECT_EQ(ZELUpdateServerInfo("", Hash{{"k", "1"}}), 0);
+    EXPECT_EQ(ZELUpdateServerInfo("", Hash{{"k", "2"}}), 0);
+    EXPECT_EQ(Text(), "[]\n\tk=\"1\"\n[]\n\tk=\"2\"\n");
+    EXPECT_EQ(ZELUpdateServerInfo(nullptr, Hash{}), -1);
+    EXPECT_EQ(ZELServerUpdateShare(nullptr, Hash{}), -1);
+    EXPECT_THAT(test::TakeSyslogTexts(), IsEmpty());
+}
+
+TEST_F(Registry, AWriteThatFailsSaysWhatFailed) {
+    const std::string file = "[" + path_ + "], section=[SHARE_a], errno=[0x0123]";
+    for (const auto& [operation, text, existing] :
+         std::vector<std::tuple<const char*, std::string, bool>>{
+             {"KAPICSemOpen", "", true},
+             {"KAPICSemLock", "", true},
+             {"KAPICSzHashAlloc", "none", true},
+             {"KAPICFileGetSection",
+              "KAPICFileGetSection error. filePath:[" + path_ +
+                  "] szOldSecName:[SHARE_a]  iRet:[-3]",
+              true},
+             {"KAPICFileSetSection", "KAPICFileSetSection() failed!! szFile=" + file, true},
+             {"KAPICFileAddSection", "KAPICFileAddSection() failed!! szFile=" + file, false}}) {
+        const std::string old = existing ? "[SHARE_a]\n" : "";
+        Write(old);
+        const Hash values{{"k", "v"}};
+        Fail(operation);
+        EXPECT_EQ(ZELServerUpdateShare("a", values), -1) << operation;
+        failing = "";
+        const auto log = test::TakeSyslogTexts();
+        if (text.empty()) {
+            EXPECT_THAT(log, ElementsAre("ZELUpdateServerInfo() lock failed"));
+        } else if (text == "none") {
+            EXPECT_THAT(log, ElementsAre(set_error_));
+        } else {
+            EXPECT_THAT(log, ElementsAre(text, set_error_)) << operation;
+        }
+        EXPECT_EQ(Text(), old);
+        EXPECT_EQ(ZELServerUpdateShare("a", values), 0) << "the lock was given back";
+    }
+    std::filesystem::remove_all(root_.Path("usr"));
+    EXPECT_EQ(ZELServerUpdateShare("a", Hash{}), -1);
+    EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre("Failed to open file [" + path_ +
+                                                         "], errno=[2/No such file or directory]",
+                                                     set_error_));
+    root_.Write("usr", "in the way");
+    failing = "KAPICFileGetSection", passes = 0;
+    EXPECT_EQ(ZELUpdateServerInfo("", Hash{}), -1);
+    const auto log = test::TakeSyslog();
+    ASSERT_EQ(log.size(), 2U);
+    EXPECT_EQ(log[0].text, "Failed to stat file [" + path_ + "], errno=[20/Not a directory]");
+    EXPECT_EQ(log[0].priority, LOG_ERR);
+}
+
+TEST_F(Registry, TheSwitchKeepsWhatItIsNotGiven) {
+    EXPECT_EQ(TARQUISetZEL(1, "A", nullptr), 0);
+    EXPECT_EQ(Text(), "[PairedClientInfo]\nzelEnabled=\"yes\"\n");
+    EXPECT_EQ(TARQUISetZEL(0, "A", "nas"), 0);
+    EXPECT_EQ(TARQUISetZEL(2, nullptr, "other"), 0);
+    EXPECT_EQ(Text(),
+              "[PairedClientInfo]\nzelEnabled=\"yes\"\nclientID=\"A\"\nserverName=\"nas\"\n");
+    for (const char* operation : {"KAPICSzHashAlloc", "KAPICFileGetSection", "KAPICSzHashSetValue",
+                                  "KAPICSemOpen", "KAPICIFileModifySection"}) {
+        Fail(operation);
+        EXPECT_EQ(TARQUISetZEL(0, nullptr, nullptr), -1) << operation;
+    }
+    Fail("KAPICSzHashSetValue", 5);  // three are read, clientID, then serverName
+    EXPECT_EQ(TARQUISetZEL(0, "B", "nas"), -1);
+    EXPECT_THAT(Text(), HasSubstr("zelEnabled=\"yes\"\nclientID=\"A\""));
+}
+
+TEST_F(Registry, AShareIsSyncedWhileSomebodyRunsAndTheSwitchIsNotOff) {
+    for (const auto& [text, synced] : std::vector<std::pair<const char*, int>>{
+             {"[SHARE_a]\nRunningID=\"A\"\n", 1},
+             {"[PairedClientInfo]\n[SHARE_a]\nRunningID=\"A\"\n", 1},
+             {"[PairedClientInfo]\nzelEnabled=\"No\"\n[SHARE_a]\nRunningID=\"A\"\n", 1},
+             {"[PairedClientInfo]\nzelEnabled=\"no\"\n[SHARE_a]\nRunningID=\"A\"\n", 0},
+             {"[SHARE_a]\nRunningID=\"\"\n", 0},
+             {"[SHARE_a]\n", 0},
+             {"[SHARE_A]\nRunningID=\"A\"\n", 0},
+             {"", 0}}) {
+        Write(text);
+        EXPECT_EQ(TARQZELIsSyncedShare("a"), synced) << text;
+    }
+    EXPECT_EQ(TARQZELIsSyncedShare(""), 0);
+    EXPECT_EQ(KAPICErrGet(), 0xD00);
+    EXPECT_THAT(test::TakeSyslogTexts(), IsEmpty()) << "absence is no error";
+
+    Write("[SHARE_a]\nRunningID=\"A\"\n");
+    for (int after : {0, 1}) {
+        Fail("KAPICFileGetSectionValue", after);
+        EXPECT_EQ(TARQZELIsSyncedShare("a"), 0);
+    }
+    Fail("KAPICStrGet");
+    EXPECT_EQ(TARQZELIsSyncedShare("a"), 0);
+    const std::string at = "ZEL/is_syncedshare:[0-9]+ ";
+    EXPECT_THAT(
+        test::TakeSyslogTexts(),
+        ElementsAre(
+            MatchesRegex(at +
+                         "KAPICFileGetSectionValue error. key:.PairedClientInfo. errno=.0x0123."),
+            MatchesRegex(at + "KAPICFileGetSectionValue error. key:.SHARE_a. errno=.0x0123."),
+            MatchesRegex(at + "Fail to KAPICStrGet shareName:.a. errno=.0x0123.")));
+}
+
+TEST_F(Registry, LowerCaseStopsAtThirtyTwoCharacters) {
+    char target[40] = "";
+    getLowerString("ABCDEFGHIJKLMNOPQRSTUVWXYZ[\xC4\x80@`{ZZZ", target);
+    EXPECT_STREQ(target, "abcdefghijklmnopqrstuvwxyz[\xC4\x80@`{");
+}
+
+TEST_F(Registry, AShareThatAnotherClientSyncsIntoIsRefused) {
+    const std::string id = "123456789-123456789-123456789-123456";  // as long as identities go
+    const std::string running = "\"\nRunningID=\"";
+    Write("[SHARE_Photos]\nCompleteID=\"A" + running + "B\"\n[SHARE_music]\nCompleteID=\"" +
+          running +
+          "\"\n[SHARE_half]\nCompleteID=\"A\"\n[SHARE_none]\n[SHARE_MUSIC]\nRunningID=\"\"\n[SHARE_"
+          "long]\nCompleteID=\"" +
+          running + id +
+          "\"\n[SHARE_Music]\nRunningID=\"C\"\n[SHARE_12345678901234567890123456789012X]"
+          "\nRunningID=\"B\"\n");
+    for (const auto& [shares, client, result] :
+         std::vector<std::tuple<std::initializer_list<const char*>, std::string, std::string>>{
+             {{"new"}, "A", "0"},
+             {{"photos"}, "A", "214 photos"},
+             {{"photos", "Photos"}, "B", "0"},
+             {{"new", "Photos", "video"}, "A", "214 Photos"},
+             {{"music"}, "A", "214 music"},
+             {{"music"}, "C", "0"},
+             {{"Photos", "half", "music"}, "A", "206 Photos"},
+             {{"none"}, "A", "206"},
+             {{"HALF"}, "A", "0"},
+             {{"", "new", "", "photos"}, "A", "214   photos"},
+             {{"long"}, id, "0"},
+             {{"long"}, id.substr(0, 35) + "7", "214 long"},
+             {{"12345678901234567890123456789012Y"},
+              "A",
+              "214 12345678901234567890123456789012Y"}}) {
+        EXPECT_EQ(Admit(shares, client.c_str()), result) << *shares.begin() << " for " << client;
+    }
+    EXPECT_THAT(
+        test::TakeSyslogTexts(),
+        ElementsAre("Failed to get section [half] RunningID value.", "getSharePairStatus error",
+                    "Failed to get section [none] CompleteID value.", "getSharePairStatus error",
+                    "Parameter error on getSharePairStatus.",
+                    "Parameter error on getSharePairStatus."));
+}
+
+TEST_F(Registry, AnAdmissionCheckThatCannotBeFinishedAdmitsNobody) {
+    const std::string converted = "Failed to get converted shared name.";
+    for (const auto& [operation, after, text] :
+         std::vector<std::tuple<const char*, int, std::string>>{
+             {"KAPICFileGetSectionValue", 0, "Failed to get section [photos] CompleteID value."},
+             {"KAPICSzListAlloc", 2, "Failed to allocate memory.\n"},
+             {"KAPICSzHashAlloc", 0, "Failed to allocate memory.\n"},
+             {"KAPICFileEnumSection", 0, "Failed to get section list.\n"},
+             {"KAPICFileGetSection", 0, "Failed to get section.\n"}}) {
+        Write("[SHARE_PHOTOS]\n");
+        Fail(operation, after);
+        EXPECT_EQ(Admit({"photos"}, "A"), "206") << operation;
+        const bool status = after == 0 && std::string(operation) == "KAPICFileGetSectionValue";
+        EXPECT_THAT(test::TakeSyslogTexts(),
+                    ElementsAre(text, status ? "getSharePairStatus error" : converted));
+    }
+    std::filesystem::remove_all(root_.Path("usr"));
+    EXPECT_EQ(Admit({"photos"}, "A"), "206");
+    EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre("Failed to check server info.\n", converted));
+    root_.Write("usr/tarq/etc/tarqZEL.info", "[SHARE_PHOTOS]\nRunningID=\"B\"\n");
+    Fail("KAPICSzListPush", 3);  // left over, photos and the section's name come first
+    EXPECT_EQ(Admit({"photos"}, "A"), "206") << "a refusal that cannot be told";
+    failing = "";
+    EXPECT_EQ(Admit({"photos"}, ""), "201 left over");
+    EXPECT_EQ(Admit({}, "A"), "201 left over");
+    EXPECT_EQ(ZELCheckIfSharePaired(nullptr, "A", nullptr), 201);
+    EXPECT_EQ(test::TakeSyslogTexts(),
+              std::vector<std::string>(3, "Input parameters are null or empty!"));
+}
+
+TEST_F(Registry, AnOldClientIsOneThatOwnsThePairing) {
+    const std::string marker = "ZELMULTI-SRC-SUPPORT";
+    for (const auto& [client, server, paired] :
+         std::vector<std::tuple<std::string, std::string, int>>{{"A", "nas", 1},
+                                                                {"A", marker, 1},
+                                                                {marker, "nas", 1},
+                                                                {marker, marker, 0},
+                                                                {"", "nas", 0},
+                                                                {"A", "", 0}}) {
+        Write("[PairedClientInfo]\nclientID=\"" + client + "\"\nserverName=\"" + server + "\"\n");
+        EXPECT_EQ(ZELServerIfOldClientPaired(), paired) << client << " " << server;
+    }
+    Write("");
+    EXPECT_EQ(ZELServerIfOldClientPaired(), 0);
+    for (const char* operation : {"KAPICSzHashAlloc", "KAPICFileGetSection"}) {
+        Fail(operation);
+        EXPECT_EQ(ZELServerIfOldClientPaired(), -1);
+    }
+    EXPECT_THAT(test::TakeSyslogTexts(),
+                ElementsAre("Failed to allocate memory of hash.", "Get server paired-info error."));
+}
+
+TEST_F(Registry, APairingIsRecordedWhole) {
+    Write("[PairedClientInfo]\nzelEnabled=\"no\"\n");
+    const Hash pair{{"clientID", "A"}, {"serverName", "nas"}, {"other", "x"}};
+    EXPECT_EQ(ZELServerSetPairValue(pair), 0);
+    EXPECT_EQ(Text(),
+              "[PairedClientInfo]\n\tclientID=\"A\"\n\tserverName=\"nas\"\n\tzelEnabled=\"no\"\n");
+    EXPECT_EQ(ZELServerUpdatePairInfo("B", "box"), 0);
+    const std::string multi =
+        "[PairedClientInfo]\n\tclientID=\"ZELMULTI-SRC-SUPPORT\"\n"
+        "\tserverName=\"ZELMULTI-SRC-SUPPORT\"\n\tzelEnabled=\"no\"\n";
+    EXPECT_EQ(Text(), multi + "[CLIENTID_B]\n\tServerName=\"box\"\n");
+
+    Write("");
+    EXPECT_EQ(ZELServerSetPairValue(nullptr), 201);
+    EXPECT_EQ(ZELServerSetPairValue(Hash{{"clientID", "A"}}), 202);
+    EXPECT_EQ(ZELServerUpdatePairInfo("", "box"), 201);
+    EXPECT_EQ(ZELServerUpdatePairInfo("B", nullptr), 201);
+    for (const auto& [operation, pair_result, info_result] :
+         {std::tuple("KAPICSzHashAlloc", 200, 200),
+          {"KAPICFileGetSection", 206, 205},
+          {"KAPICSzHashSetValue", 202, 202},
+          {"KAPICSemOpen", 205, 205}}) {
+        Fail(operation);
+        EXPECT_EQ(ZELServerSetPairValue(pair), pair_result) << operation;
+        Fail(operation);
+        EXPECT_EQ(ZELServerUpdatePairInfo("B", "box"), info_result) << operation;
+    }
+    EXPECT_EQ(Text(), "");
+}
+
+TEST_F(Registry, TheStatusTellsWhatIsServedAndWhetherASyncRuns) {
+    EXPECT_EQ(Status(), "0:00 - -");
+    const std::string on = "[PairedClientInfo]\nzelEnabled=\"yes\"\nclientID=\"A\"\n";
+    Write(on);
+    EXPECT_EQ(Status(), "0:00 A -") << "no rsync daemon";
+    root_.Write("var/run/rsyncd.pid", std::to_string(getpid()) + "\n");
+    EXPECT_EQ(Status(), "0:10 A -");
+    const auto ago = [](long long seconds) { return std::to_string(time(nullptr) - seconds); };
+    for (const auto& [tasks, busy] : std::vector<std::pair<std::string, char>>{
+             {"[TASK_1]\nstatus=\"idle\"\n[TASK_]\nstatus=\"" + ago(0), '1'},
+             {"[TASK_1]\nstatus=\"" + ago(110), '1'},
+             {"[TASK_1]\nstatus=\"" + ago(120), '0'},
+             {"[TASK_1]\nstatus=\"" + ago(-500), '1'},
+             {"[TASK_1]\nstatus=\"abc", '0'},
+             {"[TASKX]\nstatus=\"" + ago(0), '0'},
+             {"[TASK_1]\nother=\"" + ago(0), '0'},
+             {"[TASK_1]\nstatus=\"" + ago(-(1LL << 32)), '1'},
+             {"[TASK_1]\nstatus=\"-99999999999999999999", '0'}}) {
+        Write(on + tasks + "\"\n");
+        EXPECT_EQ(Status(), std::string("0:1") + busy + " A -") << tasks;
+    }
+    Write(on + "[TASK_1]\nstatus=\"idle\"\n[TASK_2]\nstatus=\"" + ago(0) + "\"\n");
+    for (const auto& [operation, after, expected] :
+         {std::tuple("KAPICFileGetSection", 0, "-1:00 - -"),
+          {"KAPICFileGetSection", 1, "-1:10 - -"},
+          {"KAPICFileGetSection", 2, "0:10 A -"},
+          {"KAPICFileEnumSection", 0, "0:10 A -"},
+          {"KAPICSzListAlloc", 0, "0:10 A -"}}) {
+        Fail(operation, after);
+        EXPECT_EQ(Status(), expected) << operation << after;
+    }
+    EXPECT_EQ(zel_svr_put_status(nullptr), 0);
+    EXPECT_EQ(zel_svr_get_status(nullptr), -1);
+}
+
+TEST_F(Registry, AResetGivesTheSingleClientItsOwnSection) {
+    Write("[PairedClientInfo]\n\tzelEnabled=\"yes\"\n\tclientID=\"A\"\n\tserverName=\"nas\"\n");
+    EXPECT_EQ(zel_svr_reset_pair(), 0);
+    const std::string multi =
+        "[PairedClientInfo]\n\tzelEnabled=\"yes\"\n\tclientID=\"ZELMULTI-SRC-SUPPORT\"\n"
+        "\tserverName=\"ZELMULTI-SRC-SUPPORT\"\n[CLIENTID_A]\nServerName=\"nas\"\n";
+    EXPECT_EQ(Text(), multi);
+    EXPECT_EQ(zel_svr_reset_pair(), 0);
+    EXPECT_EQ(Text(),
+              multi + "[CLIENTID_ZELMULTI-SRC-SUPPORT]\nServerName=\"ZELMULTI-SRC-SUPPORT\"\n");
+
+    for (const auto& [text, message] :
+         {std::pair("clientID=\"A\"\n", "Failed to get serverName from hash."),
+          {"serverName=\"n\"\n", "Failed to get clientID from hash."}}) {
+        Write(std::string("[PairedClientInfo]\n") + text);
+        EXPECT_EQ(zel_svr_reset_pair(), 0);
+        EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre(message));
+        EXPECT_EQ(ZELServerIfOldClientPaired(), 0);
+        EXPECT_THAT(Text(), HasSubstr("clientID=\"ZELMULTI-SRC-SUPPORT\""));
+    }
+    Write("[PairedClientInfo]\nclientID=\"A\"\nserverName=\"nas\"\n");
+    Fail("KAPICFileAddSection");
+    EXPECT_EQ(zel_svr_reset_pair(), 0);
+    EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre("Failed to add section [CLIENTID_A]."));
+    for (const char* operation :
+         {"KAPICSemOpen", "KAPICIFileModifySection", "KAPICFileGetSection"}) {
+        Fail(operation);
+        EXPECT_EQ(zel_svr_reset_pair(), -1) << operation;
+    }
+}
+
+}  // namespace

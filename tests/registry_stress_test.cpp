@@ -1,0 +1,112 @@
+// Many processes on one registry, for ZEL_STRESS_SECONDS (10 unless set).
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <functional>
+
+#include "ZEL/is_syncedshare.h"
+#include "tarq/root_path.h"
+#include "tests/support/string_hash.h"
+#include "tests/support/temp_root.h"
+
+namespace {
+
+using test::Hash;
+
+constexpr int kWriters = 8;
+constexpr int kReaders = 2;
+constexpr int kSharesOfAWriter = 5;
+
+std::string ShareName(int writer, long turn) {
+    return "w" + std::to_string(writer) + "_" + std::to_string(turn % kSharesOfAWriter);
+}
+
+/// Counts up in shares of its own: what it reads there is what it wrote last, whatever the others
+/// do.
+bool WriteUntil(time_t end, int writer) {
+    for (long turn = 0; time(nullptr) < end; ++turn) {
+        char value[256] = "";
+        if (turn >= kSharesOfAWriter && (ZELServerGetShare(ShareName(writer, turn).c_str(),
+                                                           "RunningID", value, sizeof value) != 0 ||
+                                         atol(value) != turn - kSharesOfAWriter)) {
+            fprintf(stderr, "writer %d lost update %ld: \"%s\"\n", writer, turn, value);
+            return false;
+        }
+        const std::string text =
+            std::to_string(turn) + std::string(static_cast<size_t>(turn % 97), ' ');
+        if (ZELServerUpdateShare(ShareName(writer, turn).c_str(),
+                                 Hash{{"RunningID", text}, {"CompleteID", text}}) != 0) {
+            fprintf(stderr, "writer %d cannot write: %m\n", writer);
+            return false;
+        }
+    }
+    return true;
+}
+
+/// Sections come whole and never go: both keys alike, and no fewer sections than before.
+bool ReadUntil(time_t end) {
+    int most = 0;
+    while (time(nullptr) < end) {
+        const KAPICSzList sections = KAPICSzListAlloc(64);
+        KAPICFileEnumSection(TARQ::RootPath("/usr/tarq/etc/tarqZEL.info").c_str(), sections);
+        const int count = KAPICSzListCount(sections);
+        bool whole = count >= most;
+        for (int i = 0; i < count; ++i) {
+            const Hash values;
+            whole &= ZELGetServerInfo(KAPICSzListGet(sections, i), values) > 0;
+            const auto all = values.All();
+            whole &= all.size() == 2 && all[0].second == all[1].second;
+        }
+        KAPICSzListFree(sections);
+        if (!whole) {
+            fprintf(stderr, "a reader saw a torn file\n");
+            return false;
+        }
+        most = count;
+    }
+    return true;
+}
+
+pid_t Start(const std::function<bool()>& work) {
+    const pid_t child = fork();
+    if (child == 0) {
+        _exit(work() ? 0 : 1);
+    }
+    return child;
+}
+
+TEST(RegistryStress, EightWritersAndTwoReadersLoseNothingWhileHoldersOfTheLockDie) {
+    const test::TempRoot root;
+    const char* seconds = getenv("ZEL_STRESS_SECONDS");
+    const time_t end = time(nullptr) + (seconds != nullptr ? atol(seconds) : 10);
+    std::vector<pid_t> children;
+    for (int i = 0; i < kWriters; ++i) {
+        children.push_back(Start([=] { return WriteUntil(end, i); }));
+    }
+    for (int i = 0; i < kReaders; ++i) {
+        children.push_back(Start([=] { return ReadUntil(end); }));
+    }
+    int deaths = 0;
+    for (; time(nullptr) < end; ++deaths) {
+        const pid_t holder = Start([] {
+            KAPICSemLock(KAPICSemOpen(TARQ::RootSemaphoreKey(0x2980298)));
+            return raise(SIGKILL) == 0;
+        });
+        int status = 0;
+        waitpid(holder, &status, 0);
+        ASSERT_TRUE(WIFSIGNALED(status));
+        usleep(20'000);
+    }
+    for (const pid_t child : children) {
+        int status = 0;
+        waitpid(child, &status, 0);
+        EXPECT_EQ(status, 0);
+    }
+    EXPECT_GT(deaths, 10);
+}
+
+}  // namespace
