@@ -70,7 +70,7 @@ void Print(const char* what, const Contestant& ours, const char* peer, const Con
            double wanted) {
     const double our_median = Median(ours.seconds);
     const double their_median = Median(theirs.seconds);
-    std::printf("%-34s %9.2f ms, %-28s %9.2f ms: ratio %.3f (wanted: at most %.2f)\n", what,
+    std::printf("%-20s %9.2f ms, %-28s %9.2f ms: ratio %.3f (wanted: at most %.2f)\n", what,
                 our_median * 1e3, peer, their_median * 1e3, our_median / their_median, wanted);
 }
 

@@ -243,41 +243,6 @@ TEST_F(ArgumentsTest, EachTransportGetsItsOwnWayAndNoneShowsThePassword) {
     EXPECT_EQ(invocation.input, "");
 }
 
-TEST_F(ArgumentsTest, EverySetterAndWishAddsItsOption) {
-    struct Case {
-        std::function<void(Settings&, RunOptions&)> set;
-        const char* option;
-    };
-    for (const Case& c : std::initializer_list<Case>{
-             {[](Settings&s, RunOptions&) { s.delete_missing = true; }, "--delete-after"},
-             {[](Settings&s, RunOptions&) { s.numeric_ids = true; }, "--numeric-ids"},
-             {[](Settings&s, RunOptions&) { s.pseudo_root = true; }, "-D"},
-             {[](Settings&s, RunOptions&) { s.compress = true; }, "-z"},
-             {[](Settings&s, RunOptions&) { s.delta_copy = true; }, "--no-whole-file"},
-             {[](Settings&s, RunOptions&) { s.relative_path = true; }, "--relative"},
-             {[](Settings&s, RunOptions&) { s.list_only = true; }, "--list-only"},
-             {[](Settings&s, RunOptions&) { s.timeout = 5; }, "--timeout=5"},
-             {[](Settings&s, RunOptions&) { s.timeout = 5; }, "--contimeout=5"},
-             {[](Settings&s, RunOptions&) { s.port = 8730; }, "--port=8730"},
-             {[](Settings&, RunOptions&o) { o.bandwidth_limit = 100; }, "--bwlimit=100"},
-             {[](Settings&, RunOptions&o) { o.dry_run = true; }, "--dry-run"},
-             {[](Settings&, RunOptions&o) { o.on_progress = [](auto&) {}; }, "--info=progress2"},
-             {[](Settings&s, RunOptions&) {
-                  s.module = "/x";
-                  s.pseudo_root = true;
-              },
-              "-M--fake-super"},
-         }) {
-        SCOPED_TRACE(c.option);
-        EXPECT_THAT(Build().arguments, Not(Contains(c.option)));
-        const Settings before = settings_;
-        RunOptions options;
-        c.set(settings_, options);
-        EXPECT_THAT(Build(options).arguments, Contains(c.option));
-        settings_ = before;
-    }
-}
-
 std::string Shell(ChildSpec spec, const std::string& script, ChildResult* result = nullptr,
                   const std::function<bool()>& cancelled = nullptr) {
     std::string output;

@@ -8,7 +8,7 @@ namespace Backup {
 
 /// No answer is larger, its status line included. Nothing that the server's programs send comes
 /// near.
-constexpr size_t kMaxAnswerBytes = 16 * 1024 * 1024;
+constexpr size_t kMaxAnswerBytes = size_t{16} * 1024 * 1024;
 
 /// A server's answer: the line status="N", then bytes for the command's outfile.
 struct Answer {

@@ -26,7 +26,7 @@ constexpr int kSshAliveInterval = 15;
 constexpr char kPartialFolder[] = ".tarqrsync-partial";
 
 // Rules that are longer together go to a file: a program's arguments have a limit.
-constexpr size_t kMaxRuleBytes = 32 * 1024;
+constexpr size_t kMaxRuleBytes = size_t{32} * 1024;
 
 using Words = std::vector<std::string>;
 

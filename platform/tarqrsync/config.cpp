@@ -3,7 +3,7 @@
 #include <charconv>
 #include <sstream>
 
-#include "tarq/owners.h"
+#include "platform/internal/config.h"
 #include "tarq/root_path.h"
 
 namespace TARQ {
@@ -13,7 +13,6 @@ namespace {
 
 constexpr char kConfigPath[] = "/usr/tarq/etc/tarqrsync.conf";
 constexpr char kSection[] = "rsync";
-constexpr int kMaxPort = 65535;
 
 bool ParsePort(const std::string& text, int* port) {
     const char* end = text.data() + text.size();
@@ -25,16 +24,13 @@ bool ParsePort(const std::string& text, int* port) {
 
 std::string ReadConfig(Config* config) {
     const std::string path = RootPath(kConfigPath);
-    if (!KAPICFileExist(path.c_str())) {
-        return "";
-    }
-    const HashOwner values(KAPICSzHashAlloc(4));
-    if (!values || KAPICFileGetSection(path.c_str(), kSection, values.get()) < 0) {
+    tarq_internal::Section values;
+    if (tarq_internal::ReadSection(path, kSection, &values) == tarq_internal::ReadResult::kFailed) {
         return "cannot read " + path;
     }
-    const auto value = [&values](const char* key, const std::string& otherwise) -> std::string {
-        const char* text = KAPICSzHashGetValue(values.get(), key);
-        return text && *text ? text : otherwise;
+    const auto value = [&values](const char* key, const std::string& otherwise) {
+        std::string text = tarq_internal::ValueOf(values, key);
+        return text.empty() ? otherwise : text;
     };
     config->rsync = value("rsync", config->rsync);
     config->ssh = value("ssh", config->ssh);

@@ -6,6 +6,8 @@
 namespace TARQ {
 namespace Backup {
 
+constexpr int kMaxPort = 65535;
+
 /// /usr/tarq/etc/tarqrsync.conf, section "rsync". What the file does not say stays as it is here.
 struct Config {
     int daemon_port = 873;

@@ -5,7 +5,7 @@ namespace Backup {
 
 namespace {
 
-constexpr size_t kKept = 64 * 1024;
+constexpr size_t kKept = size_t{64} * 1024;
 
 }  // namespace
 

@@ -14,7 +14,7 @@ namespace {
 // Progress comes with each file: a listener hears of it no more often than this.
 constexpr std::chrono::milliseconds kProgressInterval(200);
 // A name of PATH_MAX bytes, each escaped as four, and the figures before it.
-constexpr size_t kMaxLine = 64 * 1024;
+constexpr size_t kMaxLine = size_t{64} * 1024;
 constexpr size_t kMaxOtherText = 4096;
 
 constexpr std::string_view kDeleting = "*deleting";
@@ -229,7 +229,7 @@ bool OutputParser::TakeListed(std::string_view line) {
     if (!scanner.Literal(" ")) {
         return false;
     }
-    entry.path = UnescapeName(scanner.Rest());
+    entry.path = UnescapeName(scanner.Rest()) + (mode[0] == 'd' ? "/" : "");
     entry.kind = mode[0] == '-' ? RunChange::SEND : RunChange::OTHER;
     if (entry.kind != RunChange::SEND) {
         entry.length = 0;

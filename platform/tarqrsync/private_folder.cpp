@@ -42,7 +42,7 @@ std::string PrivateFolder::Path(const std::string& name) {
 
 std::string PrivateFolder::Write(const std::string& name, const std::string& content,
                                  bool executable) {
-    const std::string path = Path(name);
+    std::string path = Path(name);
     const tarq_internal::UniqueFd fd(
         open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, executable ? 0700 : 0600));
     if (!fd || !tarq_internal::WriteAll(fd.Get(), content)) {

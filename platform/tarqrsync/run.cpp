@@ -29,7 +29,7 @@ using tarq_internal::ChildResult;
 using tarq_internal::ChildSpec;
 
 constexpr char kLogPath[] = "/var/log/tarqrsync.log";
-constexpr off_t kMaxLogBytes = 1024 * 1024;
+constexpr off_t kMaxLogBytes = off_t{1024} * 1024;
 // A command's rsync writes the answer and, to a log that was below its limit before, a few lines.
 constexpr uint64_t kMaxCommandFileBytes = kMaxAnswerBytes;
 

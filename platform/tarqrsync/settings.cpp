@@ -4,14 +4,13 @@
 #include <cctype>
 #include <string_view>
 
-#include "tarq/rsync_wrapper.h"
+#include "platform/tarqrsync/config.h"
 
 namespace TARQ {
 namespace Backup {
 
 namespace {
 
-constexpr int kMaxPort = 65535;
 constexpr std::string_view kOutfilePrefix = "outfile=\"";
 // rsync reads one line of at most this many bytes as its password.
 constexpr size_t kMaxPasswordBytes = 255;
@@ -108,7 +107,7 @@ std::string RefusalOf(const Settings& settings) {
     if (settings.timeout < 0) {
         return "the time-out is negative";
     }
-    const std::string refusal = RefusalOfAccount(settings);
+    std::string refusal = RefusalOfAccount(settings);
     if (!refusal.empty()) {
         return refusal;
     }

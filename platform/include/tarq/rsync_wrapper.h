@@ -27,11 +27,12 @@ struct RunProgress {
     bool totals_final = false;  ///< the search for files has ended
 };
 
-/// One difference that a run makes, or with a dry run would make, at the destination.
+/// One difference that a run makes, or with a dry run would make, at the destination; or an entry
+/// of a listing (SEND for a file).
 struct RunChange {
     enum Kind { SEND, DELETE, OTHER /* attributes, directories, links */ };
     Kind kind = OTHER;
-    std::string path;     ///< relative to the source, bytes as they are on disk
+    std::string path;  ///< relative to the source, bytes as they are on disk; a folder ends in "/"
     uint64_t length = 0;  ///< size of the file in bytes, for SEND
 };
 
@@ -60,7 +61,8 @@ struct RunOptions {
     unsigned int bandwidth_limit = 0;  ///< KiB a second; 0: no limit
     bool dry_run = false;              ///< copies only: change nothing at the destination
     std::function<void(const RunProgress&)>
-        on_progress;  ///< called on the running thread, a few times a second
+        on_progress;  ///< called on the running thread, with files that end and once a second, at
+                      ///< most five times a second
     std::function<void(const RunChange&)>
         on_change;                ///< called on the running thread, in rsync's order
     RunReport* report = nullptr;  ///< filled when the run ends; the caller's
@@ -103,7 +105,7 @@ constexpr const char kCommandModule[] = "zel_command";
 
 /// The longest command, its session line included, that rsync carries to the server's handler, in
 /// bytes.
-constexpr size_t kMaxCommandBytes = 5 * 1024;
+constexpr size_t kMaxCommandBytes = size_t{5} * 1024;
 
 /// One rsync run.
 ///
