@@ -6,6 +6,9 @@
 
 #include <atomic>
 #include <cstdlib>
+#include <functional>
+#include <map>
+#include <memory>
 #include <new>
 #include <thread>
 #include <utility>
@@ -66,6 +69,24 @@ std::string Repeat(const std::string& text, int times) {
         repeated += text;
     }
     return repeated;
+}
+
+// On as much stack as a service's worker may have; instrumented code needs more.
+int OnSmallStack(std::function<int()> work) {
+    pthread_attr_t attributes;
+    pthread_attr_init(&attributes);
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
+    pthread_attr_setstacksize(&attributes, 256 * 1024);
+#endif
+    const auto run = [](void* argument) -> void* {
+        return new int((*static_cast<std::function<int()>*>(argument))());
+    };
+    pthread_t thread;
+    void* result = nullptr;
+    EXPECT_EQ(pthread_create(&thread, &attributes, run, &work), 0);
+    pthread_join(thread, &result);
+    pthread_attr_destroy(&attributes);
+    return *std::unique_ptr<int>(static_cast<int*>(result));
 }
 
 // What receiving `bytes`, and then nothing more, gives.
@@ -216,31 +237,9 @@ TEST(PStream, DeepNestingIsSentInFullAndReceivedTo512Levels) {
             return Repeat(maps ? "\x42" + key : "\x41", levels) + Unhex("00 00") +
                    Repeat("\x40", levels);
         };
-        // On a small stack, as a service's worker may have. Instrumented code needs more.
-        struct Run {
-            std::string bytes;
-            PObject value;
-            int result;
-        } good = {wire(512), {}, 1}, deep = {wire(513), {}, 1};
-        for (Run* run : {&good, &deep}) {
-            pthread_attr_t attributes;
-            pthread_attr_init(&attributes);
-#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
-            pthread_attr_setstacksize(&attributes, 256 * 1024);
-#endif
-            pthread_t thread;
-            const auto body = [](void* argument) -> void* {
-                auto* r = static_cast<Run*>(argument);
-                r->result = Receive(r->bytes, r->value);
-                return nullptr;
-            };
-            ASSERT_EQ(pthread_create(&thread, &attributes, body, run), 0);
-            pthread_join(thread, nullptr);
-            pthread_attr_destroy(&attributes);
-        }
-        EXPECT_EQ(good.result, 0);
-        EXPECT_EQ(deep.result, ZEL::RESULT_PROTOCOL);
-
+        PObject good, deep;
+        EXPECT_EQ(OnSmallStack([&] { return Receive(wire(512), good); }), 0);
+        EXPECT_EQ(OnSmallStack([&] { return Receive(wire(513), deep); }), ZEL::RESULT_PROTOCOL);
         constexpr int kSentLevels = 100000;
         PObject value;
         for (int i = 0; i < kSentLevels; ++i) {
@@ -251,9 +250,8 @@ TEST(PStream, DeepNestingIsSentInFullAndReceivedTo512Levels) {
         RawPeer peer;
         std::string received;
         std::thread reader([&] {
-            char buffer[65536];
-            for (ssize_t n; (n = read(peer.fd, buffer, sizeof buffer)) > 0;) {
-                received.append(buffer, static_cast<size_t>(n));
+            for (char byte[4096]; ssize_t n = read(peer.fd, byte, sizeof byte);) {
+                received.append(byte, static_cast<size_t>(n));
             }
         });
         EXPECT_EQ(PStream().Send(peer.channel, value), 0);
@@ -264,39 +262,26 @@ TEST(PStream, DeepNestingIsSentInFullAndReceivedTo512Levels) {
 }
 
 TEST(PStream, TheTraceIsIndentedToElevenLevels) {
-    RawPeer peer;
-    PObject value = "deep";
+    PObject value = 7;
     for (int i = 0; i < 12; ++i) {
         value = Array({value});
     }
-    const PObject message = Map({{"k", value}});
-    const auto trace = [](const test::LogCapture& log) {
-        std::string lines;
-        for (const std::string& line : log.Lines()) {
-            if (line.find("ZEL/stream") != std::string::npos) {
-                lines += line.substr(line.find(": ") + 2) + "\n";
-            }
-        }
-        return lines;
-    };
-    std::string expected = "{\n  \"k\"\n";
-    std::string closing = "}\n";
-    for (int i = 1; i <= 12; ++i) {
-        const std::string indent(static_cast<size_t>(2 * std::min(i, 11)), ' ');
-        expected += indent + "[\n";
-        closing = indent + "]\n" + closing;
-    }
-    expected += std::string(22, ' ') + "\"deep\"\n" + closing;
-    {
-        const test::LogCapture log;
-        ASSERT_EQ(PStream().Send(peer.channel, message), 0);
-        EXPECT_EQ(trace(log), expected);
-    }
-    PObject received;
-    const std::string bytes = peer.Take();
+    RawPeer peer;
     const test::LogCapture log;
-    ASSERT_EQ(Receive(bytes, received), 0);
-    EXPECT_EQ(trace(log), expected);
+    ASSERT_EQ(PStream().Send(peer.channel, Map({{"k", value}})), 0);
+    PObject received;
+    ASSERT_EQ(Receive(peer.Take(), received), 0);
+    std::map<std::string, int> lines;
+    for (const std::string& line : log.Lines()) {
+        ++lines[line];
+    }
+    const std::string tag = "[DEBUG] ZEL/stream(N): ";
+    for (const char* line : {"{", "  \"k\"", "  [", "    [", "  ]", "}"}) {
+        EXPECT_EQ(lines[tag + line], 2) << line << ": once sent, once received";
+    }
+    const std::string deepest = tag + std::string(22, ' ');
+    EXPECT_EQ(lines[deepest + "["], 4) << "two levels share the deepest indentation";
+    EXPECT_EQ(lines[deepest + "7"], 2);
 }
 
 TEST(PStream, AFailedSendTellsItsKeyPathAndForgetsIt) {
