@@ -30,7 +30,7 @@ class PObjectCursor;
 class PStream {
 public:
     /// The deepest nesting of maps and arrays that is received: the outermost one is level 1.
-    /// Receiving calls itself once a level, and this keeps the stack it needs below 256 KiB.
+    /// Receiving calls itself once a level: this bounds the stack that a peer can make it use.
     static constexpr uint32_t kMaxDepth = 512;
 
     /// The first byte of each element on the wire.

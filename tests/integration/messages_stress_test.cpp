@@ -93,10 +93,9 @@ TEST(Stress, EveryRequestOfEveryClientIsAnswered) {
         }
         servers.emplace_back(Serve, listener.accept(), std::ref(answered));
     }
-    for (std::vector<std::thread>* threads : {&clients, &servers}) {
-        for (std::thread& thread : *threads) {
-            thread.join();
-        }
+    std::move(servers.begin(), servers.end(), std::back_inserter(clients));
+    for (std::thread& thread : clients) {
+        thread.join();
     }
     EXPECT_EQ(answered, expected);
     ZEL::Logger::Destroy();

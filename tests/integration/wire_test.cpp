@@ -6,7 +6,7 @@
 
 #include "ZEL/ipc.h"
 #include "ZEL/stream.h"
-#include "tests/integration/child.h"
+#include "tests/integration/command.h"
 #include "tests/support/sockets.h"
 #include "tests/support/temp_root.h"
 
@@ -14,13 +14,13 @@ using ZEL::PObject;
 
 namespace {
 
-constexpr char kPeer[] = TESTS_FOLDER "/integration/wire_peer.py";
+const std::string kPeer = "python3 " TESTS_FOLDER "/integration/wire_peer.py ";
 constexpr char kDocument[] = TESTS_FOLDER "/../docs/wire-format.md";
 
 }  // namespace
 
 TEST(Wire, TheDocumentsExampleIsWhatTheLibrarySends) {
-    std::istringstream output(test::Run({"python3", kPeer, "document", kDocument}));
+    std::istringstream output(test::Run(kPeer + "document " + kDocument));
     std::string hex, text;
     std::getline(output, hex);
     std::getline(output, text);
@@ -37,7 +37,7 @@ TEST(Wire, AnotherLanguageReadsAndWritesTheSameValues) {
     const test::TempFolder folder;
     ZEL::IPCListener listener;
     ASSERT_EQ(listener.prepare(folder.Path("socket")), 0);
-    test::Child python({"python3", kPeer, "echo", folder.Path("socket")});
+    test::Command python(kPeer + "echo " + folder.Path("socket"));
     ZEL::IPCSender sender;
     ASSERT_EQ(sender.assign(listener.accept()), 0);
 
@@ -64,6 +64,7 @@ TEST(Wire, AnotherLanguageReadsAndWritesTheSameValues) {
         EXPECT_EQ(reply.toString(), value.toString());
     }
     sender.close();
-    std::string rest;
-    EXPECT_EQ(python.Finish(rest), 0) << rest;
+    int status = 1;
+    EXPECT_EQ(python.Finish(status), "");
+    EXPECT_EQ(status, 0);
 }

@@ -41,10 +41,14 @@ public:
         }
         return bytes;
     }
-    /// True when the channel's side has been closed.
-    bool SeesEnd() const {
-        char byte;
-        return recv(fd, &byte, 1, MSG_DONTWAIT) == 0;
+    /// All that arrives until the channel's side is closed.
+    std::string TakeAll() const {
+        std::string bytes;
+        char buffer[4096];
+        for (ssize_t n; (n = read(fd, buffer, sizeof buffer)) > 0;) {
+            bytes.append(buffer, static_cast<size_t>(n));
+        }
+        return bytes;
     }
     void Close() {
         if (fd >= 0) {
