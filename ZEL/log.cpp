@@ -93,47 +93,48 @@ int Logger::Initialize(Type type, int level, const std::string& path, int rotate
 }
 
 void Logger::LogMsg(Level level, const char* format, ...) {
-    // The level is looked at without the lock first: most calls are filtered, and those cost a compare.
-    // The level moves only while nobody logs, so the look under the lock below cannot differ.
+    // Most calls are filtered: a look ahead of the lock makes those cost a compare. The look under
+    // the lock decides.
     if (level > log_level.load(std::memory_order_relaxed)) {
         return;
     }
     const ErrnoKeeper keep;
+    const MutexGuard lock(&log_mutex);
+    if (level > log_level.load(std::memory_order_relaxed)) {
+        return;
+    }
     va_list arguments;
     va_start(arguments, format);
-    {
-        const MutexGuard lock(&log_mutex);
-        // No stream: a failed rotation has silenced the log.
-        if (level <= log_level.load(std::memory_order_relaxed) &&
-            (log_type == SYSLOG || log_fp != nullptr)) {
-            switch (log_type) {
-                case SYSLOG:
-                    vsyslog(LOG_ERR, format, arguments);
-                    break;
-                case STDOUT:
-                case STDERR:
-                case LOGFILE: {
-                    const int prefix = WriteTimePrefix(log_fp);
-                    const int message = vfprintf(log_fp, format, arguments);
-                    fflush(log_fp);
-                    if (log_type == LOGFILE && log_size >= 0 && prefix >= 0 && message >= 0) {
-                        // 64 bits: one message may be up to INT_MAX bytes long.
-                        const int64_t size = int64_t{log_size} + prefix + message;
-                        if (size > kRotateAbove) {
-                            Rotate();
-                            log_size = 0;
-                        } else {
-                            log_size = static_cast<int32_t>(size);
-                        }
-                    }
-                    break;
-                }
-                default:
-                    vfprintf(stderr, format, arguments);
-            }
-        }
-    }
+    Write(format, arguments);
     va_end(arguments);
+}
+
+void Logger::Write(const char* format, va_list arguments) {
+    if (log_type == SYSLOG) {
+        vsyslog(LOG_ERR, format, arguments);
+        return;
+    }
+    if (log_fp == nullptr) {
+        return;  // never set up well, or silenced by a failed rotation
+    }
+    if (log_type != STDOUT && log_type != STDERR && log_type != LOGFILE) {
+        vfprintf(stderr, format, arguments);
+        return;
+    }
+    const int prefix = WriteTimePrefix(log_fp);
+    const int message = vfprintf(log_fp, format, arguments);
+    fflush(log_fp);
+    if (log_type != LOGFILE || log_size < 0 || prefix < 0 || message < 0) {
+        return;
+    }
+    // 64 bits: one message may be up to INT_MAX bytes long.
+    const int64_t size = int64_t{log_size} + prefix + message;
+    if (size <= kRotateAbove) {
+        log_size = static_cast<int32_t>(size);
+        return;
+    }
+    Rotate();
+    log_size = 0;
 }
 
 void Logger::Destroy() {
@@ -143,7 +144,8 @@ void Logger::Destroy() {
     if (log_fp != nullptr) {
         fclose(log_fp);
     }
-    // The type says standard error while the stream is standard output: lines go to standard output.
+    // The type says standard error while the stream is standard output: lines go to standard
+    // output.
     log_type = STDERR;
     log_level = kDefaultLevel;
     log_fp = stdout;
@@ -158,14 +160,15 @@ int Logger::Rotate() {
         const std::string from = RotatedName(log_path, static_cast<int>(i));
         const std::string to = RotatedName(log_path, static_cast<int>(i + 1));
         if (rename(from.c_str(), to.c_str()) != 0) {
-            syslog(LOG_ERR, "%s:%d failed to rename old_name '%s' to new_name '%s'.", kSource, kRenameLine,
-                   from.c_str(), to.c_str());
+            syslog(LOG_ERR, "%s:%d failed to rename old_name '%s' to new_name '%s'.", kSource,
+                   kRenameLine, from.c_str(), to.c_str());
         }
     }
     // The removal comes after the shift, so one file fewer survives than the count says.
     const std::string oldest = RotatedName(log_path, static_cast<int>(int64_t{rotate_cnt} - 1));
     if (remove(oldest.c_str()) != 0) {
-        syslog(LOG_ERR, "%s:%d failed to remove old_name '%s'.", kSource, kRemoveLine, oldest.c_str());
+        syslog(LOG_ERR, "%s:%d failed to remove old_name '%s'.", kSource, kRemoveLine,
+               oldest.c_str());
     }
     if (log_fp != nullptr) {
         fclose(log_fp);

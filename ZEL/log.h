@@ -1,10 +1,11 @@
 // The process-wide log.
 //
-// A program calls Logger::Initialize once to choose where lines go; every module then calls Logger::LogMsg.
-// Until then lines at error level go to the system log.
+// A program calls Logger::Initialize once to choose where lines go; every module then calls
+// Logger::LogMsg. Until then lines at error level go to the system log.
 #pragma once
 
 #include <pthread.h>
+#include <stdarg.h>
 #include <stdio.h>
 
 #include <atomic>
@@ -17,8 +18,8 @@ namespace ZEL {
 
 /// Static operations only; there is one log in a process.
 ///
-/// Threads: LogMsg may be called from any thread at any time. Initialize and Destroy must not run while another
-/// thread logs.
+/// Threads: LogMsg may be called from any thread at any time. Initialize and Destroy must not run
+/// while another thread logs.
 class Logger {
 public:
     /// Where lines go.
@@ -29,7 +30,8 @@ public:
         LOGFILE = 3  ///< a file given by path, rotated when it passes 1 MiB
     };
 
-    /// How grave a line is, in the system log's numbering. The matching tag is part of each message's own text.
+    /// How grave a line is, in the system log's numbering. The matching tag is part of each
+    /// message's own text.
     enum Level : int32_t {
         LEVEL_ERROR = 3,    ///< "[ERROR]"
         LEVEL_WARNING = 4,  ///< "[WARNING]"
@@ -42,29 +44,33 @@ public:
 
     /// Chooses the destination and the highest level that is still written.
     ///
-    /// `path` and `rotate_cnt` count only for a file: lines are appended to `path`, and after a rotation
-    /// `path`_0 (the newest) to `path`_(rotate_cnt - 2) hold the older lines. What the file already holds does
-    /// not count towards its size. Any type but 0, 1 and 2 means a file.
+    /// `path` and `rotate_cnt` count only for a file: lines are appended to `path`, and after a
+    /// rotation `path`_0 (the newest) to `path`_(rotate_cnt - 2) hold the older lines. What the
+    /// file already holds does not count towards its size. Any type but 0, 1 and 2 means a file.
     ///
-    /// Returns 0, or -1 when the path is empty or the file cannot be opened; type and level are set all the same.
-    /// May be called again to switch; a file of an earlier call stays open until Destroy or the next rotation
-    /// of its own.
+    /// Returns 0, or -1 when the path is empty or the file cannot be opened; type and level are set
+    /// all the same, and the stream of an earlier call stays in use. May be called again to switch;
+    /// a file that an earlier call opened is not closed then.
     static int Initialize(Type type, int level, const std::string& path, int rotate_cnt);
 
-    /// Writes one message, formatted as printf does it, when `level` is not above the chosen one. Adds the local
-    /// time in front (not in the system log) and no newline. The system log gets every message at priority error.
-    /// Never fails; errno is kept.
+    /// Writes one message, formatted as printf does it, when `level` is not above the chosen one.
+    /// Adds the local time in front (not in the system log) and no newline. The system log gets
+    /// every message at priority error. Never fails; errno is kept.
     static void LogMsg(Level level, const char* format, ...) __attribute__((format(printf, 2, 3)));
 
-    /// Closes the file of a file set-up; lines at error level then go to standard output. Does nothing for the
-    /// other destinations.
+    /// Closes the file of a file set-up; lines at error level then go to standard output. Does
+    /// nothing for the other destinations.
     static void Destroy();
 
-    /// Shifts the rotated files by one and starts a new file. Returns 0, or -1 when the new file cannot be made:
-    /// the log is silent from then on. LogMsg calls it with its lock held; it takes none itself.
+    /// Shifts the rotated files by one and starts a new file. Returns 0, or -1 when the new file
+    /// cannot be made: the log is silent from then on. LogMsg calls it with its lock held; it takes
+    /// none itself.
     static int Rotate();
 
 private:
+    // Writes one message that has passed the level; log_mutex is held.
+    static void Write(const char* format, va_list arguments) __attribute__((format(printf, 1, 0)));
+
     static Type log_type;               // current destination
     static std::atomic<int> log_level;  // highest level that is written
     static FILE* log_fp;                // open stream of types 1 to 3

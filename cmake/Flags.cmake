@@ -18,3 +18,6 @@ if(ZEL_SANITIZE)
 else()
     target_link_options(zel_flags INTERFACE -Wl,--no-undefined)
 endif()
+
+# No path of the machine that builds stands in what it built.
+target_compile_options(zel_flags INTERFACE -ffile-prefix-map=${PROJECT_SOURCE_DIR}=.)

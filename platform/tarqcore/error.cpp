@@ -36,21 +36,27 @@ const char* KAPICErrText(int code) {
         case TARQ_ERR_WRITE_FILE:
             return "cannot write the file";
         case TARQ_ERR_BAD_PARAMETER:
-            return "bad parameter";
+            return "an argument is missing or not allowed";
         case TARQ_ERR_SEMAPHORE:
             return "semaphore failure";
         case TARQ_ERR_NO_SHARE:
             return "no such share";
         case TARQ_ERR_SHARE_VOLUME:
-            return "the share's volume is not mounted";
+            return "the share's volume is not mounted where it was when the share was added";
         case TARQ_ERR_SHARE_EXISTS:
-            return "the share exists already";
+            return "there is a share of that name already";
+        case TARQ_ERR_SHARE_OVERLAP:
+            return "the folder holds, or lies in, another share's";
+        case TARQ_ERR_SHARE_FOLDER:
+            return "the share's folder is not there, or is no folder that can be read";
         case TARQ_ERR_NO_KEY:
             return "no such key";
         case TARQ_ERR_NO_SECTION:
             return "no such section";
         case TARQ_ERR_NO_VOLUME:
-            return "no such volume";
+            return "the path lies on no volume, or cannot be examined";
+        case TARQ_ERR_LOOKUP:
+            return "the name service failed";
         case TARQ_ERR_SERVICE:
             return "the service manager refused or cannot be reached";
         case TARQ_ERR_SERVICE_BUSY:

@@ -16,7 +16,8 @@ public:
     LogCapture(const LogCapture&) = delete;
     LogCapture& operator=(const LogCapture&) = delete;
 
-    /// All that was logged, with each line's time taken off and each source line number written as (N):
+    /// All that was logged, with each line's time taken off and each source line number written as
+    /// (N):
     /// "[ERROR] ZEL/zel(N): Fail to get share 'x'\n".
     std::string Text() const;
     /// The same, a line each, without the newline.

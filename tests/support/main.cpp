@@ -4,7 +4,8 @@
 #include <cstdlib>
 
 int main(int argc, char** argv) {
-    // A test that wants a root folder makes its own; one from outside would lead it to somebody's files.
+    // A test that wants a root folder makes its own; one from outside would lead it to somebody's
+    // files.
     unsetenv("TARQ_ROOT");
     setenv("LC_ALL", "C", 1);
     testing::InitGoogleMock(&argc, argv);

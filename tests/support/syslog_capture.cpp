@@ -22,7 +22,8 @@ void Record(int priority, const char* format, va_list arguments) {
 // The C library's entry points, the checked ones of fortified builds included.
 extern "C" {
 
-__attribute__((visibility("default"))) void vsyslog(int priority, const char* format, va_list arguments) {
+__attribute__((visibility("default"))) void vsyslog(int priority, const char* format,
+                                                    va_list arguments) {
     Record(priority, format, arguments);
 }
 
@@ -38,7 +39,8 @@ __attribute__((visibility("default"))) void __vsyslog_chk(int priority, int, con
     Record(priority, format, arguments);
 }
 
-__attribute__((visibility("default"))) void __syslog_chk(int priority, int, const char* format, ...) {
+__attribute__((visibility("default"))) void __syslog_chk(int priority, int, const char* format,
+                                                         ...) {
     va_list arguments;
     va_start(arguments, format);
     Record(priority, format, arguments);

@@ -10,8 +10,8 @@ struct SyslogLine {
     std::string text;
 };
 
-/// What the process has sent to the system log since the last call. Only in programs linked with test_syslog,
-/// whose system log goes nowhere else.
+/// What the process has sent to the system log since the last call. Only in programs linked with
+/// test_syslog, whose system log goes nowhere else.
 std::vector<SyslogLine> TakeSyslog();
 
 /// The same, texts only.

@@ -1,9 +1,10 @@
-/* Section files, string hashes and lists, formatted strings, the error state, semaphores and processes.
+/* Section files, string hashes and lists, formatted strings, the error state, semaphores and
+ * processes.
  *
- * C linkage throughout. Strings are NUL-terminated bytes, never NULL unless an operation says so; paths are used as
- * they stand (see root_path.h for where the system's own files lie). An operation that fails sets the calling
- * thread's error code, which KAPICErrGet() gives. All operations may be called from any thread; one hash, list or
- * stream belongs to one thread at a time.
+ * C linkage throughout. Strings are NUL-terminated bytes, never NULL unless an operation says so;
+ * paths are used as they stand (see root_path.h for where the system's own files lie). An operation
+ * that fails sets the calling thread's error code, which KAPICErrGet() gives. All operations may be
+ * called from any thread; one hash, list or stream belongs to one thread at a time.
  */
 #pragma once
 
@@ -19,112 +20,135 @@ extern "C" {
 /* The error codes. What failed is in the code; where, in the position that is kept beside it. */
 enum TARQErrorCode {
     TARQ_ERR_NONE = 0,
-    TARQ_ERR_NO_MEMORY = 0x0200,     /* an allocation failed */
-    TARQ_ERR_OPEN_FILE = 0x0900,     /* a file cannot be opened; errno says why */
-    TARQ_ERR_READ_FILE = 0x0A00,     /* a file cannot be read; errno says why */
-    TARQ_ERR_WRITE_FILE = 0x0B00,    /* a file cannot be written, flushed or renamed; errno says why */
+    TARQ_ERR_NO_MEMORY = 0x0200,  /* an allocation failed */
+    TARQ_ERR_OPEN_FILE = 0x0900,  /* a file cannot be opened; errno says why */
+    TARQ_ERR_READ_FILE = 0x0A00,  /* a file cannot be read; errno says why */
+    TARQ_ERR_WRITE_FILE = 0x0B00, /* a file cannot be written, flushed or renamed; errno says why */
     TARQ_ERR_BAD_PARAMETER = 0x0D00, /* an argument is missing or could break a file's format */
     TARQ_ERR_SEMAPHORE = 0x0E00,     /* a semaphore call failed; errno says why */
     TARQ_ERR_NO_SHARE = 0x1400,      /* the catalogue has no share of that name */
-    TARQ_ERR_SHARE_VOLUME = 0x1A00,  /* the share's volume is not mounted where it was when the share was added */
+    TARQ_ERR_SHARE_VOLUME =
+        0x1A00, /* the share's volume is not mounted where it was when the share was added */
     TARQ_ERR_SHARE_EXISTS = 0x1B00,  /* the catalogue has a share of that name already */
-    TARQ_ERR_NO_KEY = 0x2000,        /* the section has no such key */
-    TARQ_ERR_NO_SECTION = 0x2200,    /* the file has no such section */
-    TARQ_ERR_NO_VOLUME = 0x2300,     /* the path lies on no volume, or cannot be examined */
-    TARQ_ERR_SERVICE = 0xEA00,       /* the service manager refused or cannot be reached */
-    TARQ_ERR_SERVICE_BUSY = 0xEB00   /* the unit is being started already */
+    TARQ_ERR_SHARE_OVERLAP = 0x1C00, /* the folder holds, or lies in, another share's */
+    TARQ_ERR_SHARE_FOLDER =
+        0x1D00,                   /* the share's folder is not there or no folder; errno says why */
+    TARQ_ERR_NO_KEY = 0x2000,     /* the section has no such key */
+    TARQ_ERR_NO_SECTION = 0x2200, /* the file has no such section */
+    TARQ_ERR_NO_VOLUME = 0x2300,  /* the path lies on no volume, or cannot be examined */
+    TARQ_ERR_LOOKUP = 0x3100,     /* the name service failed */
+    TARQ_ERR_SERVICE = 0xEA00,    /* the service manager refused or cannot be reached */
+    TARQ_ERR_SERVICE_BUSY = 0xEB00 /* the unit is being started already */
 };
 
-/* The calling thread's last error code; 0 when no operation has failed on it. A success leaves it as it was. */
+/* The calling thread's last error code; 0 when no operation has failed on it. A success leaves it
+ * as it was. */
 int KAPICErrGet(void);
-/* Sets the calling thread's error code, with the source position that it arose at. `file` must outlive the thread
- * (a literal). */
-void KAPICErrSetEx(int code, const char *file, int line);
-/* What `code` means, for a person: a literal in English, "unknown error" for a code that is not in the list. */
-const char *KAPICErrText(int code);
+/* Sets the calling thread's error code, with the source position that it arose at. `file` must
+ * outlive the thread (a literal). */
+void KAPICErrSetEx(int code, const char* file, int line);
+/* What `code` means, for a person: a literal in English, "unknown error" for a code that is not in
+ * the list. */
+const char* KAPICErrText(int code);
 
-/* ---- String hashes: string keys to string values; keys are unique and compared byte by byte ---- */
+/* ---- String hashes: string keys to string values; keys are unique and compared byte by byte ----
+ */
 
-typedef struct KAPICSzHashRec *KAPICSzHash;
+typedef struct KAPICSzHashRec* KAPICSzHash;
 
-/* An empty hash; NULL when there is no memory. `capacity` is a hint, never a limit. Free with KAPICSzHashFree. */
+/* An empty hash; NULL when there is no memory. `capacity` is a hint, never a limit. Free with
+ * KAPICSzHashFree. */
 KAPICSzHash KAPICSzHashAlloc(int capacity);
 /* Frees the hash and its strings. NULL is allowed. */
 void KAPICSzHashFree(KAPICSzHash hash);
-/* The value of `key`, or NULL when it is absent or an argument is NULL. The hash's own: valid until the key is set
- * again or the hash is emptied or freed. */
-const char *KAPICSzHashGetValue(KAPICSzHash hash, const char *key);
+/* The value of `key`, or NULL when it is absent or an argument is NULL. The hash's own: valid until
+ * the key is set again or the hash is emptied or freed. */
+const char* KAPICSzHashGetValue(KAPICSzHash hash, const char* key);
 /* Sets `key` to a copy of `value`. 0, or -1 when an argument is NULL or there is no memory. */
-int KAPICSzHashSetValue(KAPICSzHash hash, const char *key, const char *value);
+int KAPICSzHashSetValue(KAPICSzHash hash, const char* key, const char* value);
 /* Empties the hash. */
 void KAPICHashRemoveAll(KAPICSzHash hash);
-/* Walks the hash in byte-wise order of the keys: start with *position 0; gives 1 and the next key and value (the
- * hash's own), or 0 at the end. The hash must not change during the walk. */
-int KAPICSzHashNext(KAPICSzHash hash, int *position, const char **key, const char **value);
+/* Walks the hash in byte-wise order of the keys: start with *position 0; gives 1 and the next key
+ * and value (the hash's own), or 0 at the end. The hash must not change during the walk. */
+int KAPICSzHashNext(KAPICSzHash hash, int* position, const char** key, const char** value);
 
 /* ---- String lists: ordered strings ---- */
 
-typedef struct KAPICSzListRec *KAPICSzList;
+typedef struct KAPICSzListRec* KAPICSzList;
 
-/* An empty list; NULL when there is no memory. `capacity` is a hint, never a limit. Free with KAPICSzListFree. */
+/* An empty list; NULL when there is no memory. `capacity` is a hint, never a limit. Free with
+ * KAPICSzListFree. */
 KAPICSzList KAPICSzListAlloc(int capacity);
 /* Frees the list and its strings. NULL is allowed. */
 void KAPICSzListFree(KAPICSzList list);
 /* Appends a copy of `item`. 0, or -1 when an argument is NULL or there is no memory. */
-int KAPICSzListPush(KAPICSzList list, const char *item);
+int KAPICSzListPush(KAPICSzList list, const char* item);
 /* Empties the list. */
 void KAPICSzListRemoveAll(KAPICSzList list);
 /* The number of entries; 0 for NULL. */
 int KAPICSzListCount(KAPICSzList list);
-/* Entry `index`, counted from 0; NULL past either end. The list's own: valid until the list is emptied or freed. */
-const char *KAPICSzListGet(KAPICSzList list, int index);
+/* Entry `index`, counted from 0; NULL past either end. The list's own: valid until the list is
+ * emptied or freed. */
+const char* KAPICSzListGet(KAPICSzList list, int index);
 
 /* ---- Formatted strings ---- */
 
-/* `format` with its "%s" replaced by `argument`, newly allocated; NULL when an argument is NULL, the format holds any
- * conversion but "%s" and "%%", or there is no memory. Free with KAPICStrPut. */
-char *KAPICStrGet(const char *format, const char *argument);
+/* `format` with its "%s" replaced by `argument`, newly allocated; NULL when an argument is NULL,
+ * the format holds any conversion but "%s" and "%%", or there is no memory. Free with KAPICStrPut.
+ */
+char* KAPICStrGet(const char* format, const char* argument);
 /* Frees a string of KAPICStrGet. NULL is allowed. */
-void KAPICStrPut(char *text);
+void KAPICStrPut(char* text);
 
 /* ---- Section files ----
  *
- * [name] lines, each followed by the section's key="value" lines; blank lines and lines that begin with "#" are
- * comments. A write goes to a temporary file in the same folder, is flushed to disk and renamed over the old file,
- * whose mode and owner it takes: after a crash or a full disk at any instant the old file or the new one is there.
- * Writers do not lock: callers serialise them (see the semaphores below).
+ * [name] lines, each followed by the section's key="value" lines; blank lines and lines that begin
+ * with "#" are comments. A write goes to a temporary file in the same folder, is flushed to disk
+ * and renamed over the old file, whose mode and owner it takes: after a crash or a full disk at any
+ * instant the old file or the new one is there. Writers do not lock: callers serialise them (see
+ * the semaphores below).
  *
- * Refused with TARQ_ERR_BAD_PARAMETER, nothing written: a line break in a name, key or value, "]" in a section name,
+ * Refused with TARQ_ERR_BAD_PARAMETER, nothing written: a line break in a name, key or value, "]"
+ * in a section name,
  * "=" or a quote in a key, an empty key.
  */
 
 /* 1 when something exists at `path`, else 0. */
-int KAPICFileExist(const char *path);
-/* Adds the section's keys and values to `into`. Positive: read; 0: there is no such section; negative: failure. */
-int KAPICFileGetSection(const char *path, const char *section, KAPICSzHash into);
-/* Copies one value, cut to size - 1 bytes, and its terminator into `buffer`. 0, or negative: TARQ_ERR_NO_SECTION and
- * TARQ_ERR_NO_KEY tell absence (the buffer is left alone) from failure. A file that does not exist has no section. */
-int KAPICFileGetSectionValue(const char *path, const char *section, const char *key, char *buffer, int size);
-/* Replaces the whole section, or appends it, by `values`, each written with `line_format` (two "%s": key and value;
- * NULL: the default "%s=\"%s\"\n"). `reserved` is 0. Positive, or negative on failure. */
-int KAPICFileSetSection(const char *path, const char *section, int reserved, KAPICSzHash values,
-                        const char *line_format);
+int KAPICFileExist(const char* path);
+/* Adds the section's keys and values to `into`. Positive: read; 0: there is no such section;
+ * negative: failure. */
+int KAPICFileGetSection(const char* path, const char* section, KAPICSzHash into);
+/* Copies one value, cut to size - 1 bytes, and its terminator into `buffer`. 0, or negative:
+ * TARQ_ERR_NO_SECTION and TARQ_ERR_NO_KEY tell absence (the buffer is left alone) from failure. A
+ * file that does not exist has no section. */
+int KAPICFileGetSectionValue(const char* path, const char* section, const char* key, char* buffer,
+                             int size);
+/* Replaces the whole section, or appends it, by `values`, each written with `line_format` (two
+ * "%s": key and value; NULL: the default "%s=\"%s\"\n"). `reserved` is 0. Positive, or negative on
+ * failure. */
+int KAPICFileSetSection(const char* path, const char* section, int reserved, KAPICSzHash values,
+                        const char* line_format);
 /* Appends a section, without looking for one of that name. 1 or more, else it failed. */
-int KAPICFileAddSection(const char *path, const char *section, KAPICSzHash values, const char *line_format);
-/* Sets the given keys of an existing section in place and keeps its other keys. The three numbers are 0, 1 and 0.
- * Positive: done; 0: there is no such section, nothing written; negative: failure. */
-int KAPICIFileModifySection(const char *path, const char *section, int reserved, KAPICSzHash values, int replace,
-                            int reserved2);
+int KAPICFileAddSection(const char* path, const char* section, KAPICSzHash values,
+                        const char* line_format);
+/* Sets the given keys of an existing section in place and keeps its other keys. The three numbers
+ * are 0, 1 and 0. Positive: done; 0: there is no such section, nothing written; negative: failure.
+ */
+int KAPICIFileModifySection(const char* path, const char* section, int reserved, KAPICSzHash values,
+                            int replace, int reserved2);
 /* Takes the section out of the file. 1: done; 0: there is no such section; negative: failure. */
-int KAPICFileRemoveSection(const char *path, const char *section);
-/* Appends the names of all sections, in file order, to `into`. 0 or more, or negative on failure. */
-int KAPICFileEnumSection(const char *path, KAPICSzList into);
+int KAPICFileRemoveSection(const char* path, const char* section);
+/* Appends the names of all sections, in file order, to `into`. 0 or more, or negative on failure.
+ */
+int KAPICFileEnumSection(const char* path, KAPICSzList into);
 
 /* ---- Semaphores: mutual exclusion between processes ---- */
 
-/* Opens, or makes, the machine's semaphore of that key. An id for the calls below, or negative on failure. */
+/* Opens, or makes, the machine's semaphore of that key. An id for the calls below, or negative on
+ * failure. */
 int KAPICSemOpen(int key);
-/* Waits for the semaphore and takes it. The kernel gives it back when the holder dies. 0, or negative on failure. */
+/* Waits for the semaphore and takes it. The kernel gives it back when the holder dies. 0, or
+ * negative on failure. */
 int KAPICSemLock(int id);
 /* Gives it back. 0, or negative on failure. */
 int KAPICSemUnlock(int id);
@@ -133,16 +157,16 @@ int KAPICSemClose(int id);
 
 /* ---- Processes ---- */
 
-/* Runs `program` with the given arguments (strings, then NULL; without the program's own name), with a pipe from its
- * standard output (mode "r") or to its standard input ("w"), without a shell. The stream, or NULL when the program
- * cannot be started. Close with KAPICPclose. */
-FILE *KAPICPopen(const char *program, const char *mode, ... /* arguments, NULL */);
+/* Runs `program` with the given arguments (strings, then NULL; without the program's own name),
+ * with a pipe from its standard output (mode "r") or to its standard input ("w"), without a shell.
+ * The stream, or NULL when the program cannot be started. Close with KAPICPclose. */
+FILE* KAPICPopen(const char* program, const char* mode, ... /* arguments, NULL */);
 /* Closes the stream and waits for the program. Its wait status as waitpid() gives it, or -1. */
-int KAPICPclose(FILE *stream);
+int KAPICPclose(FILE* stream);
 /* 1 when the pid file names a process that is alive, else 0. */
-int KAPICProcAliveByPidFile(const char *path);
-/* 1 on the small single-bay device family, else 0: always 0 on stock Linux, unless /usr/tarq/etc/tarqcore.conf,
- * section "device", says mini_unit="yes". */
+int KAPICProcAliveByPidFile(const char* path);
+/* 1 on the small single-bay device family, else 0: always 0 on stock Linux, unless
+ * /usr/tarq/etc/tarqcore.conf, section "device", says mini_unit="yes". */
 int KAPICIsMiniUnit(void);
 
 #pragma GCC visibility pop

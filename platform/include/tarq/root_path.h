@@ -1,8 +1,9 @@
 // Where the system's fixed paths lie.
 //
-// Every fixed path (/usr/tarq/etc/..., /var/run/rsyncd.pid, /tmp/ZEL/...) passes through RootPath(), so that an
-// unprivileged person can run a whole client and a whole server side by side in two folders: the folder named
-// by the environment variable TARQ_ROOT stands in front of each path. A set-user-ID program ignores it.
+// Every fixed path (/usr/tarq/etc/..., /var/run/rsyncd.pid, /tmp/ZEL/...) passes through
+// RootPath(), so that an unprivileged person can run a whole client and a whole server side by side
+// in two folders: the folder named by the environment variable TARQ_ROOT stands in front of each
+// path. A set-user-ID program ignores it.
 //
 // Header only: it holds as well on a system that brings the platform libraries itself.
 #pragma once
@@ -14,7 +15,8 @@
 
 namespace TARQ {
 
-/// The folder that stands for "/", without a trailing slash; empty when the paths hold as they stand.
+/// The folder that stands for "/", without a trailing slash; empty when the paths hold as they
+/// stand.
 inline std::string RootFolder() {
     const char* root = secure_getenv("TARQ_ROOT");
     std::string folder = root ? root : "";
@@ -29,8 +31,9 @@ inline std::string RootPath(const std::string& path) {
     return RootFolder() + path;
 }
 
-/// The semaphore key for `key`: itself without a root folder; otherwise a key of the folder's own, so that two
-/// roots on one machine never wait for each other. Never 0 (IPC_PRIVATE) and never negative.
+/// The semaphore key for `key`: itself without a root folder; otherwise a key of the folder's own,
+/// so that two roots on one machine never wait for each other. Never 0 (IPC_PRIVATE) and never
+/// negative.
 inline int RootSemaphoreKey(int key) {
     const std::string folder = RootFolder();
     if (folder.empty()) {

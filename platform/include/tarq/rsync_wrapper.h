@@ -1,8 +1,8 @@
 // One rsync run: a server command or a copy of files, on the stock rsync and ssh programs.
 //
-// An RsyncWrapper is configured with its setters, run once with execute(), and thrown away. What a caller wants
-// to know or to limit beyond that (progress, bandwidth, a list of what would change) it asks for with
-// RunOptions around the run, on the same thread.
+// An RsyncWrapper is configured with its setters, run once with execute(), and thrown away. What a
+// caller wants to know or to limit beyond that (progress, bandwidth, a list of what would change)
+// it asks for with RunOptions around the run, on the same thread.
 #pragma once
 
 #include <cstdint>
@@ -16,28 +16,37 @@ namespace Backup {
 
 #pragma GCC visibility push(default)
 
-/// How far a copy has come. rsync finds files while it copies, so the totals grow until `totals_final`.
+/// How far a copy has come. rsync finds files while it copies, so the totals grow until
+/// `totals_final`.
 struct RunProgress {
-    uint64_t bytes_done = 0;     ///< bytes of file content handled so far
-    unsigned int percent = 0;    ///< 0..100 of what is known so far
+    uint64_t bytes_done = 0;   ///< bytes of file content handled so far
+    unsigned int percent = 0;  ///< 0..100 of what is known so far
     uint64_t bytes_per_second = 0;
-    uint64_t files_left = 0;     ///< files not looked at yet
-    uint64_t files_total = 0;    ///< files found so far
-    bool totals_final = false;   ///< the search for files has ended
+    uint64_t files_left = 0;    ///< files not looked at yet
+    uint64_t files_total = 0;   ///< files found so far
+    bool totals_final = false;  ///< the search for files has ended
 };
 
 /// One difference that a run makes, or with a dry run would make, at the destination.
 struct RunChange {
     enum Kind { SEND, DELETE, OTHER /* attributes, directories, links */ };
     Kind kind = OTHER;
-    std::string path;      ///< relative to the source, bytes as they are on disk
-    uint64_t length = 0;   ///< size of the file in bytes, for SEND
+    std::string path;     ///< relative to the source, bytes as they are on disk
+    uint64_t length = 0;  ///< size of the file in bytes, for SEND
+};
+
+/// Why a run failed, where callers act on it; the explanation is for people.
+enum class RunCause {
+    NONE,           ///< it did not fail, or for a reason of no name here
+    UNKNOWN_MODULE  ///< the server's daemon has no module of that name
 };
 
 /// What a finished run came to.
 struct RunReport {
-    int status = -1;              ///< what execute() returned; -1 until then
-    std::string explanation;      ///< why it failed, one or more lines for a person; empty after success
+    int status = -1;  ///< what execute() returned; -1 until then
+    RunCause cause = RunCause::NONE;
+    std::string
+        explanation;  ///< why it failed, one or more lines for a person; empty after success
     uint64_t files_total = 0;     ///< files, folders and links looked at
     uint64_t files_sent = 0;      ///< regular files whose content travelled
     uint64_t files_deleted = 0;   ///< entries deleted at the destination
@@ -50,12 +59,15 @@ struct RunReport {
 struct RunOptions {
     unsigned int bandwidth_limit = 0;  ///< KiB a second; 0: no limit
     bool dry_run = false;              ///< copies only: change nothing at the destination
-    std::function<void(const RunProgress&)> on_progress;  ///< called on the running thread, a few times a second
-    std::function<void(const RunChange&)> on_change;      ///< called on the running thread, in rsync's order
-    RunReport* report = nullptr;       ///< filled when the run ends; the caller's
+    std::function<void(const RunProgress&)>
+        on_progress;  ///< called on the running thread, a few times a second
+    std::function<void(const RunChange&)>
+        on_change;                ///< called on the running thread, in rsync's order
+    RunReport* report = nullptr;  ///< filled when the run ends; the caller's
 };
 
-/// Makes `options` hold for every execute() on this thread until it is destroyed; then those of before hold again.
+/// Makes `options` hold for every execute() on this thread until it is destroyed; then those of
+/// before hold again.
 class ScopedRunOptions {
 public:
     explicit ScopedRunOptions(RunOptions options);
@@ -68,35 +80,41 @@ private:
     std::unique_ptr<Impl> impl_;
 };
 
-/// Statuses that execute() returns by itself; all others are rsync's exit codes or the server's answer.
+/// Statuses that execute() returns by itself; all others are rsync's exit codes or the server's
+/// answer.
 enum WrapperStatus : int {
     STATUS_DONE = 0,
-    STATUS_SYNTAX = 1,              ///< rsync's own: also an rsync that is too old, and says so
-    STATUS_FILE_SELECT = 3,         ///< rsync's own: a source or an answer file cannot be reached
-    STATUS_AUTHENTICATION = 5,      ///< rsync's own: wrong account or password, a module that is not there
-    STATUS_SOCKET = 10,             ///< rsync's own: the server cannot be reached
-    STATUS_PROTOCOL_STREAM = 12,    ///< rsync's own: the connection broke
-    STATUS_CANCELLED = 20,          ///< rsync's own: ended by a signal, which is how a cancelled run ends
-    STATUS_TIMEOUT = 30,            ///< rsync's own: nothing moved for the time-out
-    STATUS_UNKNOWN_COMMAND = 43,    ///< the server does not know the command, or no commands at all
-    STATUS_COMMAND_TOO_LONG = 50,   ///< the command has more bytes than rsync carries; nothing was sent
-    STATUS_RSYNC_MISSING = 127      ///< the rsync program cannot be started
+    STATUS_SYNTAX = 1,       ///< rsync's own: also an rsync that is too old, and says so
+    STATUS_FILE_SELECT = 3,  ///< rsync's own: a source or an answer file cannot be reached
+    STATUS_AUTHENTICATION =
+        5,               ///< rsync's own: wrong account or password, a module that is not there
+    STATUS_SOCKET = 10,  ///< rsync's own: the server cannot be reached
+    STATUS_PROTOCOL_STREAM = 12,  ///< rsync's own: the connection broke
+    STATUS_CANCELLED = 20,  ///< rsync's own: ended by a signal, which is how a cancelled run ends
+    STATUS_TIMEOUT = 30,    ///< rsync's own: nothing moved for the time-out
+    STATUS_UNKNOWN_COMMAND = 43,  ///< the server does not know the command, or no commands at all
+    STATUS_COMMAND_TOO_LONG =
+        50,                     ///< the command has more bytes than rsync carries; nothing was sent
+    STATUS_RSYNC_MISSING = 127  ///< the rsync program cannot be started
 };
 
 /// The rsync daemon's module that takes server commands.
 constexpr const char kCommandModule[] = "zel_command";
 
-/// The longest command, its session line included, that rsync carries to the server's handler, in bytes.
+/// The longest command, its session line included, that rsync carries to the server's handler, in
+/// bytes.
 constexpr size_t kMaxCommandBytes = 5 * 1024;
 
 /// One rsync run.
 ///
-/// Configuration: /usr/tarq/etc/tarqrsync.conf, section "rsync", may name `port` (the daemon's, default 873),
-/// `rsync` and `ssh` (the programs) and `ssh_options` (words, put in front of the host). Read at each execute().
+/// Configuration: /usr/tarq/etc/tarqrsync.conf, section "rsync", may name `port` (the daemon's,
+/// default 873), `rsync` and `ssh` (the programs) and `ssh_options` (words, put in front of the
+/// host). Read at each execute().
 ///
-/// Passwords reach rsync on its standard input and ssh through an askpass helper: never in an argument list, in
-/// an environment or in a log. Host keys are kept in /usr/tarq/etc/tarqrsync_known_hosts: an unknown key is
-/// accepted and remembered, a changed one ends the run.
+/// Passwords reach rsync on its standard input and ssh through an askpass helper: never in an
+/// argument list, in an environment or in a log. Host keys are kept in
+/// /usr/tarq/etc/tarqrsync_known_hosts: an unknown key is accepted and remembered, a changed one
+/// ends the run.
 ///
 /// Threads: an object belongs to one thread; any number of threads may run their own.
 class RsyncWrapper {
@@ -110,21 +128,25 @@ public:
     void setDelete(bool enable);
     /// Owners and groups travel as numbers, not as names. Default off.
     void setNumericIds(bool enable);
-    /// `account`: log in at the rsync daemon with user and password. `required`: refuse to run without a user,
-    /// rather than fall back to an anonymous connection. Default off, off.
+    /// `account`: log in at the rsync daemon with user and password. `required`: refuse to run
+    /// without a user, rather than fall back to an anonymous connection. Default off, off.
     void setTarqAuth(bool account, bool required);
-    /// Ownership and special files are kept in extended attributes at the receiving end, so that it need not be
-    /// root. A daemon decides that for its own modules; a directory reached over ssh is told. Default off.
+    /// Ownership and special files are kept in extended attributes at the receiving end, so that it
+    /// need not be root. A daemon decides that for its own modules; a directory reached over ssh is
+    /// told. Default off.
     void setTarqPseudoRoot(bool enable);
     /// Everything goes through ssh. Default off. See setPort.
     void setSsh(bool enable);
-    /// With ssh the port of the ssh server (0: 22), else the port of the rsync daemon (0: the configured one).
+    /// With ssh the port of the ssh server (0: 22), else the port of the rsync daemon (0: the
+    /// configured one).
     void setPort(int port);
     /// Compress on the way. Default off.
     void setCompress(bool enable);
-    /// Send only the changed blocks of a file that the destination holds already; off: whole files. Default off.
+    /// Send only the changed blocks of a file that the destination holds already; off: whole files.
+    /// Default off.
     void setDeltaCopy(bool enable);
-    /// List the destination's files instead of copying. A server command runs as it always does. Default off.
+    /// List the destination's files instead of copying. A server command runs as it always does.
+    /// Default off.
     void setListOnly(bool enable);
     /// Keep the source's path, from a "/./" in it on, at the destination. Default off.
     void setRelativePath(bool enable);
@@ -134,23 +156,24 @@ public:
     void setDebugLog(bool enable);
     /// Give up when nothing moves for so many seconds; 0: never. Default 0.
     void setTimeout(int seconds);
-    /// Lines key="value" of a server command: makes this run a command run. The answer's bytes go to the path
-    /// that the line `outfile` names, if there is one.
+    /// Lines key="value" of a server command: makes this run a command run. The answer's bytes go
+    /// to the path that the line `outfile` names, if there is one.
     void setTarqCustCmdRule(const std::list<std::string>& lines);
     /// rsync exclude patterns, in order.
     void setExcludeRule(const std::list<std::string>& rules);
     /// File or folder to copy; a trailing slash means the folder's content.
     void setSrcPath(const std::string& path);
-    /// Where to: `module` is a module of the server's daemon, or, when it begins with "/", a directory reached over
-    /// ssh. `sub_path` is below it. A command run needs no module.
+    /// Where to: `module` is a module of the server's daemon, or, when it begins with "/", a
+    /// directory reached over ssh. `sub_path` is below it. A command run needs no module.
     void setDestPath(const std::string& user, const std::string& host, const std::string& password,
                      const std::string& module, const std::string& sub_path);
 
-    /// Runs, and returns 0, rsync's exit code, a WrapperStatus or, after a command run, the server's status.
+    /// Runs, and returns 0, rsync's exit code, a WrapperStatus or, after a command run, the
+    /// server's status.
     ///
-    /// `cancelled` (may be empty) is asked several times a second on this thread; once it says true the whole
-    /// process group is ended within a second and the result is STATUS_CANCELLED.
-    /// Deletes nothing at the destination when the source cannot be read in full.
+    /// `cancelled` (may be empty) is asked several times a second on this thread; once it says true
+    /// the whole process group is ended within a second and the result is STATUS_CANCELLED. Deletes
+    /// nothing at the destination when the source cannot be read in full.
     int execute(const std::function<bool()>& cancelled);
 
     /// Writes why the last execute() failed to the system log. Nothing after a success.

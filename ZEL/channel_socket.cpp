@@ -1,0 +1,137 @@
+#include <errno.h>
+#include <limits.h>
+#include <poll.h>
+#include <string.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <algorithm>
+
+#include "ZEL/internal/channel_socket.h"
+#include "ZEL/log.h"
+
+namespace ZEL {
+
+namespace {
+
+// What select(2) puts into its sets of the events that poll(2) reports.
+constexpr short kReadEvents = POLLIN | POLLHUP | POLLERR;
+constexpr short kWriteEvents = POLLOUT | POLLERR;
+
+}  // namespace
+
+int PollMilliseconds(const timeval& interval) {
+    const int64_t milliseconds =
+        int64_t{interval.tv_sec} * 1000 + (int64_t{interval.tv_usec} + 999) / 1000;
+    return static_cast<int>(std::clamp<int64_t>(milliseconds, 0, INT_MAX));
+}
+
+bool Aborted(const int* flag) {
+    // Another thread sets the int while this one waits.
+    return flag != nullptr && __atomic_load_n(flag, __ATOMIC_RELAXED) != 0;
+}
+
+int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Readiness& readiness) {
+    const bool reading = watch == Watch::kRead;
+    pollfd watched = {fd, static_cast<short>((reading ? POLLIN : POLLOUT) | POLLPRI), 0};
+    for (;;) {
+        if (Aborted(flag)) {
+            return RESULT_INTERRUPTED;
+        }
+        // poll() passes over a negative descriptor and reports one that is not open; both are
+        // errors here.
+        int ready = fd < 0 ? 1 : poll(&watched, 1, PollMilliseconds(interval));
+        if (fd < 0 || (ready > 0 && (watched.revents & POLLNVAL) != 0)) {
+            ready = -1;
+            errno = EBADF;
+        }
+        if (ready > 0) {
+            readiness.ready = (watched.revents & (reading ? kReadEvents : kWriteEvents)) != 0;
+            readiness.exception = (watched.revents & POLLPRI) != 0;
+            return RESULT_SUCCESS;
+        }
+        if (ready == 0) {
+            Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): select: timeout\n",
+                           __LINE__);
+            return RESULT_TIMEOUT;
+        }
+        if (errno != EINTR) {
+            Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/channel(%d): select: %s (%d)\n",
+                           __LINE__, strerror(errno), errno);
+            return RESULT_SYSTEM;
+        }
+    }
+}
+
+int WaitReadable(int fd, const timeval& interval, const int* flag) {
+    Readiness readiness;
+    const int result = WaitFd(fd, Watch::kRead, interval, flag, readiness);
+    if (result < 0) {
+        return result;
+    }
+    if (readiness.exception) {
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/channel(%d): ReadFd: exception set\n",
+                       __LINE__);
+        return RESULT_IO;
+    }
+    if (!readiness.ready) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): ReadFd: select but fd [%d] not ready\n",
+                       __LINE__, fd);
+        return RESULT_SYSTEM;
+    }
+    return RESULT_SUCCESS;
+}
+
+int WaitWritable(int fd, const timeval& interval, const int* flag) {
+    Readiness readiness;
+    const int result = WaitFd(fd, Watch::kWrite, interval, flag, readiness);
+    if (result < 0) {
+        return result;
+    }
+    if (readiness.exception) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): WriteFd: exception occurs\n", __LINE__);
+        return RESULT_IO;
+    }
+    if (!readiness.ready) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): WriteFd: select but fd [%d] not ready\n",
+                       __LINE__, fd);
+        return RESULT_SYSTEM;
+    }
+    return RESULT_SUCCESS;
+}
+
+int RefuseEmptyRead(unsigned int length) {
+    if (length == 0) {
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/channel(%d): ReadFd: request 0\n",
+                       __LINE__);
+        return RESULT_INVALID_ARGUMENT;
+    }
+    return RESULT_SUCCESS;
+}
+
+int TellRead(int count) {
+    Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): ReadFd: read %d bytes\n",
+                   __LINE__, count);
+    return count;
+}
+
+int TellWritten(int count) {
+    Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): WriteFd: write %d bytes\n",
+                   __LINE__, count);
+    return count;
+}
+
+void CloseSocket(int fd) {
+    if (shutdown(fd, SHUT_RDWR) != 0) {
+        Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): Channel: shutdown: %s\n",
+                       __LINE__, strerror(errno));
+    }
+    close(fd);
+    Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): Channel: socket %d closed\n",
+                   __LINE__, fd);
+}
+
+}  // namespace ZEL

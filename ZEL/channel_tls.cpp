@@ -1,0 +1,525 @@
+// The TLS mode of a channel.
+//
+// OpenSSL is used through its 1.1 interface. Its per-thread error queue is emptied before each call
+// whose result is looked at with SSL_get_error(), which would otherwise report another connection's
+// old error.
+#include <errno.h>
+#include <openssl/err.h>
+#include <openssl/ssl.h>
+#include <openssl/x509v3.h>
+#include <string.h>
+
+#include <memory>
+#include <mutex>
+
+#include "ZEL/channel.h"
+#include "ZEL/internal/cert_name.h"
+#include "ZEL/internal/channel_socket.h"
+#include "ZEL/internal/tls_socket_bio.h"
+#include "ZEL/log.h"
+#include "tarq/root_path.h"
+
+namespace ZEL {
+
+namespace {
+
+constexpr char kClientCiphers[] = "RC4-MD5";
+
+template <auto function>
+struct Deleter {
+    template <typename T>
+    void operator()(T* object) const {
+        function(object);
+    }
+};
+using OwnedX509 = std::unique_ptr<X509, Deleter<X509_free>>;
+using OwnedNames = std::unique_ptr<GENERAL_NAMES, Deleter<GENERAL_NAMES_free>>;
+
+// A path of the process: the default, below the root folder of the moment, until it is set.
+class PathSetting {
+public:
+    explicit PathSetting(const char* default_path) : default_path_(default_path) {}
+
+    std::string Get() {
+        const std::lock_guard<std::mutex> lock(mutex_);
+        return set_ ? path_ : TARQ::RootPath(default_path_);
+    }
+
+    void Set(const std::string& path) {
+        const std::lock_guard<std::mutex> lock(mutex_);
+        path_ = path;
+        set_ = true;
+    }
+
+private:
+    const char* default_path_;
+    std::mutex mutex_;
+    std::string path_;
+    bool set_ = false;
+};
+
+PathSetting& CertSetting() {
+    static PathSetting setting("/tmp/.cloud_certs");
+    return setting;
+}
+
+PathSetting& KeySetting() {
+    static PathSetting setting("/tmp/.cloud_server.key");
+    return setting;
+}
+
+PathSetting& CaSetting() {
+    static PathSetting setting("/certs.pem");
+    return setting;
+}
+
+// Nobody sits at the terminal of a daemon: an encrypted key cannot be read.
+int RefusePassphrase(char*, int, int, void*) {
+    return 0;
+}
+
+bool NewContext(SSL_CTX*& ctx, const SSL_METHOD* method) {
+    SSL_CTX_free(ctx);
+    ctx = SSL_CTX_new(method);
+    if (ctx == nullptr) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): m_ssl_ctx created failed\n", __LINE__);
+        return false;
+    }
+    // A retried write may come from another place of the ring, and each record that went out is
+    // progress.
+    SSL_CTX_set_mode(ctx, SSL_MODE_ENABLE_PARTIAL_WRITE | SSL_MODE_ACCEPT_MOVING_WRITE_BUFFER);
+    // A peer that begins a new handshake in mid-stream would make writes wait for something to
+    // read.
+    SSL_CTX_set_options(ctx, SSL_OP_NO_RENEGOTIATION);
+    SSL_CTX_set_default_passwd_cb(ctx, RefusePassphrase);
+    return true;
+}
+
+bool NewTlsObject(SSL*& ssl, SSL_CTX* ctx) {
+    ssl = SSL_new(ctx);
+    if (ssl == nullptr) {
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/channel(%d): m_ssl created failed\n",
+                       __LINE__);
+    }
+    return ssl != nullptr;
+}
+
+bool SetUpServer(SSL*& ssl, SSL_CTX*& ctx) {
+    if (!NewContext(ctx, TLS_server_method())) {
+        return false;
+    }
+    if (Channel::InstallCERT(ctx) != 0) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): Open: init ssl certificate failed\n", __LINE__);
+        return false;
+    }
+    // The check finds a key of another kind than the certificate's, which loads without complaint.
+    if (Channel::InstallPriKey(ctx) != 0 || SSL_CTX_check_private_key(ctx) != 1) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): Open: init ssl private key failed\n", __LINE__);
+        return false;
+    }
+    // Every connection has a context of its own: no session is ever resumed. A ticket would only
+    // wait unread in the socket of a client that sends and closes, and so turn its close into a
+    // reset.
+    SSL_CTX_set_num_tickets(ctx, 0);
+    if (!NewTlsObject(ssl, ctx)) {
+        return false;
+    }
+    SSL_set_accept_state(ssl);
+    return true;
+}
+
+bool SetUpClient(SSL*& ssl, SSL_CTX*& ctx, bool allow_untrusted) {
+    if (!NewContext(ctx, TLS_client_method())) {
+        return false;
+    }
+    if (SSL_CTX_set_cipher_list(ctx, kClientCiphers) != 1) {
+        Logger::LogMsg(
+            Logger::LEVEL_WARNING,
+            "[WARNING] ZEL/channel(%d): can't set cipher suit to SSL3_TXT_RSA_RC4_128_MD5\n",
+            __LINE__);
+        // The refused list has already taken the place of the defaults for TLS 1.2 and below.
+        if (!NewContext(ctx, TLS_client_method())) {
+            return false;
+        }
+    }
+    if (!NewTlsObject(ssl, ctx)) {
+        return false;
+    }
+    if (!allow_untrusted && Channel::InstallVerifyCA(ctx) != 0) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): InitSSL(): set Verify store fail\n", __LINE__);
+        return false;
+    }
+    // The chain is checked all the same; its result is looked at after the handshake.
+    SSL_set_verify(ssl, SSL_VERIFY_NONE, nullptr);
+    SSL_set_connect_state(ssl);
+    return true;
+}
+
+bool WantsRetry(int error) {
+    return error == SSL_ERROR_WANT_READ || error == SSL_ERROR_WANT_WRITE;
+}
+
+// After a fatal error nothing may be sent any more: the later shutdown then is a quiet one.
+void ForbidAlerts(SSL* ssl, int error) {
+    if (error == SSL_ERROR_SSL || error == SSL_ERROR_SYSCALL) {
+        SSL_set_quiet_shutdown(ssl, 1);
+    }
+}
+
+int WaitForHandshake(SSL* ssl, Watch watch, const timeval& interval) {
+    Readiness readiness;
+    const int result = WaitFd(SSL_get_fd(ssl), watch, interval, nullptr, readiness);
+    if (result < 0) {
+        return result;
+    }
+    if (readiness.exception) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): SSLHandshake: exception set\n", __LINE__);
+        return RESULT_IO;
+    }
+    if (!readiness.ready) {
+        Logger::LogMsg(
+            Logger::LEVEL_WARNING,
+            "[WARNING] ZEL/channel(%d): SSLHandshake: select returns but fd is not set\n",
+            __LINE__);
+        return RESULT_SYSTEM;
+    }
+    Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): SSLHandshake: reset timeout\n",
+                   __LINE__);
+    return RESULT_SUCCESS;
+}
+
+int SSLHandshake(SSL* ssl, const timeval& interval, unsigned int timeout) {
+    int64_t elapsed = 0;
+    for (;;) {
+        ERR_clear_error();
+        const int step = SSL_do_handshake(ssl);
+        if (step == 1) {
+            return RESULT_SUCCESS;
+        }
+        const int error = SSL_get_error(ssl, step);
+        if (step == 0) {
+            Logger::LogMsg(Logger::LEVEL_WARNING,
+                           "[WARNING] ZEL/channel(%d): SSLHandshake: SSL error code: %d\n",
+                           __LINE__, error);
+            Channel::log_ssl();
+            return RESULT_IO;
+        }
+        if (!WantsRetry(error)) {
+            Logger::LogMsg(Logger::LEVEL_WARNING,
+                           "[WARNING] ZEL/channel(%d): SSLHandshake: SSL fatel error code: %d\n",
+                           __LINE__, error);
+            Channel::log_ssl();
+            return RESULT_IO;
+        }
+        const int result = WaitForHandshake(
+            ssl, error == SSL_ERROR_WANT_READ ? Watch::kRead : Watch::kWrite, interval);
+        if (result == RESULT_SUCCESS) {
+            elapsed = 0;
+        } else if (result != RESULT_TIMEOUT) {
+            return result;
+        } else {
+            elapsed += interval.tv_sec;
+            if (timeout != 0 && elapsed >= int64_t{timeout}) {
+                Logger::LogMsg(
+                    Logger::LEVEL_WARNING,
+                    "[WARNING] ZEL/channel(%d): SSLHandshake: timed out during connect (%d "
+                    "seconds), abort anyway\n",
+                    __LINE__, static_cast<int>(timeout));
+                return RESULT_TIMEOUT;
+            }
+        }
+    }
+}
+
+bool Covers(const ASN1_STRING* name, const std::string& host) {
+    unsigned char* bytes = nullptr;
+    const int length = ASN1_STRING_to_UTF8(&bytes, name);
+    if (length < 0) {
+        return false;
+    }
+    const std::unique_ptr<unsigned char, void (*)(unsigned char*)> owner(
+        bytes, [](unsigned char* text) { OPENSSL_free(text); });
+    return CertNameCovers(std::string(reinterpret_cast<char*>(bytes), static_cast<size_t>(length)),
+                          host);
+}
+
+bool CommonNameCovers(X509* certificate, const std::string& host) {
+    const X509_NAME* subject = X509_get_subject_name(certificate);
+    const int index = X509_NAME_get_index_by_NID(subject, NID_commonName, -1);
+    return index >= 0 &&
+           Covers(X509_NAME_ENTRY_get_data(X509_NAME_get_entry(subject, index)), host);
+}
+
+bool AlternativeNameCovers(X509* certificate, const std::string& host) {
+    const OwnedNames names(static_cast<GENERAL_NAMES*>(
+        X509_get_ext_d2i(certificate, NID_subject_alt_name, nullptr, nullptr)));
+    for (int i = 0; i < sk_GENERAL_NAME_num(names.get()); ++i) {
+        const GENERAL_NAME* name = sk_GENERAL_NAME_value(names.get(), i);
+        if (name->type == GEN_DNS && Covers(name->d.dNSName, host)) {
+            return true;
+        }
+    }
+    return false;
+}
+
+bool PeerIsTrusted(SSL* ssl, const std::string& host) {
+    if (SSL_get_verify_result(ssl) != X509_V_OK) {
+        return false;
+    }
+    if (host.empty()) {
+        return true;
+    }
+    const OwnedX509 certificate(SSL_get_peer_certificate(ssl));
+    return certificate != nullptr && (CommonNameCovers(certificate.get(), host) ||
+                                      AlternativeNameCovers(certificate.get(), host));
+}
+
+// Owns what ConvertToSSLChannel() has set up until the channel takes it over.
+class PendingTls {
+public:
+    PendingTls() = default;
+    ~PendingTls() { Channel::DeinitSSL(ssl, ctx, true); }
+    PendingTls(const PendingTls&) = delete;
+    PendingTls& operator=(const PendingTls&) = delete;
+
+    SSL* ssl = nullptr;
+    SSL_CTX* ctx = nullptr;
+};
+
+int TlsSocket(void* handle) {
+    return handle == nullptr ? -1 : SSL_get_fd(static_cast<SSL*>(handle));
+}
+
+// What a read that gave no bytes comes to.
+int ReadFailure(SSL* ssl, int count) {
+    const int error = SSL_get_error(ssl, count);
+    if (WantsRetry(error)) {
+        // The peer's record has not arrived in full, or was none with data in it.
+        Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): SSL want read", __LINE__);
+        return RESULT_TIMEOUT;
+    }
+    ForbidAlerts(ssl, error);
+    Channel::log_ssl();
+    return RESULT_IO;
+}
+
+int SSLReadFd(void* handle, char* buffer, unsigned int length, const timeval& interval,
+              const int* flag) {
+    auto* ssl = static_cast<SSL*>(handle);
+    int result = RefuseEmptyRead(length);
+    if (result < 0) {
+        return result;
+    }
+    const bool decrypted = ssl != nullptr && SSL_pending(ssl) > 0;
+    if (!decrypted) {
+        result = WaitReadable(TlsSocket(handle), interval, flag);
+        if (result < 0) {
+            return result;
+        }
+    }
+    ERR_clear_error();
+    const int count = SSL_read(ssl, buffer, static_cast<int>(length));
+    if (count > 0) {
+        return TellRead(count);
+    }
+    if (decrypted) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): Diagnose: SSL_read failed\n", __LINE__);
+        ForbidAlerts(ssl, SSL_get_error(ssl, count));
+        Channel::log_ssl();
+        return RESULT_IO;
+    }
+    return ReadFailure(ssl, count);
+}
+
+int SSLWriteFd(void* handle, const char* data, unsigned int length, const timeval& interval,
+               const int* flag) {
+    auto* ssl = static_cast<SSL*>(handle);
+    const int result = WaitWritable(TlsSocket(handle), interval, flag);
+    if (result < 0) {
+        return result;
+    }
+    ERR_clear_error();
+    errno = 0;
+    const int count = SSL_write(ssl, data, static_cast<int>(length));
+    const int saved_errno = errno;
+    if (count > 0) {
+        return TellWritten(count);
+    }
+    const int error = SSL_get_error(ssl, count);
+    ForbidAlerts(ssl, error);
+    if (WantsRetry(error)) {
+        Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): SSL want write\n", __LINE__);
+        return RESULT_TIMEOUT;
+    }
+    if (error == SSL_ERROR_SYSCALL) {
+        Logger::LogMsg(
+            Logger::LEVEL_WARNING,
+            "[WARNING] ZEL/channel(%d): syscall error: n = %d, ssl_ret = %d, errno = %d, err "
+            "= %s\n",
+            __LINE__, count, error, saved_errno, strerror(saved_errno));
+        return RESULT_SYSTEM;
+    }
+    Logger::LogMsg(Logger::LEVEL_WARNING,
+                   "[WARNING] ZEL/channel(%d): misc error: n = %d, ssl_ret = %d, errno = %d\n",
+                   __LINE__, count, error, saved_errno);
+    return RESULT_IO;
+}
+
+void CloseTls(void* handle) {
+    auto* ssl = static_cast<SSL*>(handle);
+    Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): destroy ssl obj %p\n", __LINE__,
+                   handle);
+    const int fd = TlsSocket(handle);
+    SSL_CTX* ctx = SSL_get_SSL_CTX(ssl);
+    Channel::DeinitSSL(ssl, ctx, false);
+    CloseSocket(fd);
+}
+
+bool IsTlsClosed(void* handle) {
+    return handle == nullptr;
+}
+
+}  // namespace
+
+const ChannelOps kTlsOps = {SSLReadFd, SSLWriteFd, TlsSocket, CloseTls, IsTlsClosed};
+
+int Channel::ConvertToSSLChannel(bool server) {
+    if (tls_) {
+        Logger::LogMsg(
+            Logger::LEVEL_WARNING,
+            "[WARNING] ZEL/channel(%d): ConvertToSSLChannel: Channel is SSL channel, no need "
+            "to be converted\n",
+            __LINE__);
+        return RESULT_SUCCESS;
+    }
+    PendingTls tls;
+    if (InitSSL(tls.ssl, tls.ctx, server, allow_untrusted_) != 0) {
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/channel(%d): Open: init ssl failed\n",
+                       __LINE__);
+        return RESULT_IO;
+    }
+    BIO* bio = NewTlsSocketBio(ops_.get_fd(handle_));
+    if (bio == nullptr) {
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/channel(%d): set fd failed\n",
+                       __LINE__);
+        return RESULT_IO;
+    }
+    SSL_set_bio(tls.ssl, bio, bio);
+    const int result = SSLHandshake(tls.ssl, select_interval_, timeout_);
+    if (result < 0) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): Open to SSL connect to server failed\n",
+                       __LINE__);
+        return result == RESULT_TIMEOUT ? result : RESULT_IO;
+    }
+    if (!server && !allow_untrusted_ && !PeerIsTrusted(tls.ssl, tls_host_name_)) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): ConvertToSSLChannel: Verify Fail!\n", __LINE__);
+        return RESULT_CERTIFICATE;
+    }
+    delete static_cast<int*>(handle_);  // the cell only: the socket lives on below TLS
+    handle_ = tls.ssl;
+    tls_ = true;
+    SwitchChannelOp(0);
+    tls.ssl = nullptr;
+    tls.ctx = nullptr;
+    return RESULT_SUCCESS;
+}
+
+std::string Channel::GetCertPath() {
+    return CertSetting().Get();
+}
+
+void Channel::SetCERTPath(const std::string& path) {
+    CertSetting().Set(path);
+}
+
+std::string Channel::GetKeyPath() {
+    return KeySetting().Get();
+}
+
+void Channel::SetPriKeyPath(const std::string& path) {
+    KeySetting().Set(path);
+}
+
+std::string Channel::GetCAPath() {
+    return CaSetting().Get();
+}
+
+void Channel::SetVerifyCAPath(const std::string& path) {
+    CaSetting().Set(path);
+}
+
+int Channel::InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allow_untrusted) {
+    ssl = nullptr;
+    ctx = nullptr;
+    if (server ? SetUpServer(ssl, ctx) : SetUpClient(ssl, ctx, allow_untrusted)) {
+        return 0;
+    }
+    DeinitSSL(ssl, ctx, true);
+    return -1;
+}
+
+int Channel::InstallCERT(SSL_CTX* ctx) {
+    const std::string path = GetCertPath();
+    Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): cert path = %s\n", __LINE__,
+                   path.c_str());
+    if (SSL_CTX_use_certificate_chain_file(ctx, path.c_str()) != 1) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): Install certificate failed\n", __LINE__);
+        return -1;
+    }
+    return 0;
+}
+
+int Channel::InstallPriKey(SSL_CTX* ctx) {
+    if (SSL_CTX_use_PrivateKey_file(ctx, GetKeyPath().c_str(), SSL_FILETYPE_PEM) != 1) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): Install private key failed\n", __LINE__);
+        return -1;
+    }
+    return 0;
+}
+
+int Channel::InstallVerifyCA(SSL_CTX* ctx) {
+    const std::string path = GetCAPath();
+    if (SSL_CTX_load_verify_locations(ctx, path.c_str(), nullptr) != 1) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] ZEL/channel(%d): SSL_CTX_load_verify_locations(%s) failed\n",
+                       __LINE__, path.c_str());
+        return -1;
+    }
+    return 0;
+}
+
+void Channel::DeinitSSL(SSL*& ssl, SSL_CTX*& ctx, bool quiet) {
+    if (ssl != nullptr) {
+        if (quiet) {
+            SSL_set_quiet_shutdown(ssl, 1);
+        }
+        // Told once, the peer's answer is not waited for: the socket is closed next.
+        SSL_shutdown(ssl);
+        SSL_free(ssl);
+    }
+    SSL_CTX_free(ctx);
+    ssl = nullptr;
+    ctx = nullptr;
+    ERR_clear_error();
+}
+
+void Channel::log_ssl() {
+    while (const unsigned long error = ERR_get_error()) {
+        char text[256];
+        ERR_error_string_n(error, text, sizeof text);
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/channel(%d): ssl-errors: %s\n",
+                       __LINE__, text);
+    }
+}
+
+}  // namespace ZEL

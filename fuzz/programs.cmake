@@ -1,0 +1,1 @@
+fuzz_target(command_file_fuzz command_file_fuzz.cpp LIBRARIES server_parts)

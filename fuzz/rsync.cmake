@@ -1,0 +1,1 @@
+fuzz_target(answer_file_fuzz answer_file_fuzz.cpp LIBRARIES tarqrsync_parts)

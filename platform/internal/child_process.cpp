@@ -1,0 +1,412 @@
+#include "platform/internal/child_process.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/resource.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <chrono>
+#include <optional>
+#include <string_view>
+
+#include "platform/internal/unique_fd.h"
+#include "platform/internal/write_all.h"
+
+namespace tarq_internal {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using std::chrono::milliseconds;
+
+// How often the caller is asked whether to go on.
+constexpr milliseconds kAskInterval(100);
+// What a program gets to clear up after itself before it is killed.
+constexpr milliseconds kTermGrace(300);
+// What the kernel gets to bury the rest of a killed group: it needs far less.
+constexpr milliseconds kBurialGrace(200);
+
+// How long and how often a program is watched that has done its work.
+constexpr milliseconds kEarlyEndWatch(100);
+constexpr milliseconds kEarlyEndStep(1);
+
+constexpr int kFirstFreeFd = 3;
+
+struct Pipe {
+    UniqueFd read_end;
+    UniqueFd write_end;
+};
+
+// Above the standard three, so that arranging those in the child overwrites no end of a pipe even
+// when the host runs with a standard descriptor closed.
+UniqueFd MoveAboveStandard(UniqueFd fd) {
+    if (!fd || fd.Get() >= kFirstFreeFd) {
+        return fd;
+    }
+    return UniqueFd(fcntl(fd.Get(), F_DUPFD_CLOEXEC, kFirstFreeFd));
+}
+
+bool MakePipe(Pipe* result) {
+    int ends[2];
+    if (pipe2(ends, O_CLOEXEC) != 0) {
+        return false;
+    }
+    result->read_end = MoveAboveStandard(UniqueFd(ends[0]));
+    result->write_end = MoveAboveStandard(UniqueFd(ends[1]));
+    return result->read_end && result->write_end;
+}
+
+// The input goes into the pipe before there is a child: it fits, and while this process holds the
+// read end no SIGPIPE can come of it.
+UniqueFd MakeInput(const std::string& input) {
+    if (input.empty()) {
+        return MoveAboveStandard(UniqueFd(open("/dev/null", O_RDONLY | O_CLOEXEC)));
+    }
+    if (input.size() > kMaxChildInput) {
+        errno = E2BIG;
+        return UniqueFd();
+    }
+    Pipe pipe;
+    if (!MakePipe(&pipe) || !WriteAll(pipe.write_end.Get(), input)) {
+        return UniqueFd();
+    }
+    return std::move(pipe.read_end);
+}
+
+std::vector<char*> CStrings(const std::vector<std::string>& strings) {
+    std::vector<char*> pointers;
+    pointers.reserve(strings.size() + 1);
+    for (const std::string& text : strings) {
+        pointers.push_back(const_cast<char*>(text.c_str()));  // execve() only reads them
+    }
+    pointers.push_back(nullptr);
+    return pointers;
+}
+
+// Blocks every signal on this thread while it lives: a child must not run the host's handlers
+// between fork() and the moment that its dispositions are the default ones.
+class SignalsBlocked {
+public:
+    SignalsBlocked() {
+        sigset_t all;
+        sigfillset(&all);
+        pthread_sigmask(SIG_SETMASK, &all, &before_);
+    }
+    ~SignalsBlocked() { pthread_sigmask(SIG_SETMASK, &before_, nullptr); }
+    SignalsBlocked(const SignalsBlocked&) = delete;
+    SignalsBlocked& operator=(const SignalsBlocked&) = delete;
+
+private:
+    sigset_t before_;
+};
+
+struct ChildPlan {
+    const char* program;
+    char* const* arguments;
+    char* const* environment;
+    int input, output, error, report;
+    uint64_t max_file_bytes;
+    pid_t parent;
+};
+
+// Between fork() and execve() only what is safe in the child of a process with threads.
+[[noreturn]] void BecomeProgram(const ChildPlan& plan) {
+    struct sigaction default_action = {};
+    default_action.sa_handler = SIG_DFL;
+    for (int number = 1; number < NSIG; ++number) {
+        sigaction(number, &default_action, nullptr);
+    }
+    sigset_t none;
+    sigemptyset(&none);
+    sigprocmask(SIG_SETMASK, &none, nullptr);
+
+    setsid();
+    // The second line is for a parent that died before the first one took effect.
+    prctl(PR_SET_PDEATHSIG, SIGTERM);
+    bool ready = getppid() == plan.parent;
+    if (plan.max_file_bytes != 0) {
+        const rlimit limit = {static_cast<rlim_t>(plan.max_file_bytes),
+                              static_cast<rlim_t>(plan.max_file_bytes)};
+        ready = ready && setrlimit(RLIMIT_FSIZE, &limit) == 0;
+    }
+    ready = ready && dup2(plan.input, STDIN_FILENO) >= 0 && dup2(plan.output, STDOUT_FILENO) >= 0 &&
+            dup2(plan.error, STDERR_FILENO) >= 0;
+#ifdef SYS_close_range
+    // What the host has left open without close-on-exec. A kernel without the call lets the program
+    // have it.
+    constexpr unsigned int kCloseRangeCloexec = 4;
+    syscall(SYS_close_range, kFirstFreeFd, ~0U, kCloseRangeCloexec);
+#endif
+    if (ready) {
+        execve(plan.program, plan.arguments, plan.environment);
+    }
+    const int reason = errno;
+    [[maybe_unused]] const ssize_t told = write(plan.report, &reason, sizeof reason);
+    _exit(127);
+}
+
+int OpenPidFd(pid_t pid) {
+#ifdef SYS_pidfd_open
+    return static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+#else
+    static_cast<void>(pid);
+    return -1;
+#endif
+}
+
+// Owns a child that leads its process group: kills what is left of the group and reaps the child.
+class ProcessGroup {
+public:
+    explicit ProcessGroup(pid_t leader) : leader_(leader), exit_fd_(OpenPidFd(leader)) {}
+    ~ProcessGroup() { End(); }
+    ProcessGroup(const ProcessGroup&) = delete;
+    ProcessGroup& operator=(const ProcessGroup&) = delete;
+
+    pid_t Leader() const { return leader_; }
+
+    // Readable once the leader has ended; -1 on a kernel that has no such descriptor.
+    int ExitFd() const { return exit_fd_.Get(); }
+
+    void Signal(int number) { kill(-leader_, number); }
+
+    // The leader stays a zombie, so its number still means this group.
+    bool LeaderHasEnded() {
+        siginfo_t info = {};
+        const int result =
+            waitid(P_PID, static_cast<id_t>(leader_), &info, WEXITED | WNOHANG | WNOWAIT);
+        return result != 0 || info.si_pid == leader_;
+    }
+
+    int End() {
+        if (ended_) {
+            return wait_status_;
+        }
+        ended_ = true;
+        Signal(SIGKILL);
+        int status = 0;
+        pid_t reaped;
+        do {
+            reaped = waitpid(leader_, &status, 0);
+        } while (reaped < 0 && errno == EINTR);
+        wait_status_ = reaped == leader_ ? status : -1;
+        const Clock::time_point give_up = Clock::now() + kBurialGrace;
+        while (kill(-leader_, 0) == 0 && Clock::now() < give_up) {
+            usleep(1000);
+        }
+        return wait_status_;
+    }
+
+private:
+    pid_t leader_;
+    UniqueFd exit_fd_;
+    bool ended_ = false;
+    int wait_status_ = -1;
+};
+
+// One stream of the child's.
+struct Stream {
+    UniqueFd fd;
+    const OutputHandler* handler;
+
+    // Reads once; closes the stream at its end. True when there may be more at once.
+    bool ReadOnce() {
+        std::array<char, 16384> buffer;
+        const ssize_t count = read(fd.Get(), buffer.data(), buffer.size());
+        if (count > 0) {
+            (*handler)(buffer.data(), static_cast<size_t>(count));
+            return true;
+        }
+        if (count < 0 && errno == EINTR) {
+            return true;
+        }
+        if (count == 0 || errno != EAGAIN) {
+            fd.Reset();
+        }
+        return false;
+    }
+};
+
+// Starts the child. 0, or errno.
+int Start(const ChildSpec& spec, std::optional<ProcessGroup>* group, Stream* output,
+          Stream* error) {
+    const std::vector<char*> arguments = CStrings(spec.arguments);
+    const std::vector<char*> environment = CStrings(spec.environment);
+    Pipe out, err, report;
+    const UniqueFd input = MakeInput(spec.input);
+    if (!input || !MakePipe(&out) || !MakePipe(&err) || !MakePipe(&report)) {
+        return errno;
+    }
+    for (const UniqueFd* end : {&out.read_end, &err.read_end}) {
+        fcntl(end->Get(), F_SETFL, O_NONBLOCK);
+    }
+    const ChildPlan plan = {spec.program.c_str(),
+                            arguments.data(),
+                            environment.data(),
+                            input.Get(),
+                            out.write_end.Get(),
+                            err.write_end.Get(),
+                            report.write_end.Get(),
+                            spec.max_file_bytes,
+                            getpid()};
+    pid_t pid;
+    int fork_error;
+    {
+        const SignalsBlocked no_handlers;
+        pid = fork();
+        fork_error = errno;
+        if (pid == 0) {
+            BecomeProgram(plan);
+        }
+    }
+    if (pid < 0) {
+        return fork_error;
+    }
+    group->emplace(pid);
+    // The report closes by itself when the program starts; from then on the group exists.
+    report.write_end.Reset();
+    int reason = 0;
+    ssize_t count;
+    do {
+        count = read(report.read_end.Get(), &reason, sizeof reason);
+    } while (count < 0 && errno == EINTR);
+    if (count == static_cast<ssize_t>(sizeof reason)) {
+        return reason == 0 ? ECHILD : reason;
+    }
+    output->fd = std::move(out.read_end);
+    error->fd = std::move(err.read_end);
+    return 0;
+}
+
+// Follows an EarlyEnd: sleeps until its descriptor is readable, then asks for a while.
+class EarlyEndWatch {
+public:
+    explicit EarlyEndWatch(const EarlyEnd& early_end)
+        : early_end_(early_end), fd_(early_end.reached ? early_end.ready_fd : -1) {}
+
+    // What to wait for; -1 when there is nothing.
+    int Fd() const { return fd_; }
+    bool IsAsking() const { return asking_; }
+
+    void FdIsReadable() {
+        fd_ = -1;
+        asking_ = true;
+        until_ = Clock::now() + kEarlyEndWatch;
+    }
+
+    bool IsReached(pid_t leader) {
+        asking_ = asking_ && Clock::now() <= until_;
+        return asking_ && early_end_.reached(leader);
+    }
+
+private:
+    const EarlyEnd& early_end_;
+    int fd_;
+    bool asking_ = false;
+    Clock::time_point until_;
+};
+
+// Waits until something happens or the time is up; without a time, for as long as it takes.
+void Wait(const ProcessGroup& group, const Stream& output, const Stream& error,
+          EarlyEndWatch* watch, std::optional<Clock::time_point> until) {
+    // poll() skips descriptors of -1, which is what a closed stream and a kernel without pidfds
+    // have.
+    std::array<pollfd, 4> fds = {{{group.ExitFd(), POLLIN, 0},
+                                  {output.fd.Get(), POLLIN, 0},
+                                  {error.fd.Get(), POLLIN, 0},
+                                  {watch->Fd(), POLLIN, 0}}};
+    int timeout = group.ExitFd() >= 0 ? -1 : static_cast<int>(kAskInterval.count());
+    if (until) {
+        const auto left = std::chrono::ceil<milliseconds>(*until - Clock::now()).count();
+        timeout = static_cast<int>(std::clamp<long long>(left, 0, kAskInterval.count()));
+    }
+    if (watch->IsAsking()) {
+        timeout = static_cast<int>(kEarlyEndStep.count());
+    }
+    if (poll(fds.data(), fds.size(), timeout) > 0 && fds[3].revents != 0) {
+        watch->FdIsReadable();
+    }
+}
+
+}  // namespace
+
+ChildResult RunChild(const ChildSpec& spec, const std::function<bool()>& cancelled,
+                     const OutputHandler& on_output, const OutputHandler& on_error,
+                     const EarlyEnd& early_end) {
+    const OutputHandler nowhere = [](const char*, size_t) {};
+    Stream output = {UniqueFd(), on_output ? &on_output : &nowhere};
+    Stream error = {UniqueFd(), on_error ? &on_error : &nowhere};
+    std::optional<ProcessGroup> group;
+    ChildResult result;
+    if (cancelled && cancelled()) {
+        result.cancelled = true;
+        return result;
+    }
+    result.start_error = Start(spec, &group, &output, &error);
+    if (result.start_error != 0) {
+        return result;
+    }
+
+    std::optional<Clock::time_point> next_step;  // the next question, or the end of the grace
+    if (cancelled) {
+        next_step = Clock::now() + kAskInterval;
+    }
+    EarlyEndWatch watch(early_end);
+    while (!group->LeaderHasEnded()) {
+        Wait(*group, output, error, &watch, next_step);
+        for (Stream* stream : {&output, &error}) {
+            if (stream->fd) {
+                stream->ReadOnce();
+            }
+        }
+        if (!result.cancelled && watch.IsReached(group->Leader())) {
+            result.ended_early = true;
+            break;
+        }
+        if (!next_step || Clock::now() < *next_step) {
+            continue;
+        }
+        if (result.cancelled) {
+            group->Signal(SIGKILL);
+            next_step = Clock::now() + kTermGrace;
+        } else if (cancelled()) {
+            result.cancelled = true;
+            group->Signal(SIGTERM);
+            next_step = Clock::now() + kTermGrace;
+        } else {
+            next_step = Clock::now() + kAskInterval;
+        }
+    }
+    result.wait_status = group->End();
+    // With the whole group gone the rest is what lies in the pipes.
+    for (Stream* stream : {&output, &error}) {
+        while (stream->fd && stream->ReadOnce()) {
+        }
+    }
+    return result;
+}
+
+std::string FindProgram(const std::string& name, const std::string& search_path) {
+    if (name.find('/') != std::string::npos) {
+        return name;
+    }
+    std::string_view rest = search_path;
+    while (!name.empty() && !rest.empty()) {
+        const size_t end = std::min(rest.find(':'), rest.size());
+        std::string candidate(rest.substr(0, end));
+        rest.remove_prefix(std::min(end + 1, rest.size()));
+        candidate += "/" + name;
+        if (access(candidate.c_str(), X_OK) == 0) {
+            return candidate;
+        }
+    }
+    return "";
+}
+
+}  // namespace tarq_internal

@@ -1,1 +1,0 @@
-// The first operation lands with the library's own source.

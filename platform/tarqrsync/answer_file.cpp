@@ -1,0 +1,90 @@
+#include "platform/tarqrsync/answer_file.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <charconv>
+
+#include "platform/internal/unique_fd.h"
+#include "platform/internal/write_all.h"
+
+namespace TARQ {
+namespace Backup {
+
+namespace {
+
+constexpr std::string_view kStatusPrefix = "status=\"";
+constexpr std::string_view kStatusSuffix = "\"";
+// Nine digits always fit an int.
+constexpr size_t kMaxStatusDigits = 9;
+
+bool ParseStatus(std::string_view digits, int* status) {
+    if (digits.empty() || digits.size() > kMaxStatusDigits ||
+        (digits.size() > 1 && digits[0] == '0') ||
+        !std::all_of(digits.begin(), digits.end(), [](char c) { return c >= '0' && c <= '9'; })) {
+        return false;
+    }
+    std::from_chars(digits.data(), digits.data() + digits.size(), *status);
+    return true;
+}
+
+}  // namespace
+
+bool ParseAnswer(std::string_view text, Answer* answer) {
+    const size_t line_end = text.find('\n');
+    if (line_end == std::string_view::npos) {
+        return false;
+    }
+    const std::string_view line = text.substr(0, line_end);
+    const size_t frame = kStatusPrefix.size() + kStatusSuffix.size();
+    if (line.size() < frame || line.substr(0, kStatusPrefix.size()) != kStatusPrefix ||
+        line.substr(line.size() - kStatusSuffix.size()) != kStatusSuffix ||
+        !ParseStatus(line.substr(kStatusPrefix.size(), line.size() - frame), &answer->status)) {
+        return false;
+    }
+    answer->content = text.substr(line_end + 1);
+    return true;
+}
+
+bool ReadAnswerFile(const std::string& path, std::string* text) {
+    // Without O_NONBLOCK the opening of a FIFO would wait for a writer.
+    const tarq_internal::UniqueFd fd(
+        open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+    struct stat info;
+    if (!fd || fstat(fd.Get(), &info) != 0) {
+        return false;
+    }
+    if (!S_ISREG(info.st_mode) || info.st_size > static_cast<off_t>(kMaxAnswerBytes)) {
+        errno = S_ISREG(info.st_mode) ? EFBIG : EINVAL;
+        return false;
+    }
+    text->resize(static_cast<size_t>(info.st_size));
+    size_t done = 0;
+    while (done < text->size()) {
+        const ssize_t count = read(fd.Get(), text->data() + done, text->size() - done);
+        if (count < 0 && errno == EINTR) {
+            continue;
+        }
+        if (count < 0) {
+            return false;
+        }
+        if (count == 0) {
+            break;
+        }
+        done += static_cast<size_t>(count);
+    }
+    text->resize(done);
+    return true;
+}
+
+bool WriteOutfile(const std::string& path, const std::string& content) {
+    const tarq_internal::UniqueFd fd(open(
+        path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0600));
+    return fd && tarq_internal::WriteAll(fd.Get(), content);
+}
+
+}  // namespace Backup
+}  // namespace TARQ

@@ -1,0 +1,308 @@
+#include "platform/tarqrsync/explain.h"
+
+#include <algorithm>
+#include <cctype>
+#include <initializer_list>
+#include <string_view>
+#include <utility>
+
+#include "tarq/rsync_wrapper.h"
+
+namespace TARQ {
+namespace Backup {
+
+namespace {
+
+// rsync's exit codes that have no name in the public header.
+constexpr int kExitProtocol = 2;
+constexpr int kExitUnsupported = 4;
+constexpr int kExitFileIo = 11;
+constexpr int kExitIpc = 14;
+constexpr int kExitPartial = 23;
+constexpr int kExitVanished = 24;
+constexpr int kExitConnectTimeout = 35;
+// What ssh ends with when it fails by itself.
+constexpr int kExitSsh = 255;
+
+constexpr int kKeepStatus = -1;
+
+constexpr std::string_view kUnknownModule = "@ERROR: Unknown module";
+
+enum Where : unsigned int {
+    DAEMON = 1U,
+    COMMAND = 2U,  // a server command
+    COPY = 4U,
+    SSH = 8U,  // either of the runs over ssh
+    ANYWHERE = DAEMON | COMMAND | COPY | SSH
+};
+
+// Words of rsync's or ssh's, and what they mean to a person. {host}, {user}, {module}, {port},
+// {daemon_port}, {ssh}, and {line} (all of the line that the words were found in) are filled in.
+struct Clue {
+    std::string_view words;
+    unsigned int where;
+    int status;
+    std::string_view meaning;
+};
+
+// The first that fits holds, so the causes stand before what follows from them.
+constexpr Clue kClues[] = {
+    {"Could not resolve hostname", SSH, STATUS_SOCKET, "the host name {host} is unknown"},
+    {"UNPROTECTED PRIVATE KEY FILE", SSH, STATUS_AUTHENTICATION,
+     "ssh refuses the private key: others may read its file"},
+    {"ssh_askpass: exec", SSH, STATUS_AUTHENTICATION,
+     "the program that hands the password to ssh cannot be run: is /tmp mounted with noexec?"},
+    {"stdio forwarding failed", SSH, STATUS_SOCKET,
+     "the ssh login at {host} works, but no rsync daemon answers there on port {daemon_port}, or "
+     "its ssh server forbids the way to it (AllowTcpForwarding)"},
+    {"Connection timed out", SSH, kExitConnectTimeout,
+     "{host} did not answer on ssh port {port} in time"},
+    {"Operation timed out", SSH, kExitConnectTimeout,
+     "{host} did not answer on ssh port {port} in time"},
+    {"Connection refused", SSH, STATUS_SOCKET,
+     "{host} refuses connections on ssh port {port}: is its ssh server running?"},
+    {"Too many authentication failures", SSH, STATUS_AUTHENTICATION,
+     "the ssh login of '{user}' at {host} was refused: too many keys were offered"},
+    {"ssh: not found", SSH, kExitIpc, "the program {ssh} is missing"},
+    {"Failed to exec", SSH, kExitIpc, "the program {ssh} cannot be started"},
+    {"rsync: command not found", SSH, kKeepStatus, "{host} has no rsync program"},
+    {"rsync: not found", SSH, kKeepStatus, "{host} has no rsync program"},
+    {"getaddrinfo:", DAEMON, kKeepStatus, "the host name {host} is unknown"},
+    {"Connection refused", DAEMON, kKeepStatus,
+     "{host} refuses connections on port {port}: is its rsync daemon running?"},
+    {"No route to host", ANYWHERE, STATUS_SOCKET, "there is no way to {host} in the network"},
+    {"Network is unreachable", ANYWHERE, STATUS_SOCKET, "there is no way to {host} in the network"},
+    {"Connection timed out", DAEMON, kKeepStatus, "{host} did not answer on port {port} in time"},
+    {"failed to read a password", ANYWHERE, STATUS_AUTHENTICATION,
+     "{host} asks for a password and none is set"},
+    {"@ERROR: auth failed", ANYWHERE, kKeepStatus,
+     "{host} refused the login: wrong account or password, or an account without rights there"},
+    {"@ERROR: access denied", ANYWHERE, kKeepStatus,
+     "{host} does not let this machine reach the module {module}"},
+    {"@ERROR: max connections", ANYWHERE, kKeepStatus,
+     "{host} serves as many connections as it takes: try again later"},
+    {kUnknownModule, COMMAND, STATUS_UNKNOWN_COMMAND,
+     "{host} takes no server commands: its rsync daemon has no module for them"},
+    {kUnknownModule, COPY, kKeepStatus, "{host} has no module '{module}'"},
+    {"@ERROR: early exec failed", ANYWHERE, kKeepStatus,
+     "the program that takes commands at {host} failed"},
+    {"@ERROR: Unknown command", COMMAND, STATUS_UNKNOWN_COMMAND,
+     "the rsync daemon at {host} is older than 3.2.1 and takes no commands"},
+    {"configured to refuse", ANYWHERE, kKeepStatus,
+     "the rsync daemon at {host} is configured to refuse an option of this run"},
+    {"module is read only", ANYWHERE, kKeepStatus, "the module {module} at {host} is read-only"},
+    {"@ERROR:", ANYWHERE, kKeepStatus, "{host} refused the run: {line}"},
+    {"No space left on device", COPY, kKeepStatus, "the disk of {host} is full"},
+    {"Disk quota exceeded", COPY, kKeepStatus,
+     "the disk quota of the account at {host} is used up"},
+    {"Read-only file system", COPY, kKeepStatus, "the file system at {host} is read-only"},
+    {"No space left on device", COMMAND, kKeepStatus, "the local disk is full"},
+    {"[sender] link_stat", COMMAND, kKeepStatus,
+     "{host} took the command and left no answer to it"},
+};
+
+// What the exit code alone says.
+struct ExitMeaning {
+    int code;
+    std::string_view meaning;
+};
+
+constexpr ExitMeaning kExitMeanings[] = {
+    {STATUS_SYNTAX, "rsync does not take the options of this run"},
+    {kExitProtocol, "the rsync at {host} speaks a protocol that this one does not know"},
+    {STATUS_FILE_SELECT, "the source or the destination cannot be reached"},
+    {kExitUnsupported, "the rsync at {host} does not support an option of this run"},
+    {STATUS_AUTHENTICATION, "{host} did not start the run"},
+    {STATUS_SOCKET, "the connection to {host} failed"},
+    {kExitFileIo, "a file could not be written or read"},
+    {STATUS_PROTOCOL_STREAM, "the connection to {host} broke"},
+    {kExitIpc, "rsync could not start its other half"},
+    {STATUS_CANCELLED, "rsync was ended by a signal"},
+    {kExitPartial, "not everything could be copied"},
+    {kExitVanished,
+     "some files vanished from the source during the run; all others were copied, and "
+     "nothing needs to be done"},
+    {STATUS_TIMEOUT, "nothing moved between here and {host} for the time-out"},
+    {kExitConnectTimeout, "{host} did not answer in time"},
+};
+
+std::string_view LineAt(std::string_view text, size_t position) {
+    const size_t before = text.rfind('\n', position);
+    const size_t start = before == std::string_view::npos ? 0 : before + 1;
+    return text.substr(start, text.find('\n', position) - start);
+}
+
+bool Contains(std::string_view text, std::string_view words) {
+    return text.find(words) != std::string_view::npos;
+}
+
+std::string PortOf(const RunFacts& facts) {
+    if (facts.settings.port != 0) {
+        return std::to_string(facts.settings.port);
+    }
+    return TransportOf(facts.settings) == Transport::DAEMON
+               ? std::to_string(facts.config.daemon_port)
+               : "22";
+}
+
+std::string Fill(std::string_view meaning, const RunFacts& facts, std::string_view line) {
+    const Settings& settings = facts.settings;
+    const std::initializer_list<std::pair<std::string_view, std::string>> fields = {
+        {"{host}", settings.host},
+        {"{user}", settings.user},
+        {"{module}", settings.module},
+        {"{port}", PortOf(facts)},
+        {"{daemon_port}", std::to_string(facts.config.daemon_port)},
+        {"{ssh}", facts.config.ssh},
+        {"{line}", std::string(line)},
+    };
+    std::string result;
+    while (!meaning.empty()) {
+        const auto field = std::find_if(fields.begin(), fields.end(), [meaning](const auto& entry) {
+            return meaning.substr(0, entry.first.size()) == entry.first;
+        });
+        const size_t width = field == fields.end() ? 1 : field->first.size();
+        result += field == fields.end() ? std::string(meaning.substr(0, 1)) : field->second;
+        meaning.remove_prefix(width);
+    }
+    return result;
+}
+
+// ssh: "user@host: Permission denied (publickey,password)."; rsync writes a number between the
+// brackets.
+bool IsRefusedSshLogin(std::string_view text) {
+    constexpr std::string_view kWords = "Permission denied (";
+    for (size_t at = text.find(kWords); at != std::string_view::npos;
+         at = text.find(kWords, at + 1)) {
+        const size_t reason = at + kWords.size();
+        if (reason < text.size() && std::isalpha(static_cast<unsigned char>(text[reason])) != 0) {
+            return true;
+        }
+    }
+    return false;
+}
+
+// "Offending ED25519 key in /path/known_hosts:7" tells where the old key stands.
+std::string ChangedHostKey(const RunFacts& facts) {
+    std::string result =
+        "the host key of " + facts.settings.host +
+        " has changed: either it was set up anew or another machine answers in its place";
+    constexpr std::string_view kPlace = " key in ";
+    const size_t offending = facts.messages.find("Offending ");
+    const size_t place = facts.messages.find(kPlace, std::min(offending, facts.messages.size()));
+    if (place != std::string::npos) {
+        const std::string_view rest =
+            std::string_view(facts.messages).substr(place + kPlace.size());
+        const std::string_view where = rest.substr(0, rest.find('\n'));
+        const size_t colon = where.rfind(':');
+        if (colon != std::string_view::npos) {
+            result += "; if it was, remove line " + std::string(where.substr(colon + 1)) + " of " +
+                      std::string(where.substr(0, colon));
+        }
+    }
+    return result;
+}
+
+unsigned int WhereOf(const Settings& settings) {
+    const bool daemon = TransportOf(settings) == Transport::DAEMON;
+    return (daemon ? DAEMON : SSH) | (settings.is_command ? COMMAND : COPY);
+}
+
+// Runs that came so far that names of files stand in the words: a file may be called "Connection
+// refused".
+bool CameToFiles(int exit_code) {
+    return exit_code == kExitFileIo || exit_code == kExitPartial || exit_code == kExitVanished;
+}
+
+// In a copy that ran to its end every complaint of the sending half is about the source.
+constexpr std::string_view kSourceComplaint = "[sender] ";
+
+bool IsUnreadableSource(const RunFacts& facts) {
+    return facts.exit_code == kExitPartial && !facts.settings.is_command &&
+           !facts.settings.list_only && Contains(facts.messages, kSourceComplaint);
+}
+
+Verdict UnreadableSource(const RunFacts& facts) {
+    const std::string_view messages = facts.messages;
+    std::string line = "the source cannot be read in full: " +
+                       std::string(LineAt(messages, messages.find(kSourceComplaint)));
+    if (facts.settings.delete_missing) {
+        line += "; nothing was deleted at the destination";
+    }
+    return {facts.exit_code, RunCause::NONE, line};
+}
+
+Verdict FromWords(const RunFacts& facts, int status) {
+    const unsigned int where = WhereOf(facts.settings);
+    const std::string_view messages = facts.messages;
+    const bool connected = CameToFiles(status);
+    if ((where & SSH) != 0 && !connected) {
+        if (Contains(messages, "Host key verification failed") ||
+            Contains(messages, "HOST IDENTIFICATION HAS CHANGED")) {
+            return {STATUS_AUTHENTICATION, RunCause::NONE, ChangedHostKey(facts)};
+        }
+        if (IsRefusedSshLogin(messages)) {
+            return {
+                STATUS_AUTHENTICATION, RunCause::NONE,
+                Fill("the ssh login of '{user}' at {host} was refused: wrong account or password",
+                     facts, "")};
+        }
+    }
+    for (const Clue& clue : kClues) {
+        const size_t position = messages.find(clue.words);
+        const bool about_connection = (clue.where & (DAEMON | SSH)) != 0;
+        if ((clue.where & where) != 0 && position != std::string_view::npos &&
+            !(connected && about_connection)) {
+            return {clue.status == kKeepStatus ? status : clue.status,
+                    clue.words == kUnknownModule ? RunCause::UNKNOWN_MODULE : RunCause::NONE,
+                    Fill(clue.meaning, facts, LineAt(messages, position))};
+        }
+    }
+    for (const ExitMeaning& meaning : kExitMeanings) {
+        if (meaning.code == status) {
+            return {status, RunCause::NONE, Fill(meaning.meaning, facts, "")};
+        }
+    }
+    return {status, RunCause::NONE, "rsync failed with exit code " + std::to_string(status)};
+}
+
+}  // namespace
+
+Verdict Judge(const RunFacts& facts) {
+    if (IsUnreadableSource(facts)) {
+        return UnreadableSource(facts);
+    }
+    // These two say all by their number: what else was written has no part in it.
+    const bool plain = facts.exit_code == kExitVanished || facts.exit_code == STATUS_TIMEOUT;
+    return FromWords(plain ? RunFacts{facts.settings, facts.config, facts.exit_code, ""} : facts,
+                     facts.exit_code == kExitSsh ? STATUS_SOCKET : facts.exit_code);
+}
+
+RefusedAttributes FindRefusedAttributes(const RunFacts& facts) {
+    const std::string_view messages = facts.messages;
+    RefusedAttributes refused;
+    switch (facts.exit_code) {
+        // An rsync built without them, here or there, or a daemon that is configured to refuse
+        // them.
+        case STATUS_SYNTAX:
+        case kExitUnsupported:
+            refused.acls =
+                Contains(messages, "ACLs are not supported") || Contains(messages, "--acls");
+            refused.xattrs = Contains(messages, "xtended attributes are not supported") ||
+                             Contains(messages, "--xattrs");
+            break;
+        // A file system that has none.
+        case kExitPartial: {
+            const bool unsupported = Contains(messages, "Operation not supported");
+            refused.acls = unsupported && Contains(messages, "set_acl");
+            refused.xattrs = unsupported && Contains(messages, "xattr");
+            break;
+        }
+        default:
+            break;
+    }
+    return refused;
+}
+
+}  // namespace Backup
+}  // namespace TARQ

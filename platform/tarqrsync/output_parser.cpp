@@ -1,0 +1,276 @@
+#include "platform/tarqrsync/output_parser.h"
+
+#include <algorithm>
+#include <array>
+#include <charconv>
+
+#include "platform/tarqrsync/arguments.h"
+
+namespace TARQ {
+namespace Backup {
+
+namespace {
+
+// Progress comes with each file: a listener hears of it no more often than this.
+constexpr std::chrono::milliseconds kProgressInterval(200);
+// A name of PATH_MAX bytes, each escaped as four, and the figures before it.
+constexpr size_t kMaxLine = 64 * 1024;
+constexpr size_t kMaxOtherText = 4096;
+
+constexpr std::string_view kDeleting = "*deleting";
+// The letters that tell what happens to an entry, and of which kind it is.
+constexpr size_t kItemizeWidth = 11;
+
+// A reader of the words and numbers of a line.
+class Scanner {
+public:
+    explicit Scanner(std::string_view text) : text_(text) {}
+
+    Scanner& SkipSpaces() {
+        text_.remove_prefix(std::min(text_.find_first_not_of(' '), text_.size()));
+        return *this;
+    }
+
+    bool Literal(std::string_view expected) {
+        if (text_.substr(0, expected.size()) != expected) {
+            return false;
+        }
+        text_.remove_prefix(expected.size());
+        return true;
+    }
+
+    template <typename Number>
+    bool Read(Number* value) {
+        const auto [rest, error] =
+            std::from_chars(text_.data(), text_.data() + text_.size(), *value);
+        if (error != std::errc()) {
+            return false;
+        }
+        text_.remove_prefix(static_cast<size_t>(rest - text_.data()));
+        return true;
+    }
+
+    std::string_view Word() {
+        const std::string_view word = text_.substr(0, std::min(text_.find(' '), text_.size()));
+        text_.remove_prefix(word.size());
+        return word;
+    }
+
+    std::string_view Take(size_t count) {
+        const std::string_view taken = text_.substr(0, count);
+        text_.remove_prefix(taken.size());
+        return taken;
+    }
+
+    std::string_view Rest() const { return text_; }
+
+private:
+    std::string_view text_;
+};
+
+// "9.78MB/s": two decimals, in units of 1024.
+bool ReadRate(Scanner* scanner, uint64_t* bytes_per_second) {
+    double number = 0;
+    if (!scanner->Read(&number) || !(number >= 0)) {
+        return false;
+    }
+    constexpr std::string_view kUnits = "kMGT";
+    const size_t unit = kUnits.find(scanner->Take(1));
+    if (unit == std::string_view::npos || !scanner->Literal("B/s")) {
+        return false;
+    }
+    for (size_t i = 0; i <= unit; ++i) {
+        number *= 1024;
+    }
+    constexpr double kLargest = 1e18;
+    *bytes_per_second = static_cast<uint64_t>(std::min(number, kLargest));
+    return true;
+}
+
+struct Figure {
+    std::string_view label;
+    uint64_t RunReport::*member;
+};
+
+constexpr std::array<Figure, 6> kFigures = {{
+    {"Number of files: ", &RunReport::files_total},
+    {"Number of regular files transferred: ", &RunReport::files_sent},
+    {"Number of deleted files: ", &RunReport::files_deleted},
+    {"Total file size: ", &RunReport::bytes_total},
+    {"Total bytes sent: ", &RunReport::bytes_sent},
+    {"Total bytes received: ", &RunReport::bytes_received},
+}};
+
+bool IsOctal(char c) {
+    return c >= '0' && c <= '7';
+}
+
+}  // namespace
+
+OutputParser::OutputParser(const RunOptions& options, bool listing)
+    : options_(options), listing_(listing) {}
+
+void OutputParser::Feed(std::string_view bytes) {
+    while (!bytes.empty()) {
+        // Progress lines end in a carriage return and overwrite each other.
+        const size_t end = bytes.find_first_of("\r\n");
+        const std::string_view piece = bytes.substr(0, end);
+        if (line_.size() + piece.size() > kMaxLine) {
+            line_dropped_ = true;
+            line_.clear();
+        } else if (!line_dropped_) {
+            line_ += piece;
+        }
+        if (end == std::string_view::npos) {
+            return;
+        }
+        bytes.remove_prefix(end + 1);
+        if (!line_dropped_) {
+            TakeLine(line_);
+        }
+        line_.clear();
+        line_dropped_ = false;
+    }
+}
+
+void OutputParser::Finish() {
+    Feed("\n");
+    if (held_back_) {
+        options_.on_progress(*held_back_);
+        held_back_.reset();
+    }
+}
+
+void OutputParser::FillReport(RunReport* report) const {
+    for (const Figure& figure : kFigures) {
+        report->*figure.member = figures_.*figure.member;
+    }
+}
+
+void OutputParser::TakeLine(std::string_view line) {
+    const bool known =
+        TakeProgress(line) || TakeChange(line) || TakeListed(line) || TakeFigure(line);
+    if (!known && !line.empty() && other_text_.size() + line.size() < kMaxOtherText) {
+        other_text_.append(line).append("\n");
+    }
+}
+
+// "   21004288  66%    9.77MB/s    0:00:01 (xfr#1, to-chk=4/6)"; the last part comes with each
+// file's end, and says ir-chk until all files are known.
+bool OutputParser::TakeProgress(std::string_view line) {
+    if (!options_.on_progress) {
+        return false;
+    }
+    Scanner scanner(line);
+    RunProgress now = progress_;
+    if (!scanner.SkipSpaces().Read(&now.bytes_done) || !scanner.SkipSpaces().Read(&now.percent) ||
+        !scanner.Literal("%") || !ReadRate(&scanner.SkipSpaces(), &now.bytes_per_second)) {
+        return false;
+    }
+    now.percent = std::min(now.percent, 100U);
+    scanner.SkipSpaces().Word();  // the time left, which is the listener's to work out
+    uint64_t sent = 0;
+    if (scanner.SkipSpaces().Literal("(xfr#") && scanner.Read(&sent) && scanner.Literal(", ")) {
+        now.totals_final = scanner.Literal("to-chk=");
+        if ((now.totals_final || scanner.Literal("ir-chk=")) && scanner.Read(&now.files_left) &&
+            scanner.Literal("/")) {
+            scanner.Read(&now.files_total);
+        }
+    }
+    progress_ = now;
+    const auto time = std::chrono::steady_clock::now();
+    if (time < next_progress_) {
+        held_back_ = now;
+        return true;
+    }
+    next_progress_ = time + kProgressInterval;
+    held_back_.reset();
+    options_.on_progress(now);
+    return true;
+}
+
+// "@@ <f+++++++++ 31457280 folder/name", "@@ *deleting   0 name".
+bool OutputParser::TakeChange(std::string_view line) {
+    Scanner scanner(line);
+    if (!options_.on_change || !scanner.Literal(kChangeMark)) {
+        return false;
+    }
+    const std::string_view itemized = scanner.Take(kItemizeWidth);
+    RunChange change;
+    if (!scanner.Literal(" ") || !scanner.Read(&change.length) || !scanner.Literal(" ")) {
+        return false;
+    }
+    change.path = UnescapeName(scanner.Rest());
+    if (itemized.substr(0, kDeleting.size()) == kDeleting) {
+        change.kind = RunChange::DELETE;
+    } else if (itemized[0] == '<' || itemized[0] == '>') {
+        change.kind = RunChange::SEND;
+    }
+    if (change.kind != RunChange::SEND) {
+        change.length = 0;
+    }
+    options_.on_change(change);
+    return true;
+}
+
+// "-rw-r--r--    31457280 2026/11/21 11:37:51 folder/name".
+bool OutputParser::TakeListed(std::string_view line) {
+    if (!listing_) {
+        return false;
+    }
+    Scanner scanner(line);
+    const std::string_view mode = scanner.Word();
+    RunChange entry;
+    if (mode.size() < 10 || !scanner.SkipSpaces().Read(&entry.length)) {
+        return false;
+    }
+    scanner.SkipSpaces().Word();
+    scanner.SkipSpaces().Word();
+    if (!scanner.Literal(" ")) {
+        return false;
+    }
+    entry.path = UnescapeName(scanner.Rest());
+    entry.kind = mode[0] == '-' ? RunChange::SEND : RunChange::OTHER;
+    if (entry.kind != RunChange::SEND) {
+        entry.length = 0;
+    }
+    if (options_.on_change) {
+        options_.on_change(entry);
+    }
+    return true;
+}
+
+bool OutputParser::TakeFigure(std::string_view line) {
+    if (options_.report == nullptr) {
+        return false;
+    }
+    for (const Figure& figure : kFigures) {
+        Scanner scanner(line);
+        uint64_t value = 0;
+        if (scanner.Literal(figure.label) && scanner.Read(&value)) {
+            figures_.*figure.member = value;
+            return true;
+        }
+    }
+    return false;
+}
+
+std::string UnescapeName(std::string_view name) {
+    constexpr size_t kEscapeSize = 5;
+    std::string result;
+    result.reserve(name.size());
+    while (!name.empty()) {
+        if (name.size() >= kEscapeSize && name[0] == '\\' && name[1] == '#' && name[2] <= '3' &&
+            IsOctal(name[2]) && IsOctal(name[3]) && IsOctal(name[4])) {
+            result += static_cast<char>((name[2] - '0') * 64 + (name[3] - '0') * 8 + name[4] - '0');
+            name.remove_prefix(kEscapeSize);
+        } else {
+            result += name[0];
+            name.remove_prefix(1);
+        }
+    }
+    return result;
+}
+
+}  // namespace Backup
+}  // namespace TARQ

@@ -1,0 +1,55 @@
+#pragma once
+
+#include <chrono>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "tarq/rsync_wrapper.h"
+
+namespace TARQ {
+namespace Backup {
+
+/// Reads what rsync writes to its standard output: progress, changes, listed files and closing
+/// figures. Hands them on as they come, and keeps the text of lines that are none of these.
+class OutputParser {
+public:
+    /// `options` must outlive the parser. `listing`: the run lists files, each of which is handed
+    /// on as a change.
+    OutputParser(const RunOptions& options, bool listing);
+
+    /// Takes the next piece of output, of any size.
+    void Feed(std::string_view bytes);
+    /// The output has ended: a last line without a newline counts, progress that was held back is
+    /// handed on.
+    void Finish();
+
+    /// The closing figures, as far as they were seen; status and explanation are left alone.
+    void FillReport(RunReport* report) const;
+    /// The start of all other lines, at most a few KiB.
+    const std::string& OtherText() const { return other_text_; }
+
+private:
+    void TakeLine(std::string_view line);
+    bool TakeProgress(std::string_view line);
+    bool TakeChange(std::string_view line);
+    bool TakeListed(std::string_view line);
+    bool TakeFigure(std::string_view line);
+
+    const RunOptions& options_;
+    const bool listing_;
+    std::string line_;           // the start of a line whose end has not come
+    bool line_dropped_ = false;  // that line is too long to mean anything
+    std::optional<RunProgress> held_back_;
+    RunProgress progress_;
+    std::chrono::steady_clock::time_point next_progress_;
+    RunReport figures_;
+    std::string other_text_;
+};
+
+/// A name as rsync writes it, with its \#ooo escapes turned back into the bytes that they stand
+/// for.
+std::string UnescapeName(std::string_view name);
+
+}  // namespace Backup
+}  // namespace TARQ

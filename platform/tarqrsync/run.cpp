@@ -1,0 +1,345 @@
+#include "platform/tarqrsync/run.h"
+
+#include <fcntl.h>
+#include <sys/inotify.h>
+#include <sys/random.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <charconv>
+#include <cstring>
+
+#include "platform/internal/child_process.h"
+#include "platform/internal/proc_stat.h"
+#include "platform/internal/unique_fd.h"
+#include "platform/tarqrsync/answer_file.h"
+#include "platform/tarqrsync/message_keeper.h"
+#include "tarq/root_path.h"
+
+namespace TARQ {
+namespace Backup {
+
+namespace {
+
+using tarq_internal::ChildResult;
+using tarq_internal::ChildSpec;
+
+constexpr char kLogPath[] = "/var/log/tarqrsync.log";
+constexpr off_t kMaxLogBytes = 1024 * 1024;
+// A command's rsync writes the answer and, to a log that was below its limit before, a few lines.
+constexpr uint64_t kMaxCommandFileBytes = kMaxAnswerBytes;
+
+// rsync's own codes: a file cannot be written; a child was killed by a signal; a child was reaped
+// by somebody else.
+constexpr int kStatusFileIo = 11;
+constexpr int kStatusKilled = 16;
+constexpr int kStatusLostChild = 21;
+
+using Version = std::array<int, 3>;
+constexpr Version kOldestRsync = {3, 2, 1};
+
+// The log's path when rsync can write there, else empty: a run without its log is better than none.
+std::string PrepareLog() {
+    const std::string path = RootPath(kLogPath);
+    struct stat info;
+    if (stat(path.c_str(), &info) == 0 && info.st_size >= kMaxLogBytes) {
+        rename(path.c_str(), (path + ".1").c_str());
+    }
+    const tarq_internal::UniqueFd log(open(
+        path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0640));
+    const bool usable =
+        log && fstat(log.Get(), &info) == 0 && S_ISREG(info.st_mode) && info.st_size < kMaxLogBytes;
+    return usable ? path : "";
+}
+
+std::string RandomSession() {
+    std::array<unsigned char, 16> bytes;
+    // Up to 256 bytes come whole or not at all.
+    if (getrandom(bytes.data(), bytes.size(), 0) != static_cast<ssize_t>(bytes.size())) {
+        throw PrivateFileError("no random numbers for a session");
+    }
+    std::string session;
+    for (const unsigned char byte : bytes) {
+        session += "0123456789abcdef"[byte >> 4];
+        session += "0123456789abcdef"[byte & 15];
+    }
+    return session;
+}
+
+std::string PathVariable(const std::vector<std::string>& environment) {
+    for (const std::string& variable : environment) {
+        if (variable.compare(0, 5, "PATH=") == 0) {
+            return variable.substr(5);
+        }
+    }
+    return "";
+}
+
+// The number in "rsync  version 3.2.7  protocol version 31"; empty when the program does not say.
+std::string AskVersion(const ChildSpec& used) {
+    ChildSpec spec;
+    spec.program = used.program;
+    spec.arguments = {used.program, "--version"};
+    spec.environment = used.environment;
+    std::string text;
+    tarq_internal::RunChild(
+        spec, nullptr, [&text](const char* bytes, size_t size) { text.append(bytes, size); },
+        nullptr);
+    const std::string head = "rsync  version ";
+    if (text.compare(0, head.size(), head) != 0) {
+        return "";
+    }
+    return text.substr(head.size(), text.find(' ', head.size()) - head.size());
+}
+
+bool IsTooOld(const std::string& text) {
+    Version version = {};
+    const char* position = text.data();
+    const char* const end = text.data() + text.size();
+    for (int& part : version) {
+        const auto [rest, error] = std::from_chars(position, end, part);
+        if (error != std::errc()) {
+            return false;
+        }
+        position = rest < end && *rest == '.' ? rest + 1 : rest;
+    }
+    return version < kOldestRsync;
+}
+
+bool IsMissing(const std::string& path) {
+    struct stat info;
+    return lstat(path.c_str(), &info) != 0 && (errno == ENOENT || errno == ENOTDIR);
+}
+
+// The first child of `parent`, if it was made soon after its parent; else -1.
+pid_t FindChild(pid_t parent) {
+    constexpr pid_t kSoon = 256;
+    for (pid_t pid = parent + 1; pid <= parent + kSoon; ++pid) {
+        const auto stat = tarq_internal::ReadProcStat(pid);
+        if (stat && stat->parent == parent) {
+            return pid;
+        }
+    }
+    return -1;
+}
+
+// rsync receives in a child, which renames the answer into place once it has checked it, and ends
+// when the connection's last words are said. The parent then sleeps for 20 ms before it looks
+// whether the child is gone: half of what a command costs. The watch sees both and lets the
+// run end there. Where it cannot see them the run ends by itself.
+class AnswerWatch {
+public:
+    AnswerWatch(const std::string& folder, const std::string& answer_file)
+        : answer_file_(answer_file), notify_(inotify_init1(IN_CLOEXEC | IN_NONBLOCK)) {
+        if (notify_ && inotify_add_watch(notify_.Get(), folder.c_str(), IN_MOVED_TO) < 0) {
+            notify_.Reset();
+        }
+    }
+
+    tarq_internal::EarlyEnd End() {
+        return {notify_.Get(), [this](pid_t rsync) { return IsOver(rsync); }};
+    }
+
+private:
+    bool IsOver(pid_t rsync) {
+        if (IsMissing(answer_file_)) {
+            return false;
+        }
+        if (receiver_ < 0) {
+            receiver_ = FindChild(rsync);
+        }
+        if (receiver_ < 0) {
+            return false;
+        }
+        const auto stat = tarq_internal::ReadProcStat(receiver_);
+        return !stat || stat->state == 'Z';
+    }
+
+    std::string answer_file_;
+    tarq_internal::UniqueFd notify_;
+    pid_t receiver_ = -1;
+};
+
+}  // namespace
+
+int Run::Execute(const std::function<bool()>& cancelled) {
+    try {
+        outcome_.status = Attempt(cancelled);
+    } catch (const PrivateFileError& error) {
+        outcome_.status = Fail(kStatusFileIo, error.what());
+    }
+    return outcome_.status;
+}
+
+int Run::Attempt(const std::function<bool()>& cancelled) {
+    const std::string refusal = RefusalOf(settings_);
+    if (!refusal.empty()) {
+        const bool lacks_account = settings_.user.empty() && settings_.account_required;
+        return Fail(lacks_account ? STATUS_AUTHENTICATION : STATUS_SYNTAX, refusal);
+    }
+    const std::string fault = ReadConfig(&config_);
+    if (!fault.empty()) {
+        return Fail(STATUS_SYNTAX, fault);
+    }
+    if (settings_.debug_log) {
+        log_file_ = PrepareLog();
+    }
+    return settings_.is_command ? RunCommand(cancelled) : RunCopy(cancelled);
+}
+
+int Run::RunCommand(const std::function<bool()>& cancelled) {
+    const std::string session = RandomSession();
+    std::string text = "session=\"" + session + "\"\n";
+    for (const std::string& line : settings_.command) {
+        text += line + "\n";
+    }
+    if (text.size() > kMaxCommandBytes) {
+        return Fail(STATUS_COMMAND_TOO_LONG,
+                    "the command has " + std::to_string(text.size()) +
+                        " bytes and rsync carries no more than " +
+                        std::to_string(kMaxCommandBytes) +
+                        ": it was not sent; name fewer or shorter shares in one command");
+    }
+    const RunOptions no_options;
+    OutputParser parser(no_options, /*listing=*/false);
+    const std::string answer_file = folder_.Path("answer");
+    const InvocationContext context = {settings_, config_, no_options, false, false, log_file_};
+    const Invocation invocation =
+        CommandInvocation(context, folder_.Write("command", text), session, answer_file, &folder_);
+    AnswerWatch watch(folder_.Path(""), answer_file);
+    ChildLimits limits = {kMaxCommandFileBytes, {}};
+    if (TransportOf(settings_) == Transport::DAEMON) {  // else rsync has other children
+        limits.early_end = watch.End();
+    }
+    const int status = RunRsync(cancelled, invocation, &parser, limits);
+    // rsync tells on its standard output what it did not take for an answer, a link for example.
+    messages_ += parser.OtherText();
+    return status == STATUS_DONE ? TakeAnswer(answer_file) : status;
+}
+
+int Run::TakeAnswer(const std::string& answer_file) {
+    const std::string& host = settings_.host;
+    std::string text;
+    Answer answer;
+    if (!ReadAnswerFile(answer_file, &text)) {
+        return Fail(STATUS_PROTOCOL_STREAM,
+                    host + " answered with something that is no file, or one larger than " +
+                        std::to_string(kMaxAnswerBytes) + " bytes");
+    }
+    if (!ParseAnswer(text, &answer)) {
+        return Fail(STATUS_PROTOCOL_STREAM,
+                    "the answer of " + host + " does not begin with a status");
+    }
+    const std::string outfile = OutfileOf(settings_.command);
+    if (!outfile.empty() && !WriteOutfile(outfile, std::string(answer.content))) {
+        return Fail(kStatusFileIo, "the answer of " + host + " cannot be written to " + outfile +
+                                       ": " + strerror(errno));
+    }
+    if (answer.status != STATUS_DONE) {
+        Fail(answer.status,
+             host + " answered the command with status " + std::to_string(answer.status));
+    }
+    return answer.status;
+}
+
+int Run::RunCopy(const std::function<bool()>& cancelled) {
+    if (!settings_.list_only && IsMissing(settings_.source)) {
+        return Fail(STATUS_FILE_SELECT, "the source " + settings_.source + " does not exist");
+    }
+    InvocationContext context = {settings_,     config_,       options_,
+                                 settings_.acl, settings_.acl, log_file_};
+    while (true) {
+        OutputParser parser(options_, settings_.list_only);
+        PrivateFolder files;
+        const int status = RunRsync(cancelled, CopyInvocation(context, &files), &parser, {});
+        parser.Finish();
+        parser.FillReport(&outcome_);
+        const RefusedAttributes refused = FindRefusedAttributes(Facts(status));
+        const bool less = (context.acls && refused.acls) || (context.xattrs && refused.xattrs);
+        if (status == STATUS_DONE || !less) {
+            return status;
+        }
+        context.acls = context.acls && !refused.acls;
+        context.xattrs = context.xattrs && !refused.xattrs;
+        syslog(LOG_NOTICE, "tarqrsync: %s cannot keep %s of %s: copying without",
+               settings_.host.c_str(),
+               refused.acls ? "the access control lists" : "the extended attributes",
+               settings_.source.c_str());
+    }
+}
+
+// Runs one rsync; after a failure the explanation is there.
+int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invocation,
+                  OutputParser* parser, const ChildLimits& limits) {
+    outcome_.explanation.clear();
+    messages_.clear();
+    ChildSpec spec;
+    spec.program = tarq_internal::FindProgram(config_.rsync, PathVariable(invocation.environment));
+    spec.arguments = invocation.arguments;
+    spec.arguments.insert(spec.arguments.begin(), config_.rsync);
+    spec.environment = invocation.environment;
+    spec.input = invocation.input;
+    spec.max_file_bytes = limits.max_file_bytes;
+    if (spec.program.empty()) {
+        return Fail(STATUS_RSYNC_MISSING, "the program " + config_.rsync + " is not installed");
+    }
+
+    MessageKeeper keeper;
+    const ChildResult result = tarq_internal::RunChild(
+        spec, cancelled,
+        [parser](const char* bytes, size_t size) {
+            parser->Feed({bytes, size});
+        },
+        [&keeper](const char* bytes, size_t size) {
+            keeper.Feed({bytes, size});
+        },
+        limits.early_end);
+    messages_ = keeper.Text();
+    if (result.start_error != 0) {
+        return Fail(STATUS_RSYNC_MISSING, "the program " + spec.program + " cannot be started: " +
+                                              strerror(result.start_error));
+    }
+    if (result.cancelled) {
+        return Fail(STATUS_CANCELLED, "the run was cancelled");
+    }
+    if (result.ended_early) {
+        return STATUS_DONE;
+    }
+    if (result.wait_status == -1) {
+        return Fail(kStatusLostChild,
+                    "rsync ended and its exit code went to another part of this program");
+    }
+    if (WIFSIGNALED(result.wait_status)) {
+        return Fail(kStatusKilled,
+                    "rsync was killed by signal " + std::to_string(WTERMSIG(result.wait_status)));
+    }
+    const int exit_code = WEXITSTATUS(result.wait_status);
+    if (exit_code == STATUS_DONE) {
+        return STATUS_DONE;
+    }
+    if (exit_code == STATUS_SYNTAX && messages_.find("unknown option") != std::string::npos) {
+        const std::string version = AskVersion(spec);
+        if (IsTooOld(version)) {
+            return Fail(STATUS_SYNTAX, spec.program + " is rsync " + version +
+                                           ", which is too old: version 3.2.1 or later is needed");
+        }
+    }
+    const Verdict verdict = Judge(Facts(exit_code));
+    outcome_.cause = verdict.cause;
+    return Fail(verdict.status, verdict.first_line);
+}
+
+int Run::Fail(int status, const std::string& first_line) {
+    outcome_.explanation = messages_.empty() ? first_line : first_line + "\n" + messages_;
+    while (!outcome_.explanation.empty() && outcome_.explanation.back() == '\n') {
+        outcome_.explanation.pop_back();
+    }
+    return status;
+}
+
+}  // namespace Backup
+}  // namespace TARQ

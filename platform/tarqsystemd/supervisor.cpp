@@ -1,0 +1,199 @@
+#include "platform/tarqsystemd/supervisor.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/file.h>
+#include <tarq/core.h>
+#include <tarq/root_path.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <charconv>
+#include <chrono>
+#include <cstdio>
+#include <optional>
+#include <sstream>
+#include <vector>
+
+#include "platform/internal/config.h"
+#include "platform/internal/unique_fd.h"
+#include "platform/tarqsystemd/process.h"
+
+namespace tarq_systemd {
+namespace {
+
+using std::chrono::seconds;
+using tarq_internal::ReadResult;
+using tarq_internal::UniqueFd;
+
+constexpr char kConfiguration[] = "/usr/tarq/etc/tarqsystemd.conf";
+constexpr char kRunFolder[] = "/var/run/";
+constexpr seconds kStopLimit(30);
+constexpr int kLongestStopLimit = 24 * 60 * 60;
+constexpr seconds kKillLimit(10);  // for the kernel to take down what no longer has a say in it
+
+std::string PidFile(const std::string& unit) {
+    return TARQ::RootPath(kRunFolder + unit + ".pid");
+}
+
+/// The right to change a unit's state, among all processes; waits for it.
+class UnitLock {
+public:
+    explicit UnitLock(const std::string& unit)
+        : file_(open(TARQ::RootPath(kRunFolder + unit + ".lock").c_str(),
+                     O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600)) {
+        while (file_ && !locked_) {
+            locked_ = flock(file_.Get(), LOCK_EX) == 0;
+            if (!locked_ && errno != EINTR) {
+                break;
+            }
+        }
+    }
+    explicit operator bool() const { return locked_; }
+
+private:
+    UniqueFd file_;
+    bool locked_ = false;
+};
+
+/// The unit's process when it runs. False, with errno set, when that cannot be found out.
+bool FindProcess(const std::string& unit, std::optional<Process>* process) {
+    const auto text = tarq_internal::ReadTextFile(PidFile(unit));
+    if (!text) {
+        return errno == ENOENT;
+    }
+    ProcessId id;
+    if (std::istringstream(*text) >> id.pid >> id.start_time) {
+        *process = Process::Open(id);
+    }
+    return true;
+}
+
+/// In one step, so that a reader never sees half a number.
+bool WritePidFile(const std::string& unit, const ProcessId& id) {
+    const std::string path = PidFile(unit);
+    const std::string draft = path + ".new";
+    const std::string text = std::to_string(id.pid) + "\n" + std::to_string(id.start_time) + "\n";
+    const UniqueFd file(
+        open(draft.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0644));
+    if (!file) {
+        return false;
+    }
+    const ssize_t written = write(file.Get(), text.data(), text.size());
+    if (written != static_cast<ssize_t>(text.size())) {
+        errno = written < 0 ? errno : ENOSPC;
+        return false;
+    }
+    return rename(draft.c_str(), path.c_str()) == 0;
+}
+
+/// The words of the unit's command; none, with the error code set, when it has no command that
+/// could be run.
+std::vector<std::string> ReadCommand(const std::string& unit) {
+    tarq_internal::Section section;
+    const ReadResult result =
+        tarq_internal::ReadSection(TARQ::RootPath(kConfiguration), unit, &section);
+    const auto command = section.find("command");
+    if (result == ReadResult::kFailed) {
+        return {};
+    }
+    if (command == section.end()) {
+        Failed(result == ReadResult::kFound ? TARQ_ERR_NO_KEY : TARQ_ERR_NO_SECTION);
+        return {};
+    }
+    std::vector<std::string> words =
+        SplitCommand(command->second).value_or(std::vector<std::string>());
+    if (words.empty() || words[0].empty() || words[0][0] != '/') {
+        Failed(TARQ_ERR_BAD_PARAMETER);
+        return {};
+    }
+    return words;
+}
+
+/// False, with the error code set, when what is configured is no number of seconds.
+bool ReadStopLimit(const std::string& unit, seconds* limit) {
+    std::string text;
+    switch (tarq_internal::ReadValue(TARQ::RootPath(kConfiguration), unit, "stop_seconds", &text)) {
+        case ReadResult::kFailed:
+            return false;
+        case ReadResult::kAbsent:
+            *limit = kStopLimit;
+            return true;
+        case ReadResult::kFound:
+            break;
+    }
+    int number = -1;
+    const char* end = text.data() + text.size();
+    const auto [stop, error] = std::from_chars(text.data(), end, number);
+    if (error != std::errc() || stop != end || number < 0 || number > kLongestStopLimit) {
+        Failed(TARQ_ERR_BAD_PARAMETER);
+        return false;
+    }
+    *limit = seconds(number);
+    return true;
+}
+
+}  // namespace
+
+Status Supervisor::StatusOf(const std::string& unit) {
+    std::optional<Process> process;
+    if (!FindProcess(unit, &process)) {
+        Failed(TARQ_ERR_SERVICE);
+        return Status::kUnknown;
+    }
+    return process ? Status::kActive : Status::kInactive;
+}
+
+Outcome Supervisor::Start(const std::string& unit) {
+    const UnitLock lock(unit);
+    std::optional<Process> process;
+    if (!lock || !FindProcess(unit, &process)) {
+        return Failed(TARQ_ERR_SERVICE);
+    }
+    if (process) {
+        return Outcome::kDone;
+    }
+    const std::vector<std::string> command = ReadCommand(unit);
+    if (command.empty()) {
+        return Outcome::kFailed;
+    }
+    // The number is on record before the command runs: whatever ends us here, no command runs that
+    // nobody can stop.
+    auto launch = BackgroundLaunch::Prepare(command);
+    if (!launch || !WritePidFile(unit, launch->Id())) {
+        return Failed(TARQ_ERR_SERVICE);
+    }
+    if (!launch->Release()) {
+        const int reason = errno;
+        unlink(PidFile(unit).c_str());
+        errno = reason;
+        return Failed(TARQ_ERR_SERVICE);
+    }
+    return Outcome::kDone;
+}
+
+Outcome Supervisor::Stop(const std::string& unit) {
+    const UnitLock lock(unit);
+    std::optional<Process> process;
+    if (!lock || !FindProcess(unit, &process)) {
+        return Failed(TARQ_ERR_SERVICE);
+    }
+    if (process) {
+        seconds limit;
+        if (!ReadStopLimit(unit, &limit)) {
+            return Outcome::kFailed;
+        }
+        if (!process->Signal(SIGTERM)) {
+            return Failed(TARQ_ERR_SERVICE);
+        }
+        if (!process->WaitForEnd(limit) &&
+            (!process->KillGroup() || !process->WaitForEnd(kKillLimit))) {
+            errno = ETIMEDOUT;
+            return Failed(TARQ_ERR_SERVICE);
+        }
+    }
+    unlink(PidFile(unit).c_str());
+    return Outcome::kDone;
+}
+
+}  // namespace tarq_systemd

@@ -1,0 +1,93 @@
+#include "programs/common/terminal.h"
+
+#include <termios.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+#include <iostream>
+
+namespace programs {
+
+namespace {
+
+constexpr size_t kMaxPassword = 255;
+
+// Switches a terminal's echo off while it lives.
+class NoEcho {
+public:
+    explicit NoEcho(int fd) : fd_(fd) {
+        if (tcgetattr(fd_, &saved_) == 0) {
+            struct termios silent = saved_;
+            silent.c_lflag &= ~static_cast<tcflag_t>(ECHO);
+            restore_ = tcsetattr(fd_, TCSAFLUSH, &silent) == 0;
+        }
+    }
+    ~NoEcho() {
+        if (restore_) {
+            tcsetattr(fd_, TCSAFLUSH, &saved_);
+        }
+    }
+    NoEcho(const NoEcho&) = delete;
+    NoEcho& operator=(const NoEcho&) = delete;
+
+private:
+    int fd_;
+    struct termios saved_ = {};
+    bool restore_ = false;
+};
+
+bool ReadLine(std::istream& stream, std::string& line) {
+    if (!std::getline(stream, line)) {
+        return false;
+    }
+    if (!line.empty() && line.back() == '\r') {
+        line.pop_back();
+    }
+    return true;
+}
+
+bool TypeAtTerminal(const std::string& prompt, std::string& line) {
+    std::fputs(prompt.c_str(), stderr);
+    const NoEcho silent(STDIN_FILENO);
+    const bool read = ReadLine(std::cin, line);
+    std::fputc('\n', stderr);
+    return read;
+}
+
+}  // namespace
+
+std::optional<std::string> ReadPassword(const std::string& file, const std::string& prompt,
+                                        std::string& error) {
+    std::string line;
+    if (file.empty()) {
+        if (isatty(STDIN_FILENO) == 0) {
+            error = "no password: give --password-file FILE, or '-' to read it from standard input";
+            return std::nullopt;
+        }
+        if (!TypeAtTerminal(prompt, line)) {
+            error = "no password was typed";
+            return std::nullopt;
+        }
+    } else if (file == "-") {
+        if (!ReadLine(std::cin, line)) {
+            error = "no password on standard input";
+            return std::nullopt;
+        }
+    } else {
+        std::ifstream stream(file);
+        if (!stream || !ReadLine(stream, line)) {
+            error = "cannot read a password from '" + file + "': " + std::strerror(errno);
+            return std::nullopt;
+        }
+    }
+    if (line.empty() || line.size() > kMaxPassword) {
+        error = "a password has 1 to 255 characters";
+        return std::nullopt;
+    }
+    return line;
+}
+
+}  // namespace programs

@@ -1,0 +1,14 @@
+#pragma once
+
+#include <optional>
+#include <string>
+
+namespace programs {
+
+/// A password: from the first line of `file` ("-": standard input), or, when `file` is empty, typed
+/// at the terminal without echo. Nothing when there is none to be had; the reason is then in
+/// `error`.
+std::optional<std::string> ReadPassword(const std::string& file, const std::string& prompt,
+                                        std::string& error);
+
+}  // namespace programs

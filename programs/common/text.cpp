@@ -1,0 +1,100 @@
+#include "programs/common/text.h"
+
+#include <charconv>
+#include <cstdio>
+#include <ctime>
+#include <fstream>
+
+namespace programs {
+
+std::optional<uint64_t> ParseNumber(const std::string& value, uint64_t max) {
+    uint64_t number = 0;
+    const char* const end = value.data() + value.size();
+    const auto [stopped, error] = std::from_chars(value.data(), end, number);
+    if (error != std::errc() || stopped != end || number > max) {
+        return std::nullopt;
+    }
+    return number;
+}
+
+std::string HumanBytes(uint64_t bytes) {
+    static const char* const units[] = {"B", "KiB", "MiB", "GiB", "TiB", "PiB", "EiB"};
+    size_t unit = 0;
+    double value = static_cast<double>(bytes);
+    while (value >= 1024 && unit + 1 < std::size(units)) {
+        value /= 1024;
+        ++unit;
+    }
+    char text[32];
+    snprintf(text, sizeof text, unit == 0 || value >= 100 ? "%.0f %s" : "%.1f %s", value,
+             units[unit]);
+    return text;
+}
+
+std::string HumanDuration(uint64_t seconds) {
+    char text[40];
+    const unsigned long long hours = seconds / 3600;
+    const unsigned int minutes = static_cast<unsigned int>(seconds / 60 % 60);
+    const unsigned int rest = static_cast<unsigned int>(seconds % 60);
+    if (hours > 0) {
+        snprintf(text, sizeof text, "%llu:%02u:%02u", hours, minutes, rest);
+    } else {
+        snprintf(text, sizeof text, "%u:%02u", minutes, rest);
+    }
+    return text;
+}
+
+std::string HumanElapsed(double seconds) {
+    char text[32];
+    if (seconds < 1) {
+        snprintf(text, sizeof text, "%.0f ms", seconds * 1000);
+    } else {
+        snprintf(text, sizeof text, "%.1f s", seconds);
+    }
+    return text;
+}
+
+std::string Count(uint64_t count, const std::string& noun) {
+    return std::to_string(count) + " " + noun + (count == 1 ? "" : "s");
+}
+
+std::string HumanTime(int64_t seconds_since_epoch) {
+    const time_t moment = static_cast<time_t>(seconds_since_epoch);
+    struct tm local = {};
+    char text[64] = "";
+    if (localtime_r(&moment, &local) != nullptr) {
+        strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S", &local);
+    }
+    return text;
+}
+
+std::string Printable(const std::string& text) {
+    std::string printable;
+    for (const char c : text) {
+        const unsigned char byte = static_cast<unsigned char>(c);
+        if (byte < 0x20 || byte == 0x7f) {
+            char escaped[8];
+            snprintf(escaped, sizeof escaped, "\\%03o", static_cast<unsigned int>(byte));
+            printable += escaped;
+        } else {
+            printable += c;
+        }
+    }
+    return printable;
+}
+
+std::optional<std::string> ReadWholeFile(const std::string& path, size_t max) {
+    std::ifstream file(path, std::ios::binary);
+    if (!file) {
+        return std::nullopt;
+    }
+    std::string content(max + 1, '\0');
+    file.read(content.data(), static_cast<std::streamsize>(content.size()));
+    content.resize(static_cast<size_t>(file.gcount()));
+    if (file.bad() || content.size() > max) {
+        return std::nullopt;
+    }
+    return content;
+}
+
+}  // namespace programs

@@ -1,0 +1,33 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+namespace programs {
+
+/// `value` as a whole number in decimal digits, at most `max`; nothing for any other text.
+std::optional<uint64_t> ParseNumber(const std::string& value, uint64_t max);
+
+/// "0 B", "1.5 KiB", "23 MiB" ...
+std::string HumanBytes(uint64_t bytes);
+
+/// "1:05" or "2:01:05", from seconds.
+std::string HumanDuration(uint64_t seconds);
+
+/// "45 ms" or "1.2 s", from seconds.
+std::string HumanElapsed(double seconds);
+
+/// "1 file", "2 files": `noun` with an "s" where there is not just one.
+std::string Count(uint64_t count, const std::string& noun);
+
+/// A local date and time, "2026-11-21 08:30:00".
+std::string HumanTime(int64_t seconds_since_epoch);
+
+/// `text` with control characters written as \ooo: safe on a terminal.
+std::string Printable(const std::string& text);
+
+/// The whole file; nothing when it cannot be read or is larger than `max` bytes.
+std::optional<std::string> ReadWholeFile(const std::string& path, size_t max);
+
+}  // namespace programs

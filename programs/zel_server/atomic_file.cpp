@@ -1,0 +1,58 @@
+#include "programs/zel_server/atomic_file.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+
+#include "platform/internal/unique_fd.h"
+
+namespace zel_server {
+
+namespace {
+
+using tarq_internal::UniqueFd;
+
+bool WriteAll(int fd, const std::string& content) {
+    size_t done = 0;
+    while (done < content.size()) {
+        const ssize_t written = write(fd, content.data() + done, content.size() - done);
+        if (written < 0 && errno != EINTR) {
+            return false;
+        }
+        done += written > 0 ? static_cast<size_t>(written) : 0;
+    }
+    return true;
+}
+
+void SyncFolderOf(const std::string& path) {
+    const UniqueFd folder(
+        open(path.substr(0, path.rfind('/') + 1).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (folder) {
+        fsync(folder.Get());
+    }
+}
+
+}  // namespace
+
+bool WriteFileAtomically(const std::string& path, const std::string& content, mode_t mode) {
+    // A name without ".conf" at the end: the rsync daemon reads every *.conf of its folders.
+    std::string temporary = path + ".XXXXXX";
+    const UniqueFd file(mkostemp(temporary.data(), O_CLOEXEC));
+    if (!file) {
+        return false;
+    }
+    if (fchmod(file.Get(), mode) == 0 && WriteAll(file.Get(), content) && fsync(file.Get()) == 0 &&
+        rename(temporary.c_str(), path.c_str()) == 0) {
+        SyncFolderOf(path);
+        return true;
+    }
+    const int saved = errno;
+    unlink(temporary.c_str());
+    errno = saved;
+    return false;
+}
+
+}  // namespace zel_server

@@ -1,0 +1,119 @@
+#include "programs/zel_server/registry.h"
+
+#include "ZEL/is_syncedshare.h"
+#include "programs/zel_server/server_config.h"
+#include "tarq/owners.h"
+
+namespace zel_server {
+
+namespace {
+
+constexpr int kHashCapacity = 64;
+
+TARQ::HashOwner ToHash(const Section& section) {
+    TARQ::HashOwner hash(KAPICSzHashAlloc(kHashCapacity));
+    for (const auto& [key, value] : section) {
+        if (!hash || KAPICSzHashSetValue(hash.get(), key.c_str(), value.c_str()) != 0) {
+            return nullptr;
+        }
+    }
+    return hash;
+}
+
+// The keys of a share's section, and what they hold.
+struct ShareKey {
+    const char* key;
+    std::string ShareState::*member;
+};
+constexpr ShareKey kShareKeys[] = {
+    {"RunningID", &ShareState::running_id},
+    {"CompleteID", &ShareState::complete_id},
+    {"Account", &ShareState::account},
+    {"Module", &ShareState::module},
+    {"Path", &ShareState::path},
+    {"LastResult", &ShareState::last_result},
+    {"LastTime", &ShareState::last_time},
+};
+
+}  // namespace
+
+RegistryLock::RegistryLock()
+    : lock_(ZEL::LockFactory(LockFile()).GetLock()), held_(lock_.ExLock() == 0) {}
+
+ReadResult ReadSection(const std::string& name, Section& section) {
+    section.clear();
+    const TARQ::HashOwner hash(KAPICSzHashAlloc(kHashCapacity));
+    const int read = hash ? ZELGetServerInfo(name.c_str(), hash.get()) : -1;
+    if (read <= 0) {
+        return read == 0 ? ReadResult::kMissing : ReadResult::kFailed;
+    }
+    int position = 0;
+    for (const char *key, *value; KAPICSzHashNext(hash.get(), &position, &key, &value) != 0;) {
+        section[key] = value;
+    }
+    return ReadResult::kRead;
+}
+
+std::optional<std::vector<std::string>> SectionNames() {
+    const TARQ::ListOwner list(KAPICSzListAlloc(kHashCapacity));
+    if (!list || ZELCheckServerInfo() != 0 ||
+        KAPICFileEnumSection(RegistryFile().c_str(), list.get()) < 0) {
+        return std::nullopt;
+    }
+    std::vector<std::string> names;
+    for (int i = 0; i < KAPICSzListCount(list.get()); ++i) {
+        names.emplace_back(KAPICSzListGet(list.get(), i));
+    }
+    return names;
+}
+
+ReadResult ReadShare(const std::string& share, ShareState& state) {
+    Section section;
+    const ReadResult result = ReadSection("SHARE_" + share, section);
+    state = ShareState();
+    for (const ShareKey& entry : kShareKeys) {
+        state.*entry.member = section[entry.key];
+    }
+    return result;
+}
+
+bool WriteShare(const std::string& share, const ShareState& state) {
+    // Every key is written, an empty RunningID too: its absence would count as damage.
+    Section section;
+    for (const ShareKey& entry : kShareKeys) {
+        section[entry.key] = state.*entry.member;
+    }
+    const TARQ::HashOwner hash = ToHash(section);
+    return hash && ZELServerUpdateShare(share.c_str(), hash.get()) == 0;
+}
+
+std::string ShareOfModule(const std::string& module) {
+    const bool encrypted = module.size() > 2 && module.front() == '@' && module.back() == '@';
+    return encrypted ? module.substr(1, module.size() - 2) : module;
+}
+
+bool WriteTaskStatus(const std::string& task, const std::string& status) {
+    const TARQ::HashOwner hash = ToHash({{"status", status}});
+    return hash && ZELServerUpdateTask(task.c_str(), hash.get()) == 0;
+}
+
+bool IsSwitchedOn() {
+    Section pairing;
+    return ReadSection("PairedClientInfo", pairing) != ReadResult::kFailed &&
+           pairing["zelEnabled"] != "no";
+}
+
+Paired IsPaired(const std::string& client_id) {
+    Section section;
+    const ReadResult own = ReadSection("CLIENTID_" + client_id, section);
+    if (own == ReadResult::kRead) {
+        return Paired::kYes;
+    }
+    if (own == ReadResult::kFailed ||
+        ReadSection("PairedClientInfo", section) == ReadResult::kFailed) {
+        return Paired::kFailed;
+    }
+    return section["clientID"] == client_id ? Paired::kYes : Paired::kNo;
+}
+
+}  // namespace zel_server

@@ -1,0 +1,142 @@
+#include "programs/zel_server/server_config.h"
+
+#include <unistd.h>
+
+#include "programs/common/text.h"
+#include "tarq/owners.h"
+#include "tarq/root_path.h"
+#include "tarq/share.h"
+
+namespace zel_server {
+
+namespace {
+
+constexpr char kServerSection[] = "server";
+constexpr char kVolumesSection[] = "volumes";
+constexpr char kDisksSection[] = "disks";  // folder to mount path, as they were at set-up
+
+bool GetSection(const char* section, TARQ::HashOwner& values) {
+    values.reset(KAPICSzHashAlloc(16));
+    return values && KAPICFileGetSection(ConfigFile().c_str(), section, values.get()) > 0;
+}
+
+std::string Value(const TARQ::HashOwner& values, const char* key) {
+    const char* const value = KAPICSzHashGetValue(values.get(), key);
+    return value != nullptr ? value : "";
+}
+
+bool SetSection(const char* section, const std::map<std::string, std::string>& entries) {
+    const TARQ::HashOwner values(KAPICSzHashAlloc(16));
+    if (!values) {
+        return false;
+    }
+    for (const auto& [key, value] : entries) {
+        if (KAPICSzHashSetValue(values.get(), key.c_str(), value.c_str()) != 0) {
+            return false;
+        }
+    }
+    return KAPICFileSetSection(ConfigFile().c_str(), section, 0, values.get(), nullptr) > 0;
+}
+
+std::string MountPathOf(const std::string& folder) {
+    TARQVolumePath volume = {};
+    return VolumePathParseEx(folder.c_str(), &volume) == 0 ? volume.path : "";
+}
+
+}  // namespace
+
+std::string ConfigFolder() {
+    return TARQ::RootPath("/usr/tarq/etc/zel_server");
+}
+std::string ConfigFile() {
+    return ConfigFolder() + "/server.conf";
+}
+std::string RsyncdConfig() {
+    return ConfigFolder() + "/rsyncd.conf";
+}
+std::string ShareModules() {
+    return ConfigFolder() + "/shares.d";
+}
+std::string AdminModules() {
+    return ConfigFolder() + "/admin.d";
+}
+std::string SecretsFile() {
+    return ConfigFolder() + "/rsyncd.secrets";
+}
+std::string AnswerFolder() {
+    return TARQ::RootPath("/var/run/zel_server");
+}
+std::string PidFile() {
+    return TARQ::RootPath("/var/run/rsyncd.pid");
+}
+std::string RegistryFile() {
+    return TARQ::RootPath("/usr/tarq/etc/tarqZEL.info");
+}
+std::string LockFile() {
+    return ConfigFolder() + "/lock";
+}
+
+std::optional<ServerConfig> LoadServerConfig() {
+    TARQ::HashOwner values;
+    if (!GetSection(kServerSection, values)) {
+        return std::nullopt;
+    }
+    ServerConfig config;
+    const auto port = programs::ParseNumber(Value(values, "port"), 65535);
+    config.address = Value(values, "address");
+    config.storage = Value(values, "storage");
+    config.encryption = Value(values, "encryption") != "no";
+    config.user = Value(values, "user");
+    config.program = Value(values, "program");
+    if (!port || *port == 0 || config.storage.empty() || config.program.empty()) {
+        return std::nullopt;
+    }
+    config.port = static_cast<int>(*port);
+    TARQ::HashOwner volumes;
+    if (GetSection(kVolumesSection, volumes)) {
+        int position = 0;
+        for (const char *name, *folder;
+             KAPICSzHashNext(volumes.get(), &position, &name, &folder) != 0;) {
+            config.volumes[name] = folder;
+        }
+    }
+    return config;
+}
+
+bool SaveServerConfig(const ServerConfig& config) {
+    return SetSection(kServerSection, {{"port", std::to_string(config.port)},
+                                       {"address", config.address},
+                                       {"storage", config.storage},
+                                       {"encryption", config.encryption ? "yes" : "no"},
+                                       {"user", config.user},
+                                       {"program", config.program}}) &&
+           SetSection(kVolumesSection, config.volumes);
+}
+
+std::string StorageFor(const ServerConfig& config, const std::string& volume_name) {
+    const auto volume = config.volumes.find(volume_name);
+    return volume != config.volumes.end() ? volume->second : config.storage;
+}
+
+bool IsStorageThere(const std::string& folder) {
+    TARQ::HashOwner disks;
+    // A storage disk that is not mounted leaves an empty folder on another disk: nothing may be put
+    // there.
+    return access(folder.c_str(), W_OK | X_OK) == 0 && GetSection(kDisksSection, disks) &&
+           Value(disks, folder.c_str()) == MountPathOf(folder);
+}
+
+std::string RecordDiskOf(const std::string& folder) {
+    const std::string mount_path = MountPathOf(folder);
+    std::map<std::string, std::string> entries = {{folder, mount_path}};
+    TARQ::HashOwner disks;
+    if (GetSection(kDisksSection, disks)) {
+        int position = 0;
+        for (const char *name, *path; KAPICSzHashNext(disks.get(), &position, &name, &path) != 0;) {
+            entries.emplace(name, path);
+        }
+    }
+    return !mount_path.empty() && SetSection(kDisksSection, entries) ? mount_path : "";
+}
+
+}  // namespace zel_server

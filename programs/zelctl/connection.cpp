@@ -1,0 +1,88 @@
+#include "programs/zelctl/connection.h"
+
+#include <arpa/inet.h>
+
+#include "programs/common/server_status.h"
+#include "programs/common/terminal.h"
+
+namespace zelctl {
+
+namespace {
+
+constexpr int kLookupFailed = 42;
+constexpr int kNothingSent = 213;
+constexpr int kFirstServerStatus = 200;
+
+bool IsAddress(const std::string& text) {
+    unsigned char address[16];
+    return inet_pton(AF_INET, text.c_str(), address) == 1 ||
+           inet_pton(AF_INET6, text.c_str(), address) == 1;
+}
+
+}  // namespace
+
+void ConnectionOptions::AddTo(CLI::App* command) {
+    command->add_option("-s,--server", server, "The server's name or address")->required();
+    command->add_option("-u,--user", user, "Account on the server")->required();
+    command->add_option(
+        "--password-file", password_file,
+        "File with the account's password ('-': standard input); else it is asked for");
+    command->add_flag("--ssh", ssh, "Carry everything through ssh");
+    command->add_option("--ssh-port", ssh_port, "Port of the ssh server")
+        ->check(CLI::Range(1, 65535))
+        ->capture_default_str();
+    command->add_option("--timeout", timeout, "Give up when nothing moves for so many seconds")
+        ->check(CLI::Range(600, 86400))
+        ->capture_default_str();
+    command->add_flag("--compress", compress, "Compress on the way");
+    command->add_flag("--delta", delta, "Send only the changed blocks of files");
+}
+
+ExitCode ConnectionOptions::ToSyncInfo(ZEL::SyncInfo& info) const {
+    std::string error;
+    const auto password = programs::ReadPassword(
+        password_file, "Password of " + user + " on " + server + ": ", error);
+    if (!password) {
+        return Fail(kUsage, "%s", error.c_str());
+    }
+    if (IsAddress(server)) {
+        info.SetServerIP(server);
+    } else {
+        info.SetServerName(server);
+    }
+    info.SetUser(user);
+    info.SetPassword(*password);
+    info.SetSSH(ssh);
+    info.SetSSHPort(ssh_port);
+    info.SetRsyncTimeout(timeout);
+    info.SetCompression(compress);
+    info.SetBlockLevelSync(delta);
+    return info.Validate() ? kOk : Fail(kUsage, "the server or the account is not given");
+}
+
+std::string Explain(int status, const TARQ::Backup::RunReport& report) {
+    if (status == kLookupFailed) {
+        return "no such server: its name cannot be looked up";
+    }
+    if (status == kNothingSent) {
+        return "this machine has no identity to show to the server: no serial number and no "
+               "network interface; give "
+               "it one in /usr/tarq/etc/tarqsdk.conf";
+    }
+    const std::string server_text = programs::ServerStatusText(status);
+    if (!server_text.empty() && (status >= kFirstServerStatus || report.explanation.empty())) {
+        return server_text;
+    }
+    return !report.explanation.empty()
+               ? report.explanation
+               : "status " + std::to_string(status) + " (see the system log)";
+}
+
+ExitCode CodeOf(int status) {
+    if (status == kLookupFailed || status < kFirstServerStatus) {
+        return kFailed;
+    }
+    return status == kNothingSent ? kLocal : kRefused;
+}
+
+}  // namespace zelctl

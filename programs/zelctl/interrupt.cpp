@@ -1,0 +1,48 @@
+#include "programs/zelctl/interrupt.h"
+
+#include <signal.h>
+
+#include <cstdarg>
+#include <cstdio>
+#include <initializer_list>
+
+#include "programs/zelctl/exit_codes.h"
+
+namespace zelctl {
+
+namespace {
+
+volatile sig_atomic_t interrupted = 0;
+
+extern "C" void Note(int) {
+    interrupted = 1;
+}
+
+}  // namespace
+
+void WatchForInterrupt() {
+    struct sigaction action = {};
+    action.sa_handler = Note;
+    // The default comes back after the first: a person who insists is obeyed.
+    action.sa_flags = static_cast<int>(SA_RESETHAND);
+    sigemptyset(&action.sa_mask);
+    for (const int number : {SIGINT, SIGTERM, SIGHUP}) {
+        sigaction(number, &action, nullptr);
+    }
+}
+
+bool Interrupted() {
+    return interrupted != 0;
+}
+
+ExitCode Fail(ExitCode code, const char* format, ...) {
+    va_list arguments;
+    va_start(arguments, format);
+    fputs("zelctl: ", stderr);
+    vfprintf(stderr, format, arguments);
+    fputc('\n', stderr);
+    va_end(arguments);
+    return code;
+}
+
+}  // namespace zelctl

@@ -1,0 +1,19 @@
+// The commands about this machine's shares.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "programs/zelctl/exit_codes.h"
+
+namespace zelctl {
+
+ExitCode AddShare(const std::string& name, const std::string& path, bool acl, bool windows);
+ExitCode RemoveShare(const std::string& name);
+ExitCode ListShares(bool as_json);
+
+/// Complains about the first share that is not in the catalogue, whose folder cannot be read, or
+/// whose volume is not there or not fit for syncing.
+ExitCode CheckShares(const std::vector<std::string>& names);
+
+}  // namespace zelctl

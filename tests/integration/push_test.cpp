@@ -1,0 +1,372 @@
+// A whole client and a whole server: the programs as people run them, on a real rsync daemon and a
+// real sshd.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "platform/internal/child_process.h"
+#include "tests/integration/servers.h"
+#include "tests/support/temp_root.h"
+
+namespace fs = std::filesystem;
+using testing::AllOf;
+using testing::HasSubstr;
+using testing::Not;
+
+namespace {
+
+constexpr char kSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
+
+struct Outcome {
+    int exit_code = -1;
+    std::string output;  // both streams
+};
+
+Outcome RunProgram(const std::string& root, std::vector<std::string> command,
+                   const std::string& input = "", const std::function<bool()>& cancelled = nullptr,
+                   const std::string& path = kSearchPath) {
+    tarq_internal::ChildSpec spec;
+    spec.program = tarq_internal::FindProgram(command[0], kSearchPath);
+    spec.arguments = std::move(command);
+    spec.environment = {"LC_ALL=C", "TARQ_ROOT=" + root, "PATH=" + path};
+    spec.input = input;
+    Outcome outcome;
+    const auto append = [&](const char* bytes, size_t size) { outcome.output.append(bytes, size); };
+    const tarq_internal::ChildResult result =
+        tarq_internal::RunChild(spec, cancelled, append, append);
+    outcome.exit_code = WIFEXITED(result.wait_status) ? WEXITSTATUS(result.wait_status) : -1;
+    return outcome;
+}
+
+/// A server with the account "alice", and a client that knows how to find it.
+class PushTest : public testing::Test {
+protected:
+    PushTest() : port_(test::FreePort()) {
+        for (const char* folder :
+             {"client/usr/tarq/etc", "source"}) {
+            fs::create_directories(folder_.Path(folder));
+        }
+        Must(Server({"setup", "--storage", storage_, "--port", std::to_string(port_), "--address",
+                     "127.0.0.1"}));
+        Must(Server({"account", "add", "alice", "--password-file", "-"}, "secret\n"));
+        StartDaemon();
+        Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\n");
+        folder_.Write("client/usr/tarq/etc/tarqsdk.conf", "[device]\nserial=\"CLIENT-1\"\n");
+        Write("a.txt", "alpha");
+        Write("sub/b.txt", "beta");
+        Write("-n\n odd \xc3\xa4", "odd");
+        Must(Client({"share", "add", "docs", source_}));
+    }
+
+    void StartDaemon() {
+        daemon_.Start({"rsync", "--daemon", "--no-detach",
+                       "--config=" + folder_.Path("server/usr/tarq/etc/zel_server/rsyncd.conf")},
+                      folder_.Path("daemon.log"), port_);
+    }
+    void Configure(const std::string& text) {
+        folder_.Write("client/usr/tarq/etc/tarqrsync.conf", text);
+    }
+    void Write(const std::string& name, const std::string& content) {
+        folder_.Write("source/" + name, content);
+    }
+
+    static void Must(const Outcome& outcome) {
+        if (outcome.exit_code != 0) {
+            throw std::runtime_error(outcome.output);
+        }
+    }
+    Outcome Server(std::vector<std::string> arguments, const std::string& input = "") {
+        arguments.insert(arguments.begin(), ZEL_SERVER);
+        return RunProgram(folder_.Path("server"), arguments, input);
+    }
+    Outcome Client(std::vector<std::string> arguments, const std::string& input = "",
+                   const std::function<bool()>& cancelled = nullptr) {
+        arguments.insert(arguments.begin(), ZELCTL);
+        return RunProgram(folder_.Path("client"), arguments, input, cancelled);
+    }
+    std::vector<std::string> PushCommand(const std::vector<std::string>& more,
+                                         const std::string& user) {
+        std::vector<std::string> command = {
+            "push", "docs", "-s", "127.0.0.1", "-u", user, "--password-file", "-"};
+        command.insert(command.end(), more.begin(), more.end());
+        return command;
+    }
+    Outcome Push(const std::vector<std::string>& more = {}, const std::string& password = "secret",
+                 const std::string& user = "alice") {
+        return Client(PushCommand(more, user), password + "\n");
+    }
+    void ExpectCopyIsComplete() {
+        const Outcome compared = RunProgram("", {"diff", "-r", source_, storage_ + "/docs"});
+        EXPECT_EQ(compared.exit_code, 0) << compared.output;
+    }
+    void ExpectNextPushCompletes(const std::vector<std::string>& more = {},
+                                 const std::string& user = "alice") {
+        const Outcome pushed = Push(more, "secret", user);
+        EXPECT_EQ(pushed.exit_code, 0) << pushed.output;
+        ExpectCopyIsComplete();
+    }
+
+    test::TempFolder folder_;
+    const std::string source_ = folder_.Path("source");
+    const std::string storage_ = folder_.Path("server/storage");
+    int port_;
+    test::ServerProcess daemon_;
+};
+
+TEST_F(PushTest, OnlyTheChangeTravelsAndADeletionIsOne) {
+    EXPECT_THAT(Push().output,
+                AllOf(HasSubstr("Paired with"), HasSubstr("3 files sent, 0 deleted")));
+    ExpectCopyIsComplete();
+    EXPECT_THAT(Push().output,
+                AllOf(Not(HasSubstr("Paired")), HasSubstr("0 files sent, 0 deleted")));
+
+    Write("new", "n");
+    fs::remove(source_ + "/a.txt");
+    const Outcome listed = Push({"--dry-run"});
+    EXPECT_THAT(listed.output, AllOf(HasSubstr("send    new (1 B)"), HasSubstr("delete  a.txt")));
+    EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
+    EXPECT_THAT(Push().output, HasSubstr("1 file sent, 1 deleted"));
+    ExpectCopyIsComplete();
+    EXPECT_THAT(Server({"shares", "--json"}).output, HasSubstr("\"state\": \"complete"));
+
+    // A part of the share takes nothing else with it.
+    Write("sub/c.txt", "c");
+    Write("top", "t");
+    EXPECT_THAT(Push({"--path", "/sub"}).output, HasSubstr("1 file sent, 0 deleted"));
+    EXPECT_FALSE(fs::exists(storage_ + "/docs/top"));
+    EXPECT_EQ(Push({"--path", "/no such"}).exit_code, 3);
+}
+
+TEST_F(PushTest, ADryRunAtAServerWithoutACopyChangesNothingThere) {
+    EXPECT_THAT(Push({"--dry-run"}).output, HasSubstr("the server holds no copy yet"));
+    EXPECT_TRUE(fs::is_empty(storage_));
+    EXPECT_THAT(Server({"clients", "--json"}).output, Not(HasSubstr("CLIENT-1")));
+}
+
+TEST_F(PushTest, EachFailureHasItsOwnErrorAndTheNextPushCompletesTheCopy) {
+    Outcome failed = Push({}, "wrong");
+    EXPECT_EQ(failed.exit_code, 1);
+    EXPECT_THAT(failed.output, HasSubstr("password"));
+
+    failed = Client(
+        {"push", "docs", "-s", "no-such-server.invalid", "-u", "alice", "--password-file", "-"},
+        "secret\n");
+    EXPECT_EQ(failed.exit_code, 1);
+    EXPECT_THAT(failed.output, HasSubstr("cannot be looked up"));
+
+    daemon_.Stop();
+    failed = Push();
+    EXPECT_EQ(failed.exit_code, 1);
+    EXPECT_THAT(failed.output, HasSubstr("refused"));
+    StartDaemon();
+
+    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nrsync=\"/nonexistent/rsync\"\n");
+    EXPECT_THAT(Push().output, HasSubstr("/nonexistent/rsync cannot be started"));
+    const std::string old = folder_.Write(
+        "rsync",
+        "#!/bin/sh\n[ \"$1\" = --version ] && echo 'rsync  version 3.1.3  "
+        "protocol version 31' && exit\necho 'rsync: --early-input: unknown option' >&2\n"
+        "exit 1\n");
+    chmod(old.c_str(), 0755);
+    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nrsync=\"" + old + "\"\n");
+    EXPECT_THAT(Push().output, HasSubstr("rsync 3.1.3, which is too old"));
+    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\n");
+
+    Must(Server({"disable"}));
+    failed = Push();
+    EXPECT_EQ(failed.exit_code, 4);
+    EXPECT_THAT(failed.output, HasSubstr("switched off"));
+    Must(Server({"enable"}));
+
+    fs::rename(storage_, storage_ + ".away");
+    failed = Push();
+    EXPECT_EQ(failed.exit_code, 4);
+    EXPECT_THAT(failed.output, HasSubstr("storage folder is not there"));
+    fs::rename(storage_ + ".away", storage_);
+    ExpectNextPushCompletes();
+}
+
+TEST_F(PushTest, AKilledPushAndARestartedServerLoseNothing) {
+    ExpectNextPushCompletes();
+    std::ofstream(source_ + "/large") << std::string(20 << 20, 'x');
+    fs::remove(source_ + "/a.txt");
+    // Slow enough to be caught in the middle.
+    const std::vector<std::string> slow = PushCommand({"--bwlimit", "4096", "-q"}, "alice");
+    for (const bool kill_server : {false, true}) {
+        const auto begin = std::chrono::steady_clock::now();
+        const auto after_a_second = [&] {
+            return std::chrono::steady_clock::now() - begin > std::chrono::seconds(1);
+        };
+        if (kill_server) {
+            std::thread restart([&] {
+                std::this_thread::sleep_for(std::chrono::seconds(1));
+                daemon_.Stop();
+                StartDaemon();
+            });
+            EXPECT_EQ(Client(slow, "secret\n").exit_code, 1);
+            restart.join();
+        } else {
+            Client(slow, "secret\n", after_a_second);
+        }
+        // Deletions come last, and no half file stands under its name.
+        EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
+        EXPECT_FALSE(fs::exists(storage_ + "/docs/large"));
+        EXPECT_THAT(Server({"shares"}).output, HasSubstr("CLIENT-1"));
+    }
+    ExpectNextPushCompletes();
+}
+
+TEST_F(PushTest, AnInterruptedPushEndsInOrder) {
+    std::ofstream(source_ + "/large") << std::string(20 << 20, 'x');
+    const std::vector<std::string> slow = PushCommand({"--bwlimit", "4096", "-q"}, "alice");
+    std::thread interrupt([&] {
+        std::this_thread::sleep_for(std::chrono::seconds(1));
+        RunProgram("",
+                   {"pkill", "-INT", "-f", "--", std::string(ZELCTL) + " push docs -s 127.0.0.1"});
+    });
+    const Outcome ended = Client(slow, "secret\n");
+    interrupt.join();
+    EXPECT_EQ(ended.exit_code, 5);
+    EXPECT_THAT(ended.output, HasSubstr("ended by the user"));
+    // The server knows that nobody pushes any more.
+    EXPECT_THAT(Server({"shares"}).output, Not(HasSubstr("being pushed")));
+    ExpectNextPushCompletes();
+}
+
+TEST_F(PushTest, AnUnreadableSourceOrAnotherVolumeNeverLeadsToDeletions) {
+    ExpectNextPushCompletes();
+    fs::rename(source_, source_ + ".away");
+    EXPECT_EQ(Push().exit_code, 3);
+    EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
+    fs::rename(source_ + ".away", source_);
+
+    // As if the share had been added on a disk that is not mounted now: its folder is there, and
+    // empty.
+    const std::string catalogue = folder_.Path("client/usr/tarq/etc/tarqshare.conf");
+    const std::string good = test::ReadFile(catalogue);
+    std::string elsewhere = good;
+    const size_t volume = elsewhere.find("volume=\"/");
+    ASSERT_NE(volume, std::string::npos) << good;
+    elsewhere.insert(volume + 9, "mnt/unplugged-");
+    std::ofstream(catalogue) << elsewhere;
+    fs::remove(source_ + "/a.txt");
+    const Outcome refused = Push();
+    EXPECT_EQ(refused.exit_code, 3);
+    EXPECT_THAT(refused.output, HasSubstr("not mounted where it was"));
+    EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
+    std::ofstream(catalogue) << good;
+    ExpectNextPushCompletes();
+}
+
+TEST_F(PushTest, AFullDiskAtTheServerIsSaidAndThenHealed) {
+    if (geteuid() != 0 || mkdir(folder_.Path("small").c_str(), 0755) != 0 ||
+        mount("tmpfs", folder_.Path("small").c_str(), "tmpfs", 0, "size=4m") != 0) {
+        GTEST_SKIP() << "needs root to mount a small disk";
+    }
+    Must(Server({"setup", "--storage", folder_.Path("small"), "--port", std::to_string(port_),
+                 "--address", "127.0.0.1"}));
+    EXPECT_EQ(Push().exit_code, 0);
+    std::ofstream(source_ + "/large") << std::string(8 << 20, 'x');
+    fs::remove(source_ + "/a.txt");
+    const Outcome full = Push();
+    EXPECT_EQ(full.exit_code, 1);
+    EXPECT_THAT(full.output, HasSubstr("full"));
+    EXPECT_TRUE(fs::exists(folder_.Path("small/docs/a.txt")));
+    EXPECT_EQ(mount("tmpfs", folder_.Path("small").c_str(), "tmpfs", MS_REMOUNT, "size=16m"), 0);
+    EXPECT_EQ(Push().exit_code, 0);
+    EXPECT_EQ(fs::file_size(folder_.Path("small/docs/large")), size_t{8} << 20);
+    umount2(folder_.Path("small").c_str(), MNT_DETACH);
+}
+
+TEST_F(PushTest, AnotherAccountOrClientIsKeptOut) {
+    Must(Server({"account", "add", "mallory", "--password-file", "-"}, "secret\n"));
+    ExpectNextPushCompletes();
+    const Outcome other = Push({}, "secret", "mallory");
+    EXPECT_EQ(other.exit_code, 4);
+    EXPECT_THAT(other.output, HasSubstr("belongs to another client or account"));
+    // Nor past the command line, straight at the module.
+    const std::string password = folder_.Write("password", "secret\n");
+    chmod(password.c_str(), 0600);
+    for (const char* user : {"mallory", "alice"}) {  // alice: nothing has been started
+        const Outcome written = RunProgram(
+            "", {"rsync", "--password-file=" + password, "--port=" + std::to_string(port_),
+                 source_ + "/a.txt", std::string(user) + "@127.0.0.1::docs/forged"});
+        EXPECT_NE(written.exit_code, 0) << user;
+        EXPECT_FALSE(fs::exists(storage_ + "/docs/forged"));
+    }
+    // A client with another identity does not get alice's share either, until the admin releases
+    // it.
+    folder_.Write("client/usr/tarq/etc/tarqsdk.conf", "[device]\nserial=\"CLIENT-2\"\n");
+    EXPECT_EQ(Push().exit_code, 4);
+    Must(Server({"shares", "--release", "docs"}));
+    ExpectNextPushCompletes();
+}
+
+TEST_F(PushTest, CommandsOfMischiefChangeNothing) {
+    ExpectNextPushCompletes();
+    const std::string registry = folder_.Path("server/usr/tarq/etc/tarqZEL.info");
+    const std::string before = test::ReadFile(registry);
+    const std::string password = folder_.Write("password", "secret\n");
+    chmod(password.c_str(), 0600);
+    const std::string session = std::string(32, 'b');
+    const std::string head = "session=\"" + session + "\"\n";
+    const std::string start =
+        "command=\"ZEL_SyncStart\"\nclientID=\"CLIENT-1\"\nvolumeName=\"v\"\n";
+    const std::pair<std::string, std::string> cases[] = {
+        {head + start + "shareName=\"x\"\nshareName=\"y\"\n", "status=\"201\"\n"},
+        {head + start + "shareName=\"x\"\ncommand=\"ZEL_Pairing\"\n", "status=\"201\"\n"},
+        {head + start + "shareName=\"../../etc\"\n", "status=\"201\"\n"},
+        {head + "command=\"ZEL_Pairing\"\nclientID=\"C\"\nserverName=\"x\ndryRun=\"no\"\"\ndryRun="
+                "\"yes\"\n",
+         "status=\"201\"\n"},
+        {head + start + "shareName=\"x\"\n" + std::string(4800, '#'), "status=\"201\"\n"},
+        {std::string(5000, '\xff'), ""},
+        {"", ""},
+    };
+    for (const auto& [text, answer] : cases) {
+        const std::string file = folder_.Write("command", text);
+        fs::remove(folder_.Path("answer"));
+        RunProgram("", {"rsync", "--early-input=" + file, "--password-file=" + password,
+                        "--port=" + std::to_string(port_),
+                        "alice@127.0.0.1::zel_command/" + session, folder_.Path("answer")});
+        EXPECT_EQ(test::ReadFile(folder_.Path("answer")), answer) << text.substr(0, 200);
+    }
+    EXPECT_EQ(test::ReadFile(registry), before);
+    // Answers do not pile up.
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    EXPECT_TRUE(fs::is_empty(folder_.Path("server/var/run/zel_server/alice")));
+}
+
+TEST_F(PushTest, SshReachesTheSameServerAndAChangedHostKeyIsRefused) {
+    if (!test::SshServer::Available()) {
+        GTEST_SKIP() << "this machine cannot run an ssh server for the test";
+    }
+    test::SshServer ssh;
+    const std::string user = ssh.User();
+    Must(Server({"account", "add", user, "--password-file", "-"}, "secret\n"));
+    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nssh_options=\"-i " +
+              ssh.ClientKey() + "\"\n");
+    const std::vector<std::string> over_ssh = {"--ssh", "--ssh-port", std::to_string(ssh.Port())};
+    ExpectNextPushCompletes(over_ssh, user);
+    EXPECT_THAT(ssh.Log(), HasSubstr("Accepted publickey"));
+
+    Write("more", "m");
+    ssh.ChangeHostKey();
+    const Outcome refused = Push(over_ssh, "secret", user);
+    EXPECT_EQ(refused.exit_code, 1);
+    EXPECT_THAT(refused.output, AllOf(HasSubstr("host key"), HasSubstr("tarqrsync_known_hosts")));
+    fs::remove(folder_.Path("client/usr/tarq/etc/tarqrsync_known_hosts"));
+    ExpectNextPushCompletes(over_ssh, user);
+}
+
+}  // namespace

@@ -1,0 +1,186 @@
+#include "tests/integration/servers.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <pwd.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <stdexcept>
+#include <thread>
+
+#include "platform/internal/child_process.h"
+#include "platform/internal/unique_fd.h"
+
+namespace test {
+
+namespace fs = std::filesystem;
+using std::chrono::milliseconds;
+using std::chrono::steady_clock;
+
+namespace {
+
+constexpr milliseconds kStartLimit(10000);
+constexpr milliseconds kStep(5);
+constexpr char kPrograms[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
+
+sockaddr_in Loopback(int port) {
+    sockaddr_in address = {};
+    address.sin_family = AF_INET;
+    address.sin_port = htons(static_cast<uint16_t>(port));
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    return address;
+}
+
+bool Answers(int port) {
+    const tarq_internal::UniqueFd socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    const sockaddr_in address = Loopback(port);
+    return connect(socket.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+}
+
+tarq_internal::ChildSpec SpecOf(const std::vector<std::string>& command) {
+    tarq_internal::ChildSpec spec;
+    spec.program = tarq_internal::FindProgram(command[0], kPrograms);
+    spec.arguments = command;
+    spec.environment = {"LC_ALL=C", std::string("PATH=") + kPrograms};
+    return spec;
+}
+
+void Run(const std::vector<std::string>& command) {
+    const tarq_internal::ChildResult result =
+        tarq_internal::RunChild(SpecOf(command), nullptr, nullptr, nullptr);
+    if (result.start_error != 0 || result.wait_status != 0) {
+        throw std::runtime_error(command[0] + " failed");
+    }
+}
+
+void MakeKey(const std::string& path, const std::string& passphrase) {
+    std::error_code ignored;
+    fs::remove(path, ignored);
+    Run({"ssh-keygen", "-q", "-t", "ed25519", "-N", passphrase, "-C", "test", "-f", path});
+}
+
+}  // namespace
+
+void ServerProcess::Start(const std::vector<std::string>& command, const std::string& log,
+                          int port) {
+    stop_ = ended_ = false;
+    runner_ = std::thread([this, command, log] {
+        std::ofstream file(log, std::ios::app);
+        const auto append = [&file](const char* bytes, size_t size) {
+            file.write(bytes, static_cast<std::streamsize>(size)).flush();
+        };
+        tarq_internal::RunChild(
+            SpecOf(command), [this] { return stop_.load(); }, append, append);
+        ended_ = true;
+    });
+    const auto limit = steady_clock::now() + kStartLimit;
+    while (!Answers(port)) {
+        if (ended_ || steady_clock::now() > limit) {
+            Stop();
+            throw std::runtime_error(command[0] + " does not run: " + ReadFile(log));
+        }
+        std::this_thread::sleep_for(kStep);
+    }
+}
+
+void ServerProcess::Stop() {
+    if (runner_.joinable()) {
+        stop_ = true;
+        runner_.join();
+    }
+}
+
+int FreePort() {
+    const tarq_internal::UniqueFd socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_in address = Loopback(0);
+    socklen_t size = sizeof address;
+    if (bind(socket.Get(), reinterpret_cast<const sockaddr*>(&address), size) != 0 ||
+        getsockname(socket.Get(), reinterpret_cast<sockaddr*>(&address), &size) != 0) {
+        throw std::runtime_error("no free port");
+    }
+    return ntohs(address.sin_port);
+}
+
+RsyncDaemon::RsyncDaemon(const std::string& global_lines) : port_(FreePort()) {
+    AddAccount(kUser, kPassword);
+    const std::string configuration = folder_.Write(
+        "rsyncd.conf", "use chroot = no\nsocket options = TCP_NODELAY\nreverse lookup = no\n" +
+                           std::string(geteuid() == 0 ? "uid = 0\ngid = 0\n" : "") + global_lines +
+                           "\n");
+    process_.Start({"rsync", "--daemon", "--no-detach", "--config=" + configuration,
+                    "--port=" + std::to_string(port_), "--address=127.0.0.1",
+                    "--log-file=" + folder_.Path("log")},
+                   folder_.Path("output"), port_);
+}
+
+void RsyncDaemon::AddAccount(const std::string& user, const std::string& password) {
+    const std::string secrets = folder_.Path("secrets");
+    std::ofstream(secrets, std::ios::app) << user << ":" << password << "\n";
+    chmod(secrets.c_str(), 0600);
+}
+
+std::string RsyncDaemon::AddModule(const std::string& name, const std::string& lines) {
+    const std::string path = folder_.Path("modules/" + name);
+    fs::create_directories(path);
+    std::ofstream(folder_.Path("rsyncd.conf"), std::ios::app)
+        << "[" << name << "]\npath = " << path
+        << "\nread only = no\nauth users = *\nsecrets file = " << folder_.Path("secrets") << "\n"
+        << lines << "\n";
+    return path;
+}
+
+void RsyncDaemon::AddCommandModule(const std::string& handler) {
+    const std::string answers = folder_.Path("modules/zel_command");
+    AddModule("zel_command",
+              "read only = yes\nlist = no\nearly exec = ANSWERS='" + answers + "' exec " + handler);
+}
+
+bool SshServer::Available() {
+    return access(tarq_internal::FindProgram("sshd", kPrograms).c_str(), X_OK) == 0 &&
+           (access("/run/sshd", X_OK) == 0 || mkdir("/run/sshd", 0755) == 0);
+}
+
+SshServer::SshServer() : port_(FreePort()) {
+    MakeKey(folder_.Path("client"), "");
+    MakeKey(folder_.Path("locked_client"), kPassphrase);
+    folder_.Write("authorized_keys", ReadFile(folder_.Path("client.pub")) +
+                                         ReadFile(folder_.Path("locked_client.pub")));
+    MakeKey(folder_.Path("host"), "");
+    folder_.Write("sshd_config",
+                  "ListenAddress 127.0.0.1\nPort " + std::to_string(port_) + "\nHostKey " +
+                      folder_.Path("host") + "\nAuthorizedKeysFile " +
+                      folder_.Path("authorized_keys") +
+                      "\nPidFile none\nStrictModes no\nUsePAM no\n"
+                      "PermitRootLogin prohibit-password\nPasswordAuthentication no\n"
+                      "KbdInteractiveAuthentication no\n");
+    Start();
+}
+
+void SshServer::Start() {
+    // sshd starts itself anew for each connection and wants its full path for that.
+    process_.Start({tarq_internal::FindProgram("sshd", kPrograms), "-D", "-e", "-f",
+                    folder_.Path("sshd_config")},
+                   folder_.Path("log"), port_);
+}
+
+void SshServer::ChangeHostKey() {
+    process_.Stop();
+    MakeKey(folder_.Path("host"), "");
+    Start();
+}
+
+std::string SshServer::User() const {
+    const passwd* entry = getpwuid(geteuid());
+    return entry != nullptr ? entry->pw_name : "";
+}
+
+std::string SshServer::ClientKey(bool with_passphrase) const {
+    return folder_.Path(with_passphrase ? "locked_client" : "client");
+}
+
+}  // namespace test

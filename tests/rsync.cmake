@@ -1,0 +1,6 @@
+add_library(test_servers STATIC integration/servers.cpp)
+target_link_libraries(test_servers PUBLIC test_support tarq_internal)
+
+zel_test(tarqrsync_test tarqrsync_test.cpp LIBRARIES tarqrsync_parts)
+zel_test(rsync_wrapper_test integration/rsync_wrapper_test.cpp
+    LIBRARIES test_syslog test_servers tarqrsync TIMEOUT 300 LABELS integration)

@@ -1,0 +1,453 @@
+// The driver against a wrapper, a share catalogue and a host that this program puts in front of the
+// real ones.
+#include "ZEL/rsyncer.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <map>
+
+#include "tarq/hacore.h"
+#include "tarq/netsdk.h"
+#include "tarq/sdk.h"
+#include "tarq/share.h"
+#include "tests/support/log_capture.h"
+#include "tests/support/temp_root.h"
+
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+
+namespace {
+
+// What the world outside the driver says, and what the driver has done to it.
+struct World {
+    struct Answer {
+        int status = 0;
+        std::string outfile = "";
+    };
+    std::map<std::string, std::vector<Answer>> answers;  // by command name; the last one stays
+    std::vector<int> copy_statuses = {0};
+    std::string serial = "SN1";
+    struct ShareFacts {
+        std::string path;
+        unsigned int flags;
+    };
+    std::map<std::string, ShareFacts> shares;
+    std::string key_file;
+    int addresses = 2;
+
+    std::vector<std::vector<std::string>> commands;  // lines of each command sent
+    std::vector<std::string> runs;                   // setter calls of each run, in order
+    std::vector<std::string> looked_up;              // shares asked for
+    int errors_logged = 0;
+
+    World::Answer Next(const std::string& command) {
+        auto& list = answers[command];
+        if (list.empty()) {
+            return {};
+        }
+        const Answer answer = list.front();
+        if (list.size() > 1) {
+            list.erase(list.begin());
+        }
+        return answer;
+    }
+};
+World* world = nullptr;
+
+std::string ValueOf(const std::string& line) {
+    const size_t start = line.find("=\"") + 2;
+    return line.substr(start, line.size() - start - 1);
+}
+
+}  // namespace
+
+// ---- The platform in front ----
+
+namespace TARQ {
+namespace Backup {
+
+struct RsyncWrapper::Impl {
+    std::string calls;
+    std::vector<std::string> command;
+    void Note(const std::string& call) { calls += (calls.empty() ? "" : " ") + call; }
+};
+
+RsyncWrapper::RsyncWrapper() : impl_(new Impl) {}
+RsyncWrapper::~RsyncWrapper() = default;
+#define NOTE_BOOL(name)                                            \
+    void RsyncWrapper::name(bool value) {                          \
+        impl_->Note(std::string(#name "=") + (value ? "1" : "0")); \
+    }
+NOTE_BOOL(setDelete)
+NOTE_BOOL(setNumericIds)
+NOTE_BOOL(setTarqPseudoRoot)
+NOTE_BOOL(setSsh)
+NOTE_BOOL(setCompress)
+NOTE_BOOL(setDeltaCopy)
+NOTE_BOOL(setListOnly)
+NOTE_BOOL(setRelativePath)
+NOTE_BOOL(setTarqAcl)
+NOTE_BOOL(setDebugLog)
+void RsyncWrapper::setTarqAuth(bool a, bool b) {
+    impl_->Note(std::string("auth=") + (a && b ? "11" : "?"));
+}
+void RsyncWrapper::setPort(int port) {
+    impl_->Note("port=" + std::to_string(port));
+}
+void RsyncWrapper::setTimeout(int seconds) {
+    impl_->Note("timeout=" + std::to_string(seconds));
+}
+void RsyncWrapper::setTarqCustCmdRule(const std::list<std::string>& lines) {
+    impl_->command.assign(lines.begin(), lines.end());
+}
+void RsyncWrapper::setExcludeRule(const std::list<std::string>& rules) {
+    impl_->Note("excludes=" + std::to_string(rules.size()));
+}
+void RsyncWrapper::setSrcPath(const std::string& path) {
+    impl_->Note("src=" + path);
+}
+void RsyncWrapper::setDestPath(const std::string& user, const std::string& host,
+                               const std::string& password, const std::string& module,
+                               const std::string& sub_path) {
+    impl_->Note("dest=" + user + ":" + password + "@" + host + "::" + module + "|" + sub_path);
+}
+int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
+    impl_->Note(cancelled ? "cancellable" : "plain");
+    world->runs.push_back(impl_->calls);
+    if (impl_->command.empty()) {
+        const int status = world->copy_statuses.front();
+        return status;
+    }
+    world->commands.push_back(impl_->command);
+    const World::Answer answer = world->Next(ValueOf(impl_->command[0]));
+    for (const std::string& line : impl_->command) {
+        if (line.compare(0, 9, "outfile=\"") == 0 && answer.outfile != "none") {
+            std::ofstream(ValueOf(line)) << answer.outfile;
+        } else if (line.compare(0, 9, "outfile=\"") == 0) {
+            remove(ValueOf(line).c_str());
+        }
+    }
+    return answer.status;
+}
+void RsyncWrapper::logError() {
+    ++world->errors_logged;
+}
+
+}  // namespace Backup
+}  // namespace TARQ
+
+extern "C" {
+int TARQShareGet(const char* name, TARQShare* share) {
+    world->looked_up.push_back(name);
+    const auto found = world->shares.find(name);
+    if (found == world->shares.end()) {
+        KAPICErrSetEx(TARQ_ERR_NO_SHARE, "test", 1);
+        return -1;
+    }
+    *share = new TARQShareRec{strdup(name), strdup(found->second.path.c_str()), found->second.flags,
+                              256};
+    return 0;
+}
+void TARQShareFree(TARQShare share) {
+    if (share != nullptr) {
+        free(share->name);
+        free(share->path);
+        delete share;
+    }
+}
+int KAPIShareEncryptPathGet(const char* path, char* buffer, int size) {
+    snprintf(buffer, static_cast<size_t>(size), "%s.enc", path);
+    return 0;
+}
+int KAPIShareIsEncryptionGet(TARQShare share, int* result) {
+    *result = (share->flags & TARQ_SHARE_ENCRYPTED) != 0;
+    return 0;
+}
+int KAPIShareIsAutoDecryptGet(TARQShare share, int* result) {
+    *result = (share->flags & TARQ_SHARE_AUTO_MOUNT) != 0;
+    return 0;
+}
+int TARQShareEncAutoKeyFileGet(TARQShare, char*, int) {
+    return -1;
+}
+int TARQShareEncKeyFileGet(TARQShare, char* buffer, int size) {
+    snprintf(buffer, static_cast<size_t>(size), "%s", world->key_file.c_str());
+    return 0;
+}
+int VolumePathParseEx(const char*, TARQVolumePath* volume) {
+    strcpy(volume->path, "/volume1");
+    volume->type = 1;
+    return 0;
+}
+int TARQHAIsRunning(void) {
+    return 0;
+}
+int KAPIGetSerialNumber(char* buffer, int size) {
+    snprintf(buffer, static_cast<size_t>(size), "%s", world->serial.c_str());
+    return 0;
+}
+int KAPINetGetInterfaceInfo(KAPINetInterface*, int, int) {
+    return 0;
+}
+int TARQLnxGetHostname(char* buffer) {
+    strcpy(buffer, "nas");
+    return 0;
+}
+int TARQNetLookupIP(const char*, TARQNetAddress* records, int, int) {
+    for (int i = 0; i < world->addresses; ++i) {
+        snprintf(records[i].address, sizeof records[i].address, "10.0.0.%d", i + 1);
+    }
+    return world->addresses;
+}
+}
+
+namespace {
+
+class RsyncerTest : public testing::Test {
+protected:
+    RsyncerTest() {
+        world = &world_;
+        world_.answers["ZEL_GetProtocolVer"] = {{0, "1\n"}};
+        world_.shares["docs"] = {root_.Path("docs"), 0x80};
+        world_.shares["vault"] = {root_.Path("vault"), 0x2};
+        root_.Write("docs/sub/file", "x");
+        root_.Write("vault.enc/file", "x");
+        info_.SetUser("alice");
+        info_.SetPassword("secret");
+        info_.SetServerName("server");
+        info_.SetSSHPort(2222);
+    }
+    ~RsyncerTest() override { world = nullptr; }
+
+    void Connect() {
+        ASSERT_EQ(rsyncer_.Initialize(info_), 0);
+        world_.commands.clear();
+        world_.runs.clear();
+    }
+    std::string Text() const { return log_.Text(); }
+
+    test::TempRoot root_;
+    World world_;
+    test::LogCapture log_{3};  // errors only
+    ZEL::SyncInfo info_;
+    ZEL::Rsyncer rsyncer_;
+    int status_ = -7;
+};
+
+constexpr char kDefaults[] = "setDelete=1 setNumericIds=1 auth=11 setTarqPseudoRoot=1 ";
+
+TEST_F(RsyncerTest, InitializeProbesEachAddressUntilOneAnswersTheVersionCommand) {
+    world_.answers["ZEL_Pairing"] = {{10}, {207}};
+    EXPECT_EQ(rsyncer_.Initialize(info_), 0);
+    EXPECT_EQ(rsyncer_.GetLatestIP(), "10.0.0.2");
+    EXPECT_TRUE(rsyncer_.SupportMultiSource());
+    EXPECT_THAT(Text(), HasSubstr("[ERROR] ZEL/rsyncer(N): Fail to test connection [10]\n"));
+    // A probe changes nothing, is kept out of the debug log, and never asks for a port without ssh.
+    ASSERT_EQ(world_.commands.size(), 3U);
+    EXPECT_THAT(world_.commands[0], ElementsAre("command=\"ZEL_Pairing\"", "clientID=\"SN1\"",
+                                                "dryRun=\"yes\"", "serverName=\"nas\""));
+    EXPECT_EQ(world_.runs[0],
+              std::string(kDefaults) +
+                  "setSsh=0 setDebugLog=0 timeout=600 dest=alice:secret@10.0.0.1::| plain");
+    EXPECT_THAT(world_.runs[2], HasSubstr("timeout=600 setListOnly=1"));
+}
+
+TEST_F(RsyncerTest, TestServerReportsTheLastVerdictAndKeepsTheRightAddress) {
+    struct Case {
+        const char* name;
+        World::Answer pairing, version;
+        int addresses;
+        int expected;
+        const char* address;
+    };
+    const Case cases[] = {
+        {"no address answers", {30}, {0, "1"}, 2, 30, ""},
+        {"the name is unknown", {0}, {0, "1"}, 0, 42, ""},
+        {"an old server", {0}, {43}, 2, 0, "10.0.0.1"},
+        {"another old server", {0}, {51}, 2, 0, "10.0.0.1"},
+        // Answers, but tells no version: the last candidate stays, and its probe's status is the
+        // result.
+        {"no version", {0}, {12}, 2, 0, "10.0.0.2"},
+        {"an empty version file", {0}, {0, ""}, 1, 0, "10.0.0.1"},
+        {"no version file", {0}, {0, "none"}, 1, 0, "10.0.0.1"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        world_.answers = {{"ZEL_Pairing", {c.pairing}}, {"ZEL_GetProtocolVer", {c.version}}};
+        world_.addresses = c.addresses;
+        ZEL::Rsyncer rsyncer;
+        EXPECT_EQ(rsyncer.Initialize(info_), c.expected);
+        EXPECT_EQ(rsyncer.GetLatestIP(), c.address);
+        EXPECT_FALSE(rsyncer.SupportMultiSource());
+    }
+    EXPECT_THAT(Text(), HasSubstr("Fail to lookup ip for server()\n"));
+    EXPECT_THAT(Text(), HasSubstr("Fail to find rsync reachable ip for server(10.0.0.2)\n"));
+    EXPECT_THAT(Text(), HasSubstr("Fail to get server version [12]\n"));
+    EXPECT_THAT(Text(), HasSubstr("Fail to open server version file\n"));
+}
+
+TEST_F(RsyncerTest, WithoutAClientIdentityNothingIsSent) {
+    world_.serial = "";
+    EXPECT_EQ(rsyncer_.Initialize(info_), 213);
+    EXPECT_EQ(rsyncer_.SendBeacon("t", status_), -1);
+    EXPECT_EQ(status_, -7);
+    EXPECT_THAT(world_.commands, IsEmpty());
+    EXPECT_THAT(
+        Text(),
+        HasSubstr(
+            "Fail to get client id\n[ERROR] ZEL/rsyncer(N): SendBeacon: Fail to write command "
+            "file\n"));
+}
+
+TEST_F(RsyncerTest, MultiPairingNamesTheSharesAndReadsTheConflicts) {
+    Connect();
+    world_.answers["ZEL_PairingMultiSrc"] = {{214, "a::b\nrest\n"}, {0, ""}, {212}, {0, "none"}};
+    std::list<std::string> conflicts = {"before"};
+    EXPECT_EQ(rsyncer_.DoPairing(true, {"docs", "vault", "unknown"}, conflicts, status_), 0);
+    EXPECT_EQ(status_, 214);
+    EXPECT_THAT(conflicts, ElementsAre("before", "a", "", "b"));
+    // The scan ends at the first encrypted share: the unknown one behind it is no failure.
+    EXPECT_THAT(world_.looked_up, ElementsAre("docs", "vault"));
+    ASSERT_EQ(world_.commands.size(), 1U);
+    const std::vector<std::string>& lines = world_.commands[0];
+    EXPECT_THAT(lines, ElementsAre("command=\"ZEL_PairingMultiSrc\"", "clientID=\"SN1\"",
+                                   "serverName=\"nas\"", "syncShares=\"docs:vault:unknown\"",
+                                   "dryRun=\"yes\"",
+                                   testing::StartsWith("outfile=\"" + root_.Path("tmp/ZEL/temp.")),
+                                   "requireEncryptionShareSupport=\"yes\""));
+
+    EXPECT_EQ(rsyncer_.DoPairing(false, {"docs"}, conflicts, status_), 0);
+    EXPECT_EQ(conflicts.size(), 4U);
+    EXPECT_EQ(rsyncer_.DoPairing(false, {"docs"}, conflicts, status_), -1);
+    EXPECT_EQ(rsyncer_.DoPairing(false, {"docs"}, conflicts, status_), -1);
+    EXPECT_EQ(rsyncer_.DoPairing(false, {"unknown"}, conflicts, status_), -1);
+    EXPECT_EQ(rsyncer_.DoPairing(false, {}, conflicts, status_), -1);
+    EXPECT_THAT(Text(), HasSubstr("Fail to check share pairing [212]\n"));
+    EXPECT_THAT(
+        Text(),
+        HasSubstr("Fail to open conflict share file\n[ERROR] ZEL/rsyncer(N): Fail to parse out "
+                  "conflict shares\n"));
+    EXPECT_THAT(Text(), HasSubstr("MultiPairing: Share list is empty\n"));
+    EXPECT_TRUE(std::filesystem::is_empty(root_.Path("tmp/ZEL")));
+}
+
+TEST_F(RsyncerTest, AnOldServerIsNotToldTheShares) {
+    world_.answers["ZEL_GetProtocolVer"] = {{43}};
+    Connect();
+    std::list<std::string> conflicts = {"left over"};
+    EXPECT_EQ(rsyncer_.DoPairing(false, {"docs"}, conflicts, status_), 0);
+    EXPECT_THAT(conflicts, IsEmpty());
+    EXPECT_THAT(world_.commands[0], ElementsAre("command=\"ZEL_Pairing\"", "clientID=\"SN1\"",
+                                                "dryRun=\"no\"", "serverName=\"nas\""));
+}
+
+TEST_F(RsyncerTest, StartFallsBackToTheShortFormOnlyWhenTheServerAsksForIt) {
+    Connect();
+    world_.answers["ZEL_SyncStart"] = {{202}, {0}};
+    EXPECT_EQ(rsyncer_.StartSyncShare("docs", status_), 0);
+    EXPECT_EQ(status_, 0);
+    ASSERT_EQ(world_.commands.size(), 2U);
+    EXPECT_THAT(world_.commands[0],
+                ElementsAre("command=\"ZEL_SyncStart\"", "clientID=\"SN1\"",
+                            "volumeName=\"volume1\"", "shareName=\"docs\"", "isEncrypt=\"0\"",
+                            "isAutomount=\"0\"", "isEnableACL=\"1\"", "isWinShare=\"0\"",
+                            "lenEncKey=\"256\"", "connAccount=\"alice\""));
+    EXPECT_EQ(world_.commands[1].size(), 4U);
+    world_.answers["ZEL_SyncStart"] = {{214}};
+    EXPECT_EQ(rsyncer_.StartSyncShare("docs", status_), 0);
+    EXPECT_EQ(status_, 214);
+    EXPECT_EQ(world_.commands.size(), 3U);
+    EXPECT_EQ(rsyncer_.StartSyncShare("unknown", status_), -1);
+    EXPECT_THAT(Text(), HasSubstr("Fail to start sync share 'unknown' with ACL\n"));
+}
+
+TEST_F(RsyncerTest, ADataRunGoesIntoTheSharesModule) {
+    info_.SetSSH(true);
+    info_.SetCompression(true);
+    rsyncer_.SetCancelChecker([] { return false; });
+    Connect();
+    EXPECT_EQ(rsyncer_.RunSync(1, "docs", "/", {"*.tmp"}, status_), 0);
+    EXPECT_EQ(status_, 0);
+    const std::string base =
+        std::string(kDefaults) +
+        "setSsh=1 setDebugLog=1 port=2222 timeout=600 setCompress=1 setDeltaCopy=0 setTarqAcl=1 ";
+    const std::string docs = root_.Path("docs");
+    EXPECT_EQ(world_.runs[0],
+              base + "excludes=1 src=" + docs + "/ dest=alice:secret@10.0.0.1::docs| cancellable");
+    EXPECT_EQ(rsyncer_.RunSync(1, "docs", "/sub", {}, status_), 0);
+    EXPECT_EQ(world_.runs[1], base + "setRelativePath=1 excludes=0 src=" + docs +
+                                  "/./sub dest=alice:secret@10.0.0.1::docs| cancellable");
+    EXPECT_EQ(rsyncer_.RunSync(1, "vault", "/", {}, status_), 0);
+    EXPECT_THAT(world_.runs[2], HasSubstr("src=" + root_.Path("vault.enc") +
+                                          "/ dest=alice:secret@10.0.0.1::@vault@|"));
+    // The host was asked once for each share.
+    EXPECT_THAT(world_.looked_up, ElementsAre("docs", "vault"));
+
+    // Statuses come back as they are, and any but 0 is explained, 207 too.
+    world_.copy_statuses = {207};
+    EXPECT_EQ(rsyncer_.RunSync(1, "docs", "/", {}, status_), 0);
+    EXPECT_EQ(status_, 207);
+    EXPECT_EQ(world_.errors_logged, 1);
+    // A path that is gone is no error and no run.
+    EXPECT_EQ(rsyncer_.RunSync(1, "docs", "/gone", {}, status_), 0);
+    EXPECT_EQ(status_, 0);
+    EXPECT_EQ(world_.runs.size(), 4U);
+}
+
+TEST_F(RsyncerTest, CommandsThatAreAcceptedAreNotExplained) {
+    Connect();
+    for (const int status : {0, 207, 208, 214}) {
+        world_.answers["ZEL_UpdateTaskStatus"] = {{status}};
+        EXPECT_EQ(rsyncer_.SendBeacon("task", status_), 0);
+        EXPECT_EQ(status_, status);
+    }
+    EXPECT_EQ(world_.errors_logged, 1);
+    EXPECT_EQ(rsyncer_.FinishSync("share", "docs", status_), 0);
+    EXPECT_THAT(world_.commands.back(),
+                ElementsAre("command=\"ZEL_SyncFinish\"", "clientID=\"SN1\"",
+                            "finishType=\"share\"", "name=\"docs\""));
+    EXPECT_EQ(rsyncer_.FinishSync("", "docs", status_), -1);
+    EXPECT_EQ(rsyncer_.SendBeacon("", status_), -1);
+    EXPECT_THAT(Text(), HasSubstr("GenFinishSyncCmd: Empty parameter\n"));
+    EXPECT_THAT(Text(), HasSubstr("GenSendBeaconCmd: Empty parameter\n"));
+}
+
+TEST_F(RsyncerTest, AKeyFileTravelsOverSshWhateverTheTaskSays) {
+    Connect();
+    EXPECT_EQ(rsyncer_.SyncEncryptKey("docs"), 0);
+    world_.key_file = root_.Path("no such key");
+    EXPECT_EQ(rsyncer_.SyncEncryptKey("vault"), 0);
+    EXPECT_THAT(world_.runs, IsEmpty());
+
+    world_.key_file = root_.Write("vault.key", "key");
+    world_.copy_statuses = {12};
+    EXPECT_EQ(rsyncer_.SyncEncryptKey("vault"), 12);
+    EXPECT_EQ(world_.runs[0],
+              std::string(kDefaults) +
+                  "setSsh=0 setDebugLog=1 timeout=600 setCompress=0 setDeltaCopy=0 setSsh=1 "
+                  "port=2222 excludes=0 src=" +
+                  world_.key_file +
+                  " dest=alice:secret@10.0.0.1::/usr/tarq/etc/.encrypt|vault plain");
+
+    world_.shares["vault"].flags |= TARQ_SHARE_AUTO_MOUNT;
+    EXPECT_EQ(rsyncer_.SyncEncryptKey("vault"), 300);
+    EXPECT_EQ(rsyncer_.SyncEncryptKey("unknown"), 300);
+    EXPECT_THAT(Text(), HasSubstr("Fail to get auto key file path for share 'vault', errno=["));
+    EXPECT_THAT(Text(), HasSubstr("Fail to get share 'unknown', errno=[5120]\n"));
+}
+
+TEST(SplitStringByChars, KeepsEmptyPiecesAndAppends) {
+    std::list<std::string> out = {"x"};
+    ZEL::SplitStringByChars(":a;:b", ":;", out);
+    EXPECT_THAT(out, ElementsAre("x", "", "a", "", "b"));
+    out.clear();
+    ZEL::SplitStringByChars("", ":", out);
+    EXPECT_THAT(out, ElementsAre(""));
+}
+
+}  // namespace

@@ -1,0 +1,311 @@
+// The server's side: what arrives from outside, and who may do what.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <cstdlib>
+#include <filesystem>
+
+#include "ZEL/is_syncedshare.h"
+#include "programs/common/server_status.h"
+#include "programs/zel_server/accounts.h"
+#include "programs/zel_server/answers.h"
+#include "programs/zel_server/command.h"
+#include "programs/zel_server/command_handler.h"
+#include "programs/zel_server/registry.h"
+#include "programs/zel_server/rsyncd_config.h"
+#include "programs/zel_server/transfer.h"
+#include "tests/support/temp_root.h"
+
+using namespace programs;
+using namespace zel_server;
+using testing::ElementsAre;
+using testing::HasSubstr;
+
+namespace {
+
+const std::string kSession(32, 'a');
+const std::string kHead = "session=\"" + kSession + "\"\ncommand=\"X\"\nclientID=\"SN1\"\n";
+
+TEST(CommandText, IsTakenApart) {
+    const auto command = ParseCommand(kHead + "name=\"a b=c\"\nempty=\"\"");
+    ASSERT_TRUE(command);
+    EXPECT_EQ(command->name, "X");
+    EXPECT_EQ(command->client_id, "SN1");
+    EXPECT_EQ(*command->Find("name"), "a b=c");
+    EXPECT_EQ(*command->Find("empty"), "");
+    EXPECT_EQ(command->Find("other"), nullptr);
+}
+
+TEST(CommandText, ThatIsNotToTheLetterIsRefusedWhole) {
+    const std::string session = "session=\"" + kSession + "\"\n";
+    const std::string cases[] = {
+        "",
+        session,
+        kHead + "\n",
+        kHead + "key=value\n",
+        kHead + "key=\"v\n",
+        kHead + "key=\"\"\"\n",
+        kHead + "k=\"1\"\nk=\"2\"\n",  // repeated
+        kHead + "command=\"Y\"\n",
+        kHead + "clientID=\"SN2\"\n",  // a forged second one
+        kHead + session,
+        kHead + "k=\"a\x01b\"\n",
+        kHead + "k=\"a\rb\"\n",
+        kHead + std::string("k=\"a\0b\"\n", 8),
+        kHead + "k1=\"v\"\n",
+        kHead + "=\"v\"\n",
+        kHead + " k=\"v\"\n",
+        session + "clientID=\"SN1\"\ncommand=\"X\"\n",  // out of order
+        session + "command=\"X\"\nclientID=\"\"\n",
+        session + "command=\"\"\nclientID=\"SN1\"\n",
+        session + "command=\"X\"\nclientID=\"a]b\"\n",
+        session + "command=\"X\"\nclientID=\"" + std::string(36, 'x') + "\"\n",
+        kHead + "k=\"" + std::string(5 * 1024, 'x') + "\"\n",
+    };
+    for (const std::string& text : cases) {
+        EXPECT_FALSE(ParseCommand(text)) << text;
+    }
+    for (const std::string& text : {std::string("session=\"../../etc/passwd\"\n"),
+                                    "session=\"" + std::string(32, 'A') + "\"\n",
+                                    std::string("command=\"X\"\n"), std::string()}) {
+        EXPECT_FALSE(ParseSession(text)) << text;
+    }
+}
+
+class ServerTest : public testing::Test {
+protected:
+    ServerTest() {
+        for (const std::string& folder :
+             {ShareModules(), AdminModules(), root_.Path("storage"), root_.Path("disk2")}) {
+            std::filesystem::create_directories(folder);
+        }
+        config_.port = 8873;
+        config_.storage = root_.Path("storage");
+        config_.volumes["volume2"] = root_.Path("disk2");
+        config_.program = "/usr/bin/zel_server";
+        EXPECT_TRUE(SaveServerConfig(config_));
+        EXPECT_NE(RecordDiskOf(config_.storage), "");
+        EXPECT_NE(RecordDiskOf(root_.Path("disk2")), "");
+    }
+
+    using Params = std::map<std::string, std::string>;
+
+    Answer Do(const std::string& name, const Params& params, const std::string& client = "A",
+              const std::string& account = "alice") {
+        return Execute(config_, account, Command{name, client, params});
+    }
+    int Pair(const std::string& client = "A", const std::string& shares = "docs",
+             bool dry_run = false) {
+        return Do("ZEL_PairingMultiSrc",
+                  {{"serverName", "nas"},
+                   {"syncShares", shares},
+                   {"dryRun", dry_run ? "yes" : "no"},
+                   {"outfile", "/tmp/x"},
+                   {"requireEncryptionShareSupport", "no"}},
+                  client)
+            .status;
+    }
+    int Start(const std::string& share, const std::string& client = "A",
+              const std::string& account = "alice", Params more = {}) {
+        more.insert({{"shareName", share}, {"volumeName", "volume1"}});
+        return Do("ZEL_SyncStart", more, client, account).status;
+    }
+    int Finish(const std::string& type, const std::string& name, const std::string& client = "A",
+               const std::string& account = "alice") {
+        return Do("ZEL_SyncFinish", {{"finishType", type}, {"name", name}}, client, account).status;
+    }
+    ShareState State(const std::string& share) {
+        ShareState state;
+        ReadShare(share, state);
+        return state;
+    }
+    // What the daemon would be told of a connection with these rsync arguments.
+    int Admit(const std::string& module, const std::string& account,
+              const std::vector<std::string>& arguments) {
+        for (int i = 0; i < 9; ++i) {
+            unsetenv(("RSYNC_ARG" + std::to_string(i)).c_str());
+        }
+        setenv("RSYNC_MODULE_NAME", module.c_str(), 1);
+        setenv("RSYNC_USER_NAME", account.c_str(), 1);
+        setenv("RSYNC_ARG0", "rsyncd", 1);
+        for (size_t i = 0; i < arguments.size(); ++i) {
+            setenv(("RSYNC_ARG" + std::to_string(i + 1)).c_str(), arguments[i].c_str(), 1);
+        }
+        return AdmitTransfer();
+    }
+
+    test::TempRoot root_;
+    ServerConfig config_;
+};
+
+const std::vector<std::string> kWrite = {"--server", "-logDtpre.iLsfxCIvu", "--delete", ".", "."};
+const std::vector<std::string> kDryRun = {"--server", "-nlogDtpre.iLsfxCIvu", ".", "."};
+const std::vector<std::string> kRead = {"--server", "--sender", "-logDtpre.iLsfxCIvu", ".", "."};
+
+TEST_F(ServerTest, APushGoesFromPairingToCompletion) {
+    EXPECT_EQ(Do("ZEL_GetProtocolVer", {{"outfile", "/x"}}).body, "1\n");
+    EXPECT_EQ(Start("docs"), kNotPaired);
+    EXPECT_EQ(Pair("A", "docs", true), kDone);
+    EXPECT_EQ(Start("docs"), kNotPaired);  // the dry run has changed nothing
+    EXPECT_EQ(Pair(), kDone);
+    EXPECT_EQ(Start("docs", "A", "alice",
+                    {{"isEncrypt", "0"}, {"connAccount", "alice"}, {"unknown", "ignored"}}),
+              kDone);
+    EXPECT_EQ(State("docs").running_id, "A");
+    EXPECT_EQ(TARQZELIsSyncedShare("docs"), 1);
+    EXPECT_TRUE(std::filesystem::is_directory(root_.Path("storage/docs")));
+    EXPECT_THAT(test::ReadFile(ShareModules() + "/docs.conf"),
+                HasSubstr("[docs]\n    path = " + root_.Path("storage/docs")));
+    EXPECT_EQ(Do("ZEL_UpdateTaskStatus", {{"taskName", "t"}}).status, kDone);
+    zel_svr_status status = {};
+    ASSERT_EQ(zel_svr_get_status(&status), 0);
+    EXPECT_EQ(status.busy, 1);
+    zel_svr_put_status(&status);
+    EXPECT_EQ(Finish("share", "docs"), kDone);
+    EXPECT_EQ(Finish("task", "t"), kDone);
+    EXPECT_EQ(State("docs").running_id, "");
+    EXPECT_EQ(State("docs").complete_id, "A");
+    EXPECT_EQ(Finish("share", "docs"), kNotRunning);
+    EXPECT_EQ(Do("ZEL_Unknown", {}).status, kUnknownCommand);
+}
+
+TEST_F(ServerTest, AnotherClientOrAccountNeverGetsAtAShare) {
+    ASSERT_EQ(Pair("A"), kDone);
+    ASSERT_EQ(Pair("B", "other"), kDone);
+    ASSERT_EQ(Start("docs"), kDone);
+    EXPECT_EQ(Start("docs", "B"), kConflicts);
+    EXPECT_EQ(Start("DOCS", "B"), kConflicts);
+    EXPECT_EQ(Start("docs", "A", "mallory"), kOtherAccount);
+    EXPECT_EQ(Start("new", "A", "mallory", {{"connAccount", "alice"}}), kOtherAccount);
+    EXPECT_EQ(Finish("share", "docs", "B"), kNotRunning);
+    EXPECT_EQ(Finish("abort", "docs", "A", "mallory"), kNotRunning);
+    ASSERT_EQ(Finish("share", "docs"), kDone);
+    // Now that nobody pushes, the copy still belongs to A and alice.
+    EXPECT_EQ(Start("docs", "B"), kConflicts);
+    EXPECT_EQ(Start("Docs"), kNameTaken);
+    EXPECT_EQ(Start("docs", "A", "mallory"), kOtherAccount);
+    const Answer pairing = Do("ZEL_PairingMultiSrc",
+                              {{"serverName", "nas"},
+                               {"syncShares", "free:docs"},
+                               {"dryRun", "no"},
+                               {"outfile", "x"},
+                               {"requireEncryptionShareSupport", "no"}},
+                              "B");
+    EXPECT_EQ(pairing.status, kConflicts);
+    EXPECT_EQ(pairing.body, "docs\n");
+}
+
+TEST_F(ServerTest, ADataRunIsLetInOnlyForTheOwningAccountWhileItIsStarted) {
+    ASSERT_EQ(Pair(), kDone);
+    EXPECT_NE(Admit("docs", "alice", kWrite), 0);  // not known yet
+    ASSERT_EQ(Start("docs"), kDone);
+    EXPECT_EQ(Admit("docs", "alice", kWrite), 0);
+    EXPECT_NE(Admit("docs", "mallory", kWrite), 0);
+    EXPECT_NE(Admit("docs", "mallory", kRead), 0);
+    EXPECT_NE(Admit("@docs@", "alice", kWrite), 0);
+    ASSERT_EQ(Finish("share", "docs"), kDone);
+    EXPECT_NE(Admit("docs", "alice", kWrite), 0);
+    EXPECT_EQ(Admit("docs", "alice", kRead), 0);
+    EXPECT_EQ(Admit("docs", "alice", kDryRun), 0);
+    // Behind the "." come paths, behind an "e" capabilities: neither makes a run harmless.
+    EXPECT_NE(Admit("docs", "alice", {"--server", "-logDtpre.n", ".", "--sender"}), 0);
+    ASSERT_EQ(TARQUISetZEL(0, nullptr, nullptr), 0);
+    EXPECT_NE(Admit("docs", "alice", kRead), 0);
+    EXPECT_EQ(Start("docs"), kSwitchedOff);
+    EXPECT_EQ(Do("ZEL_GetProtocolVer", {{"outfile", "/x"}}).status, kSwitchedOff);
+}
+
+TEST_F(ServerTest, NamesNeverReachOutsideTheirPlace) {
+    ASSERT_EQ(Pair(), kDone);
+    for (const char* name :
+         {"", ".", "..", ".hidden", "a/b", "../up", "a\\b", "a\"b", "a]b", "a%b", "a:b", "a\nb",
+          "a\x7f", " a", "a ", "zel_command", "ZEL_Command", "global", "@a@"}) {
+        EXPECT_EQ(Start(name), kBadArgument) << name;
+        EXPECT_EQ(Finish("share", name), kBadArgument) << name;
+    }
+    EXPECT_EQ(Start(std::string(81, 'x')), kBadArgument);
+    for (const char* volume : {"..", "../x", "a/../b", ".x", "a\nb"}) {
+        EXPECT_EQ(Do("ZEL_SyncStart", {{"shareName", "s"}, {"volumeName", volume}}).status,
+                  kBadArgument)
+            << volume;
+    }
+    EXPECT_TRUE(std::filesystem::is_empty(root_.Path("storage")));
+    // Volumes that the server does not have, nested mounts among them, mean the common folder.
+    for (const char* volume : {"", "volume1", "mnt/data", "/etc"}) {
+        EXPECT_EQ(Do("ZEL_SyncStart", {{"shareName", "s"}, {"volumeName", volume}}).status, kDone)
+            << volume;
+        EXPECT_EQ(State("s").path, root_.Path("storage/s"));
+    }
+    EXPECT_EQ(Do("ZEL_SyncStart", {{"shareName", "Größe 1"}, {"volumeName", "volume2"}}).status,
+              kDone);
+    EXPECT_EQ(State("Größe 1").path, root_.Path("disk2/Größe 1"));
+}
+
+TEST_F(ServerTest, MissingAndOddArgumentsAreRefused) {
+    ASSERT_EQ(Pair(), kDone);
+    EXPECT_EQ(Do("ZEL_GetProtocolVer", {}).status, kBadArgument);
+    EXPECT_EQ(Do("ZEL_Pairing", {{"dryRun", "maybe"}, {"serverName", "x"}}).status, kBadArgument);
+    EXPECT_EQ(Do("ZEL_PairingMultiSrc", {{"dryRun", "no"}}).status, kBadArgument);
+    EXPECT_EQ(Do("ZEL_UpdateTaskStatus", {}).status, kBadArgument);
+    EXPECT_EQ(Do("ZEL_UpdateTaskStatus", {{"taskName", "a]\n[b"}}).status, kBadArgument);
+    EXPECT_EQ(Finish("other", "docs"), kBadArgument);
+    EXPECT_EQ(Do("ZEL_SyncStart", {{"shareName", "docs"}}).status, kBadArgument);
+    EXPECT_EQ(Start("docs", "A", "alice", {{"isEncrypt", "2"}}), kBadArgument);
+    EXPECT_EQ(Start("docs", "A", "alice", {{"lenEncKey", "-1"}}), kBadArgument);
+    EXPECT_EQ(Pair("A", "a:..:b"), kBadArgument);
+    config_.encryption = false;
+    EXPECT_EQ(Start("docs", "A", "alice", {{"isEncrypt", "1"}}), kNoEncryption);
+    std::filesystem::remove_all(root_.Path("storage"));
+    EXPECT_EQ(Start("docs"), kStorage);
+}
+
+TEST_F(ServerTest, TheSingleClientStaysPairedWhenASecondComes) {
+    ASSERT_EQ(TARQUISetZEL(1, "OLD", "nas-old"), 0);
+    EXPECT_EQ(IsPaired("OLD"), Paired::kYes);
+    EXPECT_EQ(IsPaired("A"), Paired::kNo);
+    ASSERT_EQ(Pair("A"), kDone);
+    EXPECT_EQ(IsPaired("OLD"), Paired::kYes);
+    EXPECT_EQ(IsPaired("A"), Paired::kYes);
+    EXPECT_EQ(ZELServerIfOldClientPaired(), 0);
+}
+
+TEST_F(ServerTest, TheOutcomeOfADataRunIsRecordedAndAnAnswerRemoved) {
+    ASSERT_EQ(Pair(), kDone);
+    ASSERT_EQ(Start("docs"), kDone);
+    Admit("docs", "alice", kWrite);
+    setenv("RSYNC_EXIT_STATUS", "11", 1);
+    EXPECT_EQ(EndTransfer(), 0);
+    EXPECT_EQ(State("docs").last_result, "11");
+    EXPECT_EQ(State("docs").running_id, "A");
+    setenv("RSYNC_EXIT_STATUS", "0", 1);
+    Admit("docs", "mallory", kWrite);
+    EXPECT_EQ(EndTransfer(), 0);
+    EXPECT_EQ(State("docs").last_result, "11");
+
+    ASSERT_TRUE(PrepareAnswers("alice"));
+    ASSERT_TRUE(WriteAnswer("alice", kSession, "4711", {214, "docs\n"}));
+    EXPECT_FALSE(WriteAnswer("alice", kSession, "4712", {0, ""}));
+    const std::string folder = AnswerFolder() + "/alice";
+    EXPECT_EQ(test::ReadFile(folder + "/" + kSession), "status=\"214\"\ndocs\n");
+    Admit("zel_command", "alice", {});
+    setenv("RSYNC_PID", "4711", 1);
+    EXPECT_EQ(EndTransfer(), 0);
+    EXPECT_TRUE(std::filesystem::is_empty(folder));
+}
+
+TEST_F(ServerTest, AccountsAreKeptInAPrivateFile) {
+    EXPECT_TRUE(SetAccount("alice", "one"));
+    EXPECT_TRUE(SetAccount("bob", "two:three"));
+    EXPECT_TRUE(SetAccount("alice", "new"));
+    EXPECT_THAT(*Accounts(), ElementsAre("alice", "bob"));
+    EXPECT_EQ(test::ReadFile(SecretsFile()), "alice:new\nbob:two:three\n");
+    struct stat info = {};
+    ASSERT_EQ(stat(SecretsFile().c_str(), &info), 0);
+    EXPECT_EQ(info.st_mode & 0777U, 0600U);
+    EXPECT_TRUE(RemoveAccount("alice"));
+    EXPECT_FALSE(RemoveAccount("alice"));
+    EXPECT_THAT(*Accounts(), ElementsAre("bob"));
+}
+
+}  // namespace

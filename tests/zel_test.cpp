@@ -1,0 +1,395 @@
+#include "ZEL/zel.h"
+
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <pthread.h>
+#include <signal.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <stdexcept>
+#include <thread>
+
+#include "tarq/core.h"
+#include "tarq/netsdk.h"
+#include "tarq/sdk.h"
+#include "tarq/share.h"
+#include "tarq/systemd.h"
+#include "tests/support/log_capture.h"
+
+namespace {
+
+using Strings = std::vector<std::string>;
+using testing::ElementsAre;
+using testing::IsEmpty;
+
+// What the platform's operations below answer with, and what they were asked.
+struct Host {
+    TARQShareRec share = {nullptr, const_cast<char*>("/volume1/docs"), 0, 256};
+    int share_result = 0, encrypt_path_result = 0, volume_result = 0;
+    int open_records = 0;
+    std::string volume = "/volume1";
+    unsigned int volume_type = 1;
+    int small_device = 0, in_sharebin = 0;
+    std::string serial;
+    int interfaces = 1;
+    Strings addresses;
+    bool look_up_fails = false;
+    int unit_status = 0, unit_result = 0, unit_error = 0;
+    Strings calls;
+} host;
+
+int AskUnit(const char* unit, int result) {
+    KAPICErrSetEx(host.unit_error, __FILE__, __LINE__);
+    return std::string(unit) == "zel_daemon" ? result : -99;
+}
+
+}  // namespace
+
+int TARQShareGet(const char* name, TARQShare* share) {
+    host.calls.push_back(name);
+    *share = new TARQShareRec(host.share);
+    ++host.open_records;
+    return host.share_result;
+}
+void TARQShareFree(TARQShare share) {
+    host.open_records -= share != nullptr;
+    delete share;
+}
+int KAPIShareEncryptPathGet(const char* path, char* buffer, int size) {
+    snprintf(buffer, static_cast<size_t>(size), "%s/@%d@", path, size);
+    return host.encrypt_path_result;
+}
+int VolumePathParseEx(const char* path, TARQVolumePath* volume) {
+    host.calls.push_back(path);
+    host.volume.copy(volume->path, sizeof volume->path);
+    volume->type = host.volume_type;
+    return host.volume_result;
+}
+int KAPICIsMiniUnit(void) {
+    return host.small_device;
+}
+int TARQShareIsInSharebin(const char*) {
+    return host.in_sharebin;
+}
+int KAPIGetSerialNumber(char* buffer, int size) {
+    host.serial.copy(buffer, static_cast<size_t>(size));
+    return 0;
+}
+int KAPINetGetInterfaceInfo(KAPINetInterface* records, int count, int flags) {
+    *records = {"eth0", {0x02, 0x00, 0x5E, 0xAB, 0x0C, 0xFF}};
+    return count == 1 && flags == 1 ? host.interfaces : -1;
+}
+int TARQNetLookupIP(const char* name, TARQNetAddress* records, int count, int) {
+    host.calls.push_back(name + std::to_string(count));
+    for (size_t i = 0; i < host.addresses.size(); ++i) {
+        host.addresses[i].copy(records[i].address, sizeof records[i].address);
+    }
+    return host.look_up_fails ? -1 : static_cast<int>(host.addresses.size());
+}
+int TARQSystemdActiveStatusGet(const char* unit) {
+    return AskUnit(unit, host.unit_status);
+}
+int TARQSystemdStart(const char* unit) {
+    return AskUnit(unit, host.unit_result);
+}
+int TARQSystemdStop(const char* unit) {
+    return AskUnit(unit, host.unit_result);
+}
+
+namespace {
+
+class Zel : public testing::Test {
+protected:
+    Zel() { host = {}; }
+    ~Zel() override { EXPECT_EQ(host.open_records, 0); }
+
+    // What was logged since the last look, a line each without level and source.
+    Strings Faults() {
+        Strings faults;
+        const Strings lines = log_.Lines();
+        for (; seen_ < lines.size(); ++seen_) {
+            EXPECT_EQ(lines[seen_].rfind("[ERROR] ZEL/zel(N): ", 0), 0U) << lines[seen_];
+            faults.push_back(lines[seen_].substr(20));
+        }
+        return faults;
+    }
+    // Lets the machine answer NetBIOS queries.
+    void Answer(const std::string& text) const {
+        const std::string tool =
+            root_.Write("usr/local/bin/nmblookup", "#!/bin/sh\necho \"$@\" >\"$0.asked\"\n" + text);
+        chmod(tool.c_str(), 0700);
+    }
+
+    const test::TempRoot root_;
+    const test::LogCapture log_;
+    size_t seen_ = 0;
+};
+
+TEST_F(Zel, AnEncryptedShareIsServedFromItsStorage) {
+    ZEL::ShareInfo share;
+    host.share.flags = 0x2;
+    ASSERT_EQ(ZEL::GetShareInfo("docs", share), 0);
+    EXPECT_THAT(
+        (Strings{share.GetName(), share.GetPath(), share.GetModuleName(), share.GetModulePath()}),
+        ElementsAre("docs", "/volume1/docs", "@docs@", "/volume1/docs/@4095@"));
+    EXPECT_EQ(share.GetEncryptKeyLen(), 256);
+    host.share.flags = ~0x8886U;
+    ASSERT_EQ(ZEL::GetShareInfo("docs", share), 0);
+    EXPECT_THAT((Strings{share.GetModuleName(), share.GetModulePath()}),
+                ElementsAre("docs", "/volume1/docs"));
+    EXPECT_FALSE(share.IsEncrypted() || share.IsAutoMount() || share.IsWinShare() ||
+                 share.IsACL() || share.IsCluster());
+    host.share.flags = 0x800;
+    ASSERT_EQ(ZEL::GetShareInfo("docs", share), 0);
+    EXPECT_TRUE(share.IsWinShare() && share.IsACL());
+    host.share.flags = 0x8084;
+    ASSERT_EQ(ZEL::GetShareInfo("docs", share), 0);
+    EXPECT_TRUE(share.IsACL() && share.IsAutoMount() && share.IsCluster() && !share.IsWinShare());
+}
+
+TEST_F(Zel, ShareFailuresAreLoggedFromTheInnermostOut) {
+    const auto check = [&](const std::string& name) {
+        bool valid = true;
+        EXPECT_EQ(ZEL::IsValidShare(name, valid), -1);
+        EXPECT_TRUE(valid) << "touched";
+        return Faults();
+    };
+    EXPECT_THAT(check(""), ElementsAre("Fail to get share info", "Fail to get volume info"));
+    EXPECT_THAT(check(std::string("docs\0x", 6)),
+                ElementsAre("Fail to get share 'docs'", "Fail to get share info",
+                            "Fail to get volume info"));
+    EXPECT_THAT(host.calls, IsEmpty());
+    host.volume_result = -1;
+    EXPECT_THAT(check("docs"),
+                ElementsAre("Fail to get volume info of share 'docs'", "Fail to get volume info"));
+    host.share.flags = 0x2;
+    host.encrypt_path_result = -1;
+    EXPECT_EQ(check("docs")[0], "Fail to get encrypted path of share 'docs'");
+    host.share.path = nullptr;
+    EXPECT_EQ(check("docs")[0], "Fail to get the path of share 'docs'");
+    host.share_result = -1;
+    EXPECT_EQ(check("docs")[0], "Fail to get share 'docs'");
+}
+
+TEST_F(Zel, SharesOnInternalVolumesAreValid) {
+    bool valid = false;
+    host.share.flags = 0x2;
+    EXPECT_EQ(ZEL::IsValidShare("docs", valid), 0);
+    EXPECT_TRUE(valid);
+    EXPECT_THAT(host.calls, ElementsAre("docs", "/volume1/docs"));
+    host.volume_type = 0x80000001U;
+    EXPECT_EQ(ZEL::IsValidShare("docs", valid), 0);
+    EXPECT_FALSE(valid);
+
+    ZEL::VolumeInfo volume;
+    EXPECT_THROW(volume.GetName(), std::out_of_range);
+    host.volume = "/" + std::string(127, 'v');  // fills its field
+    ASSERT_EQ(ZEL::GetVolumeInfo("docs", volume), 0);
+    EXPECT_EQ(volume.GetPath(), host.volume);
+    EXPECT_EQ(volume.GetName(), std::string(127, 'v'));
+
+    host.calls.clear();
+    host.small_device = 1;
+    for (const int answer : {1, 0, 2, -1}) {
+        host.in_sharebin = answer;
+        EXPECT_EQ(ZEL::IsValidShare("docs", valid), 0);
+        EXPECT_EQ(valid, answer == 1);
+    }
+    EXPECT_THAT(host.calls, IsEmpty());
+}
+
+TEST_F(Zel, ClientIsTheSerialNumberElseAMacAddress) {
+    EXPECT_EQ(ZEL::GetClientID(), "02:00:5e:ab:0c:ff");
+    host.interfaces = 0;
+    EXPECT_EQ(ZEL::GetClientID(), "");
+    EXPECT_THAT(Faults(), IsEmpty());
+    host.serial = std::string(40, 's');
+    EXPECT_EQ(ZEL::GetClientID(), std::string(36, 's'));
+    root_.Write("usr/tarq/etc/tarqha.conf", "[pair]\nrunning=\"yes\"\n");
+    EXPECT_EQ(ZEL::GetClientID(), host.serial);
+    host.serial = "";
+    EXPECT_EQ(ZEL::GetClientID(), "");
+    EXPECT_THAT(Faults(), ElementsAre("Fail to get ha sn and mac"));
+    root_.Write("usr/tarq/etc/tarqha.conf",
+                "[pair]\nrunning=\"yes\"\nmac0=\"02:00:5e:00:00:01\"\n");
+    EXPECT_EQ(ZEL::GetClientID(), "02:00:5e:00:00:01");
+}
+
+TEST_F(Zel, HostNameKeepsItsTail) {
+    const auto tail = [&](const std::string& name, unsigned int skip) {
+        root_.Write("usr/tarq/etc/tarqsdk.conf", "[device]\nhostname=\"" + name + "\"\n");
+        return ZEL::GetHostName(skip);
+    };
+    EXPECT_EQ(tail("nas", 35), "nas");
+    EXPECT_EQ(tail(std::string(35, 'n'), 35), std::string(35, 'n'));
+    EXPECT_EQ(tail(std::string(35, 'n') + "tail", 35), "tail");
+    EXPECT_EQ(tail("na\ts", 0), "");
+    EXPECT_THAT(Faults(), ElementsAre("Fail to call TARQLnxGetHostname"));
+}
+
+TEST_F(Zel, UsableAddresses) {
+    const std::string literal(46, 'f');  // fills its field
+    const std::string endless = "yes '\tSERVER1 <00>'";
+    const std::string other = "echo SERVER1; printf '\\t\\n\\tOTHER#\\n\\tSERVER1\\n'";
+    const std::string long_name = "printf '\\tLONGER_THAN_16_BYTE'";
+    const std::string long_line = "printf '%0127d\\tSERVER1 <00>\\n' 0";
+    struct {
+        const char *name, *address;
+        std::string answer;
+        Strings found, usable;
+    } const cases[] = {
+        {"", "10.0.0.5", "", {"10.0.0.7"}, {"10.0.0.5"}},
+        {"", "", "", {}, {""}},
+        {"server1", "", "", {literal, "10.0.0.8"}, {literal, "10.0.0.8"}},
+        {"server1", "10.0.0.5", endless, {"10.0.0.7"}, {"10.0.0.5"}},
+        {"server1", "10.0.0.5", other, {literal, "10.0.0.8"}, {literal, "10.0.0.8"}},
+        {"server1", "10.0.0.5", long_line, {"10.0.0.7"}, {"10.0.0.7"}},
+        {"longer_than_16_byte", "10.0.0.5", long_name, {"10.0.0.7"}, {"10.0.0.7"}},
+        {"server1", "10.0.0.5", "", {}, {"10.0.0.5"}},
+        {"server1", "FE80::1", "", {"10.0.0.7", "fe80::1"}, {"FE80::1"}},
+    };
+    for (const auto& c : cases) {
+        Answer(c.answer);
+        host.addresses = c.found;
+        Strings out = {"before"};
+        EXPECT_EQ(ZEL::GetUsableIP(c.name, c.address, out), 0);
+        out.erase(out.begin());
+        EXPECT_EQ(out, c.usable) << c.name << " " << c.address << " " << c.answer;
+    }
+    EXPECT_EQ(test::ReadFile(root_.Path("usr/local/bin/nmblookup.asked")), "-A FE80::1\n");
+    EXPECT_THAT(Faults(), IsEmpty());
+}
+
+TEST_F(Zel, AddressesAreAskedForOnlyWhereNeededAndAFailureAppendsNone) {
+    Strings out;
+    Answer("printf '\\tSERVER1'");
+    EXPECT_EQ(ZEL::GetUsableIP("", "10.0.0.5", out), 0);
+    EXPECT_EQ(ZEL::GetUsableIP("server1", "10.0.0.5", out), 0);
+    EXPECT_THAT(host.calls, IsEmpty());
+    std::filesystem::remove(root_.Path("usr/local/bin/nmblookup.asked"));
+    EXPECT_EQ(ZEL::GetUsableIP("server1", "-option", out), 0);
+    EXPECT_THAT(host.calls, ElementsAre("server120"));
+    EXPECT_FALSE(ZEL::IsPathExist(root_.Path("usr/local/bin/nmblookup.asked")));
+    out.clear();
+    EXPECT_EQ(ZEL::GetUsableIP("server1", "", out), -1);
+    host.look_up_fails = true;
+    host.addresses = {"10.0.0.7"};
+    EXPECT_EQ(ZEL::GetUsableIP("server1", "", out), -1);
+    EXPECT_THAT(Faults(), IsEmpty());
+    std::filesystem::remove(root_.Path("usr/local/bin/nmblookup"));
+    EXPECT_EQ(ZEL::GetUsableIP("server1", "10.0.0.5", out), -1);
+    EXPECT_THAT(Faults(), ElementsAre("nmblookup_r: popen error"));
+    EXPECT_THAT(out, IsEmpty());
+}
+
+TEST_F(Zel, StartingToleratesABusyUnitAndStoppingDoesNot) {
+    struct {
+        int result, error, start, stop;
+    } const cases[] = {{1, 0xEA00, 0, 0}, {0, 0xEB00, 0, -1}, {0, 0xA00, -1, -1}};
+    for (const auto& c : cases) {
+        host.unit_result = c.result;
+        host.unit_error = c.error;
+        EXPECT_EQ(ZEL::StartDaemon(), c.start);
+        EXPECT_EQ(ZEL::StopDaemon(), c.stop);
+    }
+    EXPECT_THAT(Faults(), ElementsAre("Fail to stop daemon, tarqerr=[0xEB00]",
+                                      "Fail to start daemon, tarqerr=[0x0A00]",
+                                      "Fail to stop daemon, tarqerr=[0x0A00]"));
+    for (const int status : {1, 0, -1, 2}) {
+        host.unit_status = status;
+        EXPECT_EQ(ZEL::IsDaemonRunning(), status == 1);
+    }
+}
+
+TEST_F(Zel, TempFilesAreNewEmptyAndPrivate) {
+    const std::string path = ZEL::GetTempFile();
+    ASSERT_EQ(path.rfind(root_.Path("tmp/ZEL/temp."), 0), 0U) << path;
+    EXPECT_NE(ZEL::GetTempFile(), path);
+    EXPECT_EQ(static_cast<unsigned int>(std::filesystem::status(path).permissions()), 0600U);
+    EXPECT_EQ(std::filesystem::file_size(path), 0U);
+    ZEL::PutTempFile("");
+    ZEL::PutTempFile(path);
+    EXPECT_FALSE(ZEL::IsPathExist(path));
+    EXPECT_THAT(Faults(), IsEmpty());
+    ZEL::PutTempFile(path);
+    EXPECT_THAT(Faults(), ElementsAre("Fail to unlink temp file '" + path + "' [2]"));
+    std::filesystem::remove_all(root_.Path("tmp"));
+    EXPECT_EQ(ZEL::GetTempFile(), "");
+    EXPECT_THAT(Faults(), IsEmpty());
+}
+
+TEST_F(Zel, ALockIsHeldFromExLockToUnLockOrTheEnd) {
+    const std::string path = root_.Write("lock", "kept");
+    const ZEL::LockFactory factory(path);
+    const auto is_free = [&] {
+        const int fd = open(path.c_str(), O_RDWR | O_CLOEXEC);
+        const bool free = flock(fd, LOCK_EX | LOCK_NB) == 0;
+        close(fd);
+        return free;
+    };
+    {
+        ZEL::SimpleFileLock lock = factory.GetLock();
+        EXPECT_EQ(lock.UnLock(), 0);
+        EXPECT_EQ(lock.ExLock(), 0);
+        EXPECT_EQ(lock.ExLock(), 0);
+        EXPECT_FALSE(is_free());
+        EXPECT_EQ(lock.UnLock(), 0);
+        EXPECT_TRUE(is_free());
+        EXPECT_EQ(lock.ExLock(), 0);
+        ZEL::SimpleFileLock holder = std::move(lock);
+        // NOLINTNEXTLINE(bugprone-use-after-move,clang-analyzer-cplusplus.Move): it is no lock now
+        EXPECT_EQ(lock.ExLock(), -1);
+        EXPECT_FALSE(is_free());
+        holder = factory.GetLock();
+        EXPECT_TRUE(is_free());
+        EXPECT_EQ(holder.ExLock(), 0);
+    }
+    EXPECT_TRUE(is_free());
+    EXPECT_EQ(test::ReadFile(path), "kept");
+    EXPECT_THAT(Faults(), IsEmpty());
+}
+
+TEST_F(Zel, ALockFileIsPrivateAndStaysOutOfPrograms) {
+    const ZEL::SimpleFileLock lock(root_.Path("lock"));
+    const auto mode = std::filesystem::status(root_.Path("lock")).permissions();
+    EXPECT_EQ(static_cast<unsigned int>(mode), 0600U);
+    const std::string in_program =
+        "test -z \"$(find /proc/self/fd -lname '" + root_.Path("lock") + "')\"";
+    EXPECT_EQ(system(in_program.c_str()), 0);
+
+    const std::string missing = root_.Path("missing/lock");
+    ZEL::SimpleFileLock none(missing);
+    EXPECT_THAT(Faults(), ElementsAre("Fail to open lock file at '" + missing +
+                                      "', error:'No such file or directory'"));
+    EXPECT_EQ(none.ExLock(), -1);
+    EXPECT_THAT(Faults(), IsEmpty());
+}
+
+TEST_F(Zel, ALockWaitsThroughSignalsUntilItIsFree) {
+    struct sigaction nothing = {};
+    nothing.sa_handler = [](int) {};
+    sigaction(SIGUSR1, &nothing, nullptr);
+    ZEL::SimpleFileLock held(root_.Path("lock"));
+    ASSERT_EQ(held.ExLock(), 0);
+    std::atomic<bool> given_back{false};
+    std::thread waiter([&] {
+        ZEL::SimpleFileLock lock(root_.Path("lock"));
+        EXPECT_EQ(lock.ExLock(), 0);
+        EXPECT_TRUE(given_back);
+    });
+    for (int i = 0; i < 10; ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(2));
+        pthread_kill(waiter.native_handle(), SIGUSR1);
+    }
+    given_back = true;
+    EXPECT_EQ(held.UnLock(), 0);
+    waiter.join();
+}
+
+}  // namespace
