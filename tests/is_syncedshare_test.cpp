@@ -7,6 +7,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 
 #include "tests/support/string_hash.h"
@@ -17,13 +18,12 @@ namespace {
 
 const char* failing = "";  // the platform operation that fails
 int passes = 0;            // how many calls of it succeed first
-int failing_code = 0;      // the error code that it sets
 
 bool Fails(const char* operation) {
     if (std::string(failing) != operation || passes-- > 0) {
         return false;
     }
-    KAPICErrSetEx(failing_code, "", 0);
+    KAPICErrSetEx(0x123, "", 0);
     return true;
 }
 
@@ -35,25 +35,25 @@ bool Fails(const char* operation) {
         static const auto next = reinterpret_cast<Result(*) Parameters>(dlsym(RTLD_NEXT, #Name)); \
         return Fails(#Name) ? (failed) : next Arguments;                                          \
     }
+// clang-format off
+using Hash_ = KAPICSzHash;
+using List_ = KAPICSzList;
+using Str = const char*;
 FRONT(int, KAPICSemOpen, (int key), (key), -1)
 FRONT(int, KAPICSemLock, (int id), (id), -1)
-FRONT(KAPICSzHash, KAPICSzHashAlloc, (int n), (n), nullptr)
-FRONT(KAPICSzList, KAPICSzListAlloc, (int n), (n), nullptr)
-FRONT(int, KAPICSzHashSetValue, (KAPICSzHash h, const char* k, const char* v), (h, k, v), -1)
-FRONT(int, KAPICSzListPush, (KAPICSzList l, const char* s), (l, s), -1)
-FRONT(char*, KAPICStrGet, (const char* f, const char* a), (f, a), nullptr)
-FRONT(int, KAPICProcAliveByPidFile, (const char* p), (p), 0)
-FRONT(int, KAPICFileExist, (const char* p), (p), 0)
-FRONT(int, KAPICFileEnumSection, (const char* p, KAPICSzList l), (p, l), -1)
-FRONT(int, KAPICFileGetSection, (const char* p, const char* s, KAPICSzHash h), (p, s, h), -3)
-FRONT(int, KAPICFileGetSectionValue, (const char* p, const char* s, const char* k, char* b, int n),
-      (p, s, k, b, n), -1)
-FRONT(int, KAPICFileSetSection, (const char* p, const char* s, int r, KAPICSzHash h, const char* f),
-      (p, s, r, h, f), -1)
-FRONT(int, KAPICFileAddSection, (const char* p, const char* s, KAPICSzHash h, const char* f),
-      (p, s, h, f), -1)
-FRONT(int, KAPICIFileModifySection,
-      (const char* p, const char* s, int r, KAPICSzHash h, int a, int b), (p, s, r, h, a, b), -1)
+FRONT(Hash_, KAPICSzHashAlloc, (int n), (n), nullptr)
+FRONT(List_, KAPICSzListAlloc, (int n), (n), nullptr)
+FRONT(int, KAPICSzHashSetValue, (Hash_ h, Str k, Str v), (h, k, v), -1)
+FRONT(int, KAPICSzListPush, (List_ l, Str s), (l, s), -1)
+FRONT(char*, KAPICStrGet, (Str f, Str a), (f, a), nullptr)
+FRONT(int, KAPICFileEnumSection, (Str p, List_ l), (p, l), -1)
+FRONT(int, KAPICFileGetSection, (Str p, Str s, Hash_ h), (p, s, h), -3)
+FRONT(int, KAPICFileGetSectionValue, (Str p, Str s, Str k, char* b, int n), (p, s, k, b, n), -1)
+FRONT(int, KAPICFileSetSection, (Str p, Str s, int r, Hash_ h, Str f), (p, s, r, h, f), -1)
+FRONT(int, KAPICFileAddSection, (Str p, Str s, Hash_ h, Str f), (p, s, h, f), -1)
+FRONT(int, KAPICIFileModifySection, (Str p, Str s, int r, Hash_ h, int a, int b),
+      (p, s, r, h, a, b), -1)
+// clang-format on
 
 namespace {
 
@@ -68,19 +68,22 @@ protected:
     Registry() { test::TakeSyslog(); }
     ~Registry() override { failing = ""; }
 
-    void Write(const std::string& text) const { root_.Write("usr/tarq/etc/tarqZEL.info", text); }
+    /// `|` stands for a line break.
+    void Write(std::string text) const {
+        std::replace(text.begin(), text.end(), '|', '\n');
+        root_.Write("usr/tarq/etc/tarqZEL.info", text);
+    }
     std::string Text() const { return test::ReadFile(path_); }
-    static void Fail(const char* operation, int after = 0, int code = 0x123) {
+    static void Fail(const char* operation, int after = 0) {
         failing = operation;
         passes = after;
-        failing_code = code;
     }
     /// The result of the check with the refused names, "214 photos music".
-    static std::string Admit(std::initializer_list<const char*> shares, const char* client) {
+    static std::string Admit(const std::vector<std::string>& shares, const char* client) {
         KAPICSzList list = KAPICSzListAlloc(4), refused = KAPICSzListAlloc(4);
         KAPICSzListPush(refused, "left over");
-        for (const char* share : shares) {
-            KAPICSzListPush(list, share);
+        for (const std::string& share : shares) {
+            KAPICSzListPush(list, share.c_str());
         }
         std::string result = std::to_string(ZELCheckIfSharePaired(list, client, &refused));
         for (int i = 0; i < KAPICSzListCount(refused); ++i) {
@@ -149,46 +152,40 @@ TEST_F(Registry, AWriteReplacesTheWholeSectionOrAppendsIt) {
 }
 
 TEST_F(Registry, AWriteThatFailsSaysWhatFailed) {
-    const std::string file = "[" + path_ + "], section=[SHARE_a], errno=[0x0123]";
-    for (const auto& [operation, text, existing] :
-         std::vector<std::tuple<const char*, std::string, bool>>{
-             {"KAPICSemOpen", "", true},
-             {"KAPICSemLock", "", true},
-             {"KAPICSzHashAlloc", "none", true},
-             {"KAPICFileGetSection",
-              "KAPICFileGetSection error. filePath:[" + path_ +
-                  "] szOldSecName:[SHARE_a]  iRet:[-3]",
-              true},
-             {"KAPICFileSetSection", "KAPICFileSetSection() failed!! szFile=" + file, true},
-             {"KAPICFileAddSection", "KAPICFileAddSection() failed!! szFile=" + file, false}}) {
-        const std::string old = existing ? "[SHARE_a]\n" : "";
+    const std::string at = "[" + path_ + "]", code = ", section=[SHARE_a], errno=[0x0123]";
+    const std::string locked = "ZELUpdateServerInfo() lock failed";
+    const std::string read =
+        "KAPICFileGetSection error. filePath:" + at + " szOldSecName:[SHARE_a]  iRet:[-3]";
+    const std::string set = "KAPICFileSetSection() failed!! szFile=" + at + code;
+    const std::string add = "KAPICFileAddSection() failed!! szFile=" + at + code;
+    using Log = std::vector<std::string>;
+    // clang-format off
+    for (const auto& [operation, old, log] : std::vector<std::tuple<Str, Str, Log>>{
+         {"KAPICSemOpen", "[SHARE_a]\n", {locked}}, {"KAPICSemLock", "[SHARE_a]\n", {locked}},
+         {"KAPICSzHashAlloc", "[SHARE_a]\n", {set_error_}},
+         {"KAPICFileGetSection", "[SHARE_a]\n", {read, set_error_}},
+         {"KAPICFileSetSection", "[SHARE_a]\n", {set, set_error_}},
+         {"KAPICFileAddSection", "", {add, set_error_}}}) {
+        // clang-format on
         Write(old);
         const Hash values{{"k", "v"}};
         Fail(operation);
         EXPECT_EQ(ZELServerUpdateShare("a", values), -1) << operation;
         failing = "";
-        const auto log = test::TakeSyslogTexts();
-        if (text.empty()) {
-            EXPECT_THAT(log, ElementsAre("ZELUpdateServerInfo() lock failed"));
-        } else if (text == "none") {
-            EXPECT_THAT(log, ElementsAre(set_error_));
-        } else {
-            EXPECT_THAT(log, ElementsAre(text, set_error_)) << operation;
-        }
+        EXPECT_EQ(test::TakeSyslogTexts(), log);
         EXPECT_EQ(Text(), old);
         EXPECT_EQ(ZELServerUpdateShare("a", values), 0) << "the lock was given back";
     }
     std::filesystem::remove_all(root_.Path("usr"));
     EXPECT_EQ(ZELServerUpdateShare("a", Hash{}), -1);
-    EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre("Failed to open file [" + path_ +
-                                                         "], errno=[2/No such file or directory]",
-                                                     set_error_));
+    const std::string opened =
+        "Failed to open file " + at + ", errno=[2/No such file or directory]";
+    EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre(opened, set_error_));
     root_.Write("usr", "in the way");
-    failing = "KAPICFileGetSection", passes = 0;
     EXPECT_EQ(ZELUpdateServerInfo("", Hash{}), -1);
     const auto log = test::TakeSyslog();
     ASSERT_EQ(log.size(), 2U);
-    EXPECT_EQ(log[0].text, "Failed to stat file [" + path_ + "], errno=[20/Not a directory]");
+    EXPECT_EQ(log[0].text, "Failed to stat file " + at + ", errno=[20/Not a directory]");
     EXPECT_EQ(log[0].priority, LOG_ERR);
 }
 
@@ -210,15 +207,14 @@ TEST_F(Registry, TheSwitchKeepsWhatItIsNotGiven) {
 }
 
 TEST_F(Registry, AShareIsSyncedWhileSomebodyRunsAndTheSwitchIsNotOff) {
-    for (const auto& [text, synced] : std::vector<std::pair<const char*, int>>{
-             {"[SHARE_a]\nRunningID=\"A\"\n", 1},
-             {"[PairedClientInfo]\n[SHARE_a]\nRunningID=\"A\"\n", 1},
-             {"[PairedClientInfo]\nzelEnabled=\"No\"\n[SHARE_a]\nRunningID=\"A\"\n", 1},
-             {"[PairedClientInfo]\nzelEnabled=\"no\"\n[SHARE_a]\nRunningID=\"A\"\n", 0},
-             {"[SHARE_a]\nRunningID=\"\"\n", 0},
-             {"[SHARE_a]\n", 0},
-             {"[SHARE_A]\nRunningID=\"A\"\n", 0},
-             {"", 0}}) {
+    const std::string share = "[SHARE_a]|RunningID=A|";
+    // clang-format off
+    for (const auto& [text, synced] : std::vector<std::pair<std::string, int>>{
+         {share, 1}, {"[PairedClientInfo]|" + share, 1},
+         {"[PairedClientInfo]|zelEnabled=No|" + share, 1},
+         {"[PairedClientInfo]|zelEnabled=no|" + share, 0}, {"[SHARE_a]|RunningID=|", 0},
+         {"[SHARE_a]|", 0}, {"[SHARE_A]|RunningID=A|", 0}, {"", 0}}) {
+        // clang-format on
         Write(text);
         EXPECT_EQ(TARQZELIsSyncedShare("a"), synced) << text;
     }
@@ -226,86 +222,71 @@ TEST_F(Registry, AShareIsSyncedWhileSomebodyRunsAndTheSwitchIsNotOff) {
     EXPECT_EQ(KAPICErrGet(), 0xD00);
     EXPECT_THAT(test::TakeSyslogTexts(), IsEmpty()) << "absence is no error";
 
-    Write("[SHARE_a]\nRunningID=\"A\"\n");
+    Write(share);
     for (int after : {0, 1}) {
         Fail("KAPICFileGetSectionValue", after);
         EXPECT_EQ(TARQZELIsSyncedShare("a"), 0);
     }
     Fail("KAPICStrGet");
     EXPECT_EQ(TARQZELIsSyncedShare("a"), 0);
-    const std::string at = "ZEL/is_syncedshare:[0-9]+ ";
-    EXPECT_THAT(
-        test::TakeSyslogTexts(),
-        ElementsAre(
-            MatchesRegex(at +
-                         "KAPICFileGetSectionValue error. key:.PairedClientInfo. errno=.0x0123."),
-            MatchesRegex(at + "KAPICFileGetSectionValue error. key:.SHARE_a. errno=.0x0123."),
-            MatchesRegex(at + "Fail to KAPICStrGet shareName:.a. errno=.0x0123.")));
-}
-
-TEST_F(Registry, LowerCaseStopsAtThirtyTwoCharacters) {
-    char target[40] = "";
-    getLowerString("ABCDEFGHIJKLMNOPQRSTUVWXYZ[\xC4\x80@`{ZZZ", target);
-    EXPECT_STREQ(target, "abcdefghijklmnopqrstuvwxyz[\xC4\x80@`{");
+    const std::string at = "ZEL/is_syncedshare:[0-9]+ ",
+                      read = at + "KAPICFileGetSectionValue error. key:.";
+    EXPECT_THAT(test::TakeSyslogTexts(),
+                ElementsAre(MatchesRegex(read + "PairedClientInfo. errno=.0x0123."),
+                            MatchesRegex(read + "SHARE_a. errno=.0x0123."),
+                            MatchesRegex(at + "Fail to KAPICStrGet shareName:.a. errno=.0x0123.")));
 }
 
 TEST_F(Registry, AShareThatAnotherClientSyncsIntoIsRefused) {
     const std::string id = "123456789-123456789-123456789-123456";  // as long as identities go
-    const std::string running = "\"\nRunningID=\"";
-    Write("[SHARE_Photos]\nCompleteID=\"A" + running + "B\"\n[SHARE_music]\nCompleteID=\"" +
-          running +
-          "\"\n[SHARE_half]\nCompleteID=\"A\"\n[SHARE_none]\n[SHARE_MUSIC]\nRunningID=\"\"\n[SHARE_"
-          "long]\nCompleteID=\"" +
-          running + id +
-          "\"\n[SHARE_Music]\nRunningID=\"C\"\n[SHARE_12345678901234567890123456789012X]"
-          "\nRunningID=\"B\"\n");
+    const std::string name = "12345678901234567890123456789012";    // as much of a name as counts
+    Write(
+        "[SHARE_Photos]|CompleteID=A|RunningID=B|[SHARE_music]|CompleteID=|RunningID=|[SHARE_half]|"
+        "CompleteID=A|"
+        "[SHARE_none]|[SHARE_MUSIC]|RunningID=|[SHARE_long]|CompleteID=|RunningID=" +
+        id + "|[SHARE_Music]|RunningID=C|[SHARE_" + name + "X]|RunningID=B|");
+    // clang-format off
     for (const auto& [shares, client, result] :
-         std::vector<std::tuple<std::initializer_list<const char*>, std::string, std::string>>{
-             {{"new"}, "A", "0"},
-             {{"photos"}, "A", "214 photos"},
-             {{"photos", "Photos"}, "B", "0"},
-             {{"new", "Photos", "video"}, "A", "214 Photos"},
-             {{"music"}, "A", "214 music"},
-             {{"music"}, "C", "0"},
-             {{"Photos", "half", "music"}, "A", "206 Photos"},
-             {{"none"}, "A", "206"},
-             {{"HALF"}, "A", "0"},
-             {{"", "new", "", "photos"}, "A", "214   photos"},
-             {{"long"}, id, "0"},
-             {{"long"}, id.substr(0, 35) + "7", "214 long"},
-             {{"12345678901234567890123456789012Y"},
-              "A",
-              "214 12345678901234567890123456789012Y"}}) {
-        EXPECT_EQ(Admit(shares, client.c_str()), result) << *shares.begin() << " for " << client;
+         std::vector<std::tuple<std::vector<std::string>, std::string, std::string>>{
+         {{"new"}, "A", "0"}, {{"photos"}, "A", "214 photos"}, {{"photos", "Photos"}, "B", "0"},
+         {{"new", "Photos", "video"}, "A", "214 Photos"}, {{"music"}, "A", "214 music"},
+         {{"music"}, "C", "0"}, {{"Photos", "half", "music"}, "A", "206 Photos"},
+         {{"none"}, "A", "206"}, {{"HALF"}, "A", "0"},
+         {{"", "new", "", "photos"}, "A", "214   photos"}, {{"long"}, id, "0"},
+         {{"long"}, id.substr(0, 35) + "7", "214 long"},
+         {{name + "Y"}, "A", "214 " + name + "Y"}}) {
+        // clang-format on
+        EXPECT_EQ(Admit(shares, client.c_str()), result) << shares[0] << " for " << client;
     }
+    const std::string error = "getSharePairStatus error",
+                      parameter = "Parameter error on getSharePairStatus.";
     EXPECT_THAT(
         test::TakeSyslogTexts(),
-        ElementsAre("Failed to get section [half] RunningID value.", "getSharePairStatus error",
-                    "Failed to get section [none] CompleteID value.", "getSharePairStatus error",
-                    "Parameter error on getSharePairStatus.",
-                    "Parameter error on getSharePairStatus."));
+        ElementsAre("Failed to get section [half] RunningID value.", error,
+                    "Failed to get section [none] CompleteID value.", error, parameter, parameter));
 }
 
 TEST_F(Registry, AnAdmissionCheckThatCannotBeFinishedAdmitsNobody) {
-    const std::string converted = "Failed to get converted shared name.";
-    for (const auto& [operation, after, text] :
-         std::vector<std::tuple<const char*, int, std::string>>{
-             {"KAPICFileGetSectionValue", 0, "Failed to get section [photos] CompleteID value."},
-             {"KAPICSzListAlloc", 2, "Failed to allocate memory.\n"},
-             {"KAPICSzHashAlloc", 0, "Failed to allocate memory.\n"},
-             {"KAPICFileEnumSection", 0, "Failed to get section list.\n"},
-             {"KAPICFileGetSection", 0, "Failed to get section.\n"}}) {
-        Write("[SHARE_PHOTOS]\n");
+    const std::string converted = "Failed to get converted shared name.",
+                      memory = "Failed to allocate memory.\n";
+    // clang-format off
+    for (const auto& [operation, after, text, last] :
+         std::vector<std::tuple<Str, int, std::string, std::string>>{
+         {"KAPICFileGetSectionValue", 0, "Failed to get section [photos] CompleteID value.",
+          "getSharePairStatus error"},
+         {"KAPICSzListAlloc", 2, memory, converted}, {"KAPICSzHashAlloc", 0, memory, converted},
+         {"KAPICFileEnumSection", 0, "Failed to get section list.\n", converted},
+         {"KAPICFileGetSection", 0, "Failed to get section.\n", converted}}) {
+        // clang-format on
+        Write("[SHARE_PHOTOS]|");
         Fail(operation, after);
         EXPECT_EQ(Admit({"photos"}, "A"), "206") << operation;
-        const bool status = after == 0 && std::string(operation) == "KAPICFileGetSectionValue";
-        EXPECT_THAT(test::TakeSyslogTexts(),
-                    ElementsAre(text, status ? "getSharePairStatus error" : converted));
+        EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre(text, last));
     }
     std::filesystem::remove_all(root_.Path("usr"));
     EXPECT_EQ(Admit({"photos"}, "A"), "206");
     EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre("Failed to check server info.\n", converted));
-    root_.Write("usr/tarq/etc/tarqZEL.info", "[SHARE_PHOTOS]\nRunningID=\"B\"\n");
+    Write("[SHARE_PHOTOS]|RunningID=B|");
     Fail("KAPICSzListPush", 3);  // left over, photos and the section's name come first
     EXPECT_EQ(Admit({"photos"}, "A"), "206") << "a refusal that cannot be told";
     failing = "";
@@ -318,14 +299,13 @@ TEST_F(Registry, AnAdmissionCheckThatCannotBeFinishedAdmitsNobody) {
 
 TEST_F(Registry, AnOldClientIsOneThatOwnsThePairing) {
     const std::string marker = "ZELMULTI-SRC-SUPPORT";
+    // clang-format off
     for (const auto& [client, server, paired] :
-         std::vector<std::tuple<std::string, std::string, int>>{{"A", "nas", 1},
-                                                                {"A", marker, 1},
-                                                                {marker, "nas", 1},
-                                                                {marker, marker, 0},
-                                                                {"", "nas", 0},
-                                                                {"A", "", 0}}) {
-        Write("[PairedClientInfo]\nclientID=\"" + client + "\"\nserverName=\"" + server + "\"\n");
+         std::vector<std::tuple<std::string, std::string, int>>{
+         {"A", "nas", 1}, {"A", marker, 1}, {marker, "nas", 1}, {marker, marker, 0}, {"", "nas", 0},
+         {"A", "", 0}}) {
+        // clang-format on
+        Write("[PairedClientInfo]|clientID=" + client + "|serverName=" + server + "|");
         EXPECT_EQ(ZELServerIfOldClientPaired(), paired) << client << " " << server;
     }
     Write("");
@@ -370,26 +350,25 @@ TEST_F(Registry, APairingIsRecordedWhole) {
 
 TEST_F(Registry, TheStatusTellsWhatIsServedAndWhetherASyncRuns) {
     EXPECT_EQ(Status(), "0:00 - -");
-    const std::string on = "[PairedClientInfo]\nzelEnabled=\"yes\"\nclientID=\"A\"\n";
+    const std::string on = "[PairedClientInfo]|zelEnabled=yes|clientID=A|";
     Write(on);
     EXPECT_EQ(Status(), "0:00 A -") << "no rsync daemon";
     root_.Write("var/run/rsyncd.pid", std::to_string(getpid()) + "\n");
     EXPECT_EQ(Status(), "0:10 A -");
     const auto ago = [](long long seconds) { return std::to_string(time(nullptr) - seconds); };
+    // clang-format off
     for (const auto& [tasks, busy] : std::vector<std::pair<std::string, char>>{
-             {"[TASK_1]\nstatus=\"idle\"\n[TASK_]\nstatus=\"" + ago(0), '1'},
-             {"[TASK_1]\nstatus=\"" + ago(110), '1'},
-             {"[TASK_1]\nstatus=\"" + ago(120), '0'},
-             {"[TASK_1]\nstatus=\"" + ago(-500), '1'},
-             {"[TASK_1]\nstatus=\"abc", '0'},
-             {"[TASKX]\nstatus=\"" + ago(0), '0'},
-             {"[TASK_1]\nother=\"" + ago(0), '0'},
-             {"[TASK_1]\nstatus=\"" + ago(-(1LL << 32)), '1'},
-             {"[TASK_1]\nstatus=\"-99999999999999999999", '0'}}) {
-        Write(on + tasks + "\"\n");
+         {"[TASK_1]|status=idle|[TASK_]|status=" + ago(0), '1'},
+         {"[TASK_1]|status=" + ago(110), '1'}, {"[TASK_1]|status=" + ago(120), '0'},
+         {"[TASK_1]|status=" + ago(-500), '1'}, {"[TASK_1]|status=abc", '0'},
+         {"[TASKX]|status=" + ago(0), '0'}, {"[TASK_1]|other=" + ago(0), '0'},
+         {"[TASK_1]|status=" + ago(-(1LL << 32)), '1'},
+         {"[TASK_1]|status=-99999999999999999999", '0'}}) {
+        // clang-format on
+        Write(on + tasks);
         EXPECT_EQ(Status(), std::string("0:1") + busy + " A -") << tasks;
     }
-    Write(on + "[TASK_1]\nstatus=\"idle\"\n[TASK_2]\nstatus=\"" + ago(0) + "\"\n");
+    Write(on + "[TASK_1]|status=idle|[TASK_2]|status=" + ago(0));
     for (const auto& [operation, after, expected] :
          {std::tuple("KAPICFileGetSection", 0, "-1:00 - -"),
           {"KAPICFileGetSection", 1, "-1:10 - -"},
