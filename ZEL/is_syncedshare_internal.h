@@ -6,7 +6,7 @@
 #include <string>
 #include <utility>
 
-#include "tarq/core.h"
+#include "tarq/owners.h"
 
 namespace ZEL::registry {
 
@@ -23,18 +23,9 @@ inline constexpr const char* kClientFormat = "CLIENTID_%s";
 
 inline constexpr int kEntries = 1024;  // capacity of the hashes and lists
 
-struct HashFree {
-    void operator()(KAPICSzHash hash) const { KAPICSzHashFree(hash); }
-};
-struct ListFree {
-    void operator()(KAPICSzList list) const { KAPICSzListFree(list); }
-};
-struct TextPut {
-    void operator()(char* text) const { KAPICStrPut(text); }
-};
-using Hash = std::unique_ptr<KAPICSzHashRec, HashFree>;
-using List = std::unique_ptr<KAPICSzListRec, ListFree>;
-using Text = std::unique_ptr<char, TextPut>;
+using Hash = TARQ::HashOwner;
+using List = TARQ::ListOwner;
+using Text = TARQ::TextOwner;
 
 inline Hash MakeHash(int capacity = kEntries) {
     return Hash(KAPICSzHashAlloc(capacity));

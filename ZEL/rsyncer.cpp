@@ -2,11 +2,10 @@
 
 #include <fstream>
 #include <functional>
-#include <memory>
 #include <vector>
 
 #include "ZEL/log.h"
-#include "tarq/share.h"
+#include "tarq/owners.h"
 
 // The texts name the place in this file that speaks, but for two that say a number of their own.
 #define LOG_ERROR_AT(line, text, ...) \
@@ -75,11 +74,6 @@ public:
 private:
     std::string path_;
 };
-
-struct ShareDeleter {
-    void operator()(TARQShareRec* share) const { TARQShareFree(share); }
-};
-using ShareOwner = std::unique_ptr<TARQShareRec, ShareDeleter>;
 
 std::string Line(const std::string& key, const std::string& value) {
     return key + "=\"" + value + "\"";
@@ -409,7 +403,7 @@ int Rsyncer::GenPairMultiSrcCmd(bool dry_run, bool require_encryption,
 int Rsyncer::SyncEncryptKey(const std::string& share_name) const {
     TARQShare record = nullptr;
     const int found = TARQShareGet(share_name.c_str(), &record);
-    const ShareOwner share(record);
+    const TARQ::ShareOwner share(record);
     if (found < 0) {
         LOG_ERROR("Fail to get share '%s', errno=[%d]", share_name.c_str(), KAPICErrGet());
         return kKeyFileFailed;

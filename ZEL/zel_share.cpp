@@ -6,7 +6,7 @@
 #include "ZEL/log.h"
 #include "ZEL/zel.h"
 #include "tarq/core.h"
-#include "tarq/share.h"
+#include "tarq/owners.h"
 
 namespace ZEL {
 
@@ -14,10 +14,7 @@ namespace {
 
 constexpr size_t kEncryptPathSize = 4095;
 
-struct ShareFree {
-    void operator()(TARQShare share) const { TARQShareFree(share); }
-};
-using ShareRecord = std::unique_ptr<TARQShareRec, ShareFree>;
+using ShareRecord = TARQ::ShareOwner;
 
 // Null when there is no such share. A name with a NUL inside names none: the platform would take
 // its head for it.

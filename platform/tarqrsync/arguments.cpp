@@ -203,7 +203,8 @@ void AddReporting(const RunOptions& options, Words* arguments) {
         arguments->push_back("--out-format=" + std::string(kChangeMark) + "%i %l %n");
     }
     if (options.report != nullptr) {
-        arguments->push_back("--stats");
+        // Before rsync 3.4 the closing figures miss what is deleted last: each deletion is told.
+        Append(arguments, {"--stats", "--info=del1"});
     }
     if (options.dry_run) {
         arguments->push_back("--dry-run");

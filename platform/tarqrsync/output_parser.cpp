@@ -18,6 +18,7 @@ constexpr size_t kMaxLine = size_t{64} * 1024;
 constexpr size_t kMaxOtherText = 4096;
 
 constexpr std::string_view kDeleting = "*deleting";
+constexpr std::string_view kDeletingPlain = "deleting ";
 // The letters that tell what happens to an entry, and of which kind it is.
 constexpr size_t kItemizeWidth = 11;
 
@@ -145,6 +146,7 @@ void OutputParser::FillReport(RunReport* report) const {
     for (const Figure& figure : kFigures) {
         report->*figure.member = figures_.*figure.member;
     }
+    report->files_deleted = std::max(report->files_deleted, deletions_told_);
 }
 
 void OutputParser::TakeLine(std::string_view line) {
@@ -203,6 +205,7 @@ bool OutputParser::TakeChange(std::string_view line) {
     change.path = UnescapeName(scanner.Rest());
     if (itemized.substr(0, kDeleting.size()) == kDeleting) {
         change.kind = RunChange::DELETE;
+        ++deletions_told_;
     } else if (itemized[0] == '<' || itemized[0] == '>') {
         change.kind = RunChange::SEND;
     }
@@ -243,6 +246,10 @@ bool OutputParser::TakeListed(std::string_view line) {
 bool OutputParser::TakeFigure(std::string_view line) {
     if (options_.report == nullptr) {
         return false;
+    }
+    if (line.substr(0, kDeletingPlain.size()) == kDeletingPlain) {
+        ++deletions_told_;
+        return true;
     }
     for (const Figure& figure : kFigures) {
         Scanner scanner(line);

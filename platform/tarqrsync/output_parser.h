@@ -44,6 +44,7 @@ private:
     RunProgress progress_;
     std::chrono::steady_clock::time_point next_progress_;
     RunReport figures_;
+    uint64_t deletions_told_ = 0;  // the closing figure may leave out the last ones
     std::string other_text_;
 };
 

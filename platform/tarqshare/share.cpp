@@ -3,7 +3,7 @@
 #include <fcntl.h>
 #include <strings.h>
 #include <sys/stat.h>
-#include <tarq/core.h>
+#include <tarq/owners.h>
 #include <unistd.h>
 
 #include <array>
@@ -39,10 +39,6 @@ using tarq_share::Volume;
 int Fail(int code, int line = __builtin_LINE()) {
     return tarq_internal::Fail(code, "tarq/share", line);
 }
-
-struct ShareFree {
-    void operator()(TARQShare share) const { TARQShareFree(share); }
-};
 
 int Answer(const std::string& text, char* buffer, int size) {
     return CopyOut(text, buffer, size) ? 0 : Fail(TARQ_ERR_BAD_PARAMETER);
@@ -136,7 +132,7 @@ int TARQShareGet(const char* name, TARQShare* share) {
         if (!found || CheckData(*found) < 0) {
             return -1;
         }
-        std::unique_ptr<TARQShareRec, ShareFree> record(new (std::nothrow) TARQShareRec{});
+        TARQ::ShareOwner record(new (std::nothrow) TARQShareRec{});
         if (record) {
             record->name = strdup(found->name.c_str());
             record->path = found->path.empty() ? nullptr : strdup(found->path.c_str());
@@ -294,7 +290,7 @@ int TARQShareIsInSharebin(const char* name) {
         if (TARQShareGet(name, &record) < 0) {
             return 0;
         }
-        const std::unique_ptr<TARQShareRec, ShareFree> share(record);
+        const TARQ::ShareOwner share(record);
         TARQVolumePath volume{};
         return share->path != nullptr && VolumePathParseEx(share->path, &volume) == 0 &&
                        volume.type == TARQ_VOLUME_INTERNAL

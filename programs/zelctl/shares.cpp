@@ -5,23 +5,18 @@
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
-#include <memory>
 
 #include "ZEL/zel.h"
 #include "programs/common/table.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/prepare.h"
 #include "tarq/owners.h"
-#include "tarq/share.h"
 
 namespace zelctl {
 
 namespace {
 
-struct ShareFree {
-    void operator()(TARQShareRec* share) const { TARQShareFree(share); }
-};
-using ShareOwner = std::unique_ptr<TARQShareRec, ShareFree>;
+using TARQ::ShareOwner;
 
 ShareOwner GetShare(const std::string& name) {
     TARQShare share = nullptr;
