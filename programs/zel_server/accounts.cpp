@@ -13,7 +13,7 @@ namespace zel_server {
 
 namespace {
 
-constexpr size_t kMaxSecrets = 4 * 1024 * 1024;
+constexpr size_t kMaxSecrets = 4194304;
 
 // The file's lines, comments included; nothing when it is there and cannot be read.
 std::optional<std::vector<std::string>> ReadLines() {

@@ -61,6 +61,7 @@ std::optional<std::vector<std::string>> SectionNames() {
         return std::nullopt;
     }
     std::vector<std::string> names;
+    names.reserve(static_cast<size_t>(KAPICSzListCount(list.get())));
     for (int i = 0; i < KAPICSzListCount(list.get()); ++i) {
         names.emplace_back(KAPICSzListGet(list.get(), i));
     }

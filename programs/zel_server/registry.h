@@ -12,7 +12,8 @@ namespace zel_server {
 
 using Section = std::map<std::string, std::string>;
 
-/// The client has said that its push ended without being complete; rsync's own word has not come yet.
+/// The client has said that its push ended without being complete; rsync's own word has not come
+/// yet.
 inline constexpr char kEndedByClient[] = "ended";
 
 /// A share's section. `RunningID` and `CompleteID` are the library's keys; the others are this

@@ -17,7 +17,7 @@ namespace zel_server {
 
 namespace {
 
-constexpr size_t kMaxModuleFile = 64 * 1024;
+constexpr size_t kMaxModuleFile = 65536;
 
 bool IsRoot() {
     return geteuid() == 0;

@@ -69,7 +69,7 @@ std::string Explain(int status, const TARQ::Backup::RunReport& report) {
                "network interface; give "
                "it one in /usr/tarq/etc/tarqsdk.conf";
     }
-    const std::string server_text = programs::ServerStatusText(status);
+    std::string server_text = programs::ServerStatusText(status);
     if (!server_text.empty() && (status >= kFirstServerStatus || report.explanation.empty())) {
         return server_text;
     }
@@ -79,10 +79,10 @@ std::string Explain(int status, const TARQ::Backup::RunReport& report) {
 }
 
 ExitCode CodeOf(int status) {
-    if (status == kLookupFailed || status < kFirstServerStatus) {
-        return kFailed;
+    if (status == kNothingSent) {
+        return kLocal;
     }
-    return status == kNothingSent ? kLocal : kRefused;
+    return status < kFirstServerStatus ? kFailed : kRefused;
 }
 
 }  // namespace zelctl

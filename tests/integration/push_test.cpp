@@ -52,8 +52,7 @@ Outcome RunProgram(const std::string& root, std::vector<std::string> command,
 class PushTest : public testing::Test {
 protected:
     PushTest() : port_(test::FreePort()) {
-        for (const char* folder :
-             {"client/usr/tarq/etc", "source"}) {
+        for (const char* folder : {"client/usr/tarq/etc", "source"}) {
             fs::create_directories(folder_.Path(folder));
         }
         Must(Server({"setup", "--storage", storage_, "--port", std::to_string(port_), "--address",

@@ -4,7 +4,8 @@
 
 namespace test {
 
-/// A folder of its own below the system's temporary folder, removed with all that is in it at the end.
+/// A folder of its own below the system's temporary folder, removed with all that is in it at the
+/// end.
 class TempFolder {
 public:
     TempFolder();
@@ -21,8 +22,8 @@ private:
     std::string path_;
 };
 
-/// A TempFolder that is the system's root (TARQ_ROOT) while it lives, with the folders that the system expects. Takes the
-/// registry's semaphore with it.
+/// A TempFolder that is the system's root (TARQ_ROOT) while it lives, with the folders that the
+/// system expects. Takes the registry's semaphore with it.
 class TempRoot : public TempFolder {
 public:
     TempRoot();

@@ -1,4 +1,5 @@
-// C++ owners of the handles of tarq/core.h and tarq/share.h: each frees what it holds when it goes. Header only.
+// C++ owners of the handles of tarq/core.h and tarq/share.h: each frees what it holds when it goes.
+// Header only.
 #pragma once
 
 #include <memory>
