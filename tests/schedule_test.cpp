@@ -173,6 +173,7 @@ TEST(Schedule, NextRun) {
         {berlin, fifth, "2025-10-20 10:00:00", "2025-11-05 06:00:00"},  // from 5 October, in summer
         {berlin, fifth, "2025-11-01 10:00:00", "2025-11-05 07:00:00"},
         {berlin, Make("yearly", "2014-06-15", 8), "2015-03-15 00:00:00", "2015-06-15 06:00:00"},
+        {"America/New_York", daily, "2025-03-08 13:00:00", "2025-03-09 13:00:00"},
         {berlin, Make("weekly", "1", 2), "2025-03-29 23:30:00", "2025-03-30 01:00:00"},  // no 02:00
     };
     for (const auto& c : cases) {
