@@ -101,7 +101,6 @@ TEST(Schedule, ValidateLogsTheFirstFault) {
     } const cases[] = {
         {[](Schedule& s) { s.SetStartHour(23), s.SetStartMinute(59); }, {}},
         {[](Schedule& s) { s.SetStartHour(24), s.SetStartMinute(60); }, {"Invalid begin hour"}},
-        {[](Schedule& s) { s.SetStartHour(-1); }, {"Invalid begin hour"}},
         {[](Schedule& s) { s.SetStartMinute(INT_MIN); }, {"Invalid begin minute"}},
         {[](Schedule& s) { s.SetPeriod(86399); }, {}},
         {[](Schedule& s) { s.SetPeriod(86400); }, {"Invalid period or repeat"}},
@@ -116,7 +115,6 @@ TEST(Schedule, ValidateLogsTheFirstFault) {
          {"Invalid begin", "-2147483648 -2147483648 1 12 0 0"}},
         {[](Schedule& s) { s = Make("once", "2015-2-29", 0); }, {"Invalid begin date"}},
         {[](Schedule& s) { s = Make("once", "2016-2-29", 2); }, {}},
-        {[](Schedule& s) { s.SetBeginMonth(13); }, {"Invalid begin date"}},
         {[](Schedule& s) { const Schedule taken = std::move(s); }, {"Wrong length of weekday ''"}},
         {[](Schedule& s) { s.SetMode(static_cast<ZEL::SCHD_MODE>(6)); },
          {"Invalid schedule mode [6]"}},
@@ -150,9 +148,7 @@ TEST(Schedule, NextRun) {
     } const cases[] = {
         {"UTC", monday, "2015-03-16 07:59:00", "2015-03-16 08:00:00"},
         {"UTC", monday, "2015-03-16 08:00:00", "2015-03-23 08:00:00"},
-        {"UTC", monday, "2015-03-17 00:00:00", "2015-03-23 08:00:00"},
         {"UTC", hourly, "2015-03-16 09:30:00", "2015-03-16 10:00:00"},
-        {"UTC", hourly, "2015-03-16 10:00:00", "2015-03-16 11:00:00"},
         {"UTC", hourly, "2015-12-31 11:00:00", "2016-01-01 08:00:00"},
         {"UTC", last_day, "2015-04-15 12:00:00", "2015-05-01 08:00:00"},
         {"UTC", last_day, "2015-05-01 08:00:00", "2015-05-31 08:00:00"},
@@ -163,7 +159,6 @@ TEST(Schedule, NextRun) {
         {"UTC", once, "2015-01-01 00:00:00", "2015-04-20 08:00:00"},
         {"UTC", once, "2015-04-20 08:00:00", "2015-04-20 08:01:00"},
         {"UTC", once, "2015-04-20 08:01:00", "1970-01-01 00:00:00"},
-        {"UTC", once, "2030-01-01 00:00:00", "1970-01-01 00:00:00"},
         // A start is read with the daylight flag that the search reaches its day with.
         {berlin, daily, "2025-03-29 08:00:00", "2025-03-30 07:00:00"},  // 09:00 in summer
         {berlin, daily, "2025-03-30 07:00:00", "2025-03-31 06:00:00"},
