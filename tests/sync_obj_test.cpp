@@ -30,10 +30,12 @@ using testing::ElementsAre;
 using ZEL::SyncInfo;
 using ZEL::TaskInfo;
 
-SyncInfo ValidInfo() {
+SyncInfo ValidInfo(uint32_t port = 0, uint32_t timeout = 600) {
     SyncInfo info;
     info.SetServerName("server");
     info.SetUser("user");
+    info.SetSSHPort(port);
+    info.SetRsyncTimeout(timeout);
     return info;
 }
 
@@ -50,31 +52,21 @@ TEST(SyncInfo, SwitchesTouchTheirOwnBitAlone) {
 }
 
 TEST(SyncInfo, ValidateLogsTheFirstFault) {
-    const auto with = [](uint32_t port, uint32_t timeout) {
-        SyncInfo info = ValidInfo();
-        info.SetSSHPort(port);
-        info.SetRsyncTimeout(timeout);
-        return info;
-    };
     SyncInfo address_only;
     address_only.SetServerIP("10.0.0.5");
-    struct {
-        SyncInfo info;
-        const char* line;
-    } const cases[] = {
+    const std::pair<SyncInfo, const char*> cases[] = {
         {SyncInfo(), "[NOTE] ZEL/sync_obj(N): Empty server ip and name\n"},
         {address_only, "[NOTE] ZEL/sync_obj(N): Empty user name\n"},
-        {ValidInfo(), ""},
-        {with(65535, 600), ""},
-        {with(65536, 599), "[NOTE] ZEL/sync_obj(N): Invalid SSH port '65536'\n"},
-        {with(0, 599), "[ERROR] ZEL/sync_obj(N): Invalid rsync timeout '599'\n"},
-        {with(0, 86400), ""},
-        {with(0, 4294967295U), "[ERROR] ZEL/sync_obj(N): Invalid rsync timeout '4294967295'\n"},
+        {ValidInfo(65535, 600), ""},
+        {ValidInfo(65536, 599), "[NOTE] ZEL/sync_obj(N): Invalid SSH port '65536'\n"},
+        {ValidInfo(0, 599), "[ERROR] ZEL/sync_obj(N): Invalid rsync timeout '599'\n"},
+        {ValidInfo(0, 86400), ""},
+        {ValidInfo(0, UINT32_MAX), "[ERROR] ZEL/sync_obj(N): Invalid rsync timeout '4294967295'\n"},
     };
-    for (const auto& c : cases) {
+    for (const auto& [info, line] : cases) {
         const test::LogCapture log;
-        EXPECT_EQ(c.info.Validate(), *c.line == '\0');
-        EXPECT_EQ(log.Text(), c.line);
+        EXPECT_EQ(info.Validate(), *line == '\0');
+        EXPECT_EQ(log.Text(), line);
     }
 }
 
