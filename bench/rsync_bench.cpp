@@ -1,12 +1,10 @@
 // What the wrapper costs beside bare rsync, over a daemon of its own on loopback.
 //
-//   rsync_bench [COMMAND_HANDLER] [--copies]
+//   rsync_bench [--copies]
 //
-// COMMAND_HANDLER: the program (with arguments) that answers commands, as for the daemon's `early
-// exec`; by default this program itself, which answers at once. --copies: also the two large
-// copies, which write 2 GB below $TMPDIR. Runs alternate and medians are compared; a busy machine
-// distorts them, so each line gives the ratios of the fastest runs and of processor time as well.
-#include <sys/resource.h>
+// The server is a real one: zel_server's configuration, handler and admission on an rsync daemon.
+// --copies: also the two large copies, which write 2 GB below $TMPDIR. Runs alternate, medians are
+// compared; each line ends in the ratio and the ratio that is wanted.
 #include <sys/stat.h>
 #include <sys/time.h>
 #include <unistd.h>
@@ -19,7 +17,7 @@
 #include <filesystem>
 #include <fstream>
 #include <functional>
-#include <iostream>
+#include <list>
 #include <string>
 #include <vector>
 
@@ -100,25 +98,46 @@ void Print(const char* what, const Contestant& ours, const char* peer, const Con
     std::fflush(stdout);
 }
 
+constexpr char kUser[] = "bob";
+constexpr char kPassword[] = "secret";
+constexpr char kShare[] = "data";
+
 class Bench {
 public:
-    explicit Bench(const std::string& handler) {
-        daemon_.AddCommandModule(handler);
-        std::ofstream(daemon_.AddModule("byte") + "/byte") << "x";
-        module_ = daemon_.AddModule("data", "fake super = yes");
-        password_file_ = root_.Write("password", std::string(test::RsyncDaemon::kPassword) + "\n");
+    Bench() : port_(test::FreePort()) {
+        password_file_ = root_.Write("password", std::string(kPassword) + "\n");
         chmod(password_file_.c_str(), 0600);
         root_.Write("usr/tarq/etc/tarqrsync.conf",
-                    "[rsync]\nport=\"" + std::to_string(daemon_.Port()) + "\"\n");
+                    "[rsync]\nport=\"" + std::to_string(port_) + "\"\n");
+        ZelServer({"setup", "--storage", root_.Path("storage"), "--port", std::to_string(port_),
+                   "--address", "127.0.0.1"});
+        ZelServer({"account", "add", kUser, "--password-file", password_file_});
+        // The peers' modules: nothing of ours is asked there.
+        const std::string configuration = root_.Path("server/usr/tarq/etc/zel_server");
+        const std::string common =
+            "\nread only = no\nuse chroot = no\nfake super = yes\nauth users = " +
+            std::string(kUser) + "\nsecrets file = " + configuration + "/rsyncd.secrets\n" +
+            (geteuid() == 0 ? "uid = 0\ngid = 0\n" : "");
+        root_.Write("byte/byte", "x");
+        fs::create_directories(root_.Path("plain"));
+        root_.Write("server/usr/tarq/etc/zel_server/admin.d/peers.conf",
+                    "[byte]\npath = " + root_.Path("byte") + common +
+                        "[plain]\npath = " + root_.Path("plain") + common);
+        daemon_.Start(
+            {"rsync", "--daemon", "--no-detach", "--config=" + configuration + "/rsyncd.conf"},
+            root_.Path("daemon.log"), port_);
+        Must(Command({"command=\"ZEL_PairingMultiSrc\"", "clientID=\"BENCH\"",
+                      "serverName=\"bench\"", "syncShares=\"data\"", "dryRun=\"no\"",
+                      "outfile=\"\"", "requireEncryptionShareSupport=\"no\""}));
+        Must(Command({"command=\"ZEL_SyncStart\"", "clientID=\"BENCH\"", "volumeName=\"\"",
+                      "shareName=\"data\""}));
     }
 
     void Commands() {
         Contestant wrapper = {nullptr, [this] { return WrapperCommand(); }};
         Contestant plain = {nullptr, [this] { return BareByte({}); }};
         Contestant quick = {nullptr, [this] { return BareByte({"--sockopts=TCP_NODELAY"}); }};
-        Contestant same = {nullptr, [this] { return BareCommand(); }};
-        Measure({&wrapper, &plain, &quick, &same}, kCommandRuns);
-        Print("server command", wrapper, "rsync, the same command", same, 1.05);
+        Measure({&wrapper, &plain, &quick}, kCommandRuns);
         Print("server command", wrapper, "rsync, one byte", plain, 0.35);
         Print("server command", wrapper, "rsync TCP_NODELAY, one byte", quick, 1.2);
     }
@@ -144,8 +163,10 @@ private:
         const std::string source = root_.Path(name);
         Fill(source, count, size);
         const auto empty = [this] {
-            fs::remove_all(module_);
-            fs::create_directories(module_);
+            for (const std::string& folder : {root_.Path("storage/data"), root_.Path("plain")}) {
+                fs::remove_all(folder);
+                fs::create_directories(folder);
+            }
             sync();
         };
         Contestant wrapper = {empty, [&] { return WrapperCopy(source); }};
@@ -166,28 +187,47 @@ private:
         }
     }
 
-    void Prepare(TARQ::Backup::RsyncWrapper& wrapper, const std::string& module) const {
+    static void Must(bool done) {
+        if (!done) {
+            std::fprintf(stderr, "the server cannot be set up\n");
+            std::exit(1);
+        }
+    }
+
+    void ZelServer(Words arguments) const {
+        arguments.insert(arguments.begin(), ZEL_SERVER);
+        tarq_internal::ChildSpec spec;
+        spec.program = ZEL_SERVER;
+        spec.arguments = std::move(arguments);
+        spec.environment = {"LC_ALL=C", "TARQ_ROOT=" + root_.Path("server")};
+        const auto result = tarq_internal::RunChild(spec, nullptr, nullptr, nullptr);
+        Must(result.start_error == 0 && result.wait_status == 0);
+    }
+
+    static void Prepare(TARQ::Backup::RsyncWrapper& wrapper, const std::string& module) {
         wrapper.setDelete(true);
         wrapper.setNumericIds(true);
         wrapper.setTarqAuth(true, true);
         wrapper.setTarqPseudoRoot(true);
         wrapper.setTimeout(600);
-        wrapper.setDestPath(test::RsyncDaemon::kUser, "127.0.0.1", test::RsyncDaemon::kPassword,
-                            module, "");
+        wrapper.setDestPath(kUser, "127.0.0.1", kPassword, module, "");
+    }
+
+    static bool Command(const std::list<std::string>& lines) {
+        TARQ::Backup::RsyncWrapper wrapper;
+        Prepare(wrapper, "");
+        wrapper.setTarqCustCmdRule(lines);
+        return wrapper.execute([] { return false; }) == 0;
     }
 
     bool WrapperCommand() const {
-        TARQ::Backup::RsyncWrapper wrapper;
-        Prepare(wrapper, "");
-        wrapper.setTarqCustCmdRule({"command=\"ZEL_GetProtocolVer\"",
-                                    "clientID=\"00:11:22:33:44:55\"",
-                                    "outfile=\"" + root_.Path("tmp/ZEL/out") + "\""});
-        return wrapper.execute([] { return false; }) == 0;
+        return Command({"command=\"ZEL_GetProtocolVer\"", "clientID=\"BENCH\"",
+                        "outfile=\"" + root_.Path("tmp/ZEL/out") + "\""});
     }
 
     bool WrapperCopy(const std::string& source) const {
         TARQ::Backup::RsyncWrapper wrapper;
-        Prepare(wrapper, "data");
+        Prepare(wrapper, kShare);
         wrapper.setTarqAcl(true);
         wrapper.setSrcPath(source + "/");
         return wrapper.execute([] { return false; }) == 0;
@@ -197,27 +237,20 @@ private:
         return Bare(options, {Server("byte/byte"), root_.Path("tmp/byte")});
     }
 
-    bool BareCommand() const {
-        const std::string command = root_.Path("tmp/command");
-        std::ofstream(command) << "session=\"0\"\ncommand=\"ZEL_GetProtocolVer\"\n";
-        return Bare({"--sockopts=TCP_NODELAY", "--early-input=" + command},
-                    {Server("zel_command/0"), root_.Path("tmp/answer")});
-    }
-
     bool BareCopy(const std::string& source, Words options) const {
         options.insert(options.end(), {"-rlptgo", "-D", "-A", "-X", "--numeric-ids", "--whole-file",
                                        "--delete-after", "--timeout=600"});
-        return Bare(options, {source + "/", Server("data/")});
+        return Bare(options, {source + "/", Server("plain/")});
     }
 
     std::string Server(const std::string& path) const {
-        return std::string(test::RsyncDaemon::kUser) + "@127.0.0.1::" + path;
+        return std::string(kUser) + "@127.0.0.1::" + path;
     }
 
     bool Bare(const Words& options, const Words& paths) const {
         tarq_internal::ChildSpec spec;
         spec.program = tarq_internal::FindProgram("rsync", "/usr/local/bin:/usr/bin:/bin");
-        spec.arguments = {"rsync", "--port=" + std::to_string(daemon_.Port()),
+        spec.arguments = {"rsync", "--port=" + std::to_string(port_),
                           "--password-file=" + password_file_};
         spec.arguments.insert(spec.arguments.end(), options.begin(), options.end());
         spec.arguments.insert(spec.arguments.end(), paths.begin(), paths.end());
@@ -227,40 +260,18 @@ private:
     }
 
     test::TempRoot root_;
-    test::RsyncDaemon daemon_;
-    std::string module_;
+    int port_;
+    test::ServerProcess daemon_;
     std::string password_file_;
 };
-
-/// The stand-in for a server's command handler.
-int AnswerCommand() {
-    std::string word;
-    std::getline(std::cin, word, '"');
-    std::string session;
-    std::getline(std::cin, session, '"');
-    std::ofstream(std::string(std::getenv("ANSWERS")) + "/" + session) << "status=\"0\"\n1\n";
-    return 0;
-}
 
 }  // namespace
 
 int main(int argc, char** argv) {
-    std::string handler = fs::read_symlink("/proc/self/exe").string() + " --answer-command";
-    bool copies = false;
-    for (int i = 1; i < argc; ++i) {
-        if (std::strcmp(argv[i], "--answer-command") == 0) {
-            return AnswerCommand();
-        }
-        if (std::strcmp(argv[i], "--copies") == 0) {
-            copies = true;
-        } else {
-            handler = argv[i];
-        }
-    }
-    Bench bench(handler);
+    Bench bench;
     bench.Commands();
     bench.Unchanged();
-    if (copies) {
+    if (argc > 1 && std::strcmp(argv[1], "--copies") == 0) {
         bench.Copies();
     }
 }
