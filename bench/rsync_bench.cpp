@@ -5,6 +5,7 @@
 // The server is a real one: zel_server's configuration, handler and admission on an rsync daemon.
 // --copies: also the two large copies, which write 2 GB below $TMPDIR. Runs alternate, medians are
 // compared; each line ends in the ratio and the ratio that is wanted.
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/time.h>
 #include <unistd.h>
