@@ -346,7 +346,7 @@ TEST_F(RsyncWrapperTest, ACancelledRunEndsWithinASecondAndLeavesNothing) {
         EXPECT_LT(std::chrono::steady_clock::now() - asked, std::chrono::seconds(1));
         EXPECT_EQ(report_.explanation, "the run was cancelled");
         EXPECT_EQ(CountProcesses("54321"), 0U);
-        EXPECT_EQ(CountProcesses("--early-input="), 0U);
+        EXPECT_EQ(CountProcesses("--early-input=" + root_.Path()), 0U);
         EXPECT_THAT(Leftovers(), IsEmpty());
     }
 }
@@ -688,12 +688,14 @@ TEST_F(RsyncWrapperSshTest, APassphraseIsSeenNowhereAndACancelledRunLeavesNoSsh)
                       for (const auto& [pid, text] : OtherProcesses()) {
                           EXPECT_THAT(text, Not(HasSubstr(secret))) << pid;
                       }
-                      seen_ssh = std::max(seen_ssh, CountProcesses("RSYNC_CONNECT_PROG"));
+                      seen_ssh = std::max(
+                          seen_ssh,
+                          CountProcesses(root_.Path("usr/tarq/etc/tarqrsync_known_hosts")));
                       return ++asked > 5;
                   }),
               20);
     EXPECT_GE(seen_ssh, 2U);
-    EXPECT_EQ(CountProcesses("RSYNC_CONNECT_PROG"), 0U);
+    EXPECT_EQ(CountProcesses(root_.Path("usr/tarq/etc/tarqrsync_known_hosts")), 0U);
     EXPECT_THAT(Leftovers(), IsEmpty());
 }
 
