@@ -30,11 +30,13 @@ bool Fails(const char* operation) {
 }  // namespace
 
 // A platform operation that fails on demand, in front of the real one.
-#define FRONT(Result, Name, Parameters, Arguments, failed)                                        \
-    extern "C" __attribute__((visibility("default"))) Result Name Parameters {                    \
-        static const auto next = reinterpret_cast<Result(*) Parameters>(dlsym(RTLD_NEXT, #Name)); \
-        return Fails(#Name) ? (failed) : next Arguments;                                          \
+// NOLINTBEGIN(bugprone-macro-parentheses)
+#define FRONT(Result, Name, Parameters, Arguments, failed)                                   \
+    extern "C" __attribute__((visibility("default"))) Result Name Parameters {               \
+        static const auto next = reinterpret_cast<decltype(&Name)>(dlsym(RTLD_NEXT, #Name)); \
+        return Fails(#Name) ? (failed) : next Arguments;                                     \
     }
+// NOLINTEND(bugprone-macro-parentheses)
 // clang-format off
 using Hash_ = KAPICSzHash;
 using List_ = KAPICSzList;
@@ -305,7 +307,8 @@ TEST_F(Registry, AnOldClientIsOneThatOwnsThePairing) {
          {"A", "nas", 1}, {"A", marker, 1}, {marker, "nas", 1}, {marker, marker, 0}, {"", "nas", 0},
          {"A", "", 0}}) {
         // clang-format on
-        Write("[PairedClientInfo]|clientID=" + client + "|serverName=" + server + "|");
+        Write(std::string("[PairedClientInfo]|clientID=").append(client).append("|serverName=") +
+              server);
         EXPECT_EQ(ZELServerIfOldClientPaired(), paired) << client << " " << server;
     }
     Write("");

@@ -74,6 +74,7 @@ TEST(RegistryStress, EightWritersAndTwoReadersLoseNothingWhileHoldersOfTheLockDi
     const char* seconds = getenv("ZEL_STRESS_SECONDS");
     const time_t end = time(nullptr) + (seconds != nullptr ? atol(seconds) : 10);
     std::vector<pid_t> children;
+    children.reserve(kWriters + kReaders);
     for (int i = 0; i < kWriters; ++i) {
         children.push_back(Start([=] { return WriteUntil(end, i); }));
     }

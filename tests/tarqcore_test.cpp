@@ -42,11 +42,13 @@ bool IsFolder(int fd) {
 }  // namespace
 
 // clang-format off
+// NOLINTBEGIN(bugprone-macro-parentheses)
 #define FRONT(Result, Name, Parameters, Arguments, fails)                                         \
     extern "C" __attribute__((visibility("default"))) Result Name Parameters {                    \
-        static const auto next = reinterpret_cast<Result(*) Parameters>(dlsym(RTLD_NEXT, #Name)); \
+        static const auto next = reinterpret_cast<decltype(&Name)>(dlsym(RTLD_NEXT, #Name));      \
         return (fails) ? -1 : next Arguments;                                                     \
     }
+// NOLINTEND(bugprone-macro-parentheses)
 FRONT(int, fsync, (int fd), (fd), Fails(IsFolder(fd) ? "fsync folder" : "fsync"))
 FRONT(int, fchmod, (int fd, mode_t mode), (fd, mode), Fails("fchmod"))
 FRONT(int, renameat, (int from_folder, const char* from, int to_folder, const char* to),
@@ -67,6 +69,7 @@ std::vector<std::string> Sections(const std::string& path) {
     KAPICSzList list = KAPICSzListAlloc(16);
     std::vector<std::string> names;
     EXPECT_GE(KAPICFileEnumSection(path.c_str(), list), 0);
+    names.reserve(static_cast<size_t>(KAPICSzListCount(list)));
     for (int i = 0; i < KAPICSzListCount(list); ++i) {
         names.emplace_back(KAPICSzListGet(list, i));
     }

@@ -12,7 +12,10 @@ std::vector<test::SyslogLine> lines;
 
 void Record(int priority, const char* format, va_list arguments) {
     char text[8192];
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"  // it is the caller's
     vsnprintf(text, sizeof text, format, arguments);
+#pragma GCC diagnostic pop
     const std::lock_guard<std::mutex> lock(mutex);
     lines.push_back({priority, text});
 }
