@@ -8,7 +8,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
-#include "ZEL/is_syncedshare_internal.h"
+#include "ZEL/internal/registry.h"
 #include "tarq/root_path.h"
 
 using namespace ZEL::registry;

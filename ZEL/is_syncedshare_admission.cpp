@@ -3,7 +3,7 @@
 #include <syslog.h>
 
 #include "ZEL/is_syncedshare.h"
-#include "ZEL/is_syncedshare_internal.h"
+#include "ZEL/internal/registry.h"
 
 using namespace ZEL::registry;
 

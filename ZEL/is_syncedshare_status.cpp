@@ -7,7 +7,7 @@
 #include <cstdint>
 
 #include "ZEL/is_syncedshare.h"
-#include "ZEL/is_syncedshare_internal.h"
+#include "ZEL/internal/registry.h"
 #include "tarq/root_path.h"
 
 using namespace ZEL::registry;
