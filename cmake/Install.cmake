@@ -18,6 +18,8 @@ write_basic_package_version_file(${CMAKE_BINARY_DIR}/ZELConfigVersion.cmake COMP
 install(FILES ${CMAKE_BINARY_DIR}/ZELConfig.cmake ${CMAKE_BINARY_DIR}/ZELConfigVersion.cmake
     DESTINATION ${CMAKE_INSTALL_LIBDIR}/cmake/ZEL)
 
+# Relative to where the file lies: a tree that is moved stays right.
+file(RELATIVE_PATH ZEL_PC_TO_PREFIX "/${CMAKE_INSTALL_LIBDIR}/pkgconfig" "/")
 configure_file(cmake/zel.pc.in ${CMAKE_BINARY_DIR}/zel.pc @ONLY)
 install(FILES ${CMAKE_BINARY_DIR}/zel.pc DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig)
 

@@ -108,9 +108,11 @@ void KAPICStrPut(char* text);
  * instant the old file or the new one is there. Writers do not lock: callers serialise them (see
  * the semaphores below).
  *
+ * Of several sections of one name, and of several lines of one key, the first counts. A file of more
+ * than 8 MiB is refused (TARQ_ERR_READ_FILE, errno EFBIG).
+ *
  * Refused with TARQ_ERR_BAD_PARAMETER, nothing written: a line break in a name, key or value, "]"
- * in a section name,
- * "=" or a quote in a key, an empty key.
+ * in a section name, "=" or a quote in a key, an empty key.
  */
 
 /* 1 when something exists at `path`, else 0. */
@@ -150,7 +152,7 @@ int KAPICSemOpen(int key);
 /* Waits for the semaphore and takes it. The kernel gives it back when the holder dies. 0, or
  * negative on failure. */
 int KAPICSemLock(int id);
-/* Gives it back. 0, or negative on failure. */
+/* Gives it back. 0, or negative on failure: errno EPERM when the process does not hold it. */
 int KAPICSemUnlock(int id);
 /* Ends the use of an id; the semaphore itself stays. 0, or negative on failure. */
 int KAPICSemClose(int id);
