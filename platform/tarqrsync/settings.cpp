@@ -12,8 +12,8 @@ namespace Backup {
 namespace {
 
 constexpr std::string_view kOutfilePrefix = "outfile=\"";
-// rsync reads one line of at most this many bytes as its password.
-constexpr size_t kMaxPasswordBytes = 255;
+// rsync cuts a longer password off without a word.
+constexpr size_t kMaxPasswordBytes = 511;
 
 bool HasControl(const std::string& text) {
     return std::any_of(text.begin(), text.end(),
