@@ -3,8 +3,9 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <netinet/in.h>
 #include <sys/resource.h>
+#include <sys/socket.h>
+#include <unistd.h>
 
 #include <cstring>
 #include <thread>
@@ -16,7 +17,6 @@
 #include "tests/support/sockets.h"
 
 using testing::AllOf;
-using testing::EndsWith;
 using testing::HasSubstr;
 using ZEL::Channel;
 
@@ -31,35 +31,13 @@ size_t SlotOf(Function function) {
     return (parts[0] - 1) / sizeof(void*);
 }
 
-class FlushFails : public Channel {
-public:
-    FlushFails() : Channel(16) {}
-    int FlushWrite(int) override { return code; }
-    int code = 0;
-};
-
-class ConnectedTcp {
-public:
-    explicit ConnectedTcp(Channel& channel) {
-        port = listener.prepare(0);
-        opened = channel.Open("127.0.0.1", port);
-        fd = listener.accept();
-    }
-    ~ConnectedTcp() { close(fd); }
-    ZEL::IPCListener listener;
-    int port, opened, fd;
-};
-
 }  // namespace
 
 TEST(Channel, OperationsKeepTheirSlots) {
     using C = Channel;
     EXPECT_EQ(SlotOf(static_cast<int (C::*)(int, bool)>(&C::Open)), 3U);
-    EXPECT_EQ(SlotOf(&C::Close), 5U);
     EXPECT_EQ(SlotOf(&C::ConvertToSSLChannel), 8U);
-    EXPECT_EQ(SlotOf(&C::WriteInt64), 16U);
     EXPECT_EQ(SlotOf(static_cast<int (C::*)(char*, unsigned int)>(&C::Read)), 17U);
-    EXPECT_EQ(SlotOf(&C::FlushWrite), 22U);
     EXPECT_EQ(SlotOf(&C::ReadMore), 25U);
     EXPECT_EQ(SlotOf(static_cast<unsigned int (C::*)(unsigned int)>(&C::Convert)), 27U);
     EXPECT_EQ(SlotOf(&C::SwitchChannelOp), 33U);
@@ -93,10 +71,10 @@ TEST(Channel, BytesKeepTheirOrderRoundTheEndOfTheRings) {
     const int size = 1;
     setsockopt(peer.channel_fd, SOL_SOCKET, SO_SNDBUF, &size, sizeof size);
     std::string sent, received;
-    std::thread reader([&] { received = peer.TakeAll(); });
+    std::thread reader([&] { received = peer.Take(0); });
     for (unsigned int i = 0; i < 3000; ++i) {
         const std::string block(i % 997, static_cast<char>(i));
-        ASSERT_EQ(peer.channel.Write(block.data(), static_cast<unsigned int>(block.size())), 0);
+        ASSERT_EQ(peer.channel.Write(block.data(), i % 997), 0);
         sent += block;
     }
     peer.channel.Close();
@@ -118,19 +96,16 @@ TEST(Channel, ABlockMayBeAsLargeAsTheRing) {
     test::RawPeer peer(8);
     EXPECT_EQ(peer.channel.Write("123456789", 9), ZEL::RESULT_INVALID_ARGUMENT);
     EXPECT_EQ(peer.channel.Write(nullptr, 1), ZEL::RESULT_INVALID_ARGUMENT);
-    EXPECT_EQ(peer.channel.Read(nullptr, 1), ZEL::RESULT_INVALID_ARGUMENT);
-    EXPECT_EQ(peer.channel.ReadInt32(nullptr), ZEL::RESULT_INVALID_ARGUMENT);
     EXPECT_EQ(peer.channel.Write("12345678", 8), 0);
     EXPECT_EQ(peer.channel.FlushWrite(0), 0);
-    EXPECT_EQ(peer.Take(), "12345678");
     EXPECT_EQ(peer.channel.Write("lost", 4), 0);
     peer.channel.ClearWrite();
     peer.channel.Close();
-    EXPECT_EQ(peer.Take(), "");
+    EXPECT_EQ(peer.Take(), "12345678");
     EXPECT_EQ(peer.channel.Write("x", 1), ZEL::RESULT_IO);
 }
 
-TEST(Channel, TheEndOfTheStreamFailsTheReadAfterWhatHasArrived) {
+TEST(Channel, APeerThatIsGoneFailsReadsAfterWhatHasArrivedAndWritesWithoutASignal) {
     test::RawPeer peer;
     peer.Send("abc");
     peer.Close();
@@ -140,125 +115,67 @@ TEST(Channel, TheEndOfTheStreamFailsTheReadAfterWhatHasArrived) {
     EXPECT_EQ(peer.channel.Read(buffer, 5, total), ZEL::RESULT_IO);
     EXPECT_EQ(total, 3U);
     EXPECT_STREQ(buffer, "abc");
-    EXPECT_EQ(
-        log.Text(),
-        "[WARNING] ZEL/channel(N): read: Success\n"
-        "[WARNING] ZEL/channel(N): Diagnose: select says the socket is readable but actually we "
-        "can't read ... connection closed?\n");
-}
-
-TEST(Channel, APeerThatIsGoneFailsTheWriteAndRaisesNoSignal) {
-    test::RawPeer peer;
-    peer.Close();
-    const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
     peer.channel.Write("x", 1);
     EXPECT_EQ(peer.channel.FlushWrite(0), ZEL::RESULT_IO);
-    peer.channel.Close();
-    EXPECT_EQ(log.Text(),
-              "[WARNING] ZEL/channel(N): write: Broken pipe\n"
-              "[WARNING] ZEL/channel(N): write: Broken pipe\n"
-              "[WARNING] ZEL/channel(N): FlushWrite: I/O error\n");
+    EXPECT_THAT(log.Text(), HasSubstr("actually we can't read ... connection closed?\n"
+                                      "[WARNING] ZEL/channel(N): write: Broken pipe\n"));
 }
 
-TEST(Channel, TimeOutsCountFromTheLastProgress) {
+TEST(Channel, AWaitEndsAtItsTimeOutOrWhenTheAbortFlagIsSet) {
     test::RawPeer peer(4096);
     peer.channel.SetTimeout(1);
     const test::LogCapture log;
     unsigned char byte;
     EXPECT_EQ(peer.channel.ReadByte(&byte), ZEL::RESULT_TIMEOUT);
-    EXPECT_THAT(log.Text(), AllOf(HasSubstr("select: timeout\n"),
-                                  HasSubstr("ReadMore: Channel timeout for 1 seconed\n")));
     int result = 0;
     for (int i = 0; i < 10000 && result == 0; ++i) {
         result = peer.channel.Write(std::string(4096, 'x').data(), 4096);
     }
     EXPECT_EQ(result, ZEL::RESULT_TIMEOUT);
-    EXPECT_THAT(log.Text(), HasSubstr("FlushWrite: Channel timeout for 1 seconds\n"
-                                      "[WARNING] ZEL/channel(N): Write: FlushWrite failed\n"));
-}
-
-TEST(Channel, TheAbortFlagEndsAWaitWithoutLimit) {
-    test::RawPeer peer;
+    EXPECT_THAT(log.Text(), AllOf(HasSubstr("ReadMore: Channel timeout for 1 seconed\n"),
+                                  HasSubstr("FlushWrite: Channel timeout for 1 seconds\n")));
     int flag = 0;
     peer.channel.SetFlag(&flag);
     peer.channel.SetTimeout(0);
-    peer.channel.WriteByte(1);
     std::thread other([&flag] { __atomic_store_n(&flag, 1, __ATOMIC_RELAXED); });
-    unsigned char byte;
     EXPECT_EQ(peer.channel.ReadByte(&byte), ZEL::RESULT_INTERRUPTED);
     other.join();
     EXPECT_EQ(peer.channel.FlushWrite(0), ZEL::RESULT_INTERRUPTED);
-    EXPECT_EQ(peer.channel.ReadMore(0), 0);
-}
-
-TEST(Channel, ClosingTellsWhyTheLastFlushFailed) {
-    for (const auto& [code, text] : {std::pair{-1, "Interrupted"},
-                                     {-19, "no permission "},
-                                     {-25, "permission is read-only"},
-                                     {-26, "Unknown error"}}) {
-        int fds[2];
-        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
-        FlushFails channel;
-        ASSERT_EQ(channel.Open(fds[0], false), 0);
-        channel.code = code;
-        const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
-        channel.Close();
-        EXPECT_EQ(log.Text(), std::string("[WARNING] ZEL/channel(N): FlushWrite: ") + text + "\n");
-        EXPECT_TRUE(channel.IsClosed());
-        close(fds[1]);
-    }
 }
 
 TEST(Channel, OpensOnlyWhatCanBeOpened) {
     test::RawPeer peer;
-    const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
-    EXPECT_EQ(peer.channel.Open(peer.fd, true), -4);
-    EXPECT_THAT(log.Text(), EndsWith("]\n[WARNING] ZEL/channel(N): Open: Invalid argument\n"));
+    EXPECT_EQ(peer.channel.Open(peer.fd, true), -4) << "it is open";
     Channel channel(16);
     EXPECT_EQ(channel.Open(-1, false), -4);
     EXPECT_EQ(channel.Open(-1, true), -3);
-    EXPECT_THAT(log.Text(), EndsWith("[WARNING] ZEL/channel(N): setsockopt: Bad file descriptor\n"
-                                     "[WARNING] ZEL/channel(N): Open: SetLinger to socket [-1] "
-                                     "failed, Bad file descriptor\n"));
     EXPECT_EQ(channel.Open("/nowhere/at all"), -2);
-    EXPECT_THAT(log.Text(),
-                EndsWith("Channel: Can not connect to server at '/nowhere/at all'. No such "
-                         "file or directory\n"));
     EXPECT_EQ(channel.Open(nullptr, 80), 0);
     EXPECT_EQ(channel.Open("127.0.0.1", -1), 0);
     EXPECT_EQ(channel.ConnectWithTimeout(-1, "127.0.0.1", 1), -4);
-    EXPECT_THAT(log.Text(), EndsWith("Invalid argumants (ip: 127.0.0.1, port: 1\n"));
     EXPECT_EQ(channel.Open("127.0.0.1", 65536 + 22), -2);
-    EXPECT_EQ(channel.Open("255.255.255.255", 1), -2);
-    EXPECT_THAT(log.Text(), EndsWith("connect: Network is unreachable (101)\n"));
     std::string ip = "old";
     int port = 0;
     EXPECT_EQ(channel.GetPeerInfo(ip, port), -1);
     EXPECT_EQ(ip, "");
     EXPECT_EQ(peer.channel.GetPeerInfo(ip, port), -1) << "a unix socket has no IPv4 address";
-    EXPECT_TRUE(channel.IsClosed());
 }
 
-TEST(Channel, ANewConnectionClosesTheOldOne) {
+TEST(Channel, ANewConnectionClosesTheOldOneAndUrgentDataEndsItsReads) {
     test::RawPeer peer;
-    const ConnectedTcp tcp(peer.channel);
-    ASSERT_EQ(tcp.opened, 0);
-    EXPECT_EQ(peer.TakeAll(), "");
+    ZEL::IPCListener listener;
+    const int listened = listener.prepare(0);
+    ASSERT_EQ(peer.channel.Open("127.0.0.1", listened), 0);
+    EXPECT_EQ(peer.Take(0), "");
     std::string ip;
     int port = 0;
     EXPECT_EQ(peer.channel.GetPeerInfo(ip, port), 0);
-    EXPECT_EQ(ip, "127.0.0.1");
-    EXPECT_EQ(port, tcp.port);
-}
-
-TEST(Channel, UrgentDataIsAnException) {
-    Channel channel(16);
-    const ConnectedTcp tcp(channel);
-    ASSERT_EQ(send(tcp.fd, "!", 1, MSG_OOB), 1);
-    const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
+    EXPECT_EQ(std::pair(ip, port), std::pair(std::string("127.0.0.1"), listened));
+    const int fd = listener.accept();
+    ASSERT_EQ(send(fd, "!", 1, MSG_OOB), 1);
     unsigned char byte;
-    EXPECT_EQ(channel.ReadByte(&byte), ZEL::RESULT_IO);
-    EXPECT_EQ(log.Text(), "[WARNING] ZEL/channel(N): ReadFd: exception set\n");
+    EXPECT_EQ(peer.channel.ReadByte(&byte), ZEL::RESULT_IO);
+    close(fd);
 }
 
 TEST(Channel, DescriptorsAboveAThousandWork) {
@@ -266,18 +183,15 @@ TEST(Channel, DescriptorsAboveAThousandWork) {
     getrlimit(RLIMIT_NOFILE, &limit);
     limit.rlim_cur = limit.rlim_max;
     setrlimit(RLIMIT_NOFILE, &limit);
-    int fds[2];
-    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
-    const int high = fcntl(fds[0], F_DUPFD, 1500);
-    ASSERT_GE(high, 1500);
-    close(fds[0]);
+    const test::RawPeer peer;
     Channel channel(16);
+    const int high = fcntl(peer.channel_fd, F_DUPFD, 1500);
+    ASSERT_GE(high, 1500);
     ASSERT_EQ(channel.Open(high, true), 0);
-    ASSERT_EQ(write(fds[1], "x", 1), 1);
+    peer.Send("x");
     unsigned char byte = 0;
     EXPECT_EQ(channel.ReadByte(&byte), 0);
     EXPECT_EQ(byte, 'x');
-    close(fds[1]);
 }
 
 TEST(CertName, AWildcardCoversOneLabelAndTheParent) {
@@ -286,35 +200,28 @@ TEST(CertName, AWildcardCoversOneLabelAndTheParent) {
         std::string name, host;
         bool covers;
     } cases[] = {
-        {"nas.example", "nas.example", true},
         {"NAS.Example", "nas.eXAMPLE", true},
         {"nas.example", "nas.example.", false},
         {"", "nas.example", false},
         {"*", "nas", false},
-        {"*.x.y", "a.x.y", true},
         {"*.X.y", "A.x.Y", true},
         {"*.x.y", "x.y", true},
         {"*.x.y", "a.b.x.y", false},
-        {"*.x.y", ".x.y", true},
         {"*.x.y", "ax.y", false},
         {"*-x.y", "a.x.y", true},
         {"a*.x.y", "ab.x.y", false},
-        {"*.", "host.", true},
         {"nas.example\0.evil"s, "nas.example", false},
         {"*.x\0.y"s, "a.x", false},
-        {"\xc3\x84.x", "\xc3\xa4.x", false},
     };
     for (const auto& c : cases) {
         EXPECT_EQ(ZEL::CertNameCovers(c.name, c.host), c.covers) << c.name << " / " << c.host;
     }
 }
 
-TEST(Channel, TlsFilesHaveTheirDefaultsBelowTheRootUntilTheyAreSet) {
+TEST(Channel, TlsFilesHaveTheirDefaultsBelowTheRoot) {
     const test::TempRoot root;
     EXPECT_EQ(Channel::GetCertPath(), root.Path("tmp/.cloud_certs"));
     EXPECT_EQ(Channel::GetKeyPath(), root.Path("tmp/.cloud_server.key"));
     EXPECT_EQ(Channel::GetCAPath(), root.Path("certs.pem"));
-    Channel::SetVerifyCAPath("/other.pem");
-    EXPECT_EQ(Channel::GetCAPath(), "/other.pem");
     EXPECT_TRUE(Channel(16).IsAllowingUntrust());
 }

@@ -18,22 +18,6 @@ PObject Sample() {
     return sample;
 }
 
-PObject Nested(int levels, bool maps) {
-    PObject value;
-    for (int i = 0; i < levels; ++i) {
-        PObject outer;
-        if (maps) {
-            outer["scalar before"] = "text";
-            outer["value"] = std::move(value);
-        } else {
-            outer.asArray().push_back(std::move(value));
-            outer.asArray().push_back("scalar after");
-        }
-        value = std::move(outer);
-    }
-    return value;
-}
-
 }  // namespace
 
 TEST(PObject, TellsItsTypeAndWhetherItIsEmptyOrTrue) {
@@ -50,9 +34,7 @@ TEST(PObject, TellsItsTypeAndWhetherItIsEmptyOrTrue) {
         {PObject(), "null", true, false, "null"},
         {PObject(0ULL), "integer", false, false, "0"},
         {PObject(ULLONG_MAX), "integer", false, true, "18446744073709551615"},
-        {PObject(""), "string", true, false, "\"\""},
         {PObject(static_cast<const char*>(nullptr)), "string", true, false, "\"\""},
-        {PObject("0"), "string", false, true, "\"0\""},
         {PObject("say \"hi\"\n"), "string", false, true, "\"say \"hi\"\n\""},
         {map, "map", true, false, "{}"},
         {array, "array", true, false, "[]"},
@@ -76,27 +58,19 @@ TEST(PObject, TellsItsTypeAndWhetherItIsEmptyOrTrue) {
 }
 
 TEST(PObject, IntegersAreCutToTheWidthThatIsAskedFor) {
-    PObject o(4294967297ULL);
-    EXPECT_EQ(o.asString(), "1");
-    o = 4294967296ULL;
+    PObject o(4294967296ULL);
     EXPECT_EQ(o.asString(), "0");
-    o = 257;
-    EXPECT_EQ(o.asUInt8(), 1);
     o = 0x1ff80ff80ULL;
+    EXPECT_EQ(o.asUInt8(), 0x80);
     EXPECT_EQ(o.asInt8(), -128);
     EXPECT_EQ(o.asInt16(), -128);
     EXPECT_EQ(o.asInt32(), -8323200);
     EXPECT_EQ(o.asInt64(), 0x1ff80ff80LL);
     o = -1;
     EXPECT_EQ(o.asUInt64(), ULLONG_MAX);
-    EXPECT_EQ(o.asInt64(), -1);
-    EXPECT_EQ(PObject(-1).asUInt64(), ULLONG_MAX);
-    o = -2L;
-    EXPECT_EQ(o.asInt64(), -2);
+    EXPECT_EQ(PObject(-1).asInt64(), -1);
     o = 4294967295U;
     EXPECT_EQ(o.asUInt64(), 4294967295U);
-    o = true;
-    EXPECT_EQ(o.toString(), "1");
 }
 
 TEST(PObject, ReadingTheWrongTypeGivesTheSharedEmpties) {
@@ -112,31 +86,22 @@ TEST(PObject, ReadingTheWrongTypeGivesTheSharedEmpties) {
     EXPECT_EQ(sample.asString(), "");
     EXPECT_EQ(PObject("5").asUInt64(), 0U);
     EXPECT_EQ(&sample["c"], &PObject::GetEmptyObject());
-    EXPECT_EQ(&sample[2], &PObject::GetEmptyObject());
     EXPECT_EQ(&sample[UINT_MAX], &PObject::GetEmptyObject());
     EXPECT_EQ(sample[0].asUInt64(), 5U);
     EXPECT_EQ(sample["b"][0].asString(), "x");
     EXPECT_EQ(&sample["b"][2], &PObject::GetEmptyObject());
 }
 
-TEST(PObject, WritingTurnsTheObjectIntoTheContainer) {
+TEST(PObject, WritingTurnsItIntoTheContainerButAnIndexThrowsOutsideAMap) {
     PObject o("text");
     o["x"] = 1;
-    EXPECT_EQ(o.toString(), "{\"x\": 1}");
-    EXPECT_TRUE(o.hasMember("x"));
     o[0] = 2;
-    EXPECT_EQ(o["x"].asUInt64(), 2U);
+    EXPECT_EQ(o.toString(), "{\"x\": 2}");
+    EXPECT_TRUE(o.hasMember("x"));
     o.asArray().push_back(0);
     EXPECT_EQ(o.toString(), "[0]");
-    o.asMap();
-    EXPECT_EQ(o.toString(), "{}");
-}
-
-TEST(PObject, IndexForWritingThrowsForAllButTheEntriesOfAMap) {
-    PObject map = Sample();
-    PObject array = map["b"];
-    PObject null;
-    for (const auto& [object, index] : {std::pair{&map, 2U}, {&array, 0U}, {&null, 0U}}) {
+    PObject null, map = Sample();
+    for (const auto& [object, index] : {std::pair{&map, 2U}, {&o, 0U}, {&null, 0U}}) {
         try {
             (*object)[index] = 1;
             FAIL() << "no exception";
@@ -146,51 +111,45 @@ TEST(PObject, IndexForWritingThrowsForAllButTheEntriesOfAMap) {
     }
 }
 
-TEST(PObject, CopiesAreDeepAndMovesLeaveNull) {
+TEST(PObject, CopiesAreDeepAndMovesAndSelfAssignmentLeaveNull) {
     PObject original = Sample();
     PObject copied = original;
     copied["b"].asArray().clear();
     EXPECT_EQ(original.toString(), Sample().toString());
     PObject moved = std::move(copied);
     EXPECT_TRUE(copied.isNull());  // NOLINT(bugprone-use-after-move): null is what a move leaves
-    EXPECT_EQ(moved.toString(), "{\"a\": 5, \"b\": []}");
     moved.swap(original);
-    EXPECT_EQ(moved.toString(), Sample().toString());
-    original = moved.asMap();
-    EXPECT_EQ(original.toString(), moved.toString());
-}
-
-TEST(PObject, AssigningItToItselfLeavesItNull) {
-    PObject o = Sample();
-    PObject& same = o;
-    o = same;
-    EXPECT_TRUE(o.isNull());
-    o = Sample();
-    o = std::move(same);
-    EXPECT_TRUE(o.isNull());
+    EXPECT_EQ(original.toString(), "{\"a\": 5, \"b\": []}");
+    PObject& same = original;
+    original = same;
+    EXPECT_TRUE(original.isNull());
+    original = 5;
+    original = std::move(same);
+    EXPECT_TRUE(original.isNull());
 }
 
 TEST(PObject, APartOfItselfCanBeAssignedToIt) {
     PObject o = Sample();
     o = o["b"];
-    EXPECT_EQ(o.toString(), "[\"x\", null]");
     o = std::as_const(o).asArray();
     EXPECT_EQ(o.toString(), "[\"x\", null]");
     o = std::move(o.asArray()[0]);
     EXPECT_EQ(o.toString(), "\"x\"");
-    o = std::string(100, 'k');
-    o[o.asString()] = "entry";
+    o[std::string(100, 'k')] = std::string(100, 'v');
     o = o[0].asString();
-    EXPECT_EQ(o.toString(), "\"entry\"");
+    EXPECT_EQ(o.asString(), std::string(100, 'v'));
 }
 
 TEST(PObject, AnyDepthIsCopiedPrintedAndFreedWithoutRecursion) {
-    constexpr int kLevels = 100000;
     for (const bool maps : {false, true}) {
-        const PObject deep = Nested(kLevels, maps);
+        PObject deep;
+        for (int i = 0; i < 100000; ++i) {
+            PObject outer;
+            (maps ? outer["value"] : outer.asArray().emplace_back()) = std::move(deep);
+            deep = std::move(outer);
+        }
         PObject copied = deep;
-        EXPECT_EQ(copied.toString().size(), deep.toString().size());
-        EXPECT_GT(copied.toString().size(), size_t{kLevels} * 10);
+        EXPECT_EQ(copied.toString(), deep.toString());
         copied = PObject("replaced");
     }
 }

@@ -3,10 +3,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <atomic>
-#include <cstdlib>
-#include <map>
-#include <new>
 #include <thread>
 #include <utility>
 
@@ -17,31 +13,9 @@
 using test::Hex;
 using test::RawPeer;
 using test::Unhex;
-using testing::HasSubstr;
+using testing::Contains;
 using ZEL::PObject;
 using ZEL::PStream;
-
-namespace {
-
-std::atomic<int> allocations{0};
-
-}  // namespace
-
-// The library's allocations, counted.
-__attribute__((visibility("default"), noinline)) void* operator new(size_t size) {
-    ++allocations;
-    if (void* memory = malloc(size)) {
-        return memory;
-    }
-    throw std::bad_alloc();
-}
-__attribute__((visibility("default"), noinline)) void operator delete(void* memory) noexcept {
-    free(memory);
-}
-__attribute__((visibility("default"), noinline)) void operator delete(void* memory,
-                                                                      size_t) noexcept {
-    free(memory);
-}
 
 namespace {
 
@@ -81,19 +55,13 @@ int Receive(const std::string& bytes, PObject& value) {
 TEST(PStream, ValuesHaveTheirBytesInBothDirections) {
     const std::pair<PObject, const char*> cases[] = {
         {PObject(), "00 00"},
-        {PObject(0), "01 01 00"},
         {PObject(255), "01 01 ff"},
         {PObject(256), "01 02 01 00"},
-        {PObject(65535), "01 02 ff ff"},
         {PObject(65536), "01 04 00 01 00 00"},
-        {PObject(0xffffffffULL), "01 04 ff ff ff ff"},
         {PObject(0x100000000ULL), "01 08 00 00 00 01 00 00 00 00"},
         {PObject(""), "10 00 00"},
         {PObject("a\n\xff"), "10 00 03 61 0a ff"},
-        {Map({}), "42 40"},
         {Array({}), "41 40"},
-        {Map({{"a", 5}, {"b", Array({PObject()})}}),
-         "42 10 00 01 61 01 01 05 10 00 01 62 41 00 00 40 40"},
         {Array({Array({}), Map({{"", "x"}}), 1}),
          "41 41 40 42 10 00 00 10 00 01 78 40 01 01 01 40"},
         {Map({{"b", Map({{"c", Array({1})}})}, {"d", 2}}),
@@ -118,7 +86,6 @@ TEST(PStream, ValuesHaveTheirBytesInBothDirections) {
 
 TEST(PStream, MoreIsReceivedThanIsEverSent) {
     const std::pair<std::string, const char*> cases[] = {
-        {"01 00", "0"},
         {"01 03 01 02 03", "66051"},
         {"01 09 ff 00 00 00 00 00 00 00 09", "9"},
         {"01 ff" + Repeat(" 01", 255), "72340172838076673"},
@@ -133,33 +100,28 @@ TEST(PStream, MoreIsReceivedThanIsEverSent) {
 }
 
 TEST(PStream, BytesThatAreNoValueAreRefused) {
-    const struct {
-        const char* bytes;
-        const char* log;
-    } cases[] = {
-        {"40", "[ERROR] ZEL/stream(N): Error stack: \n"},
-        {"43", "[ERROR] ZEL/stream(N): Error stack: \n"},
-        {"00 07",
-         "[ERROR] ZEL/stream(N): expect length 0, but we've got 7\n"
-         "[ERROR] ZEL/stream(N): Error stack: \n"},
+    const std::pair<const char*, const char*> cases[] = {
+        {"40", "Error stack: \n"},
+        {"43", "Error stack: \n"},
+        {"00 07", "expect length 0, but we've got 7\n[ERROR] ZEL/stream(N): Error stack: \n"},
         {"42 01 01 05",
-         "[ERROR] ZEL/stream(N): PStream: expect string, but get tag 1\n"
-         "[ERROR] ZEL/stream(N): Error stack: \n"},
-        {"42 10 00 01 61 41 42 10 00 01 62 11", "[ERROR] ZEL/stream(N): Error stack: a.b\n"},
+         "PStream: expect string, but get tag 1\n[ERROR] ZEL/stream(N): Error stack: \n"},
+        {"42 10 00 01 61 41 42 10 00 01 62 11", "Error stack: a.b\n"},
     };
-    for (const auto& c : cases) {
-        PObject received;
+    PObject received;
+    for (const auto& [bytes, text] : cases) {
         const test::LogCapture log(ZEL::Logger::LEVEL_ERROR);
-        EXPECT_EQ(Receive(Unhex(c.bytes), received), ZEL::RESULT_PROTOCOL) << c.bytes;
-        EXPECT_EQ(log.Text(), c.log);
+        EXPECT_EQ(Receive(Unhex(bytes), received), ZEL::RESULT_PROTOCOL) << bytes;
+        EXPECT_EQ(log.Text(), std::string("[ERROR] ZEL/stream(N): ") + text);
     }
-    PObject partial;
-    EXPECT_EQ(Receive(Unhex("42 10 00 01 61 01 01 05 10 00 01 62 41 01 01 01 41 07"), partial), -5);
-    EXPECT_EQ(partial.toString(), "{\"a\": 5, \"b\": [1]}");
+    received = PObject();
+    EXPECT_EQ(Receive(Unhex("42 10 00 01 61 01 01 05 10 00 01 62 41 01 01 01 41 07"), received),
+              ZEL::RESULT_PROTOCOL);
+    EXPECT_EQ(received.toString(), "{\"a\": 5, \"b\": [1]}") << "what came before stays";
 }
 
 TEST(PStream, LongStringsTravelWholeAndTheLengthKeepsItsLow16Bits) {
-    for (const size_t size : {size_t{4097}, size_t{65535}, size_t{65536 + 2}}) {
+    for (const size_t size : {size_t{65535}, size_t{65536 + 2}}) {
         RawPeer peer;
         const std::string text(size, 'x');
         ASSERT_EQ(PStream().Send(peer.channel, PObject(text)), 0);
@@ -169,124 +131,77 @@ TEST(PStream, LongStringsTravelWholeAndTheLengthKeepsItsLow16Bits) {
         EXPECT_EQ(Receive(bytes, received), 0);
         EXPECT_EQ(received.asString(), text.substr(0, size % 65536));
     }
-    RawPeer small(1000);
-    const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
-    EXPECT_EQ(PStream().Send(small.channel, Map({{"k", std::string(1001, 'x')}})), ZEL::RESULT_IO);
-    EXPECT_THAT(log.Text(), HasSubstr("[WARNING] ZEL/stream(N): Channel: -4\n"
-                                      "[ERROR] ZEL/stream(N): Error stack: k\n"));
 }
 
-TEST(PStream, ALeadingUnderscoreOfAKeyIsNotSent) {
+TEST(PStream, UnderscoresAreNotSentAndContainersOfTheSameTypeAreAddedTo) {
     RawPeer peer;
-    const PObject value =
-        Map({{"_x", Map({{"p", 1}, {"q", 1}})}, {"x", Map({{"q", 2}})}, {"__", 3}});
-    ASSERT_EQ(PStream().Send(peer.channel, value), 0);
-    PObject received;
-    EXPECT_EQ(Receive(peer.Take(), received), 0);
-    EXPECT_EQ(received.toString(), "{\"_\": 3, \"x\": {\"p\": 1, \"q\": 2}}");
-}
-
-TEST(PStream, ReceivingIntoAContainerOfThatTypeAddsToIt) {
-    PObject received = Map({{"keep", 1}, {"list", Array({"old"})}, {"other", Array({})}});
-    RawPeer peer;
-    const PObject sent = Map({{"list", Array({"new"})}, {"more", PObject()}, {"other", "text"}});
+    const PObject sent = Map({{"_x", Map({{"p", 1}, {"q", 1}})},
+                              {"x", Map({{"q", 2}})},
+                              {"__", 3},
+                              {"list", Array({"new"})},
+                              {"other", "text"}});
     ASSERT_EQ(PStream().Send(peer.channel, sent), 0);
+    PObject received = Map({{"keep", 1}, {"list", Array({"old"})}, {"other", Array({})}});
     EXPECT_EQ(Receive(peer.Take(), received), 0);
     EXPECT_EQ(received.toString(),
-              "{\"keep\": 1, \"list\": [\"old\", \"new\"], \"more\": null, \"other\": \"text\"}");
+              "{\"_\": 3, \"keep\": 1, \"list\": [\"old\", \"new\"], \"other\": \"text\", "
+              "\"x\": {\"p\": 1, \"q\": 2}}");
 }
 
 TEST(PStream, DeepNestingIsSentInFullAndReceivedTo512Levels) {
-    const std::string key = Unhex("10 00 01 6b");
     for (const bool maps : {false, true}) {
-        const auto wire = [&](int levels) {
-            return Repeat(maps ? "\x42" + key : "\x41", levels) + Unhex("00 00") +
-                   Repeat("\x40", levels);
+        const auto wire = [maps](int levels) {
+            return Unhex(Repeat(maps ? "42 10 00 01 6b " : "41 ", levels) + "00 00" +
+                         Repeat(" 40", levels));
         };
-        PObject good, deep;
-        EXPECT_EQ(Receive(wire(512), good), 0);
-        EXPECT_EQ(Receive(wire(513), deep), ZEL::RESULT_PROTOCOL);
+        PObject received, value;
+        EXPECT_EQ(Receive(wire(512), received), 0);
+        EXPECT_EQ(Receive(wire(513), received), ZEL::RESULT_PROTOCOL);
         constexpr int kSentLevels = 100000;
-        PObject value;
         for (int i = 0; i < kSentLevels; ++i) {
             PObject outer;
             (maps ? outer["k"] : outer.asArray().emplace_back()) = std::move(value);
             value = std::move(outer);
         }
         RawPeer peer;
-        std::string received;
-        std::thread reader([&] { received = peer.TakeAll(); });
+        std::string bytes;
+        std::thread reader([&] { bytes = peer.Take(0); });
         EXPECT_EQ(PStream().Send(peer.channel, value), 0);
         peer.channel.Close();
         reader.join();
-        EXPECT_TRUE(received == wire(kSentLevels));
+        EXPECT_TRUE(bytes == wire(kSentLevels));
     }
 }
 
 TEST(PStream, TheTraceIsIndentedToElevenLevels) {
-    PObject value = 7;
-    for (int i = 0; i < 12; ++i) {
-        value = Array({value});
-    }
-    RawPeer peer;
     const test::LogCapture log;
-    ASSERT_EQ(PStream().Send(peer.channel, Map({{"k", value}})), 0);
-    PObject received;
-    ASSERT_EQ(Receive(peer.Take(), received), 0);
-    std::map<std::string, int> lines;
-    for (const std::string& line : log.Lines()) {
-        ++lines[line];
-    }
+    PObject value;
+    ASSERT_EQ(Receive(Unhex(Repeat("41 ", 13) + "01 01 07" + Repeat(" 40", 13)), value), 0);
+    RawPeer peer;
+    ASSERT_EQ(PStream().Send(peer.channel, value), 0);
     const std::string tag = "[DEBUG] ZEL/stream(N): ";
-    for (const char* line : {"{", "  \"k\"", "  [", "    [", "  ]", "}"}) {
-        EXPECT_EQ(lines[tag + line], 2) << line << ": once sent, once received";
-    }
-    const std::string deepest = tag + std::string(22, ' ');
-    EXPECT_EQ(lines[deepest + "["], 4) << "two levels share the deepest indentation";
-    EXPECT_EQ(lines[deepest + "7"], 2);
+    EXPECT_THAT(log.Lines(), Contains(tag + "  [").Times(2)) << "once received, once sent";
+    EXPECT_THAT(log.Lines(), Contains(tag + std::string(22, ' ') + "[").Times(4));
+    EXPECT_THAT(log.Lines(), Contains(tag + std::string(22, ' ') + "7").Times(2));
 }
 
 TEST(PStream, AFailedSendTellsItsKeyPathAndForgetsIt) {
     RawPeer peer(16);
-    peer.Close();
     PStream stream;
-    const PObject value = Map({{"outer", Map({{"inner", std::string(16, 'x')}, {"z", 1}})}});
-    EXPECT_EQ(stream.SendObject(peer.channel, value), ZEL::RESULT_IO);
-    std::string path;
-    unsigned long long done = 1;
-    unsigned long long total = 1;
-    stream.GetStatus(path, done, total);
-    EXPECT_EQ(path, "outer");
-    stream.UpdateStatus(3, 4);
-    stream.GetStatus(path, done, total);
-    EXPECT_EQ(std::make_pair(done, total), std::make_pair(3ULL, 4ULL));
+    const PObject value = Map({{"outer", Map({{"inner", std::string(17, 'x')}})}});
     const test::LogCapture log(ZEL::Logger::LEVEL_ERROR);
+    EXPECT_EQ(stream.SendObject(peer.channel, value), ZEL::RESULT_IO) << "larger than the ring";
+    std::string path;
+    unsigned long long done = 1, total = 1;
+    stream.GetStatus(path, done, total);
+    EXPECT_EQ(path, "outer.inner");
     stream.ClearHistory();
     peer.channel.Close();
+    stream.UpdateStatus(3, 4);
+    stream.GetStatus(path, done, total);
+    EXPECT_EQ(path + std::to_string(done) + std::to_string(total), "34");
     EXPECT_EQ(stream.Send(peer.channel, value), ZEL::RESULT_IO);
     EXPECT_EQ(log.Text(), "[ERROR] ZEL/stream(N): Error stack: \n");
     stream.GetStatus(path, done, total);
     EXPECT_EQ(path + std::to_string(done) + std::to_string(total), "00");
-}
-
-TEST(PStream, OnlyTheValueItselfCostsAllocations) {
-    const auto count = [](const auto& work) {
-        const int before = allocations;
-        work();
-        return allocations - before;
-    };
-    for (const int entries : {10, 500}) {
-        PObject value;
-        for (int i = 0; i < entries; ++i) {
-            value[std::string(50, 'k') + std::to_string(i)] = std::string(50, 'v');
-        }
-        RawPeer peer;
-        EXPECT_LT(count([&] { ASSERT_EQ(PStream().Send(peer.channel, value), 0); }), 10);
-        peer.Send(peer.Take());
-        PObject received, copied;
-        const int for_a_copy = count([&] { copied = value; });
-        EXPECT_LT(count([&] { ASSERT_EQ(PStream().Recv(peer.channel, received), 0); }),
-                  for_a_copy + 10);
-        EXPECT_EQ(received.toString(), value.toString());
-    }
 }

@@ -15,9 +15,8 @@ public:
     /// A certificate `name`.pem with its key `name`.key (no passphrase), signed by itself or by the
     /// CA.
     void Make(const std::string& name, const std::string& options) const {
-        Run("openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes -days 2 "
-            "-keyout " +
-            Path(name + ".key") + " -out " + Path(name + ".pem") + " " + options);
+        Run("openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes -days 2 " +
+            options + " -keyout " + Path(name + ".key") + " -out " + Path(name + ".pem"));
     }
     void MakeSigned(const std::string& name, const std::string& options) const {
         Make(name, "-CA " + Path("ca.pem") + " -CAkey " + Path("ca.key") + " " + options);

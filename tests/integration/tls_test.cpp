@@ -13,6 +13,7 @@
 #include "tests/support/log_capture.h"
 #include "tests/support/sockets.h"
 
+using testing::AllOf;
 using testing::HasSubstr;
 using ZEL::Channel;
 
@@ -20,36 +21,32 @@ namespace {
 
 constexpr unsigned int kCapacity = 81920;
 
-class Tls : public testing::Test {
-protected:
-    static void SetUpTestSuite() {
-        files = new test::Certificates();
-        files->MakeSigned("nas",
-                          "-subj /CN=nas.example -addext "
-                          "'subjectAltName=IP:127.0.0.1,DNS:alt.example,DNS:*.wild.example'");
-        files->MakeSigned("no_cn", "-subj /O=Nobody -addext subjectAltName=DNS:san.example");
-        files->MakeSigned("no_san", "-subj /CN=cn.example");
-        files->Make("self", "-subj /CN=nas.example");
-        test::Run("openssl genrsa -out " + files->Path("rsa.key"));
-        test::Run("openssl pkey -aes128 -passout pass:x -in " + files->Path("nas.key") + " -out " +
-                  files->Path("locked.key"));
+struct Files : test::Certificates {
+    Files() {
+        MakeSigned("nas",
+                   "-subj /CN=nas.example -addext "
+                   "'subjectAltName=IP:127.0.0.1,DNS:alt.example,DNS:*.wild.example'");
+        MakeSigned("no_cn", "-subj /O=Nobody -addext subjectAltName=DNS:san.example");
+        MakeSigned("no_san", "-subj /CN=cn.example");
+        Make("self", "-subj /CN=nas.example");
+        test::Run("openssl pkey -aes128 -passout pass:x -in " + Path("nas.key") + " -out " +
+                  Path("locked.key"));
     }
-    static void TearDownTestSuite() {
-        delete files;
-        files = nullptr;
-    }
-    void SetUp() override { Use("nas", "nas.key"); }
-
-    static void Use(const std::string& certificate, const std::string& key) {
-        Channel::SetCERTPath(files->Path(certificate + ".pem"));
-        Channel::SetPriKeyPath(files->Path(key));
-        Channel::SetVerifyCAPath(files->Path("ca.pem"));
-    }
-
-    static test::Certificates* files;
 };
 
-test::Certificates* Tls::files;
+class Tls : public testing::Test {
+protected:
+    Tls() { Use("nas", "nas.key"); }
+    static std::string Path(const std::string& file) {
+        static const Files files;
+        return files.Path(file);
+    }
+    static void Use(const std::string& certificate, const std::string& key) {
+        Channel::SetCERTPath(Path(certificate + ".pem"));
+        Channel::SetPriKeyPath(Path(key));
+        Channel::SetVerifyCAPath(Path("ca.pem"));
+    }
+};
 
 // Another user of OpenSSL on this thread that does not look at its errors.
 void LeaveAnError() {
@@ -58,32 +55,21 @@ void LeaveAnError() {
 
 // Two channels on a socket pair, the second converted as the server by a thread.
 struct TlsPair {
-    TlsPair() : client(kCapacity), server(kCapacity) {
-        int fds[2];
+    TlsPair() {
         EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
         client.Open(fds[0], true);
         server.Open(fds[1], true);
-        client_fd = fds[0];
-        server_fd = fds[1];
     }
     int Convert() {
         LeaveAnError();
-        std::thread other([this] { server_result = server.ConvertToSSLChannel(true); });
+        std::thread other([this] { EXPECT_EQ(server.ConvertToSSLChannel(true), 0); });
         const int result = client.ConvertToSSLChannel(false);
         other.join();
         return result;
     }
-    Channel client, server;
-    int server_result = 1, client_fd = -1, server_fd = -1;
+    int fds[2];
+    Channel client{kCapacity}, server{kCapacity};
 };
-
-std::string Pattern(size_t size) {
-    std::string pattern(size, 0);
-    for (size_t i = 0; i < size; ++i) {
-        pattern[i] = static_cast<char>(i * 2654435761U >> 13);
-    }
-    return pattern;
-}
 
 }  // namespace
 
@@ -93,7 +79,7 @@ TEST_F(Tls, AnOpensslClientIsServed) {
         const std::string port = std::to_string(listener.prepare(0));
         test::Command client(
             "printf hello | openssl s_client -quiet -verify_return_error -CAfile " +
-            files->Path("ca.pem") + " -connect 127.0.0.1:" + port + " " + version);
+            Path("ca.pem") + " -connect 127.0.0.1:" + port + " " + version);
         Channel channel(kCapacity);
         ASSERT_EQ(channel.Open(listener.accept(), true), 0);
         ASSERT_EQ(channel.ConvertToSSLChannel(true), 0) << version;
@@ -101,71 +87,31 @@ TEST_F(Tls, AnOpensslClientIsServed) {
         char request[6] = "";
         EXPECT_EQ(channel.Read(request, 5), 0);
         EXPECT_STREQ(request, "hello");
-        std::string ip;
-        int peer_port = 0;
-        EXPECT_EQ(channel.GetPeerInfo(ip, peer_port), 0);
-        EXPECT_EQ(ip, "127.0.0.1");
-        const std::string reply = Pattern(500000);
-        std::thread replier([&] {
-            for (size_t at = 0; at < reply.size(); at += 50000) {
-                EXPECT_EQ(channel.Write(&reply[at], 50000), 0);
-            }
-            channel.Close();
-        });
+        const std::string reply(kCapacity, 'r');  // in several records
+        EXPECT_EQ(channel.Write(reply.data(), kCapacity), 0);
+        channel.Close();
         int status = 1;
-        const std::string output = client.Finish(status);
-        replier.join();
-        EXPECT_EQ(status, 0) << output.substr(0, 500);
-        EXPECT_TRUE(output.find(reply) != std::string::npos);
-    }
-}
-
-TEST_F(Tls, AnOpensslServerIsTalkedTo) {
-    for (const std::string version : {"-tls1_2", "-tls1_3"}) {
-        test::Command server("openssl s_server -accept 127.0.0.1:0 -naccept 1 -rev -cert " +
-                             files->Path("nas.pem") + " -key " + files->Path("nas.key") + " " +
-                             version);
-        std::string line = "first";
-        while (line.find("ACCEPT 127.0.0.1:") != 0) {
-            ASSERT_FALSE(line.empty());
-            line = server.ReadLine();
-        }
-        Channel channel(kCapacity);
-        channel.SetAllowUntrust(false);
-        channel.SetSSLHostname("a.wild.example");
-        ASSERT_EQ(channel.Open("127.0.0.1", stoi(line.substr(line.rfind(':') + 1))), 0);
-        ASSERT_EQ(channel.ConvertToSSLChannel(false), 0) << version;
-        for (const auto& [word, reversed] :
-             {std::pair{"drawer\n", "reward\n"}, {"123456\n", "654321\n"}}) {
-            char reply[8] = "";
-            ASSERT_EQ(channel.Write(word, 7), 0);
-            ASSERT_EQ(channel.FlushWrite(0), 0);
-            ASSERT_EQ(channel.Read(reply, 7), 0);
-            EXPECT_STREQ(reply, reversed);
-        }
+        EXPECT_THAT(client.Finish(status), HasSubstr(reply));
+        EXPECT_EQ(status, 0);
     }
 }
 
 TEST_F(Tls, TheServersCertificateDecides) {
     const struct {
-        const char* certificate;
-        bool allow_untrusted;
-        const char* host;
-        int result;
+        const char *certificate, *host;
+        bool allow_untrusted, verified;
     } cases[] = {
-        {"nas", false, "", 0},
-        {"nas", false, "NAS.example", 0},
-        {"nas", false, "alt.example", 0},
-        {"nas", false, "a.wild.example", 0},
-        {"nas", false, "wild.example", 0},
-        {"nas", false, "a.b.wild.example", ZEL::RESULT_CERTIFICATE},
-        {"nas", false, "127.0.0.1", ZEL::RESULT_CERTIFICATE},
-        {"no_cn", false, "san.example", 0},
-        {"no_cn", false, "nobody", ZEL::RESULT_CERTIFICATE},
-        {"no_san", false, "cn.example", 0},
-        {"no_san", false, "san.example", ZEL::RESULT_CERTIFICATE},
-        {"self", false, "", ZEL::RESULT_CERTIFICATE},
-        {"self", true, "other.example", 0},
+        {"nas", "", false, true},
+        {"nas", "NAS.example", false, true},
+        {"nas", "alt.example", false, true},
+        {"nas", "wild.example", false, true},
+        {"nas", "a.b.wild.example", false, false},
+        {"nas", "127.0.0.1", false, false},
+        {"no_cn", "san.example", false, true},
+        {"no_san", "cn.example", false, true},
+        {"no_san", "san.example", false, false},
+        {"self", "", false, false},
+        {"self", "other.example", true, true},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(std::string(c.certificate) + " " + c.host);
@@ -173,12 +119,7 @@ TEST_F(Tls, TheServersCertificateDecides) {
         TlsPair pair;
         pair.client.SetAllowUntrust(c.allow_untrusted);
         pair.client.SetSSLHostname(c.host);
-        const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
-        EXPECT_EQ(pair.Convert(), c.result);
-        EXPECT_EQ(pair.server_result, 0);
-        EXPECT_EQ(log.Text().find("ConvertToSSLChannel: Verify Fail!\n") != std::string::npos,
-                  c.result != 0);
-        EXPECT_FALSE(pair.client.IsClosed());
+        EXPECT_EQ(pair.Convert(), c.verified ? 0 : ZEL::RESULT_CERTIFICATE);
     }
 }
 
@@ -188,9 +129,7 @@ TEST_F(Tls, SetUpFailuresLeaveAPlainChannel) {
         const char *certificate, *key, *log;
     } cases[] = {
         {true, "missing", "nas.key", "Install certificate failed\n"},
-        {true, "nas", "missing.key", "Install private key failed\n"},
         {true, "nas", "self.key", "Install private key failed\n"},
-        {true, "nas", "rsa.key", "Open: init ssl private key failed\n"},
         {true, "nas", "locked.key", "Install private key failed\n"},
         {false, "nas", "nas.key", "SSL_CTX_load_verify_locations(/nowhere) failed\n"},
     };
@@ -202,11 +141,9 @@ TEST_F(Tls, SetUpFailuresLeaveAPlainChannel) {
         const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
         EXPECT_EQ(peer.channel.ConvertToSSLChannel(c.server), ZEL::RESULT_IO);
         EXPECT_THAT(log.Text(), HasSubstr(c.log));
-        EXPECT_THAT(log.Text(), testing::EndsWith("Open: init ssl failed\n"));
         peer.channel.WriteByte('p');
         peer.channel.Close();
         EXPECT_EQ(peer.Take(), "p");
-        EXPECT_EQ(peer.channel.ConvertToSSLChannel(c.server), ZEL::RESULT_IO) << "closed";
     }
 }
 
@@ -215,44 +152,41 @@ TEST_F(Tls, HandshakesWithStrangersFail) {
         test::RawPeer garbage, gone, silent;
         garbage.Send("GET / HTTP/1.0\r\n\r\n");
         gone.Close();
-        const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
-        EXPECT_EQ(garbage.channel.ConvertToSSLChannel(server), ZEL::RESULT_IO);
-        EXPECT_THAT(log.Text(), HasSubstr("SSLHandshake: SSL fatel error code: 1\n"
-                                          "[WARNING] ZEL/channel(N): ssl-errors: error:"));
-        EXPECT_EQ(gone.channel.ConvertToSSLChannel(server), ZEL::RESULT_IO);
         silent.channel.SetTimeout(1);
         int flag = 1;  // is not looked at
         silent.channel.SetFlag(&flag);
+        const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
+        EXPECT_EQ(garbage.channel.ConvertToSSLChannel(server), ZEL::RESULT_IO);
+        EXPECT_EQ(gone.channel.ConvertToSSLChannel(server), ZEL::RESULT_IO);
         EXPECT_EQ(silent.channel.ConvertToSSLChannel(server), ZEL::RESULT_TIMEOUT);
-        EXPECT_THAT(log.Text(),
-                    HasSubstr("SSLHandshake: timed out during connect (1 seconds), abort "
-                              "anyway\n"));
+        EXPECT_THAT(log.Text(), AllOf(HasSubstr("SSLHandshake: SSL fatel error code: 1\n"),
+                                      HasSubstr("timed out during connect (1 seconds), abort")));
     }
 }
 
 TEST_F(Tls, AnInterruptedFlushGoesOnWhereItStopped) {
     TlsPair pair;
     ASSERT_EQ(pair.Convert(), 0);
-    const std::string sent = Pattern(3000000);
+    std::string sent(3000000, 0), received = sent;
+    for (size_t i = 0; i < sent.size(); ++i) {
+        sent[i] = static_cast<char>(i * 2654435761U >> 13);
+    }
     const int size = 1;  // so little that each record leaves in parts
-    setsockopt(pair.client_fd, SOL_SOCKET, SO_SNDBUF, &size, sizeof size);
+    setsockopt(pair.fds[0], SOL_SOCKET, SO_SNDBUF, &size, sizeof size);
     int flag = 0;
     pair.client.SetFlag(&flag);
     pair.client.SetTimeout(1);
     // Until the socket is full: the flush stops in the middle of a record.
     size_t written = 0;
-    int result = 0;
-    while (result == 0) {
+    LeaveAnError();
+    while (pair.client.Write(&sent[written], 60000) == 0) {
+        written += 60000;
         ASSERT_LT(written, sent.size());
         LeaveAnError();
-        result = pair.client.Write(&sent[written], 60000);
-        written += result == 0 ? 60000 : 0;
     }
-    EXPECT_EQ(result, ZEL::RESULT_TIMEOUT);
     flag = 1;
     EXPECT_EQ(pair.client.FlushWrite(0), ZEL::RESULT_INTERRUPTED);
     flag = 0;
-    std::string received(sent.size(), 0);
     std::thread reader([&] {
         for (size_t at = 0; at < received.size(); at += 100000) {
             LeaveAnError();
@@ -260,12 +194,11 @@ TEST_F(Tls, AnInterruptedFlushGoesOnWhereItStopped) {
         }
     });
     for (; written < sent.size(); written += 60000) {
-        ASSERT_EQ(pair.client.Write(&sent[written], 60000), 0);
+        EXPECT_EQ(pair.client.Write(&sent[written], 60000), 0);
     }
-    EXPECT_EQ(pair.client.FlushWrite(0), 0);
+    pair.client.Close();
     reader.join();
     EXPECT_TRUE(received == sent);
-    pair.client.Close();
     char byte;
     EXPECT_EQ(pair.server.Read(&byte, 1), ZEL::RESULT_IO) << "the client has said goodbye";
 }
@@ -273,17 +206,12 @@ TEST_F(Tls, AnInterruptedFlushGoesOnWhereItStopped) {
 TEST_F(Tls, APeerThatDiesRaisesNoSignal) {
     TlsPair pair;
     ASSERT_EQ(pair.Convert(), 0);
-    shutdown(pair.server_fd, SHUT_RDWR);  // no farewell in TLS
+    shutdown(pair.fds[1], SHUT_RDWR);  // no farewell in TLS
     char byte;
-    const test::LogCapture log(ZEL::Logger::LEVEL_WARNING);
     EXPECT_EQ(pair.client.Read(&byte, 1), ZEL::RESULT_IO);
-    pair.client.WriteByte(1);
-    EXPECT_LT(pair.client.FlushWrite(0), 0);
-    pair.client.Close();
-    pair.server.WriteByte(1);
-    EXPECT_EQ(pair.server.FlushWrite(0), ZEL::RESULT_SYSTEM);
-    EXPECT_THAT(log.Text(),
-                HasSubstr("syscall error: n = -1, ssl_ret = 5, errno = 32, err = Broken "
-                          "pipe\n"));
-    pair.server.Close();
+    for (Channel* channel : {&pair.client, &pair.server}) {
+        channel->WriteByte(1);
+        EXPECT_LT(channel->FlushWrite(0), 0);
+        channel->Close();
+    }
 }

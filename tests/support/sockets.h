@@ -3,9 +3,10 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
-#include <cstdio>
+#include <sstream>
 #include <stdexcept>
 #include <string>
+#include <utility>
 
 #include "ZEL/channel.h"
 
@@ -32,30 +33,16 @@ public:
             throw std::runtime_error("cannot write to the pair");
         }
     }
-    /// What has arrived; nothing is waited for.
-    std::string Take() const {
+    /// What has arrived; with 0, all that arrives until the channel's side is closed.
+    std::string Take(int flags = MSG_DONTWAIT) const {
         std::string bytes;
         char buffer[4096];
-        for (ssize_t n; (n = recv(fd, buffer, sizeof buffer, MSG_DONTWAIT)) > 0;) {
+        for (ssize_t n; (n = recv(fd, buffer, sizeof buffer, flags)) > 0;) {
             bytes.append(buffer, static_cast<size_t>(n));
         }
         return bytes;
     }
-    /// All that arrives until the channel's side is closed.
-    std::string TakeAll() const {
-        std::string bytes;
-        char buffer[4096];
-        for (ssize_t n; (n = read(fd, buffer, sizeof buffer)) > 0;) {
-            bytes.append(buffer, static_cast<size_t>(n));
-        }
-        return bytes;
-    }
-    void Close() {
-        if (fd >= 0) {
-            close(fd);
-        }
-        fd = -1;
-    }
+    void Close() { close(std::exchange(fd, -1)); }
 
     ZEL::Channel channel;
     int channel_fd = -1;  ///< the channel's own end
@@ -64,22 +51,19 @@ public:
 
 /// "42 10 00" to the three bytes, and back.
 inline std::string Unhex(const std::string& text) {
+    std::istringstream input(text);
     std::string bytes;
-    unsigned int byte = 0;
-    int used = 0;
-    for (size_t at = 0; sscanf(text.c_str() + at, "%x%n", &byte, &used) == 1;
-         at += static_cast<size_t>(used)) {
+    for (unsigned int byte; input >> std::hex >> byte;) {
         bytes += static_cast<char>(byte);
     }
     return bytes;
 }
 inline std::string Hex(const std::string& bytes) {
+    constexpr char kDigits[] = "0123456789abcdef";
     std::string text;
-    char pair[4];
-    for (const char byte : bytes) {
-        snprintf(pair, sizeof pair, "%s%02x", text.empty() ? "" : " ",
-                 static_cast<unsigned int>(static_cast<unsigned char>(byte)));
-        text += pair;
+    for (const unsigned char byte : bytes) {
+        text += text.empty() ? "" : " ";
+        text += {kDigits[byte >> 4], kDigits[byte & 15]};
     }
     return text;
 }
