@@ -197,11 +197,11 @@ private:
 
     void ZelServer(Words arguments) const {
         arguments.insert(arguments.begin(), ZEL_SERVER);
-        tarq_internal::ChildSpec spec;
-        spec.program = ZEL_SERVER;
-        spec.arguments = std::move(arguments);
-        spec.environment = {"LC_ALL=C", "TARQ_ROOT=" + root_.Path("server")};
-        const auto result = tarq_internal::RunChild(spec, nullptr, nullptr, nullptr);
+        tarq_internal::ChildSetup setup;
+        setup.program = ZEL_SERVER;
+        setup.arguments = std::move(arguments);
+        setup.environment = {"LC_ALL=C", "TARQ_ROOT=" + root_.Path("server")};
+        const auto result = tarq_internal::RunChild(setup, nullptr, nullptr, nullptr);
         Must(result.start_error == 0 && result.wait_status == 0);
     }
 
@@ -249,14 +249,14 @@ private:
     }
 
     bool Bare(const Words& options, const Words& paths) const {
-        tarq_internal::ChildSpec spec;
-        spec.program = tarq_internal::FindProgram("rsync", "/usr/local/bin:/usr/bin:/bin");
-        spec.arguments = {"rsync", "--port=" + std::to_string(port_),
-                          "--password-file=" + password_file_};
-        spec.arguments.insert(spec.arguments.end(), options.begin(), options.end());
-        spec.arguments.insert(spec.arguments.end(), paths.begin(), paths.end());
-        spec.environment = {"LC_ALL=C"};
-        const auto result = tarq_internal::RunChild(spec, nullptr, nullptr, nullptr);
+        tarq_internal::ChildSetup setup;
+        setup.program = tarq_internal::FindProgram("rsync", "/usr/local/bin:/usr/bin:/bin");
+        setup.arguments = {"rsync", "--port=" + std::to_string(port_),
+                           "--password-file=" + password_file_};
+        setup.arguments.insert(setup.arguments.end(), options.begin(), options.end());
+        setup.arguments.insert(setup.arguments.end(), paths.begin(), paths.end());
+        setup.environment = {"LC_ALL=C"};
+        const auto result = tarq_internal::RunChild(setup, nullptr, nullptr, nullptr);
         return result.start_error == 0 && result.wait_status == 0;
     }
 

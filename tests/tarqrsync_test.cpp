@@ -20,7 +20,7 @@ namespace TARQ::Backup {
 namespace {
 
 using tarq_internal::ChildResult;
-using tarq_internal::ChildSpec;
+using tarq_internal::ChildSetup;
 using testing::AllOf;
 using testing::Contains;
 using testing::ElementsAre;
@@ -243,13 +243,13 @@ TEST_F(ArgumentsTest, EachTransportGetsItsOwnWayAndNoneShowsThePassword) {
     EXPECT_EQ(invocation.input, "");
 }
 
-std::string Shell(ChildSpec spec, const std::string& script, ChildResult* result = nullptr,
+std::string Shell(ChildSetup setup, const std::string& script, ChildResult* result = nullptr,
                   const std::function<bool()>& cancelled = nullptr) {
     std::string output;
     const auto append = [&output](const char* bytes, size_t size) { output.append(bytes, size); };
-    spec.program = "/bin/sh";
-    spec.arguments = {"sh", "-c", script};
-    const ChildResult ended = tarq_internal::RunChild(spec, cancelled, append, append);
+    setup.program = "/bin/sh";
+    setup.arguments = {"sh", "-c", script};
+    const ChildResult ended = tarq_internal::RunChild(setup, cancelled, append, append);
     if (result != nullptr) {
         *result = ended;
     }
@@ -271,11 +271,11 @@ TEST(ChildProcess, InheritsNothingOfTheHost) {
     sigaddset(&blocked, SIGTERM);
     pthread_sigmask(SIG_BLOCK, &blocked, &before);
     setenv("HOST_SECRET", "x", 1);
-    ChildSpec spec;
-    spec.environment = {"GIVEN=1"};
-    spec.input = "in";
+    ChildSetup setup;
+    setup.environment = {"GIVEN=1"};
+    setup.input = "in";
     const std::string output =
-        Shell(spec,
+        Shell(setup,
               "cat; echo; for f in /proc/self/fd/*; do echo ${f##*/}; done;"
               "read -r _ _ _ _ group session tty _ < /proc/self/stat; "
               "echo $((group == session)) $tty $HOST_SECRET $GIVEN;"
@@ -304,14 +304,14 @@ TEST(ChildProcess, EndsWithItsWholeGroupHoweverTheRunEnds) {
     EXPECT_EQ(result.wait_status, 0);
 
     std::string pid;
-    ChildSpec spec;
-    spec.program = "/bin/sh";
-    spec.arguments = {"sh", "-c", "sleep 100 & echo $!; wait"};
+    ChildSetup setup;
+    setup.program = "/bin/sh";
+    setup.arguments = {"sh", "-c", "sleep 100 & echo $!; wait"};
     const auto thrower = [&pid](const char* bytes, size_t size) {
         pid.assign(bytes, size);
         throw std::logic_error("stop");
     };
-    EXPECT_THROW(tarq_internal::RunChild(spec, nullptr, thrower, nullptr), std::logic_error);
+    EXPECT_THROW(tarq_internal::RunChild(setup, nullptr, thrower, nullptr), std::logic_error);
     EXPECT_TRUE(gone(pid));
 
     int asked = 0;
@@ -323,12 +323,12 @@ TEST(ChildProcess, EndsWithItsWholeGroupHoweverTheRunEnds) {
 }
 
 TEST(ChildProcess, TellsWhyAProgramDidNotStartAndHowItEnded) {
-    ChildSpec spec;
-    spec.program = "/no/such";
-    spec.arguments = {"x"};
-    EXPECT_EQ(tarq_internal::RunChild(spec, nullptr, nullptr, nullptr).start_error, ENOENT);
-    spec.input.assign(tarq_internal::kMaxChildInput + 1, 'x');
-    EXPECT_EQ(tarq_internal::RunChild(spec, nullptr, nullptr, nullptr).start_error, E2BIG);
+    ChildSetup setup;
+    setup.program = "/no/such";
+    setup.arguments = {"x"};
+    EXPECT_EQ(tarq_internal::RunChild(setup, nullptr, nullptr, nullptr).start_error, ENOENT);
+    setup.input.assign(tarq_internal::kMaxChildInput + 1, 'x');
+    EXPECT_EQ(tarq_internal::RunChild(setup, nullptr, nullptr, nullptr).start_error, E2BIG);
 
     ChildResult result;
     Shell({}, "exit 7", &result);
@@ -337,7 +337,7 @@ TEST(ChildProcess, TellsWhyAProgramDidNotStartAndHowItEnded) {
     EXPECT_EQ(large.size(), 3000000U);
 
     const test::TempFolder folder;
-    ChildSpec limited;
+    ChildSetup limited;
     limited.max_file_bytes = 1000;
     Shell(limited, "exec head -c 3000 /dev/zero > " + folder.Path("f"), &result);
     EXPECT_NE(result.wait_status, 0);

@@ -234,26 +234,26 @@ struct Stream {
 };
 
 // Starts the child. 0, or errno.
-int Start(const ChildSpec& spec, std::optional<ProcessGroup>* group, Stream* output,
+int Start(const ChildSetup& setup, std::optional<ProcessGroup>* group, Stream* output,
           Stream* error) {
-    const std::vector<char*> arguments = CStrings(spec.arguments);
-    const std::vector<char*> environment = CStrings(spec.environment);
+    const std::vector<char*> arguments = CStrings(setup.arguments);
+    const std::vector<char*> environment = CStrings(setup.environment);
     Pipe out, err, report;
-    const UniqueFd input = MakeInput(spec.input);
+    const UniqueFd input = MakeInput(setup.input);
     if (!input || !MakePipe(&out) || !MakePipe(&err) || !MakePipe(&report)) {
         return errno;
     }
     for (const UniqueFd* end : {&out.read_end, &err.read_end}) {
         fcntl(end->Get(), F_SETFL, O_NONBLOCK);
     }
-    const ChildPlan plan = {spec.program.c_str(),
+    const ChildPlan plan = {setup.program.c_str(),
                             arguments.data(),
                             environment.data(),
                             input.Get(),
                             out.write_end.Get(),
                             err.write_end.Get(),
                             report.write_end.Get(),
-                            spec.max_file_bytes,
+                            setup.max_file_bytes,
                             getpid()};
     pid_t pid;
     int fork_error;
@@ -336,7 +336,7 @@ void Wait(const ProcessGroup& group, const Stream& output, const Stream& error,
 
 }  // namespace
 
-ChildResult RunChild(const ChildSpec& spec, const std::function<bool()>& cancelled,
+ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cancelled,
                      const OutputHandler& on_output, const OutputHandler& on_error,
                      const EarlyEnd& early_end) {
     const OutputHandler nowhere = [](const char*, size_t) {};
@@ -348,7 +348,7 @@ ChildResult RunChild(const ChildSpec& spec, const std::function<bool()>& cancell
         result.cancelled = true;
         return result;
     }
-    result.start_error = Start(spec, &group, &output, &error);
+    result.start_error = Start(setup, &group, &output, &error);
     if (result.start_error != 0) {
         return result;
     }

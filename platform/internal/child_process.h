@@ -13,7 +13,7 @@ namespace tarq_internal {
 /// A program to run. The child gets these arguments and this environment and nothing else of the
 /// host: default signal dispositions, no descriptor above 2, a session and process group of its
 /// own, no terminal.
-struct ChildSpec {
+struct ChildSetup {
     std::string program;                   ///< path of the executable, see FindProgram()
     std::vector<std::string> arguments;    ///< argv, the program's own name included
     std::vector<std::string> environment;  ///< NAME=value
@@ -50,7 +50,7 @@ using OutputHandler = std::function<void(const char* bytes, size_t size)>;
 ///
 /// May be called from any thread. The process's signal dispositions are neither used nor changed; a
 /// process that ignores SIGCHLD, or reaps every child it finds, gets wait_status -1.
-ChildResult RunChild(const ChildSpec& spec, const std::function<bool()>& cancelled,
+ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cancelled,
                      const OutputHandler& on_output, const OutputHandler& on_error,
                      const EarlyEnd& early_end = {});
 

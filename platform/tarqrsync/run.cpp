@@ -26,7 +26,7 @@ namespace Backup {
 namespace {
 
 using tarq_internal::ChildResult;
-using tarq_internal::ChildSpec;
+using tarq_internal::ChildSetup;
 
 constexpr char kLogPath[] = "/var/log/tarqrsync.log";
 constexpr off_t kMaxLogBytes = off_t{1024} * 1024;
@@ -80,14 +80,14 @@ std::string PathVariable(const std::vector<std::string>& environment) {
 }
 
 // The number in "rsync  version 3.2.7  protocol version 31"; empty when the program does not say.
-std::string AskVersion(const ChildSpec& used) {
-    ChildSpec spec;
-    spec.program = used.program;
-    spec.arguments = {used.program, "--version"};
-    spec.environment = used.environment;
+std::string AskVersion(const ChildSetup& used) {
+    ChildSetup setup;
+    setup.program = used.program;
+    setup.arguments = {used.program, "--version"};
+    setup.environment = used.environment;
     std::string text;
     tarq_internal::RunChild(
-        spec, nullptr, [&text](const char* bytes, size_t size) { text.append(bytes, size); },
+        setup, nullptr, [&text](const char* bytes, size_t size) { text.append(bytes, size); },
         nullptr);
     const std::string head = "rsync  version ";
     if (text.compare(0, head.size(), head) != 0) {
@@ -277,20 +277,20 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
                   OutputParser* parser, const ChildLimits& limits) {
     outcome_.explanation.clear();
     messages_.clear();
-    ChildSpec spec;
-    spec.program = tarq_internal::FindProgram(config_.rsync, PathVariable(invocation.environment));
-    spec.arguments = invocation.arguments;
-    spec.arguments.insert(spec.arguments.begin(), config_.rsync);
-    spec.environment = invocation.environment;
-    spec.input = invocation.input;
-    spec.max_file_bytes = limits.max_file_bytes;
-    if (spec.program.empty()) {
+    ChildSetup setup;
+    setup.program = tarq_internal::FindProgram(config_.rsync, PathVariable(invocation.environment));
+    setup.arguments = invocation.arguments;
+    setup.arguments.insert(setup.arguments.begin(), config_.rsync);
+    setup.environment = invocation.environment;
+    setup.input = invocation.input;
+    setup.max_file_bytes = limits.max_file_bytes;
+    if (setup.program.empty()) {
         return Fail(STATUS_RSYNC_MISSING, "the program " + config_.rsync + " is not installed");
     }
 
     MessageKeeper keeper;
     const ChildResult result = tarq_internal::RunChild(
-        spec, cancelled,
+        setup, cancelled,
         [parser](const char* bytes, size_t size) {
             parser->Feed({bytes, size});
         },
@@ -300,7 +300,7 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
         limits.early_end);
     messages_ = keeper.Text();
     if (result.start_error != 0) {
-        return Fail(STATUS_RSYNC_MISSING, "the program " + spec.program + " cannot be started: " +
+        return Fail(STATUS_RSYNC_MISSING, "the program " + setup.program + " cannot be started: " +
                                               strerror(result.start_error));
     }
     if (result.cancelled) {
@@ -322,9 +322,9 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
         return STATUS_DONE;
     }
     if (exit_code == STATUS_SYNTAX && messages_.find("unknown option") != std::string::npos) {
-        const std::string version = AskVersion(spec);
+        const std::string version = AskVersion(setup);
         if (IsTooOld(version)) {
-            return Fail(STATUS_SYNTAX, spec.program + " is rsync " + version +
+            return Fail(STATUS_SYNTAX, setup.program + " is rsync " + version +
                                            ", which is too old: version 3.2.1 or later is needed");
         }
     }

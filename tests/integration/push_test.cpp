@@ -35,15 +35,15 @@ struct Outcome {
 Outcome RunProgram(const std::string& root, std::vector<std::string> command,
                    const std::string& input = "", const std::function<bool()>& cancelled = nullptr,
                    const std::string& path = kSearchPath) {
-    tarq_internal::ChildSpec spec;
-    spec.program = tarq_internal::FindProgram(command[0], kSearchPath);
-    spec.arguments = std::move(command);
-    spec.environment = {"LC_ALL=C", "TARQ_ROOT=" + root, "PATH=" + path};
-    spec.input = input;
+    tarq_internal::ChildSetup setup;
+    setup.program = tarq_internal::FindProgram(command[0], kSearchPath);
+    setup.arguments = std::move(command);
+    setup.environment = {"LC_ALL=C", "TARQ_ROOT=" + root, "PATH=" + path};
+    setup.input = input;
     Outcome outcome;
     const auto append = [&](const char* bytes, size_t size) { outcome.output.append(bytes, size); };
     const tarq_internal::ChildResult result =
-        tarq_internal::RunChild(spec, cancelled, append, append);
+        tarq_internal::RunChild(setup, cancelled, append, append);
     outcome.exit_code = WIFEXITED(result.wait_status) ? WEXITSTATUS(result.wait_status) : -1;
     return outcome;
 }

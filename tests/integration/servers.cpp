@@ -42,17 +42,17 @@ bool Answers(int port) {
     return connect(socket.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
 }
 
-tarq_internal::ChildSpec SpecOf(const std::vector<std::string>& command) {
-    tarq_internal::ChildSpec spec;
-    spec.program = tarq_internal::FindProgram(command[0], kPrograms);
-    spec.arguments = command;
-    spec.environment = {"LC_ALL=C", std::string("PATH=") + kPrograms};
-    return spec;
+tarq_internal::ChildSetup SetupOf(const std::vector<std::string>& command) {
+    tarq_internal::ChildSetup setup;
+    setup.program = tarq_internal::FindProgram(command[0], kPrograms);
+    setup.arguments = command;
+    setup.environment = {"LC_ALL=C", std::string("PATH=") + kPrograms};
+    return setup;
 }
 
 void Run(const std::vector<std::string>& command) {
     const tarq_internal::ChildResult result =
-        tarq_internal::RunChild(SpecOf(command), nullptr, nullptr, nullptr);
+        tarq_internal::RunChild(SetupOf(command), nullptr, nullptr, nullptr);
     if (result.start_error != 0 || result.wait_status != 0) {
         throw std::runtime_error(command[0] + " failed");
     }
@@ -75,7 +75,7 @@ void ServerProcess::Start(const std::vector<std::string>& command, const std::st
             file.write(bytes, static_cast<std::streamsize>(size)).flush();
         };
         tarq_internal::RunChild(
-            SpecOf(command), [this] { return stop_.load(); }, append, append);
+            SetupOf(command), [this] { return stop_.load(); }, append, append);
         ended_ = true;
     });
     const auto limit = steady_clock::now() + kStartLimit;
