@@ -3,6 +3,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <cstdlib>
+#include <new>
 #include <thread>
 #include <utility>
 
@@ -16,6 +19,28 @@ using test::Unhex;
 using testing::Contains;
 using ZEL::PObject;
 using ZEL::PStream;
+
+namespace {
+
+std::atomic<int> allocations{0};
+
+}  // namespace
+
+// The library's allocations, counted.
+__attribute__((visibility("default"), noinline)) void* operator new(size_t size) {
+    ++allocations;
+    if (void* memory = malloc(size)) {
+        return memory;
+    }
+    throw std::bad_alloc();
+}
+__attribute__((visibility("default"), noinline)) void operator delete(void* memory) noexcept {
+    free(memory);
+}
+__attribute__((visibility("default"), noinline)) void operator delete(void* memory,
+                                                                      size_t) noexcept {
+    free(memory);
+}
 
 namespace {
 
@@ -205,4 +230,26 @@ TEST(PStream, AFailedSendTellsItsKeyPathAndForgetsIt) {
     EXPECT_EQ(log.Text(), "[ERROR] ZEL/stream(N): Error stack: \n");
     stream.GetStatus(path, done, total);
     EXPECT_EQ(path + std::to_string(done) + std::to_string(total), "00");
+}
+
+TEST(PStream, OnlyTheValueItselfCostsAllocations) {
+    const auto count = [](const auto& work) {
+        const int before = allocations;
+        work();
+        return allocations - before;
+    };
+    for (const int entries : {10, 500}) {
+        PObject value;
+        for (int i = 0; i < entries; ++i) {
+            value[std::string(50, 'k') + std::to_string(i)] = std::string(50, 'v');
+        }
+        RawPeer peer;
+        EXPECT_LT(count([&] { ASSERT_EQ(PStream().Send(peer.channel, value), 0); }), 10);
+        peer.Send(peer.Take());
+        PObject received, copied;
+        const int for_a_copy = count([&] { copied = value; });
+        EXPECT_LT(count([&] { ASSERT_EQ(PStream().Recv(peer.channel, received), 0); }),
+                  for_a_copy + 10);
+        EXPECT_EQ(received.toString(), value.toString());
+    }
 }

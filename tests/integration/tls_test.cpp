@@ -96,6 +96,28 @@ TEST_F(Tls, AnOpensslClientIsServed) {
     }
 }
 
+TEST_F(Tls, AnOpensslServerIsTalkedTo) {
+    for (const std::string version : {"-tls1_2", "-tls1_3"}) {
+        test::Command server("openssl s_server -accept 127.0.0.1:0 -naccept 1 -rev -cert " +
+                             Path("nas.pem") + " -key " + Path("nas.key") + " " + version);
+        std::string line = "first";
+        while (line.find("ACCEPT 127.0.0.1:") != 0) {
+            ASSERT_FALSE(line.empty());
+            line = server.ReadLine();
+        }
+        Channel channel(kCapacity);
+        channel.SetAllowUntrust(false);
+        channel.SetSSLHostname("a.wild.example");
+        ASSERT_EQ(channel.Open("127.0.0.1", stoi(line.substr(line.rfind(':') + 1))), 0);
+        ASSERT_EQ(channel.ConvertToSSLChannel(false), 0) << version;
+        char reply[8] = "";
+        ASSERT_EQ(channel.Write("drawer\n", 7), 0);
+        ASSERT_EQ(channel.FlushWrite(0), 0);
+        ASSERT_EQ(channel.Read(reply, 7), 0);
+        EXPECT_STREQ(reply, "reward\n");
+    }
+}
+
 TEST_F(Tls, TheServersCertificateDecides) {
     const struct {
         const char *certificate, *host;
