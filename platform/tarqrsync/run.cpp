@@ -4,6 +4,7 @@
 #include <sys/inotify.h>
 #include <sys/random.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -14,7 +15,7 @@
 #include <cstring>
 
 #include "platform/internal/child_process.h"
-#include "platform/internal/proc_stat.h"
+#include "platform/internal/config.h"
 #include "platform/internal/unique_fd.h"
 #include "platform/tarqrsync/answer_file.h"
 #include "platform/tarqrsync/message_keeper.h"
@@ -115,22 +116,27 @@ bool IsMissing(const std::string& path) {
     return lstat(path.c_str(), &info) != 0 && (errno == ENOENT || errno == ENOTDIR);
 }
 
-// The first child of `parent`, if it was made soon after its parent; else -1.
-pid_t FindChild(pid_t parent) {
-    constexpr pid_t kSoon = 256;
-    for (pid_t pid = parent + 1; pid <= parent + kSoon; ++pid) {
-        const auto stat = tarq_internal::ReadProcStat(pid);
-        if (stat && stat->parent == parent) {
-            return pid;
-        }
+// True when the process `pid` is known to lie in a sleep of a fixed time.
+bool IsInTimedSleep(pid_t pid) {
+    const auto text = tarq_internal::ReadTextFile("/proc/" + std::to_string(pid) + "/syscall");
+    long number = -1;  // of the system call; no number when the process runs
+    if (!text) {
+        return false;
     }
-    return -1;
+    std::from_chars(text->data(), text->data() + text->size(), number);
+#ifdef SYS_clock_nanosleep_time64
+    if (number == SYS_clock_nanosleep_time64) {
+        return true;
+    }
+#endif
+    return number == SYS_clock_nanosleep || number == SYS_nanosleep;
 }
 
-// rsync receives in a child, which renames the answer into place once it has checked it, and ends
-// when the connection's last words are said. The parent then sleeps for 20 ms before it looks
-// whether the child is gone: half of what a command costs. The watch sees both and lets the
-// run end there. Where it cannot see them the run ends by itself.
+// rsync receives in a child, which renames the answer into place once it has checked it. When then
+// the connection's last words are written, the parent tells the child to go and looks after it
+// every 20 ms: half of what a command costs. The watch sees the answer, and that the parent sleeps,
+// which it does at no other time after the answer, and lets the run end there. Where it cannot
+// see them the run ends by itself.
 class AnswerWatch {
 public:
     AnswerWatch(const std::string& folder, const std::string& answer_file)
@@ -140,28 +146,14 @@ public:
         }
     }
 
-    tarq_internal::EarlyEnd End() {
-        return {notify_.Get(), [this](pid_t rsync) { return IsOver(rsync); }};
+    tarq_internal::EarlyEnd End() const {
+        return {notify_.Get(),
+                [this](pid_t rsync) { return !IsMissing(answer_file_) && IsInTimedSleep(rsync); }};
     }
 
 private:
-    bool IsOver(pid_t rsync) {
-        if (IsMissing(answer_file_)) {
-            return false;
-        }
-        if (receiver_ < 0) {
-            receiver_ = FindChild(rsync);
-        }
-        if (receiver_ < 0) {
-            return false;
-        }
-        const auto stat = tarq_internal::ReadProcStat(receiver_);
-        return !stat || stat->state == 'Z';
-    }
-
     std::string answer_file_;
     tarq_internal::UniqueFd notify_;
-    pid_t receiver_ = -1;
 };
 
 }  // namespace
@@ -210,9 +202,10 @@ int Run::RunCommand(const std::function<bool()>& cancelled) {
     const InvocationContext context = {settings_, config_, no_options, false, false, log_file_};
     const Invocation invocation =
         CommandInvocation(context, folder_.Write("command", text), session, answer_file, &folder_);
-    AnswerWatch watch(folder_.Path(""), answer_file);
+    const AnswerWatch watch(folder_.Path(""), answer_file);
     ChildLimits limits = {kMaxCommandFileBytes, {}};
-    if (TransportOf(settings_) == Transport::DAEMON) {  // else rsync has other children
+    // With ssh the last words are written to it, and not yet to the connection.
+    if (TransportOf(settings_) == Transport::DAEMON) {
         limits.early_end = watch.End();
     }
     const int status = RunRsync(cancelled, invocation, &parser, limits);
