@@ -8,24 +8,13 @@
 #include <cstdio>
 
 #include "platform/internal/unique_fd.h"
+#include "platform/internal/write_all.h"
 
 namespace zel_server {
 
 namespace {
 
 using tarq_internal::UniqueFd;
-
-bool WriteAll(int fd, const std::string& content) {
-    size_t done = 0;
-    while (done < content.size()) {
-        const ssize_t written = write(fd, content.data() + done, content.size() - done);
-        if (written < 0 && errno != EINTR) {
-            return false;
-        }
-        done += written > 0 ? static_cast<size_t>(written) : 0;
-    }
-    return true;
-}
 
 void SyncFolderOf(const std::string& path) {
     const UniqueFd folder(
@@ -44,8 +33,8 @@ bool WriteFileAtomically(const std::string& path, const std::string& content, mo
     if (!file) {
         return false;
     }
-    if (fchmod(file.Get(), mode) == 0 && WriteAll(file.Get(), content) && fsync(file.Get()) == 0 &&
-        rename(temporary.c_str(), path.c_str()) == 0) {
+    if (fchmod(file.Get(), mode) == 0 && tarq_internal::WriteAll(file.Get(), content) &&
+        fsync(file.Get()) == 0 && rename(temporary.c_str(), path.c_str()) == 0) {
         SyncFolderOf(path);
         return true;
     }
