@@ -2,8 +2,8 @@
 #include <string.h>
 #include <syslog.h>
 
-#include "ZEL/is_syncedshare.h"
 #include "ZEL/internal/registry.h"
+#include "ZEL/is_syncedshare.h"
 
 using namespace ZEL::registry;
 

@@ -6,8 +6,8 @@
 
 #include <cstdint>
 
-#include "ZEL/is_syncedshare.h"
 #include "ZEL/internal/registry.h"
+#include "ZEL/is_syncedshare.h"
 #include "tarq/root_path.h"
 
 using namespace ZEL::registry;

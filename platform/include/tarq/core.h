@@ -108,8 +108,8 @@ void KAPICStrPut(char* text);
  * instant the old file or the new one is there. Writers do not lock: callers serialise them (see
  * the semaphores below).
  *
- * Of several sections of one name, and of several lines of one key, the first counts. A file of more
- * than 8 MiB is refused (TARQ_ERR_READ_FILE, errno EFBIG).
+ * Of several sections of one name, and of several lines of one key, the first counts. A file of
+ * more than 8 MiB is refused (TARQ_ERR_READ_FILE, errno EFBIG).
  *
  * Refused with TARQ_ERR_BAD_PARAMETER, nothing written: a line break in a name, key or value, "]"
  * in a section name, "=" or a quote in a key, an empty key.
