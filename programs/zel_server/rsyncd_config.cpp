@@ -23,11 +23,11 @@ bool IsRoot() {
     return geteuid() == 0;
 }
 
-// An exec line of the daemon, which a shell reads. The root folder is named: the daemon may have
-// been started without.
+// An exec line of the daemon, which a shell reads and then is. The root folder is named: the daemon
+// may have been started without.
 std::string ExecLine(const ServerConfig& config, const char* operation) {
     const std::string root = TARQ::RootFolder();
-    return (root.empty() ? "" : "TARQ_ROOT='" + root + "' ") + "'" + config.program + "' " +
+    return (root.empty() ? "" : "TARQ_ROOT='" + root + "' ") + "exec '" + config.program + "' " +
            operation;
 }
 
