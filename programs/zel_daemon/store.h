@@ -1,0 +1,79 @@
+// What the daemon must not forget: tasks, changes that wait to be sent, and the history of runs.
+//
+// One SQLite file in WAL mode, mode 0600 (it holds passwords). Every operation is one transaction:
+// a killed process leaves the state before it or after it.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+#include "programs/zel_daemon/task_record.h"
+
+namespace zel_daemon {
+
+/// The store cannot be read or written: what() says which file, what failed and what to do.
+class StoreError : public std::runtime_error {
+public:
+    using std::runtime_error::runtime_error;
+};
+
+/// Threads: one thread. Every operation may throw StoreError; nothing has changed then.
+class Store {
+public:
+    /// The layout of the file that this program writes. An older one is brought up to it when it is
+    /// opened; a newer one is refused.
+    static constexpr int kSchemaVersion = 1;
+    /// Runs kept of each task; the oldest are dropped when new ones begin.
+    static constexpr int kRunsKept = 200;
+
+    /// Opens the file, making it (and its folder, 0700) when it is not there. Runs that had not
+    /// ended when the file was last used are marked as failed ("the daemon was stopped"), and their
+    /// events wait again.
+    explicit Store(const std::string& path);
+    ~Store();
+    Store(const Store&) = delete;
+    Store& operator=(const Store&) = delete;
+
+    /// All tasks, by id.
+    std::vector<TaskRecord> Tasks();
+    /// Stores a new task and returns its id, never used before. The record's own id is not looked
+    /// at. A name that is taken throws.
+    uint64_t AddTask(const TaskRecord& record);
+    /// Replaces the task with the record's id.
+    void UpdateTask(const TaskRecord& record);
+    /// Removes a task with its events and its history.
+    void RemoveTask(uint64_t id);
+
+    /// Stores changes as waiting, in one transaction; what is there already is not stored twice.
+    void AddEvents(uint64_t task_id, const std::string& share,
+                   const std::vector<std::string>& paths);
+    /// The changes of a task that wait, oldest first, as (share, path) with their ids.
+    std::vector<ZEL::Event> PendingEvents(uint64_t task_id);
+    /// Marks these as being sent: a change of the same path that comes now waits on its own.
+    void MarkSending(const std::vector<uint64_t>& ids);
+    /// The server took these.
+    void RemoveEvents(const std::vector<uint64_t>& ids);
+    /// The run failed: they wait again.
+    void ReturnEvents(const std::vector<uint64_t>& ids);
+    uint64_t CountEvents(uint64_t task_id);
+    /// Forgets all changes of a task, whatever their state.
+    void ClearEvents(uint64_t task_id);
+
+    /// Notes the beginning of a run and returns its id.
+    uint64_t BeginRun(uint64_t task_id, RunReason reason, int64_t start);
+    /// Notes how the run with the record's id ended.
+    void EndRun(const RunRecord& run);
+    /// The last runs of a task, newest first.
+    std::vector<RunRecord> Runs(uint64_t task_id, unsigned int limit);
+    /// The last run of each task that has one, the running ones included, by task id.
+    std::vector<RunRecord> LastRuns();
+
+private:
+    struct Impl;
+    std::unique_ptr<Impl> impl_;
+};
+
+}  // namespace zel_daemon

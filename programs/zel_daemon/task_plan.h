@@ -1,0 +1,77 @@
+// When a task is to run next: its schedule, what was missed, and what failed.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <optional>
+
+#include "ZEL/sync_obj.h"
+
+namespace zel_daemon {
+
+/// The times that plans are made with. Tests set their own.
+class Clock {
+public:
+    virtual ~Clock() = default;
+    /// Seconds since the epoch, as people's clocks show it: may jump.
+    virtual int64_t Now() const = 0;
+    /// Milliseconds since some moment, time asleep included: never jumps.
+    virtual int64_t Elapsed() const = 0;
+};
+
+class SystemClock : public Clock {
+public:
+    int64_t Now() const override;
+    int64_t Elapsed() const override;
+};
+
+/// The plan of one task. It knows nothing of pauses and of running: whoever holds it asks only when
+/// the task may run.
+///
+/// Schedule: a run that was missed (the machine was off, the clock jumped ahead) is made up for
+/// once, however many were missed. After a jump back the schedule goes on from the time that the
+/// clock shows. A failed run is tried again after 10 s, 20 s, 40 s ... up to 1 h, each up to a
+/// fifth shorter or longer so that many clients do not come back together.
+///
+/// Threads: one thread.
+class TaskPlan {
+public:
+    static constexpr int64_t kFirstRetryMs = 10 * 1000;
+    static constexpr int64_t kLongestRetryMs = 3600 * 1000;
+
+    /// `checked_until`: runs of the schedule up to here have been made. `random` gives numbers from
+    /// 0 to below 1; tests set their own.
+    TaskPlan(const Clock& clock, const ZEL::Schedule& schedule, int64_t checked_until,
+             std::function<double()> random = nullptr);
+
+    /// The schedule's next run, in seconds since the epoch; one in the past is due now. Nothing for
+    /// manual and realtime tasks and when no run will come.
+    std::optional<int64_t> NextRun() const;
+    /// True when the schedule wants a run now. A clock that was set back is noticed here.
+    bool ScheduleDue();
+    /// A run of the schedule starts, or is given up: the next one counts from now.
+    void ScheduleTaken();
+    /// What must be stored: runs up to here are done with.
+    int64_t CheckedUntil() const { return checked_until_; }
+
+    /// A run failed: sets the moment of the next try.
+    void Failed();
+    /// A run was made well, or cancelled by a person: no try is waiting any more.
+    void Settled();
+    /// Whether a failed run waits to be tried again, and whether its moment has come.
+    bool RetryWaiting() const { return retry_at_.has_value(); }
+    bool RetryDue() const;
+    unsigned int Failures() const { return failures_; }
+    /// Milliseconds until the next try; 0 when it is due; nothing when none waits.
+    std::optional<int64_t> UntilRetry() const;
+
+private:
+    const Clock& clock_;
+    ZEL::Schedule schedule_;
+    int64_t checked_until_;
+    std::function<double()> random_;
+    unsigned int failures_ = 0;
+    std::optional<int64_t> retry_at_;  // on the clock that never jumps
+};
+
+}  // namespace zel_daemon

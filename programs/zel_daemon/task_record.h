@@ -1,0 +1,53 @@
+// A task as the daemon keeps it: what the library knows of it, and what is the daemon's own.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "ZEL/pobject.h"
+#include "ZEL/sync_obj.h"
+
+namespace zel_daemon {
+
+struct TaskRecord {
+    ZEL::SyncTask task;
+    std::vector<std::string> excludes;  ///< rsync patterns of files that stay behind
+    bool paused = false;                ///< started by nobody but a person
+    /// Runs of the schedule up to this moment (seconds since the epoch) have been made or given up.
+    int64_t checked_until = 0;
+    /// A realtime task's next run takes its shares whole: its events do not tell all that changed.
+    bool whole_due = false;
+
+    uint64_t ID() const { return task.GetID(); }
+    std::string Name() const { return task.GetInfo().GetName(); }
+    const ZEL::TaskInfo& Info() const { return task.GetInfo(); }
+    bool IsRealtime() const { return Info().GetSchedule().GetMode() == ZEL::SCHD_MODE_REALTIME; }
+};
+
+/// Why a run was made.
+enum class RunReason : int {
+    kSchedule = 0,  ///< it was due
+    kChange = 1,    ///< something below its shares had changed
+    kRequest = 2,   ///< a person asked for it
+    kRetry = 3      ///< the run before had failed
+};
+
+/// One run of a task in the history.
+struct RunRecord {
+    uint64_t id = 0;
+    uint64_t task_id = 0;
+    RunReason reason = RunReason::kSchedule;
+    int64_t start = 0;  ///< seconds since the epoch
+    int64_t end = 0;    ///< 0 while it runs
+    ZEL::TASK_RESULT result = ZEL::TASK_RESULT_NONE;
+    int status =
+        0;  ///< the server's or rsync's, see tarq/rsync_wrapper.h; 0 also for local failures
+    std::string error;  ///< what failed and where, for a person; empty after a success
+    uint64_t files_sent = 0;
+    uint64_t files_deleted = 0;
+    uint64_t bytes_sent = 0;
+    uint64_t rsync_runs = 0;  ///< copies made, without the server commands around them
+};
+
+}  // namespace zel_daemon
