@@ -6,4 +6,6 @@ if(ZEL_BUILD_PROGRAMS)
     target_compile_definitions(push_test PRIVATE
         ZELCTL="$<TARGET_FILE:zelctl>" ZEL_SERVER="$<TARGET_FILE:zel_server>")
     add_dependencies(push_test zelctl zel_server)
+    add_test(NAME completion_test
+        COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/integration/completion_test.sh ${PROJECT_SOURCE_DIR})
 endif()
