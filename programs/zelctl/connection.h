@@ -4,7 +4,7 @@
 #include <CLI/CLI.hpp>
 #include <string>
 
-#include "ZEL/rsyncer.h"
+#include "ZEL/sync_obj.h"
 #include "programs/zelctl/exit_codes.h"
 
 namespace zelctl {
@@ -24,11 +24,5 @@ struct ConnectionOptions {
     /// Fills `info`, asking for the password where needed.
     ExitCode ToSyncInfo(ZEL::SyncInfo& info) const;
 };
-
-/// What a failed operation came to, for a person: the server's words, rsync's, or where to look.
-std::string Explain(int status, const TARQ::Backup::RunReport& report);
-
-/// Whether `status` is the server's refusal rather than a failure on the way.
-ExitCode CodeOf(int status);
 
 }  // namespace zelctl

@@ -12,10 +12,11 @@ namespace zelctl {
 
 namespace {
 
-volatile sig_atomic_t interrupted = 0;
+std::atomic<bool> interrupted{false};
+static_assert(std::atomic<bool>::is_always_lock_free, "set in a signal handler");
 
 extern "C" void Note(int) {
-    interrupted = 1;
+    interrupted = true;
 }
 
 }  // namespace
@@ -31,8 +32,8 @@ void WatchForInterrupt() {
     }
 }
 
-bool Interrupted() {
-    return interrupted != 0;
+const std::atomic<bool>& Interrupted() {
+    return interrupted;
 }
 
 ExitCode Fail(ExitCode code, const char* format, ...) {
