@@ -25,6 +25,9 @@ struct ConnectionOptions {
     ExitCode ToSyncInfo(ZEL::SyncInfo& info) const;
 };
 
+/// Enters `server` as the address or the name that it is, and forgets the other.
+void SetServer(const std::string& server, ZEL::SyncInfo& info);
+
 /// What a failed operation came to, for a person: the server's words, rsync's, or where to look.
 std::string Explain(int status, const TARQ::Backup::RunReport& report);
 

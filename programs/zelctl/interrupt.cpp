@@ -12,10 +12,10 @@ namespace zelctl {
 
 namespace {
 
-volatile sig_atomic_t interrupted = 0;
+int interrupted = 0;  // a whole int, for those who take it as an abort flag
 
 extern "C" void Note(int) {
-    interrupted = 1;
+    __atomic_store_n(&interrupted, 1, __ATOMIC_RELAXED);
 }
 
 }  // namespace
@@ -32,7 +32,11 @@ void WatchForInterrupt() {
 }
 
 bool Interrupted() {
-    return interrupted != 0;
+    return __atomic_load_n(&interrupted, __ATOMIC_RELAXED) != 0;
+}
+
+int* InterruptFlag() {
+    return &interrupted;
 }
 
 ExitCode Fail(ExitCode code, const char* format, ...) {

@@ -10,4 +10,7 @@ void WatchForInterrupt();
 /// Whether one has come: a cancel checker for the library's runs.
 bool Interrupted();
 
+/// Not 0 once one has come: an abort flag for channels.
+int* InterruptFlag();
+
 }  // namespace zelctl

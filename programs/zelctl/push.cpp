@@ -87,8 +87,8 @@ public:
         if (result == kOk) {
             result = CheckShares(options_.shares);
         }
-        ZEL::SyncInfo info;
-        if (result == kOk) {
+        ZEL::SyncInfo info = options_.info.value_or(ZEL::SyncInfo());
+        if (result == kOk && !options_.info) {
             result = options_.connection.ToSyncInfo(info);
         }
         if (result != kOk) {
