@@ -40,11 +40,7 @@ ExitCode ConnectionOptions::ToSyncInfo(ZEL::SyncInfo& info) const {
     if (!password) {
         return Fail(kUsage, "%s", error.c_str());
     }
-    if (IsAddress(server)) {
-        info.SetServerIP(server);
-    } else {
-        info.SetServerName(server);
-    }
+    SetServer(server, info);
     info.SetUser(user);
     info.SetPassword(*password);
     info.SetSSH(ssh);
@@ -53,6 +49,12 @@ ExitCode ConnectionOptions::ToSyncInfo(ZEL::SyncInfo& info) const {
     info.SetCompression(compress);
     info.SetBlockLevelSync(delta);
     return info.Validate() ? kOk : Fail(kUsage, "the server or the account is not given");
+}
+
+void SetServer(const std::string& server, ZEL::SyncInfo& info) {
+    const bool is_address = IsAddress(server);
+    info.SetServerIP(is_address ? server : "");
+    info.SetServerName(is_address ? "" : server);
 }
 
 }  // namespace zelctl

@@ -25,4 +25,7 @@ struct ConnectionOptions {
     ExitCode ToSyncInfo(ZEL::SyncInfo& info) const;
 };
 
+/// Enters `server` as the address or the name that it is, and forgets the other.
+void SetServer(const std::string& server, ZEL::SyncInfo& info);
+
 }  // namespace zelctl

@@ -13,10 +13,12 @@ namespace zelctl {
 namespace {
 
 std::atomic<bool> interrupted{false};
+int interrupt_flag = 0;  // the same for those who take it as an abort flag; accessed atomically
 static_assert(std::atomic<bool>::is_always_lock_free, "set in a signal handler");
 
 extern "C" void Note(int) {
     interrupted = true;
+    __atomic_store_n(&interrupt_flag, 1, __ATOMIC_RELAXED);
 }
 
 }  // namespace
@@ -34,6 +36,10 @@ void WatchForInterrupt() {
 
 const std::atomic<bool>& Interrupted() {
     return interrupted;
+}
+
+int* InterruptFlag() {
+    return &interrupt_flag;
 }
 
 ExitCode Fail(ExitCode code, const char* format, ...) {

@@ -12,4 +12,7 @@ void WatchForInterrupt();
 /// Whether one has come.
 const std::atomic<bool>& Interrupted();
 
+/// Not 0 once one has come: an abort flag for channels.
+int* InterruptFlag();
+
 }  // namespace zelctl

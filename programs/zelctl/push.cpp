@@ -65,6 +65,7 @@ ExitCode Prepare(const PushOptions& options, ZEL::SyncInfo& info) {
         info = *options.info;
     } else if (result == kOk) {
         result = options.connection.ToSyncInfo(info);
+        info.SetMaxBandwidth(options.bandwidth_limit);
     }
     if (result == kOk) {
         WatchForInterrupt();
@@ -135,7 +136,6 @@ ExitCode Push(const PushOptions& options) {
     if (prepared != kOk) {
         return prepared;
     }
-    info.SetMaxBandwidth(options.bandwidth_limit);
     ProgressDisplay display(options.quiet);
     programs::RunListener listener;
     listener.on_progress = [&](const std::string& share, const auto& progress) {
