@@ -122,13 +122,6 @@ std::string Explain(int status, const RunReport& report) {
                : "status " + std::to_string(status) + " (see the system log)";
 }
 
-Trouble TroubleOf(int status) {
-    if (status == kNothingSent) {
-        return Trouble::kLocal;
-    }
-    return status < kFirstServerStatus ? Trouble::kFailed : Trouble::kRefused;
-}
-
 bool IsBelow(const std::string& path, const std::string& folder) {
     return folder == "/" || (path.size() > folder.size() && path[folder.size()] == '/' &&
                              path.compare(0, folder.size(), folder) == 0);
@@ -163,6 +156,13 @@ std::string Quoted(const std::string& share) {
 }
 
 }  // namespace
+
+Trouble TroubleOf(int status) {
+    if (status == kNothingSent) {
+        return Trouble::kLocal;
+    }
+    return status < kFirstServerStatus ? Trouble::kFailed : Trouble::kRefused;
+}
 
 struct TaskRun::Impl {
     Impl(const ZEL::SyncInfo& sync_info, const std::atomic<bool>& cancel_flag, RunListener told)

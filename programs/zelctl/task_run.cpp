@@ -135,8 +135,8 @@ private:
                 return Fail(kCancelled, "task '%s': the run was cancelled", name.c_str());
             default: {
                 const int status = task["last_status"].asInt32();
-                return Fail(status == 0 ? kLocal : CodeOf(status), "task '%s' failed after %s: %s",
-                            name.c_str(), took_words.c_str(),
+                return Fail(status == 0 ? kLocal : CodeOf(programs::TroubleOf(status)),
+                            "task '%s' failed after %s: %s", name.c_str(), took_words.c_str(),
                             Printable(task["last_error"].asString()).c_str());
             }
         }
