@@ -67,6 +67,8 @@ public:
     std::optional<int64_t> UntilRetry() const;
 
 private:
+    bool WasSetBack(int64_t now) const;
+
     const Clock& clock_;
     ZEL::Schedule schedule_;
     int64_t checked_until_;
