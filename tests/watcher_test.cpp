@@ -113,6 +113,15 @@ protected:
         EXPECT_EQ(ToldAfterWork(), probes) << what;
         EXPECT_EQ(watcher_.Stats("s").folders, probes.size()) << what;
         EXPECT_FALSE(watcher_.Stats("s").searching) << what;
+        EXPECT_EQ(KernelWatches(), probes.size()) << what;
+    }
+    size_t KernelWatches() const {
+        std::ifstream info("/proc/self/fdinfo/" + std::to_string(watcher_.Fd()));
+        size_t count = 0;
+        for (std::string line; std::getline(info, line);) {
+            count += line.rfind("inotify", 0) == 0;
+        }
+        return count;
     }
 
     test::TempFolder folder_;
@@ -173,6 +182,23 @@ TEST_F(WatcherTest, NewFoldersAreToldWholeAndWatched) {
     ExpectAllWatched();
 }
 
+TEST_F(WatcherTest, NewFoldersAreToldDuringTheFirstSearchToo) {
+    fs::create_directories(Path("/a"));
+    fs::create_directories(Path("/b"));
+    int watched = 0;
+    before_watch = [&](ino_t) {
+        if (++watched == 2) {  // the share's own folder has been read
+            fs::create_directories(Path("/new/x/y"));
+        }
+        return 0;
+    };
+    watcher_.Add("s", Path());
+    while (watcher_.Work(std::chrono::milliseconds(0))) {
+    }
+    EXPECT_THAT(TakeTold(), ElementsAre("/new", "/new/x", "/new/x/y"));
+    ExpectAllWatched();
+}
+
 TEST_F(WatcherTest, MovedTreesAreToldAtBothEndsAndFollowed) {
     fs::create_directories(Path("/a/b/c"));
     fs::create_directories(Path("/t/empty"));
@@ -196,6 +222,15 @@ TEST_F(WatcherTest, MovedTreesAreToldAtBothEndsAndFollowed) {
     EXPECT_THAT(ToldAfterWork(), ElementsAre("/x"));
     fs::create_directories(Outside("/x/in/1/2/3"));
     ExpectAllWatched("out");
+    // Over a folder that somebody holds open: the kernel keeps its watch for now.
+    fs::create_directories(Path("/held"));
+    fs::create_directories(Outside("/over/sub"));
+    Work();
+    const int held = open(Path("/held").c_str(), O_RDONLY);
+    move(Outside("/over"), Path("/held"));
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/held", "/held/sub"));
+    ExpectAllWatched("in and over");
+    close(held);
     ASSERT_EQ(renameat2(AT_FDCWD, Path("/t/a").c_str(), AT_FDCWD, Path("/t/again").c_str(),
                         RENAME_EXCHANGE),
               0);
@@ -225,12 +260,20 @@ TEST_F(WatcherTest, NoSymbolicLinkLeadsOutOfTheShare) {
     };
     Work();
     fs::create_directories(Path("/known/secret/more"));
-    before_watch = [&](ino_t) {
-        before_watch = nullptr;
-        replace("/known");
-        return 0;
-    };
+    fs::create_directories(Outside("/secret/more"));
+    struct stat secret;
+    ASSERT_EQ(stat(Outside("/secret/more").c_str(), &secret), 0);
+    bool replaced = false;
+    before_watch =
+        [&](ino_t folder) {  // of the share's own folder first: it is opened for a search
+            EXPECT_NE(folder, secret.st_ino);
+            if (!std::exchange(replaced, true)) {
+                replace("/known");
+            }
+            return 0;
+        };
     Work();
+    before_watch = nullptr;
     TakeTold();
     for (const char* name : {"/f", "/secret/f", "/late/f", "/new/f", "/known/secret/f"}) {
         std::ofstream(Outside(name)) << "x";
@@ -322,14 +365,12 @@ TEST_F(WatcherTest, SaysWhenTheFolderIsGone) {
     const std::function<void()> kWays[] = {
         [&] { fs::remove_all(Path()); },
         [&] { rename(Path().c_str(), Outside("/moved").c_str()); },
-        [&] {  // replaced, and noticed by the search for a new folder
-            fs::create_directory(Path("/a/new"));
-            before_watch = [&](ino_t) {
-                before_watch = nullptr;
-                fs::rename(Path(), Outside("/replaced"));
-                fs::create_directories(Path("/a"));
-                return 0;
-            };
+        [&] {  // with the folder above it, which nothing tells: noticed at the next search
+            watcher_.Add("s", Path("/a/b"));
+            Work();
+            rename(Path("/a").c_str(), Path("/c").c_str());
+            fs::create_directories(Path("/a/b"));
+            fs::create_directory(Path("/c/b/new"));
         },
     };
     for (const auto& way : kWays) {
