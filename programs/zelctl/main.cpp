@@ -2,6 +2,7 @@
 #include <cstring>
 
 #include "ZEL/log.h"
+#include "programs/common/text.h"
 #include "programs/zelctl/cli.h"
 
 namespace {
@@ -19,6 +20,9 @@ constexpr Command kCommands[] = {
     {"share", "The folders of this machine that may be pushed", DeclareShare},
     {"status", "What the daemon is doing", DeclareStatus},
     {"reload", "Let the daemon read its configuration again", DeclareReload},
+    {"doctor", "Look at all that a push needs, and say how to mend what is wrong", DeclareDoctor},
+    {"export", "Write all tasks to a file", DeclareExport},
+    {"import", "Add the tasks of a file", DeclareImport},
     {"pair", "Pairing with a server", DeclarePair},
     {"push", "Push shares to a server now, without the daemon", DeclarePush},
     {"next", "Show the next runs of a schedule", DeclareNext},
@@ -46,12 +50,18 @@ int main(int argc, char** argv) {
         "Write the library's log to standard error instead of the system log");
     ExitCode result = kOk;
     const char* const wanted = CommandOf(argc, argv);
+    bool known = *wanted == '\0';
     for (const Command& command : kCommands) {
         CLI::App* const declared = app.add_subcommand(command.name, command.about);
         // What another command takes need not be known to run this one.
         if (strcmp(command.name, wanted) == 0) {
             command.declare(*declared, result);
+            known = true;
         }
+    }
+    if (!known) {
+        return Fail(kUsage, "there is no command '%s': 'zelctl -h' lists them",
+                    programs::Printable(wanted).c_str());
     }
     app.footer(
         "'zelctl COMMAND -h' tells more.\n"

@@ -36,10 +36,10 @@ public:
             request["task"] = name;
         }
         const ExitCode code = connection_.Connect();
-        return code == kOk ? connection_.Send(request) : code;
+        return connection_.Tell(code == kOk ? connection_.Send(request) : code);
     }
     /// Waits for the next news.
-    ExitCode Next() { return connection_.Receive(reply_); }
+    ExitCode Next() { return connection_.Tell(connection_.Receive(reply_)); }
     const PObject::Array& Tasks() const {
         return static_cast<const PObject&>(reply_)["tasks"].asArray();
     }
