@@ -15,6 +15,8 @@ namespace {
 
 using programs::Printable;
 
+constexpr size_t kNamesShown = 3;
+
 // In the order of what depends on what.
 constexpr void (*kChecks[])(const Patient&, Findings&) = {
     CheckRsync, CheckSSH,     CheckClock, CheckCatalogue, CheckFiles,
@@ -76,6 +78,17 @@ bool Patient::UsesSSH() const {
     return std::any_of(tasks.begin(), tasks.end(), [](const ZEL::SyncTask& task) {
         return task.GetInfo().GetSyncInfo().UseSSH();
     });
+}
+
+std::string TasksInWords(const std::set<std::string>& names) {
+    if (names.size() > kNamesShown) {
+        return programs::Count(names.size(), "task");
+    }
+    std::string joined;
+    for (const std::string& name : names) {
+        joined += (joined.empty() ? "" : ", ") + name;
+    }
+    return (names.size() == 1 ? "task " : "tasks ") + joined;
 }
 
 ExitCode Doctor(bool as_json) {

@@ -49,6 +49,9 @@ void CheckFiles(const Patient& patient, Findings& findings);
 void CheckUnit(const Patient& patient, Findings& findings);
 void CheckDaemon(const Patient& patient, Findings& findings);
 
+/// "task a", "tasks a, b", or how many they are
+std::string TasksInWords(const std::set<std::string>& names);
+
 /// A value of section "rsync" of /usr/tarq/etc/tarqrsync.conf, or `otherwise`.
 std::string RsyncSetting(const char* key, const std::string& otherwise);
 

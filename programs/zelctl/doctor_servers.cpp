@@ -166,9 +166,7 @@ void CheckServers(const Patient& patient, Findings& findings) {
     }
     for (const Endpoint& endpoint : endpoints) {
         const std::string name = "server " + endpoint.Shown();
-        const std::string users = endpoint.tasks.size() == 1
-                                      ? " (task " + *endpoint.tasks.begin() + ")"
-                                      : " (" + std::to_string(endpoint.tasks.size()) + " tasks)";
+        const std::string users = " (" + TasksInWords(endpoint.tasks) + ")";
         if (endpoint.reached) {
             findings.push_back({name, Verdict::kOk, "answers" + users, ""});
         } else {

@@ -8,6 +8,7 @@
 #include <filesystem>
 
 #include "ZEL/zel.h"
+#include "programs/common/text.h"
 #include "programs/zelctl/doctor_checks.h"
 #include "tarq/core.h"
 #include "tarq/owners.h"
@@ -55,14 +56,6 @@ std::string FaultOfShare(const std::string& name, std::string& remedy) {
     }
     remedy = fit ? "" : "move it to one of this machine's own disks";
     return fit ? "" : "it lies on a removable or network disk, which is not pushed";
-}
-
-std::string Joined(const std::set<std::string>& names) {
-    std::string joined;
-    for (const std::string& name : names) {
-        joined += (joined.empty() ? "" : ", ") + name;
-    }
-    return joined;
 }
 
 // What is wrong with the owner and the mode of a file that is there; empty when nothing is.
@@ -149,7 +142,7 @@ void CheckCatalogue(const Patient& patient, Findings& findings) {
     for (const auto& [name, tasks] : patient.shares) {
         std::string remedy;
         const std::string fault = FaultOfShare(name, remedy);
-        const std::string users = tasks.empty() ? "" : " (tasks " + Joined(tasks) + ")";
+        const std::string users = tasks.empty() ? "" : " (" + TasksInWords(tasks) + ")";
         if (fault.empty()) {
             findings.push_back({"share " + name, Verdict::kOk, "ready" + users, ""});
         } else {
@@ -221,7 +214,7 @@ void CheckDaemon(const Patient& patient, Findings& findings) {
     } else {
         findings.push_back({"daemon", Verdict::kOk,
                             "version " + patient.daemon["version"].asString() + ", " +
-                                std::to_string(patient.tasks.size()) + " tasks",
+                                programs::Count(patient.tasks.size(), "task"),
                             ""});
     }
 }

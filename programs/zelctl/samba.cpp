@@ -22,7 +22,7 @@ using programs::Printable;
 constexpr const char* kOwnSections[] = {"global", "homes", "printers", "print$", "ipc$"};
 
 std::string Trimmed(const std::string& text) {
-    const char* const blanks = " \t\r";
+    const char* const blanks = " \t\r\n";
     const size_t begin = text.find_first_not_of(blanks);
     return begin == std::string::npos
                ? ""
@@ -150,8 +150,10 @@ ExitCode ImportSambaShares(const std::string& config, const std::vector<std::str
                     Printable(answer.failure).c_str());
     }
     if (answer.exit_code != 0) {
+        std::string errors = Trimmed(answer.errors);
+        std::replace(errors.begin(), errors.end(), '\n', ' ');
         return Fail(kLocal, "testparm cannot read the configuration: %s",
-                    Printable(Trimmed(answer.errors)).c_str());
+                    Printable(errors).c_str());
     }
     std::vector<SambaShare> shares = ParseSambaShares(answer.output);
     ExitCode result = Choose(names, shares);

@@ -84,7 +84,7 @@ public:
     Import(std::vector<PObject> tasks, bool replace, std::string password_file)
         : tasks_(std::move(tasks)), replace_(replace), password_file_(std::move(password_file)) {}
 
-    /// Looks at all tasks, and tells all that is wrong.
+    /// Looks at the tasks, and tells what is wrong with them, up to a screenful.
     ExitCode Check() {
         PObject reply;
         ExitCode code = GetTasks(false, reply);
@@ -95,9 +95,14 @@ public:
             const std::string name = static_cast<const PObject&>(task)["name"].asString();
             there_[name].swap(task);
         }
+        size_t told = 0;
         for (const PObject& task : tasks_) {
             const ExitCode checked = CheckOne(task);
             code = code == kOk ? checked : code;
+            told += checked == kOk ? 0 : 1;
+            if (told == kFaultsShown) {
+                break;
+            }
         }
         return code == kOk ? code : Fail(code, "nothing was imported");
     }
