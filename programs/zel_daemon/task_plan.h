@@ -47,7 +47,8 @@ public:
     /// The schedule's next run, in seconds since the epoch; one in the past is due now. Nothing for
     /// manual and realtime tasks and when no run will come.
     std::optional<int64_t> NextRun() const;
-    /// True when the schedule wants a run now. A clock that was set back is noticed here.
+    /// True when the schedule wants a run now. A clock that was set back by more than a minute is
+    /// noticed here, and changes CheckedUntil().
     bool ScheduleDue();
     /// A run of the schedule starts, or is given up: the next one counts from now.
     void ScheduleTaken();

@@ -12,10 +12,13 @@ namespace zelctl {
 
 namespace {
 
-int interrupted = 0;  // a whole int, for those who take it as an abort flag
+std::atomic<bool> interrupted{false};
+int interrupt_flag = 0;  // the same for those who take it as an abort flag; accessed atomically
+static_assert(std::atomic<bool>::is_always_lock_free, "set in a signal handler");
 
 extern "C" void Note(int) {
-    __atomic_store_n(&interrupted, 1, __ATOMIC_RELAXED);
+    interrupted = true;
+    __atomic_store_n(&interrupt_flag, 1, __ATOMIC_RELAXED);
 }
 
 }  // namespace
@@ -31,12 +34,12 @@ void WatchForInterrupt() {
     }
 }
 
-bool Interrupted() {
-    return __atomic_load_n(&interrupted, __ATOMIC_RELAXED) != 0;
+const std::atomic<bool>& Interrupted() {
+    return interrupted;
 }
 
 int* InterruptFlag() {
-    return &interrupted;
+    return &interrupt_flag;
 }
 
 ExitCode Fail(ExitCode code, const char* format, ...) {

@@ -11,8 +11,7 @@ namespace zelctl {
 
 struct PushOptions {
     ConnectionOptions connection;
-    std::optional<ZEL::SyncInfo> info;  ///< ready settings; the connection's server then is a name
-                                        ///< for people
+    std::optional<ZEL::SyncInfo> info;  ///< used in place of `connection` when it is there
     std::vector<std::string> shares;
     std::string path = "/";  ///< what of each share; "/" is all
     std::vector<std::string> excludes;
