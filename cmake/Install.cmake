@@ -25,5 +25,6 @@ install(FILES ${CMAKE_BINARY_DIR}/zel.pc DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkg
 
 if(ZEL_BUILD_PROGRAMS)
     install(TARGETS zelctl zel_server RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
+    install(TARGETS zelctl_commands LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR})
     install(FILES packaging/zel_rsyncd.service DESTINATION lib/systemd/system)
 endif()

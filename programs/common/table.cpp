@@ -93,7 +93,9 @@ void Table::Print(bool as_json) const {
         puts(array.dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace).c_str());
         return;
     }
-    Format([](const std::string& line) { puts(line.c_str()); });
+    std::string text;
+    Format([&](const std::string& line) { (text += line) += '\n'; });
+    fwrite(text.data(), 1, text.size(), stdout);
 }
 
 }  // namespace programs

@@ -1,7 +1,27 @@
 #include "programs/zelctl/cli.h"
+#include "programs/zelctl/samba.h"
 #include "programs/zelctl/shares.h"
 
 namespace zelctl {
+
+namespace {
+
+void DeclareShareImport(CLI::App& share, ExitCode& result) {
+    static std::string config;
+    static std::vector<std::string> names;
+    static bool samba = false;
+    static bool dry_run = false;
+    CLI::App* const import = share.add_subcommand("import", "Add the shares of another service");
+    import->add_flag("--samba", samba, "Of Samba, as 'testparm' tells them")->required();
+    import->add_option("--config", config, "Its configuration file (the system's)");
+    import->add_flag("-n,--dry-run", dry_run, "Only say which would be added");
+    import->add_option("names", names, "Only these");
+    import->footer("Shares that are in the catalogue already stay as they are.");
+    import->callback([&result] { result = ImportSambaShares(config, names, dry_run);
+});
+}  // namespace
+
+}  // namespace zelctl
 
 void DeclareShare(CLI::App& share, ExitCode& result) {
     share.require_subcommand(1);
@@ -26,6 +46,8 @@ void DeclareShare(CLI::App& share, ExitCode& result) {
         share.add_subcommand("rm", "Take a share out of the catalogue; its files stay");
     remove->add_option("name", name, "The share's name")->required();
     remove->callback([&result] { result = RemoveShare(name); });
+
+    DeclareShareImport(share, result);
 }
 
 }  // namespace zelctl

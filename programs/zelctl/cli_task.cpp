@@ -178,14 +178,4 @@ void DeclareTask(CLI::App& task, ExitCode& result) {
     watch->callback([&result, &name] { result = WatchTasks(name); });
 }
 
-void DeclareStatus(CLI::App& status, ExitCode& result) {
-    static bool as_json = false;
-    status.add_flag("--json", as_json, "Write JSON, for programs");
-    status.callback([&result] { result = ShowDaemonStatus(as_json); });
-}
-
-void DeclareReload(CLI::App& reload, ExitCode& result) {
-    reload.callback([&result] { result = ReloadDaemon(); });
-}
-
 }  // namespace zelctl

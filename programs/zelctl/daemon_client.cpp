@@ -23,24 +23,6 @@ constexpr size_t kMaxString = 65535;  // a string's length has 16 bits on the wi
 // A daemon that hangs with a full queue of connections would keep connect() waiting for ever.
 constexpr timeval kConnectLimit = {10, 0};
 
-ExitCode CannotConnect(const std::string& path, int error) {
-    switch (error) {
-        case ENOENT:
-        case ECONNREFUSED:
-            return Fail(kLocal, "the daemon is not running: systemctl start zel_daemon");
-        case EACCES:
-        case EPERM:
-            return Fail(kLocal,
-                        "not permitted to use the daemon's socket %s: be root, or a member of its "
-                        "group (key 'group' of zel_daemon.conf)",
-                        path.c_str());
-        case EAGAIN:
-            return Fail(kLocal, "the daemon does not answer: systemctl restart zel_daemon");
-        default:
-            return Fail(kLocal, "cannot reach the daemon at %s: %s", path.c_str(), strerror(error));
-    }
-}
-
 // The key under which a string is too long for the wire; empty when none is.
 std::string TooLong(const ZEL::PObject& value, const std::string& key) {
     if (value.isString() && value.asString().size() > kMaxString) {
@@ -75,6 +57,32 @@ DaemonConnection::DaemonConnection() : channel_(kRingBytes) {
     channel_.SetFlag(InterruptFlag());
 }
 
+ExitCode DaemonConnection::Tell(ExitCode code) const {
+    return error_.empty() ? code : Fail(code, "%s", error_.c_str());
+}
+
+ExitCode DaemonConnection::Failed(ExitCode code, const std::string& error) {
+    error_ = programs::Printable(error);
+    return code;
+}
+
+ExitCode DaemonConnection::CannotConnect(const std::string& path, int error) {
+    switch (error) {
+        case ENOENT:
+        case ECONNREFUSED:
+            return Failed(kLocal, "the daemon is not running: systemctl start zel_daemon");
+        case EACCES:
+        case EPERM:
+            return Failed(kLocal, "not permitted to use the daemon's socket " + path +
+                                      ": be root, or a member of its group (key 'group' of "
+                                      "zel_daemon.conf)");
+        case EAGAIN:
+            return Failed(kLocal, "the daemon does not answer: systemctl restart zel_daemon");
+        default:
+            return Failed(kLocal, "cannot reach the daemon at " + path + ": " + strerror(error));
+    }
+}
+
 ExitCode DaemonConnection::Connect() {
     const std::string path = DaemonSocket();
     sockaddr_un address = {};
@@ -96,18 +104,18 @@ ExitCode DaemonConnection::Connect() {
     return kOk;
 }
 
-ExitCode DaemonConnection::Lost() const {
-    return Interrupted()
-               ? kCancelled
-               : Fail(kLocal,
-                      "the daemon has broken off: see 'systemctl status zel_daemon' and its log");
+ExitCode DaemonConnection::Lost() {
+    return Failed(Interrupted() ? kCancelled : kLocal,
+                  Interrupted()
+                      ? ""
+                      : "the daemon has broken off: see 'systemctl status zel_daemon' and its log");
 }
 
 ExitCode DaemonConnection::Send(const ZEL::PObject& request) {
     const std::string key = TooLong(request, "request");
     if (!key.empty()) {
-        return Fail(kUsage, "the value for '%s' is too long: a text has at most 65535 bytes",
-                    programs::Printable(key).c_str());
+        return Failed(kUsage,
+                      "the value for '" + key + "' is too long: a text has at most 65535 bytes");
     }
     ZEL::PStream stream;
     return stream.Send(channel_, request) == ZEL::RESULT_SUCCESS ? kOk : Lost();
@@ -121,26 +129,33 @@ ExitCode DaemonConnection::Receive(ZEL::PObject& reply) {
     }
     const ZEL::PObject& received = reply;
     if (!received["result"].isInteger()) {
-        return Fail(kLocal,
-                    "the daemon's answer is no reply: are zelctl and zel_daemon of one "
-                    "version?");
+        return Failed(kLocal,
+                      "the daemon's answer is no reply: are zelctl and zel_daemon of one version?");
     }
     const int result = received["result"].asInt32();
     if (result == ZEL::RESULT_SUCCESS) {
         return kOk;
     }
-    const std::string error = programs::Printable(received["error"].asString());
-    return error.empty() ? Fail(CodeOfResult(result), "the daemon refuses (result %d)", result)
-                         : Fail(CodeOfResult(result), "%s", error.c_str());
+    const std::string error = received["error"].asString();
+    return Failed(
+        CodeOfResult(result),
+        error.empty() ? "the daemon refuses (result " + std::to_string(result) + ")" : error);
 }
 
-ExitCode AskDaemon(const ZEL::PObject& request, ZEL::PObject& reply) {
+ExitCode AskDaemon(const ZEL::PObject& request, ZEL::PObject& reply, std::string* error) {
     DaemonConnection connection;
     ExitCode code = connection.Connect();
     if (code == kOk) {
         code = connection.Send(request);
     }
-    return code == kOk ? connection.Receive(reply) : code;
+    if (code == kOk) {
+        code = connection.Receive(reply);
+    }
+    if (error != nullptr) {
+        *error = connection.Error();
+        return code;
+    }
+    return connection.Tell(code);
 }
 
 ZEL::PObject TaskRequest(const char* command, const std::string& task) {

@@ -1,66 +1,29 @@
-#include <CLI/CLI.hpp>
+// Loads the command line, unless the command is one that can do without.
+#include <dlfcn.h>
+
+#include <cstdio>
 #include <cstring>
 
-#include "ZEL/log.h"
-#include "programs/zelctl/cli.h"
+#include "programs/zelctl/command_line.h"
+#include "programs/zelctl/exit_codes.h"
+#include "programs/zelctl/quick_list.h"
 
 namespace {
 
-using namespace zelctl;
-
-struct Command {
-    const char* name;
-    const char* about;
-    void (*declare)(CLI::App& app, ExitCode& result);
-};
-
-constexpr Command kCommands[] = {
-    {"task", "Tasks: shares that the daemon keeps in step with a server", DeclareTask},
-    {"share", "The folders of this machine that may be pushed", DeclareShare},
-    {"status", "What the daemon is doing", DeclareStatus},
-    {"reload", "Let the daemon read its configuration again", DeclareReload},
-    {"pair", "Pairing with a server", DeclarePair},
-    {"push", "Push shares to a server now, without the daemon", DeclarePush},
-    {"next", "Show the next runs of a schedule", DeclareNext},
-};
-
-// The first word that is no option: the command, if there is one.
-const char* CommandOf(int argc, char** argv) {
-    for (int i = 1; i < argc; ++i) {
-        if (argv[i][0] != '-') {
-            return argv[i];
-        }
-    }
-    return "";
-}
+constexpr char kLibrary[] = "libzelctl_commands.so";  // found beside the program's libraries
 
 }  // namespace
 
 int main(int argc, char** argv) {
-    CLI::App app{"Keeps shared folders in step with a paired server"};
-    app.name("zelctl");
-    app.require_subcommand(1);
-    app.add_flag_callback(
-        "-v,--verbose",
-        [] { ZEL::Logger::Initialize(ZEL::Logger::STDERR, ZEL::Logger::LEVEL_INFO, "", 0); },
-        "Write the library's log to standard error instead of the system log");
-    ExitCode result = kOk;
-    const char* const wanted = CommandOf(argc, argv);
-    for (const Command& command : kCommands) {
-        CLI::App* const declared = app.add_subcommand(command.name, command.about);
-        // What another command takes need not be known to run this one.
-        if (strcmp(command.name, wanted) == 0) {
-            command.declare(*declared, result);
-        }
+    const bool is_list = argc == 3 && strcmp(argv[1], "task") == 0 && strcmp(argv[2], "list") == 0;
+    if (is_list && zelctl::PrintTaskListQuickly()) {
+        return zelctl::kOk;
     }
-    app.footer(
-        "'zelctl COMMAND -h' tells more.\n"
-        "Exit codes: 0 done, 1 failed on the way, 2 wrong usage, 3 a problem on this machine,\n"
-        "4 the server refuses, 5 ended by the user.");
-    try {
-        app.parse(argc, argv);
-    } catch (const CLI::ParseError& error) {
-        return app.exit(error) == 0 ? kOk : kUsage;
+    void* const library = dlopen(kLibrary, RTLD_NOW);
+    void* const found = library == nullptr ? nullptr : dlsym(library, "RunCommandLine");
+    if (found == nullptr) {
+        fprintf(stderr, "zelctl: its own library is missing, install it again: %s\n", dlerror());
+        return zelctl::kLocal;
     }
-    return result;
+    return reinterpret_cast<decltype(&RunCommandLine)>(found)(argc, argv);
 }

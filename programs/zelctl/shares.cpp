@@ -67,14 +67,26 @@ ExitCode RemoveShare(const std::string& name) {
     return kOk;
 }
 
+std::optional<std::vector<std::string>> ShareNames() {
+    const TARQ::ListOwner list(KAPICSzListAlloc(64));
+    if (!list || TARQShareEnum(list.get()) < 0) {
+        Fail(kLocal, "cannot read the share catalogue: %s", LastError().c_str());
+        return std::nullopt;
+    }
+    std::vector<std::string> names;
+    for (int i = 0; i < KAPICSzListCount(list.get()); ++i) {
+        names.emplace_back(KAPICSzListGet(list.get(), i));
+    }
+    return names;
+}
+
 ExitCode ListShares(bool as_json) {
-    const TARQ::ListOwner names(KAPICSzListAlloc(64));
-    if (!names || TARQShareEnum(names.get()) < 0) {
-        return Fail(kLocal, "cannot read the share catalogue: %s", LastError().c_str());
+    const auto names = ShareNames();
+    if (!names) {
+        return kLocal;
     }
     programs::Table table({"SHARE", "STATE", "FOLDER"});
-    for (int i = 0; i < KAPICSzListCount(names.get()); ++i) {
-        const std::string name = KAPICSzListGet(names.get(), i);
+    for (const std::string& name : *names) {
         const ShareOwner share = GetShare(name);
         table.Add({name, share ? "ready" : LastError(),
                    share && share->path != nullptr ? share->path : ""});

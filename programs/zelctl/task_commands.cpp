@@ -36,8 +36,7 @@ ExitCode AskPassword(const std::string& file, ZEL::TaskInfo& info) {
 // A date in the past is no wish for a task.
 ExitCode CheckFuture(const TaskOptions& options, const ZEL::Schedule& schedule) {
     if (options.schedule.once && schedule.GetNextScheduledSeconds(time(nullptr)) == 0) {
-        return Fail(kUsage, "--once: %s lies in the past",
-                    programs::DescribeSchedule(schedule).substr(sizeof "once").c_str());
+        return Fail(kUsage, "'%s' lies in the past", programs::DescribeSchedule(schedule).c_str());
     }
     return kOk;
 }
@@ -97,7 +96,8 @@ ExitCode AddTask(const std::string& name, const TaskOptions& options,
     }
     if (code == kOk) {
         // Nobody types a password for a daemon that is not there.
-        code = DaemonConnection().Connect();
+        DaemonConnection connection;
+        code = connection.Tell(connection.Connect());
     }
     if (code == kOk) {
         code = AskPassword(password_file, info);

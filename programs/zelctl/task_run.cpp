@@ -36,10 +36,10 @@ public:
             request["task"] = name;
         }
         const ExitCode code = connection_.Connect();
-        return code == kOk ? connection_.Send(request) : code;
+        return connection_.Tell(code == kOk ? connection_.Send(request) : code);
     }
     /// Waits for the next news.
-    ExitCode Next() { return connection_.Receive(reply_); }
+    ExitCode Next() { return connection_.Tell(connection_.Receive(reply_)); }
     const PObject::Array& Tasks() const {
         return static_cast<const PObject&>(reply_)["tasks"].asArray();
     }
@@ -59,7 +59,7 @@ const PObject* FindTask(const PObject::Array& tasks, const std::string& name) {
 std::string ProgressLine(const PObject& task) {
     const std::string name = Printable(task["name"].asString());
     if (task["status"].asInt32() != ZEL::TASK_STATUS_RUNNING) {
-        return name + ": " + StateWords(task);
+        return name + ": " + programs::TaskStateWords(RowOf(task));
     }
     const unsigned int percent = std::min(task["progress_percent"].asUInt32(), 100U);
     const std::string share = Printable(task["progress_share"].asString());
@@ -153,8 +153,9 @@ class ChangeLines {
 public:
     void See(const PObject::Array& tasks) {
         for (const PObject& task : tasks) {
-            std::string line = Printable(task["name"].asString()) + ": " + StateWords(task) +
-                               ", last run " + ResultWords(task);
+            std::string line = Printable(task["name"].asString()) + ": " +
+                               programs::TaskStateWords(RowOf(task)) + ", last run " +
+                               programs::TaskResultWord(task["sync_result"].asInt32());
             std::string& before = lines_[task["name"].asString()];
             if (line != before) {
                 printf("%s  %s\n", programs::HumanTime(time(nullptr)).c_str(), line.c_str());

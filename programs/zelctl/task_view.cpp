@@ -24,47 +24,17 @@ std::string Joined(const PObject::Array& texts) {
     return joined;
 }
 
+template <typename T>
+std::optional<T> NumberOf(const PObject& value) {
+    return value.isInteger() ? std::optional<T>(static_cast<T>(value.asUInt64())) : std::nullopt;
+}
+
 std::string TimeOf(const PObject& moment, const char* otherwise) {
     return moment.isInteger() ? HumanTime(moment.asInt64()) : otherwise;
 }
 
-std::string ResultWord(int result) {
-    switch (result) {
-        case ZEL::TASK_RESULT_SUCCESS:
-            return "done";
-        case ZEL::TASK_RESULT_FAILED:
-            return "failed";
-        case ZEL::TASK_RESULT_CANCELLED:
-            return "cancelled";
-        default:
-            return "not yet";
-    }
-}
-
-std::string StatusWord(int status) {
-    switch (status) {
-        case ZEL::TASK_STATUS_WAITING:
-            return "waiting";
-        case ZEL::TASK_STATUS_RUNNING:
-            return "running";
-        case ZEL::TASK_STATUS_PAUSED:
-            return "paused";
-        default:
-            return "idle";
-    }
-}
-
 std::string OnOff(const PObject& flag) {
     return flag.asBool() ? "yes" : "no";
-}
-
-// "done 2026-11-21 08:30:00"
-std::string LastRun(const PObject& task) {
-    std::string text = ResultWords(task);
-    if (task["last_end"].isInteger()) {
-        text += " " + HumanTime(task["last_end"].asInt64());
-    }
-    return text;
 }
 
 /// What there is to say of one thing: a line for each fact, or JSON.
@@ -94,8 +64,8 @@ private:
 ordered_json TaskJson(const PObject& task) {
     ordered_json json = ToJson(task);
     json["schedule"] = ScheduleOf(task);
-    json["state"] = StatusWord(task["status"].asInt32());
-    json["result"] = ResultWord(task["sync_result"].asInt32());
+    json["state"] = programs::TaskStatusWord(task["status"].asInt32());
+    json["result"] = programs::TaskResultWord(task["sync_result"].asInt32());
     return json;
 }
 
@@ -109,25 +79,28 @@ ordered_json ListJson(const PObject::Array& list, ordered_json (*to_json)(const 
 
 ordered_json RunJson(const PObject& run) {
     ordered_json json = ToJson(run);
-    json["result"] = run["end"].isInteger() ? ResultWord(run["sync_result"].asInt32()) : "running";
+    json["result"] =
+        run["end"].isInteger() ? programs::TaskResultWord(run["sync_result"].asInt32()) : "running";
     return json;
 }
 
 }  // namespace
 
-std::string StateWords(const PObject& task) {
-    const int status = task["status"].asInt32();
-    std::string words = StatusWord(status);
-    if (status == ZEL::TASK_STATUS_RUNNING && task["progress_percent"].isInteger()) {
-        words += " " + std::to_string(task["progress_percent"].asUInt32()) + "%";
-    } else if (status != ZEL::TASK_STATUS_RUNNING && task["retry_in"].isInteger()) {
-        words = "retry in " + programs::HumanDuration(task["retry_in"].asUInt64());
-    }
-    return words;
-}
-
-std::string ResultWords(const PObject& task) {
-    return ResultWord(task["sync_result"].asInt32());
+programs::TaskRow RowOf(const PObject& task) {
+    programs::TaskRow row;
+    row.name = task["name"].asString();
+    row.shares = Joined(task["share_list"].asArray());
+    row.server = ServerOf(task);
+    row.schedule = ScheduleOf(task);
+    row.status = task["status"].asInt32();
+    row.result = task["sync_result"].asInt32();
+    row.last_end = NumberOf<int64_t>(task["last_end"]);
+    row.next_run = NumberOf<int64_t>(task["next_run"]);
+    row.retry_in = NumberOf<uint64_t>(task["retry_in"]);
+    row.percent = NumberOf<uint64_t>(task["progress_percent"]);
+    row.pending = task["pending"].asUInt64();
+    row.note = task["note"].asString();
+    return row;
 }
 
 std::string ScheduleOf(const PObject& task) {
@@ -159,13 +132,9 @@ std::string ProgressWords(const PObject& task) {
 }
 
 Table TaskTable(const PObject::Array& tasks) {
-    Table table(
-        {"NAME", "SHARES", "SERVER", "SCHEDULE", "STATE", "LAST RUN", "NEXT RUN", "PENDING"});
-    table.Reserve(tasks.size());
+    Table table = programs::NewTaskTable();
     for (const PObject& task : tasks) {
-        table.Add({task["name"].asString(), Joined(task["share_list"].asArray()), ServerOf(task),
-                   ScheduleOf(task), StateWords(task), LastRun(task), TimeOf(task["next_run"], "-"),
-                   std::to_string(task["pending"].asUInt64())});
+        programs::AddTaskRow(RowOf(task), table);
     }
     return table;
 }
@@ -206,11 +175,11 @@ void PrintTask(const PObject& task, bool as_json) {
     facts.Add("exclude", Joined(task["exclude"].asArray()));
     facts.Add("schedule", ScheduleOf(task));
     facts.Add("next run", TimeOf(task["next_run"], "-"));
-    facts.Add("state", StateWords(task));
+    facts.Add("state", programs::TaskStateWords(RowOf(task)));
     if (task["run"].isInteger()) {
         facts.Add("progress", task["progress_share"].asString() + ": " + ProgressWords(task));
     }
-    facts.Add("last run", LastRun(task));
+    facts.Add("last run", programs::TaskLastRunWords(RowOf(task)));
     facts.Add("error", task["last_error"].asString());
     facts.Add("pending changes", std::to_string(task["pending"].asUInt64()));
     facts.Add("note", task["note"].asString());
@@ -229,8 +198,8 @@ void PrintRuns(const PObject::Array& runs, bool as_json) {
         table.Add(
             {std::to_string(run["run"].asUInt64()), HumanTime(run["start"].asInt64()),
              ended ? programs::HumanDuration(took < 0 ? 0 : static_cast<uint64_t>(took)) : "-",
-             ended ? ResultWord(run["sync_result"].asInt32()) : "running", run["reason"].asString(),
-             std::to_string(run["files_sent"].asUInt64()),
+             ended ? programs::TaskResultWord(run["sync_result"].asInt32()) : "running",
+             run["reason"].asString(), std::to_string(run["files_sent"].asUInt64()),
              std::to_string(run["files_deleted"].asUInt64()),
              programs::HumanBytes(run["bytes_sent"].asUInt64()), run["error"].asString()});
     }

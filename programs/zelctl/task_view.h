@@ -6,16 +6,14 @@
 
 #include "ZEL/pobject.h"
 #include "programs/common/table.h"
+#include "programs/common/task_row.h"
 
 namespace zelctl {
 
 // Of a task as the daemon tells it (docs/daemon-protocol.md). Texts are the daemon's bytes: tables
 // show them printable, other places have to.
 
-/// "idle", "waiting", "running 45%", "paused", "retry in 0:20"
-std::string StateWords(const ZEL::PObject& task);
-/// "done", "failed", "cancelled", "not yet"
-std::string ResultWords(const ZEL::PObject& task);
+programs::TaskRow RowOf(const ZEL::PObject& task);
 std::string ScheduleOf(const ZEL::PObject& task);
 /// The server's name, or its address.
 std::string ServerOf(const ZEL::PObject& task);
