@@ -8,8 +8,11 @@
 #include <time.h>
 
 #include <cstdint>
+#include <iosfwd>
 #include <list>
 #include <string>
+
+#include "ZEL/pobject.h"
 
 namespace ZEL {
 
@@ -125,7 +128,6 @@ class Schedule {
 public:
     SCHD_MODE GetMode() const { return mode_; }
     /// Seconds between the runs of one day.
-    /// never set.
     long GetPeriodSeconds() const { return period_; }
     /// Runs of one day after the first.
     long GetRepeatTimesInDay() const { return repeat_times_in_day_; }
@@ -266,6 +268,47 @@ private:
     std::string share_name_;
     std::string relative_path_;
 };
+
+// Tasks as one flat PObject map, with the fields of sync info and schedule beside the task's own:
+//
+//   id, name, share_list (an array of strings),
+//   user, pswd, server_ip, server_name, compress, block, ssh (0 or 1), ssh_port, max_bandwidth,
+//   rsync_timeout,
+//   schedule_mode (the number), week_schd, repeat_times_in_day, period_hour, period_minute,
+//   schedule_begin_year, _month, _day, _hour, _min.
+//
+// The period's seconds beyond whole minutes, and flag bits other than the three switches, do not
+// travel. Nothing is checked on the way: values of another type come in as PObject's reads give
+// them, and Validate() judges the outcome.
+
+/// Sets the fields that the map has keys for, and leaves the others as they are.
+void PObj2SyncInfo(const PObject& obj, SyncInfo& info);
+
+/// Replaces the task's info whole: a field without a key gets its default. The id alone stays as it
+/// was without its key. The period needs both of its keys; one alone is not looked at. It is set
+/// after the repeat count: no period, no repeats.
+void PObj2SyncTask(const PObject& obj, SyncTask& task);
+/// The same, with what travels beside a task: "status" and "sync_result", 0 where they are missing.
+void PObj2SyncTask(const PObject& obj, SyncTask& task, TASK_STATUS& status, TASK_RESULT& result);
+
+/// Writes every key but the id. Other keys of `obj` stay; what is no map becomes one.
+void TaskInfo2PObj(const TaskInfo& info, PObject& obj);
+/// The same with the id. Whoever sends "status" and "sync_result" sets them beside it.
+void SyncTask2PObj(const SyncTask& task, PObject& obj);
+
+// For logs and people: a label and a value a line, every line ended and flushed, except that a
+// schedule, and with it what ends in one, stops after its last value. The password is never
+// written.
+
+std::ostream& operator<<(std::ostream& stream, const Share& share);
+std::ostream& operator<<(std::ostream& stream, const Event& event);
+std::ostream& operator<<(std::ostream& stream, const SyncInfo& info);
+/// Leaves the stream's fill character at '0'.
+std::ostream& operator<<(std::ostream& stream, const Schedule& schedule);
+/// Leaves the stream's fill character at '0'.
+std::ostream& operator<<(std::ostream& stream, const TaskInfo& info);
+/// Leaves the stream's fill character at '0'.
+std::ostream& operator<<(std::ostream& stream, const SyncTask& task);
 
 #pragma GCC visibility pop
 

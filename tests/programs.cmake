@@ -1,11 +1,15 @@
 zel_test(rsyncer_test rsyncer_test.cpp)
 if(ZEL_BUILD_PROGRAMS)
     zel_test(zel_server_test zel_server_test.cpp LIBRARIES server_parts)
-    zel_test(push_test integration/push_test.cpp
-        LIBRARIES test_servers TIMEOUT 300 LABELS integration)
-    target_compile_definitions(push_test PRIVATE
+
+    # A whole client and a whole server.
+    add_library(test_whole STATIC integration/client_and_server.cpp)
+    target_link_libraries(test_whole PUBLIC test_servers)
+    target_compile_definitions(test_whole PUBLIC
         ZELCTL="$<TARGET_FILE:zelctl>" ZEL_SERVER="$<TARGET_FILE:zel_server>")
-    add_dependencies(push_test zelctl zel_server)
+    add_dependencies(test_whole zelctl zel_server)
+    zel_test(push_test integration/push_test.cpp
+        LIBRARIES test_whole TIMEOUT 300 LABELS integration)
     add_test(NAME completion_test
         COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/integration/completion_test.sh ${PROJECT_SOURCE_DIR})
 endif()

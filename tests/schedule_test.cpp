@@ -6,53 +6,15 @@
 #include <functional>
 #include <random>
 
-#include "ZEL/sync_obj.h"
 #include "tests/support/log_capture.h"
+#include "tests/support/schedules.h"
 
 namespace {
 
 using testing::ElementsAre;
 using testing::IsEmpty;
 using ZEL::Schedule;
-
-void SetZone(const char* zone) {
-    setenv("TZ", zone, 1);
-    tzset();
-}
-
-long Utc(const char* text) {
-    struct tm time = {};
-    EXPECT_NE(strptime(text, "%Y-%m-%d %H:%M:%S", &time), nullptr) << text;
-    return timegm(&time);
-}
-
-std::string UtcText(long seconds) {
-    struct tm time = {};
-    char text[64] = "";
-    gmtime_r(&seconds, &time);
-    strftime(text, sizeof text, "%F %T", &time);
-    return text;
-}
-
-// `days`: a week of seven characters, or a begin date.
-Schedule Make(const char* mode, const char* days, int hour, long period = 0, long repeat = 0) {
-    Schedule schedule;
-    schedule.SetModeByStr(mode);
-    int year = 0;
-    int month = 0;
-    int day = 0;
-    if (sscanf(days, "%d-%d-%d", &year, &month, &day) == 3) {
-        schedule.SetBeginYear(year);
-        schedule.SetBeginMonth(month);
-        schedule.SetBeginDay(day);
-    } else {
-        schedule.SetWeekSchedule(days);
-    }
-    schedule.SetStartHour(hour);
-    schedule.SetPeriod(period);
-    schedule.SetRepeatTimesInDay(repeat);
-    return schedule;
-}
+using namespace test;
 
 TEST(Schedule, SettersKeepModePeriodAndWeekSound) {
     Schedule schedule;

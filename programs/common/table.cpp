@@ -24,23 +24,59 @@ size_t Width(const std::string& text) {
     }));
 }
 
-void PrintRow(const std::vector<std::string>& cells, const std::vector<size_t>& widths) {
-    std::string line;
-    for (size_t i = 0; i < cells.size(); ++i) {
-        line += cells[i];
-        if (i + 1 < cells.size()) {
-            line.append(widths[i] - Width(cells[i]) + 2, ' ');
-        }
-    }
-    puts(line.c_str());
-}
-
 }  // namespace
 
 Table::Table(std::vector<std::string> columns) : columns_(std::move(columns)) {}
 
+void Table::Reserve(size_t rows) {
+    rows_.reserve(rows);
+}
+
 void Table::Add(std::vector<std::string> cells) {
     rows_.push_back(std::move(cells));
+}
+
+template <typename Take>
+void Table::Format(Take take) const {
+    // Hardly any cell needs escapes: the others are taken as they stand.
+    std::vector<std::vector<std::string>> escaped;
+    std::vector<const std::vector<std::string>*> lines = {&columns_};
+    lines.reserve(rows_.size() + 1);
+    escaped.reserve(rows_.size());
+    for (const auto& row : rows_) {
+        if (std::all_of(row.begin(), row.end(), IsPrintable)) {
+            lines.push_back(&row);
+        } else {
+            escaped.emplace_back(row);
+            for (std::string& cell : escaped.back()) {
+                cell = Printable(cell);
+            }
+            lines.push_back(&escaped.back());
+        }
+    }
+    std::vector<size_t> widths(columns_.size(), 0);
+    for (const auto* line : lines) {
+        for (size_t i = 0; i < line->size(); ++i) {
+            widths[i] = std::max(widths[i], Width((*line)[i]));
+        }
+    }
+    std::string text;
+    for (const auto* line : lines) {
+        text.clear();
+        for (size_t i = 0; i < line->size(); ++i) {
+            text += (*line)[i];
+            if (i + 1 < line->size()) {
+                text.append(widths[i] - Width((*line)[i]) + 2, ' ');
+            }
+        }
+        take(text);
+    }
+}
+
+std::vector<std::string> Table::Lines() const {
+    std::vector<std::string> lines;
+    Format([&](const std::string& line) { lines.push_back(line); });
+    return lines;
 }
 
 void Table::Print(bool as_json) const {
@@ -57,22 +93,9 @@ void Table::Print(bool as_json) const {
         puts(array.dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace).c_str());
         return;
     }
-    std::vector<std::vector<std::string>> lines = {columns_};
-    for (const auto& row : rows_) {
-        lines.emplace_back();
-        for (const std::string& cell : row) {
-            lines.back().push_back(Printable(cell));
-        }
-    }
-    std::vector<size_t> widths(columns_.size(), 0);
-    for (const auto& line : lines) {
-        for (size_t i = 0; i < line.size(); ++i) {
-            widths[i] = std::max(widths[i], Width(line[i]));
-        }
-    }
-    for (const auto& line : lines) {
-        PrintRow(line, widths);
-    }
+    std::string text;
+    Format([&](const std::string& line) { (text += line) += '\n'; });
+    fwrite(text.data(), 1, text.size(), stdout);
 }
 
 }  // namespace programs

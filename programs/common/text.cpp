@@ -7,6 +7,20 @@
 
 namespace programs {
 
+namespace {
+
+// Whether byte `i` is a control character, or the first byte of one of U+0080 to U+009F, which
+// some terminals obey as well.
+bool IsControl(const std::string& text, size_t i) {
+    const unsigned char byte = static_cast<unsigned char>(text[i]);
+    if (byte == 0xc2 && i + 1 < text.size()) {
+        return (static_cast<unsigned char>(text[i + 1]) & 0xe0) == 0x80;
+    }
+    return byte < 0x20 || byte == 0x7f;
+}
+
+}  // namespace
+
 std::optional<uint64_t> ParseNumber(const std::string& value, uint64_t max) {
     uint64_t number = 0;
     const char* const end = value.data() + value.size();
@@ -68,16 +82,28 @@ std::string HumanTime(int64_t seconds_since_epoch) {
     return text;
 }
 
+bool IsPrintable(const std::string& text) {
+    for (size_t i = 0; i < text.size(); ++i) {
+        if (IsControl(text, i)) {
+            return false;
+        }
+    }
+    return true;
+}
+
 std::string Printable(const std::string& text) {
+    if (IsPrintable(text)) {
+        return text;
+    }
     std::string printable;
-    for (const char c : text) {
-        const unsigned char byte = static_cast<unsigned char>(c);
-        if (byte < 0x20 || byte == 0x7f) {
+    for (size_t i = 0; i < text.size(); ++i) {
+        if (IsControl(text, i)) {
             char escaped[8];
-            snprintf(escaped, sizeof escaped, "\\%03o", static_cast<unsigned int>(byte));
+            snprintf(escaped, sizeof escaped, "\\%03o",
+                     static_cast<unsigned int>(static_cast<unsigned char>(text[i])));
             printable += escaped;
         } else {
-            printable += c;
+            printable += text[i];
         }
     }
     return printable;

@@ -24,8 +24,11 @@ std::string Count(uint64_t count, const std::string& noun);
 /// A local date and time, "2026-11-21 08:30:00".
 std::string HumanTime(int64_t seconds_since_epoch);
 
-/// `text` with control characters written as \ooo: safe on a terminal.
+/// `text` with control characters, the eight-bit ones included, written as \ooo: safe on a
+/// terminal.
 std::string Printable(const std::string& text);
+/// Whether Printable() would give the text as it is.
+bool IsPrintable(const std::string& text);
 
 /// The whole file; nothing when it cannot be read or is larger than `max` bytes.
 std::optional<std::string> ReadWholeFile(const std::string& path, size_t max);

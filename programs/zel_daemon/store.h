@@ -23,15 +23,14 @@ public:
 /// Threads: one thread. Every operation may throw StoreError; nothing has changed then.
 class Store {
 public:
-    /// The layout of the file that this program writes. An older one is brought up to it when it is
-    /// opened; a newer one is refused.
-    static constexpr int kSchemaVersion = 1;
     /// Runs kept of each task; the oldest are dropped when new ones begin.
     static constexpr int kRunsKept = 200;
 
-    /// Opens the file, making it (and its folder, 0700) when it is not there. Runs that had not
-    /// ended when the file was last used are marked as failed ("the daemon was stopped"), and their
-    /// events wait again.
+    /// Opens the file, making it (and its folder, 0700) when it is not there. One with an older
+    /// layout is brought up to date; one with a newer layout, and a database that is no store, are
+    /// refused and left as they are. Runs that had not ended when the file was last used are marked
+    /// as failed ("the daemon was stopped"), with their start as their end, and their events wait
+    /// again.
     explicit Store(const std::string& path);
     ~Store();
     Store(const Store&) = delete;
@@ -42,29 +41,30 @@ public:
     /// Stores a new task and returns its id, never used before. The record's own id is not looked
     /// at. A name that is taken throws.
     uint64_t AddTask(const TaskRecord& record);
-    /// Replaces the task with the record's id.
+    /// Replaces the task with the record's id. Throws when there is none, or the name is taken.
     void UpdateTask(const TaskRecord& record);
     /// Removes a task with its events and its history.
     void RemoveTask(uint64_t id);
 
-    /// Stores changes as waiting, in one transaction; what is there already is not stored twice.
+    /// Stores changes as waiting, in one transaction; what waits already is not stored twice.
     void AddEvents(uint64_t task_id, const std::string& share,
                    const std::vector<std::string>& paths);
-    /// The changes of a task that wait, oldest first, as (share, path) with their ids.
+    /// The changes of a task that wait, oldest first.
     std::vector<ZEL::Event> PendingEvents(uint64_t task_id);
     /// Marks these as being sent: a change of the same path that comes now waits on its own.
     void MarkSending(const std::vector<uint64_t>& ids);
     /// The server took these.
     void RemoveEvents(const std::vector<uint64_t>& ids);
-    /// The run failed: they wait again.
+    /// The run failed: they wait again, each as one with a change of the same path that came since.
     void ReturnEvents(const std::vector<uint64_t>& ids);
+    /// The changes of a task that the server has not taken yet: that wait or are being sent.
     uint64_t CountEvents(uint64_t task_id);
     /// Forgets all changes of a task, whatever their state.
     void ClearEvents(uint64_t task_id);
 
     /// Notes the beginning of a run and returns its id.
     uint64_t BeginRun(uint64_t task_id, RunReason reason, int64_t start);
-    /// Notes how the run with the record's id ended.
+    /// Notes how the run with the record's id ended; nothing when its task is gone.
     void EndRun(const RunRecord& run);
     /// The last runs of a task, newest first.
     std::vector<RunRecord> Runs(uint64_t task_id, unsigned int limit);

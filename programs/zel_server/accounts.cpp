@@ -6,7 +6,7 @@
 
 #include "ZEL/zel.h"
 #include "programs/common/text.h"
-#include "programs/zel_server/atomic_file.h"
+#include "programs/common/atomic_file.h"
 #include "programs/zel_server/server_config.h"
 
 namespace zel_server {
@@ -37,7 +37,7 @@ bool WriteLines(const std::vector<std::string>& lines) {
     for (const std::string& line : lines) {
         content += line + "\n";
     }
-    return WriteFileAtomically(SecretsFile(), content, 0600);
+    return programs::WriteFileAtomically(SecretsFile(), content, 0600);
 }
 
 bool IsLineOf(const std::string& line, const std::string& name) {

@@ -9,7 +9,7 @@
 #include <sstream>
 
 #include "programs/common/text.h"
-#include "programs/zel_server/atomic_file.h"
+#include "programs/common/atomic_file.h"
 #include "tarq/root_path.h"
 #include "tarq/rsync_wrapper.h"
 
@@ -71,7 +71,7 @@ bool WriteRsyncdConfig(const ServerConfig& config) {
         text << "    use chroot = no\n";
     }
     text << "\n&include " << ShareModules() << "\n&include " << AdminModules() << "\n";
-    return WriteFileAtomically(RsyncdConfig(), text.str(), 0644);
+    return programs::WriteFileAtomically(RsyncdConfig(), text.str(), 0644);
 }
 
 bool MakeShareFolder(const ServerConfig& config, const std::string& path) {
@@ -112,7 +112,7 @@ bool WriteShareModule(const ServerConfig& config, const std::string& share,
     }
     const std::string file = ShareModules() + "/" + share + ".conf";
     return programs::ReadWholeFile(file, kMaxModuleFile) == text.str() ||
-           WriteFileAtomically(file, text.str(), 0644);
+           programs::WriteFileAtomically(file, text.str(), 0644);
 }
 
 std::string StartCommand() {

@@ -2,16 +2,11 @@
 
 #include <arpa/inet.h>
 
-#include "programs/common/server_status.h"
 #include "programs/common/terminal.h"
 
 namespace zelctl {
 
 namespace {
-
-constexpr int kLookupFailed = 42;
-constexpr int kNothingSent = 213;
-constexpr int kFirstServerStatus = 200;
 
 bool IsAddress(const std::string& text) {
     unsigned char address[16];
@@ -45,11 +40,7 @@ ExitCode ConnectionOptions::ToSyncInfo(ZEL::SyncInfo& info) const {
     if (!password) {
         return Fail(kUsage, "%s", error.c_str());
     }
-    if (IsAddress(server)) {
-        info.SetServerIP(server);
-    } else {
-        info.SetServerName(server);
-    }
+    SetServer(server, info);
     info.SetUser(user);
     info.SetPassword(*password);
     info.SetSSH(ssh);
@@ -60,29 +51,10 @@ ExitCode ConnectionOptions::ToSyncInfo(ZEL::SyncInfo& info) const {
     return info.Validate() ? kOk : Fail(kUsage, "the server or the account is not given");
 }
 
-std::string Explain(int status, const TARQ::Backup::RunReport& report) {
-    if (status == kLookupFailed) {
-        return "no such server: its name cannot be looked up";
-    }
-    if (status == kNothingSent) {
-        return "this machine has no identity to show to the server: no serial number and no "
-               "network interface; give "
-               "it one in /usr/tarq/etc/tarqsdk.conf";
-    }
-    std::string server_text = programs::ServerStatusText(status);
-    if (!server_text.empty() && (status >= kFirstServerStatus || report.explanation.empty())) {
-        return server_text;
-    }
-    return !report.explanation.empty()
-               ? report.explanation
-               : "status " + std::to_string(status) + " (see the system log)";
-}
-
-ExitCode CodeOf(int status) {
-    if (status == kNothingSent) {
-        return kLocal;
-    }
-    return status < kFirstServerStatus ? kFailed : kRefused;
+void SetServer(const std::string& server, ZEL::SyncInfo& info) {
+    const bool is_address = IsAddress(server);
+    info.SetServerIP(is_address ? server : "");
+    info.SetServerName(is_address ? "" : server);
 }
 
 }  // namespace zelctl

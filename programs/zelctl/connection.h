@@ -4,7 +4,7 @@
 #include <CLI/CLI.hpp>
 #include <string>
 
-#include "ZEL/rsyncer.h"
+#include "ZEL/sync_obj.h"
 #include "programs/zelctl/exit_codes.h"
 
 namespace zelctl {
@@ -25,10 +25,7 @@ struct ConnectionOptions {
     ExitCode ToSyncInfo(ZEL::SyncInfo& info) const;
 };
 
-/// What a failed operation came to, for a person: the server's words, rsync's, or where to look.
-std::string Explain(int status, const TARQ::Backup::RunReport& report);
-
-/// Whether `status` is the server's refusal rather than a failure on the way.
-ExitCode CodeOf(int status);
+/// Enters `server` as the address or the name that it is, and forgets the other.
+void SetServer(const std::string& server, ZEL::SyncInfo& info);
 
 }  // namespace zelctl

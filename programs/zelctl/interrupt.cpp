@@ -2,20 +2,19 @@
 
 #include <signal.h>
 
-#include <cstdarg>
-#include <cstdio>
 #include <initializer_list>
-
-#include "programs/zelctl/exit_codes.h"
 
 namespace zelctl {
 
 namespace {
 
-volatile sig_atomic_t interrupted = 0;
+std::atomic<bool> interrupted{false};
+int interrupt_flag = 0;  // the same for those who take it as an abort flag; accessed atomically
+static_assert(std::atomic<bool>::is_always_lock_free, "set in a signal handler");
 
 extern "C" void Note(int) {
-    interrupted = 1;
+    interrupted = true;
+    __atomic_store_n(&interrupt_flag, 1, __ATOMIC_RELAXED);
 }
 
 }  // namespace
@@ -31,18 +30,12 @@ void WatchForInterrupt() {
     }
 }
 
-bool Interrupted() {
-    return interrupted != 0;
+const std::atomic<bool>& Interrupted() {
+    return interrupted;
 }
 
-ExitCode Fail(ExitCode code, const char* format, ...) {
-    va_list arguments;
-    va_start(arguments, format);
-    fputs("zelctl: ", stderr);
-    vfprintf(stderr, format, arguments);
-    fputc('\n', stderr);
-    va_end(arguments);
-    return code;
+int* InterruptFlag() {
+    return &interrupt_flag;
 }
 
 }  // namespace zelctl

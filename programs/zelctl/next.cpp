@@ -1,9 +1,9 @@
 #include "programs/zelctl/next.h"
 
-#include <cstdio>
+#include <algorithm>
 #include <ctime>
 
-#include "ZEL/sync_obj.h"
+#include "programs/common/schedule_words.h"
 #include "programs/common/table.h"
 #include "programs/common/text.h"
 
@@ -11,36 +11,26 @@ namespace zelctl {
 
 namespace {
 
-// Two or three numbers between separators, all of the text.
-bool ParseDate(const std::string& text, int& year, int& month, int& day) {
-    int used = 0;
-    return sscanf(text.c_str(), "%4d-%2d-%2d%n", &year, &month, &day, &used) == 3 &&
-           static_cast<size_t>(used) == text.size();
-}
-
-bool ParseTime(const std::string& text, int& hours, int& minutes) {
-    int used = 0;
-    return sscanf(text.c_str(), "%2d:%2d%n", &hours, &minutes, &used) == 2 &&
-           static_cast<size_t>(used) == text.size();
-}
+using programs::ParseDate;
+using programs::ParseTimeOfDay;
 
 bool ParseMoment(const std::string& text, long& moment) {
     if (text.empty()) {
         moment = time(nullptr);
         return true;
     }
-    int year = 0;
-    int month = 0;
-    int day = 0;
-    struct tm local = {};
-    const size_t blank = text.find(' ');
-    if (blank == std::string::npos || !ParseDate(text.substr(0, blank), year, month, day) ||
-        !ParseTime(text.substr(blank + 1), local.tm_hour, local.tm_min)) {
+    const size_t blank = std::min(text.find(' '), text.size());
+    const auto date = ParseDate(text.substr(0, blank));
+    const auto clock = ParseTimeOfDay(text.substr(std::min(blank + 1, text.size())));
+    if (!date || !clock) {
         return false;
     }
-    local.tm_year = year - 1900;
-    local.tm_mon = month - 1;
-    local.tm_mday = day;
+    struct tm local = {};
+    local.tm_year = date->year - 1900;
+    local.tm_mon = date->month - 1;
+    local.tm_mday = date->day;
+    local.tm_hour = clock->hours;
+    local.tm_min = clock->minutes;
     local.tm_isdst = -1;
     moment = mktime(&local);
     return moment >= 0;
@@ -62,41 +52,41 @@ ExitCode ShowNextRuns(const NextOptions& options) {
         options.week == "0000000") {
         return BadValue("week", options.week, "seven digits 0 or 1, Sunday first, at least one 1");
     }
-    int year = 0;
-    int month = 0;
-    int day = 0;
-    int hours = 0;
-    int minutes = 0;
-    if (!ParseDate(options.begin, year, month, day)) {
+    const auto begin = ParseDate(options.begin);
+    if (!begin) {
         return BadValue("begin", options.begin, "a date YYYY-MM-DD");
     }
-    if (!ParseTime(options.start, hours, minutes)) {
+    const auto start = ParseTimeOfDay(options.start);
+    if (!start) {
         return BadValue("start", options.start, "a time HH:MM");
     }
-    schedule.SetWeekSchedule(options.week);
-    schedule.SetBeginYear(year);
-    schedule.SetBeginMonth(month);
-    schedule.SetBeginDay(day);
-    schedule.SetStartHour(hours);
-    schedule.SetStartMinute(minutes);
-    if (!ParseTime(options.period, hours, minutes)) {
+    const auto period = ParseTimeOfDay(options.period);
+    if (!period) {
         return BadValue("period", options.period, "a time HH:MM");
     }
+    schedule.SetWeekSchedule(options.week);
+    schedule.SetBeginYear(begin->year);
+    schedule.SetBeginMonth(begin->month);
+    schedule.SetBeginDay(begin->day);
+    schedule.SetStartHour(start->hours);
+    schedule.SetStartMinute(start->minutes);
     // The count first: a period of 0 then takes it back, as a period without a count would go.
     schedule.SetRepeatTimesInDay(static_cast<long>(options.repeat));
-    schedule.SetPeriod(hours, minutes);
+    schedule.SetPeriod(period->hours, period->minutes);
     if (!schedule.Validate()) {
-        return Fail(kUsage,
-                    "the schedule is not possible: check the begin date, the start time, and that "
-                    "all repeats "
-                    "fall on the same day");
+        return Fail(kUsage, "the schedule is not possible: all repeats must fall on the same day");
     }
     long moment = 0;
     if (!ParseMoment(options.from, moment)) {
         return BadValue("from", options.from, "a moment 'YYYY-MM-DD HH:MM'");
     }
+    return ShowNextRuns(schedule, moment, options.count, options.as_json);
+}
+
+ExitCode ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count, bool as_json) {
     programs::Table table({"NEXT RUN", "SECONDS"});
-    for (unsigned int i = 0; i < options.count; ++i) {
+    long moment = after;
+    for (unsigned int i = 0; i < count; ++i) {
         moment = schedule.GetNextScheduledSeconds(moment);
         if (moment < 0) {
             return Fail(kFailed, "the next run cannot be computed (see the system log)");
@@ -106,7 +96,7 @@ ExitCode ShowNextRuns(const NextOptions& options) {
         }
         table.Add({programs::HumanTime(moment), std::to_string(moment)});
     }
-    table.Print(options.as_json);
+    table.Print(as_json);
     return kOk;
 }
 

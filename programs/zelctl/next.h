@@ -2,6 +2,7 @@
 
 #include <string>
 
+#include "ZEL/sync_obj.h"
 #include "programs/zelctl/exit_codes.h"
 
 namespace zelctl {
@@ -21,5 +22,8 @@ struct NextOptions {
 
 /// Prints the next runs of the schedule.
 ExitCode ShowNextRuns(const NextOptions& options);
+
+/// Prints the runs of a schedule after a moment, `count` at most.
+ExitCode ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count, bool as_json);
 
 }  // namespace zelctl

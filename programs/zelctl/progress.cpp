@@ -18,12 +18,6 @@ constexpr int kBarWidth = 24;
 constexpr milliseconds kRedrawEvery(100);
 constexpr seconds kLineEvery(10);
 
-std::string Bar(unsigned int percent) {
-    const int filled = static_cast<int>(percent) * kBarWidth / 100;
-    return std::string(static_cast<size_t>(filled), '#') +
-           std::string(static_cast<size_t>(kBarWidth - filled), '.');
-}
-
 std::string TimeLeft(const TARQ::Backup::RunProgress& progress) {
     if (!progress.totals_final || progress.percent == 0 || progress.bytes_per_second == 0) {
         return "";
@@ -49,7 +43,7 @@ void ProgressDisplay::Show(const std::string& share, const TARQ::Backup::RunProg
     const std::string rate = programs::HumanBytes(progress.bytes_per_second);
     if (on_terminal_) {
         printf("\r%s [%s] %3u%%  %s, %s/s%s\033[K", programs::Printable(share).c_str(),
-               Bar(progress.percent).c_str(), progress.percent, done.c_str(), rate.c_str(),
+               ProgressBar(progress.percent).c_str(), progress.percent, done.c_str(), rate.c_str(),
                TimeLeft(progress).c_str());
         drawn_ = true;
     } else if (!first) {
@@ -65,6 +59,12 @@ void ProgressDisplay::Clear() {
         fflush(stdout);
         drawn_ = false;
     }
+}
+
+std::string ProgressBar(unsigned int percent) {
+    const int filled = static_cast<int>(percent) * kBarWidth / 100;
+    return std::string(static_cast<size_t>(filled), '#') +
+           std::string(static_cast<size_t>(kBarWidth - filled), '.');
 }
 
 std::string Summary(const TARQ::Backup::RunReport& report, double elapsed) {

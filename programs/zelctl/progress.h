@@ -25,6 +25,9 @@ private:
     std::chrono::steady_clock::time_point last_;
 };
 
+/// "######.........." for a share of 100.
+std::string ProgressBar(unsigned int percent);
+
 /// "12 files sent, 1 deleted, 40 compared, 5.0 KiB on the wire, 45 ms"
 std::string Summary(const TARQ::Backup::RunReport& report, double seconds);
 

@@ -1,13 +1,7 @@
 #include "programs/zelctl/push.h"
 
-#include <chrono>
-#include <condition_variable>
-#include <filesystem>
-#include <mutex>
-#include <thread>
-
-#include "ZEL/rsyncer.h"
-#include "programs/common/server_status.h"
+#include "ZEL/zel.h"
+#include "programs/common/task_run.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/interrupt.h"
 #include "programs/zelctl/prepare.h"
@@ -18,326 +12,165 @@ namespace zelctl {
 
 namespace {
 
+using programs::RunOrder;
+using programs::RunTotals;
+using programs::TaskRun;
+using programs::Verdict;
 using TARQ::Backup::RunChange;
-using TARQ::Backup::RunOptions;
-using TARQ::Backup::RunProgress;
-using TARQ::Backup::RunReport;
-using TARQ::Backup::ScopedRunOptions;
 
-constexpr std::chrono::seconds kBeaconEvery(60);  // the server takes a task for dead after 120
-constexpr int kVanishedFiles = 24;  // rsync: some files were gone before it came to them
-
-std::list<std::string> ToList(const std::vector<std::string>& items) {
-    return {items.begin(), items.end()};
+ExitCode Tell(const Verdict& verdict) {
+    return verdict.Ok() ? kOk : Fail(CodeOf(verdict.trouble), "%s", verdict.error.c_str());
 }
 
-/// Tells the server that the push is alive, from a thread and a connection of its own.
-class Beacon {
-public:
-    Beacon(const ZEL::SyncInfo& info, std::string task) : info_(info), task_(std::move(task)) {
-        thread_ = std::thread([this] { Run(); });
-    }
-    ~Beacon() {
-        {
-            const std::lock_guard<std::mutex> lock(mutex_);
-            stop_ = true;
-        }
-        wake_.notify_one();
-        thread_.join();
-    }
-    Beacon(const Beacon&) = delete;
-    Beacon& operator=(const Beacon&) = delete;
-
-private:
-    void Run() {
-        ZEL::Rsyncer rsyncer;
-        rsyncer.SetCancelChecker(Interrupted);
-        bool ready = false;
-        std::unique_lock<std::mutex> lock(mutex_);
-        while (!wake_.wait_for(lock, kBeaconEvery, [this] { return stop_; })) {
-            lock.unlock();
-            // A beacon that fails is no reason to end the push.
-            ready = ready || rsyncer.Initialize(info_) == 0;
-            int status = 0;
-            if (ready) {
-                rsyncer.SendBeacon(task_, status);
-            }
-            lock.lock();
-        }
-    }
-
-    ZEL::SyncInfo info_;
-    std::string task_;
-    std::mutex mutex_;
-    std::condition_variable wake_;
-    bool stop_ = false;
-    std::thread thread_;
-};
-
-/// One push: the connection and what has been said of it.
-class Pusher {
-public:
-    explicit Pusher(const PushOptions& options) : options_(options), display_(options.quiet) {
-        rsyncer_.SetCancelChecker(Interrupted);
-    }
-
-    /// Finds the server and asks whether it would take the shares. Changes nothing there.
-    ExitCode Connect() {
-        ExitCode result = PrepareHost();
-        if (result == kOk) {
-            result = CheckShares(options_.shares);
-        }
-        ZEL::SyncInfo info;
-        if (result == kOk) {
-            result = options_.connection.ToSyncInfo(info);
-        }
-        if (result != kOk) {
-            return result;
-        }
-        WatchForInterrupt();
-        {
-            const ScopedRunOptions watched(Reporting());
-            const int status = rsyncer_.Initialize(info);
-            if (status != 0) {
-                return Failed("cannot use server " + options_.connection.server, status);
-            }
-        }
-        return Pair(true);
-    }
-
-    /// Asks the server for these shares; `dry_run`: would it take them?
-    ExitCode Pair(bool dry_run) {
-        std::list<std::string> conflicts;
-        int status = 0;
-        const ScopedRunOptions watched(Reporting());
-        if (rsyncer_.DoPairing(dry_run, ToList(options_.shares), conflicts, status) != 0) {
-            return Failed("the server does not take these shares", status);
-        }
-        for (const std::string& share : conflicts) {
-            Fail(kRefused, "share '%s' belongs to another client or account at the server",
-                 programs::Printable(share).c_str());
-        }
-        return status == programs::kDone ? kOk : kRefused;
-    }
-
-    ExitCode PushAll() {
-        const std::string task = "push-" + ZEL::GetHostName(35);
-        int ignored = 0;
-        ExitCode result = kOk;
-        {
-            const Beacon beacon(rsyncer_.GetSyncInfo(), task);
-            rsyncer_.SendBeacon(task, ignored);
-            for (const std::string& share : options_.shares) {
-                result = PushShare(share);
-                if (result != kOk) {
-                    break;
-                }
-            }
-        }
-        rsyncer_.SetCancelChecker(
-            nullptr);  // the last word is sent even when the user has had enough
-        rsyncer_.FinishSync("task", task, ignored);
-        return result;
-    }
-
-    ExitCode ListAll() {
-        for (const std::string& share : options_.shares) {
-            const ExitCode result = ListChanges(share);
-            if (result != kOk) {
-                return result;
-            }
-        }
-        return kOk;
-    }
-
-private:
-    RunOptions Reporting() {
-        RunOptions wishes;
-        report_ = RunReport();
-        wishes.report = &report_;
-        return wishes;
-    }
-
-    ExitCode Failed(const std::string& what, int status) {
-        display_.Clear();
-        if (Interrupted()) {
-            return Fail(kCancelled, "ended by the user; the next push completes the copy");
-        }
-        const std::string why = status == 0 ? "see the system log" : Explain(status, report_);
-        return Fail(status == 0 ? kLocal : CodeOf(status), "%s: %s", what.c_str(), why.c_str());
-    }
-
-    // Announces a share, and pairs first when the server does not know this client.
-    ExitCode Start(const std::string& share) {
-        for (const bool may_pair : {true, false}) {
-            int status = 0;
-            {
-                const ScopedRunOptions watched(Reporting());
-                if (rsyncer_.StartSyncShare(share, status) != 0) {
-                    return Failed("share '" + share + "' cannot be announced", 0);
-                }
-            }
-            if (status == programs::kNotPaired && may_pair) {
-                const ExitCode paired = PairForReal();
-                if (paired != kOk) {
-                    return paired;
-                }
-                continue;
-            }
-            return status == programs::kDone
-                       ? kOk
-                       : Failed("the server does not take share '" + share + "'", status);
-        }
-        return kOk;
-    }
-
-    ExitCode PairForReal() {
-        const ExitCode paired = Pair(false);
-        if (paired == kOk && !options_.quiet) {
-            printf("Paired with %s.\n", rsyncer_.GetLatestIP().c_str());
-        }
-        return paired;
-    }
-
-    ExitCode SendKey(const std::string& share) {
-        const ScopedRunOptions watched(Reporting());
-        const int status = rsyncer_.SyncEncryptKey(share);
-        return status == 0
-                   ? kOk
-                   : Failed("the key of encrypted share '" + share + "' cannot be sent", status);
-    }
-
-    ExitCode PushShare(const std::string& share) {
-        ExitCode result = Start(share);
-        if (result == kOk) {
-            result = SendKey(share);
-        }
-        if (result != kOk) {
-            return result;
-        }
-        const auto begin = std::chrono::steady_clock::now();
-        // Once more, right before files are compared: an unmounted volume must not look like an
-        // emptied share.
-        result = CheckShares({share});
-        if (result == kOk) {
-            result = SendFiles(share);
-        }
-        const std::chrono::duration<double> elapsed = std::chrono::steady_clock::now() - begin;
-        const RunReport sent = report_;
-        const ExitCode closed = Finish(share, result == kOk);
-        if (result == kOk && closed == kOk && !options_.quiet) {
-            printf("%s: %s\n", programs::Printable(share).c_str(),
-                   Summary(sent, elapsed.count()).c_str());
-        }
-        return result != kOk ? result : closed;
-    }
-
-    ExitCode SendFiles(const std::string& share) {
-        RunOptions wishes = Reporting();
-        wishes.bandwidth_limit = options_.bandwidth_limit;
-        if (!options_.quiet) {
-            wishes.on_progress = [&](const RunProgress& progress) {
-                display_.Show(share, progress);
-            };
-        }
-        int status = 0;
-        const ScopedRunOptions watched(std::move(wishes));
-        const int ran =
-            rsyncer_.RunSync(0, share, options_.path, ToList(options_.excludes), status);
-        display_.Clear();
-        if (ran == 0 && status == 0 && report_.status != 0) {
+// A path that a person names has to be there: it is a slip of the pen, not a deletion.
+ExitCode CheckPath(const PushOptions& options) {
+    for (const std::string& share : options.shares) {
+        ZEL::ShareInfo facts;
+        if (ZEL::GetShareInfo(share, facts) != 0 ||
+            !ZEL::IsPathExist(facts.GetModulePath() + options.path)) {
             return Fail(kLocal, "share '%s' has no %s", programs::Printable(share).c_str(),
-                        programs::Printable(options_.path).c_str());
+                        programs::Printable(options.path).c_str());
         }
-        if (ran == 0 && status == kVanishedFiles) {
-            fprintf(stderr,
-                    "zelctl: share '%s': some files vanished while they were being pushed\n",
-                    share.c_str());
-            return kOk;
+    }
+    return kOk;
+}
+
+// What every command does before it speaks to the server.
+ExitCode Prepare(const PushOptions& options, ZEL::SyncInfo& info) {
+    ExitCode result = PrepareHost();
+    if (result == kOk) {
+        result = CheckShares(options.shares);
+    }
+    if (result == kOk) {
+        result = CheckPath(options);
+    }
+    if (result == kOk && options.info) {
+        info = *options.info;
+    } else if (result == kOk) {
+        result = options.connection.ToSyncInfo(info);
+        info.SetMaxBandwidth(options.bandwidth_limit);
+    }
+    if (result == kOk) {
+        WatchForInterrupt();
+    }
+    return result;
+}
+
+Verdict Connect(TaskRun& run, const std::vector<std::string>& shares) {
+    Verdict verdict = run.Connect();
+    return verdict.Ok() ? run.CheckPairing(shares) : verdict;
+}
+
+/// Prints what a push would do, and a sum a share.
+class ChangeList {
+public:
+    void Add(const RunChange& change) {
+        const std::string path = programs::Printable(change.path);
+        if (change.kind == RunChange::SEND) {
+            printf("send    %s (%s)\n", path.c_str(), programs::HumanBytes(change.length).c_str());
+            ++sends_;
+            bytes_ += change.length;
+        } else if (change.kind == RunChange::DELETE) {
+            printf("delete  %s\n", path.c_str());
+            ++deletes_;
         }
-        return ran == 0 && status == 0 ? kOk
-                                       : Failed("share '" + share + "' is not complete", status);
+    }
+    void AddMissing(const std::string& share) {
+        printf("%s: the server holds no copy yet; all of it would be sent.\n",
+               programs::Printable(share).c_str());
+        missing_ = true;
+    }
+    void Sum(const std::string& share) const {
+        if (!missing_) {
+            printf("%s: %s (%s) would be sent, %llu deleted.\n", programs::Printable(share).c_str(),
+                   programs::Count(sends_, "file").c_str(), programs::HumanBytes(bytes_).c_str(),
+                   static_cast<unsigned long long>(deletes_));
+        }
     }
 
-    ExitCode Finish(const std::string& share, bool completed) {
-        int status = 0;
-        const RunReport of_the_run = report_;
-        rsyncer_.SetCancelChecker(nullptr);
-        const ScopedRunOptions watched(Reporting());
-        const int sent = rsyncer_.FinishSync(completed ? "share" : "abort", share, status);
-        rsyncer_.SetCancelChecker(Interrupted);
-        if (!completed) {
-            return kOk;  // the failure itself has been told
-        }
-        return sent == 0 && status == programs::kDone
-                   ? kOk
-                   : Failed("the server does not confirm share '" + share + "'", status);
-    }
-
-    ExitCode ListChanges(const std::string& share) {
-        RunOptions wishes = Reporting();
-        wishes.dry_run = true;
-        uint64_t sends = 0;
-        uint64_t bytes = 0;
-        uint64_t deletes = 0;
-        wishes.on_change = [&](const RunChange& change) {
-            const std::string path = programs::Printable(change.path);
-            if (change.kind == RunChange::SEND) {
-                printf("send    %s (%s)\n", path.c_str(),
-                       programs::HumanBytes(change.length).c_str());
-                ++sends;
-                bytes += change.length;
-            } else if (change.kind == RunChange::DELETE) {
-                printf("delete  %s\n", path.c_str());
-                ++deletes;
-            }
-        };
-        int status = 0;
-        int ran = 0;
-        {
-            const ScopedRunOptions watched(std::move(wishes));
-            ran = rsyncer_.RunSync(0, share, options_.path, ToList(options_.excludes), status);
-        }
-        if (ran == 0 && status != 0 && report_.cause == TARQ::Backup::RunCause::UNKNOWN_MODULE) {
-            printf("%s: the server holds no copy yet; all of it would be sent.\n", share.c_str());
-            return kOk;
-        }
-        if (ran != 0 || (status != 0 && status != kVanishedFiles)) {
-            return Failed("share '" + share + "' cannot be compared", status);
-        }
-        printf("%s: %s (%s) would be sent, %llu deleted.\n", programs::Printable(share).c_str(),
-               programs::Count(sends, "file").c_str(), programs::HumanBytes(bytes).c_str(),
-               static_cast<unsigned long long>(deletes));
-        return kOk;
-    }
-
-    const PushOptions& options_;
-    ProgressDisplay display_;
-    RunReport report_;
-    ZEL::Rsyncer rsyncer_;
+private:
+    uint64_t sends_ = 0;
+    uint64_t bytes_ = 0;
+    uint64_t deletes_ = 0;
+    bool missing_ = false;
 };
+
+ExitCode ListChanges(TaskRun& run, const RunOrder& order) {
+    for (const programs::ShareOrder& share : order.shares) {
+        ChangeList list;
+        RunOrder alone = order;
+        alone.shares = {share};
+        const Verdict verdict = run.List(
+            alone, [&](const std::string&, const RunChange& change) { list.Add(change); },
+            [&](const std::string& name) { list.AddMissing(name); });
+        if (!verdict.Ok()) {
+            return Tell(verdict);
+        }
+        list.Sum(share.share);
+    }
+    return kOk;
+}
 
 }  // namespace
 
 ExitCode Push(const PushOptions& options) {
-    Pusher pusher(options);
-    const ExitCode result = pusher.Connect();
-    if (result != kOk) {
-        return result;
+    ZEL::SyncInfo info;
+    const ExitCode prepared = Prepare(options, info);
+    if (prepared != kOk) {
+        return prepared;
     }
-    return options.dry_run ? pusher.ListAll() : pusher.PushAll();
+    ProgressDisplay display(options.quiet);
+    programs::RunListener listener;
+    listener.on_progress = [&](const std::string& share, const auto& progress) {
+        display.Show(share, progress);
+    };
+    listener.on_share_done = [&](const std::string& share, const auto& report, double seconds) {
+        display.Clear();
+        if (!options.quiet) {
+            printf("%s: %s\n", programs::Printable(share).c_str(),
+                   Summary(report, seconds).c_str());
+        }
+    };
+    listener.on_paired = [&](const std::string& address) {
+        if (!options.quiet) {
+            printf("Paired with %s.\n", address.c_str());
+        }
+    };
+    TaskRun run(info, Interrupted(), std::move(listener));
+    Verdict verdict = Connect(run, options.shares);
+    if (!verdict.Ok()) {
+        return Tell(verdict);
+    }
+    RunOrder order;
+    order.task = "push-" + ZEL::GetHostName(35);
+    order.excludes = options.excludes;
+    for (const std::string& share : options.shares) {
+        order.shares.push_back({share, {options.path}});
+    }
+    if (options.dry_run) {
+        return ListChanges(run, order);
+    }
+    RunTotals totals;
+    verdict = run.Push(order, totals);
+    display.Clear();
+    return Tell(verdict);
 }
 
 ExitCode CheckPairing(const ConnectionOptions& connection, const std::vector<std::string>& shares) {
     PushOptions options;
     options.connection = connection;
     options.shares = shares;
-    Pusher pusher(options);
-    const ExitCode result = pusher.Connect();
-    if (result == kOk) {
+    ZEL::SyncInfo info;
+    const ExitCode prepared = Prepare(options, info);
+    if (prepared != kOk) {
+        return prepared;
+    }
+    TaskRun run(info, Interrupted());
+    const Verdict verdict = Connect(run, shares);
+    if (verdict.Ok()) {
         puts("The server would take these shares from this client.");
     }
-    return result;
+    return Tell(verdict);
 }
 
 }  // namespace zelctl

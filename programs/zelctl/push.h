@@ -1,6 +1,7 @@
 // Pushing shares to the server, from the first probe to the last word.
 #pragma once
 
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -10,6 +11,7 @@ namespace zelctl {
 
 struct PushOptions {
     ConnectionOptions connection;
+    std::optional<ZEL::SyncInfo> info;  ///< used in place of `connection` when it is there
     std::vector<std::string> shares;
     std::string path = "/";  ///< what of each share; "/" is all
     std::vector<std::string> excludes;

@@ -1,13 +1,9 @@
 #include "programs/zelctl/shares.h"
 
-#include <unistd.h>
-
-#include <cerrno>
-#include <cstring>
 #include <filesystem>
 
-#include "ZEL/zel.h"
 #include "programs/common/table.h"
+#include "programs/common/task_run.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/prepare.h"
 #include "tarq/owners.h"
@@ -27,31 +23,6 @@ ShareOwner GetShare(const std::string& name) {
 
 std::string LastError() {
     return KAPICErrText(KAPICErrGet());
-}
-
-ExitCode CheckShare(const std::string& name) {
-    const std::string shown = programs::Printable(name);
-    const ShareOwner share = GetShare(name);
-    if (!share || share->path == nullptr) {
-        return Fail(kLocal, "share '%s': %s (see 'zelctl share list')", shown.c_str(),
-                    LastError().c_str());
-    }
-    if (access(share->path, R_OK | X_OK) != 0) {
-        return Fail(kLocal, "share '%s': its folder %s cannot be read: %s", shown.c_str(),
-                    share->path, strerror(errno));
-    }
-    bool fit = false;
-    if (ZEL::IsValidShare(name, fit) != 0) {
-        return Fail(kLocal, "share '%s': %s", shown.c_str(), LastError().c_str());
-    }
-    if (!fit) {
-        return Fail(
-            kLocal,
-            "share '%s' lies on a removable or network disk: only shares on this machine's own "
-            "disks are pushed",
-            shown.c_str());
-    }
-    return kOk;
 }
 
 }  // namespace
@@ -96,14 +67,26 @@ ExitCode RemoveShare(const std::string& name) {
     return kOk;
 }
 
+std::optional<std::vector<std::string>> ShareNames() {
+    const TARQ::ListOwner list(KAPICSzListAlloc(64));
+    if (!list || TARQShareEnum(list.get()) < 0) {
+        Fail(kLocal, "cannot read the share catalogue: %s", LastError().c_str());
+        return std::nullopt;
+    }
+    std::vector<std::string> names;
+    for (int i = 0; i < KAPICSzListCount(list.get()); ++i) {
+        names.emplace_back(KAPICSzListGet(list.get(), i));
+    }
+    return names;
+}
+
 ExitCode ListShares(bool as_json) {
-    const TARQ::ListOwner names(KAPICSzListAlloc(64));
-    if (!names || TARQShareEnum(names.get()) < 0) {
-        return Fail(kLocal, "cannot read the share catalogue: %s", LastError().c_str());
+    const auto names = ShareNames();
+    if (!names) {
+        return kLocal;
     }
     programs::Table table({"SHARE", "STATE", "FOLDER"});
-    for (int i = 0; i < KAPICSzListCount(names.get()); ++i) {
-        const std::string name = KAPICSzListGet(names.get(), i);
+    for (const std::string& name : *names) {
         const ShareOwner share = GetShare(name);
         table.Add({name, share ? "ready" : LastError(),
                    share && share->path != nullptr ? share->path : ""});
@@ -114,9 +97,9 @@ ExitCode ListShares(bool as_json) {
 
 ExitCode CheckShares(const std::vector<std::string>& names) {
     for (const std::string& name : names) {
-        const ExitCode checked = CheckShare(name);
-        if (checked != kOk) {
-            return checked;
+        const std::string problem = programs::ShareProblem(name);
+        if (!problem.empty()) {
+            return Fail(kLocal, "%s", problem.c_str());
         }
     }
     return kOk;

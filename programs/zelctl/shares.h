@@ -1,6 +1,7 @@
 // The commands about this machine's shares.
 #pragma once
 
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -11,6 +12,9 @@ namespace zelctl {
 ExitCode AddShare(const std::string& name, const std::string& path, bool acl, bool windows);
 ExitCode RemoveShare(const std::string& name);
 ExitCode ListShares(bool as_json);
+
+/// All shares of the catalogue, in its order; nothing, and the reason told, when it cannot be read.
+std::optional<std::vector<std::string>> ShareNames();
 
 /// Complains about the first share that is not in the catalogue, whose folder cannot be read, or
 /// whose volume is not there or not fit for syncing.

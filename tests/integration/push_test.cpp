@@ -14,85 +14,21 @@
 #include <fstream>
 #include <thread>
 
-#include "platform/internal/child_process.h"
-#include "tests/integration/servers.h"
+#include "tests/integration/client_and_server.h"
 #include "tests/support/temp_root.h"
 
 namespace fs = std::filesystem;
+using test::Must;
+using test::Outcome;
+using test::RunProgram;
 using testing::AllOf;
 using testing::HasSubstr;
 using testing::Not;
 
 namespace {
 
-constexpr char kSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
-
-struct Outcome {
-    int exit_code = -1;
-    std::string output;  // both streams
-};
-
-Outcome RunProgram(const std::string& root, std::vector<std::string> command,
-                   const std::string& input = "", const std::function<bool()>& cancelled = nullptr,
-                   const std::string& path = kSearchPath) {
-    tarq_internal::ChildSetup setup;
-    setup.program = tarq_internal::FindProgram(command[0], kSearchPath);
-    setup.arguments = std::move(command);
-    setup.environment = {"LC_ALL=C", "TARQ_ROOT=" + root, "PATH=" + path};
-    setup.input = input;
-    Outcome outcome;
-    const auto append = [&](const char* bytes, size_t size) { outcome.output.append(bytes, size); };
-    const tarq_internal::ChildResult result =
-        tarq_internal::RunChild(setup, cancelled, append, append);
-    outcome.exit_code = WIFEXITED(result.wait_status) ? WEXITSTATUS(result.wait_status) : -1;
-    return outcome;
-}
-
-/// A server with the account "alice", and a client that knows how to find it.
-class PushTest : public testing::Test {
+class PushTest : public testing::Test, public test::ClientAndServer {
 protected:
-    PushTest() : port_(test::FreePort()) {
-        for (const char* folder : {"client/usr/tarq/etc", "source"}) {
-            fs::create_directories(folder_.Path(folder));
-        }
-        Must(Server({"setup", "--storage", storage_, "--port", std::to_string(port_), "--address",
-                     "127.0.0.1"}));
-        Must(Server({"account", "add", "alice", "--password-file", "-"}, "secret\n"));
-        StartDaemon();
-        Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\n");
-        folder_.Write("client/usr/tarq/etc/tarqsdk.conf", "[device]\nserial=\"CLIENT-1\"\n");
-        Write("a.txt", "alpha");
-        Write("sub/b.txt", "beta");
-        Write("-n\n odd \xc3\xa4", "odd");
-        Must(Client({"share", "add", "docs", source_}));
-    }
-
-    void StartDaemon() {
-        daemon_.Start({"rsync", "--daemon", "--no-detach",
-                       "--config=" + folder_.Path("server/usr/tarq/etc/zel_server/rsyncd.conf")},
-                      folder_.Path("daemon.log"), port_);
-    }
-    void Configure(const std::string& text) {
-        folder_.Write("client/usr/tarq/etc/tarqrsync.conf", text);
-    }
-    void Write(const std::string& name, const std::string& content) {
-        folder_.Write("source/" + name, content);
-    }
-
-    static void Must(const Outcome& outcome) {
-        if (outcome.exit_code != 0) {
-            throw std::runtime_error(outcome.output);
-        }
-    }
-    Outcome Server(std::vector<std::string> arguments, const std::string& input = "") {
-        arguments.insert(arguments.begin(), ZEL_SERVER);
-        return RunProgram(folder_.Path("server"), arguments, input);
-    }
-    Outcome Client(std::vector<std::string> arguments, const std::string& input = "",
-                   const std::function<bool()>& cancelled = nullptr) {
-        arguments.insert(arguments.begin(), ZELCTL);
-        return RunProgram(folder_.Path("client"), arguments, input, cancelled);
-    }
     std::vector<std::string> PushCommand(const std::vector<std::string>& more,
                                          const std::string& user) {
         std::vector<std::string> command = {
@@ -104,22 +40,12 @@ protected:
                  const std::string& user = "alice") {
         return Client(PushCommand(more, user), password + "\n");
     }
-    void ExpectCopyIsComplete() {
-        const Outcome compared = RunProgram("", {"diff", "-r", source_, storage_ + "/docs"});
-        EXPECT_EQ(compared.exit_code, 0) << compared.output;
-    }
     void ExpectNextPushCompletes(const std::vector<std::string>& more = {},
                                  const std::string& user = "alice") {
         const Outcome pushed = Push(more, "secret", user);
         EXPECT_EQ(pushed.exit_code, 0) << pushed.output;
         ExpectCopyIsComplete();
     }
-
-    test::TempFolder folder_;
-    const std::string source_ = folder_.Path("source");
-    const std::string storage_ = folder_.Path("server/storage");
-    int port_;
-    test::ServerProcess daemon_;
 };
 
 TEST_F(PushTest, OnlyTheChangeTravelsAndADeletionIsOne) {
@@ -163,11 +89,11 @@ TEST_F(PushTest, EachFailureHasItsOwnErrorAndTheNextPushCompletesTheCopy) {
     EXPECT_EQ(failed.exit_code, 1);
     EXPECT_THAT(failed.output, HasSubstr("cannot be looked up"));
 
-    daemon_.Stop();
+    StopServer();
     failed = Push();
     EXPECT_EQ(failed.exit_code, 1);
     EXPECT_THAT(failed.output, HasSubstr("refused"));
-    StartDaemon();
+    StartServer();
 
     Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nrsync=\"/nonexistent/rsync\"\n");
     EXPECT_THAT(Push().output, HasSubstr("/nonexistent/rsync cannot be started"));
@@ -209,8 +135,8 @@ TEST_F(PushTest, AKilledPushAndARestartedServerLoseNothing) {
         if (kill_server) {
             std::thread restart([&] {
                 std::this_thread::sleep_for(std::chrono::seconds(1));
-                daemon_.Stop();
-                StartDaemon();
+                StopServer();
+                StartServer();
             });
             EXPECT_EQ(Client(slow, "secret\n").exit_code, 1);
             restart.join();

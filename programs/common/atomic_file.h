@@ -4,10 +4,10 @@
 
 #include <string>
 
-namespace zel_server {
+namespace programs {
 
 /// Writes a whole file so that after a crash the old one or the new one is there. False, with errno
 /// set, on failure.
 bool WriteFileAtomically(const std::string& path, const std::string& content, mode_t mode);
 
-}  // namespace zel_server
+}  // namespace programs

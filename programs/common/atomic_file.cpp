@@ -1,4 +1,4 @@
-#include "programs/zel_server/atomic_file.h"
+#include "programs/common/atomic_file.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -10,7 +10,7 @@
 #include "platform/internal/unique_fd.h"
 #include "platform/internal/write_all.h"
 
-namespace zel_server {
+namespace programs {
 
 namespace {
 
@@ -44,4 +44,4 @@ bool WriteFileAtomically(const std::string& path, const std::string& content, mo
     return false;
 }
 
-}  // namespace zel_server
+}  // namespace programs

@@ -1,0 +1,311 @@
+#include "programs/common/schedule_words.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <iterator>
+#include <vector>
+
+#include "ZEL/rsyncer.h"
+#include "programs/common/text.h"
+
+namespace programs {
+
+namespace {
+
+constexpr const char* kDays[] = {"sunday",   "monday", "tuesday", "wednesday",
+                                 "thursday", "friday", "saturday"};
+constexpr size_t kShortDay = 3;  // letters
+
+struct NamedWeek {
+    const char* word;
+    const char* week;  // Sunday first
+};
+constexpr NamedWeek kNamedWeeks[] = {
+    {"daily", "1111111"}, {"weekdays", "0111110"}, {"weekends", "1000001"}};
+
+// A year with a 29th of February, and its first month with all 31 days: what a schedule without a
+// year, or without a month, counts from.
+constexpr int kLeapYear = 2016;
+constexpr int kJanuary = 1;
+
+constexpr int kLastMinuteOfDay = 24 * 60 - 1;
+constexpr long kMaxTimes = 95;  // the library's bound: a run each quarter of an hour
+
+std::string Lower(std::string text) {
+    std::transform(text.begin(), text.end(), text.begin(), [](char c) {
+        return static_cast<char>(c >= 'A' && c <= 'Z' ? c - 'A' + 'a' : c);
+    });
+    return text;
+}
+
+std::string Quoted(const std::string& text) {
+    return "'" + Printable(text) + "'";
+}
+
+// The decimal numbers between `separator`s, as many as there are entries in `digits`, each of one
+// digit up to that many. Empty for any other text.
+std::vector<int> Numbers(const std::string& text, char separator,
+                         const std::vector<size_t>& digits) {
+    std::vector<std::string> pieces;
+    ZEL::SplitStringByChars(text, std::string(1, separator), pieces);
+    std::vector<int> numbers;
+    for (size_t i = 0; i < pieces.size() && pieces.size() == digits.size(); ++i) {
+        const auto number = ParseNumber(pieces[i], 9999);
+        if (!number || pieces[i].size() > digits[i]) {
+            return {};
+        }
+        numbers.push_back(static_cast<int>(*number));
+    }
+    return numbers;
+}
+
+bool IsDate(int year, int month, int day) {
+    static constexpr int kDaysOfMonth[] = {31, 28, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
+    if (year < 1970 || month < 1 || month > 12 || day < 1) {
+        return false;
+    }
+    const bool leap = year % 4 == 0 && (year % 100 != 0 || year % 400 == 0);
+    return day <= kDaysOfMonth[month - 1] + (leap && month == 2 ? 1 : 0);
+}
+
+// "90m", "2h", "1h30m" as minutes; nothing for any other text, 0 and a day or more.
+std::optional<int> ParsePeriod(const std::string& text) {
+    const size_t h = text.find('h');
+    const std::string hours = h == std::string::npos ? "0" : text.substr(0, h);
+    std::string minutes = h == std::string::npos ? text : text.substr(h + 1);
+    if (minutes.empty() && h != std::string::npos) {
+        minutes = "0m";
+    }
+    if (minutes.size() < 2 || minutes.back() != 'm') {
+        return std::nullopt;
+    }
+    minutes.pop_back();
+    const auto whole = ParseNumber(hours, 23);
+    const auto rest = ParseNumber(minutes, kLastMinuteOfDay);
+    if (!whole || !rest) {
+        return std::nullopt;
+    }
+    const int period = static_cast<int>(*whole * 60 + *rest);
+    return period == 0 || period > kLastMinuteOfDay ? std::nullopt : std::optional<int>(period);
+}
+
+std::string DescribePeriod(long seconds) {
+    const long hours = seconds / 3600;
+    const long minutes = seconds / 60 % 60;
+    std::string text = hours > 0 ? std::to_string(hours) + "h" : "";
+    if (minutes > 0 || hours == 0) {
+        text += std::to_string(minutes) + "m";
+    }
+    return text;
+}
+
+std::string ApplyWeek(const std::string& words, ZEL::Schedule& schedule) {
+    std::vector<std::string> pieces;
+    ZEL::SplitStringByChars(Lower(words), ",", pieces);
+    std::string week = "0000000";
+    for (const std::string& piece : pieces) {
+        const auto* const named =
+            std::find_if(std::begin(kNamedWeeks), std::end(kNamedWeeks),
+                         [&](const NamedWeek& entry) { return piece == entry.word; });
+        const auto* const day =
+            std::find_if(std::begin(kDays), std::end(kDays), [&](const std::string& name) {
+                return piece == name || piece == name.substr(0, kShortDay);
+            });
+        if (named != std::end(kNamedWeeks)) {
+            for (size_t i = 0; i < week.size(); ++i) {
+                week[i] = std::max(week[i], named->week[i]);
+            }
+        } else if (day != std::end(kDays)) {
+            week[static_cast<size_t>(day - std::begin(kDays))] = '1';
+        } else {
+            return "--weekly: " + Quoted(piece) +
+                   " is no day: give days as in mon,thu or monday, or daily, weekdays, weekends";
+        }
+    }
+    schedule.SetMode(ZEL::SCHD_MODE_WEEKLY);
+    schedule.SetWeekSchedule(week);
+    return "";
+}
+
+void SetBegin(ZEL::Schedule& schedule, ZEL::SCHD_MODE mode, const CalendarDate& date) {
+    schedule.SetMode(mode);
+    schedule.SetBeginYear(date.year);
+    schedule.SetBeginMonth(date.month);
+    schedule.SetBeginDay(date.day);
+}
+
+// The mode with its days.
+std::string ApplyDays(const ScheduleWords& words, ZEL::Schedule& schedule) {
+    const int modes = int{words.manual} + int{words.on_change} + int{words.weekly.has_value()} +
+                      int{words.monthly.has_value()} + int{words.yearly.has_value()} +
+                      int{words.once.has_value()};
+    if (modes > 1) {
+        return "give only one of --manual, --on-change, --weekly, --monthly, --yearly and --once";
+    }
+    if (words.manual || words.on_change) {
+        schedule.SetMode(words.manual ? ZEL::SCHD_MODE_MANUAL : ZEL::SCHD_MODE_REALTIME);
+        schedule.SetRepeatTimesInDay(0);
+        schedule.SetStartHour(0);
+        schedule.SetStartMinute(0);
+    } else if (words.weekly) {
+        return ApplyWeek(*words.weekly, schedule);
+    } else if (words.monthly) {
+        const auto day = ParseNumber(*words.monthly, 31);
+        if (!day || *day == 0) {
+            return "--monthly: " + Quoted(*words.monthly) + " is no day of a month: give 1 to 31";
+        }
+        SetBegin(schedule, ZEL::SCHD_MODE_MONTHLY, {kLeapYear, kJanuary, static_cast<int>(*day)});
+    } else if (words.yearly) {
+        const std::vector<int> date = Numbers(*words.yearly, '-', {2, 2});
+        if (date.empty() || !IsDate(kLeapYear, date[0], date[1])) {
+            return "--yearly: " + Quoted(*words.yearly) + " is no date MM-DD, as in 03-31";
+        }
+        SetBegin(schedule, ZEL::SCHD_MODE_YEARLY, {kLeapYear, date[0], date[1]});
+    } else if (words.once) {
+        const auto date = ParseDate(*words.once);
+        if (!date) {
+            return "--once: " + Quoted(*words.once) + " is no date YYYY-MM-DD, as in 2026-03-31";
+        }
+        SetBegin(schedule, ZEL::SCHD_MODE_ONCE, *date);
+    }
+    return "";
+}
+
+std::string ApplyRepeats(const ScheduleWords& words, ZEL::Schedule& schedule) {
+    std::optional<int> period;
+    if (words.every) {
+        period = ParsePeriod(*words.every);
+        if (!period) {
+            return "--every: " + Quoted(*words.every) +
+                   " is no time span: give hours and minutes, as in 90m, 2h or 1h30m";
+        }
+    } else if (schedule.GetPeriodSeconds() > 0) {
+        period = static_cast<int>(schedule.GetPeriodSeconds() / 60);
+    }
+    const long times = words.times ? long{*words.times} : schedule.GetRepeatTimesInDay();
+    if (times > kMaxTimes) {
+        return "--times: a day has at most 95 runs after the first";
+    }
+    if (words.every && times == 0) {
+        return "--every needs --times N: how often a day's run is repeated";
+    }
+    if (times > 0 && !period) {
+        return "--times needs --every: the time between two runs, as in 1h30m";
+    }
+    // The count first: set after it, a period stands.
+    schedule.SetRepeatTimesInDay(times);
+    if (times > 0) {
+        schedule.SetPeriod(0, *period);
+    }
+    return "";
+}
+
+std::string DescribeDays(const ZEL::Schedule& schedule) {
+    char text[64] = "";
+    switch (schedule.GetMode()) {
+        case ZEL::SCHD_MODE_MONTHLY:
+            snprintf(text, sizeof text, "monthly %d", schedule.GetBeginDay());
+            break;
+        case ZEL::SCHD_MODE_YEARLY:
+            snprintf(text, sizeof text, "yearly %02d-%02d", schedule.GetBeginMonth(),
+                     schedule.GetBeginDay());
+            break;
+        case ZEL::SCHD_MODE_ONCE:
+            snprintf(text, sizeof text, "once %04d-%02d-%02d", schedule.GetBeginYear(),
+                     schedule.GetBeginMonth(), schedule.GetBeginDay());
+            break;
+        default: {
+            const std::string week = schedule.GetWeekSchedule();
+            for (const NamedWeek& named : kNamedWeeks) {
+                if (week == named.week) {
+                    return named.word;
+                }
+            }
+            std::string days;
+            for (size_t i = 0; i < std::size(kDays) && i < week.size(); ++i) {
+                // From Monday on, as people say it.
+                const size_t day = (i + 1) % std::size(kDays);
+                if (week[day] != '0') {
+                    days += (days.empty() ? "" : ",") + std::string(kDays[day], kShortDay);
+                }
+            }
+            return "weekly " + days;
+        }
+    }
+    return text;
+}
+
+}  // namespace
+
+bool ScheduleWords::Any() const {
+    return manual || on_change || weekly || monthly || yearly || once || at || every || times;
+}
+
+std::string ApplyWords(const ScheduleWords& words, ZEL::Schedule& schedule) {
+    std::string fault = ApplyDays(words, schedule);
+    if (!fault.empty()) {
+        return fault;
+    }
+    const bool has_times = words.at || words.every || words.times;
+    if (has_times && schedule.GetMode() <= ZEL::SCHD_MODE_REALTIME) {
+        return "--at, --every and --times go with --weekly, --monthly, --yearly or --once";
+    }
+    if (words.at) {
+        const auto start = ParseTimeOfDay(*words.at);
+        if (!start) {
+            return "--at: " + Quoted(*words.at) + " is no time HH:MM from 00:00 to 23:59";
+        }
+        schedule.SetStartHour(start->hours);
+        schedule.SetStartMinute(start->minutes);
+    }
+    if (words.every || words.times) {
+        fault = ApplyRepeats(words, schedule);
+    }
+    // A schedule that came from elsewhere may hold any numbers; these bounds keep the sum small.
+    const long period = std::clamp(schedule.GetPeriodSeconds() / 60, 0L, kLastMinuteOfDay + 1L);
+    const long times = std::clamp(schedule.GetRepeatTimesInDay(), 0L, kMaxTimes + 1L);
+    const long start = std::clamp(schedule.GetStartHour(), 0, 24) * 60L +
+                       std::clamp(schedule.GetStartMinute(), 0, 60);
+    const long last = start + period * times;  // minutes
+    if (fault.empty() && last > kLastMinuteOfDay) {
+        fault = "the last of the day's runs would be " + DescribePeriod(last * 60) +
+                " after midnight, on another day: choose an earlier --at, a shorter --every or "
+                "fewer --times";
+    }
+    return fault;
+}
+
+std::string DescribeSchedule(const ZEL::Schedule& schedule) {
+    if (schedule.GetMode() == ZEL::SCHD_MODE_MANUAL) {
+        return "manual";
+    }
+    if (schedule.GetMode() == ZEL::SCHD_MODE_REALTIME) {
+        return "on change";
+    }
+    char start[32];
+    snprintf(start, sizeof start, " %02d:%02d", schedule.GetStartHour(), schedule.GetStartMinute());
+    std::string text = DescribeDays(schedule) + start;
+    if (schedule.GetRepeatTimesInDay() > 0) {
+        text += ", " + std::to_string(schedule.GetRepeatTimesInDay()) + " more every " +
+                DescribePeriod(schedule.GetPeriodSeconds());
+    }
+    return text;
+}
+
+std::optional<CalendarDate> ParseDate(const std::string& text) {
+    const std::vector<int> date = Numbers(text, '-', {4, 2, 2});
+    if (date.empty() || !IsDate(date[0], date[1], date[2])) {
+        return std::nullopt;
+    }
+    return CalendarDate{date[0], date[1], date[2]};
+}
+
+std::optional<TimeOfDay> ParseTimeOfDay(const std::string& text) {
+    const std::vector<int> time = Numbers(text, ':', {2, 2});
+    if (time.empty() || time[0] > 23 || time[1] > 59) {
+        return std::nullopt;
+    }
+    return TimeOfDay{time[0], time[1]};
+}
+
+}  // namespace programs

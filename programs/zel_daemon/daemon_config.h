@@ -1,0 +1,22 @@
+// What an administrator sets in /usr/tarq/etc/zel_daemon.conf; docs/daemon-protocol.md has the
+// keys.
+#pragma once
+
+#include <chrono>
+#include <string>
+
+namespace zel_daemon {
+
+struct DaemonConfig {
+    unsigned int workers = 2;                     ///< runs at the same time
+    std::chrono::milliseconds gather{1000};       ///< quiet time before changes are sent ...
+    std::chrono::milliseconds gather_max{10000};  ///< ... but they wait no longer than this
+    std::chrono::seconds poll{900};  ///< how often what cannot be watched is compared whole
+    std::string group;               ///< whose members may use the socket; empty: nobody's
+};
+
+/// Reads the file; keys that are missing have their defaults. A value that does not pass is told in
+/// `error` ("key: what is wrong with it"), which is empty otherwise, and the defaults come back.
+DaemonConfig ReadDaemonConfig(std::string& error);
+
+}  // namespace zel_daemon

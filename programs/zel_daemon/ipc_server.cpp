@@ -1,0 +1,297 @@
+#include "programs/zel_daemon/ipc_server.h"
+
+#include <grp.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <chrono>
+#include <cstring>
+#include <future>
+#include <stdexcept>
+#include <utility>
+#include <vector>
+
+#include "ZEL/channel.h"
+#include "ZEL/log.h"
+#include "ZEL/stream.h"
+
+namespace zel_daemon {
+
+namespace {
+
+using std::chrono::milliseconds;
+using ZEL::Logger;
+using ZEL::PObject;
+
+constexpr unsigned int kChannelBytes = 81920;      // as an IPCSender's
+constexpr unsigned int kIdleSeconds = 60;          // a connection that asks nothing is closed
+constexpr unsigned int kRefusedSeconds = 5;        // one that may not ask has less time to
+constexpr milliseconds kWatchEvery(200);           // a watcher hears no more often than this ...
+constexpr std::chrono::seconds kWatchAtLeast(30);  // ... and no less
+constexpr std::chrono::seconds kPeerCheck(1);      // how soon a watcher that has gone is noticed
+
+// The socket file is never open to others, not even before its mode is set.
+class Umask {
+public:
+    explicit Umask(mode_t mask) : before_(umask(mask)) {}
+    ~Umask() { umask(before_); }
+    Umask(const Umask&) = delete;
+    Umask& operator=(const Umask&) = delete;
+
+private:
+    mode_t before_;
+};
+
+// Whether the other side asks something more; false when it goes, or is silent for so long.
+bool IsAsking(int fd, unsigned int seconds, const std::function<bool()>& stopped) {
+    for (unsigned int i = 0; i < seconds && !stopped(); ++i) {
+        pollfd watched = {fd, POLLIN, 0};
+        if (poll(&watched, 1, 1000) > 0) {
+            char byte = 0;
+            return recv(fd, &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 1;
+        }
+    }
+    return false;
+}
+
+// Whether the other side still listens.
+bool IsPeerThere(int fd) {
+    pollfd watched = {fd, POLLRDHUP, 0};
+    return poll(&watched, 1, 0) == 0;
+}
+
+bool HasGroup(int fd, const ucred& peer, gid_t group) {
+    if (peer.gid == group) {
+        return true;
+    }
+    std::vector<gid_t> groups(64);
+    for (;;) {
+        auto size = static_cast<socklen_t>(groups.size() * sizeof(gid_t));
+        if (getsockopt(fd, SOL_SOCKET, SO_PEERGROUPS, groups.data(), &size) == 0) {
+            groups.resize(size / sizeof(gid_t));
+            return std::find(groups.begin(), groups.end(), group) != groups.end();
+        }
+        if (errno != ERANGE) {
+            return false;
+        }
+        groups.resize(size / sizeof(gid_t) + 1);
+    }
+}
+
+}  // namespace
+
+/// One connection, on a thread of its own.
+class IpcServer::Session {
+public:
+    Session(IpcServer& server, int fd, bool allowed, const Peer& peer)
+        : server_(server), fd_(fd), peer_(peer), channel_(kChannelBytes) {
+        channel_.SetFlag(&stop_);
+        channel_.SetTimeout(kIdleSeconds);
+        thread_ = std::thread([this, allowed] {
+            Serve(allowed);
+            channel_.Close();
+            ended_ = true;
+        });
+    }
+    ~Session() {
+        Stop();
+        thread_.join();
+    }
+
+    /// Lets the thread end soon.
+    void Stop() { __atomic_store_n(&stop_, 1, __ATOMIC_RELAXED); }
+    bool Stopped() const { return __atomic_load_n(&stop_, __ATOMIC_RELAXED) != 0; }
+    bool Ended() const { return ended_; }
+    bool HasPeer() const { return !Stopped() && IsPeerThere(fd_); }
+
+private:
+    void Serve(bool allowed) {
+        if (channel_.Open(fd_, true) != ZEL::RESULT_SUCCESS) {
+            close(fd_);
+            return;
+        }
+        const unsigned int patience = allowed ? kIdleSeconds : kRefusedSeconds;
+        while (IsAsking(fd_, patience, [this] { return Stopped(); })) {
+            PObject request;
+            if (ZEL::PStream().Recv(channel_, request) != ZEL::RESULT_SUCCESS) {
+                return;
+            }
+            if (!allowed) {
+                PObject refusal;
+                refusal["result"] = static_cast<int>(ZEL::RESULT_NO_PERMISSION);
+                refusal["error"] =
+                    "only root, the daemon's own user and the members of its group "
+                    "(zel_daemon.conf)"
+                    " may ask it";
+                ZEL::PStream().Send(channel_, refusal);
+                return;
+            }
+            if (!Reply(request)) {
+                return;
+            }
+        }
+    }
+
+    bool Send(const PObject& reply) {
+        return ZEL::PStream().Send(channel_, reply) == ZEL::RESULT_SUCCESS;
+    }
+
+    bool Reply(const PObject& request) {
+        uint64_t seen = 0;
+        {
+            const std::lock_guard<std::mutex> lock(server_.mutex_);
+            seen = server_.version_;
+        }
+        PObject reply = Ask(request);
+        if (!Send(reply)) {
+            return false;
+        }
+        if (!Requests::IsWatch(request)) {
+            return true;
+        }
+        std::string shown = reply.toString();
+        while (reply["result"].asInt32() == ZEL::RESULT_SUCCESS) {
+            const bool changed = server_.WaitForChange(*this, seen);
+            if (!HasPeer()) {
+                return false;
+            }
+            reply = Ask(request);
+            std::string now = reply.toString();
+            if (!changed || now != shown) {
+                shown = std::move(now);
+                if (!Send(reply)) {
+                    return false;
+                }
+            }
+        }
+        return true;
+    }
+
+    // Has the loop's thread answer.
+    PObject Ask(const PObject& request) {
+        auto answer = std::make_shared<std::promise<PObject>>();
+        std::future<PObject> future = answer->get_future();
+        server_.loop_.Post([this, answer, &request] {
+            if (!Stopped()) {
+                answer->set_value(server_.handler_(peer_, request));
+            }
+        });
+        // The loop may end before it comes to this.
+        while (future.wait_for(milliseconds(100)) == std::future_status::timeout) {
+            if (Stopped()) {
+                PObject stopped;
+                stopped["result"] = static_cast<int>(ZEL::RESULT_INTERRUPTED);
+                stopped["error"] = "the daemon is being stopped";
+                return stopped;
+            }
+        }
+        return future.get();
+    }
+
+    IpcServer& server_;
+    int fd_;
+    Peer peer_;
+    int stop_ = 0;  // accessed atomically; an int because it is the channel's abort flag
+    std::atomic<bool> ended_{false};
+    ZEL::Channel channel_;
+    std::thread thread_;
+};
+
+IpcServer::IpcServer(EventLoop& loop, const std::string& path, const std::string& group,
+                     Handler handler)
+    : loop_(loop), handler_(std::move(handler)), own_user_(geteuid()) {
+    {
+        const Umask closed(0117);
+        if (listener_.prepare(path) != 0) {
+            throw std::runtime_error("cannot listen at " + path + ": " + strerror(errno));
+        }
+    }
+    if (!group.empty()) {
+        const struct group* entry = getgrnam(group.c_str());
+        if (entry == nullptr) {
+            throw std::runtime_error("there is no group '" + group + "' (zel_daemon.conf)");
+        }
+        group_ = entry->gr_gid;
+        if (chown(path.c_str(), static_cast<uid_t>(-1), group_) != 0) {
+            throw std::runtime_error("cannot give " + path + " to group '" + group +
+                                     "': " + strerror(errno));
+        }
+    }
+    loop_.OnReadable(listener_.getFD(), [this] { Accept(); });
+}
+
+IpcServer::~IpcServer() {
+    for (const auto& session : sessions_) {
+        session->Stop();
+    }
+    Changed();
+}
+
+void IpcServer::Changed() {
+    {
+        const std::lock_guard<std::mutex> lock(mutex_);
+        ++version_;
+    }
+    changed_.notify_all();
+}
+
+bool IpcServer::MayAsk(int fd, Peer& peer) const {
+    ucred who = {};
+    socklen_t size = sizeof who;
+    if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &who, &size) != 0) {
+        return false;
+    }
+    peer.trusted = who.uid == 0 || who.uid == own_user_;
+    return peer.trusted || (group_ != static_cast<gid_t>(-1) && HasGroup(fd, who, group_));
+}
+
+void IpcServer::Accept() {
+    SweepEnded();
+    const int fd = listener_.accept();
+    if (fd < 0) {
+        return;
+    }
+    if (sessions_.size() >= kMaxConnections) {
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] zel_daemon(%d): more than %zu connections: one is refused\n",
+                       __LINE__, kMaxConnections);
+        close(fd);
+        return;
+    }
+    Peer peer;
+    const bool allowed = MayAsk(fd, peer);
+    sessions_.push_back(std::make_unique<Session>(*this, fd, allowed, peer));
+}
+
+void IpcServer::SweepEnded() {
+    sessions_.remove_if([](const std::unique_ptr<Session>& session) { return session->Ended(); });
+}
+
+// Waits until what watchers see has changed since `seen`, or it is time to show that the daemon is
+// there. False in the second case.
+bool IpcServer::WaitForChange(const Session& session, uint64_t& seen) {
+    using std::chrono::steady_clock;
+    std::this_thread::sleep_for(kWatchEvery);
+    const auto until = steady_clock::now() + kWatchAtLeast;
+    std::unique_lock<std::mutex> lock(mutex_);
+    while (version_ == seen) {
+        changed_.wait_for(lock, kPeerCheck);
+        if (version_ == seen && steady_clock::now() >= until) {
+            return false;
+        }
+        lock.unlock();
+        const bool there = session.HasPeer();
+        lock.lock();
+        if (!there) {
+            break;
+        }
+    }
+    seen = version_;
+    return true;
+}
+
+}  // namespace zel_daemon

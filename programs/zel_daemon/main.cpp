@@ -1,0 +1,182 @@
+// zel_daemon: keeps the tasks of a client, and runs each when it is due.
+#include <signal.h>
+#include <sys/file.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <cerrno>
+#include <cstring>
+#include <optional>
+
+#include "ZEL/log.h"
+#include "platform/internal/unique_fd.h"
+#include "programs/common/task_run.h"
+#include "programs/zel_daemon/background.h"
+#include "programs/zel_daemon/daemon_config.h"
+#include "programs/zel_daemon/event_loop.h"
+#include "programs/zel_daemon/ipc_server.h"
+#include "programs/zel_daemon/requests.h"
+#include "programs/zel_daemon/service.h"
+#include "programs/zel_daemon/store.h"
+#include "programs/zel_daemon/zone_watch.h"
+#include "tarq/root_path.h"
+
+namespace {
+
+using namespace zel_daemon;
+using ZEL::Logger;
+
+constexpr char kStorePath[] = "/usr/tarq/etc/zel_daemon/tasks.db";
+constexpr char kSocketPath[] = "/var/run/zel_daemon.sock";
+constexpr char kLockPath[] = "/var/run/zel_daemon.lock";
+constexpr int kRotatedLogs = 5;
+
+enum ExitCode : int { kEnded = 0, kFailed = 1, kUsage = 2 };
+
+struct Options {
+    bool foreground = false;
+    std::string log = "syslog";
+    int level = Logger::LEVEL_NOTE;
+};
+
+void StartLog(const Options& options) {
+    const auto type = options.log == "syslog"   ? Logger::SYSLOG
+                      : options.log == "stderr" ? Logger::STDERR
+                                                : Logger::LOGFILE;
+    if (Logger::Initialize(type, options.level, options.log, kRotatedLogs) != 0) {
+        throw std::runtime_error("cannot write the log " + options.log + ": " + strerror(errno));
+    }
+}
+
+// Two daemons on one store would run every task twice. The lock goes with the process.
+tarq_internal::UniqueFd TakeLock() {
+    const std::string path = TARQ::RootPath(kLockPath);
+    tarq_internal::UniqueFd lock(open(path.c_str(), O_CREAT | O_RDWR | O_CLOEXEC, 0600));
+    if (!lock) {
+        throw std::runtime_error("cannot open " + path + ": " + strerror(errno));
+    }
+    if (flock(lock.Get(), LOCK_EX | LOCK_NB) != 0) {
+        throw std::runtime_error("another zel_daemon runs already (it holds " + path + ")");
+    }
+    return lock;
+}
+
+void PrepareFolders() {
+    const std::string problem = programs::PrepareHost();
+    if (!problem.empty()) {
+        throw std::runtime_error(problem);
+    }
+    std::error_code error;
+    const std::string run = TARQ::RootPath("/var/run");
+    std::filesystem::create_directories(run, error);
+    if (error) {
+        throw std::runtime_error("cannot make " + run + ": " + error.message());
+    }
+}
+
+DaemonConfig ReadConfigOrThrow() {
+    std::string error;
+    DaemonConfig config = ReadDaemonConfig(error);
+    if (!error.empty()) {
+        throw std::runtime_error(error);
+    }
+    return config;
+}
+
+void Serve(const Options& options) {
+    std::optional<Background> background;
+    if (!options.foreground) {
+        background.emplace();
+    }
+    StartLog(options);
+    PrepareFolders();
+    const tarq_internal::UniqueFd lock = TakeLock();
+    const DaemonConfig config = ReadConfigOrThrow();
+
+    EventLoop loop;
+    loop.OnSignal(SIGTERM, [&] { loop.Stop(); });
+    loop.OnSignal(SIGINT, [&] { loop.Stop(); });
+    const std::string store_path = TARQ::RootPath(kStorePath);
+    Store store(store_path);
+    const SystemClock clock;
+    std::optional<IpcServer> server;
+    Service service(loop, clock, store, config, [&] {
+        if (server) {
+            server->Changed();
+        }
+    });
+    const auto reload = [&] {
+        std::string error;
+        const DaemonConfig changed = ReadDaemonConfig(error);
+        if (error.empty()) {
+            service.SetConfig(changed);
+        }
+        service.Refresh();
+        return error;
+    };
+    Requests requests(service, reload, store_path);
+    loop.OnSignal(SIGHUP, [&] {
+        const std::string error = reload();
+        if (!error.empty()) {
+            Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__,
+                           error.c_str());
+        }
+    });
+    loop.OnClockSet([&] { service.Refresh(); });
+    ZoneWatch zone;
+    if (zone.Fd() >= 0) {
+        loop.OnReadable(zone.Fd(), [&] {
+            if (zone.Changed()) {
+                service.Refresh();
+            }
+        });
+    }
+    service.Start();
+    server.emplace(loop, TARQ::RootPath(kSocketPath), config.group,
+                   [&](const Peer& peer, const ZEL::PObject& request) {
+                       return requests.Answer(peer, request);
+                   });
+    if (background) {
+        background->Ready();
+    }
+    sd_notify(0, "READY=1");
+    Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] zel_daemon(%d): ready, %zu tasks\n", __LINE__,
+                   service.Stats().tasks);
+    loop.Run();
+    sd_notify(0, "STOPPING=1");
+    Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] zel_daemon(%d): stopping\n", __LINE__);
+    server.reset();
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    CLI::App app{"Keeps the sync tasks of this machine, and runs each when it is due"};
+    app.name("zel_daemon");
+    app.set_version_flag("--version", ZEL_VERSION);
+    Options options;
+    app.add_flag("--foreground", options.foreground, "Stay in the foreground");
+    app.add_option("--log", options.log, "syslog, stderr, or a file's path")->capture_default_str();
+    const std::map<std::string, int> levels = {{"error", Logger::LEVEL_ERROR},
+                                               {"warning", Logger::LEVEL_WARNING},
+                                               {"note", Logger::LEVEL_NOTE},
+                                               {"info", Logger::LEVEL_INFO},
+                                               {"debug", Logger::LEVEL_DEBUG}};
+    app.add_option("--log-level", options.level, "error, warning, note, info or debug")
+        ->transform(CLI::CheckedTransformer(levels, CLI::ignore_case))
+        ->default_str("note");
+    try {
+        app.parse(argc, argv);
+    } catch (const CLI::ParseError& error) {
+        return app.exit(error) == 0 ? kEnded : kUsage;
+    }
+    try {
+        Serve(options);
+    } catch (const std::exception& error) {
+        fprintf(stderr, "zel_daemon: %s\n", error.what());
+        Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__, error.what());
+        return kFailed;
+    }
+    return kEnded;
+}

@@ -1,0 +1,351 @@
+#include "programs/zel_daemon/store.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <system_error>
+
+#include "platform/internal/unique_fd.h"
+#include "programs/zel_daemon/store_schema.h"
+#include "programs/zel_daemon/task_row.h"
+
+namespace zel_daemon {
+
+namespace {
+
+using tarq_internal::UniqueFd;
+
+constexpr char kStopped[] = "the daemon was stopped";
+
+constexpr char kRunColumns[] =
+    "id, task, reason, start_time, end_time, result, status, error, files_sent, files_deleted, "
+    "bytes_sent, rsync_runs";
+
+void ThrowErrno(const std::string& what) {
+    throw std::system_error(errno, std::generic_category(), what);
+}
+
+std::string FolderOf(const std::string& path) {
+    const size_t slash = path.rfind('/');
+    return slash == std::string::npos ? "." : path.substr(0, std::max<size_t>(slash, 1));
+}
+
+// An entry that was made in the folder survives a power cut from here on.
+void SyncFolder(const std::string& folder) {
+    const UniqueFd fd(open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!fd || fsync(fd.Get()) != 0) {
+        ThrowErrno(folder);
+    }
+}
+
+// The file and its folder, for the daemon alone: tasks have passwords. SQLite gives its own files
+// beside the file the file's mode.
+void MakePrivateFile(const std::string& path) {
+    const std::string folder = FolderOf(path);
+    if (mkdir(folder.c_str(), 0700) == 0) {
+        SyncFolder(FolderOf(folder));
+    } else if (errno != EEXIST) {
+        ThrowErrno(folder);
+    }
+    const UniqueFd fresh(open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
+    if (fresh) {
+        SyncFolder(folder);
+    } else if (errno != EEXIST) {
+        ThrowErrno(path);
+    }
+    struct stat info = {};
+    if (stat(path.c_str(), &info) != 0 ||
+        ((info.st_mode & 0077) != 0 && chmod(path.c_str(), 0600) != 0)) {
+        ThrowErrno(path);
+    }
+}
+
+constexpr char kMakeRoom[] = "the disk is full; make room on it";
+
+const char* Advice(const std::error_code& error) {
+    return error == std::errc::no_space_on_device || error.value() == EDQUOT
+               ? kMakeRoom
+               : "see that the daemon's user may write there";
+}
+
+const char* Advice(const SqliteError& error) {
+    switch (error.Code()) {
+        case SQLITE_CONSTRAINT_UNIQUE:
+            return "the name is taken; choose another one";
+        case SQLITE_CONSTRAINT_FOREIGNKEY:
+            return "there is no such task";
+        default:
+            break;
+    }
+    switch (error.PrimaryCode()) {
+        case SQLITE_CORRUPT:
+        case SQLITE_NOTADB:
+            return "the file is damaged and is left as it is; stop the daemon, move the file and "
+                   "those beside it that begin with its name away, and put back a copy or add the "
+                   "tasks anew";
+        case SQLITE_FULL:
+            return kMakeRoom;
+        case SQLITE_READONLY:
+        case SQLITE_CANTOPEN:
+        case SQLITE_PERM:
+            return "see that the daemon's user may write to the file and to its folder";
+        case SQLITE_BUSY:
+        case SQLITE_LOCKED:
+            return "another program is using the file; end it and try again";
+        case SQLITE_IOERR:
+            return "look for errors of the disk in the system's log";
+        default:
+            return "see the daemon's log";
+    }
+}
+
+RunRecord ReadRun(Query& query) {
+    RunRecord run;
+    run.id = static_cast<uint64_t>(query.Number());
+    run.task_id = static_cast<uint64_t>(query.Number());
+    run.reason = static_cast<RunReason>(query.Number());
+    run.start = query.Number();
+    run.end = query.Number();
+    run.result = static_cast<ZEL::TASK_RESULT>(query.Number());
+    run.status = static_cast<int>(query.Number());
+    run.error = query.Text();
+    run.files_sent = static_cast<uint64_t>(query.Number());
+    run.files_deleted = static_cast<uint64_t>(query.Number());
+    run.bytes_sent = static_cast<uint64_t>(query.Number());
+    run.rsync_runs = static_cast<uint64_t>(query.Number());
+    return run;
+}
+
+template <typename Record>
+std::vector<Record> ReadAll(Query&& query, Record (*read)(Query&)) {
+    std::vector<Record> records;
+    while (query.Next()) {
+        records.push_back(read(query));
+    }
+    return records;
+}
+
+}  // namespace
+
+struct Store::Impl {
+    explicit Impl(const std::string& file) : path(file) {}
+
+    // Does `work`, and words every failure: the file, what failed, why, and what to do.
+    template <typename Work>
+    auto Do(const std::string& what, Work work) const {
+        const auto fail = [&](const std::string& why) {
+            return StoreError(path + ": cannot " + what + ": " + why);
+        };
+        try {
+            return work();
+        } catch (const SqliteError& error) {
+            throw fail(error.what() + std::string("; ") + Advice(error));
+        } catch (const SchemaError& error) {
+            throw fail(error.what());
+        } catch (const RowError& error) {
+            throw fail(error.what() + std::string("; mend it, or remove the row, in the sqlite3 "
+                                                  "shell while the daemon is stopped"));
+        } catch (const std::system_error& error) {
+            throw fail(error.what() + std::string("; ") + Advice(error.code()));
+        }
+    }
+
+    // The same, as a whole or not at all.
+    template <typename Work>
+    auto Change(const std::string& what, Work work) {
+        return Do(what, [&] {
+            Transaction transaction(*database);
+            if constexpr (std::is_void_v<decltype(work())>) {
+                work();
+                transaction.Commit();
+            } else {
+                const auto result = work();
+                transaction.Commit();
+                return result;
+            }
+        });
+    }
+
+    void ForEach(const std::string& what, const std::vector<uint64_t>& ids, const char* statement) {
+        Change(what, [&] {
+            for (const uint64_t id : ids) {
+                Query(*database, statement, id).Run();
+            }
+        });
+    }
+
+    const std::string path;
+    std::optional<Database> database;
+};
+
+Store::Store(const std::string& path) : impl_(std::make_unique<Impl>(path)) {
+    impl_->Do("open the store", [&] {
+        MakePrivateFile(path);
+        Database& database = impl_->database.emplace(path);
+        if (database.IsReadOnly()) {
+            throw SqliteError(SQLITE_READONLY, sqlite3_errstr(SQLITE_READONLY));
+        }
+        BringUpToDate(database, StoreSchema());
+        // What an operation has answered stays, through a power cut too.
+        database.Execute(
+            "PRAGMA journal_mode = WAL; PRAGMA synchronous = FULL; PRAGMA foreign_keys = ON; "
+            "PRAGMA cell_size_check = ON");
+    });
+    // When a run was cut off nobody knows: its start is what is sure. No time at all would make it
+    // run for ever.
+    impl_->Change("take up the runs that were cut off", [&] {
+        Query(*impl_->database,
+              "UPDATE runs SET end_time = max(start_time, 1), result = ?, error = ? "
+              "WHERE end_time = 0",
+              ZEL::TASK_RESULT_FAILED + 0, std::string(kStopped))
+            .Run();
+        impl_->database->Execute("UPDATE OR REPLACE events SET status = 0 WHERE status = 1");
+    });
+}
+
+Store::~Store() = default;
+
+std::vector<TaskRecord> Store::Tasks() {
+    return impl_->Do("read the tasks", [&] {
+        return ReadAll(
+            Query(*impl_->database, "SELECT id, " + TaskColumns() + " FROM tasks ORDER BY id"),
+            ReadTask);
+    });
+}
+
+uint64_t Store::AddTask(const TaskRecord& record) {
+    return impl_->Change("store task '" + record.Name() + "'", [&] {
+        Query query(*impl_->database,
+                    "INSERT INTO tasks (" + TaskColumns() + ") VALUES (" + TaskParameters() + ")");
+        BindTask(query, record);
+        query.Run();
+        return impl_->database->LastId();
+    });
+}
+
+void Store::UpdateTask(const TaskRecord& record) {
+    impl_->Change("store task '" + record.Name() + "'", [&] {
+        Query query(*impl_->database, "UPDATE tasks SET (" + TaskColumns() + ") = (" +
+                                          TaskParameters() + ") WHERE id = ?");
+        BindTask(query, record);
+        query.Bind(record.ID());
+        query.Run();
+        if (impl_->database->Changes() == 0) {
+            throw SqliteError(SQLITE_CONSTRAINT_FOREIGNKEY, "id " + std::to_string(record.ID()));
+        }
+    });
+}
+
+void Store::RemoveTask(uint64_t id) {
+    impl_->Change("remove a task",
+                  [&] { Query(*impl_->database, "DELETE FROM tasks WHERE id = ?", id).Run(); });
+}
+
+void Store::AddEvents(uint64_t task_id, const std::string& share,
+                      const std::vector<std::string>& paths) {
+    impl_->Change("store changes", [&] {
+        for (const std::string& path : paths) {
+            Query(*impl_->database,
+                  "INSERT INTO events (task, status, share, path) VALUES (?, 0, ?, ?) "
+                  "ON CONFLICT DO NOTHING",
+                  task_id, share, path)
+                .Run();
+        }
+    });
+}
+
+std::vector<ZEL::Event> Store::PendingEvents(uint64_t task_id) {
+    return impl_->Do("read the changes", [&] {
+        return ReadAll<ZEL::Event>(
+            Query(*impl_->database,
+                  "SELECT id, share, path FROM events WHERE task = ? AND status = 0 ORDER BY id",
+                  task_id),
+            [](Query& query) {
+                ZEL::Event event;
+                event.SetID(static_cast<uint64_t>(query.Number()));
+                event.SetShareName(query.Text());
+                event.SetRelativePath(query.Text());
+                return event;
+            });
+    });
+}
+
+// A change that comes to another one of the same path in the same state takes its place.
+void Store::MarkSending(const std::vector<uint64_t>& ids) {
+    impl_->ForEach("mark changes as being sent", ids,
+                   "UPDATE OR REPLACE events SET status = 1 WHERE id = ?");
+}
+
+void Store::RemoveEvents(const std::vector<uint64_t>& ids) {
+    impl_->ForEach("remove changes that were sent", ids, "DELETE FROM events WHERE id = ?");
+}
+
+void Store::ReturnEvents(const std::vector<uint64_t>& ids) {
+    impl_->ForEach("take back changes", ids,
+                   "UPDATE OR REPLACE events SET status = 0 WHERE id = ?");
+}
+
+uint64_t Store::CountEvents(uint64_t task_id) {
+    return impl_->Do("count the changes", [&] {
+        Query query(*impl_->database, "SELECT count(*) FROM events WHERE task = ?", task_id);
+        query.Next();
+        return static_cast<uint64_t>(query.Number());
+    });
+}
+
+void Store::ClearEvents(uint64_t task_id) {
+    impl_->Change("forget changes", [&] {
+        Query(*impl_->database, "DELETE FROM events WHERE task = ?", task_id).Run();
+    });
+}
+
+uint64_t Store::BeginRun(uint64_t task_id, RunReason reason, int64_t start) {
+    return impl_->Change("note the beginning of a run", [&] {
+        Query(*impl_->database, "INSERT INTO runs (task, reason, start_time) VALUES (?, ?, ?)",
+              task_id, static_cast<int>(reason), start)
+            .Run();
+        const uint64_t id = impl_->database->LastId();
+        Query(*impl_->database,
+              "DELETE FROM runs WHERE task = ?1 AND id <= "
+              "(SELECT id FROM runs WHERE task = ?1 ORDER BY id DESC LIMIT 1 OFFSET ?2)",
+              task_id, kRunsKept)
+            .Run();
+        return id;
+    });
+}
+
+void Store::EndRun(const RunRecord& run) {
+    impl_->Change("note the end of a run", [&] {
+        Query(*impl_->database,
+              "UPDATE runs SET end_time = ?, result = ?, status = ?, error = ?, files_sent = ?, "
+              "files_deleted = ?, bytes_sent = ?, rsync_runs = ? WHERE id = ?",
+              run.end, static_cast<int>(run.result), run.status, run.error, run.files_sent,
+              run.files_deleted, run.bytes_sent, run.rsync_runs, run.id)
+            .Run();
+    });
+}
+
+std::vector<RunRecord> Store::Runs(uint64_t task_id, unsigned int limit) {
+    return impl_->Do("read the history", [&] {
+        return ReadAll(Query(*impl_->database,
+                             std::string("SELECT ") + kRunColumns +
+                                 " FROM runs WHERE task = ? ORDER BY id DESC LIMIT ?",
+                             task_id, limit),
+                       ReadRun);
+    });
+}
+
+std::vector<RunRecord> Store::LastRuns() {
+    return impl_->Do("read the history", [&] {
+        return ReadAll(Query(*impl_->database,
+                             std::string("SELECT ") + kRunColumns +
+                                 " FROM runs WHERE id IN (SELECT (SELECT max(id) FROM runs WHERE "
+                                 "task = tasks.id) FROM tasks) ORDER BY task"),
+                       ReadRun);
+    });
+}
+
+}  // namespace zel_daemon

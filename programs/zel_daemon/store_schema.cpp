@@ -1,0 +1,100 @@
+#include "programs/zel_daemon/store_schema.h"
+
+#include <string>
+
+namespace zel_daemon {
+
+namespace {
+
+// Marks the file as a store ("ZELd"), so that no other program's database is ever written to.
+constexpr int64_t kApplicationId = 0x5a454c64;
+
+// Columns of tasks are named like the keys of a task's map. Lists are JSON arrays. Ids are never
+// used again: a late answer about what is gone meets nothing.
+constexpr char kFirst[] = R"(
+CREATE TABLE tasks (
+    id INTEGER PRIMARY KEY AUTOINCREMENT,
+    name TEXT NOT NULL UNIQUE,
+    share_list TEXT NOT NULL,
+    user TEXT NOT NULL,
+    pswd TEXT NOT NULL,
+    server_ip TEXT NOT NULL,
+    server_name TEXT NOT NULL,
+    compress INTEGER NOT NULL,
+    block INTEGER NOT NULL,
+    ssh INTEGER NOT NULL,
+    ssh_port INTEGER NOT NULL,
+    max_bandwidth INTEGER NOT NULL,
+    rsync_timeout INTEGER NOT NULL,
+    schedule_mode INTEGER NOT NULL,        -- 0 manual, 1 realtime, 2 weekly, 3 monthly, 4 yearly, 5 once
+    week_schd TEXT NOT NULL,               -- from Sunday to Saturday
+    repeat_times_in_day INTEGER NOT NULL,
+    period_hour INTEGER NOT NULL,
+    period_minute INTEGER NOT NULL,
+    schedule_begin_year INTEGER NOT NULL,
+    schedule_begin_month INTEGER NOT NULL,
+    schedule_begin_day INTEGER NOT NULL,
+    schedule_begin_hour INTEGER NOT NULL,
+    schedule_begin_min INTEGER NOT NULL,
+    exclude TEXT NOT NULL,
+    paused INTEGER NOT NULL,
+    checked_until INTEGER NOT NULL,        -- seconds since the epoch
+    whole_due INTEGER NOT NULL
+);
+CREATE TABLE events (
+    id INTEGER PRIMARY KEY AUTOINCREMENT,
+    task INTEGER NOT NULL REFERENCES tasks (id) ON DELETE CASCADE,
+    status INTEGER NOT NULL,               -- 0 waits, 1 is being sent
+    share TEXT NOT NULL,
+    path TEXT NOT NULL,
+    UNIQUE (task, status, share, path)
+);
+CREATE TABLE runs (
+    id INTEGER PRIMARY KEY AUTOINCREMENT,
+    task INTEGER NOT NULL REFERENCES tasks (id) ON DELETE CASCADE,
+    reason INTEGER NOT NULL,               -- 0 schedule, 1 change, 2 request, 3 retry
+    start_time INTEGER NOT NULL,           -- seconds since the epoch
+    end_time INTEGER NOT NULL DEFAULT 0,   -- 0 while it runs
+    result INTEGER NOT NULL DEFAULT 0,     -- 1 success, 2 failed, 3 cancelled
+    status INTEGER NOT NULL DEFAULT 0,
+    error TEXT NOT NULL DEFAULT '',
+    files_sent INTEGER NOT NULL DEFAULT 0,
+    files_deleted INTEGER NOT NULL DEFAULT 0,
+    bytes_sent INTEGER NOT NULL DEFAULT 0,
+    rsync_runs INTEGER NOT NULL DEFAULT 0
+);
+CREATE INDEX runs_of_task ON runs (task, id);
+CREATE INDEX runs_not_ended ON runs (id) WHERE end_time = 0;
+)";
+
+}  // namespace
+
+const SchemaSteps& StoreSchema() {
+    static const SchemaSteps steps = {kFirst};
+    return steps;
+}
+
+void BringUpToDate(Database& database, const SchemaSteps& steps) {
+    const int64_t application = database.Number("PRAGMA application_id");
+    const int64_t version = database.Number("PRAGMA user_version");
+    const bool empty = application == 0 && version == 0 &&
+                       database.Number("SELECT count(*) FROM sqlite_schema") == 0;
+    if (!empty && application != kApplicationId) {
+        throw SchemaError("it is a database of another program; name another file");
+    }
+    const auto known = static_cast<int64_t>(steps.size());
+    if (version < 0 || version > known) {
+        throw SchemaError("its layout has version " + std::to_string(version) +
+                          ", and this program knows versions up to " + std::to_string(known) +
+                          "; install the newer program again, or put back a copy of the file");
+    }
+    for (int64_t step = version; step < known; ++step) {
+        Transaction transaction(database);
+        database.Execute(steps[static_cast<size_t>(step)]);
+        database.Execute(("PRAGMA application_id = " + std::to_string(kApplicationId)).c_str());
+        database.Execute(("PRAGMA user_version = " + std::to_string(step + 1)).c_str());
+        transaction.Commit();
+    }
+}
+
+}  // namespace zel_daemon

@@ -1,0 +1,188 @@
+#include "programs/zelctl/samba.h"
+
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <set>
+#include <sstream>
+
+#include "programs/common/text.h"
+#include "programs/zelctl/child_output.h"
+#include "programs/zelctl/shares.h"
+
+namespace zelctl {
+
+namespace {
+
+using programs::Printable;
+
+constexpr const char* kOwnSections[] = {"global", "homes", "printers", "print$", "ipc$"};
+
+std::string Trimmed(const std::string& text) {
+    const char* const blanks = " \t\r\n";
+    const size_t begin = text.find_first_not_of(blanks);
+    return begin == std::string::npos
+               ? ""
+               : text.substr(begin, text.find_last_not_of(blanks) - begin + 1);
+}
+
+// Samba folds names like this; those of the catalogue differ in more than capitals as well.
+std::string Folded(std::string text) {
+    std::transform(text.begin(), text.end(), text.begin(), [](char c) {
+        return static_cast<char>(c >= 'A' && c <= 'Z' ? c - 'A' + 'a' : c);
+    });
+    return text;
+}
+
+bool IsYes(const std::string& value) {
+    const std::string folded = Folded(value);
+    return folded == "yes" || folded == "true" || folded == "1";
+}
+
+/// One section, as its lines come.
+struct Section {
+    std::string name;
+    std::string path;
+    bool printable = false;
+    bool available = true;
+
+    void Take(const std::string& key, const std::string& value) {
+        if (key == "path" || key == "directory") {
+            path = value;
+        } else if (key == "printable" || key == "print ok") {
+            printable = IsYes(value);
+        } else if (key == "available") {
+            available = IsYes(value);
+        }
+    }
+
+    bool IsShare() const {
+        const auto* const own =
+            std::find(std::begin(kOwnSections), std::end(kOwnSections), Folded(name));
+        return !name.empty() && !printable && own == std::end(kOwnSections);
+    }
+
+    std::string Refusal() const {
+        if (path.empty()) {
+            return "it names no folder";
+        }
+        if (path.find('%') != std::string::npos) {
+            return "its folder " + path + " is another one for each user or client";
+        }
+        if (path.front() != '/') {
+            return "its folder " + path + " is no absolute path";
+        }
+        return available ? "" : "Samba has it switched off (available = no)";
+    }
+};
+
+std::string FaultOfFolder(const std::string& path) {
+    struct stat info = {};
+    if (stat(path.c_str(), &info) != 0) {
+        return "its folder " + path + " is not available: " + strerror(errno);
+    }
+    return S_ISDIR(info.st_mode) ? "" : path + " is no folder";
+}
+
+// The shares that are wanted, or all; names that Samba does not know are told.
+ExitCode Choose(const std::vector<std::string>& names, std::vector<SambaShare>& shares) {
+    if (names.empty()) {
+        return kOk;
+    }
+    std::vector<SambaShare> chosen;
+    ExitCode result = kOk;
+    for (const std::string& name : names) {
+        const auto found = std::find_if(shares.begin(), shares.end(), [&](const SambaShare& share) {
+            return Folded(share.name) == Folded(name);
+        });
+        if (found == shares.end()) {
+            result = Fail(kLocal, "Samba has no share '%s'", Printable(name).c_str());
+        } else {
+            chosen.push_back(*found);
+        }
+    }
+    shares = std::move(chosen);
+    return result;
+}
+
+}  // namespace
+
+std::vector<SambaShare> ParseSambaShares(const std::string& text) {
+    std::vector<Section> sections;
+    std::istringstream lines(text);
+    for (std::string line; std::getline(lines, line);) {
+        line = Trimmed(line);
+        if (line.empty() || line.front() == '#' || line.front() == ';') {
+            continue;
+        }
+        if (line.front() == '[' && line.back() == ']') {
+            sections.emplace_back();
+            sections.back().name = Trimmed(line.substr(1, line.size() - 2));
+            continue;
+        }
+        const size_t equals = line.find('=');
+        if (equals != std::string::npos && !sections.empty()) {
+            sections.back().Take(Folded(Trimmed(line.substr(0, equals))),
+                                 Trimmed(line.substr(equals + 1)));
+        }
+    }
+    std::vector<SambaShare> shares;
+    for (const Section& section : sections) {
+        if (section.IsShare()) {
+            shares.push_back({section.name, section.path, section.Refusal()});
+        }
+    }
+    return shares;
+}
+
+ExitCode ImportSambaShares(const std::string& config, const std::vector<std::string>& names,
+                           bool dry_run) {
+    std::vector<std::string> command = {"testparm", "-s"};
+    if (!config.empty()) {
+        command.push_back(config);
+    }
+    const ChildOutput answer = RunAndRead(command);
+    if (!answer.failure.empty()) {
+        return Fail(kLocal, "%s; it belongs to the package samba-common-bin",
+                    Printable(answer.failure).c_str());
+    }
+    if (answer.exit_code != 0) {
+        std::string errors = Trimmed(answer.errors);
+        std::replace(errors.begin(), errors.end(), '\n', ' ');
+        return Fail(kLocal, "testparm cannot read the configuration: %s",
+                    Printable(errors).c_str());
+    }
+    std::vector<SambaShare> shares = ParseSambaShares(answer.output);
+    ExitCode result = Choose(names, shares);
+    std::set<std::string> there;
+    const auto known = ShareNames();
+    if (!known) {
+        return kLocal;
+    }
+    std::transform(known->begin(), known->end(), std::inserter(there, there.end()), Folded);
+    if (shares.empty() && result == kOk) {
+        puts("Samba has no shares to take over.");
+    }
+    for (const SambaShare& share : shares) {
+        const std::string name = Printable(share.name);
+        const std::string refusal =
+            share.refusal.empty() ? FaultOfFolder(share.path) : share.refusal;
+        if (there.count(Folded(share.name)) != 0) {
+            printf("Share '%s' is in the catalogue already; it stays as it is\n", name.c_str());
+        } else if (!refusal.empty()) {
+            result = Fail(kLocal, "share '%s' is left out: %s", name.c_str(),
+                          Printable(refusal).c_str());
+        } else if (dry_run) {
+            printf("Share '%s' would be %s\n", name.c_str(), Printable(share.path).c_str());
+        } else {
+            const ExitCode added = AddShare(share.name, share.path, false, true);
+            result = added == kOk ? result : added;
+        }
+    }
+    return result;
+}
+
+}  // namespace zelctl

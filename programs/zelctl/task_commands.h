@@ -1,0 +1,29 @@
+// The commands about tasks; the daemon keeps them.
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "programs/zelctl/exit_codes.h"
+#include "programs/zelctl/task_options.h"
+
+namespace zelctl {
+
+/// `password_file`: as programs::ReadPassword takes it.
+ExitCode AddTask(const std::string& name, const TaskOptions& options,
+                 const std::string& password_file);
+/// `new_name` is empty unless the task is to be renamed. The password stays unless `new_password`
+/// or a file is given.
+ExitCode EditTask(const std::string& name, const TaskOptions& options, const std::string& new_name,
+                  bool new_password, const std::string& password_file);
+ExitCode ListTasks(bool as_json);
+ExitCode ShowTask(const std::string& name, bool as_json);
+/// `command` is one that says no more than the task's name: "task_remove", "task_cancel",
+/// "task_pause" or "task_resume"; `done` what has happened then.
+ExitCode TellTask(const char* command, const std::string& name, const char* done);
+ExitCode ShowTaskLog(const std::string& name, unsigned int limit, bool as_json);
+ExitCode ShowTaskRuns(const std::string& name, unsigned int count, bool as_json);
+ExitCode ShowDaemonStatus(bool as_json);
+ExitCode ReloadDaemon();
+
+}  // namespace zelctl

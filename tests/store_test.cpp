@@ -1,0 +1,536 @@
+#include "programs/zel_daemon/store.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <map>
+#include <random>
+#include <set>
+
+#include "programs/zel_daemon/store_schema.h"
+#include "tests/support/temp_root.h"
+
+namespace {
+
+using namespace std::string_literals;
+using testing::AllOf;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+using testing::UnorderedElementsAre;
+using zel_daemon::Database;
+using zel_daemon::Query;
+using zel_daemon::RunReason;
+using zel_daemon::RunRecord;
+using zel_daemon::Store;
+using zel_daemon::StoreError;
+using zel_daemon::TaskRecord;
+
+TaskRecord Task(const std::string& name) {
+    TaskRecord record;
+    record.task.GetInfo().SetName(name);
+    return record;
+}
+
+std::string Text(const TaskRecord& record) {
+    ZEL::PObject map;
+    ZEL::SyncTask2PObj(record.task, map);
+    std::string text = map.toString();
+    for (const std::string& exclude : record.excludes) {
+        text += " -" + exclude;
+    }
+    return text + " " + std::to_string(record.paused) + std::to_string(record.whole_due) + " " +
+           std::to_string(record.checked_until);
+}
+
+std::string Fault(const std::function<void()>& work) {
+    try {
+        work();
+    } catch (const StoreError& error) {
+        return error.what();
+    }
+    return "none";
+}
+
+mode_t ModeOf(const std::string& path) {
+    struct stat info = {};
+    return stat(path.c_str(), &info) == 0 ? info.st_mode & 07777 : 0;
+}
+
+class StoreTest : public testing::Test {
+protected:
+    void Reopen() {
+        store_.reset();
+        store_ = std::make_unique<Store>(path_);
+    }
+    std::string OpenFault() const {
+        return Fault([&] { const Store store(path_); });
+    }
+    // The waiting changes, as "share path".
+    std::vector<std::string> Pending(uint64_t task) {
+        std::vector<std::string> pending;
+        for (const ZEL::Event& event : store_->PendingEvents(task)) {
+            pending.push_back(event.GetShareName() + " " + event.GetRelativePath());
+        }
+        return pending;
+    }
+    std::vector<uint64_t> PendingIds(uint64_t task) {
+        std::vector<uint64_t> ids;
+        for (const ZEL::Event& event : store_->PendingEvents(task)) {
+            ids.push_back(event.GetID());
+        }
+        return ids;
+    }
+    // What a person sees in the shell.
+    std::string Shell(const std::string& statement) const {
+        Database database(path_);
+        Query query(database, statement);
+        return query.Next() ? query.Text() : "";
+    }
+
+    const test::TempFolder folder_;
+    const std::string path_ = folder_.Path("daemon/tasks.db");
+    std::unique_ptr<Store> store_ = std::make_unique<Store>(path_);
+};
+
+TEST_F(StoreTest, KeepsEveryFieldOfATask) {
+    TaskRecord record;
+    ZEL::PObject map;
+    map = ZEL::PObject::Map{{"user", "5"},  // text, though it looks like a number
+                            {"pswd", "p\xff"},
+                            {"server_ip", "10.0.0.5"},
+                            {"server_name", "cellar"},
+                            {"block", 1},
+                            {"ssh", 1},
+                            {"ssh_port", 2222},
+                            {"max_bandwidth", -1},
+                            {"rsync_timeout", 900},
+                            {"schedule_mode", 4},
+                            {"week_schd", "0100010"},
+                            {"repeat_times_in_day", -3},
+                            {"period_hour", 1},
+                            {"period_minute", 30},
+                            {"schedule_begin_year", 16},
+                            {"schedule_begin_month", 2},
+                            {"schedule_begin_day", 29},
+                            {"schedule_begin_hour", 8},
+                            {"schedule_begin_min", 31}};
+    ZEL::PObj2SyncTask(map, record.task);
+    record.task.GetInfo().SetName("n\xffi\0ghtly"s);
+    record.task.GetInfo().SetShareList({"photo", "\xfe\0x"s, "it's \"q\"\n", ""});
+    record.excludes = {"*.tmp", "\xff*", "#re*"};
+    record.paused = true;
+    record.checked_until = INT64_MAX;
+    const uint64_t id = store_->AddTask(record);
+    record.task.SetID(id);
+    Reopen();
+    ASSERT_EQ(store_->Tasks().size(), 1U);
+    EXPECT_EQ(Text(store_->Tasks()[0]), Text(record));
+
+    record.task.GetInfo().SetName("Fotos täglich");
+    record.paused = false;
+    record.whole_due = true;
+    store_->UpdateTask(record);
+    EXPECT_EQ(Text(store_->Tasks()[0]), Text(record));
+    EXPECT_EQ(Shell("SELECT name FROM tasks WHERE name = 'Fotos täglich' AND ssh_port = 2222"),
+              "Fotos täglich");
+    EXPECT_EQ(Shell("SELECT share_list FROM tasks"), R"(["photo",[254,0,120],"it's \"q\"\n",""])");
+}
+
+TEST_F(StoreTest, NamesAreUniqueAndIdsAreNeverUsedAgain) {
+    const uint64_t first = store_->AddTask(Task("a"));
+    const uint64_t second = store_->AddTask(Task("b"));
+    EXPECT_THAT(Fault([&] { store_->AddTask(Task("a")); }),
+                AllOf(HasSubstr(path_), HasSubstr("'a'"), HasSubstr("choose another")));
+    TaskRecord renamed = Task("a");
+    renamed.task.SetID(second);
+    EXPECT_THAT(Fault([&] { store_->UpdateTask(renamed); }), HasSubstr("choose another"));
+    renamed.task.SetID(second + 1);
+    EXPECT_THAT(Fault([&] { store_->UpdateTask(renamed); }), HasSubstr("no such task"));
+    EXPECT_EQ(store_->Tasks()[1].Name(), "b");
+    store_->RemoveTask(second);
+    EXPECT_GT(store_->AddTask(Task("b")), second);
+    store_->RemoveTask(first);
+    ASSERT_EQ(store_->Tasks().size(), 1U);
+    EXPECT_EQ(store_->Tasks()[0].Name(), "b");
+}
+
+TEST_F(StoreTest, AChangeWaitsOnceAndOnceMoreWhileItIsBeingSent) {
+    const uint64_t task = store_->AddTask(Task("a"));
+    const uint64_t other = store_->AddTask(Task("b"));
+    store_->AddEvents(task, "s", {"/z", "/\xff\n", "/z", "/a"});
+    store_->AddEvents(task, "t", {"/z"});
+    store_->AddEvents(other, "s", {"/z"});
+    EXPECT_THAT(Pending(task), ElementsAre("s /z", "s /\xff\n", "s /a", "t /z"));
+
+    const std::vector<uint64_t> ids = PendingIds(task);
+    store_->MarkSending({ids[0], ids[1], ids[3]});
+    store_->AddEvents(task, "s", {"/z", "/a"});
+    EXPECT_THAT(Pending(task), ElementsAre("s /a", "s /z"));
+    EXPECT_EQ(store_->CountEvents(task), 5U);
+    store_->RemoveEvents({ids[1]});
+    store_->ReturnEvents({ids[0], ids[3], 999});
+    EXPECT_THAT(Pending(task), ElementsAre("s /z", "s /a", "t /z"));
+    EXPECT_EQ(store_->CountEvents(task), 3U);
+
+    store_->MarkSending({ids[0]});
+    store_->ClearEvents(task);
+    EXPECT_EQ(store_->CountEvents(task), 0U);
+    EXPECT_THAT(Pending(other), ElementsAre("s /z"));
+    EXPECT_THAT(Fault([&] { store_->AddEvents(99, "s", {"/"}); }), HasSubstr("no such task"));
+}
+
+TEST_F(StoreTest, KeepsTheLastRunsOfEachTask) {
+    const uint64_t task = store_->AddTask(Task("a"));
+    const uint64_t other = store_->AddTask(Task("b"));
+    store_->AddTask(Task("has not run"));
+    RunRecord run;
+    run.id = store_->BeginRun(task, RunReason::kRetry, 100);
+    run.task_id = task;
+    run.end = 160;
+    run.result = ZEL::TASK_RESULT_FAILED;
+    run.status = 23;
+    run.error = "share 'x\xff': cannot be read";
+    run.files_sent = UINT64_MAX;
+    run.files_deleted = 2;
+    run.bytes_sent = 3;
+    run.rsync_runs = 4;
+    store_->EndRun(run);
+    const RunRecord kept = store_->Runs(task, 5).at(0);
+    EXPECT_EQ(kept.id, run.id);
+    EXPECT_EQ(kept.task_id, task);
+    EXPECT_EQ(kept.reason, RunReason::kRetry);
+    EXPECT_EQ(kept.start * 1000 + kept.end, 100160);
+    EXPECT_EQ(kept.result * 100 + kept.status, 223);
+    EXPECT_EQ(kept.error, run.error);
+    EXPECT_EQ(kept.files_sent, UINT64_MAX);
+    EXPECT_EQ(kept.files_deleted * 100 + kept.bytes_sent * 10 + kept.rsync_runs, 234U);
+
+    const uint64_t others = store_->BeginRun(other, RunReason::kRequest, 50);
+    uint64_t last = 0;
+    for (int i = 0; i < Store::kRunsKept; ++i) {
+        last = store_->BeginRun(task, RunReason::kSchedule, 200 + i);
+    }
+    const std::vector<RunRecord> runs = store_->Runs(task, 1000);
+    ASSERT_EQ(runs.size(), Store::kRunsKept + 0U);
+    EXPECT_EQ(runs.front().id, last);
+    EXPECT_EQ(runs.back().start, 200);
+    EXPECT_EQ(store_->Runs(task, 3).size(), 3U);
+    std::vector<uint64_t> ids;
+    for (const RunRecord& record : store_->LastRuns()) {
+        ids.push_back(record.id);
+    }
+    EXPECT_THAT(ids, ElementsAre(last, others));
+
+    store_->RemoveTask(task);
+    EXPECT_THAT(store_->Runs(task, 1000), IsEmpty());
+    store_->EndRun(run);
+    EXPECT_EQ(store_->LastRuns().size(), 1U);
+    EXPECT_THAT(Fault([&] { store_->BeginRun(task, RunReason::kChange, 1); }),
+                HasSubstr("no such task"));
+}
+
+TEST_F(StoreTest, WhatWasCutOffHasFailedAndWaitsAgain) {
+    const uint64_t task = store_->AddTask(Task("a"));
+    const uint64_t run = store_->BeginRun(task, RunReason::kChange, 100);
+    store_->AddEvents(task, "s", {"/a", "/b"});
+    store_->MarkSending(PendingIds(task));
+    store_->AddEvents(task, "s", {"/b"});
+    Reopen();
+    const RunRecord cut = store_->Runs(task, 1).at(0);
+    EXPECT_EQ(cut.id, run);
+    EXPECT_EQ(cut.result, ZEL::TASK_RESULT_FAILED);
+    EXPECT_EQ(cut.end, 100);
+    EXPECT_EQ(cut.error, "the daemon was stopped");
+    EXPECT_THAT(Pending(task), ElementsAre("s /a", "s /b"));
+}
+
+TEST_F(StoreTest, IsForTheDaemonAlone) {
+    store_->AddTask(Task("a"));
+    EXPECT_EQ(ModeOf(folder_.Path("daemon")), 0700U);
+    EXPECT_EQ(ModeOf(path_), 0600U);
+    EXPECT_EQ(ModeOf(path_ + "-wal"), 0600U);
+    store_.reset();
+    chmod(path_.c_str(), 0644);
+    Reopen();
+    EXPECT_EQ(ModeOf(path_), 0600U);
+}
+
+TEST_F(StoreTest, AFileThatIsNoStoreOfThisProgramIsRefusedAndLeftAsItIs) {
+    store_.reset();
+    const std::string store = test::ReadFile(path_);
+    std::string damaged = store;
+    damaged.replace(100, 300, 300, '\x55');
+    const auto made = [&](const std::string& start, const char* statement) {
+        folder_.Write("daemon/tasks.db", start);
+        Database(path_).Execute(statement);
+        return test::ReadFile(path_);
+    };
+    const std::pair<std::string, const char*> cases[] = {
+        {"this is no database, whatever its name says", "not a database; the file is damaged"},
+        {damaged, "the file is damaged and is left as it is; stop the daemon"},
+        {store.substr(0, 5000), "damaged"},
+        {made(store, "PRAGMA user_version = 77"), "version 77, and this program knows versions up"},
+        {made("", "CREATE TABLE bookmarks (url)"), "of another program; name another file"},
+    };
+    for (const auto& [content, fault] : cases) {
+        folder_.Write("daemon/tasks.db", content);
+        EXPECT_THAT(OpenFault(), AllOf(HasSubstr(path_ + ": cannot open"), HasSubstr(fault)));
+        EXPECT_EQ(test::ReadFile(path_) == content, true) << fault;
+    }
+    folder_.Write("daemon/tasks.db", "");  // where making it was cut off at the very start
+    Reopen();
+    EXPECT_THAT(store_->Tasks(), IsEmpty());
+}
+
+TEST_F(StoreTest, DamageFurtherInIsToldWhenItIsMet) {
+    const uint64_t task = store_->AddTask(Task("a"));
+    for (int i = 0; i < 3000; ++i) {
+        store_->AddEvents(task, "s", {"/" + std::to_string(i) + std::string(500, 'x')});
+    }
+    store_.reset();
+    const std::string sound = test::ReadFile(path_);
+    std::mt19937 random(1);
+    int faults = 0;
+    for (int i = 0; i < 60; ++i) {
+        std::string content = sound;
+        const size_t page = random() % (sound.size() / 4096 - 12) + 12;
+        for (int j = 0; j < 400; ++j) {
+            content[page * 4096 + random() % 4096] = static_cast<char>(random());
+        }
+        folder_.Write("daemon/tasks.db", content);
+        const std::string fault = Fault([&] {
+            Store store(path_);
+            store.PendingEvents(task);
+            store.ClearEvents(task);
+        });
+        faults += fault != "none";
+        EXPECT_THAT(fault, testing::AnyOf("none", HasSubstr("the file is damaged")));
+    }
+    EXPECT_GT(faults, 10);
+}
+
+TEST_F(StoreTest, AListThatSomebodyBrokeIsTold) {
+    store_->AddTask(Task("a"));
+    for (const char* list : {"[\"a\"", "{}", "[1]", "[[\"a\"]]", "\"a\""}) {
+        Database(path_).Execute(("UPDATE tasks SET exclude = '" + std::string(list) + "'").c_str());
+        EXPECT_THAT(Fault([&] { store_->Tasks(); }), HasSubstr("lists of task 1")) << list;
+    }
+}
+
+// Makes every write of SQLite fail as on a full disk while it lives.
+class FullDisk {
+public:
+    FullDisk() {
+        for (const char* name : kNames) {
+            real_.push_back(vfs_->xGetSystemCall(vfs_, name));
+        }
+        Set([](size_t) { return reinterpret_cast<sqlite3_syscall_ptr>(&Fail); });
+    }
+    ~FullDisk() {
+        Set([&](size_t i) { return real_[i]; });
+    }
+
+private:
+    static constexpr const char* kNames[] = {"write", "pwrite", "pwrite64"};
+
+    static ssize_t Fail(int, const void*, size_t, off64_t) {
+        errno = ENOSPC;
+        return -1;
+    }
+    template <typename Call>
+    void Set(Call call) {
+        for (size_t i = 0; i < std::size(kNames); ++i) {
+            if (real_[i] != nullptr) {
+                vfs_->xSetSystemCall(vfs_, kNames[i], call(i));
+            }
+        }
+    }
+
+    sqlite3_vfs* const vfs_ = sqlite3_vfs_find(nullptr);
+    std::vector<sqlite3_syscall_ptr> real_;
+};
+
+TEST_F(StoreTest, AFullDiskLosesNothing) {
+    const uint64_t task = store_->AddTask(Task("a"));
+    store_->AddEvents(task, "s", {"/a"});
+    {
+        const FullDisk full;
+        EXPECT_THAT(Fault([&] {
+                        store_->AddEvents(task, "s", {"/b", "/c"});
+                    }),
+                    AllOf(HasSubstr(path_), HasSubstr("the disk is full; make room")));
+        EXPECT_THAT(Fault([&] { store_->RemoveTask(task); }), HasSubstr("disk is full"));
+        EXPECT_THAT(Pending(task), ElementsAre("s /a"));
+        EXPECT_THAT(Fault([&] { const Store store(folder_.Path("new/tasks.db")); }),
+                    HasSubstr("disk is full"));
+    }
+    store_->AddEvents(task, "s", {"/b"});
+    EXPECT_THAT(Pending(task), ElementsAre("s /a", "s /b"));
+    Reopen();
+    EXPECT_EQ(store_->CountEvents(task), 2U);
+    EXPECT_EQ(Fault([&] { const Store store(folder_.Path("new/tasks.db")); }), "none");
+}
+
+TEST_F(StoreTest, AFolderThatCannotBeWrittenIsTold) {
+    store_.reset();
+    folder_.Write("file", "");
+    EXPECT_THAT(Fault([&] { const Store store(folder_.Path("file/tasks.db")); }),
+                AllOf(HasSubstr("file/tasks.db: cannot open"), HasSubstr("may write there")));
+    chmod(folder_.Path().c_str(), 0755);
+    chmod(folder_.Path("daemon").c_str(), 0555);
+    chmod(path_.c_str(), 0444);
+    const bool root = geteuid() == 0;
+    ASSERT_TRUE(!root || seteuid(65534) == 0);  // root may write anywhere
+    const std::string missing = Fault([&] { const Store store(path_ + ".new"); });
+    const std::string there = OpenFault();
+    ASSERT_TRUE(!root || seteuid(0) == 0);
+    EXPECT_THAT(missing, HasSubstr("user may write"));
+    EXPECT_THAT(there, HasSubstr("user may write"));
+}
+
+TEST_F(StoreTest, LayoutsAreBroughtUpToDateStepByStep) {
+    Database database(folder_.Write("steps.db", ""));
+    const auto bring = [&](const zel_daemon::SchemaSteps& steps) {
+        zel_daemon::BringUpToDate(database, steps);
+        return database.Number("PRAGMA user_version") * 100 + database.Number("SELECT b FROM t");
+    };
+    const char* const first = "CREATE TABLE t (a); INSERT INTO t VALUES (5); ALTER TABLE t ADD b";
+    const char* const second = "UPDATE t SET b = a + 1";
+    const char* const broken = "UPDATE t SET b = 9; UPDATE missing SET b = 9";
+    EXPECT_EQ(bring({first}), 100);
+    EXPECT_EQ(bring({first}), 100);
+    EXPECT_THROW(bring({first, second, broken}), zel_daemon::SqliteError);
+    EXPECT_EQ(bring({first, second}), 206);
+    EXPECT_THROW(bring({first}), zel_daemon::SchemaError);
+    EXPECT_EQ(bring({first, second, "UPDATE t SET b = b + 1"}), 307);
+}
+
+// Works on the store and tells each thing once the store has taken it, as a line: "e" and a path
+// that waits, "t" and one that is about to go, "g" and one that is gone; "r" and a run that began,
+// "d" and one that was done.
+[[noreturn]] void WorkUntilKilled(const std::string& path, int round, int out) {
+    const auto tell = [&](char what, const std::string& which) {
+        const std::string line = what + which + "\n";
+        if (write(out, line.data(), line.size()) != static_cast<ssize_t>(line.size())) {
+            _exit(1);
+        }
+    };
+    try {
+        Store store(path);
+        const std::vector<TaskRecord> tasks = store.Tasks();
+        const uint64_t task = tasks.empty() ? store.AddTask(Task("a")) : tasks[0].ID();
+        for (int i = 0;; ++i) {
+            const std::string name = "/" + std::to_string(round) + "." + std::to_string(i);
+            store.AddEvents(task, "s", {name, name + "+"});
+            tell('e', name);
+            tell('e', name + "+");
+            RunRecord run;
+            run.id = store.BeginRun(task, RunReason::kChange, 1000);
+            tell('r', std::to_string(run.id));
+            const std::vector<ZEL::Event> events = store.PendingEvents(task);
+            store.MarkSending({events.back().GetID()});
+            run.end = 2000;
+            run.result = ZEL::TASK_RESULT_SUCCESS;
+            store.EndRun(run);
+            tell('d', std::to_string(run.id));
+            if (i % 3 == 0) {
+                tell('t', events.back().GetRelativePath());
+                store.RemoveEvents({events.back().GetID()});
+                tell('g', events.back().GetRelativePath());
+            }
+        }
+    } catch (const StoreError& error) {
+        fprintf(stderr, "%s\n", error.what());
+        _exit(1);
+    }
+}
+
+std::string ReadToEnd(int fd) {
+    std::string all;
+    char buffer[4096];
+    for (ssize_t n; (n = read(fd, buffer, sizeof buffer)) > 0;) {
+        all.append(buffer, static_cast<size_t>(n));
+    }
+    return all;
+}
+
+TEST(StoreCrash, WhatWasAnsweredIsThereWheneverTheProcessIsKilled) {
+    const test::TempFolder folder;
+    std::mt19937 random(static_cast<unsigned int>(getpid()));
+    std::map<std::string, char> paths;  // the last that was told of each
+    size_t told = 0;
+    for (int round = 0; round < 60; ++round) {
+        // Every fourth time the file is new: it is cut off while it is being made.
+        const std::string path = folder.Path(std::to_string(round / 4) + "/tasks.db");
+        if (round % 4 == 0) {
+            paths.clear();
+        }
+        int ends[2];
+        ASSERT_EQ(pipe(ends), 0);
+        const pid_t child = fork();
+        if (child == 0) {
+            close(ends[0]);
+            WorkUntilKilled(path, round, ends[1]);
+        }
+        close(ends[1]);
+        struct pollfd first_line = {ends[0], POLLIN, 0};
+        poll(&first_line, 1, round % 4 == 0 ? 0 : 60000);
+        usleep(static_cast<useconds_t>(random() % (round % 4 == 0 ? 10000 : 50000)));
+        kill(child, SIGKILL);
+        std::map<uint64_t, char> runs;
+        std::istringstream lines(ReadToEnd(ends[0]));
+        for (std::string line; std::getline(lines, line); ++told) {
+            const std::string which = line.substr(1);
+            if (line[0] == 'r' || line[0] == 'd') {
+                runs[std::stoull(which)] = line[0];
+            } else {
+                paths[which] = line[0];
+            }
+        }
+        close(ends[0]);
+        int status = 0;
+        waitpid(child, &status, 0);
+        ASSERT_TRUE(WIFSIGNALED(status)) << "the child failed by itself";
+
+        Store store(path);
+        Database database(path);
+        Query check(database, "PRAGMA integrity_check");
+        ASSERT_TRUE(check.Next());
+        EXPECT_EQ(check.Text(), "ok");
+        const std::vector<TaskRecord> tasks = store.Tasks();
+        if (tasks.empty()) {
+            EXPECT_THAT(paths, IsEmpty());
+            continue;
+        }
+        const uint64_t task = tasks[0].ID();
+        std::set<std::string> stored;
+        for (const ZEL::Event& event : store.PendingEvents(task)) {
+            stored.insert(event.GetRelativePath());
+        }
+        for (const auto& [name, last] : paths) {
+            if (last != 't') {
+                ASSERT_EQ(stored.count(name), last == 'e' ? 1U : 0U) << name << " was answered";
+            }
+        }
+        const std::vector<RunRecord> history = store.Runs(task, 1000);
+        size_t known = 0;
+        for (const RunRecord& run : history) {
+            EXPECT_NE(run.end, 0);
+            if (const auto found = runs.find(run.id); found != runs.end()) {
+                ++known;
+                EXPECT_TRUE(found->second == 'r' || run.result == ZEL::TASK_RESULT_SUCCESS);
+            }
+        }
+        EXPECT_TRUE(known == runs.size() || history.size() == Store::kRunsKept);
+    }
+    EXPECT_GE(told, 45U);
+}
+
+}  // namespace
