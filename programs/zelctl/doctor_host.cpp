@@ -3,6 +3,7 @@
 #include <sys/statvfs.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -83,7 +84,11 @@ bool IsUsableRsync(const std::string& text, std::string& version) {
     unsigned int minor = 0;
     unsigned int patch = 0;
     const size_t head = text.find(kHead);
-    const size_t begin = head == std::string::npos ? head : head + sizeof kHead - 1;
+    // Some builds put a "v" in front of the number.
+    const size_t begin =
+        head == std::string::npos
+            ? head
+            : std::min(text.find_first_not_of('v', head + sizeof kHead - 1), text.size());
     if (begin == std::string::npos ||
         sscanf(text.c_str() + begin, "%3u.%3u.%3u", &major, &minor, &patch) < 2) {
         version.clear();

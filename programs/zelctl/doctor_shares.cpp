@@ -7,7 +7,7 @@
 #include <cstring>
 #include <filesystem>
 
-#include "ZEL/zel.h"
+#include "programs/common/task_run.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/doctor_checks.h"
 #include "tarq/core.h"
@@ -26,36 +26,23 @@ constexpr char kStore[] = "/usr/tarq/etc/zel_daemon/tasks.db";
 constexpr char kCatalogue[] = "/usr/tarq/etc/tarqshare.conf";
 constexpr int kProtocol = 1;
 
-// What keeps a share from being pushed; empty when nothing does. `remedy`: what to do then.
-std::string FaultOfShare(const std::string& name, std::string& remedy) {
+// What to do about a share that has a problem.
+std::string RemedyOfShare(const std::string& name) {
     TARQShare record = nullptr;
-    const int found = TARQShareGet(name.c_str(), &record);
+    const bool found = TARQShareGet(name.c_str(), &record) == 0;
     const TARQ::ShareOwner share(record);
-    if (found < 0 || !share || share->path == nullptr) {
-        const int code = KAPICErrGet();
-        switch (code) {
-            case TARQ_ERR_NO_SHARE:
-                remedy = "zelctl share add '" + name + "' FOLDER, or take it out of the tasks";
-                break;
-            case TARQ_ERR_SHARE_VOLUME:
-                remedy = "mount its disk; if the share has moved: zelctl share rm and share add";
-                break;
-            default:
-                remedy = "if the share has moved: zelctl share rm and zelctl share add";
-        }
-        return KAPICErrText(code);
+    if (found) {
+        return "let the daemon's user read its folder; a share has to be on one of this machine's "
+               "own disks";
     }
-    if (access(share->path, R_OK | X_OK) != 0) {
-        remedy = "let the daemon's user read it";
-        return std::string("its folder ") + share->path + " cannot be read: " + strerror(errno);
+    switch (KAPICErrGet()) {
+        case TARQ_ERR_NO_SHARE:
+            return "zelctl share add '" + name + "' FOLDER, or take it out of the tasks";
+        case TARQ_ERR_SHARE_VOLUME:
+            return "mount its disk; if the share has moved: zelctl share rm and share add";
+        default:
+            return "if the share has moved: zelctl share rm and zelctl share add";
     }
-    bool fit = false;
-    if (ZEL::IsValidShare(name, fit) != 0) {
-        remedy = "check that its disk is mounted";
-        return KAPICErrText(KAPICErrGet());
-    }
-    remedy = fit ? "" : "move it to one of this machine's own disks";
-    return fit ? "" : "it lies on a removable or network disk, which is not pushed";
 }
 
 // What is wrong with the owner and the mode of a file that is there; empty when nothing is.
@@ -140,8 +127,7 @@ void CheckCatalogue(const Patient& patient, Findings& findings) {
                             "zelctl share add NAME FOLDER, or zelctl share import --samba"});
     }
     for (const auto& [name, tasks] : patient.shares) {
-        std::string remedy;
-        const std::string fault = FaultOfShare(name, remedy);
+        const std::string fault = programs::ShareProblem(name);
         const std::string users = tasks.empty() ? "" : " (" + TasksInWords(tasks) + ")";
         if (fault.empty()) {
             findings.push_back({"share " + name, Verdict::kOk, "ready" + users, ""});
@@ -149,7 +135,7 @@ void CheckCatalogue(const Patient& patient, Findings& findings) {
             // One that no task sends hurts nobody yet.
             findings.push_back({"share " + name,
                                 tasks.empty() ? Verdict::kWarning : Verdict::kFailed, fault + users,
-                                remedy});
+                                RemedyOfShare(name)});
         }
     }
 }

@@ -6,8 +6,8 @@
 #include <map>
 
 #include "ZEL/sync_obj.h"
+#include "programs/common/server_status.h"
 #include "programs/common/text.h"
-#include "programs/zelctl/connection.h"
 #include "programs/zelctl/daemon_client.h"
 #include "programs/zelctl/interrupt.h"
 #include "programs/zelctl/live_block.h"
@@ -121,6 +121,7 @@ private:
         return Fail(kFailed, "task '%s' has been removed or renamed", Printable(name).c_str());
     }
 
+    // A run that failed without a status has failed on this machine.
     static ExitCode Ended(const PObject& task) {
         const std::string name = Printable(task["name"].asString());
         const int64_t took = task["last_end"].asInt64() - task["last_start"].asInt64();
