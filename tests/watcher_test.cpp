@@ -12,7 +12,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
@@ -21,7 +21,7 @@
 #include <random>
 #include <set>
 #include <string>
-#include <tuple>
+#include <thread>
 #include <vector>
 
 #include "tests/support/temp_root.h"
@@ -32,7 +32,6 @@ namespace fs = std::filesystem;
 using testing::Contains;
 using testing::ElementsAre;
 using testing::IsEmpty;
-using testing::Not;
 using zel_daemon::Watcher;
 using zel_daemon::WatchLoss;
 
@@ -606,6 +605,28 @@ TEST_F(WatcherModelTest, ACopyKeptByWhatIsToldStaysTrue) {
         Work();
         Synchronise();
         EXPECT_EQ(copy_, TreeAt("")) << "seed " << seed;
+        ExpectAllWatched("seed " + std::to_string(seed));
+    }
+    EXPECT_THAT(losses_, IsEmpty());
+}
+
+TEST_F(WatcherModelTest, ChangesAtTheSameTimeLeaveAllWatched) {
+    Start();
+    for (unsigned int seed = 1; seed <= 10 && !HasFailure(); ++seed) {
+        random_.seed(seed);
+        std::atomic<bool> done{false};
+        std::thread changes([&] {
+            for (int i = 0; i < 1500; ++i) {
+                ChangeSomething();
+            }
+            done = true;
+        });
+        while (!done) {
+            watcher_.Work(std::chrono::milliseconds(1));
+        }
+        changes.join();
+        Work();
+        TakeTold();
         ExpectAllWatched("seed " + std::to_string(seed));
     }
     EXPECT_THAT(losses_, IsEmpty());

@@ -57,8 +57,9 @@ constexpr uint8_t kTold = 4;      // told by an event, or below such a one
 constexpr uint8_t kUnseen = 8;    // its parent is being read and has not shown it yet
 constexpr uint8_t kMissing = 16;  // cannot be watched, or not all below it
 
+/// EXDEV: moved out of the share just while it was looked up.
 bool IsGone(int error) {
-    return error == ENOENT || error == ENOTDIR || error == ELOOP;
+    return error == ENOENT || error == ENOTDIR || error == ELOOP || error == EXDEV;
 }
 
 /// Opens the folder at `path` below `root`, which no symbolic link on the way leads to.
