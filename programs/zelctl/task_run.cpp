@@ -141,7 +141,7 @@ private:
             default: {
                 const int status = task["last_status"].asInt32();
                 return Fail(CodeOfRun(status), "task '%s' failed after %s: %s", name.c_str(),
-                            took_words.c_str(), Printable(task["last_error"].asString()).c_str());
+                            took_words.c_str(), Printable(OneLine(task["last_error"].asString())).c_str());
             }
         }
     }
