@@ -1,5 +1,6 @@
 # The daemon's parts.
-if(TARGET daemon_parts)
-    zel_test(store_test store_test.cpp LIBRARIES daemon_parts)
-    zel_test(task_plan_test task_plan_test.cpp LIBRARIES daemon_parts)
+if(ZEL_BUILD_PROGRAMS)
+    foreach(part IN ITEMS change_set store task_plan watcher)
+        zel_test(${part}_test ${part}_test.cpp LIBRARIES daemon_parts)
+    endforeach()
 endif()

@@ -10,4 +10,6 @@ if(ZEL_BUILD_PROGRAMS)
     add_dependencies(test_whole zelctl zel_server)
     zel_test(push_test integration/push_test.cpp
         LIBRARIES test_whole TIMEOUT 300 LABELS integration)
+    add_test(NAME completion_test
+        COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/integration/completion_test.sh ${PROJECT_SOURCE_DIR})
 endif()

@@ -59,7 +59,9 @@ TEST(TaskPlan, MissedRunsAreMadeUpForOnce) {
         {Make("once", "2015-03-15", 8), "2015-03-20 12:00:00", {}},
         {Make("manual", "", 8), "2015-03-10 00:00:00", {}},
         {Make("realtime", "", 8), "2015-03-10 00:00:00", {}},
-        {Make("weekly", "", 8), "1969-12-31 23:59:59", {}},
+        {Make("weekly", "", 8),
+         "1969-12-31 23:59:59",
+         {"2015-03-20 12:00:00", "2015-03-21 08:00:00"}},
     };
     for (const auto& c : cases) {
         TestClock now = clock;
@@ -83,6 +85,10 @@ TEST(TaskPlan, AfterAJumpTheScheduleGoesOnFromTheTimeThatIsShown) {
     clock.now = Utc("2015-03-20 08:30:00");
     EXPECT_THAT(Live(clock, plan, 86400),
                 ElementsAre("2015-03-20 09:00:00", "2015-03-21 08:00:00"));
+    clock.now = -3600;  // an empty clock battery
+    EXPECT_THAT(Live(clock, plan, 10), IsEmpty());
+    clock.now = Utc("2015-03-21 08:30:00");
+    EXPECT_THAT(Live(clock, plan, 60), ElementsAre("2015-03-21 08:30:00"));
     // Set right by a few seconds, just after a run: it is not made twice, the next one is made.
     clock.now = Utc("2015-03-21 08:59:59");
     EXPECT_THAT(Live(clock, plan, 2), ElementsAre("2015-03-21 09:00:00"));

@@ -1,5 +1,11 @@
 #include "programs/common/task_run.h"
 
+#include <fcntl.h>
+#include <linux/openat2.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
 #include <algorithm>
 #include <chrono>
 #include <condition_variable>
@@ -9,6 +15,7 @@
 
 #include "ZEL/rsyncer.h"
 #include "ZEL/zel.h"
+#include "platform/internal/unique_fd.h"
 #include "programs/common/server_status.h"
 #include "programs/common/text.h"
 
@@ -122,25 +129,33 @@ std::string Explain(int status, const RunReport& report) {
                : "status " + std::to_string(status) + " (see the system log)";
 }
 
-Trouble TroubleOf(int status) {
-    if (status == kNothingSent) {
-        return Trouble::kLocal;
-    }
-    return status < kFirstServerStatus ? Trouble::kFailed : Trouble::kRefused;
-}
-
 bool IsBelow(const std::string& path, const std::string& folder) {
     return folder == "/" || (path.size() > folder.size() && path[folder.size()] == '/' &&
                              path.compare(0, folder.size(), folder) == 0);
+}
+
+// Whether `path` can be sent by itself: a file or folder below the share's folder (open as
+// `folder`) that no link on the way leads to, so that nothing outside the share is ever sent. A
+// link is sent with the folder that it is in.
+bool IsPresent(int folder, const std::string& path) {
+    open_how how = {};
+    how.flags = O_PATH | O_NOFOLLOW | O_CLOEXEC;
+    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS;
+    const char* below = path.c_str() + path.find_first_not_of('/');
+    const tarq_internal::UniqueFd entry(
+        static_cast<int>(syscall(SYS_openat2, folder, below, &how, sizeof how)));
+    struct stat info = {};
+    return entry && fstat(entry.Get(), &info) == 0 && !S_ISLNK(info.st_mode);
 }
 
 // The paths as they are now: one that has gone stands for the nearest folder above that is there,
 // where the deletion is seen. No path is below another one.
 std::vector<std::string> PresentPaths(const std::string& folder,
                                       const std::vector<std::string>& paths) {
+    const tarq_internal::UniqueFd root(open(folder.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
     std::vector<std::string> present;
     for (std::string path : paths) {
-        while (path.size() > 1 && !ZEL::IsPathExist(folder + path)) {
+        while (path.find_first_not_of('/') != std::string::npos && !IsPresent(root.Get(), path)) {
             path.resize(std::max<size_t>(path.rfind('/'), 1));
         }
         present.push_back(path);
@@ -163,6 +178,13 @@ std::string Quoted(const std::string& share) {
 }
 
 }  // namespace
+
+Trouble TroubleOf(int status) {
+    if (status == kNothingSent) {
+        return Trouble::kLocal;
+    }
+    return status < kFirstServerStatus ? Trouble::kFailed : Trouble::kRefused;
+}
 
 struct TaskRun::Impl {
     Impl(const ZEL::SyncInfo& sync_info, const std::atomic<bool>& cancel_flag, RunListener told)

@@ -22,6 +22,9 @@ enum class Trouble {
     kCancelled  ///< ended by a person
 };
 
+/// What a status that is not 0 comes to, see tarq/rsync_wrapper.h.
+Trouble TroubleOf(int status);
+
 /// How an operation ended, for a program and for a person.
 struct Verdict {
     Trouble trouble = Trouble::kNone;

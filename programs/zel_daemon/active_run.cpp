@@ -71,7 +71,9 @@ ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, Ru
 
 ActiveRun::~ActiveRun() {
     *alive_ = false;
-    Cancel();
+    if (!ended_) {
+        Cancel();
+    }
     thread_.join();
 }
 
@@ -91,8 +93,9 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
         verdict = {programs::Trouble::kLocal, 0, error.what()};
     }
     connection_->on_progress = nullptr;
-    loop.Post([alive = alive_, on_end, verdict, totals] {
+    loop.Post([this, alive = alive_, on_end, verdict, totals] {
         if (*alive) {
+            ended_ = true;
             on_end(verdict, totals);
         }
     });

@@ -78,6 +78,7 @@ private:
     std::shared_ptr<Connection> connection_;
     RunPlan plan_;
     std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);  // the loop's thread alone
+    bool ended_ = false;                                          // the loop's thread alone
     std::thread thread_;
 };
 

@@ -46,6 +46,18 @@ private:
     mode_t before_;
 };
 
+// Whether the other side asks something more; false when it goes, or is silent for so long.
+bool IsAsking(int fd, unsigned int seconds, const std::function<bool()>& stopped) {
+    for (unsigned int i = 0; i < seconds && !stopped(); ++i) {
+        pollfd watched = {fd, POLLIN, 0};
+        if (poll(&watched, 1, 1000) > 0) {
+            char byte = 0;
+            return recv(fd, &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 1;
+        }
+    }
+    return false;
+}
+
 // Whether the other side still listens.
 bool IsPeerThere(int fd) {
     pollfd watched = {fd, POLLRDHUP, 0};
@@ -78,7 +90,7 @@ public:
     Session(IpcServer& server, int fd, bool allowed, const Peer& peer)
         : server_(server), fd_(fd), peer_(peer), channel_(kChannelBytes) {
         channel_.SetFlag(&stop_);
-        channel_.SetTimeout(allowed ? kIdleSeconds : kRefusedSeconds);
+        channel_.SetTimeout(kIdleSeconds);
         thread_ = std::thread([this, allowed] {
             Serve(allowed);
             channel_.Close();
@@ -102,7 +114,8 @@ private:
             close(fd_);
             return;
         }
-        while (!Stopped()) {
+        const unsigned int patience = allowed ? kIdleSeconds : kRefusedSeconds;
+        while (IsAsking(fd_, patience, [this] { return Stopped(); })) {
             PObject request;
             if (ZEL::PStream().Recv(channel_, request) != ZEL::RESULT_SUCCESS) {
                 return;

@@ -63,6 +63,14 @@ void MakePrivateFile(const std::string& path) {
     }
 }
 
+constexpr char kMakeRoom[] = "the disk is full; make room on it";
+
+const char* Advice(const std::error_code& error) {
+    return error == std::errc::no_space_on_device || error.value() == EDQUOT
+               ? kMakeRoom
+               : "see that the daemon's user may write there";
+}
+
 const char* Advice(const SqliteError& error) {
     switch (error.Code()) {
         case SQLITE_CONSTRAINT_UNIQUE:
@@ -79,7 +87,7 @@ const char* Advice(const SqliteError& error) {
                    "those beside it that begin with its name away, and put back a copy or add the "
                    "tasks anew";
         case SQLITE_FULL:
-            return "the disk is full; make room on it";
+            return kMakeRoom;
         case SQLITE_READONLY:
         case SQLITE_CANTOPEN:
         case SQLITE_PERM:
@@ -141,7 +149,7 @@ struct Store::Impl {
             throw fail(error.what() + std::string("; mend it, or remove the row, in the sqlite3 "
                                                   "shell while the daemon is stopped"));
         } catch (const std::system_error& error) {
-            throw fail(error.what() + std::string("; see that the daemon's user may write there"));
+            throw fail(error.what() + std::string("; ") + Advice(error.code()));
         }
     }
 
@@ -265,7 +273,7 @@ std::vector<ZEL::Event> Store::PendingEvents(uint64_t task_id) {
     });
 }
 
-// Where the other state has the same path already, the two become one with the older's id.
+// A change that comes to another one of the same path in the same state takes its place.
 void Store::MarkSending(const std::vector<uint64_t>& ids) {
     impl_->ForEach("mark changes as being sent", ids,
                    "UPDATE OR REPLACE events SET status = 1 WHERE id = ?");

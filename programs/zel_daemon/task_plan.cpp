@@ -48,13 +48,15 @@ std::optional<int64_t> TaskPlan::NextRun() const {
         checked_until_ > std::numeric_limits<long>::max()) {
         return std::nullopt;
     }
-    const long next = schedule_.GetNextScheduledSeconds(static_cast<long>(checked_until_));
+    // A clock that stood before 1970 has no runs, but those since then are not lost.
+    const int64_t reference = std::max<int64_t>(checked_until_, 0);
+    const long next = schedule_.GetNextScheduledSeconds(static_cast<long>(reference));
     return next > 0 ? std::optional<int64_t>(next) : std::nullopt;
 }
 
 bool TaskPlan::ScheduleDue() {
     const int64_t now = clock_.Now();
-    if (now < checked_until_ - kSetRightSeconds) {
+    if (WasSetBack(now)) {
         checked_until_ = now;
     }
     const std::optional<int64_t> next = NextRun();
@@ -63,9 +65,13 @@ bool TaskPlan::ScheduleDue() {
 
 void TaskPlan::ScheduleTaken() {
     const int64_t now = clock_.Now();
-    if (now > checked_until_ || now < checked_until_ - kSetRightSeconds) {
+    if (now > checked_until_ || WasSetBack(now)) {
         checked_until_ = now;
     }
+}
+
+bool TaskPlan::WasSetBack(int64_t now) const {
+    return checked_until_ > now + kSetRightSeconds;
 }
 
 void TaskPlan::Failed() {

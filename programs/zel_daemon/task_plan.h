@@ -36,8 +36,8 @@ public:
 /// Threads: one thread.
 class TaskPlan {
 public:
-    static constexpr int64_t kFirstRetryMs = 10 * 1000;
-    static constexpr int64_t kLongestRetryMs = 3600 * 1000;
+    static constexpr int64_t kFirstRetryMs = 10000;
+    static constexpr int64_t kLongestRetryMs = 3600000;
 
     /// `checked_until`: runs of the schedule up to here have been made. `random` gives numbers from
     /// 0 to below 1; tests set their own.
@@ -67,6 +67,8 @@ public:
     std::optional<int64_t> UntilRetry() const;
 
 private:
+    bool WasSetBack(int64_t now) const;
+
     const Clock& clock_;
     ZEL::Schedule schedule_;
     int64_t checked_until_;

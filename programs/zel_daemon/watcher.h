@@ -12,9 +12,11 @@ namespace zel_daemon {
 /// Why a watcher can no longer tell all that changes in a share.
 enum class WatchLoss {
     kOverflow,    ///< the kernel dropped events; the folders are searched anew, watching goes on
-    kWatchLimit,  ///< no more folders can be watched (fs.inotify.max_user_watches): the rest is not
+    kWatchLimit,  ///< no more folders can be watched (fs.inotify.max_user_watches): the rest is
+                  ///< not, until Add() or an overflow has them searched anew
     kFolderGone,  ///< the share's folder was removed, moved away, or its file system was unmounted
-    kUnreadable   ///< some folder cannot be read, so what is below it is not watched
+    kUnreadable   ///< some folder cannot be read, or its path is longer than PATH_MAX, so what is
+                  ///< below it is not watched; one that is made readable is taken in
 };
 
 struct WatchStats {
@@ -27,6 +29,11 @@ struct WatchStats {
 /// as changed with them. Symbolic links are not followed, other file systems mounted below a share
 /// are watched as its own.
 ///
+/// From the moment that a folder was told or searched, no later change in it is missed without a
+/// loss that says so. What the kernel does not tell is missed: changes made through a name outside
+/// the share that a file also has (a hard link), changes that another host makes on a network file
+/// system, and a file system that is mounted over a folder already watched.
+///
 /// The work is done in slices by the thread that calls Work(): neither a large tree nor a flood of
 /// events holds it up.
 ///
@@ -38,8 +45,8 @@ public:
     using OnChange = std::function<void(const std::string& share, const std::string& path)>;
     using OnLoss = std::function<void(const std::string& share, WatchLoss loss)>;
 
-    /// Both are called from Work() alone and may call Add() and Remove(). Throws std::system_error
-    /// when inotify is not to be had.
+    /// Both are called from Work() alone, may call Add() and Remove(), and may not throw. Throws
+    /// std::system_error when inotify is not to be had.
     Watcher(OnChange on_change, OnLoss on_loss);
     ~Watcher();
     Watcher(const Watcher&) = delete;
@@ -49,12 +56,14 @@ public:
     int Fd() const;
 
     /// Watches `folder` for `share`, in place of what was watched for it before. The folders below
-    /// it are found by Work().
+    /// it are found by Work(), which must be called after this and after Remove(): Fd() does not
+    /// tell of them. What changes in a folder before it is found is not told, so a run that is to
+    /// leave nothing out begins when the share is no longer searched.
     void Add(const std::string& share, const std::string& folder);
     void Remove(const std::string& share);
 
-    /// Reads events and searches folders for about so long. True when folders are left to search:
-    /// call again soon. False: wait for Fd().
+    /// Reads events and searches folders for about so long. True when work is left that Fd() does
+    /// not tell of, folders to search above all: call again soon. False: wait for Fd().
     bool Work(std::chrono::milliseconds budget);
 
     /// Of one share; all zero for one that is not watched.

@@ -1,5 +1,7 @@
 #pragma once
 
+#include "programs/common/task_run.h"
+
 namespace zelctl {
 
 /// What zelctl exits with; the manual page lists them.
@@ -11,6 +13,9 @@ enum ExitCode : int {
     kRefused = 4,   ///< the server refuses: conflict, account, switch
     kCancelled = 5  ///< ended by the user
 };
+
+/// What a run's end comes to.
+ExitCode CodeOf(programs::Trouble trouble);
 
 /// Prints "zelctl: message" and gives `code` back.
 ExitCode Fail(ExitCode code, const char* format, ...) __attribute__((format(printf, 2, 3)));

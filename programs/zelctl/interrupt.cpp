@@ -2,11 +2,7 @@
 
 #include <signal.h>
 
-#include <cstdarg>
-#include <cstdio>
 #include <initializer_list>
-
-#include "programs/zelctl/exit_codes.h"
 
 namespace zelctl {
 
@@ -40,16 +36,6 @@ const std::atomic<bool>& Interrupted() {
 
 int* InterruptFlag() {
     return &interrupt_flag;
-}
-
-ExitCode Fail(ExitCode code, const char* format, ...) {
-    va_list arguments;
-    va_start(arguments, format);
-    fputs("zelctl: ", stderr);
-    vfprintf(stderr, format, arguments);
-    fputc('\n', stderr);
-    va_end(arguments);
-    return code;
 }
 
 }  // namespace zelctl

@@ -15,25 +15,8 @@ namespace {
 using programs::RunOrder;
 using programs::RunTotals;
 using programs::TaskRun;
-using programs::Trouble;
 using programs::Verdict;
 using TARQ::Backup::RunChange;
-
-ExitCode CodeOf(Trouble trouble) {
-    switch (trouble) {
-        case Trouble::kNone:
-            return kOk;
-        case Trouble::kLocal:
-            return kLocal;
-        case Trouble::kRefused:
-            return kRefused;
-        case Trouble::kCancelled:
-            return kCancelled;
-        case Trouble::kFailed:
-            break;
-    }
-    return kFailed;
-}
 
 ExitCode Tell(const Verdict& verdict) {
     return verdict.Ok() ? kOk : Fail(CodeOf(verdict.trouble), "%s", verdict.error.c_str());

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <time.h>
 
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <string>
@@ -23,10 +24,11 @@ inline long Utc(const char* text) {
     EXPECT_NE(strptime(text, "%Y-%m-%d %H:%M:%S", &time), nullptr) << text;
     return timegm(&time);
 }
-inline std::string UtcText(long seconds) {
+inline std::string UtcText(int64_t seconds) {
+    const time_t moment = static_cast<time_t>(seconds);
     struct tm time = {};
     char text[64] = "";
-    gmtime_r(&seconds, &time);
+    gmtime_r(&moment, &time);
     strftime(text, sizeof text, "%F %T", &time);
     return text;
 }

@@ -1,0 +1,61 @@
+#include "programs/zel_daemon/inotify.h"
+
+#include <sys/inotify.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <system_error>
+
+namespace zel_daemon {
+
+namespace {
+
+/// Some 2,000 events with names of usual length.
+constexpr size_t kBufferSize = 64 * 1024;
+
+/// Files that were unlinked while open are told too (no IN_EXCL_UNLINK): what is written to them
+/// may show under another name in the same folder.
+constexpr uint32_t kMask = IN_CREATE | IN_DELETE | IN_MODIFY | IN_CLOSE_WRITE | IN_ATTRIB |
+                           IN_MOVED_FROM | IN_MOVED_TO | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR;
+
+}  // namespace
+
+Inotify::Inotify() : fd_(inotify_init1(IN_NONBLOCK | IN_CLOEXEC)), buffer_(new char[kBufferSize]) {
+    if (!fd_) {
+        throw std::system_error(errno, std::generic_category(), "inotify_init1");
+    }
+}
+
+int Inotify::Watch(int folder) {
+    char path[32];
+    std::snprintf(path, sizeof(path), "/proc/self/fd/%d", folder);
+    return inotify_add_watch(fd_.Get(), path, kMask);
+}
+
+void Inotify::Unwatch(int watch) {
+    inotify_rm_watch(fd_.Get(), watch);
+}
+
+std::optional<Inotify::Event> Inotify::Next() {
+    inotify_event head;
+    if (size_ - at_ < sizeof(head)) {
+        at_ = size_ = 0;
+        ssize_t got;
+        do {
+            got = read(fd_.Get(), buffer_.get(), kBufferSize);
+        } while (got < 0 && errno == EINTR);
+        if (got < static_cast<ssize_t>(sizeof(head))) {
+            return std::nullopt;
+        }
+        size_ = static_cast<size_t>(got);
+    }
+    std::memcpy(&head, buffer_.get() + at_, sizeof(head));
+    at_ += sizeof(head);
+    const size_t length = std::min<size_t>(head.len, size_ - at_);
+    const char* name = buffer_.get() + at_;
+    at_ += length;
+    return Event{head.wd, head.mask, head.cookie, {name, strnlen(name, length)}};
+}
+
+}  // namespace zel_daemon

@@ -1,0 +1,47 @@
+// The kernel's change notices for folders.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string_view>
+
+#include "ZEL/internal/unique_fd.h"
+
+namespace zel_daemon {
+
+/// Threads: one thread.
+class Inotify {
+public:
+    struct Event {
+        int watch;              ///< -1: events were lost
+        uint32_t mask;          ///< see inotify(7)
+        uint32_t cookie;        ///< joins the two events of a move
+        std::string_view name;  ///< of the entry; empty: the folder itself. Valid until Next()
+    };
+
+    /// Throws std::system_error when the kernel gives no instance.
+    Inotify();
+
+    /// Readable when Next() has an event that was not read from the kernel yet.
+    int Fd() const { return fd_.Get(); }
+
+    /// Watches an open folder: by descriptor, so that it is this folder whatever becomes of its
+    /// path. Returns the watch, the same one for a folder that is watched already; -1 with errno.
+    int Watch(int folder);
+    void Unwatch(int watch);
+
+    /// The next event; nothing when none waits.
+    std::optional<Event> Next();
+    /// True when events have been read from the kernel that Next() has not returned.
+    bool Buffered() const { return at_ < size_; }
+
+private:
+    ZEL::UniqueFd fd_;
+    std::unique_ptr<char[]> buffer_;
+    size_t size_ = 0;
+    size_t at_ = 0;
+};
+
+}  // namespace zel_daemon

@@ -1,0 +1,635 @@
+#include "programs/zel_daemon/watcher.h"
+
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <limits.h>
+#include <poll.h>
+#include <sched.h>
+#include <sys/inotify.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <map>
+#include <random>
+#include <set>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "tests/support/temp_root.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using testing::Contains;
+using testing::ElementsAre;
+using testing::IsEmpty;
+using zel_daemon::Watcher;
+using zel_daemon::WatchLoss;
+
+/// Called before a folder gets its watch; an error that is returned takes the watch's place.
+std::function<int(ino_t folder)> before_watch;
+
+}  // namespace
+
+extern "C" int inotify_add_watch(int fd, const char* path, uint32_t mask) {
+    struct stat status;
+    if (before_watch && stat(path, &status) == 0) {
+        if (const int error = before_watch(status.st_ino)) {
+            errno = error;
+            return -1;
+        }
+    }
+    return static_cast<int>(syscall(SYS_inotify_add_watch, fd, path, mask));
+}
+
+namespace {
+
+using Told = std::vector<std::pair<std::string, std::string>>;
+using Losses = std::vector<std::pair<std::string, WatchLoss>>;
+
+/// A folder `s` that is watched as share "s", and one beside it that is not.
+class WatcherTest : public testing::Test {
+protected:
+    WatcherTest() {
+        fs::create_directories(Path());
+        fs::create_directories(Outside());
+    }
+    ~WatcherTest() override { before_watch = nullptr; }
+
+    std::string Path(const std::string& path = "") const { return folder_.Path("s") + path; }
+    std::string Outside(const std::string& path = "") const { return folder_.Path("o") + path; }
+    void Write(const std::string& path) const { std::ofstream(Path(path)) << "x"; }
+
+    void Work() {
+        pollfd waiting = {watcher_.Fd(), POLLIN, 0};
+        while (watcher_.Work(std::chrono::milliseconds(5)) || poll(&waiting, 1, 0) > 0) {
+        }
+    }
+    void Start() {
+        watcher_.Add("s", Path());
+        Work();
+        EXPECT_THAT(TakeTold(), IsEmpty());
+    }
+
+    /// The paths told of share "s" since the last call, each once.
+    std::set<std::string> TakeTold() {
+        std::set<std::string> paths;
+        for (const auto& [share, path] : std::exchange(told_, {})) {
+            EXPECT_EQ(share, "s");
+            paths.insert(path);
+        }
+        return paths;
+    }
+    std::set<std::string> ToldAfterWork() {
+        Work();
+        return TakeTold();
+    }
+    /// That all folders are watched, each under its own path, and no other.
+    void ExpectAllWatched(const std::string& what = "") {
+        std::set<std::string> probes;
+        for (const auto& entry : fs::recursive_directory_iterator(Path())) {
+            if (entry.is_directory() && !entry.is_symlink()) {
+                probes.insert(entry.path().string().substr(Path().size()) + "/probe");
+            }
+        }
+        probes.insert("/probe");
+        for (const std::string& probe : probes) {
+            Write(probe);
+        }
+        EXPECT_EQ(ToldAfterWork(), probes) << what;
+        for (const std::string& probe : probes) {
+            unlink(Path(probe).c_str());
+        }
+        EXPECT_EQ(ToldAfterWork(), probes) << what;
+        EXPECT_EQ(watcher_.Stats("s").folders, probes.size()) << what;
+        EXPECT_FALSE(watcher_.Stats("s").searching) << what;
+        EXPECT_EQ(KernelWatches(), probes.size()) << what;
+    }
+    size_t KernelWatches() const {
+        std::ifstream info("/proc/self/fdinfo/" + std::to_string(watcher_.Fd()));
+        size_t count = 0;
+        for (std::string line; std::getline(info, line);) {
+            count += line.rfind("inotify", 0) == 0;
+        }
+        return count;
+    }
+
+    test::TempFolder folder_;
+    Told told_;
+    Losses losses_;
+    std::function<void()> on_told_;
+    Watcher watcher_{
+        [this](const std::string& share, const std::string& path) {
+            told_.emplace_back(share, path);
+            if (on_told_) {
+                on_told_();
+            }
+        },
+        [this](const std::string& share, WatchLoss loss) { losses_.emplace_back(share, loss); }};
+};
+
+TEST_F(WatcherTest, TellsEachChangeByItsName) {
+    fs::create_directories(Path("/d/e"));
+    fs::create_directories(Path("/gone"));
+    for (const char* file : {"/d/e/written", "/d/mode", "/d/removed", "/old"}) {
+        Write(file);
+    }
+    Start();
+    Write("/d/e/written");
+    chmod(Path("/d/mode").c_str(), 0600);
+    unlink(Path("/d/removed").c_str());
+    rename(Path("/old").c_str(), Path("/new").c_str());
+    rmdir(Path("/gone").c_str());
+    chmod(Path("/d/e").c_str(), 0700);
+    symlink("nowhere", Path("/d/link").c_str());
+    Write("/d/line\nbreak\xff");
+    EXPECT_THAT(ToldAfterWork(),
+                ElementsAre("/d/e", "/d/e/written", "/d/line\nbreak\xff", "/d/link", "/d/mode",
+                            "/d/removed", "/gone", "/new", "/old"));
+    chmod(Path().c_str(), 0700);
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/"));
+    EXPECT_THAT(losses_, IsEmpty());
+}
+
+TEST_F(WatcherTest, NewFoldersAreToldWholeAndWatched) {
+    Start();
+    fs::create_directories(Path("/a/b/c"));
+    Write("/a/b/c/f");
+    EXPECT_THAT(ToldAfterWork(), Contains("/a"));
+    ExpectAllWatched();
+    // One that went before it could be looked at.
+    fs::create_directories(Path("/short/lived"));
+    fs::remove_all(Path("/short"));
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/short"));
+    // One that gets its folders while it is searched, after it was told: each is told again.
+    before_watch = [&](ino_t) {
+        before_watch = nullptr;
+        fs::create_directories(Path("/late/x/y"));
+        return 0;
+    };
+    fs::create_directory(Path("/late"));
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/late", "/late/x", "/late/x/y"));
+    ExpectAllWatched();
+}
+
+TEST_F(WatcherTest, NewFoldersAreToldDuringTheFirstSearchToo) {
+    fs::create_directories(Path("/a"));
+    fs::create_directories(Path("/b"));
+    int watched = 0;
+    before_watch = [&](ino_t) {
+        if (++watched == 2) {  // the share's own folder has been read
+            fs::create_directories(Path("/new/x/y"));
+        }
+        return 0;
+    };
+    watcher_.Add("s", Path());
+    while (watcher_.Work(std::chrono::milliseconds(0))) {
+    }
+    EXPECT_THAT(TakeTold(), ElementsAre("/new", "/new/x", "/new/x/y"));
+    ExpectAllWatched();
+}
+
+TEST_F(WatcherTest, MovedTreesAreToldAtBothEndsAndFollowed) {
+    fs::create_directories(Path("/a/b/c"));
+    fs::create_directories(Path("/t/empty"));
+    fs::create_directories(Path("/x/y"));
+    fs::create_directories(Outside("/in/1/2"));
+    Start();
+    const auto move = [&](const std::string& from, const std::string& to) {
+        ASSERT_EQ(rename(from.c_str(), to.c_str()), 0) << from;
+    };
+    move(Path("/a"), Path("/t/a"));  // within
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/a", "/t/a"));
+    ExpectAllWatched("within");
+    move(Path("/t/a/b"), Path("/t/empty"));  // over
+    move(Path("/t/empty"), Path("/t/again"));
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/t/a/b", "/t/again", "/t/empty"));
+    ExpectAllWatched("over");
+    move(Outside("/in"), Path("/x/in"));
+    EXPECT_THAT(ToldAfterWork(), Contains("/x/in"));
+    ExpectAllWatched("in");
+    move(Path("/x"), Outside("/x"));
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/x"));
+    fs::create_directories(Outside("/x/in/1/2/3"));
+    ExpectAllWatched("out");
+    // Over a folder that somebody holds open: the kernel keeps its watch for now.
+    fs::create_directories(Path("/held"));
+    fs::create_directories(Outside("/over/sub"));
+    Work();
+    const int held = open(Path("/held").c_str(), O_RDONLY);
+    move(Outside("/over"), Path("/held"));
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/held", "/held/sub"));
+    ExpectAllWatched("in and over");
+    close(held);
+    ASSERT_EQ(renameat2(AT_FDCWD, Path("/t/a").c_str(), AT_FDCWD, Path("/t/again").c_str(),
+                        RENAME_EXCHANGE),
+              0);
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/t/a", "/t/a/c", "/t/again"));
+    ExpectAllWatched("exchanged");
+    EXPECT_THAT(losses_, IsEmpty());
+}
+
+TEST_F(WatcherTest, NoSymbolicLinkLeadsOutOfTheShare) {
+    fs::create_directories(Outside("/secret"));
+    fs::create_directories(Path("/known/secret"));
+    symlink(Outside().c_str(), Path("/link").c_str());
+    Start();
+    const auto replace = [&](const std::string& name) {
+        rename(Path(name).c_str(), Outside(name).c_str());
+        symlink(Outside().c_str(), Path(name).c_str());
+    };
+    // Before it is opened; after it was opened; and on the way to a folder that waits.
+    fs::create_directories(Path("/new/secret"));
+    replace("/new");
+    Work();
+    fs::create_directory(Path("/late"));
+    before_watch = [&](ino_t) {
+        before_watch = nullptr;
+        replace("/late");
+        return 0;
+    };
+    Work();
+    fs::create_directories(Path("/known/secret/more"));
+    fs::create_directories(Outside("/secret/more"));
+    struct stat secret;
+    ASSERT_EQ(stat(Outside("/secret/more").c_str(), &secret), 0);
+    bool replaced = false;
+    before_watch =
+        [&](ino_t folder) {  // of the share's own folder first: it is opened for a search
+            EXPECT_NE(folder, secret.st_ino);
+            if (!std::exchange(replaced, true)) {
+                replace("/known");
+            }
+            return 0;
+        };
+    Work();
+    before_watch = nullptr;
+    TakeTold();
+    for (const char* name : {"/f", "/secret/f", "/late/f", "/new/f", "/known/secret/f"}) {
+        std::ofstream(Outside(name)) << "x";
+    }
+    EXPECT_THAT(ToldAfterWork(), IsEmpty());
+    ExpectAllWatched();
+}
+
+TEST_F(WatcherTest, AfterAnOverflowAllIsFoundAgain) {
+    fs::create_directories(Path("/stays/sub"));
+    fs::create_directories(Path("/goes/sub"));
+    Write("/f");
+    Write("/g");
+    watcher_.Add("t", Path("/stays"));
+    Start();
+    for (int i = 0; i < 20000; ++i) {  // no two alike in a row: the kernel would join them
+        chmod(Path(i % 2 ? "/f" : "/g").c_str(), 0600);
+    }
+    fs::remove_all(Path("/goes"));
+    fs::create_directories(Path("/stays/new/deep"));
+    Work();
+    EXPECT_THAT(losses_, testing::UnorderedElementsAre(std::pair("s", WatchLoss::kOverflow),
+                                                       std::pair("t", WatchLoss::kOverflow)));
+    watcher_.Remove("t");
+    told_.clear();
+    ExpectAllWatched();
+}
+
+TEST_F(WatcherTest, WhatCannotBeWatchedIsSaidOnceInASearch) {
+    for (const auto& [error, loss] :
+         {std::pair(ENOSPC, WatchLoss::kWatchLimit), std::pair(EACCES, WatchLoss::kUnreadable)}) {
+        fs::remove_all(Path());
+        fs::create_directories(Path("/a/b"));
+        fs::create_directories(Path("/c/d"));
+        std::set<ino_t> watched;
+        before_watch = [&watched, refused = error](ino_t folder) {
+            return watched.size() < 3  ? watched.insert(folder), 0
+               : watched.count(folder) ? 0
+                                       : refused;
+        };
+        Start();
+        EXPECT_THAT(std::exchange(losses_, {}), ElementsAre(std::pair("s", loss)));
+        EXPECT_EQ(watcher_.Stats("s").folders, 3u);
+        EXPECT_FALSE(watcher_.Stats("s").complete);
+        EXPECT_FALSE(watcher_.Stats("s").searching);
+        Write("/f");
+        fs::create_directories(Path("/new/below"));
+        EXPECT_THAT(ToldAfterWork(), ElementsAre("/f", "/new"));
+        EXPECT_THAT(std::exchange(losses_, {}), ElementsAre(std::pair("s", loss)));
+        // A folder that shows a sign of life is tried again; then nothing is missing.
+        before_watch = nullptr;
+        for (const char* name : {"/a", "/c", "/new"}) {
+            chmod(Path(name).c_str(), 0700);
+            Work();
+        }
+        for (const char* name : {"/a/b", "/c/d"}) {
+            chmod(Path(name).c_str(), 0700);
+            Work();
+        }
+        TakeTold();
+        ExpectAllWatched();
+        EXPECT_TRUE(watcher_.Stats("s").complete);
+        EXPECT_THAT(losses_, IsEmpty());
+        watcher_.Remove("s");
+    }
+}
+
+TEST_F(WatcherTest, APathTooLongToBeSentIsUnreadable) {
+    const std::string name(200, 'n');
+    Start();
+    int depth = 0;
+    for (int at = open(Path().c_str(), O_RDONLY); at >= 0 && depth < 40; ++depth) {
+        ASSERT_EQ(mkdirat(at, name.c_str(), 0700), 0);
+        const int below = openat(at, name.c_str(), O_RDONLY);
+        close(at);
+        at = below;
+    }
+    Work();
+    EXPECT_THAT(losses_, ElementsAre(std::pair("s", WatchLoss::kUnreadable)));
+    EXPECT_FALSE(watcher_.Stats("s").complete);
+    EXPECT_EQ(watcher_.Stats("s").folders, 1u + (PATH_MAX - 1) / 201);
+    fs::rename(Path("/" + name), Outside("/" + name));
+    Work();
+    EXPECT_TRUE(watcher_.Stats("s").complete);
+    EXPECT_EQ(watcher_.Stats("s").folders, 1u);
+}
+
+TEST_F(WatcherTest, SaysWhenTheFolderIsGone) {
+    const std::function<void()> kWays[] = {
+        [&] { fs::remove_all(Path()); },
+        [&] { rename(Path().c_str(), Outside("/moved").c_str()); },
+        [&] {  // with the folder above it, which nothing tells: noticed at the next search
+            watcher_.Add("s", Path("/a/b"));
+            Work();
+            rename(Path("/a").c_str(), Path("/c").c_str());
+            fs::create_directories(Path("/a/b"));
+            fs::create_directory(Path("/c/b/new"));
+        },
+    };
+    for (const auto& way : kWays) {
+        fs::create_directories(Path("/a/b"));
+        Start();
+        way();
+        Work();
+        EXPECT_THAT(std::exchange(losses_, {}),
+                    ElementsAre(std::pair("s", WatchLoss::kFolderGone)));
+        EXPECT_EQ(watcher_.Stats().folders, 0u);
+        EXPECT_FALSE(watcher_.Stats().complete);
+        told_.clear();
+    }
+    fs::remove_all(Path());
+    Start();
+    EXPECT_THAT(losses_, ElementsAre(std::pair("s", WatchLoss::kFolderGone)));
+}
+
+TEST_F(WatcherTest, LetsAVolumeGoAndSaysSo) {
+    const std::string user = "0 " + std::to_string(geteuid()) + " 1";
+    const std::string group = "0 " + std::to_string(getegid()) + " 1";
+    const pid_t child = fork();
+    if (child == 0) {  // in namespaces of its own: nothing of this is seen outside
+        const auto mount_at = [&](const std::string& path) {
+            return mount("test", Path(path).c_str(), "tmpfs", 0, nullptr) == 0;
+        };
+        if (unshare(CLONE_NEWUSER | CLONE_NEWNS) != 0) {
+            _exit(77);
+        }
+        std::ofstream("/proc/self/uid_map") << user;
+        std::ofstream("/proc/self/setgroups") << "deny";
+        std::ofstream("/proc/self/gid_map") << group;
+        if (!mount_at("")) {
+            _exit(77);
+        }
+        fs::create_directories(Path("/a/b"));
+        fs::create_directories(Path("/mounted"));
+        EXPECT_TRUE(mount_at("/mounted"));
+        fs::create_directories(Path("/mounted/below"));
+        Start();
+        ExpectAllWatched("with a volume inside");
+        const int inner = umount(Path("/mounted").c_str());
+        const bool inner_told = ToldAfterWork().count("/mounted") == 1;
+        ExpectAllWatched("without it");
+        const int outer = umount(Path().c_str());
+        Work();
+        _exit(inner == 0 && inner_told && outer == 0 && !HasFailure() &&
+                      losses_ == Losses{{"s", WatchLoss::kFolderGone}}
+                  ? 0
+                  : 1);
+    }
+    int status = -1;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    if (WIFEXITED(status) && WEXITSTATUS(status) == 77) {
+        GTEST_SKIP() << "no namespaces or mounts to be had";
+    }
+    EXPECT_EQ(status, 0);
+}
+
+TEST_F(WatcherTest, SharesMayLieInEachOther) {
+    fs::create_directories(Path("/in/deep"));
+    watcher_.Add("same", Path());
+    watcher_.Add("inner", Path("/in"));
+    watcher_.Add("s", Path());
+    Work();
+    EXPECT_EQ(watcher_.Stats().folders, 8u);
+    Write("/in/deep/f");
+    Work();
+    EXPECT_EQ((std::set<Told::value_type>(told_.begin(), told_.end())),
+              (std::set<Told::value_type>{
+                  {"s", "/in/deep/f"}, {"same", "/in/deep/f"}, {"inner", "/deep/f"}}));
+    // Without one of them, the others go on.
+    watcher_.Remove("same");
+    rename(Path("/in/deep").c_str(), Path("/deep").c_str());
+    Work();
+    told_.clear();
+    Write("/deep/g");
+    Work();
+    EXPECT_EQ((std::set<Told::value_type>(told_.begin(), told_.end())),
+              (std::set<Told::value_type>{{"s", "/deep/g"}}));
+    rename(Path("/in").c_str(), Path("/out").c_str());
+    Work();
+    EXPECT_THAT(losses_, ElementsAre(std::pair("inner", WatchLoss::kFolderGone)));
+    watcher_.Remove("inner");
+    told_.clear();
+    ExpectAllWatched();
+    EXPECT_EQ(watcher_.Stats("same").folders, 0u);
+}
+
+TEST_F(WatcherTest, SharesComeAndGoFromWithinACallback) {
+    fs::create_directories(Path("/a/b"));
+    Start();
+    on_told_ = [&] {
+        on_told_ = nullptr;
+        watcher_.Remove("s");
+        watcher_.Add("s", Path("/a"));
+    };
+    fs::create_directory(Path("/c"));
+    Write("/a/f");
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/c"));
+    Write("/a/b/f");
+    EXPECT_THAT(ToldAfterWork(), ElementsAre("/b/f"));
+    EXPECT_EQ(watcher_.Stats().folders, 2u);
+}
+
+/// Random changes at random moments, also right in the middle of a search, with a copy that is kept
+/// by what is told, as the daemon keeps its server's.
+class WatcherModelTest : public WatcherTest {
+protected:
+    /// What of an entry must reach the copy: kind, mode, and for files a size that no other has.
+    using State = std::pair<mode_t, off_t>;
+    using Tree = std::map<std::string, State>;
+
+    static bool IsWithin(const std::string& path, const std::string& folder) {
+        return path == folder || path.rfind(folder + "/", 0) == 0;
+    }
+
+    /// The entry at `path`, which no link leads to, and all below it, as they are now.
+    Tree TreeAt(const std::string& path) const {
+        Tree tree;
+        struct stat status;
+        for (size_t end = path.find('/', 1); end != path.npos; end = path.find('/', end + 1)) {
+            if (fs::is_symlink(Path(path.substr(0, end)))) {
+                return tree;
+            }
+        }
+        if (lstat(Path(path).c_str(), &status) != 0) {
+            return tree;
+        }
+        // Only a folder's mode is its own: its size and times follow from what is in it.
+        tree[path] = {status.st_mode, S_ISREG(status.st_mode) ? status.st_size : 0};
+        if (S_ISDIR(status.st_mode)) {
+            for (const auto& entry : fs::directory_iterator(Path(path))) {
+                tree.merge(TreeAt(path + "/" + entry.path().filename().string()));
+            }
+        }
+        return tree;
+    }
+
+    /// Brings the copy up to date in what was told, and in nothing else.
+    void Synchronise() {
+        for (const std::string& told : TakeTold()) {
+            const std::string path = told == "/" ? "" : told;
+            for (auto at = copy_.begin(); at != copy_.end();) {
+                at = IsWithin(at->first, path) ? copy_.erase(at) : std::next(at);
+            }
+            copy_.merge(TreeAt(path));
+        }
+    }
+
+    std::string RandomPath() {
+        std::string path;
+        for (unsigned int depth = 1 + Random(4); depth > 0; --depth) {
+            path += std::string("/") + "abc"[Random(3)];
+        }
+        return path;
+    }
+
+    unsigned int Random(unsigned int below) { return static_cast<unsigned int>(random_() % below); }
+
+    /// Most of them fail, since the path is not there or not of the kind: that is as good.
+    void ChangeSomething() {
+        const std::string path = Path(RandomPath());
+        const std::string other = Path(RandomPath());
+        const std::string outside = Outside(std::string("/") + "abc"[Random(3)]);
+        std::error_code ignored;
+        switch (Random(12)) {
+            case 0:
+            case 1:
+            case 2:
+                fs::create_directories(path, ignored);
+                break;
+            case 3:
+            case 4: {
+                const int file = open(path.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW, 0600);
+                if (file >= 0) {
+                    EXPECT_EQ(ftruncate(file, ++last_size_), 0);
+                    close(file);
+                }
+                break;
+            }
+            case 5:
+                fs::remove_all(path, ignored);
+                break;
+            case 6:
+            case 7:
+                rename(path.c_str(), other.c_str());
+                break;
+            case 8:
+                renameat2(AT_FDCWD, path.c_str(), AT_FDCWD, other.c_str(), RENAME_EXCHANGE);
+                break;
+            case 9:
+                rename(path.c_str(), outside.c_str());
+                break;
+            case 10:
+                rename(outside.c_str(), path.c_str());
+                break;
+            case 11:
+                if (!fs::is_symlink(path, ignored)) {
+                    chmod(path.c_str(), Random(2) ? 0700 : 0750);
+                }
+                symlink(Outside().c_str(), other.c_str());
+                break;
+        }
+    }
+
+    std::mt19937 random_;
+    off_t last_size_ = 0;
+    Tree copy_;
+};
+
+TEST_F(WatcherModelTest, ACopyKeptByWhatIsToldStaysTrue) {
+    Start();
+    for (unsigned int seed = 1; seed <= 150 && !HasFailure(); ++seed) {
+        random_.seed(seed);
+        copy_ = TreeAt("");
+        before_watch = [&](ino_t) {
+            for (unsigned int i = Random(4) == 0 ? 1 + Random(3) : 0; i > 0; --i) {
+                ChangeSomething();
+            }
+            return 0;
+        };
+        for (int i = 0; i < 120; ++i) {
+            ChangeSomething();
+            if (Random(4) == 0) {
+                watcher_.Work(std::chrono::milliseconds(0));
+            }
+            if (Random(8) == 0) {
+                Synchronise();
+            }
+        }
+        before_watch = nullptr;
+        Work();
+        Synchronise();
+        EXPECT_EQ(copy_, TreeAt("")) << "seed " << seed;
+        ExpectAllWatched("seed " + std::to_string(seed));
+    }
+    EXPECT_THAT(losses_, IsEmpty());
+}
+
+TEST_F(WatcherModelTest, ChangesAtTheSameTimeLeaveAllWatched) {
+    Start();
+    for (unsigned int seed = 1; seed <= 10 && !HasFailure(); ++seed) {
+        random_.seed(seed);
+        std::atomic<bool> done{false};
+        std::thread changes([&] {
+            for (int i = 0; i < 1500; ++i) {
+                ChangeSomething();
+            }
+            done = true;
+        });
+        while (!done) {
+            watcher_.Work(std::chrono::milliseconds(1));
+        }
+        changes.join();
+        Work();
+        TakeTold();
+        ExpectAllWatched("seed " + std::to_string(seed));
+    }
+    EXPECT_THAT(losses_, IsEmpty());
+}
+
+}  // namespace
