@@ -6,7 +6,6 @@
 #include <map>
 
 #include "ZEL/sync_obj.h"
-#include "programs/common/server_status.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/daemon_client.h"
 #include "programs/zelctl/interrupt.h"
@@ -121,7 +120,6 @@ private:
         return Fail(kFailed, "task '%s' has been removed or renamed", Printable(name).c_str());
     }
 
-    // A run that failed without a status has failed on this machine.
     static ExitCode Ended(const PObject& task) {
         const std::string name = Printable(task["name"].asString());
         const int64_t took = task["last_end"].asInt64() - task["last_start"].asInt64();
@@ -138,7 +136,7 @@ private:
                 const int status = task["last_status"].asInt32();
                 return Fail(status == 0 ? kLocal : CodeOf(programs::TroubleOf(status)),
                             "task '%s' failed after %s: %s", name.c_str(), took_words.c_str(),
-                            Printable(task["last_error"].asString()).c_str());
+                            Printable(OneLine(task["last_error"].asString())).c_str());
             }
         }
     }
