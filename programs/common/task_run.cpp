@@ -23,6 +23,7 @@ namespace programs {
 
 namespace {
 
+using std::chrono::steady_clock;
 using TARQ::Backup::RunChange;
 using TARQ::Backup::RunOptions;
 using TARQ::Backup::RunProgress;
@@ -30,6 +31,7 @@ using TARQ::Backup::RunReport;
 using TARQ::Backup::ScopedRunOptions;
 
 constexpr std::chrono::seconds kBeaconEvery(60);  // the server takes a task for dead after 120
+constexpr std::chrono::seconds kLastWord(5);
 constexpr int kVanishedFiles = 24;  // rsync: some files were gone before it came to them
 constexpr int kLookupFailed = 42;
 constexpr int kNothingSent = 213;
@@ -42,22 +44,34 @@ std::list<std::string> ToList(const std::vector<std::string>& items) {
 // The library asks a function without an argument whether to give up: what it looks at is the
 // thread's own.
 thread_local const std::atomic<bool>* wanted = nullptr;
+thread_local steady_clock::time_point patient_until;  // whatever is wanted
 
 bool CancelWanted() {
-    return wanted != nullptr && wanted->load(std::memory_order_relaxed);
+    return wanted != nullptr && wanted->load(std::memory_order_relaxed) &&
+           steady_clock::now() >= patient_until;
 }
 
-/// The operations of this thread look at `cancel` until the scope ends; null: at nothing.
+/// The operations of this thread look at `cancel` until the scope ends.
 class CancelScope {
 public:
-    explicit CancelScope(const std::atomic<bool>* cancel)
-        : before_(std::exchange(wanted, cancel)) {}
+    explicit CancelScope(const std::atomic<bool>& cancel)
+        : before_(std::exchange(wanted, &cancel)) {}
     ~CancelScope() { wanted = before_; }
     CancelScope(const CancelScope&) = delete;
     CancelScope& operator=(const CancelScope&) = delete;
 
 private:
     const std::atomic<bool>* before_;
+};
+
+/// What is said in this scope is said even when a person has had enough, unless the server takes
+/// too long to listen.
+class LastWord {
+public:
+    LastWord() { patient_until = steady_clock::now() + kLastWord; }
+    ~LastWord() { patient_until = {}; }
+    LastWord(const LastWord&) = delete;
+    LastWord& operator=(const LastWord&) = delete;
 };
 
 /// Tells the server that the run is alive, from a thread and a connection of its own.
@@ -85,7 +99,7 @@ public:
 
 private:
     void Run() {
-        const CancelScope scope(&stop_);
+        const CancelScope scope(stop_);
         ZEL::Rsyncer rsyncer;
         rsyncer.SetCancelChecker(CancelWanted);
         bool ready = false;
@@ -274,7 +288,7 @@ struct TaskRun::Impl {
         if (!result.Ok()) {
             return result;
         }
-        const auto begin = std::chrono::steady_clock::now();
+        const auto begin = steady_clock::now();
         RunReport sent;
         // Once more, right before files are compared: an unmounted volume must not look like an
         // emptied share.
@@ -285,7 +299,7 @@ struct TaskRun::Impl {
         totals.files_sent += sent.files_sent;
         totals.files_deleted += sent.files_deleted;
         totals.bytes_sent += sent.bytes_sent + sent.bytes_received;
-        const std::chrono::duration<double> elapsed = std::chrono::steady_clock::now() - begin;
+        const std::chrono::duration<double> elapsed = steady_clock::now() - begin;
         Verdict closed = Finish(share.share, result.Ok());
         if (result.Ok() && closed.Ok() && listener.on_share_done) {
             listener.on_share_done(share.share, sent, elapsed.count());
@@ -341,8 +355,7 @@ struct TaskRun::Impl {
     }
 
     Verdict Finish(const std::string& share, bool completed) {
-        // The last word is sent even when a person has had enough.
-        const CancelScope patient(nullptr);
+        const LastWord last_word;
         const RunReport of_the_run = report;
         int status = 0;
         int sent = 0;
@@ -394,7 +407,7 @@ TaskRun::TaskRun(const ZEL::SyncInfo& info, const std::atomic<bool>& cancel, Run
 TaskRun::~TaskRun() = default;
 
 Verdict TaskRun::Connect() {
-    const CancelScope scope(&impl_->cancel);
+    const CancelScope scope(impl_->cancel);
     const ScopedRunOptions watched(impl_->Reporting());
     const int status = impl_->rsyncer.Initialize(impl_->info);
     const std::string& name = impl_->info.GetServerName();
@@ -405,12 +418,12 @@ Verdict TaskRun::Connect() {
 }
 
 Verdict TaskRun::CheckPairing(const std::vector<std::string>& shares) {
-    const CancelScope scope(&impl_->cancel);
+    const CancelScope scope(impl_->cancel);
     return impl_->Pair(true, shares);
 }
 
 Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
-    const CancelScope scope(&impl_->cancel);
+    const CancelScope scope(impl_->cancel);
     std::vector<std::string> names;
     for (const ShareOrder& share : order.shares) {
         names.push_back(share.share);
@@ -434,7 +447,7 @@ Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
     }
     totals.rsync_runs += impl_->rsync_runs;
     if (announced) {
-        const CancelScope patient(nullptr);
+        const LastWord last_word;
         impl_->rsyncer.FinishSync("task", order.task, ignored);
     }
     return result;
@@ -442,7 +455,7 @@ Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
 
 Verdict TaskRun::List(const RunOrder& order, const ChangeHandler& on_change,
                       const std::function<void(const std::string& share)>& on_missing) {
-    const CancelScope scope(&impl_->cancel);
+    const CancelScope scope(impl_->cancel);
     for (const ShareOrder& share : order.shares) {
         Verdict result = impl_->ListShare(order, share, on_change, on_missing);
         if (!result.Ok()) {

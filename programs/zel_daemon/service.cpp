@@ -673,7 +673,8 @@ void Service::EndRun(Task& task, const Verdict& verdict, const RunTotals& totals
         task.store_note.clear();
         task.pending = store_.CountEvents(task.record.ID());
     } catch (const StoreError& error) {
-        // The changes count as not sent: they are sent again when the store is opened next.
+        // What was sent is not known any more.
+        task.whole_due = task.record.IsRealtime();
         task.store_note = error.what();
         Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__, error.what());
     }
