@@ -69,21 +69,38 @@ const char* ResultText(int code) {
 }
 
 int SocketOf(void* handle) {
-    return handle == nullptr ? -1 : *static_cast<int*>(handle);
+    return handle == nullptr ? -1 : static_cast<PlainSocket*>(handle)->fd;
+}
+
+// Whether a wait may see urgent data, which ends the connection before anything else is moved. On
+// other sockets a transfer itself tells whether there is something to wait for.
+bool SeesUrgentData(void* handle) {
+    return handle == nullptr || static_cast<PlainSocket*>(handle)->can_be_urgent;
 }
 
 int ReadFd(void* handle, char* buffer, unsigned int length, const timeval& interval,
            const int* flag) {
     const int fd = SocketOf(handle);
-    int result = RefuseEmptyRead(length);
-    if (result == 0) {
-        result = WaitReadable(fd, interval, flag);
+    const int refused = RefuseEmptyRead(length);
+    if (refused < 0) {
+        return refused;
     }
-    if (result < 0) {
-        return result;
+    const auto try_recv = [&](int flags) {
+        errno = 0;  // the end of the stream sets none, and is logged with its text
+        return recv(fd, buffer, length, flags);
+    };
+    ssize_t count = -1;
+    const bool tried = !SeesUrgentData(handle) && !Aborted(flag);
+    if (tried) {
+        count = try_recv(MSG_DONTWAIT);
     }
-    errno = 0;  // the end of the stream sets none, and is logged with its text
-    const ssize_t count = recv(fd, buffer, length, 0);
+    if (!tried || (count < 0 && errno == EAGAIN)) {
+        const int result = WaitReadable(fd, interval, flag);
+        if (result < 0) {
+            return result;
+        }
+        count = try_recv(0);
+    }
     if (count > 0) {
         return TellRead(static_cast<int>(count));
     }
@@ -102,14 +119,24 @@ int ReadFd(void* handle, char* buffer, unsigned int length, const timeval& inter
 int WriteFd(void* handle, const char* data, unsigned int length, const timeval& interval,
             const int* flag) {
     const int fd = SocketOf(handle);
-    const int result = WaitWritable(fd, interval, flag);
-    if (result < 0) {
-        return result;
-    }
-    errno = 0;
     // MSG_DONTWAIT: on a descriptor that was left blocking, a large block would wait beyond the
     // slice.
-    const ssize_t count = send(fd, data, length, MSG_NOSIGNAL | MSG_DONTWAIT);
+    const auto try_send = [&] {
+        errno = 0;
+        return send(fd, data, length, MSG_NOSIGNAL | MSG_DONTWAIT);
+    };
+    ssize_t count = -1;
+    const bool tried = !SeesUrgentData(handle) && !Aborted(flag);
+    if (tried) {
+        count = try_send();
+    }
+    if (!tried || (count < 0 && errno == EAGAIN)) {
+        const int result = WaitWritable(fd, interval, flag);
+        if (result < 0) {
+            return result;
+        }
+        count = try_send();
+    }
     if (count > 0) {
         return TellWritten(static_cast<int>(count));
     }
@@ -127,11 +154,17 @@ int WriteFd(void* handle, const char* data, unsigned int length, const timeval& 
 
 void ClosePlain(void* handle) {
     CloseSocket(SocketOf(handle));
-    delete static_cast<int*>(handle);
+    delete static_cast<PlainSocket*>(handle);
 }
 
 bool IsPlainClosed(void* handle) {
     return SocketOf(handle) == -1;
+}
+
+bool IsUnixSocket(int fd) {
+    int domain = 0;
+    socklen_t size = sizeof domain;
+    return getsockopt(fd, SOL_SOCKET, SO_DOMAIN, &domain, &size) == 0 && domain == AF_UNIX;
 }
 
 // Keeps sender and receiver from waiting for each other. What cannot be set is left as it is.
@@ -574,7 +607,7 @@ void Channel::Adopt(void* handle) {
 }
 
 void Channel::AdoptSocket(int fd) {
-    Adopt(new int(fd));
+    Adopt(new PlainSocket{fd, !IsUnixSocket(fd)});
     ClearRead();
     ClearWrite();
 }

@@ -431,7 +431,7 @@ int Channel::ConvertToSSLChannel(bool server) {
                        "[WARNING] ZEL/channel(%d): ConvertToSSLChannel: Verify Fail!\n", __LINE__);
         return RESULT_CERTIFICATE;
     }
-    delete static_cast<int*>(handle_);  // the cell only: the socket lives on below TLS
+    delete static_cast<PlainSocket*>(handle_);  // the record only: the socket lives on below TLS
     handle_ = tls.ssl;
     tls_ = true;
     SwitchChannelOp(0);
