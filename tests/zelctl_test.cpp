@@ -407,6 +407,7 @@ TEST_F(Zelctl, WithoutADaemonEveryCommandSaysWhatToDo) {
         EXPECT_THAT(outcome.output, HasSubstr("systemctl start zel_daemon")) << command[1];
     }
     EXPECT_THAT(Run({"tusk"}).output, HasSubstr("no command 'tusk'"));
+    EXPECT_THAT(Run({"task", "lost"}).output, HasSubstr("no command 'task lost'"));
     EXPECT_EQ(Run({"task", "show"}).exit_code, 2);
 }
 
