@@ -68,7 +68,10 @@ int RunCommandLine(int argc, char** argv) {
             known = true;
             const std::string below = NextWord(argc, argv, index);
             if (declared->get_require_subcommand_min() > 0 && !below.empty() &&
-                declared->get_subcommand_no_throw(below) == nullptr) {
+                declared
+                    ->get_subcommands(
+                        [&](const CLI::App* lower) { return lower->check_name(below); })
+                    .empty()) {
                 return NoSuchCommand(wanted + " " + below, "zelctl " + wanted);
             }
         }
