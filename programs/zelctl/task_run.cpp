@@ -39,6 +39,14 @@ public:
     }
     /// Waits for the next news.
     ExitCode Next() { return connection_.Tell(connection_.Receive(reply_)); }
+    /// Puts the tasks that do something before those that do not.
+    void PutBusyFirst() {
+        PObject::Array& tasks = reply_["tasks"].asArray();
+        std::stable_partition(tasks.begin(), tasks.end(), [](const PObject& task) {
+            const int status = task["status"].asInt32();
+            return status == ZEL::TASK_STATUS_WAITING || status == ZEL::TASK_STATUS_RUNNING;
+        });
+    }
     const PObject::Array& Tasks() const {
         return static_cast<const PObject&>(reply_)["tasks"].asArray();
     }
@@ -242,6 +250,7 @@ ExitCode WatchTasks(const std::string& name) {
             break;
         }
         if (LiveBlock::Possible()) {
+            stream.PutBusyFirst();  // a window may not hold all
             block.Draw(TaskTable(stream.Tasks()).Lines());
         } else {
             lines.See(stream.Tasks());

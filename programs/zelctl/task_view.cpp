@@ -63,6 +63,7 @@ private:
 // The daemon's keys as they are, with words beside its numbers.
 ordered_json TaskJson(const PObject& task) {
     ordered_json json = ToJson(task);
+    json.erase("pswd");  // never shown, whoever sends it
     json["schedule"] = ScheduleOf(task);
     json["state"] = programs::TaskStatusWord(task["status"].asInt32());
     json["result"] = programs::TaskResultWord(task["sync_result"].asInt32());
