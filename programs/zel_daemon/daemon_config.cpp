@@ -16,6 +16,12 @@ public:
     NumberReader(const tarq_internal::Section& section, std::string& error)
         : section_(section), error_(error) {}
 
+    std::chrono::milliseconds Read(const char* key, std::chrono::milliseconds fallback,
+                                   uint64_t min, uint64_t max) {
+        return std::chrono::milliseconds(
+            Read(key, static_cast<uint64_t>(fallback.count()), min, max));
+    }
+
     uint64_t Read(const char* key, uint64_t fallback, uint64_t min, uint64_t max) {
         const std::string text = tarq_internal::ValueOf(section_, key);
         if (text.empty()) {
@@ -51,10 +57,10 @@ DaemonConfig ReadDaemonConfig(std::string& error) {
     }
     NumberReader numbers(section, error);
     config.workers = static_cast<unsigned int>(numbers.Read("workers", config.workers, 1, 32));
-    config.gather = std::chrono::milliseconds(
-        numbers.Read("gather_ms", static_cast<uint64_t>(config.gather.count()), 10, 600000));
-    config.gather_max = std::chrono::milliseconds(numbers.Read(
-        "gather_max_ms", static_cast<uint64_t>(config.gather_max.count()), 10, 600000));
+    config.gather = numbers.Read("gather_ms", config.gather, 10, 600000);
+    config.gather_max = numbers.Read("gather_max_ms", config.gather_max, 10, 600000);
+    config.retry_first = numbers.Read("retry_first_ms", config.retry_first, 100, 86400000);
+    config.retry_max = numbers.Read("retry_max_ms", config.retry_max, 100, 86400000);
     config.poll = std::chrono::seconds(
         numbers.Read("poll_seconds", static_cast<uint64_t>(config.poll.count()), 1, 86400));
     config.group = tarq_internal::ValueOf(section, "group");

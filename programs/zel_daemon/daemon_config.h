@@ -12,7 +12,9 @@ struct DaemonConfig {
     std::chrono::milliseconds gather{1000};       ///< quiet time before changes are sent ...
     std::chrono::milliseconds gather_max{10000};  ///< ... but they wait no longer than this
     std::chrono::seconds poll{900};  ///< how often what cannot be watched is compared whole
-    std::string group;               ///< whose members may use the socket; empty: nobody's
+    std::chrono::milliseconds retry_first{10000};  ///< a run that failed is tried again after ...
+    std::chrono::milliseconds retry_max{3600000};  ///< ... which doubles with each try, up to this
+    std::string group;  ///< whose members may use the socket; empty: nobody's
 };
 
 /// Reads the file; keys that are missing have their defaults. A value that does not pass is told in

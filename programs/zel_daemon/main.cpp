@@ -6,8 +6,10 @@
 
 #include <CLI/CLI.hpp>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <optional>
+#include <thread>
 
 #include "ZEL/log.h"
 #include "platform/internal/unique_fd.h"
@@ -31,6 +33,8 @@ constexpr char kStorePath[] = "/usr/tarq/etc/zel_daemon/tasks.db";
 constexpr char kSocketPath[] = "/var/run/zel_daemon.sock";
 constexpr char kLockPath[] = "/var/run/zel_daemon.lock";
 constexpr int kRotatedLogs = 5;
+constexpr std::chrono::seconds kLockPatience(2);
+constexpr std::chrono::milliseconds kLockStep(10);
 
 enum ExitCode : int { kEnded = 0, kFailed = 1, kUsage = 2 };
 
@@ -56,7 +60,14 @@ tarq_internal::UniqueFd TakeLock() {
     if (!lock) {
         throw std::runtime_error("cannot open " + path + ": " + strerror(errno));
     }
-    if (flock(lock.Get(), LOCK_EX | LOCK_NB) != 0) {
+    // The lock of a daemon that was killed goes with the last of its children that had just been
+    // made and were no program of their own yet.
+    const auto limit = std::chrono::steady_clock::now() + kLockPatience;
+    while (flock(lock.Get(), LOCK_EX | LOCK_NB) != 0) {
+        if (std::chrono::steady_clock::now() < limit) {
+            std::this_thread::sleep_for(kLockStep);
+            continue;
+        }
         throw std::runtime_error("another zel_daemon runs already (it holds " + path + ")");
     }
     return lock;

@@ -115,13 +115,17 @@ void Service::Start() {
         }
         // A run that failed, or that the daemon's own end cut off, is made up for.
         if (run.result == ZEL::TASK_RESULT_FAILED) {
-            found->second->plan->Failed();
+            found->second->plan->Failed(Delays());
         }
         found->second->last = std::move(run);
     }
     loop_.OnReadable(watcher_.Fd(), [this] { RunWatcher(); });
     WatchShares();
     Advance();
+}
+
+RetryDelays Service::Delays() const {
+    return {config_.retry_first.count(), config_.retry_max.count()};
 }
 
 void Service::SetConfig(const DaemonConfig& config) {
@@ -656,7 +660,7 @@ void Service::EndRun(Task& task, const Verdict& verdict, const RunTotals& totals
         task.whole_due = true;
     }
     if (record.result == ZEL::TASK_RESULT_FAILED) {
-        task.plan->Failed();
+        task.plan->Failed(Delays());
         task.connection.reset();
         Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s': %s\n", __LINE__,
                        task.record.Name().c_str(), record.error.c_str());

@@ -107,7 +107,7 @@ private:
     void StartRun(Task& task, const Due& due);
     void FillOrder(Task& task, const Due& due, RunPlan& plan);
     void EndRun(Task& task, const programs::Verdict& verdict, const programs::RunTotals& totals);
-    void NoteEnd(Task& task, RunRecord record);
+    RetryDelays Delays() const;
     void SetAlarm();
     std::optional<int64_t> UntilNextStep(const Task& task) const;
 

@@ -74,12 +74,12 @@ bool TaskPlan::WasSetBack(int64_t now) const {
     return checked_until_ > now + kSetRightSeconds;
 }
 
-void TaskPlan::Failed() {
-    int64_t delay = kFirstRetryMs;
-    for (unsigned int i = 0; i < failures_ && delay < kLongestRetryMs; ++i) {
+void TaskPlan::Failed(const RetryDelays& delays) {
+    int64_t delay = delays.first;
+    for (unsigned int i = 0; i < failures_ && delay < delays.longest; ++i) {
         delay *= 2;
     }
-    delay = std::min(delay, kLongestRetryMs);
+    delay = std::min(delay, delays.longest);
     ++failures_;
     const double factor = 1 + kJitter * (2 * random_() - 1);
     retry_at_ = clock_.Elapsed() + static_cast<int64_t>(static_cast<double>(delay) * factor);

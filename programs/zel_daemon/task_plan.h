@@ -19,6 +19,12 @@ public:
     virtual int64_t Elapsed() const = 0;
 };
 
+/// How long a failed run waits for its next try, in milliseconds: the first time, and at most.
+struct RetryDelays {
+    int64_t first = 10000;
+    int64_t longest = 3600000;
+};
+
 class SystemClock : public Clock {
 public:
     int64_t Now() const override;
@@ -30,15 +36,13 @@ public:
 ///
 /// Schedule: a run that was missed (the machine was off, the clock jumped ahead) is made up for
 /// once, however many were missed. After a jump back the schedule goes on from the time that the
-/// clock shows. A failed run is tried again after 10 s, 20 s, 40 s ... up to 1 h, each up to a
-/// fifth shorter or longer so that many clients do not come back together.
+/// clock shows. A failed run is tried again after 10 s, 20 s, 40 s ... up to 1 h unless other
+/// delays are given, each up to a fifth shorter or longer so that many clients do not come back
+/// together.
 ///
 /// Threads: one thread.
 class TaskPlan {
 public:
-    static constexpr int64_t kFirstRetryMs = 10000;
-    static constexpr int64_t kLongestRetryMs = 3600000;
-
     /// `checked_until`: runs of the schedule up to here have been made. `random` gives numbers from
     /// 0 to below 1; tests set their own.
     TaskPlan(const Clock& clock, const ZEL::Schedule& schedule, int64_t checked_until,
@@ -56,7 +60,7 @@ public:
     int64_t CheckedUntil() const { return checked_until_; }
 
     /// A run failed: sets the moment of the next try.
-    void Failed();
+    void Failed(const RetryDelays& delays = {});
     /// A run was made well, or cancelled by a person: no try is waiting any more.
     void Settled();
     /// Whether a failed run waits to be tried again, and whether its moment has come.

@@ -1,0 +1,388 @@
+// The daemon as a whole, against a real server: whatever happens on disk, to the daemon, to the
+// server or on the socket, both sides are equal in the end and nothing is done needlessly.
+#include <dirent.h>
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/mount.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <random>
+#include <thread>
+
+#include "ZEL/channel.h"
+#include "ZEL/ipc.h"
+#include "ZEL/sync_obj.h"
+#include "programs/zel_daemon/sqlite.h"
+#include "tests/integration/client_and_server.h"
+#include "tests/integration/daemon_process.h"
+
+namespace fs = std::filesystem;
+using std::chrono::milliseconds;
+using std::chrono::steady_clock;
+using test::Await;
+using test::Must;
+using test::Request;
+using testing::AllOf;
+using testing::HasSubstr;
+using testing::Not;
+using ZEL::PObject;
+
+namespace {
+
+/// Every entry below a folder with its content; of a link its target, because the server keeps
+/// links in files.
+std::map<std::string, std::string> TreeOf(const std::string& folder,
+                                          const std::string& below = "") {
+    std::map<std::string, std::string> tree;
+    std::error_code ignored;
+    for (fs::directory_iterator at(folder + below, ignored), end; at != end;
+         at.increment(ignored)) {
+        const std::string name = below + "/" + at->path().filename().string();
+        if (at->is_symlink(ignored)) {
+            tree[name] = fs::read_symlink(at->path(), ignored);
+        } else if (at->is_directory(ignored)) {
+            tree[name] = "/";
+            tree.merge(TreeOf(folder, name));
+        } else {
+            tree[name] = test::ReadFile(at->path());
+        }
+    }
+    return tree;
+}
+
+class DaemonTest : public testing::Test, public test::ClientAndServer {
+protected:
+    DaemonTest() { Settings(""); }
+
+    void Settings(const std::string& more) const {
+        folder_.Write("client/usr/tarq/etc/zel_daemon.conf",
+                      "[daemon]\ngather_ms=\"50\"\ngather_max_ms=\"1000\"\nretry_first_ms=\"200\"\n"
+                      "retry_max_ms=\"1000\"\n" +
+                          more);
+    }
+    static PObject TaskOf(ZEL::SCHD_MODE mode) {
+        PObject request = Request("task_add");
+        request["name"] = "t";
+        request["share_list"].asArray().emplace_back("docs");
+        request["server_ip"] = "127.0.0.1";
+        request["user"] = "alice";
+        request["pswd"] = "secret";
+        request["schedule_mode"] = static_cast<int>(mode);
+        return request;
+    }
+    void AddTask(ZEL::SCHD_MODE mode = ZEL::SCHD_MODE_REALTIME) {
+        const PObject reply = zel_.Ask(TaskOf(mode));
+        ASSERT_EQ(reply["result"].asInt32(), 0) << reply.toString();
+    }
+    PObject Task() const { return zel_.Ask("task_show", "t")["task"]; }
+    /// All that has to be done is done.
+    bool IsAtRest() const {
+        const PObject task = Task();
+        return task["status"].asInt32() == ZEL::TASK_STATUS_IDLE && !task.hasMember("retry_in") &&
+               task["pending"].asUInt64() == 0;
+    }
+    bool IsEqual() const { return TreeOf(source_) == TreeOf(storage_ + "/docs"); }
+    void AwaitEqual(const std::string& what = "", int seconds = 60) {
+        const bool equal = Await([&] { return IsAtRest() && IsEqual(); }, seconds);
+        EXPECT_TRUE(equal) << what << ": " << Task().toString()
+                           << test::RunProgram("", {"diff", "-r", "-q", "--no-dereference", source_,
+                                                    storage_ + "/docs"})
+                                  .output;
+    }
+    std::vector<PObject> Runs() const {
+        PObject request = Request("task_log", "t");
+        request["limit"] = 200;
+        return zel_.Ask(request)["runs"].asArray();
+    }
+    uint64_t RsyncRuns() const {
+        uint64_t sum = 0;
+        for (const PObject& run : Runs()) {
+            sum += run["rsync_runs"].asUInt64();
+        }
+        return sum;
+    }
+    void StartRealtime() {
+        zel_.Start();
+        AddTask();
+        AwaitEqual("first");
+    }
+    static void TellFigure(const std::string& name, uint64_t value) {
+        RecordProperty(name, static_cast<int>(value));
+        std::printf("[ figure   ] %s: %llu\n", name.c_str(),
+                    static_cast<unsigned long long>(value));
+    }
+    /// How much is to be done: ZEL_STRESS_SECONDS, or 10.
+    static int Stress() {
+        const char* const seconds = getenv("ZEL_STRESS_SECONDS");
+        return std::clamp(seconds != nullptr ? atoi(seconds) : 10, 1, 50);
+    }
+
+    test::DaemonProcess zel_{folder_.Path("client"), folder_.Path("zel_daemon.log")};
+};
+
+TEST_F(DaemonTest, WhatChangesOnDiskIsSoonAtTheServer) {
+    StartRealtime();
+    const std::string outside = folder_.Path("outside");
+    folder_.Write("outside/tree/deep/x", "moved in");
+    folder_.Write("outside/secret/deep/passwd", "top secret");
+    const auto in = [&](const std::string& name) { return source_ + "/" + name; };
+    const struct {
+        const char* what;
+        std::function<void()> change;
+    } steps[] = {
+        {"create", [&] { Write("new", "n"); }},
+        {"change", [&] { Write("new", "changed"); }},
+        {"rename", [&] { fs::rename(in("new"), in("renamed")); }},
+        {"delete", [&] { fs::remove(in("renamed")); }},
+        {"a tree moved in", [&] { fs::rename(outside + "/tree", in("tree")); }},
+        {"changed below", [&] { Write("tree/deep/x", "changed"); }},
+        {"a tree renamed", [&] { fs::rename(in("tree"), in("sub/tree2")); }},
+        {"a tree moved out", [&] { fs::rename(in("sub/tree2"), outside + "/tree"); }},
+        {"a link", [&] { fs::create_symlink("a.txt", in("link")); }},
+        {"a dangling link", [&] { fs::create_symlink("/nowhere", in("dangling")); }},
+        {"a link to a folder outside", [&] { fs::create_symlink(outside, in("out")); }},
+        {"a folder, then a link in its place",
+         [&] {
+             Write("middle/deep/passwd", "mine");
+             AwaitEqual();
+             // Told as changes of a path that leads outside by the time it is sent.
+             Write("middle/deep/passwd", "mine again");
+             fs::rename(in("middle"), outside + "/was");
+             fs::create_symlink(outside + "/secret", in("middle"));
+         }},
+        {"odd names",
+         [&] {
+             for (const char* name : {"-n", "--delete", "*", "[a]", "?", "# c", "; ls", "a\nb",
+                                      "\xff\xfe", "tab\t", " lead", "back\\slash", "- x", "$(id)",
+                                      ".~tmp~", "\x01", "a/./b", "c/...", "::m"}) {
+                 Write(name, name);
+                 Write(std::string("odd/") + name + "/f", name);
+             }
+             Write(std::string(255, 'l'), "long");
+         }},
+        {"all gone",
+         [&] {
+             for (const auto& entry : fs::directory_iterator(source_)) {
+                 fs::remove_all(entry.path());
+             }
+         }},
+    };
+    for (const auto& step : steps) {
+        step.change();
+        AwaitEqual(step.what);
+        for (const auto& [name, content] : TreeOf(storage_)) {
+            EXPECT_NE(content, "top secret") << name;
+        }
+    }
+    EXPECT_EQ(Runs().front()["error"].asString(), "");
+}
+
+TEST_F(DaemonTest, AFloodOfChangesCostsFewRuns) {
+    StartRealtime();
+    const int files = Stress() * 1000;  // five changes each: 50,000 unless told otherwise
+    const uint64_t before = RsyncRuns();
+    const auto path = [&](int i) {
+        return source_ + "/flood/" + std::to_string(i % 100) + "/" + std::to_string(i);
+    };
+    for (int i = 0; i < 100; ++i) {
+        fs::create_directories(source_ + "/flood/" + std::to_string(i));
+    }
+    for (int i = 0; i < files; ++i) {
+        std::ofstream(path(i)) << i;
+        std::ofstream(path(i), std::ios::app) << "more";
+        chmod(path(i).c_str(), 0640);
+        fs::rename(path(i), path(i) + "r");
+        if (i % 2 == 0) {
+            fs::remove(path(i) + "r");
+        }
+    }
+    AwaitEqual("flood", 180);
+    TellFigure("rsync runs for " + std::to_string(files * 5) + " changes", RsyncRuns() - before);
+    // 16 paths a run at most, and a run begins only when the one before has ended.
+    EXPECT_LE(RsyncRuns() - before, 100u);
+}
+
+TEST_F(DaemonTest, AnOverflowOfTheQueueIsMadeUpForByOneComparison) {
+    StartRealtime();
+    const uint64_t before = RsyncRuns();
+    zel_.Signal(SIGSTOP);
+    std::ifstream queue("/proc/sys/fs/inotify/max_queued_events");
+    int events = 0;
+    queue >> events;
+    for (int i = 0; i < events / 2 + 100; ++i) {  // each is made and closed
+        Write("over" + std::to_string(i % 2) + "/" + std::to_string(i), "");
+        if (i == 0) {
+            zel_.Signal(SIGCONT);  // the new folders get their watches
+            ASSERT_TRUE(Await([&] { return IsEqual(); }));
+            Write("over1/first", "");
+            ASSERT_TRUE(Await([&] { return IsAtRest() && IsEqual(); }));
+            zel_.Signal(SIGSTOP);
+        }
+    }
+    zel_.Signal(SIGCONT);
+    AwaitEqual("overflow");
+    EXPECT_THAT(zel_.Log(), HasSubstr("too many changes at once; it is compared whole"));
+    TellFigure("rsync runs after an overflow", RsyncRuns() - before);
+    EXPECT_LE(RsyncRuns() - before, 12u);
+}
+
+TEST_F(DaemonTest, FoldersBeyondTheWatchLimitAreComparedNowAndThen) {
+    for (int i = 0; i < 40; ++i) {
+        Write("d" + std::to_string(i) + "/f", "x");
+    }
+    Settings("poll_seconds=\"1\"\n");
+    try {  // a limit of its own needs a user namespace of its own
+        zel_.Start({"unshare", "-Ur", "sh", "-c",
+                    "echo 20 >/proc/sys/user/max_inotify_watches && exec \"$@\"", "sh"});
+    } catch (const std::exception& error) {
+        GTEST_SKIP() << error.what();
+    }
+    AddTask();
+    AwaitEqual("first");
+    EXPECT_THAT(Task()["note"].asString(), HasSubstr("raise fs.inotify.max_user_watches"));
+    for (int i = 0; i < 40; ++i) {
+        Write("d" + std::to_string(i) + "/f", "changed");
+    }
+    AwaitEqual("changed where nobody watches");
+}
+
+TEST_F(DaemonTest, AShareWhoseFolderIsAwayCostsNothingAndComesBack) {
+    StartRealtime();
+    fs::rename(source_, source_ + ".away");
+    ASSERT_TRUE(Await([&] { return Task()["sync_result"].asInt32() == ZEL::TASK_RESULT_FAILED; }));
+    EXPECT_THAT(Task()["note"].asString(), HasSubstr("its folder has gone"));
+    std::this_thread::sleep_for(std::chrono::seconds(3));
+    EXPECT_LE(Runs().size(), 10u);
+    EXPECT_LE(zel_.Log().size(), 10000u) << "it goes round and round";
+    EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
+    fs::rename(source_ + ".away", source_);
+    Write("while/away", "x");
+    AwaitEqual("back");
+    Write("while/there", "x");
+    AwaitEqual("watched again");
+    EXPECT_EQ(Task()["note"].asString(), "");
+}
+
+TEST_F(DaemonTest, AnOutageLosesNothingAndMakesNoHotLoop) {
+    StartRealtime();
+    StopServer();
+    const size_t runs = Runs().size();
+    const auto begin = steady_clock::now();
+    Write("during/outage", "x");
+    fs::remove(source_ + "/a.txt");
+    ASSERT_TRUE(Await([&] { return Runs().size() >= runs + 5; }));
+    EXPECT_THAT(Task()["last_error"].asString(), HasSubstr("refused"));
+    EXPECT_GT(Task()["pending"].asUInt64(), 0u);
+    const double seconds = std::chrono::duration<double>(steady_clock::now() - begin).count();
+    // 0.2 s, 0.4 s, 0.8 s, then 1 s, each a fifth shorter at most.
+    EXPECT_GE(seconds, 0.8 * (0.2 + 0.4 + 0.8 + 1.0));
+    Write("during/later", "y");
+    EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
+    StartServer();
+    AwaitEqual("after the outage");
+    EXPECT_EQ(Task()["last_error"].asString(), "");
+}
+
+TEST_F(DaemonTest, AFullDiskAtTheServerIsSaidAndItsChangesAreSentLater) {
+    const std::string small = folder_.Path("small");
+    if (geteuid() != 0 || mkdir(small.c_str(), 0755) != 0 ||
+        mount("tmpfs", small.c_str(), "tmpfs", 0, "size=4m") != 0) {
+        GTEST_SKIP() << "needs root to mount a small disk";
+    }
+    Must(Server(
+        {"setup", "--storage", small, "--port", std::to_string(port_), "--address", "127.0.0.1"}));
+    const auto equal = [&] { return IsAtRest() && TreeOf(source_) == TreeOf(small + "/docs"); };
+    zel_.Start();
+    AddTask();
+    EXPECT_TRUE(Await(equal));
+    std::ofstream(source_ + "/large") << std::string(8 << 20, 'x');
+    EXPECT_TRUE(Await([&] {
+        return Task()["last_error"].asString().find("full") != std::string::npos;
+    })) << Task().toString();
+    EXPECT_GT(Task()["pending"].asUInt64(), 0u);
+    EXPECT_EQ(mount("tmpfs", small.c_str(), "tmpfs", MS_REMOUNT, "size=32m"), 0);
+    EXPECT_TRUE(Await(equal)) << Task().toString();
+    umount2(small.c_str(), MNT_DETACH);
+}
+
+/// Changes a tree for as long as it lives.
+class Writer {
+public:
+    explicit Writer(std::string folder) : folder_(std::move(folder)), thread_([this] { Run(); }) {}
+    ~Writer() {
+        stop_ = true;
+        thread_.join();
+    }
+
+private:
+    std::string Path() {
+        return folder_ + "/" + std::to_string(random_() % 5) + "/" + std::to_string(random_() % 5);
+    }
+    void Run() {
+        std::error_code ignored;
+        while (!stop_) {
+            const std::string path = Path();
+            switch (random_() % 5) {
+                case 0:
+                    fs::remove_all(path, ignored);
+                    break;
+                case 1:
+                    fs::rename(path, Path(), ignored);
+                    break;
+                case 2:
+                    fs::create_directories(path, ignored);
+                    break;
+                default:
+                    fs::create_directories(fs::path(path).parent_path(), ignored);
+                    std::ofstream(path) << random_();
+            }
+            std::this_thread::sleep_for(milliseconds(2));
+        }
+    }
+
+    const std::string folder_;
+    std::minstd_rand random_{7};
+    std::atomic<bool> stop_{false};
+    std::thread thread_;
+};
+
+TEST_F(DaemonTest, AHundredKillsLoseNothing) {
+    StartRealtime();
+    std::minstd_rand random(11);
+    uint64_t in_a_run = 0;
+    {
+        const Writer writer(source_ + "/busy");
+        for (int i = 0; i < 100; ++i) {
+            std::this_thread::sleep_for(milliseconds(random() % 400));
+            zel_.End(SIGKILL);
+            {
+                zel_daemon::Database store(folder_.Path("client/usr/tarq/etc/zel_daemon/tasks.db"));
+                zel_daemon::Query check(store, "PRAGMA integrity_check");
+                ASSERT_TRUE(check.Next());
+                ASSERT_EQ(check.Text(), "ok") << "after " << i;
+                in_a_run += store.Number("SELECT count(*) FROM runs WHERE end_time = 0") > 0;
+            }
+            zel_.Start();
+        }
+    }
+    AwaitEqual("after the kills");
+    TellFigure("kills in the middle of a run", in_a_run);
+    EXPECT_GE(in_a_run, 20u);
+    // What comes after needs no whole comparison: the watch stands.
+    Write("after", "x");
+    AwaitEqual("after");
+}
+
+}  // namespace
