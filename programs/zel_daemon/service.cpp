@@ -135,7 +135,9 @@ void Service::SetConfig(const DaemonConfig& config) {
 
 void Service::Refresh() {
     // What could not be watched in full is searched anew: the limit may have been raised.
+    tzset();
     for (const auto& [id, task] : tasks_) {
+        task->plan->ZoneChanged();
         for (const auto& [share, note] : task->notes) {
             watched_.erase(share);
         }
@@ -483,7 +485,6 @@ void Service::StoreGathered(Task& task) {
 // Takes every step that is due, and sleeps until the next one is. Called after whatever happened.
 void Service::Advance() {
     const int64_t now = clock_.Elapsed();
-    tzset();
     std::vector<std::pair<Task*, Due>> due;
     for (const auto& [id, task] : tasks_) {
         try {
