@@ -551,14 +551,15 @@ std::optional<Service::Due> Service::WhatIsDue(Task& task) {
 // folders have been found, so that no change falls between the comparison and the watch.
 bool Service::MayStart(const Task& task) const {
     unsigned int running = 0;
-    for (const auto& [id, other] : tasks_) {
-        if (!other->active) {
+    for (const auto& entry : tasks_) {
+        const Task& other = *entry.second;
+        if (!other.active) {
             continue;
         }
         ++running;
         const std::list<std::string>& shares = task.record.Info().GetShareList();
         if (std::any_of(shares.begin(), shares.end(),
-                        [&](const std::string& share) { return other->HasShare(share); })) {
+                        [&](const std::string& share) { return other.HasShare(share); })) {
             return false;
         }
     }
