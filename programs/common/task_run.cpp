@@ -10,6 +10,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <mutex>
+#include <optional>
 #include <thread>
 #include <utility>
 
@@ -30,6 +31,8 @@ using TARQ::Backup::RunReport;
 using TARQ::Backup::ScopedRunOptions;
 
 constexpr std::chrono::seconds kBeaconEvery(60);  // the server takes a task for dead after 120
+// The server is told of the end even when a person has had enough, unless it does not answer.
+constexpr std::chrono::milliseconds kLastWords(800);
 constexpr int kVanishedFiles = 24;  // rsync: some files were gone before it came to them
 constexpr int kLookupFailed = 42;
 constexpr int kNothingSent = 213;
@@ -39,26 +42,50 @@ std::list<std::string> ToList(const std::vector<std::string>& items) {
     return {items.begin(), items.end()};
 }
 
-// The library asks a function without an argument whether to give up: what it looks at is the
-// thread's own.
-thread_local const std::atomic<bool>* wanted = nullptr;
+/// Somebody's wish to end, and when it was first seen.
+class Patience {
+public:
+    explicit Patience(const std::atomic<bool>& cancel) : cancel_(cancel) {}
 
-bool CancelWanted() {
-    return wanted != nullptr && wanted->load(std::memory_order_relaxed);
-}
+    /// Whether the wish has been there for so long.
+    bool IsOver(std::chrono::milliseconds more) {
+        if (!cancel_.load(std::memory_order_relaxed)) {
+            return false;
+        }
+        const auto now = std::chrono::steady_clock::now();
+        since_ = since_.value_or(now);
+        return now - *since_ >= more;
+    }
 
-/// The operations of this thread look at `cancel` until the scope ends; null: at nothing.
+private:
+    const std::atomic<bool>& cancel_;
+    std::optional<std::chrono::steady_clock::time_point> since_;
+};
+
+/// The operations of this thread give up, until the scope ends, when patience has been over for so
+/// long.
 class CancelScope {
 public:
-    explicit CancelScope(const std::atomic<bool>* cancel)
-        : before_(std::exchange(wanted, cancel)) {}
-    ~CancelScope() { wanted = before_; }
+    explicit CancelScope(Patience& patience, std::chrono::milliseconds more = {})
+        : patience_(patience), more_(more), before_(std::exchange(current, this)) {}
+    ~CancelScope() { current = before_; }
     CancelScope(const CancelScope&) = delete;
     CancelScope& operator=(const CancelScope&) = delete;
 
+    // The library asks a function without an argument: what it looks at is the thread's own.
+    static bool IsWanted() {
+        return current != nullptr && current->patience_.IsOver(current->more_);
+    }
+
 private:
-    const std::atomic<bool>* before_;
+    static thread_local CancelScope* current;
+
+    Patience& patience_;
+    const std::chrono::milliseconds more_;
+    CancelScope* const before_;
 };
+
+thread_local CancelScope* CancelScope::current = nullptr;
 
 /// Tells the server that the run is alive, from a thread and a connection of its own.
 class Beacon {
@@ -85,9 +112,10 @@ public:
 
 private:
     void Run() {
-        const CancelScope scope(&stop_);
+        Patience patience(stop_);
+        const CancelScope scope(patience);
         ZEL::Rsyncer rsyncer;
-        rsyncer.SetCancelChecker(CancelWanted);
+        rsyncer.SetCancelChecker(CancelScope::IsWanted);
         bool ready = false;
         std::unique_lock<std::mutex> lock(mutex_);
         while (!wake_.wait_for(lock, kBeaconEvery, [this] { return stop_.load(); })) {
@@ -189,7 +217,7 @@ Trouble TroubleOf(int status) {
 struct TaskRun::Impl {
     Impl(const ZEL::SyncInfo& sync_info, const std::atomic<bool>& cancel_flag, RunListener told)
         : info(sync_info), cancel(cancel_flag), listener(std::move(told)) {
-        rsyncer.SetCancelChecker(CancelWanted);
+        rsyncer.SetCancelChecker(CancelScope::IsWanted);
     }
 
     RunOptions Reporting() {
@@ -341,8 +369,7 @@ struct TaskRun::Impl {
     }
 
     Verdict Finish(const std::string& share, bool completed) {
-        // The last word is sent even when a person has had enough.
-        const CancelScope patient(nullptr);
+        const CancelScope patient(patience, kLastWords);
         const RunReport of_the_run = report;
         int status = 0;
         int sent = 0;
@@ -382,6 +409,7 @@ struct TaskRun::Impl {
 
     ZEL::SyncInfo info;
     const std::atomic<bool>& cancel;
+    Patience patience{cancel};
     RunListener listener;
     RunReport report;         // of the last thing that was run
     uint64_t rsync_runs = 0;  // copies made
@@ -394,7 +422,7 @@ TaskRun::TaskRun(const ZEL::SyncInfo& info, const std::atomic<bool>& cancel, Run
 TaskRun::~TaskRun() = default;
 
 Verdict TaskRun::Connect() {
-    const CancelScope scope(&impl_->cancel);
+    const CancelScope scope(impl_->patience);
     const ScopedRunOptions watched(impl_->Reporting());
     const int status = impl_->rsyncer.Initialize(impl_->info);
     const std::string& name = impl_->info.GetServerName();
@@ -405,12 +433,12 @@ Verdict TaskRun::Connect() {
 }
 
 Verdict TaskRun::CheckPairing(const std::vector<std::string>& shares) {
-    const CancelScope scope(&impl_->cancel);
+    const CancelScope scope(impl_->patience);
     return impl_->Pair(true, shares);
 }
 
 Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
-    const CancelScope scope(&impl_->cancel);
+    const CancelScope scope(impl_->patience);
     std::vector<std::string> names;
     for (const ShareOrder& share : order.shares) {
         names.push_back(share.share);
@@ -434,7 +462,7 @@ Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
     }
     totals.rsync_runs += impl_->rsync_runs;
     if (announced) {
-        const CancelScope patient(nullptr);
+        const CancelScope patient(impl_->patience, kLastWords);
         impl_->rsyncer.FinishSync("task", order.task, ignored);
     }
     return result;
@@ -442,7 +470,7 @@ Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
 
 Verdict TaskRun::List(const RunOrder& order, const ChangeHandler& on_change,
                       const std::function<void(const std::string& share)>& on_missing) {
-    const CancelScope scope(&impl_->cancel);
+    const CancelScope scope(impl_->patience);
     for (const ShareOrder& share : order.shares) {
         Verdict result = impl_->ListShare(order, share, on_change, on_missing);
         if (!result.Ok()) {
