@@ -31,7 +31,7 @@ using TARQ::Backup::RunReport;
 using TARQ::Backup::ScopedRunOptions;
 
 constexpr std::chrono::seconds kBeaconEvery(60);  // the server takes a task for dead after 120
-constexpr std::chrono::seconds kLastWord(5);
+constexpr std::chrono::seconds kLastWord(1);
 constexpr int kVanishedFiles = 24;  // rsync: some files were gone before it came to them
 constexpr int kLookupFailed = 42;
 constexpr int kNothingSent = 213;

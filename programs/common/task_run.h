@@ -77,7 +77,7 @@ using ChangeHandler = std::function<void(const std::string& share, const TARQ::B
 class TaskRun {
 public:
     /// `cancel` outlives this object; when it is true the operation under way ends within a second,
-    /// with kCancelled.
+    /// with kCancelled; within two when the server does not answer.
     TaskRun(const ZEL::SyncInfo& info, const std::atomic<bool>& cancel, RunListener listener = {});
     ~TaskRun();
     TaskRun(const TaskRun&) = delete;

@@ -11,7 +11,9 @@
 #include <chrono>
 #include <cstring>
 #include <future>
+#include <optional>
 #include <stdexcept>
+#include <system_error>
 #include <utility>
 #include <vector>
 
@@ -24,12 +26,14 @@ namespace zel_daemon {
 namespace {
 
 using std::chrono::milliseconds;
+using std::chrono::steady_clock;
 using ZEL::Logger;
 using ZEL::PObject;
 
 constexpr unsigned int kChannelBytes = 81920;      // as an IPCSender's
 constexpr unsigned int kIdleSeconds = 60;          // a connection that asks nothing is closed
 constexpr unsigned int kRefusedSeconds = 5;        // one that may not ask has less time to
+constexpr size_t kMaxRequestBytes = 1 << 20;       // a task with thousands of patterns has less
 constexpr milliseconds kWatchEvery(200);           // a watcher hears no more often than this ...
 constexpr std::chrono::seconds kWatchAtLeast(30);  // ... and no less
 constexpr std::chrono::seconds kPeerCheck(1);      // how soon a watcher that has gone is noticed
@@ -63,6 +67,42 @@ bool IsPeerThere(int fd) {
     pollfd watched = {fd, POLLRDHUP, 0};
     return poll(&watched, 1, 0) == 0;
 }
+
+// Takes what has come and nobody reads: closing over it would tell the other side of a broken
+// connection.
+void Drain(int fd) {
+    char bytes[4096];
+    for (int i = 0; i < 64 && recv(fd, bytes, sizeof bytes, MSG_DONTWAIT) > 0; ++i) {
+    }
+}
+
+/// Gives up in the middle of a request that is too large.
+class RequestChannel : public ZEL::Channel {
+public:
+    using Channel::Channel;
+
+    void Begin() { left_ = kMaxRequestBytes; }
+
+    int ReadByte(unsigned char* value) override {
+        return Take(sizeof *value) ? Channel::ReadByte(value) : int{ZEL::RESULT_PROTOCOL};
+    }
+    int ReadInt16(unsigned short* value) override {
+        return Take(sizeof *value) ? Channel::ReadInt16(value) : int{ZEL::RESULT_PROTOCOL};
+    }
+    using Channel::Read;
+    int Read(char* buffer, unsigned int want) override {
+        return Take(want) ? Channel::Read(buffer, want) : int{ZEL::RESULT_PROTOCOL};
+    }
+    bool TooLarge() const { return left_ == 0; }
+
+private:
+    bool Take(size_t bytes) {
+        left_ -= std::min(bytes, left_);
+        return left_ > 0;
+    }
+
+    size_t left_ = kMaxRequestBytes;
+};
 
 bool HasGroup(int fd, const ucred& peer, gid_t group) {
     if (peer.gid == group) {
@@ -108,32 +148,70 @@ public:
     bool Ended() const { return ended_; }
     bool HasPeer() const { return !Stopped() && IsPeerThere(fd_); }
 
+    /// Since when the other side is to send a request; nothing while it is answered.
+    std::optional<steady_clock::time_point> WaitingSince() {
+        const std::lock_guard<std::mutex> lock(mutex_);
+        return waiting_since_;
+    }
+    /// Lets the thread end at once if it waits for a request.
+    void StopWaiting() {
+        const std::lock_guard<std::mutex> lock(mutex_);
+        if (waiting_since_) {
+            Stop();
+            shutdown(fd_, SHUT_RDWR);
+        }
+    }
+
 private:
+    void SetWaiting(bool waiting) {
+        const std::lock_guard<std::mutex> lock(mutex_);
+        waiting_since_ = waiting ? std::optional(steady_clock::now()) : std::nullopt;
+    }
+
     void Serve(bool allowed) {
         if (channel_.Open(fd_, true) != ZEL::RESULT_SUCCESS) {
             close(fd_);
             return;
         }
-        const unsigned int patience = allowed ? kIdleSeconds : kRefusedSeconds;
-        while (IsAsking(fd_, patience, [this] { return Stopped(); })) {
-            PObject request;
-            if (ZEL::PStream().Recv(channel_, request) != ZEL::RESULT_SUCCESS) {
-                return;
-            }
-            if (!allowed) {
-                PObject refusal;
-                refusal["result"] = static_cast<int>(ZEL::RESULT_NO_PERMISSION);
-                refusal["error"] =
-                    "only root, the daemon's own user and the members of its group "
-                    "(zel_daemon.conf)"
-                    " may ask it";
-                ZEL::PStream().Send(channel_, refusal);
-                return;
-            }
-            if (!Reply(request)) {
-                return;
-            }
+        while (ServeOne(allowed)) {
         }
+    }
+
+    // False: the connection has had its last reply.
+    bool ServeOne(bool allowed) {
+        PObject request;
+        SetWaiting(true);
+        const bool asks =
+            IsAsking(fd_, allowed ? kIdleSeconds : kRefusedSeconds, [this] { return Stopped(); });
+        channel_.Begin();
+        const int received =
+            asks && allowed ? ZEL::PStream().Recv(channel_, request) : int{ZEL::RESULT_SUCCESS};
+        SetWaiting(false);
+        if (!asks || Stopped()) {
+            return false;
+        }
+        if (!allowed) {
+            return SendLast(ZEL::RESULT_NO_PERMISSION,
+                            "only root, the daemon's own user and the members of its group "
+                            "(zel_daemon.conf) may ask it");
+        }
+        if (channel_.TooLarge()) {
+            return SendLast(ZEL::RESULT_PROTOCOL,
+                            "a request has at most " + std::to_string(kMaxRequestBytes) + " bytes");
+        }
+        if (received == ZEL::RESULT_PROTOCOL) {
+            return SendLast(ZEL::RESULT_PROTOCOL, "what was sent is no value");
+        }
+        return received == ZEL::RESULT_SUCCESS && Reply(request);
+    }
+
+    bool SendLast(int code, const std::string& error) {
+        PObject refusal;
+        refusal["result"] = code;
+        refusal["error"] = error;
+        Send(refusal);
+        Drain(fd_);
+        return false;
     }
 
     bool Send(const PObject& reply) {
@@ -197,7 +275,9 @@ private:
     Peer peer_;
     int stop_ = 0;  // accessed atomically; an int because it is the channel's abort flag
     std::atomic<bool> ended_{false};
-    ZEL::Channel channel_;
+    std::mutex mutex_;
+    std::optional<steady_clock::time_point> waiting_since_ = steady_clock::now();  // by the mutex
+    RequestChannel channel_;
     std::thread thread_;
 };
 
@@ -256,6 +336,9 @@ void IpcServer::Accept() {
         return;
     }
     if (sessions_.size() >= kMaxConnections) {
+        EndLongestWaiting();
+    }
+    if (sessions_.size() >= kMaxConnections) {
         Logger::LogMsg(Logger::LEVEL_WARNING,
                        "[WARNING] zel_daemon(%d): more than %zu connections: one is refused\n",
                        __LINE__, kMaxConnections);
@@ -264,17 +347,41 @@ void IpcServer::Accept() {
     }
     Peer peer;
     const bool allowed = MayAsk(fd, peer);
-    sessions_.push_back(std::make_unique<Session>(*this, fd, allowed, peer));
+    try {
+        sessions_.push_back(std::make_unique<Session>(*this, fd, allowed, peer));
+    } catch (const std::system_error& error) {
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] zel_daemon(%d): no thread: %s\n", __LINE__,
+                       error.what());
+        close(fd);
+    }
 }
 
 void IpcServer::SweepEnded() {
     sessions_.remove_if([](const std::unique_ptr<Session>& session) { return session->Ended(); });
 }
 
+// Connections that ask nothing keep nobody out.
+void IpcServer::EndLongestWaiting() {
+    Session* longest = nullptr;
+    std::optional<steady_clock::time_point> since;
+    for (const auto& session : sessions_) {
+        const auto waiting = session->WaitingSince();
+        if (waiting && (!since || *waiting < *since)) {
+            since = waiting;
+            longest = session.get();
+        }
+    }
+    if (longest != nullptr) {
+        longest->StopWaiting();
+        sessions_.remove_if([&](const std::unique_ptr<Session>& session) {
+            return session.get() == longest && session->Stopped();
+        });
+    }
+}
+
 // Waits until what watchers see has changed since `seen`, or it is time to show that the daemon is
 // there. False in the second case.
 bool IpcServer::WaitForChange(const Session& session, uint64_t& seen) {
-    using std::chrono::steady_clock;
     std::this_thread::sleep_for(kWatchEvery);
     const auto until = steady_clock::now() + kWatchAtLeast;
     std::unique_lock<std::mutex> lock(mutex_);

@@ -29,7 +29,8 @@ public:
     /// Answers one request, on the loop's thread.
     using Handler = std::function<ZEL::PObject(const Peer&, const ZEL::PObject&)>;
 
-    /// Connections at the same time; one more is closed at once.
+    /// Connections at the same time. For one more, that is closed which has been asking nothing for
+    /// the longest time; when there is none such, the new one.
     static constexpr size_t kMaxConnections = 64;
 
     /// Listens at `path`, mode 0660 and of the group when one is named. Throws std::runtime_error.
@@ -47,6 +48,7 @@ private:
 
     void Accept();
     void SweepEnded();
+    void EndLongestWaiting();
     bool MayAsk(int fd, Peer& peer) const;
     bool WaitForChange(const Session& session, uint64_t& seen);
 

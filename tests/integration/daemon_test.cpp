@@ -113,6 +113,16 @@ protected:
         }
         return sum;
     }
+    /// To the server and all that it has started.
+    void SignalServer(int number) const {
+        const std::string config = folder_.Path("server/usr/tarq/etc/zel_server/rsyncd.conf");
+        for (const auto& process : fs::directory_iterator("/proc")) {
+            const std::string line = test::ReadFile(process.path() / "cmdline");
+            if (line.find(config) != std::string::npos && line.rfind("rsync", 0) == 0) {
+                kill(std::stoi(process.path().filename()), number);
+            }
+        }
+    }
     void StartRealtime() {
         zel_.Start();
         AddTask();
@@ -187,6 +197,27 @@ TEST_F(DaemonTest, WhatChangesOnDiskIsSoonAtTheServer) {
         }
     }
     EXPECT_EQ(Runs().front()["error"].asString(), "");
+}
+
+TEST_F(DaemonTest, AFolderThatTurnsIntoALinkAgainAndAgainIsCopiedAsItIsInTheEnd) {
+    StartRealtime();
+    folder_.Write("outside/deep/passwd", "top secret of another size");
+    Write("middle/deep/passwd", "mine");
+    fs::create_symlink(folder_.Path("outside"), source_ + "/other");
+    AwaitEqual("before");
+    const std::string middle = source_ + "/middle";
+    const std::string other = source_ + "/other";
+    std::minstd_rand random(3);
+    const auto until = steady_clock::now() + std::chrono::seconds(std::min(Stress(), 5));
+    while (steady_clock::now() < until) {
+        std::ofstream((fs::is_symlink(middle) ? other : middle) + "/deep/passwd") << random();
+        std::this_thread::sleep_for(milliseconds(random() % 150));
+        renameat2(AT_FDCWD, middle.c_str(), AT_FDCWD, other.c_str(), RENAME_EXCHANGE);
+    }
+    AwaitEqual("after");
+    for (const auto& [name, content] : TreeOf(storage_)) {
+        EXPECT_NE(content, "top secret of another size") << name;
+    }
 }
 
 TEST_F(DaemonTest, AFloodOfChangesCostsFewRuns) {
@@ -383,6 +414,274 @@ TEST_F(DaemonTest, AHundredKillsLoseNothing) {
     // What comes after needs no whole comparison: the watch stands.
     Write("after", "x");
     AwaitEqual("after");
+}
+
+TEST_F(DaemonTest, AShareOfAnotherClientIsToldAndNothingChanges) {
+    StartRealtime();
+    const std::string registry = Server({"shares", "--json"}).output;
+    const auto copy = TreeOf(storage_);
+    folder_.Write("client2/usr/tarq/etc/tarqrsync.conf",
+                  test::ReadFile(folder_.Path("client/usr/tarq/etc/tarqrsync.conf")));
+    folder_.Write("client2/usr/tarq/etc/tarqsdk.conf", "[device]\nserial=\"CLIENT-2\"\n");
+    for (const std::string share : {"docs", "mine"}) {
+        folder_.Write("second/" + share + "/foreign", "x");
+        Must(test::RunProgram(folder_.Path("client2"),
+                              {ZELCTL, "share", "add", share, folder_.Path("second/" + share)}));
+    }
+    test::DaemonProcess other(folder_.Path("client2"), folder_.Path("other.log"));
+    other.Start();
+    PObject task = TaskOf(ZEL::SCHD_MODE_REALTIME);
+    task["share_list"].asArray().emplace_back("mine");
+    ASSERT_EQ(other.Ask(task)["result"].asInt32(), 0);
+    const auto error = [&] { return other.Ask("task_show", "t")["task"]["last_error"].asString(); };
+    EXPECT_TRUE(Await([&] { return !error().empty(); }));
+    EXPECT_THAT(error(),
+                AllOf(HasSubstr("share 'docs' belongs to another client"), Not(HasSubstr("mine"))));
+    EXPECT_EQ(Server({"shares", "--json"}).output, registry);
+    EXPECT_EQ(TreeOf(storage_), copy);
+    Write("still", "mine");
+    AwaitEqual("the first client goes on");
+}
+
+TEST_F(DaemonTest, ABadRequestIsRefusedInWordsAndChangesNothing) {
+    zel_.Start();
+    AddTask(ZEL::SCHD_MODE_MANUAL);
+    PObject list = Request("task_list");
+    list["secrets"] = 1;
+    const std::string before = zel_.Ask(list).toString();
+    const auto with = [](PObject request, const char* key, const PObject& value) {
+        request[key] = value;
+        return request;
+    };
+    const PObject add = with(TaskOf(ZEL::SCHD_MODE_MANUAL), "name", PObject("u"));
+    const PObject edit = Request("task_edit", "t");
+    PObject texts;
+    PObject number;
+    PObject many;
+    texts.asArray().emplace_back("no such share");
+    number.asArray().emplace_back(1);
+    for (int i = 0; i < 10000; ++i) {
+        many.asArray().emplace_back(std::string(50, 'x'));
+    }
+    const std::vector<PObject> requests = {PObject("text"),
+                                           PObject(7),
+                                           PObject(),
+                                           texts,
+                                           with(PObject(), "command", PObject(5)),
+                                           Request("no such"),
+                                           Request("task_show"),
+                                           Request("task_show", "none"),
+                                           with(Request("task_show"), "task", PObject(7)),
+                                           with(Request("task_list"), "brief", PObject("yes")),
+                                           with(Request("task_list"), "colour", PObject(1)),
+                                           with(Request("task_log", "t"), "limit", PObject(-1)),
+                                           with(Request("task_log", "t"), "limit", PObject(100000)),
+                                           with(add, "share_list", PObject("docs")),
+                                           with(add, "share_list", number),
+                                           with(add, "share_list", texts),
+                                           with(add, "share_list", many),
+                                           with(add, "name", PObject("t")),
+                                           with(add, "name", PObject("a\nb")),
+                                           with(add, "name", PObject("")),
+                                           with(add, "name", PObject(std::string(60000, 'n'))),
+                                           with(add, "rsync_timeout", PObject(5)),
+                                           with(add, "schedule_mode", PObject("x")),
+                                           with(add, "schedule_mode", PObject(99)),
+                                           with(add, "ssh_port", PObject(1 << 20)),
+                                           with(add, "user", PObject("")),
+                                           with(add, "paused", PObject(1)),
+                                           with(add, "", PObject(1)),
+                                           with(edit, "id", PObject(9)),
+                                           with(edit, "name", PObject("")),
+                                           with(edit, "share_list", PObject()),
+                                           Request("task_cancel", "t"),
+                                           Request("task_run", "none"),
+                                           Request("watch", "none")};
+    for (const PObject& request : requests) {
+        const PObject reply = zel_.Ask(request);
+        EXPECT_LT(reply["result"].asInt32(), 0) << request.toString().substr(0, 200);
+        EXPECT_FALSE(reply["error"].asString().empty()) << request.toString().substr(0, 200);
+    }
+    EXPECT_EQ(zel_.Ask(list).toString(), before);
+}
+
+/// A map of short strings: key, value, key, value ...
+std::string OnTheWire(const std::vector<std::string>& keys_and_values) {
+    std::string bytes = "B";
+    for (const std::string& text : keys_and_values) {
+        bytes += std::string("\x10\0", 2) + static_cast<char>(text.size()) + text;
+    }
+    return bytes + "@";
+}
+
+/// A raw connection to the daemon's socket.
+class RawPeer {
+public:
+    explicit RawPeer(const std::string& path)
+        : fd_(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+        sockaddr_un address = {};
+        address.sun_family = AF_UNIX;
+        path.copy(address.sun_path, sizeof address.sun_path - 1);
+        const timeval limit = {30, 0};
+        setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
+        connected_ = connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
+    }
+    ~RawPeer() { close(fd_); }
+    RawPeer(const RawPeer&) = delete;
+    RawPeer& operator=(const RawPeer&) = delete;
+
+    /// False when the other side takes no more.
+    bool Send(const std::string& bytes) const {
+        return send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL) ==
+               static_cast<ssize_t>(bytes.size());
+    }
+    /// All until the other side closes.
+    std::string ReadAll() const {
+        std::string all;
+        char bytes[4096];
+        for (ssize_t got; (got = recv(fd_, bytes, sizeof bytes, 0)) > 0;) {
+            all.append(bytes, static_cast<size_t>(got));
+        }
+        return all;
+    }
+    bool Connected() const { return connected_; }
+
+private:
+    int fd_;
+    bool connected_;
+};
+
+size_t ResidentKilobytes(pid_t pid) {
+    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+    for (std::string word; status >> word;) {
+        size_t kilobytes = 0;
+        if (word == "VmRSS:" && status >> kilobytes) {
+            return kilobytes;
+        }
+    }
+    return 0;
+}
+
+TEST_F(DaemonTest, HostilePeersHoldUpNobody) {
+    zel_.Start();
+    AddTask(ZEL::SCHD_MODE_MANUAL);
+    const auto expect_alive = [&](const std::string& what) {
+        const auto begin = steady_clock::now();
+        EXPECT_EQ(zel_.Ask("task_list")["tasks"].asArray().size(), 1u) << what;
+        EXPECT_LT(steady_clock::now() - begin, std::chrono::seconds(2)) << what;
+    };
+    for (const std::string& bytes :
+         {std::string("GET / HTTP/1.0\r\n\r\n"), std::string(100000, 'A'), std::string(64, '\xff'),
+          std::string("B\x01\x01\x01"), std::string("@")}) {
+        const RawPeer peer(zel_.Socket());
+        peer.Send(bytes);
+        EXPECT_THAT(peer.ReadAll(), HasSubstr("is no value")) << bytes.substr(0, 20);
+        expect_alive(bytes.substr(0, 20));
+    }
+    const size_t resident = ResidentKilobytes(zel_.Pid());
+    {
+        const RawPeer endless(zel_.Socket());
+        ASSERT_TRUE(endless.Send("A"));
+        const std::string piece = "\x10\xff\xff" + std::string(65535, 'x');
+        for (int i = 0; i < 1000 && endless.Send(piece); ++i) {
+        }
+        EXPECT_FALSE(endless.Send(piece));
+        expect_alive("endless");
+    }
+    EXPECT_LT(ResidentKilobytes(zel_.Pid()), resident + 40000);
+
+    // Half a request, and none at all, from more peers than are served at a time.
+    std::vector<std::unique_ptr<RawPeer>> silent;
+    for (int i = 0; i < 200; ++i) {
+        silent.push_back(std::make_unique<RawPeer>(zel_.Socket()));
+        silent.back()->Send(i % 2 == 0 ? "" : "B");
+    }
+    expect_alive("many");
+    silent.clear();
+
+    // Watchers that do not read: more is changed than their sockets take.
+    std::vector<std::unique_ptr<RawPeer>> deaf;
+    for (int i = 0; i < 20; ++i) {
+        deaf.push_back(std::make_unique<RawPeer>(zel_.Socket()));
+        deaf.back()->Send(OnTheWire({"command", "watch"}));
+    }
+    PObject edit = Request("task_edit", "t");
+    for (int i = 0; i < 20; ++i) {
+        edit["exclude"].asArray().emplace_back(std::string(60000, static_cast<char>('a' + i)));
+        if (i < 15) {
+            EXPECT_EQ(zel_.Ask(edit)["result"].asInt32(), 0);
+            expect_alive("deaf watchers");
+        }
+    }
+    EXPECT_EQ(zel_.End(SIGTERM), 0);
+}
+
+TEST_F(DaemonTest, AnotherUserIsToldThatHeMayNot) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "needs root to become another user";
+    }
+    zel_.Start();
+    AddTask(ZEL::SCHD_MODE_MANUAL);
+    for (const std::string& opened : {folder_.Path(), zel_.Socket()}) {
+        chmod(opened.c_str(), 0777);
+    }
+    const std::string remove = OnTheWire({"command", "task_remove", "task", "t"});
+    const pid_t child = fork();
+    if (child == 0) {
+        const bool dropped = setgid(65534) == 0 && setuid(65534) == 0;
+        const RawPeer peer(zel_.Socket());
+        peer.Send(remove);
+        _exit(dropped && peer.ReadAll().find("only root") != std::string::npos ? 0 : 1);
+    }
+    int status = -1;
+    waitpid(child, &status, 0);
+    EXPECT_EQ(status, 0);
+    EXPECT_EQ(Task()["name"].asString(), "t");
+    EXPECT_EQ(RawPeer(zel_.Socket()).Send(remove), true);  // the same bytes, from one who may
+    EXPECT_TRUE(Await([&] { return zel_.Ask("task_list")["tasks"].asArray().empty(); }));
+}
+
+TEST_F(DaemonTest, AStopIsQuickAndTheNextStartCompletes) {
+    PObject task = TaskOf(ZEL::SCHD_MODE_MANUAL);
+    task["max_bandwidth"] = 512;
+    std::ofstream(source_ + "/large") << std::string(4 << 20, 'x');
+    zel_.Start();
+    ASSERT_EQ(zel_.Ask(task)["result"].asInt32(), 0);
+    for (const bool stalled : {false, true}) {
+        zel_.Ask("task_run", "t");
+        ASSERT_TRUE(Await([&] { return Task()["progress_bytes"].asUInt64() > 0; }));
+        if (stalled) {
+            SignalServer(SIGSTOP);
+        }
+        const auto begin = steady_clock::now();
+        EXPECT_EQ(zel_.End(SIGTERM), 0);
+        EXPECT_LT(steady_clock::now() - begin, std::chrono::seconds(stalled ? 3 : 2));
+        if (stalled) {
+            SignalServer(SIGCONT);
+        }
+        zel_.Start();
+        EXPECT_THAT(Task()["last_error"].asString(), HasSubstr("the daemon was stopped"));
+        EXPECT_EQ(Task()["sync_result"].asInt32(), ZEL::TASK_RESULT_FAILED);
+    }
+    AwaitEqual("made up for");
+    EXPECT_EQ(Runs().front()["reason"].asString(), "retry");
+}
+
+TEST_F(DaemonTest, OneDaemonAtATimeWithAConfigurationThatPasses) {
+    zel_.Start();
+    test::DaemonProcess second(folder_.Path("client"), folder_.Path("second.log"));
+    EXPECT_THROW(second.Start(), std::runtime_error);
+    EXPECT_THAT(second.Log(), HasSubstr("another zel_daemon runs already"));
+    Settings("workers=\"7\"\n");
+    EXPECT_EQ(zel_.Ask("reload")["result"].asInt32(), 0);
+    Settings("workers=\"many\"\n");
+    EXPECT_THAT(zel_.Ask("reload")["error"].asString(), HasSubstr("workers is 'many'"));
+    zel_.Signal(SIGHUP);
+    EXPECT_TRUE(Await([&] { return zel_.Log().find("workers is 'many'") != std::string::npos; }));
+    EXPECT_EQ(zel_.Ask("daemon_status")["workers"].asInt32(), 7);
+    EXPECT_EQ(zel_.End(SIGTERM), 0);
+    EXPECT_THROW(zel_.Start(), std::runtime_error);
+    EXPECT_THAT(zel_.Log(), HasSubstr("not a number from 1 to 32"));
 }
 
 }  // namespace
