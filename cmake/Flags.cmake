@@ -16,7 +16,10 @@ if(ZEL_SANITIZE)
         $<$<CXX_COMPILER_ID:GNU>:-Wno-maybe-uninitialized>)  # sees ghosts in instrumented code
     target_link_options(zel_flags INTERFACE -fsanitize=${ZEL_SANITIZE})
 else()
-    target_link_options(zel_flags INTERFACE -Wl,--no-undefined)
+    target_link_options(zel_flags INTERFACE -Wl,--no-undefined -Wl,-z,relro,-z,now)
+    # What runs as root and reads what others send: overflows end the program.
+    target_compile_options(zel_flags INTERFACE -fstack-protector-strong)
+    target_compile_definitions(zel_flags INTERFACE $<$<NOT:$<CONFIG:Debug>>:_FORTIFY_SOURCE=2>)
 endif()
 
 # No path of the machine that builds stands in what it built.
