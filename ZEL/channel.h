@@ -2,11 +2,15 @@
 // on it.
 #pragma once
 
+#include <string.h>
 #include <sys/time.h>
 
+#include <algorithm>
 #include <chrono>
 #include <memory>
 #include <string>
+
+#include "ZEL/log.h"
 
 struct ssl_st;      // OpenSSL's SSL
 struct ssl_ctx_st;  // OpenSSL's SSL_CTX
@@ -14,6 +18,8 @@ struct ssl_ctx_st;  // OpenSSL's SSL_CTX
 namespace ZEL {
 
 #pragma GCC visibility push(default)
+
+class PStream;
 
 /// What the transport, encoding and IPC operations return: 0 or a positive count for success, else
 /// one of these. They are passed up unchanged. The codes that no operation of this library returns
@@ -198,14 +204,27 @@ public:
     static void log_ssl();
 
 private:
+    friend class PStream;  // moves most of a message by the shortcuts below
+
     struct Ring {
         std::unique_ptr<char[]> bytes;
         unsigned int head = 0;  // where the first byte held lies
         unsigned int size = 0;  // bytes held, from head on, round the end
     };
 
+    // Shortcuts past Write() and Read() for pieces of a few bytes. They do what these would do when
+    // the piece lies in the ring without a break, which is nearly always. Otherwise, and while each
+    // step is traced, they do nothing and the operation itself is to be called.
+    bool CanStore(size_t count) const;
+    bool Store(const void* data, size_t count);
+    bool Fetch(void* buffer, size_t count);
+    // The next `count` bytes to read, still in the ring, or null.
+    const char* Ahead(size_t count) const;
+    void Took(size_t count);
+
     void Adopt(void* handle);
     void AdoptSocket(int fd);
+    int Receive(int want, char* target, int& total);
     void CopyOut(char* buffer, unsigned int count);
     bool TimedOut(std::chrono::steady_clock::time_point last_progress) const;
     template <typename T>
@@ -225,7 +244,50 @@ private:
     bool tls_ = false;
     bool allow_untrusted_ = true;
     std::string tls_host_name_;
+    bool shortcuts_ = false;  // open, and of no derived class: that one's own operations are called
 };
+
+inline bool Channel::CanStore(size_t count) const {
+    const size_t tail = size_t{write_.head} + write_.size;
+    return shortcuts_ && !Logger::Passes(Logger::LEVEL_DEBUG) && tail <= capacity_ &&
+           count <= capacity_ - tail;
+}
+
+inline bool Channel::Store(const void* data, size_t count) {
+    if (!CanStore(count)) {
+        return false;
+    }
+    memcpy(write_.bytes.get() + write_.head + write_.size, data, count);
+    write_.size += static_cast<unsigned int>(count);
+    return true;
+}
+
+inline const char* Channel::Ahead(size_t count) const {
+    const size_t held = std::min(read_.size, capacity_ - read_.head);
+    return shortcuts_ && !Logger::Passes(Logger::LEVEL_DEBUG) && count <= held
+               ? read_.bytes.get() + read_.head
+               : nullptr;
+}
+
+inline bool Channel::Fetch(void* buffer, size_t count) {
+    const char* bytes = Ahead(count);
+    if (bytes == nullptr) {
+        return false;
+    }
+    memcpy(buffer, bytes, count);
+    Took(count);
+    return true;
+}
+
+inline void Channel::Took(size_t count) {
+    read_.size -= static_cast<unsigned int>(count);
+    const size_t head = read_.head + count;
+    // An empty ring starts again at its beginning, so that the next receive has all the room in one
+    // piece.
+    read_.head = static_cast<unsigned int>(read_.size == 0    ? 0
+                                           : head < capacity_ ? head
+                                                              : head - capacity_);
+}
 
 #pragma GCC visibility pop
 

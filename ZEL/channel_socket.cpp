@@ -34,13 +34,14 @@ bool Aborted(const int* flag) {
 int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Readiness& readiness) {
     const bool reading = watch == Watch::kRead;
     pollfd watched = {fd, static_cast<short>((reading ? POLLIN : POLLOUT) | POLLPRI), 0};
-    for (;;) {
+    // A socket nearly always takes more, and a look is cheaper than a wait.
+    for (bool look = !reading;; look = false) {
         if (Aborted(flag)) {
             return RESULT_INTERRUPTED;
         }
         // poll() passes over a negative descriptor and reports one that is not open; both are
         // errors here.
-        int ready = fd < 0 ? 1 : poll(&watched, 1, PollMilliseconds(interval));
+        int ready = fd < 0 ? 1 : poll(&watched, 1, look ? 0 : PollMilliseconds(interval));
         if (fd < 0 || (ready > 0 && (watched.revents & POLLNVAL) != 0)) {
             ready = -1;
             errno = EBADF;
@@ -49,6 +50,9 @@ int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Readin
             readiness.ready = (watched.revents & (reading ? kReadEvents : kWriteEvents)) != 0;
             readiness.exception = (watched.revents & POLLPRI) != 0;
             return RESULT_SUCCESS;
+        }
+        if (ready == 0 && look) {
+            continue;
         }
         if (ready == 0) {
             Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): select: timeout\n",

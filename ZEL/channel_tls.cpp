@@ -9,6 +9,7 @@
 #include <openssl/x509v3.h>
 #include <string.h>
 
+#include <algorithm>
 #include <memory>
 #include <mutex>
 
@@ -346,10 +347,17 @@ int SSLWriteFd(void* handle, const char* data, unsigned int length, const timeva
     }
     ERR_clear_error();
     errno = 0;
-    const int count = SSL_write(ssl, data, static_cast<int>(length));
+    // One wait serves all the records that the socket takes. A failure behind the first one shows
+    // again at the next call.
+    int total = 0;
+    int count = 0;
+    do {
+        count = SSL_write(ssl, data + total, static_cast<int>(length) - total);
+        total += std::max(count, 0);
+    } while (count > 0 && total < static_cast<int>(length));
     const int saved_errno = errno;
-    if (count > 0) {
-        return TellWritten(count);
+    if (total > 0) {
+        return TellWritten(total);
     }
     const int error = SSL_get_error(ssl, count);
     ForbidAlerts(ssl, error);
@@ -423,7 +431,7 @@ int Channel::ConvertToSSLChannel(bool server) {
                        "[WARNING] ZEL/channel(%d): ConvertToSSLChannel: Verify Fail!\n", __LINE__);
         return RESULT_CERTIFICATE;
     }
-    delete static_cast<int*>(handle_);  // the cell only: the socket lives on below TLS
+    delete static_cast<PlainSocket*>(handle_);  // the record only: the socket lives on below TLS
     handle_ = tls.ssl;
     tls_ = true;
     SwitchChannelOp(0);

@@ -48,15 +48,31 @@ std::string RotatedName(const std::string& path, int number) {
     return name;
 }
 
-int WriteTimePrefix(FILE* stream) {
-    char prefix[512] = "";
-    const time_t now = time(nullptr);
-    struct tm local = {};
-    if (localtime_r(&now, &local) != nullptr) {
-        strftime(prefix, sizeof prefix, "%b %d %H:%M:%S ", &local);
+// The local time in front of a line. It is made once a second and kept for that second's other
+// lines; the log's lock guards it.
+class TimePrefix {
+public:
+    // The number of bytes written, or EOF.
+    int Write(FILE* stream) {
+        const time_t now = time(nullptr);
+        if (now != second_) {
+            second_ = now;
+            length_ = 0;
+            struct tm local = {};
+            if (localtime_r(&now, &local) != nullptr) {
+                length_ = strftime(text_, sizeof text_, "%b %d %H:%M:%S ", &local);
+            }
+            text_[length_] = '\0';
+        }
+        return fputs(text_, stream) == EOF ? EOF : static_cast<int>(length_);
     }
-    return fprintf(stream, "%s", prefix);
-}
+
+private:
+    time_t second_ = -1;  // that text_ tells
+    char text_[512] = "";
+    size_t length_ = 0;  // of text_
+};
+TimePrefix time_prefix;
 
 }  // namespace
 
@@ -93,20 +109,28 @@ int Logger::Initialize(Type type, int level, const std::string& path, int rotate
 }
 
 void Logger::LogMsg(Level level, const char* format, ...) {
-    // Most calls are filtered: a look ahead of the lock makes those cost a compare. The look under
-    // the lock decides.
-    if (level > log_level.load(std::memory_order_relaxed)) {
-        return;
-    }
-    const ErrnoKeeper keep;
-    const MutexGuard lock(&log_mutex);
-    if (level > log_level.load(std::memory_order_relaxed)) {
+    if (!Passes(level)) {
         return;
     }
     va_list arguments;
     va_start(arguments, format);
-    Write(format, arguments);
+    LogLocked(level, format, arguments);
     va_end(arguments);
+}
+
+void Logger::LogPassed(Level level, const char* format, ...) {
+    va_list arguments;
+    va_start(arguments, format);
+    LogLocked(level, format, arguments);
+    va_end(arguments);
+}
+
+void Logger::LogLocked(Level level, const char* format, va_list arguments) {
+    const ErrnoKeeper keep;
+    const MutexGuard lock(&log_mutex);
+    if (Passes(level)) {
+        Write(format, arguments);
+    }
 }
 
 void Logger::Write(const char* format, va_list arguments) {
@@ -121,7 +145,7 @@ void Logger::Write(const char* format, va_list arguments) {
         vfprintf(stderr, format, arguments);
         return;
     }
-    const int prefix = WriteTimePrefix(log_fp);
+    const int prefix = time_prefix.Write(log_fp);
     const int message = vfprintf(log_fp, format, arguments);
     fflush(log_fp);
     if (log_type != LOGFILE || log_size < 0 || prefix < 0 || message < 0) {

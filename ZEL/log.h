@@ -58,6 +58,9 @@ public:
     /// every message at priority error. Never fails; errno is kept.
     static void LogMsg(Level level, const char* format, ...) __attribute__((format(printf, 2, 3)));
 
+    /// Whether a message of that level would be written. It may change before the message comes.
+    static bool Passes(Level level) { return level <= log_level.load(std::memory_order_relaxed); }
+
     /// Closes the file of a file set-up; lines at error level then go to standard output. Does
     /// nothing for the other destinations.
     static void Destroy();
@@ -68,7 +71,13 @@ public:
     static int Rotate();
 
 private:
-    // Writes one message that has passed the level; log_mutex is held.
+    // LogMsg() of a message that has passed a first look at the level.
+    static void LogPassed(Level level, const char* format, ...)
+        __attribute__((format(printf, 2, 3)));
+    // Takes the lock, under which the look at the level decides.
+    static void LogLocked(Level level, const char* format, va_list arguments)
+        __attribute__((format(printf, 2, 0)));
+    // Writes one message; log_mutex is held.
     static void Write(const char* format, va_list arguments) __attribute__((format(printf, 1, 0)));
 
     static Type log_type;               // current destination
@@ -79,6 +88,20 @@ private:
     static int rotate_cnt;              // one more than the number of rotated files kept
     static pthread_mutex_t log_mutex;   // taken around every write and every rotation
 };
+
+#if defined(__GNUC__) && !defined(__clang__)
+// Most calls are filtered: here that costs a compare at the call, before any argument is passed.
+// The function itself is still in the library. The format is checked at the call.
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"
+inline __attribute__((gnu_inline, always_inline)) void Logger::LogMsg(Level level,
+                                                                      const char* format, ...) {
+    if (Passes(level)) {
+        LogPassed(level, format, __builtin_va_arg_pack());
+    }
+}
+#pragma GCC diagnostic pop
+#endif
 
 #pragma GCC visibility pop
 

@@ -8,6 +8,14 @@
 
 namespace ZEL {
 
+namespace {
+
+// So many levels of containers are freed by recursion, which is quick; what lies deeper, by a loop.
+constexpr int kLevelsByRecursion = 32;
+thread_local int levels_being_freed = 0;
+
+}  // namespace
+
 PObject::PObject(unsigned long long value)
     : type_(TYPE_INTEGER), value_(new unsigned long long(value)) {}
 
@@ -44,7 +52,7 @@ PObject::PObject(const PObject& other) : PObject() {
         if (from->isMap()) {
             Map& target = to->become<Map>();
             for (const auto& [key, value] : from->get<Map>()) {
-                copy_one(value, target.try_emplace(target.end(), key)->second);
+                copy_one(value, target.emplace_hint(target.end(), key, PObject())->second);
             }
         } else {
             const Array& source = from->get<Array>();
@@ -62,7 +70,9 @@ PObject::PObject(PObject&& other) noexcept {
 }
 
 PObject::~PObject() {
-    clear();
+    if (!isNull()) {
+        clear();
+    }
 }
 
 template <typename T>
@@ -135,13 +145,21 @@ void PObject::swap(PObject& other) noexcept {
     std::swap(value_, other.value_);
 }
 
-// Frees a value of any depth with neither recursion nor memory: on the way down, the slot that a
-// container was taken from keeps the container above, until the way up leads there again.
 void PObject::clear() noexcept {
     if (!isContainer()) {
         deleteValue();
-        return;
+    } else if (levels_being_freed < kLevelsByRecursion) {
+        ++levels_being_freed;
+        deleteValue();
+        --levels_being_freed;
+    } else {
+        clearByLoop();
     }
+}
+
+// Frees a container of any depth with neither recursion nor memory: on the way down, the slot that
+// a container was taken from keeps the container above, until the way up leads there again.
+void PObject::clearByLoop() noexcept {
     PObject node;
     PObject parent;
     node.swap(*this);
@@ -188,7 +206,7 @@ PObject* PObject::firstSlot() {
     return isMap() ? &get<Map>().begin()->second : &get<Array>().back();
 }
 
-// Frees a value that holds no containers.
+// Frees the value, and containers below it by clear().
 void PObject::deleteValue() noexcept {
     switch (type_) {
         case TYPE_ARRAY:

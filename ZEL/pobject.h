@@ -171,6 +171,7 @@ private:
 
     PObject* findContainer();
     PObject* firstSlot();
+    void clearByLoop() noexcept;
     void deleteValue() noexcept;
 
     int32_t type_ = TYPE_NULL;
@@ -198,7 +199,9 @@ template <typename T>
 T& PObject::become() {
     if (!holds<T>()) {
         T* fresh = new T();
-        clear();
+        if (!isNull()) {
+            clear();
+        }
         value_ = fresh;
         type_ = type_trait<T>::type;
     }

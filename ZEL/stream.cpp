@@ -1,5 +1,7 @@
 #include "ZEL/stream.h"
 
+#include <string.h>
+
 #include <algorithm>
 #include <new>
 #include <utility>
@@ -18,6 +20,9 @@ static_assert(sizeof kIndent - 1 == 2 * kIndentLevels);
 // A received string grows by so many bytes at a time, so that a length costs memory only as its
 // bytes arrive.
 constexpr size_t kStringStep = 4096;
+
+// Most messages are no deeper: one allocation holds the places of all their containers.
+constexpr size_t kUsualDepth = 8;
 
 // Whether a step of the channel went well; a failure is told here.
 bool Passed(int code) {
@@ -38,13 +43,77 @@ unsigned char IntegerLength(unsigned long long value) {
     return value >> 32 == 0 ? 4 : 8;
 }
 
-// A larger string than a channel can be given is refused by the channel, as it would be in full
-// length.
-unsigned int BlockLength(size_t size) {
-    return static_cast<unsigned int>(std::min<size_t>(size, UINT32_MAX));
+// The low 64 bits of a number on the wire.
+unsigned long long Fold(const char* bytes, unsigned int length) {
+    unsigned long long value = 0;
+    for (unsigned int i = 0; i < length; ++i) {
+        value = value << 8 | static_cast<unsigned char>(bytes[i]);
+    }
+    return value;
 }
 
 }  // namespace
+
+// The steps of one byte: by the channel's shortcut where that will do.
+
+inline bool PStream::WriteByte(Channel& channel, unsigned char value) {
+    return channel.Store(&value, sizeof value) || Passed(channel.WriteByte(value));
+}
+
+inline bool PStream::ReadByte(Channel& channel, unsigned char& value) {
+    return channel.Fetch(&value, sizeof value) || Passed(channel.ReadByte(&value));
+}
+
+// The body of an integer or of a string, when all of it lies in the read ring.
+
+inline bool PStream::Take(Channel& channel, unsigned long long& value) {
+    const char* head = channel.Ahead(1);
+    const unsigned int length = head == nullptr ? 0 : static_cast<unsigned char>(*head);
+    const char* bytes = head == nullptr ? nullptr : channel.Ahead(1 + length);
+    if (bytes == nullptr) {
+        return false;
+    }
+    value = Fold(bytes + 1, length);
+    channel.Took(1 + length);
+    return true;
+}
+
+inline bool PStream::Take(Channel& channel, std::string& value) {
+    const char* head = channel.Ahead(2);
+    const size_t length = head == nullptr ? 0 : static_cast<size_t>(Fold(head, 2));
+    const char* bytes = head == nullptr ? nullptr : channel.Ahead(2 + length);
+    if (bytes == nullptr) {
+        return false;
+    }
+    value.assign(bytes + 2, strnlen(bytes + 2, length));
+    channel.Took(2 + length);
+    return true;
+}
+
+// Whether an entry's value moves between ring and object without a wait and without a failure. No
+// one can tell then that its key was not in the history: that takes a look at the transfer while
+// it waits, or a failure to report. Most entries are such, and need not take the lock.
+
+inline bool PStream::GoesAtOnce(const Channel& channel, const PObject& value) {
+    constexpr size_t kLongestHead = 10;  // of a string the tag and the length, of an integer all
+    return value.isString() ? channel.CanStore(kLongestHead + value.get<std::string>().size())
+                            : !value.isContainer() && channel.CanStore(kLongestHead);
+}
+
+inline bool PStream::ComesAtOnce(const Channel& channel) {
+    const char* bytes = channel.Ahead(3);
+    if (bytes == nullptr) {
+        return false;
+    }
+    switch (bytes[0]) {
+        case TAG_INTEGER:
+            return channel.Ahead(2 + static_cast<size_t>(Fold(bytes + 1, 1))) != nullptr;
+        case TAG_STRING:
+            return channel.Ahead(3 + static_cast<size_t>(Fold(bytes + 1, 2))) != nullptr;
+        default:
+            return false;
+    }
+}
 
 // A whole value in one direction. A value may be larger than memory: that is a failure like any
 // other.
@@ -101,19 +170,18 @@ int PStream::RecvObject(Channel& channel, PObject& value) {
 
 int PStream::SendNull(Channel& channel) {
     UpdateStatus(0, 0);
-    return Passed(channel.WriteByte(TAG_NULL)) && Passed(channel.WriteByte(0)) ? RESULT_SUCCESS
-                                                                               : RESULT_IO;
+    return WriteByte(channel, TAG_NULL) && WriteByte(channel, 0) ? RESULT_SUCCESS : RESULT_IO;
 }
 
 int PStream::Send(Channel& channel, unsigned long long value) {
     UpdateStatus(0, 0);
     const unsigned char length = IntegerLength(value);
-    char bytes[8];
-    for (unsigned int i = 0; i < length; ++i) {
-        bytes[i] = static_cast<char>(value >> (8 * (length - 1U - i)));
-    }
-    if (!Passed(channel.WriteByte(TAG_INTEGER)) || !Passed(channel.WriteByte(length)) ||
-        !Passed(channel.Write(bytes, length))) {
+    char element[2 + sizeof value] = {TAG_INTEGER, static_cast<char>(length)};
+    const unsigned long long wire = __builtin_bswap64(value << (64 - 8 * length));
+    memcpy(element + 2, &wire, sizeof wire);
+    if (!channel.Store(element, size_t{2} + length) &&
+        (!Passed(channel.WriteByte(TAG_INTEGER)) || !Passed(channel.WriteByte(length)) ||
+         !Passed(channel.Write(element + 2, length)))) {
         return RESULT_IO;
     }
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s%llu\n", __LINE__, Indent(),
@@ -122,16 +190,29 @@ int PStream::Send(Channel& channel, unsigned long long value) {
 }
 
 int PStream::Send(Channel& channel, const std::string& value) {
+    return SendText(channel, value.c_str(), value.size());
+}
+
+// REQUIRES text[size] == 0.
+int PStream::SendText(Channel& channel, const char* text, size_t size) {
     UpdateStatus(0, 0);
     // The length is the low 16 bits whatever the string's length is: short strings are the caller's
     // business.
-    if (!Passed(channel.WriteByte(TAG_STRING)) ||
-        !Passed(channel.WriteInt16(static_cast<unsigned short>(value.size()))) ||
-        !Passed(channel.Write(value.data(), BlockLength(value.size())))) {
+    const auto length = static_cast<unsigned short>(size);
+    const char head[] = {TAG_STRING, static_cast<char>(length >> 8), static_cast<char>(length)};
+    if (!channel.Store(head, sizeof head) &&
+        (!Passed(channel.WriteByte(TAG_STRING)) || !Passed(channel.WriteInt16(length)))) {
+        return RESULT_IO;
+    }
+    // A larger string than a channel can be given is refused by the channel, as it would be in full
+    // length.
+    if (!channel.Store(text, size) &&
+        !Passed(
+            channel.Write(text, static_cast<unsigned int>(std::min<size_t>(size, UINT32_MAX))))) {
         return RESULT_IO;
     }
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s\"%s\"\n", __LINE__, Indent(),
-                   value.c_str());
+                   text);
     return RESULT_SUCCESS;
 }
 
@@ -145,16 +226,15 @@ int PStream::Send(Channel& channel, const std::vector<PObject>& value) {
 
 int PStream::Recv(Channel& channel, unsigned long long& value) {
     UpdateStatus(0, 0);
+    if (Take(channel, value)) {
+        return RESULT_SUCCESS;
+    }
     unsigned char length = 0;
-    unsigned char bytes[UINT8_MAX];
-    if (!Passed(channel.ReadByte(&length)) ||
-        !Passed(channel.Read(reinterpret_cast<char*>(bytes), length))) {
+    char bytes[UINT8_MAX];
+    if (!Passed(channel.ReadByte(&length)) || !Passed(channel.Read(bytes, length))) {
         return RESULT_IO;
     }
-    value = 0;
-    for (unsigned int i = 0; i < length; ++i) {
-        value = value << 8 | bytes[i];
-    }
+    value = Fold(bytes, length);
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s%llu\n", __LINE__, Indent(),
                    value);
     return RESULT_SUCCESS;
@@ -162,6 +242,9 @@ int PStream::Recv(Channel& channel, unsigned long long& value) {
 
 int PStream::Recv(Channel& channel, std::string& value) {
     UpdateStatus(0, 0);
+    if (Take(channel, value)) {
+        return RESULT_SUCCESS;
+    }
     unsigned short length = 0;
     bool passed = Passed(channel.ReadInt16(&length));
     value.clear();
@@ -183,7 +266,6 @@ int PStream::Recv(Channel& channel, std::string& value) {
 
 int PStream::Recv(Channel& channel, std::map<std::string, PObject>& value) {
     int result = EnterBody("{");
-    std::string key;
     while (result == 0) {
         unsigned char tag = 0;
         result = RecvTag(channel, tag);
@@ -200,16 +282,20 @@ int PStream::Recv(Channel& channel, std::map<std::string, PObject>& value) {
                            __LINE__, tag);
             return RESULT_PROTOCOL;
         }
+        std::string key;
         result = Recv(channel, key);
         if (result < 0) {
             break;
         }
         // Keys come in order, so the end is where a new one belongs.
-        PObject& entry = value.try_emplace(value.end(), key)->second;
-        PushKey(key);
-        result = RecvObject(channel, entry);
-        if (result == 0) {
-            PopKey(key);
+        const auto entry = value.emplace_hint(value.end(), std::move(key), PObject());
+        const bool told = !ComesAtOnce(channel);
+        if (told) {
+            PushKey(entry->first);
+        }
+        result = RecvObject(channel, entry->second);
+        if (told && result == 0) {
+            PopKey();
         }
     }
     return result;
@@ -237,7 +323,7 @@ int PStream::Recv(Channel& channel, std::vector<PObject>& value) {
 }
 
 int PStream::RecvTag(Channel& channel, unsigned char& tag) {
-    return Passed(channel.ReadByte(&tag)) ? RESULT_SUCCESS : RESULT_IO;
+    return ReadByte(channel, tag) ? RESULT_SUCCESS : RESULT_IO;
 }
 
 int PStream::RecvDispatch(Channel& channel, unsigned char tag, PObject& value) {
@@ -256,7 +342,7 @@ int PStream::RecvDispatch(Channel& channel, unsigned char tag, PObject& value) {
             return Skip(channel, tag);
     }
     unsigned char length = 0;
-    if (!Passed(channel.ReadByte(&length))) {
+    if (!ReadByte(channel, length)) {
         return RESULT_IO;
     }
     if (length != 0) {
@@ -322,16 +408,13 @@ void PStream::GetVersion(unsigned int& major, unsigned int& minor, unsigned int&
     third = 0;
 }
 
-// The key's memory goes to the history and comes back with PopKey(), so that a map's entries share
-// one string.
-void PStream::PushKey(std::string& key) {
+void PStream::PushKey(std::string key) {
     const std::lock_guard<std::mutex> lock(mutex_);
     history_.push_back(std::move(key));
 }
 
-void PStream::PopKey(std::string& key) {
+void PStream::PopKey() {
     const std::lock_guard<std::mutex> lock(mutex_);
-    key = std::move(history_.back());
     history_.pop_back();
 }
 
@@ -343,31 +426,34 @@ const char* PStream::Indent() const {
 // allows.
 int PStream::SendContainer(Channel& channel, const PObjectCursor& outermost) {
     std::vector<PObjectCursor> open;
-    std::string key;
+    open.reserve(kUsualDepth);
     int result = OpenContainer(channel, outermost, open);
     while (result == 0 && !open.empty()) {
         PObjectCursor& place = open.back();
-        bool value_sent = true;
+        bool told = false;  // the key of a value that is now whole is in the history
         if (place.AtEnd()) {
             result = CloseContainer(channel, place);
             open.pop_back();
+            told = !open.empty() && open.back().InMap();
         } else {
-            if (place.InMap()) {
-                const std::string& name = place.Key();
-                key.assign(name, !name.empty() && name[0] == '_' ? 1 : 0, std::string::npos);
-                result = Send(channel, key);
+            const std::string* key = place.InMap() ? &place.Key() : nullptr;
+            const size_t hidden = key != nullptr && !key->empty() && key->front() == '_' ? 1 : 0;
+            if (key != nullptr) {
+                result = SendText(channel, key->c_str() + hidden, key->size() - hidden);
                 if (result < 0) {
                     break;
                 }
-                PushKey(key);
             }
             const PObject& value = place.Take();
-            value_sent = !value.isContainer();
-            result = value_sent ? SendObject(channel, value)
-                                : OpenContainer(channel, PObjectCursor::Of(value), open);
+            if (key != nullptr && !GoesAtOnce(channel, value)) {
+                PushKey(key->substr(hidden));
+                told = !value.isContainer();
+            }
+            result = value.isContainer() ? OpenContainer(channel, PObjectCursor::Of(value), open)
+                                         : SendObject(channel, value);
         }
-        if (result == 0 && value_sent && !open.empty() && open.back().InMap()) {
-            PopKey(key);
+        if (told && result == 0) {
+            PopKey();
         }
     }
     return result;
@@ -375,7 +461,7 @@ int PStream::SendContainer(Channel& channel, const PObjectCursor& outermost) {
 
 int PStream::OpenContainer(Channel& channel, const PObjectCursor& container,
                            std::vector<PObjectCursor>& open) {
-    if (!Passed(channel.WriteByte(container.InMap() ? TAG_MAP : TAG_ARRAY))) {
+    if (!WriteByte(channel, container.InMap() ? TAG_MAP : TAG_ARRAY)) {
         return RESULT_IO;
     }
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s%s\n", __LINE__, Indent(),
@@ -386,7 +472,7 @@ int PStream::OpenContainer(Channel& channel, const PObjectCursor& container,
 }
 
 int PStream::CloseContainer(Channel& channel, const PObjectCursor& container) {
-    if (!Passed(channel.WriteByte(TAG_END))) {
+    if (!WriteByte(channel, TAG_END)) {
         return RESULT_IO;
     }
     --depth_;

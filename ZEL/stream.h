@@ -110,8 +110,15 @@ public:
 private:
     template <typename Step>
     int Transfer(Step step);
-    void PushKey(std::string& key);
-    void PopKey(std::string& key);
+    static bool WriteByte(Channel& channel, unsigned char value);
+    static bool ReadByte(Channel& channel, unsigned char& value);
+    static bool Take(Channel& channel, unsigned long long& value);
+    static bool Take(Channel& channel, std::string& value);
+    static bool GoesAtOnce(const Channel& channel, const PObject& value);
+    static bool ComesAtOnce(const Channel& channel);
+    int SendText(Channel& channel, const char* text, size_t size);
+    void PushKey(std::string key);
+    void PopKey();
     const char* Indent() const;
     int OpenContainer(Channel& channel, const PObjectCursor& container,
                       std::vector<PObjectCursor>& open);

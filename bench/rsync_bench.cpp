@@ -3,8 +3,9 @@
 //   rsync_bench [--copies]
 //
 // The server is a real one: zel_server's configuration, handler and admission on an rsync daemon.
-// --copies: also the two large copies, which write 2 GB below $TMPDIR. Runs alternate, medians are
-// compared; each line ends in the ratio and the ratio that is wanted.
+// --copies: also the two large copies, which write 2 GB below $TMPDIR; in memory (/dev/shm) a
+// disk's moods stay out of it. Runs alternate, medians are compared; each line ends in the ratio
+// and the ratio that is wanted.
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/time.h>
@@ -113,17 +114,17 @@ public:
         ZelServer({"setup", "--storage", root_.Path("storage"), "--port", std::to_string(port_),
                    "--address", "127.0.0.1"});
         ZelServer({"account", "add", kUser, "--password-file", password_file_});
-        // The peers' modules: nothing of ours is asked there.
+        // The peers' modules: nothing of ours is asked there. Copies go to the folder that the
+        // share has, too: two folders of one disk are not equally fast.
         const std::string configuration = root_.Path("server/usr/tarq/etc/zel_server");
         const std::string common =
             "\nread only = no\nuse chroot = no\nfake super = yes\nauth users = " +
             std::string(kUser) + "\nsecrets file = " + configuration + "/rsyncd.secrets\n" +
             (geteuid() == 0 ? "uid = 0\ngid = 0\n" : "");
         root_.Write("byte/byte", "x");
-        fs::create_directories(root_.Path("plain"));
-        root_.Write("server/usr/tarq/etc/zel_server/admin.d/peers.conf",
-                    "[byte]\npath = " + root_.Path("byte") + common +
-                        "[plain]\npath = " + root_.Path("plain") + common);
+        root_.Write(
+            "server/usr/tarq/etc/zel_server/admin.d/peers.conf",
+            "[byte]\npath = " + root_.Path("byte") + common + "[plain]\npath = " + copy_ + common);
         daemon_.Start(
             {"rsync", "--daemon", "--no-detach", "--config=" + configuration + "/rsyncd.conf"},
             root_.Path("daemon.log"), port_);
@@ -164,10 +165,8 @@ private:
         const std::string source = root_.Path(name);
         Fill(source, count, size);
         const auto empty = [this] {
-            for (const std::string& folder : {root_.Path("storage/data"), root_.Path("plain")}) {
-                fs::remove_all(folder);
-                fs::create_directories(folder);
-            }
+            fs::remove_all(copy_);
+            fs::create_directories(copy_);
             sync();
         };
         Contestant wrapper = {empty, [&] { return WrapperCopy(source); }};
@@ -261,6 +260,7 @@ private:
     }
 
     test::TempRoot root_;
+    const std::string copy_ = root_.Path("storage/data");
     int port_;
     test::ServerProcess daemon_;
     std::string password_file_;

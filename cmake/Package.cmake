@@ -24,7 +24,6 @@ set(CPACK_INSTALL_DEFAULT_DIRECTORY_PERMISSIONS
 set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS_PRIVATE_DIRS ${CMAKE_LIBRARY_OUTPUT_DIRECTORY})
-set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS ON)
 set(CPACK_DEBIAN_PACKAGE_CONTROL_STRICT_PERMISSION ON)
 # The packages of one build belong together.
 set(CPACK_DEBIAN_ENABLE_COMPONENT_DEPENDS ON)
@@ -81,7 +80,13 @@ debian_package(zel-server admin "Shared-folder synchronisation between two NAS: 
 its own. zel_server sets it up, keeps its accounts and shows its clients and
 shares.")
 
-set(CPACK_DEBIAN_LIBZEL_PACKAGE_CONTROL_EXTRA ${PROJECT_SOURCE_DIR}/packaging/debian/triggers)
+# What packages of programs with these libraries depend on.
+file(WRITE ${papers}/libzel/shlibs "")
+foreach(library IN LISTS libraries)
+    file(APPEND ${papers}/libzel/shlibs "lib${library} ${PROJECT_VERSION_MAJOR} libzel (= ${PROJECT_VERSION})\n")
+endforeach()
+set(CPACK_DEBIAN_LIBZEL_PACKAGE_CONTROL_EXTRA
+    ${papers}/libzel/shlibs ${PROJECT_SOURCE_DIR}/packaging/debian/triggers)
 # Options of the rsync protocol that older ones lack carry the commands.
 set(CPACK_DEBIAN_ZEL-CLIENT_PACKAGE_DEPENDS "rsync (>= 3.2.1)")
 set(CPACK_DEBIAN_ZEL-CLIENT_PACKAGE_RECOMMENDS "openssh-client")

@@ -1,1 +1,3 @@
 fuzz_target(command_file_fuzz command_file_fuzz.cpp LIBRARIES server_parts)
+fuzz_target(request_fuzz request_fuzz.cpp LIBRARIES daemon_parts)
+fuzz_target(task_row_fuzz task_row_fuzz.cpp LIBRARIES program_text)

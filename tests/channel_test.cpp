@@ -92,6 +92,27 @@ TEST(Channel, BytesKeepTheirOrderRoundTheEndOfTheRings) {
     EXPECT_STREQ(buffer, "56789abc");
 }
 
+TEST(Channel, LargeReadsTakeWhatWasReadAheadFirstAndTellWhatCame) {
+    std::string sent;
+    for (int i = 0; i < 100000; ++i) {
+        sent += static_cast<char>(i * 31 >> 3);
+    }
+    for (const unsigned int first : {1U, 70000U}) {
+        test::RawPeer peer(30000);
+        std::thread writer([&] {
+            peer.Send(sent);
+            shutdown(peer.fd, SHUT_WR);
+        });
+        std::string received(sent.size() + 20000, ' ');
+        EXPECT_EQ(peer.channel.Read(received.data(), first), 0);
+        unsigned int total = 0;
+        EXPECT_EQ(peer.channel.Read(&received[first], 120000 - first, total), ZEL::RESULT_IO);
+        writer.join();
+        EXPECT_EQ(first + total, sent.size());
+        EXPECT_TRUE(received.compare(0, sent.size(), sent) == 0);
+    }
+}
+
 TEST(Channel, ABlockMayBeAsLargeAsTheRing) {
     test::RawPeer peer(8);
     EXPECT_EQ(peer.channel.Write("123456789", 9), ZEL::RESULT_INVALID_ARGUMENT);

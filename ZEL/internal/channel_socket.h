@@ -14,6 +14,13 @@ namespace ZEL {
 /// The operations of a TLS channel, whose handle is an SSL that owns its context.
 extern const ChannelOps kTlsOps;
 
+/// The handle of a plain channel, on the heap.
+struct PlainSocket {
+    int fd;
+    /// Whether its peer can send urgent data, which a wait has to see before anything is written.
+    bool can_be_urgent;
+};
+
 enum class Watch { kRead, kWrite };
 
 /// What a wait saw.

@@ -10,7 +10,6 @@
 #include <chrono>
 #include <condition_variable>
 #include <mutex>
-#include <optional>
 #include <thread>
 #include <utility>
 
@@ -24,6 +23,7 @@ namespace programs {
 
 namespace {
 
+using std::chrono::steady_clock;
 using TARQ::Backup::RunChange;
 using TARQ::Backup::RunOptions;
 using TARQ::Backup::RunProgress;
@@ -31,8 +31,7 @@ using TARQ::Backup::RunReport;
 using TARQ::Backup::ScopedRunOptions;
 
 constexpr std::chrono::seconds kBeaconEvery(60);  // the server takes a task for dead after 120
-// The server is told of the end even when a person has had enough, unless it does not answer.
-constexpr std::chrono::milliseconds kLastWords(800);
+constexpr std::chrono::seconds kLastWord(1);
 constexpr int kVanishedFiles = 24;  // rsync: some files were gone before it came to them
 constexpr int kLookupFailed = 42;
 constexpr int kNothingSent = 213;
@@ -42,50 +41,38 @@ std::list<std::string> ToList(const std::vector<std::string>& items) {
     return {items.begin(), items.end()};
 }
 
-/// Somebody's wish to end, and when it was first seen.
-class Patience {
-public:
-    explicit Patience(const std::atomic<bool>& cancel) : cancel_(cancel) {}
+// The library asks a function without an argument whether to give up: what it looks at is the
+// thread's own.
+thread_local const std::atomic<bool>* wanted = nullptr;
+thread_local steady_clock::time_point patient_until;  // whatever is wanted
 
-    /// Whether the wish has been there for so long.
-    bool IsOver(std::chrono::milliseconds more) {
-        if (!cancel_.load(std::memory_order_relaxed)) {
-            return false;
-        }
-        const auto now = std::chrono::steady_clock::now();
-        since_ = since_.value_or(now);
-        return now - *since_ >= more;
-    }
+bool CancelWanted() {
+    return wanted != nullptr && wanted->load(std::memory_order_relaxed) &&
+           steady_clock::now() >= patient_until;
+}
 
-private:
-    const std::atomic<bool>& cancel_;
-    std::optional<std::chrono::steady_clock::time_point> since_;
-};
-
-/// The operations of this thread give up, until the scope ends, when patience has been over for so
-/// long.
+/// The operations of this thread look at `cancel` until the scope ends.
 class CancelScope {
 public:
-    explicit CancelScope(Patience& patience, std::chrono::milliseconds more = {})
-        : patience_(patience), more_(more), before_(std::exchange(current, this)) {}
-    ~CancelScope() { current = before_; }
+    explicit CancelScope(const std::atomic<bool>& cancel)
+        : before_(std::exchange(wanted, &cancel)) {}
+    ~CancelScope() { wanted = before_; }
     CancelScope(const CancelScope&) = delete;
     CancelScope& operator=(const CancelScope&) = delete;
 
-    // The library asks a function without an argument: what it looks at is the thread's own.
-    static bool IsWanted() {
-        return current != nullptr && current->patience_.IsOver(current->more_);
-    }
-
 private:
-    static thread_local CancelScope* current;
-
-    Patience& patience_;
-    const std::chrono::milliseconds more_;
-    CancelScope* const before_;
+    const std::atomic<bool>* before_;
 };
 
-thread_local CancelScope* CancelScope::current = nullptr;
+/// What is said in this scope is said even when a person has had enough, unless the server takes
+/// too long to listen.
+class LastWord {
+public:
+    LastWord() { patient_until = steady_clock::now() + kLastWord; }
+    ~LastWord() { patient_until = {}; }
+    LastWord(const LastWord&) = delete;
+    LastWord& operator=(const LastWord&) = delete;
+};
 
 /// Tells the server that the run is alive, from a thread and a connection of its own.
 class Beacon {
@@ -112,10 +99,9 @@ public:
 
 private:
     void Run() {
-        Patience patience(stop_);
-        const CancelScope scope(patience);
+        const CancelScope scope(stop_);
         ZEL::Rsyncer rsyncer;
-        rsyncer.SetCancelChecker(CancelScope::IsWanted);
+        rsyncer.SetCancelChecker(CancelWanted);
         bool ready = false;
         std::unique_lock<std::mutex> lock(mutex_);
         while (!wake_.wait_for(lock, kBeaconEvery, [this] { return stop_.load(); })) {
@@ -217,7 +203,7 @@ Trouble TroubleOf(int status) {
 struct TaskRun::Impl {
     Impl(const ZEL::SyncInfo& sync_info, const std::atomic<bool>& cancel_flag, RunListener told)
         : info(sync_info), cancel(cancel_flag), listener(std::move(told)) {
-        rsyncer.SetCancelChecker(CancelScope::IsWanted);
+        rsyncer.SetCancelChecker(CancelWanted);
     }
 
     RunOptions Reporting() {
@@ -302,7 +288,7 @@ struct TaskRun::Impl {
         if (!result.Ok()) {
             return result;
         }
-        const auto begin = std::chrono::steady_clock::now();
+        const auto begin = steady_clock::now();
         RunReport sent;
         // Once more, right before files are compared: an unmounted volume must not look like an
         // emptied share.
@@ -313,7 +299,7 @@ struct TaskRun::Impl {
         totals.files_sent += sent.files_sent;
         totals.files_deleted += sent.files_deleted;
         totals.bytes_sent += sent.bytes_sent + sent.bytes_received;
-        const std::chrono::duration<double> elapsed = std::chrono::steady_clock::now() - begin;
+        const std::chrono::duration<double> elapsed = steady_clock::now() - begin;
         Verdict closed = Finish(share.share, result.Ok());
         if (result.Ok() && closed.Ok() && listener.on_share_done) {
             listener.on_share_done(share.share, sent, elapsed.count());
@@ -369,7 +355,7 @@ struct TaskRun::Impl {
     }
 
     Verdict Finish(const std::string& share, bool completed) {
-        const CancelScope patient(patience, kLastWords);
+        const LastWord last_word;
         const RunReport of_the_run = report;
         int status = 0;
         int sent = 0;
@@ -409,7 +395,6 @@ struct TaskRun::Impl {
 
     ZEL::SyncInfo info;
     const std::atomic<bool>& cancel;
-    Patience patience{cancel};
     RunListener listener;
     RunReport report;         // of the last thing that was run
     uint64_t rsync_runs = 0;  // copies made
@@ -422,7 +407,7 @@ TaskRun::TaskRun(const ZEL::SyncInfo& info, const std::atomic<bool>& cancel, Run
 TaskRun::~TaskRun() = default;
 
 Verdict TaskRun::Connect() {
-    const CancelScope scope(impl_->patience);
+    const CancelScope scope(impl_->cancel);
     const ScopedRunOptions watched(impl_->Reporting());
     const int status = impl_->rsyncer.Initialize(impl_->info);
     const std::string& name = impl_->info.GetServerName();
@@ -433,12 +418,12 @@ Verdict TaskRun::Connect() {
 }
 
 Verdict TaskRun::CheckPairing(const std::vector<std::string>& shares) {
-    const CancelScope scope(impl_->patience);
+    const CancelScope scope(impl_->cancel);
     return impl_->Pair(true, shares);
 }
 
 Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
-    const CancelScope scope(impl_->patience);
+    const CancelScope scope(impl_->cancel);
     std::vector<std::string> names;
     for (const ShareOrder& share : order.shares) {
         names.push_back(share.share);
@@ -462,7 +447,7 @@ Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
     }
     totals.rsync_runs += impl_->rsync_runs;
     if (announced) {
-        const CancelScope patient(impl_->patience, kLastWords);
+        const LastWord last_word;
         impl_->rsyncer.FinishSync("task", order.task, ignored);
     }
     return result;
@@ -470,7 +455,7 @@ Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
 
 Verdict TaskRun::List(const RunOrder& order, const ChangeHandler& on_change,
                       const std::function<void(const std::string& share)>& on_missing) {
-    const CancelScope scope(impl_->patience);
+    const CancelScope scope(impl_->cancel);
     for (const ShareOrder& share : order.shares) {
         Verdict result = impl_->ListShare(order, share, on_change, on_missing);
         if (!result.Ok()) {

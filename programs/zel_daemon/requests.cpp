@@ -10,6 +10,7 @@
 
 #include "ZEL/channel.h"
 #include "ZEL/log.h"
+#include "programs/common/schedule_words.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/store.h"
 #include "programs/zel_daemon/task_map.h"
@@ -26,6 +27,7 @@ constexpr unsigned int kLogLimit = 20;
 // Keys of a task that are the daemon's own: an exported task has them, and they are passed over.
 const std::set<std::string>& StateKeys() {
     static const std::set<std::string> keys = {"id",
+                                               "schedule",
                                                "status",
                                                "sync_result",
                                                "next_run",
@@ -137,7 +139,7 @@ PObject Requests::Dispatch(const Peer& peer, const PObject& request) {
     static const Command commands[] = {
         {"task_add", StateKeys(), true, &Requests::TaskAdd},
         {"task_edit", {"task"}, true, &Requests::TaskEdit},
-        {"task_list", {"secrets", "brief"}, false, &Requests::TaskList},
+        {"task_list", {"secrets", "brief", "rows"}, false, &Requests::TaskList},
         {"task_show", {"task", "secrets"}, false, &Requests::TaskShow},
         {"task_remove", {"task"}, false, &Requests::TaskRemove},
         {"task_run", {"task"}, false, &Requests::TaskRun},
@@ -188,6 +190,13 @@ PObject Requests::TaskList(const Peer& peer, const PObject& request) {
     const bool secrets = AsksForSecrets(peer, request);
     const bool brief = FlagOf(request, "brief");
     PObject reply = Success();
+    if (FlagOf(request, "rows")) {
+        for (const TaskRecord* record : service_.Tasks()) {
+            reply["rows"].asArray().emplace_back(programs::PackTaskRow(RowOf(*record)));
+        }
+        reply["rows"].asArray();  // also without tasks
+        return reply;
+    }
     PObject::Array& tasks = reply["tasks"].asArray();
     for (const TaskRecord* record : service_.Tasks()) {
         tasks.push_back(brief ? BriefTask(*record) : ShownTask(*record, secrets));
@@ -283,8 +292,37 @@ PObject Requests::ShownTask(const TaskRecord& record, bool secrets) const {
 
 PObject Requests::BriefTask(const TaskRecord& record) const {
     PObject map = TaskToBriefMap(record);
+    map["schedule"] = programs::DescribeSchedule(record.Info().GetSchedule());
     AddState(record, map);
     return map;
+}
+
+programs::TaskRow Requests::RowOf(const TaskRecord& record) const {
+    const TaskState state = service_.StateOf(record);
+    const ZEL::TaskInfo& info = record.Info();
+    const ZEL::SyncInfo& sync = info.GetSyncInfo();
+    programs::TaskRow row;
+    row.name = info.GetName();
+    for (const std::string& share : info.GetShareList()) {
+        row.shares += (row.shares.empty() ? "" : ",") + share;
+    }
+    row.server = sync.GetServerName().empty() ? sync.GetServerIP() : sync.GetServerName();
+    row.schedule = programs::DescribeSchedule(info.GetSchedule());
+    row.status = state.status;
+    if (state.last != nullptr) {
+        row.result = state.last->result;
+        row.last_end = state.last->end;
+    }
+    row.next_run = state.next_run;
+    if (state.retry_in) {
+        row.retry_in = static_cast<uint64_t>(*state.retry_in);
+    }
+    if (state.active != nullptr && !state.active->progress_share.empty()) {
+        row.percent = state.active->progress.percent;
+    }
+    row.pending = state.pending;
+    row.note = state.note;
+    return row;
 }
 
 void Requests::AddState(const TaskRecord& record, PObject& map) const {

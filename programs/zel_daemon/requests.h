@@ -6,6 +6,7 @@
 #include <string>
 
 #include "ZEL/pobject.h"
+#include "programs/common/task_row.h"
 #include "programs/zel_daemon/service.h"
 
 namespace zel_daemon {
@@ -49,6 +50,7 @@ private:
 
     ZEL::PObject ShownTask(const TaskRecord& record, bool secrets) const;
     ZEL::PObject BriefTask(const TaskRecord& record) const;
+    programs::TaskRow RowOf(const TaskRecord& record) const;
     void AddState(const TaskRecord& record, ZEL::PObject& map) const;
 
     Service& service_;

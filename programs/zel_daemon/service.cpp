@@ -142,7 +142,9 @@ void Service::SetConfig(const DaemonConfig& config) {
 
 void Service::Refresh() {
     // What could not be watched in full is searched anew: the limit may have been raised.
+    tzset();
     for (const auto& [id, task] : tasks_) {
+        task->plan->ZoneChanged();
         for (const auto& [share, note] : task->notes) {
             watched_.erase(share);
         }
@@ -500,7 +502,6 @@ void Service::StoreGathered(Task& task) {
 // Takes every step that is due, and sleeps until the next one is. Called after whatever happened.
 void Service::Advance() {
     const int64_t now = clock_.Elapsed();
-    tzset();
     std::vector<std::pair<Task*, Due>> due;
     for (const auto& [id, task] : tasks_) {
         try {
@@ -569,14 +570,15 @@ std::optional<Service::Due> Service::WhatIsDue(Task& task) {
 // folders have been found, so that no change falls between the comparison and the watch.
 bool Service::MayStart(const Task& task) const {
     unsigned int running = 0;
-    for (const auto& [id, other] : tasks_) {
-        if (!other->active) {
+    for (const auto& entry : tasks_) {
+        const Task& other = *entry.second;
+        if (!other.active) {
             continue;
         }
         ++running;
         const std::list<std::string>& shares = task.record.Info().GetShareList();
         if (std::any_of(shares.begin(), shares.end(),
-                        [&](const std::string& share) { return other->HasShare(share); })) {
+                        [&](const std::string& share) { return other.HasShare(share); })) {
             return false;
         }
     }

@@ -42,12 +42,19 @@ TaskPlan::TaskPlan(const Clock& clock, const ZEL::Schedule& schedule, int64_t ch
       checked_until_(checked_until),
       random_(random ? std::move(random) : SystemRandom()) {}
 
-// Reckoned anew each time: the time zone may have changed since.
 std::optional<int64_t> TaskPlan::NextRun() const {
     if (schedule_.GetMode() == ZEL::SCHD_MODE_REALTIME ||
         checked_until_ > std::numeric_limits<long>::max()) {
         return std::nullopt;
     }
+    if (next_after_ != checked_until_) {
+        next_ = Reckon();
+        next_after_ = checked_until_;
+    }
+    return next_;
+}
+
+std::optional<int64_t> TaskPlan::Reckon() const {
     // A clock that stood before 1970 has no runs, but those since then are not lost.
     const int64_t reference = std::max<int64_t>(checked_until_, 0);
     const long next = schedule_.GetNextScheduledSeconds(static_cast<long>(reference));

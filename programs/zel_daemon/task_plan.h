@@ -51,6 +51,8 @@ public:
     /// The schedule's next run, in seconds since the epoch; one in the past is due now. Nothing for
     /// manual and realtime tasks and when no run will come.
     std::optional<int64_t> NextRun() const;
+    /// The process's time zone is another one now.
+    void ZoneChanged() { next_after_.reset(); }
     /// True when the schedule wants a run now. A clock that was set back by more than a minute is
     /// noticed here, and changes CheckedUntil().
     bool ScheduleDue();
@@ -72,10 +74,14 @@ public:
 
 private:
     bool WasSetBack(int64_t now) const;
+    std::optional<int64_t> Reckon() const;
 
     const Clock& clock_;
     ZEL::Schedule schedule_;
     int64_t checked_until_;
+    // Asking for the zone's rules costs more than all else, so that the answer is kept.
+    mutable std::optional<int64_t> next_;
+    mutable std::optional<int64_t> next_after_;  // the checked_until_ that next_ belongs to
     std::function<double()> random_;
     unsigned int failures_ = 0;
     std::optional<int64_t> retry_at_;  // on the clock that never jumps

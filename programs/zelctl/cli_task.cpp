@@ -149,7 +149,7 @@ void DeclareTask(CLI::App& task, ExitCode& result) {
 
     CLI::App* const show = AddNamed(task, "show", "Show all of a task", name);
     show->add_flag("--json", as_json, "Write JSON, for programs");
-    show->callback([&result, &name] { result = ShowTask(name, as_json); });
+    show->callback([&result] { result = ShowTask(name, as_json); });
 
     DeclareRun(task, result);
     DeclareTelling(task, result, name, "rm", "Remove a task; shares and copies stay", "task_remove",
@@ -164,18 +164,18 @@ void DeclareTask(CLI::App& task, ExitCode& result) {
     CLI::App* const log = AddNamed(task, "log", "Show a task's runs, newest first", name);
     log->add_option("--limit", limit, "How many")->check(CLI::Range(1, 200))->capture_default_str();
     log->add_flag("--json", as_json, "Write JSON, for programs");
-    log->callback([&result, &name] { result = ShowTaskLog(name, limit, as_json); });
+    log->callback([&result] { result = ShowTaskLog(name, limit, as_json); });
 
     CLI::App* const next = AddNamed(task, "next", "Show when a task runs next", name);
     next->add_option("--count", count, "How many runs to show")
         ->check(CLI::Range(1, 1000))
         ->capture_default_str();
     next->add_flag("--json", as_json, "Write JSON, for programs");
-    next->callback([&result, &name] { result = ShowTaskRuns(name, count, as_json); });
+    next->callback([&result] { result = ShowTaskRuns(name, count, as_json); });
 
     CLI::App* const watch = task.add_subcommand("watch", "Show what tasks are doing, until Ctrl-C");
     watch->add_option("name", name, "The task (all)");
-    watch->callback([&result, &name] { result = WatchTasks(name); });
+    watch->callback([&result] { result = WatchTasks(name); });
 }
 
 }  // namespace zelctl

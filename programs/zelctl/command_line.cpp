@@ -1,7 +1,6 @@
 #include "programs/zelctl/command_line.h"
 
 #include <CLI/CLI.hpp>
-#include <cstring>
 
 #include "ZEL/log.h"
 #include "programs/common/text.h"
@@ -30,14 +29,21 @@ constexpr Command kCommands[] = {
     {"next", "Show the next runs of a schedule", DeclareNext},
 };
 
-// The first word that is no option: the command, if there is one.
-const char* CommandOf(int argc, char** argv) {
-    for (int i = 1; i < argc; ++i) {
-        if (argv[i][0] != '-') {
-            return argv[i];
+// The first word from `argv[index]` on that is no option, and the place after it; empty when there
+// is none.
+std::string NextWord(int argc, char** argv, int& index) {
+    while (index < argc) {
+        const char* const word = argv[index++];
+        if (word[0] != '-') {
+            return word;
         }
     }
     return "";
+}
+
+ExitCode NoSuchCommand(const std::string& words, const std::string& group) {
+    return Fail(kUsage, "there is no command '%s': '%s -h' lists them",
+                programs::Printable(words).c_str(), group.c_str());
 }
 
 }  // namespace
@@ -51,19 +57,27 @@ int RunCommandLine(int argc, char** argv) {
         [] { ZEL::Logger::Initialize(ZEL::Logger::STDERR, ZEL::Logger::LEVEL_INFO, "", 0); },
         "Write the library's log to standard error instead of the system log");
     ExitCode result = kOk;
-    const char* const wanted = CommandOf(argc, argv);
-    bool known = *wanted == '\0';
+    int index = 1;
+    const std::string wanted = NextWord(argc, argv, index);
+    bool known = wanted.empty();
     for (const Command& command : kCommands) {
         CLI::App* const declared = app.add_subcommand(command.name, command.about);
         // What another command takes need not be known to run this one.
-        if (strcmp(command.name, wanted) == 0) {
+        if (wanted == command.name) {
             command.declare(*declared, result);
             known = true;
+            const std::string below = NextWord(argc, argv, index);
+            if (declared->get_require_subcommand_min() > 0 && !below.empty() &&
+                declared
+                    ->get_subcommands(
+                        [&](const CLI::App* lower) { return lower->check_name(below); })
+                    .empty()) {
+                return NoSuchCommand(wanted + " " + below, "zelctl " + wanted);
+            }
         }
     }
     if (!known) {
-        return Fail(kUsage, "there is no command '%s': 'zelctl -h' lists them",
-                    programs::Printable(wanted).c_str());
+        return NoSuchCommand(wanted, "zelctl");
     }
     app.footer(
         "'zelctl COMMAND -h' tells more.\n"

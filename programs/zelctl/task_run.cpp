@@ -6,7 +6,6 @@
 #include <map>
 
 #include "ZEL/sync_obj.h"
-#include "programs/common/server_status.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/daemon_client.h"
 #include "programs/zelctl/interrupt.h"
@@ -40,6 +39,14 @@ public:
     }
     /// Waits for the next news.
     ExitCode Next() { return connection_.Tell(connection_.Receive(reply_)); }
+    /// Puts the tasks that do something before those that do not.
+    void PutBusyFirst() {
+        PObject::Array& tasks = reply_["tasks"].asArray();
+        std::stable_partition(tasks.begin(), tasks.end(), [](const PObject& task) {
+            const int status = task["status"].asInt32();
+            return status == ZEL::TASK_STATUS_WAITING || status == ZEL::TASK_STATUS_RUNNING;
+        });
+    }
     const PObject::Array& Tasks() const {
         return static_cast<const PObject&>(reply_)["tasks"].asArray();
     }
@@ -121,7 +128,6 @@ private:
         return Fail(kFailed, "task '%s' has been removed or renamed", Printable(name).c_str());
     }
 
-    // A run that failed without a status has failed on this machine.
     static ExitCode Ended(const PObject& task) {
         const std::string name = Printable(task["name"].asString());
         const int64_t took = task["last_end"].asInt64() - task["last_start"].asInt64();
@@ -138,7 +144,7 @@ private:
                 const int status = task["last_status"].asInt32();
                 return Fail(status == 0 ? kLocal : CodeOf(programs::TroubleOf(status)),
                             "task '%s' failed after %s: %s", name.c_str(), took_words.c_str(),
-                            Printable(task["last_error"].asString()).c_str());
+                            Printable(OneLine(task["last_error"].asString())).c_str());
             }
         }
     }
@@ -244,6 +250,7 @@ ExitCode WatchTasks(const std::string& name) {
             break;
         }
         if (LiveBlock::Possible()) {
+            stream.PutBusyFirst();  // a window may not hold all
             block.Draw(TaskTable(stream.Tasks()).Lines());
         } else {
             lines.See(stream.Tasks());

@@ -63,6 +63,7 @@ private:
 // The daemon's keys as they are, with words beside its numbers.
 ordered_json TaskJson(const PObject& task) {
     ordered_json json = ToJson(task);
+    json.erase("pswd");  // never shown, whoever sends it
     json["schedule"] = ScheduleOf(task);
     json["state"] = programs::TaskStatusWord(task["status"].asInt32());
     json["result"] = programs::TaskResultWord(task["sync_result"].asInt32());
@@ -131,6 +132,18 @@ std::string ProgressWords(const PObject& task) {
     return words;
 }
 
+std::string OneLine(const std::string& text) {
+    std::string line;
+    for (const char c : text) {
+        if (c == '\n') {
+            line += "; ";
+        } else {
+            line += c;
+        }
+    }
+    return line;
+}
+
 Table TaskTable(const PObject::Array& tasks) {
     Table table = programs::NewTaskTable();
     for (const PObject& task : tasks) {
@@ -180,7 +193,7 @@ void PrintTask(const PObject& task, bool as_json) {
         facts.Add("progress", task["progress_share"].asString() + ": " + ProgressWords(task));
     }
     facts.Add("last run", programs::TaskLastRunWords(RowOf(task)));
-    facts.Add("error", task["last_error"].asString());
+    facts.Add("error", OneLine(task["last_error"].asString()));
     facts.Add("pending changes", std::to_string(task["pending"].asUInt64()));
     facts.Add("note", task["note"].asString());
     facts.Print();
@@ -201,7 +214,7 @@ void PrintRuns(const PObject::Array& runs, bool as_json) {
              ended ? programs::TaskResultWord(run["sync_result"].asInt32()) : "running",
              run["reason"].asString(), std::to_string(run["files_sent"].asUInt64()),
              std::to_string(run["files_deleted"].asUInt64()),
-             programs::HumanBytes(run["bytes_sent"].asUInt64()), run["error"].asString()});
+             programs::HumanBytes(run["bytes_sent"].asUInt64()), OneLine(run["error"].asString())});
     }
     table.Print(false);
 }

@@ -20,6 +20,9 @@ std::string ServerOf(const ZEL::PObject& task);
 /// "1.5 MiB of it, 2.0 MiB/s, 0:20 left" of the run that is under way
 std::string ProgressWords(const ZEL::PObject& task);
 
+/// An error, which may have several lines, as one.
+std::string OneLine(const std::string& text);
+
 programs::Table TaskTable(const ZEL::PObject::Array& tasks);
 
 void PrintTasks(const ZEL::PObject::Array& tasks, bool as_json);

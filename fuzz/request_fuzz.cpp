@@ -1,0 +1,61 @@
+// A request to the daemon, as any bytes that a peer sends: refused with a reason, or a task that is
+// sound and comes back as it was taken.
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cstdint>
+#include <cstdlib>
+
+#include "ZEL/log.h"
+#include "ZEL/stream.h"
+#include "programs/zel_daemon/task_map.h"
+
+namespace {
+
+constexpr size_t kMaxInput = 32768;  // what a socket pair holds without a reader
+
+void Require(bool holds) {
+    if (!holds) {
+        abort();
+    }
+}
+
+bool Receive(const uint8_t* data, size_t size, ZEL::PObject& value) {
+    int fds[2];
+    Require(socketpair(AF_UNIX, SOCK_STREAM, 0, fds) == 0);
+    ZEL::Channel channel(256);
+    Require(channel.Open(fds[0], true) == 0);
+    Require(write(fds[1], data, size) == static_cast<ssize_t>(size));
+    close(fds[1]);
+    return ZEL::PStream().Recv(channel, value) == 0;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+    static const int silent = ZEL::Logger::Initialize(ZEL::Logger::STDERR, -1, "", 0);
+    ZEL::PObject request;
+    if (silent != 0 || size > kMaxInput || !Receive(data, size, request)) {
+        return -1;
+    }
+    // Shares are looked up on this host, which has none.
+    request.asMap().erase("share_list");
+    zel_daemon::TaskRecord task;
+    const std::string before = zel_daemon::TaskToMap(task, true).toString();
+    try {
+        zel_daemon::ApplyTaskKeys(request, task);
+    } catch (const zel_daemon::RequestError& error) {
+        Require(error.what()[0] != '\0' && error.Code() < 0);
+        Require(zel_daemon::TaskToMap(task, true).toString() == before);
+        return 0;
+    }
+    Require(!task.Name().empty() && task.Info().GetSyncInfo().Validate() &&
+            task.Info().GetSchedule().Validate());
+    const ZEL::PObject taken = zel_daemon::TaskToMap(task, true);
+    zel_daemon::TaskRecord again;
+    ZEL::PObject settings = taken;
+    settings.asMap().erase("share_list");
+    zel_daemon::ApplyTaskKeys(settings, again);
+    Require(zel_daemon::TaskToMap(again, true).toString() == taken.toString());
+    return 0;
+}
