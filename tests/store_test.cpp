@@ -14,6 +14,7 @@
 #include <set>
 
 #include "programs/zel_daemon/store_schema.h"
+#include "tests/support/full_disk.h"
 #include "tests/support/temp_root.h"
 
 namespace {
@@ -324,44 +325,11 @@ TEST_F(StoreTest, AListThatSomebodyBrokeIsTold) {
     }
 }
 
-// Makes every write of SQLite fail as on a full disk while it lives.
-class FullDisk {
-public:
-    FullDisk() {
-        for (const char* name : kNames) {
-            real_.push_back(vfs_->xGetSystemCall(vfs_, name));
-        }
-        Set([](size_t) { return reinterpret_cast<sqlite3_syscall_ptr>(&Fail); });
-    }
-    ~FullDisk() {
-        Set([&](size_t i) { return real_[i]; });
-    }
-
-private:
-    static constexpr const char* kNames[] = {"write", "pwrite", "pwrite64"};
-
-    static ssize_t Fail(int, const void*, size_t, off64_t) {
-        errno = ENOSPC;
-        return -1;
-    }
-    template <typename Call>
-    void Set(Call call) {
-        for (size_t i = 0; i < std::size(kNames); ++i) {
-            if (real_[i] != nullptr) {
-                vfs_->xSetSystemCall(vfs_, kNames[i], call(i));
-            }
-        }
-    }
-
-    sqlite3_vfs* const vfs_ = sqlite3_vfs_find(nullptr);
-    std::vector<sqlite3_syscall_ptr> real_;
-};
-
 TEST_F(StoreTest, AFullDiskLosesNothing) {
     const uint64_t task = store_->AddTask(Task("a"));
     store_->AddEvents(task, "s", {"/a"});
     {
-        const FullDisk full;
+        const test::FullDisk full;
         EXPECT_THAT(Fault([&] {
                         store_->AddEvents(task, "s", {"/b", "/c"});
                     }),

@@ -76,6 +76,12 @@ struct EventLoop::Impl {
         return 0;
     }
 
+    void Rethrow() {
+        if (failure) {
+            std::rethrow_exception(std::exchange(failure, nullptr));
+        }
+    }
+
     static int OnIo(sd_event_source*, int, uint32_t, void* data) {
         auto* handler = static_cast<Handler*>(data);
         return handler->loop->Call(handler->task);
@@ -206,13 +212,18 @@ void EventLoop::Post(Task task) {
 
 void EventLoop::Run() {
     Require(sd_event_loop(impl_->event.get()), "sd_event_loop");
-    if (impl_->failure) {
-        std::rethrow_exception(std::exchange(impl_->failure, nullptr));
-    }
+    impl_->Rethrow();
 }
 
 void EventLoop::Stop() {
     sd_event_exit(impl_->event.get(), 0);
+}
+
+bool EventLoop::RunOnce(std::chrono::milliseconds longest) {
+    const auto microseconds = static_cast<uint64_t>(longest.count()) * 1000;
+    const bool done = Require(sd_event_run(impl_->event.get(), microseconds), "sd_event_run") > 0;
+    impl_->Rethrow();
+    return done;
 }
 
 }  // namespace zel_daemon

@@ -16,7 +16,7 @@ public:
     using Task = std::function<void()>;
 
     EventLoop();
-    ~EventLoop();
+    virtual ~EventLoop();
     EventLoop(const EventLoop&) = delete;
     EventLoop& operator=(const EventLoop&) = delete;
 
@@ -29,8 +29,9 @@ public:
     void OnClockSet(Task task);
 
     /// Calls `task` once, after so long; time asleep counts. One timer: setting it again moves it.
-    void SetTimer(std::chrono::milliseconds delay, Task task);
-    void ClearTimer();
+    /// Tests, whose clocks they move themselves, have timers of their own.
+    virtual void SetTimer(std::chrono::milliseconds delay, Task task);
+    virtual void ClearTimer();
 
     /// Has `task` called by the loop's thread soon. Any thread may call.
     void Post(Task task);
@@ -38,6 +39,8 @@ public:
     /// Runs until Stop(). An exception from a task ends it and comes out here.
     void Run();
     void Stop();
+    /// Does what there is to do by then, once. False when there was nothing.
+    bool RunOnce(std::chrono::milliseconds longest);
 
 private:
     struct Impl;

@@ -1,6 +1,7 @@
 #include "programs/zel_daemon/service.h"
 
 #include <algorithm>
+#include <iterator>
 #include <utility>
 
 #include "ZEL/channel.h"
@@ -25,6 +26,12 @@ constexpr int64_t kStoreRetryMs = 10 * 1000;
 // A timer for something that is far off is set again now and then.
 constexpr int64_t kLongestWaitMs = int64_t{24} * 3600 * 1000;
 
+// A run whose end is still to be stored.
+struct EndedRun {
+    RunRecord record;
+    std::vector<uint64_t> events;  // that it was to send
+};
+
 constexpr char kStopped[] = "the daemon was stopped; the next run completes the copy";
 
 }  // namespace
@@ -48,6 +55,7 @@ struct Service::Task {
     std::optional<TaskPlan> plan;  // always there
     std::shared_ptr<Connection> connection;
     std::unique_ptr<ActiveRun> active;
+    std::optional<EndedRun> ended;  // the store does not know of its end yet
     bool by_person = false;         // the run under way was cancelled by a person
     bool requested = false;         // a person wants a run
     int64_t due_since = 0;          // on the clock that never jumps; 0: not due
@@ -86,15 +94,14 @@ Service::~Service() {
         try {
             StoreGathered(*task);
             if (task->active) {
-                RunRecord record = task->active->Plan().record;
-                const std::vector<uint64_t> events = task->active->Plan().events;
+                task->ended = EndedRun{task->active->Plan().record, task->active->Plan().events};
                 task->active.reset();
+                RunRecord& record = task->ended->record;
                 record.end = clock_.Now();
                 record.result = ZEL::TASK_RESULT_FAILED;
                 record.error = kStopped;
-                store_.ReturnEvents(events);
-                store_.EndRun(record);
             }
+            StoreEnd(*task);
         } catch (const std::exception& error) {
             // Opening the store the next time does the same.
             Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] zel_daemon(%d): %s\n", __LINE__,
@@ -454,6 +461,18 @@ void Service::OnLoss(const std::string& share, WatchLoss loss) {
     }
 }
 
+// What could not be watched may be watched since: a folder was made readable, a share came back.
+void Service::ForgetSettledNotes(Task& task) {
+    for (auto note = task.notes.begin(); note != task.notes.end();) {
+        const bool settled =
+            watched_.count(note->first) != 0 && watcher_.Stats(note->first).complete;
+        note = settled ? task.notes.erase(note) : std::next(note);
+    }
+    if (task.notes.empty()) {
+        task.poll_at.reset();
+    }
+}
+
 bool Service::GatherDue(const Task& task, int64_t now) const {
     return task.HasGathered() && now >= task.store_retry_at &&
            (now - task.gather_last >= config_.gather.count() ||
@@ -465,12 +484,10 @@ void Service::StoreGathered(Task& task) {
         const std::vector<std::string> paths = changes.Take();
         try {
             store_.AddEvents(task.record.ID(), share, paths);
-        } catch (const StoreError& error) {
+        } catch (const StoreError&) {
             for (const std::string& path : paths) {
                 changes.Add(path);
             }
-            task.store_note = error.what();
-            task.store_retry_at = clock_.Elapsed() + kStoreRetryMs;
             throw;
         }
     }
@@ -488,12 +505,14 @@ void Service::Advance() {
     std::vector<std::pair<Task*, Due>> due;
     for (const auto& [id, task] : tasks_) {
         try {
+            if (task->ended && now >= task->store_retry_at) {
+                StoreEnd(*task);
+            }
             if (GatherDue(*task, now)) {
                 StoreGathered(*task);
             }
         } catch (const StoreError& error) {
-            Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__,
-                           error.what());
+            StoreFailed(*task, error);
         }
         const std::optional<Due> what = task->active ? std::nullopt : WhatIsDue(*task);
         if (!what) {
@@ -519,7 +538,7 @@ void Service::Advance() {
 }
 
 std::optional<Service::Due> Service::WhatIsDue(Task& task) {
-    if (clock_.Elapsed() < task.store_retry_at) {
+    if (task.ended || clock_.Elapsed() < task.store_retry_at) {
         return std::nullopt;
     }
     if (task.requested) {
@@ -597,6 +616,8 @@ void Service::StartRun(Task& task, const Due& due) {
             // Changes of shares that are no longer the task's.
             store_.RemoveEvents(plan.events);
             task.pending = store_.CountEvents(task.record.ID());
+            task.plan->Settled();
+            task.due_since = 0;
             return;
         }
         if (task.plan->ScheduleDue()) {
@@ -610,10 +631,7 @@ void Service::StartRun(Task& task, const Due& due) {
         plan.record.start = clock_.Now();
         plan.record.id = store_.BeginRun(task.record.ID(), due.reason, plan.record.start);
     } catch (const StoreError& error) {
-        Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s' cannot start: %s\n",
-                       __LINE__, task.record.Name().c_str(), error.what());
-        task.store_note = error.what();
-        task.store_retry_at = clock_.Elapsed() + kStoreRetryMs;
+        StoreFailed(task, error);
         return;
     }
     task.requested = false;
@@ -622,6 +640,7 @@ void Service::StartRun(Task& task, const Due& due) {
     if (due.whole) {
         // What changes from here on is told by events of its own.
         task.whole_due = false;
+        ForgetSettledNotes(task);
         if (task.poll_at) {
             task.poll_at = clock_.Elapsed() + config_.poll.count() * 1000;
         }
@@ -669,23 +688,38 @@ void Service::EndRun(Task& task, const Verdict& verdict, const RunTotals& totals
     } else {
         task.plan->Settled();
     }
+    task.last = record;
+    task.ended = EndedRun{std::move(record), plan.events};
     try {
-        if (verdict.Ok()) {
-            store_.RemoveEvents(plan.events);
-        } else {
-            store_.ReturnEvents(plan.events);
-        }
-        store_.EndRun(record);
-        task.store_note.clear();
-        task.pending = store_.CountEvents(task.record.ID());
+        StoreEnd(task);
     } catch (const StoreError& error) {
-        // What was sent is not known any more.
-        task.whole_due = task.record.IsRealtime();
-        task.store_note = error.what();
-        Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__, error.what());
+        StoreFailed(task, error);
     }
-    task.last = std::move(record);
     Advance();
+}
+
+// Nothing of the task is run before this has been done: what was being sent would be left out.
+void Service::StoreEnd(Task& task) {
+    if (!task.ended) {
+        return;
+    }
+    if (task.ended->record.result == ZEL::TASK_RESULT_SUCCESS) {
+        store_.RemoveEvents(task.ended->events);
+    } else {
+        store_.ReturnEvents(task.ended->events);
+    }
+    store_.EndRun(task.ended->record);
+    task.ended.reset();
+    task.store_note.clear();
+    task.pending = store_.CountEvents(task.record.ID());
+}
+
+void Service::StoreFailed(Task& task, const StoreError& error) {
+    Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s': %s\n", __LINE__,
+                   task.record.Name().c_str(), error.what());
+    task.store_note = error.what();
+    task.store_retry_at = clock_.Elapsed() + kStoreRetryMs;
+    task.due_since = 0;
 }
 
 // ---- Time ----

@@ -97,6 +97,7 @@ private:
     void PostWatcher();
     void RunWatcher();
     bool IsSearching(const Task& task) const;
+    void ForgetSettledNotes(Task& task);
     void StoreGathered(Task& task);
     bool GatherDue(const Task& task, int64_t now) const;
 
@@ -107,6 +108,8 @@ private:
     void StartRun(Task& task, const Due& due);
     void FillOrder(Task& task, const Due& due, RunPlan& plan);
     void EndRun(Task& task, const programs::Verdict& verdict, const programs::RunTotals& totals);
+    void StoreEnd(Task& task);
+    void StoreFailed(Task& task, const StoreError& error);
     RetryDelays Delays() const;
     void SetAlarm();
     std::optional<int64_t> UntilNextStep(const Task& task) const;

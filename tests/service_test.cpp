@@ -1,0 +1,482 @@
+// What the daemon runs when, on a clock that the test sets, against a server that the test plays.
+#include "programs/zel_daemon/service.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+
+#include <atomic>
+#include <chrono>
+#include <fstream>
+#include <map>
+#include <mutex>
+#include <thread>
+
+#include "programs/zel_daemon/task_map.h"
+#include "tests/integration/client_and_server.h"
+#include "tests/support/full_disk.h"
+#include "tests/support/schedules.h"
+
+namespace {
+
+using namespace test;
+using std::chrono::milliseconds;
+using std::chrono::steady_clock;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+using zel_daemon::RunReason;
+using zel_daemon::RunRecord;
+using zel_daemon::Service;
+using zel_daemon::TaskRecord;
+
+/// What the server does with copies.
+struct Copies {
+    std::atomic<bool> hold{false};  // they last until this is false
+    std::atomic<int> status{0};
+    std::mutex mutex;
+    std::map<std::string, int> running;  // by module, under the mutex as what follows
+    int most_at_a_time = 0;
+    bool share_shared = false;  // one share was copied twice at the same time
+
+    int Running() {
+        const std::lock_guard<std::mutex> lock(mutex);
+        int sum = 0;
+        for (const auto& [module, count] : running) {
+            sum += count;
+        }
+        return sum;
+    }
+    int Copy(const std::string& module, const std::function<bool()>& cancelled) {
+        Count(module, 1);
+        bool ended = false;
+        while (hold && !ended) {
+            std::this_thread::sleep_for(milliseconds(1));
+            ended = cancelled();
+        }
+        Count(module, -1);
+        return ended ? int{TARQ::Backup::STATUS_CANCELLED} : status.load();
+    }
+    void Count(const std::string& module, int change) {
+        {
+            const std::lock_guard<std::mutex> lock(mutex);
+            share_shared = (running[module] += change) > 1 || share_shared;
+        }
+        const int now = Running();
+        const std::lock_guard<std::mutex> lock(mutex);
+        most_at_a_time = std::max(most_at_a_time, now);
+    }
+};
+Copies* copies = nullptr;
+
+}  // namespace
+
+// ---- The wrapper in front of the real one: every command is done, copies are as the test says
+// ----
+
+namespace TARQ {
+namespace Backup {
+
+struct RsyncWrapper::Impl {
+    std::string module;
+    std::list<std::string> command;
+};
+
+namespace {
+thread_local RunReport* report = nullptr;
+}
+
+struct ScopedRunOptions::Impl {
+    RunReport* before;
+};
+ScopedRunOptions::ScopedRunOptions(RunOptions options)
+    : impl_(new Impl{std::exchange(report, options.report)}) {}
+ScopedRunOptions::~ScopedRunOptions() {
+    report = impl_->before;
+}
+
+RsyncWrapper::RsyncWrapper() : impl_(new Impl) {}
+RsyncWrapper::~RsyncWrapper() = default;
+#define IGNORE_BOOL(name) \
+    void RsyncWrapper::name(bool) {}
+IGNORE_BOOL(setDelete)
+IGNORE_BOOL(setNumericIds)
+IGNORE_BOOL(setTarqPseudoRoot)
+IGNORE_BOOL(setSsh)
+IGNORE_BOOL(setCompress)
+IGNORE_BOOL(setDeltaCopy)
+IGNORE_BOOL(setListOnly)
+IGNORE_BOOL(setRelativePath)
+IGNORE_BOOL(setTarqAcl)
+IGNORE_BOOL(setDebugLog)
+void RsyncWrapper::setTarqAuth(bool, bool) {}
+void RsyncWrapper::setPort(int) {}
+void RsyncWrapper::setTimeout(int) {}
+void RsyncWrapper::setExcludeRule(const std::list<std::string>&) {}
+void RsyncWrapper::setSrcPath(const std::string&) {}
+void RsyncWrapper::logError() {}
+void RsyncWrapper::setTarqCustCmdRule(const std::list<std::string>& lines) {
+    impl_->command = lines;
+}
+void RsyncWrapper::setDestPath(const std::string&, const std::string&, const std::string&,
+                               const std::string& module, const std::string&) {
+    impl_->module = module;
+}
+int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
+    if (impl_->command.empty()) {
+        const int status = copies->Copy(impl_->module, cancelled);
+        report->status = status;
+        return status;
+    }
+    for (const std::string& line : impl_->command) {
+        const std::string key = "outfile=\"";
+        if (line.compare(0, key.size(), key) == 0 && line.size() > key.size() + 1) {
+            std::ofstream(line.substr(key.size(), line.size() - key.size() - 1)) << "1\n";
+        }
+    }
+    return 0;
+}
+
+}  // namespace Backup
+}  // namespace TARQ
+
+namespace {
+
+struct TestClock : zel_daemon::Clock {
+    int64_t Now() const override { return now; }
+    int64_t Elapsed() const override { return elapsed; }
+
+    int64_t now = Utc("2015-03-20 12:00:00");
+    int64_t elapsed = 1000;
+};
+
+/// Its timer rings when the test's clock is there.
+class TestLoop : public zel_daemon::EventLoop {
+public:
+    explicit TestLoop(TestClock& clock) : clock_(clock) {}
+
+    void SetTimer(milliseconds delay, Task task) override {
+        at_ = clock_.elapsed + std::max<int64_t>(delay.count(), 0);
+        task_ = std::move(task);
+    }
+    void ClearTimer() override { task_ = nullptr; }
+
+    /// Goes on to the timer's moment, but not beyond `end`. False when it has rung no bell.
+    bool Ring(int64_t end) {
+        if (!task_ || at_ > end) {
+            return false;
+        }
+        const int64_t step = at_ - clock_.elapsed;
+        clock_.elapsed += step;
+        clock_.now += (step + 999) / 1000;
+        std::exchange(task_, nullptr)();
+        return true;
+    }
+
+private:
+    TestClock& clock_;
+    int64_t at_ = 0;
+    Task task_;
+};
+
+class ServiceTest : public testing::Test {
+protected:
+    ServiceTest() {
+        copies = &copies_;
+        SetZone("UTC");
+        config_.workers = 2;
+        config_.gather = milliseconds(100);
+        for (const char* share : {"a", "b", "c", "d"}) {
+            root_.Write(std::string("shares/") + share + "/file", "x");
+            Must(RunProgram(root_.Path(),
+                            {ZELCTL, "share", "add", share, root_.Path("shares/") + share}));
+        }
+        Start();
+    }
+    ~ServiceTest() override {
+        service_.reset();
+        SetZone("UTC");
+    }
+
+    void Start() {
+        service_.reset();
+        store_.reset();
+        loop_ = std::make_unique<TestLoop>(clock_);
+        store_ = std::make_unique<zel_daemon::Store>(root_.Path("store/tasks.db"));
+        service_ = std::make_unique<Service>(*loop_, clock_, *store_, config_, [] {});
+        service_->Start();
+        Settle();
+    }
+    /// Ends the daemon; what is to happen before the next start.
+    void Off(const std::function<void()>& meanwhile) {
+        service_.reset();
+        meanwhile();
+        Start();
+    }
+    void Add(const std::string& name, const ZEL::Schedule& schedule,
+             const std::vector<std::string>& shares = {"a"}) {
+        TaskRecord record;
+        ZEL::TaskInfo& info = record.task.GetInfo();
+        info.SetName(name);
+        info.SetShareList({shares.begin(), shares.end()});
+        info.SetSchedule(schedule);
+        ZEL::SyncInfo server;
+        server.SetServerIP("127.0.0.1");
+        server.SetUser("alice");
+        info.SetSyncInfo(server);
+        service_->Add(record);
+        Settle();
+    }
+    zel_daemon::TaskState State(const std::string& name) const {
+        return service_->StateOf(service_->Find(name));
+    }
+    /// Until nothing moves any more but the copies that are held.
+    void Settle() {
+        const auto limit = steady_clock::now() + std::chrono::seconds(60);
+        int quiet = 0;
+        while (quiet < 3 && steady_clock::now() < limit) {
+            const bool moved = loop_->RunOnce(milliseconds(2));
+            const bool held =
+                copies_.hold && service_->Stats().running == static_cast<size_t>(copies_.Running());
+            quiet = moved || !(service_->Stats().running == 0 || held) ? 0 : quiet + 1;
+        }
+        EXPECT_LT(steady_clock::now(), limit);
+    }
+    /// Lets time pass; whatever is due meanwhile is begun by the service's own timer.
+    void Pass(int64_t seconds) {
+        const int64_t end = clock_.elapsed + seconds * 1000;
+        const int64_t now_at_end = clock_.now + seconds;
+        for (int i = 0; loop_->Ring(end); ++i) {
+            ASSERT_LT(i, 10000) << "it goes round and round";
+            Settle();
+        }
+        clock_.elapsed = end;
+        clock_.now = now_at_end;
+    }
+    /// Somebody sets the clock.
+    void Jump(int64_t seconds) {
+        clock_.now += seconds;
+        service_->Refresh();
+        Settle();
+    }
+    /// The starts of the runs that are new since the last call, oldest first, as "time reason".
+    std::vector<std::string> NewRuns(const std::string& name = "t") {
+        std::vector<std::string> texts;
+        for (const RunRecord& run : service_->Runs(name, 100)) {
+            if (run.id > seen_[name]) {
+                static const char* const reasons[] = {"schedule", "change", "request", "retry"};
+                texts.insert(texts.begin(), UtcText(run.start).substr(0, 16) + " " +
+                                                reasons[static_cast<int>(run.reason)]);
+            }
+        }
+        if (!texts.empty()) {
+            seen_[name] = service_->Runs(name, 1).front().id;
+        }
+        return texts;
+    }
+    static ZEL::Schedule Daily(int hour, int minute = 0) {
+        ZEL::Schedule schedule = Make("weekly", "1111111", hour);
+        schedule.SetStartMinute(minute);
+        return schedule;
+    }
+
+    static constexpr int64_t kDay = int64_t{24} * 3600;
+
+    TempRoot root_;
+    TestClock clock_;
+    Copies copies_;
+    zel_daemon::DaemonConfig config_;
+    std::unique_ptr<TestLoop> loop_;
+    std::unique_ptr<zel_daemon::Store> store_;
+    std::unique_ptr<Service> service_;
+    std::map<std::string, uint64_t> seen_;
+};
+
+TEST_F(ServiceTest, AClockThatJumpsMakesUpForOneRunAndLosesNone) {
+    Add("t", Daily(8));
+    Pass(2 * kDay);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-21 08:00 schedule", "2015-03-22 08:00 schedule"));
+    Jump(30 * kDay);  // 2015-04-21 12:00
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-04-21 12:00 schedule"));
+    Pass(kDay);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-04-22 08:00 schedule"));
+    Jump(-10 * kDay);  // 2015-04-12 12:00
+    EXPECT_THAT(NewRuns(), IsEmpty());
+    Pass(kDay);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-04-13 08:00 schedule"));
+    Jump(-30);  // set right: 08:00 does not come twice
+    Pass(kDay);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-04-14 08:00 schedule"));
+}
+
+TEST_F(ServiceTest, ZonesAndTheNightsInWhichTheyChangeLoseNoRun) {
+    Add("t", Daily(8));
+    SetZone("America/New_York");  // 08:00 there is 12:00 UTC, which has just been
+    service_->Refresh();
+    Settle();
+    EXPECT_EQ(UtcText(*State("t").next_run), "2015-03-21 12:00:00");
+    SetZone("Asia/Tokyo");
+    service_->Refresh();
+    Pass(kDay);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-20 23:00 schedule"));
+
+    SetZone("Europe/Berlin");
+    Add("night", Daily(2, 30), {"b"});
+    Jump(Utc("2015-03-28 12:00:00") - clock_.now);
+    NewRuns("night");
+    Pass(2 * kDay);  // on the 29th 02:30 is left out
+    EXPECT_THAT(NewRuns("night"),
+                ElementsAre("2015-03-29 01:30 schedule", "2015-03-30 00:30 schedule"));
+    Jump(Utc("2015-10-24 12:00:00") - clock_.now);
+    NewRuns("night");
+    Pass(2 * kDay);  // on the 25th it comes twice, and so does the run
+    EXPECT_THAT(NewRuns("night"),
+                ElementsAre("2015-10-25 00:30 schedule", "2015-10-25 01:30 schedule",
+                            "2015-10-26 01:30 schedule"));
+}
+
+TEST_F(ServiceTest, WhatWasMissedOrCutOffWhileTheDaemonWasOffIsMadeUpForOnce) {
+    Add("t", Daily(8));
+    Off([&] {
+        clock_.now += 3 * kDay;
+        clock_.elapsed = 5;  // the machine was started anew
+    });
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-23 12:00 schedule"));
+    Pass(kDay);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-24 08:00 schedule"));
+
+    copies_.hold = true;
+    Pass(kDay - 3600);  // to 2015-03-25 11:00
+    EXPECT_EQ(service_->Stats().running, 1u);
+    Off([&] { copies_.hold = false; });
+    EXPECT_THAT(State("t").last->error, HasSubstr("the daemon was stopped"));
+    EXPECT_EQ(State("t").last->result, ZEL::TASK_RESULT_FAILED);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-25 08:00 schedule"));
+    Pass(15);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-25 11:00 retry"));
+    EXPECT_EQ(State("t").last->result, ZEL::TASK_RESULT_SUCCESS);
+    Pass(3600);
+    EXPECT_THAT(NewRuns(), IsEmpty());
+}
+
+TEST_F(ServiceTest, APausedTaskRunsForAPersonAlone) {
+    Add("t", Daily(8));
+    service_->SetPaused("t", true);
+    Pass(2 * kDay);
+    service_->RequestRun("t");
+    Settle();
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-22 12:00 request"));
+    Off([] {});
+    service_->SetPaused("t", false);
+    Settle();
+    EXPECT_THAT(NewRuns(), IsEmpty());
+    Pass(kDay);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-23 08:00 schedule"));
+}
+
+TEST_F(ServiceTest, ACancelEndsARunAndARetryForGood) {
+    Add("t", Daily(8));
+    copies_.hold = true;
+    service_->RequestRun("t");
+    Settle();
+    const auto begin = steady_clock::now();
+    service_->Cancel("t");
+    while (service_->Stats().running > 0 &&
+           steady_clock::now() - begin < std::chrono::seconds(30)) {
+        loop_->RunOnce(milliseconds(5));
+    }
+    copies_.hold = false;
+    EXPECT_EQ(State("t").last->result, ZEL::TASK_RESULT_CANCELLED);
+    EXPECT_FALSE(State("t").retry_in);
+    EXPECT_THROW(service_->Cancel("t"), zel_daemon::RequestError);
+
+    copies_.status = TARQ::Backup::STATUS_PROTOCOL_STREAM;
+    service_->RequestRun("t");
+    Settle();
+    EXPECT_GT(State("t").retry_in.value_or(0), 0);
+    Pass(60);  // after 10 s, then after 20 s more
+    EXPECT_EQ(NewRuns().size(), 4u);
+    service_->Cancel("t");
+    EXPECT_FALSE(State("t").retry_in);
+    copies_.status = 0;
+    Pass(kDay);
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-21 08:00 schedule"));
+}
+
+TEST_F(ServiceTest, NoShareIsCopiedTwiceAtATimeAndNoMoreTasksRunThanWorkers) {
+    copies_.hold = true;
+    Add("1", Make("manual", "", 0), {"a"});
+    Add("2", Make("manual", "", 0), {"b", "a"});
+    Add("3", Make("manual", "", 0), {"c"});
+    Add("4", Make("manual", "", 0), {"d"});
+    for (const char* name : {"1", "2", "3", "4"}) {
+        service_->RequestRun(name);
+    }
+    Settle();
+    EXPECT_EQ(service_->Stats().running, 2u);
+    EXPECT_EQ(State("2").status, ZEL::TASK_STATUS_WAITING);  // its share is in use: 3 goes first
+    EXPECT_EQ(State("3").status, ZEL::TASK_STATUS_RUNNING);
+    copies_.hold = false;
+    Settle();
+    for (const char* name : {"1", "2", "3", "4"}) {
+        EXPECT_EQ(State(name).last->result, ZEL::TASK_RESULT_SUCCESS) << name;
+    }
+    EXPECT_EQ(copies_.most_at_a_time, 2);
+    EXPECT_FALSE(copies_.share_shared);
+}
+
+TEST_F(ServiceTest, AStoreThatCannotBeWrittenForAWhileLosesNothing) {
+    Add("t", Make("realtime", "", 0));
+    EXPECT_THAT(NewRuns(), ElementsAre("2015-03-20 12:00 change"));
+    const auto change = [&](const char* name) {
+        root_.Write(std::string("shares/a/") + name, "x");
+        Settle();
+        Pass(1);
+    };
+    {
+        const FullDisk full;  // from the change on
+        change("one");
+        EXPECT_THAT(State("t").note, HasSubstr("the disk is full"));
+        Pass(20);
+        EXPECT_THAT(NewRuns(), IsEmpty());
+    }
+    Pass(15);
+    EXPECT_EQ(NewRuns().size(), 1u);
+    EXPECT_EQ(State("t").note, "");
+
+    for (const int status : {0, int{TARQ::Backup::STATUS_PROTOCOL_STREAM}}) {
+        copies_.hold = true;
+        copies_.status = 0;
+        change(status == 0 ? "two" : "three");
+        ASSERT_EQ(service_->Stats().running, 1u);
+        {
+            const FullDisk full;  // when the run ends
+            copies_.status = status;
+            copies_.hold = false;
+            Settle();
+            EXPECT_THAT(State("t").note, HasSubstr("the disk is full"));
+            EXPECT_EQ(State("t").pending, 1u);
+        }
+        copies_.status = 0;
+        Pass(60);
+        EXPECT_EQ(State("t").pending, 0u);
+        EXPECT_EQ(State("t").note, "");
+        EXPECT_EQ(NewRuns().size(), status == 0 ? 1u : 2u);  // what failed was sent again
+        for (const RunRecord& run : service_->Runs("t", 100)) {
+            EXPECT_NE(run.end, 0);
+        }
+    }
+
+    service_->RequestRun("t");
+    Settle();
+    {
+        const FullDisk full;  // when a run is to begin
+        service_->RequestRun("t");
+        Settle();
+        EXPECT_EQ(NewRuns().size(), 1u);
+    }
+    Pass(15);
+    EXPECT_THAT(NewRuns(), ElementsAre(HasSubstr("request")));
+}
+
+}  // namespace
