@@ -6,12 +6,13 @@
 #include <sys/file.h>
 #include <unistd.h>
 
+#include "platform/internal/error.h"
 #include "platform/internal/unique_fd.h"
-#include "platform/tarqcore/error.h"
 
 namespace tarqcore {
 namespace {
 
+using tarq_internal::Fail;
 using tarq_internal::UniqueFd;
 
 // Names that writers of one file may hold at the same time.

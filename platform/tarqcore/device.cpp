@@ -2,11 +2,11 @@
 
 #include <string>
 
-#include "platform/tarqcore/error.h"
+#include "platform/internal/error.h"
 #include "tarq/root_path.h"
 
 int KAPICIsMiniUnit(void) {
-    return tarqcore::Guarded(0, [] {
+    return tarq_internal::Guarded(0, [] {
         char value[sizeof "yes" + 1] = "";  // room for one more: "yesterday" is not cut to "yes"
         const std::string path = TARQ::RootPath("/usr/tarq/etc/tarqcore.conf");
         const int before = KAPICErrGet();

@@ -1,6 +1,4 @@
-#include "platform/tarqcore/error.h"
-
-#include <cerrno>
+#include <tarq/core.h>
 
 namespace {
 
@@ -65,14 +63,3 @@ const char* KAPICErrText(int code) {
             return "unknown error";
     }
 }
-
-namespace tarqcore {
-
-int Fail(TARQErrorCode code, int line, const char* file) {
-    const int saved = errno;
-    KAPICErrSetEx(code, file, line);
-    errno = saved;  // a test or another host may have put its own KAPICErrSetEx in front
-    return -1;
-}
-
-}  // namespace tarqcore

@@ -3,7 +3,7 @@
 #include <stdlib.h>
 #include <string.h>
 
-#include "platform/tarqcore/error.h"
+#include "platform/internal/error.h"
 
 namespace tarqcore {
 
@@ -35,14 +35,14 @@ std::optional<std::string> FormatStrings(std::string_view format,
 
 }  // namespace tarqcore
 
-using tarqcore::Fail;
+using tarq_internal::Fail;
 
 char* KAPICStrGet(const char* format, const char* argument) {
     if (format == nullptr || argument == nullptr) {
         Fail(TARQ_ERR_BAD_PARAMETER);
         return nullptr;
     }
-    return tarqcore::Guarded<char*>(nullptr, [&]() -> char* {
+    return tarq_internal::Guarded<char*>(nullptr, [&]() -> char* {
         const std::optional<std::string> text = tarqcore::FormatStrings(format, {argument});
         if (!text) {
             Fail(TARQ_ERR_BAD_PARAMETER);

@@ -8,8 +8,8 @@
 #include <string>
 #include <string_view>
 
+#include "platform/internal/error.h"
 #include "platform/internal/unique_fd.h"
-#include "platform/tarqcore/error.h"
 
 using tarq_internal::UniqueFd;
 
@@ -71,7 +71,7 @@ int KAPICProcAliveByPidFile(const char* path) {
     if (path == nullptr) {
         return 0;
     }
-    return tarqcore::Guarded(0, [&] {
+    return tarq_internal::Guarded(0, [&] {
         char buffer[kPidFileBytes];
         const auto text = ReadStart(path, buffer);
         const pid_t pid = text ? ParsePid(*text) : 0;

@@ -12,12 +12,12 @@
 #include <mutex>
 #include <vector>
 
+#include "platform/internal/error.h"
 #include "platform/internal/unique_fd.h"
-#include "platform/tarqcore/error.h"
 
+using tarq_internal::Fail;
+using tarq_internal::Guarded;
 using tarq_internal::UniqueFd;
-using tarqcore::Fail;
-using tarqcore::Guarded;
 
 namespace {
 

@@ -7,15 +7,15 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/internal/error.h"
 #include "platform/tarqcore/atomic_file.h"
-#include "platform/tarqcore/error.h"
 #include "platform/tarqcore/section_edit.h"
 #include "platform/tarqcore/section_image.h"
 #include "platform/tarqcore/section_source.h"
 
-using tarqcore::Fail;
+using tarq_internal::Fail;
+using tarq_internal::Guarded;
 using tarqcore::FileToUpdate;
-using tarqcore::Guarded;
 using tarqcore::KeyLine;
 using tarqcore::NewLine;
 using tarqcore::NewText;

@@ -10,12 +10,13 @@
 #include <mutex>
 #include <string_view>
 
+#include "platform/internal/error.h"
 #include "platform/internal/unique_fd.h"
-#include "platform/tarqcore/error.h"
 
 namespace tarqcore {
 namespace {
 
+using tarq_internal::Fail;
 using tarq_internal::UniqueFd;
 
 // Files whose images are kept: the registry, the share catalogue, a few configuration files.

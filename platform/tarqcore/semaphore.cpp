@@ -3,13 +3,13 @@
 #include <sys/sem.h>
 #include <unistd.h>
 
-#include "platform/tarqcore/error.h"
+#include "platform/internal/error.h"
 
 // The semaphore's value counts its holders: 0 is free, which is what the kernel makes it with. So
 // there is nothing to initialise after its creation, and no instant at which a second process could
 // find it half made.
 
-using tarqcore::Fail;
+using tarq_internal::Fail;
 
 namespace {
 

@@ -2,10 +2,10 @@
 #include <string>
 #include <string_view>
 
-#include "platform/tarqcore/error.h"
+#include "platform/internal/error.h"
 
-using tarqcore::Fail;
-using tarqcore::Guarded;
+using tarq_internal::Fail;
+using tarq_internal::Guarded;
 
 // A sorted tree: values keep their place while others come and go, and the walk's order is the
 // keys' own.

@@ -5,10 +5,10 @@
 #include <memory>
 #include <vector>
 
-#include "platform/tarqcore/error.h"
+#include "platform/internal/error.h"
 
-using tarqcore::Fail;
-using tarqcore::Guarded;
+using tarq_internal::Fail;
+using tarq_internal::Guarded;
 
 // The strings lie one behind the other in chunks, so that they stay in place while others are
 // pushed and a list of ten thousand section names costs a few allocations.

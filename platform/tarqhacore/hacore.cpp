@@ -11,6 +11,7 @@
 namespace {
 
 using tarq_internal::CopyOut;
+using tarq_internal::Fail;
 using tarq_internal::Guarded;
 using tarq_internal::ReadResult;
 using tarq_internal::ReadSection;
@@ -21,10 +22,6 @@ constexpr char kConfiguration[] = "/usr/tarq/etc/tarqha.conf";
 constexpr char kSection[] = "pair";
 constexpr size_t kMacBytes = 6;
 constexpr size_t kMacText = 3 * kMacBytes - 1;
-
-int Fail(int code, int line = __builtin_LINE()) {
-    return tarq_internal::Fail(code, "tarq/hacore", line);
-}
 
 ReadResult ReadPair(Section* pair) {
     return ReadSection(TARQ::RootPath(kConfiguration), kSection, pair);

@@ -21,11 +21,8 @@ static_assert(sizeof(TARQNetAddress) == 52, "callers lay out arrays of 52-byte r
 namespace {
 
 using tarq_internal::CopyOut;
+using tarq_internal::Fail;
 using tarq_internal::Guarded;
-
-int Fail(int code, int line = __builtin_LINE()) {
-    return tarq_internal::Fail(code, "tarq/netsdk", line);
-}
 
 struct AddressListFree {
     void operator()(addrinfo* list) const { freeaddrinfo(list); }

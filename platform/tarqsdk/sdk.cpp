@@ -15,6 +15,7 @@
 namespace {
 
 using tarq_internal::CopyOut;
+using tarq_internal::Fail;
 using tarq_internal::Guarded;
 using tarq_internal::ReadResult;
 using tarq_internal::ReadValue;
@@ -22,10 +23,6 @@ using tarq_internal::ReadValue;
 constexpr char kConfiguration[] = "/usr/tarq/etc/tarqsdk.conf";
 constexpr char kSection[] = "device";
 constexpr int kHostnameSize = 64;
-
-int Fail(int code, int line = __builtin_LINE()) {
-    return tarq_internal::Fail(code, "tarq/sdk", line);
-}
 
 bool IsHostname(const std::string& name) {
     return !name.empty() && std::none_of(name.begin(), name.end(), [](char c) {

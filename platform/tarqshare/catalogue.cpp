@@ -49,7 +49,7 @@ constexpr FlagName kFlagNames[] = {
 };
 
 std::nullopt_t Nothing(int code, int line = __builtin_LINE()) {
-    tarq_internal::Fail(code, "tarq/share_catalogue", line);
+    tarq_internal::Fail(code, line);
     return std::nullopt;
 }
 

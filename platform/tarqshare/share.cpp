@@ -27,6 +27,7 @@ static_assert(sizeof(TARQVolumePath) == 132, "callers know the record by its siz
 namespace {
 
 using tarq_internal::CopyOut;
+using tarq_internal::Fail;
 using tarq_internal::Guarded;
 using tarq_internal::UniqueFd;
 using tarq_share::FindVolume;
@@ -35,10 +36,6 @@ using tarq_share::ReadShare;
 using tarq_share::ReadShareNames;
 using tarq_share::Share;
 using tarq_share::Volume;
-
-int Fail(int code, int line = __builtin_LINE()) {
-    return tarq_internal::Fail(code, "tarq/share", line);
-}
 
 int Answer(const std::string& text, char* buffer, int size) {
     return CopyOut(text, buffer, size) ? 0 : Fail(TARQ_ERR_BAD_PARAMETER);

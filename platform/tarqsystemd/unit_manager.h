@@ -26,7 +26,7 @@ public:
 
 /// Sets the error code, errno kept, and gives kFailed.
 inline Outcome Failed(int code, int line = __builtin_LINE()) {
-    tarq_internal::Fail(code, "tarq/systemd", line);
+    tarq_internal::Fail(code, line);
     return Outcome::kFailed;
 }
 
