@@ -2,24 +2,14 @@
 // real ones.
 #include "ZEL/rsyncer.h"
 
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
-#include <cstring>
-#include <filesystem>
-#include <fstream>
-#include <map>
-
 #include "tarq/hacore.h"
 #include "tarq/netsdk.h"
 #include "tarq/sdk.h"
 #include "tarq/share.h"
 #include "tests/support/log_capture.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
-using testing::ElementsAre;
-using testing::HasSubstr;
-using testing::IsEmpty;
+using namespace testing;
 
 namespace {
 
@@ -333,7 +323,7 @@ TEST_F(RsyncerTest, MultiPairingNamesTheSharesAndReadsTheConflicts) {
         HasSubstr("Fail to open conflict share file\n[ERROR] ZEL/rsyncer(N): Fail to parse out "
                   "conflict shares\n"));
     EXPECT_THAT(Text(), HasSubstr("MultiPairing: Share list is empty\n"));
-    EXPECT_TRUE(std::filesystem::is_empty(root_.Path("tmp/ZEL")));
+    EXPECT_TRUE(fs::is_empty(root_.Path("tmp/ZEL")));
 }
 
 TEST_F(RsyncerTest, AnOldServerIsNotToldTheShares) {

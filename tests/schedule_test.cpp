@@ -1,18 +1,12 @@
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <limits.h>
-
 #include <bitset>
-#include <functional>
-#include <random>
 
 #include "tests/support/log_capture.h"
 #include "tests/support/schedules.h"
+#include "tests/support/testing.h"
 
 namespace {
 
-using testing::ElementsAre;
-using testing::IsEmpty;
+using namespace testing;
 using ZEL::Schedule;
 using namespace test;
 

@@ -1,29 +1,14 @@
 #include "programs/zel_daemon/store.h"
 
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <poll.h>
-#include <signal.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <filesystem>
-#include <map>
-#include <random>
-#include <set>
 
 #include "programs/zel_daemon/store_schema.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace {
 
 using namespace std::string_literals;
-using testing::AllOf;
-using testing::ElementsAre;
-using testing::HasSubstr;
-using testing::IsEmpty;
-using testing::UnorderedElementsAre;
+using namespace testing;
 using zel_daemon::Database;
 using zel_daemon::Query;
 using zel_daemon::RunReason;

@@ -1,15 +1,9 @@
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
-#include <climits>
-#include <sstream>
-
 #include "ZEL/sync_obj.h"
+#include "tests/support/testing.h"
 
 namespace {
 
-using testing::ElementsAre;
-using testing::IsEmpty;
+using namespace testing;
 using ZEL::PObject;
 using ZEL::SyncInfo;
 using ZEL::SyncTask;

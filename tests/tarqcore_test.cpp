@@ -1,22 +1,10 @@
 #include <dlfcn.h>
-#include <fcntl.h>
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <signal.h>
 #include <sys/ipc.h>
 #include <sys/sem.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <atomic>
-#include <filesystem>
-#include <fstream>
-#include <thread>
 
 #include "tarq/core.h"
 #include "tests/support/string_hash.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 // System calls that fail on demand, in front of the C library's.
 namespace {
@@ -62,8 +50,7 @@ FRONT(ssize_t, pread64, (int fd, void* bytes, size_t size, off64_t at),
 namespace {
 
 using test::Hash;
-using testing::ElementsAre;
-using testing::HasSubstr;
+using namespace testing;
 
 std::vector<std::string> Sections(const std::string& path) {
     KAPICSzList list = KAPICSzListAlloc(16);
@@ -96,7 +83,7 @@ protected:
     }
     std::vector<std::string> Entries() const {
         std::vector<std::string> names;
-        for (const auto& entry : std::filesystem::directory_iterator(folder_.Path())) {
+        for (const auto& entry : fs::directory_iterator(folder_.Path())) {
             names.push_back(entry.path().filename());
         }
         return names;
@@ -302,10 +289,10 @@ TEST_F(SectionFile, AFailureIsNotAbsence) {
     EXPECT_EQ(KAPICFileGetSection(missing.c_str(), "s", hash), 0);
     EXPECT_EQ(Value(missing, "s", "k"), "no such section");
 
-    std::filesystem::create_symlink("loop", folder_.Path("loop"));
+    fs::create_symlink("loop", folder_.Path("loop"));
     ASSERT_EQ(mkfifo(folder_.Path("pipe").c_str(), 0600), 0);
     std::ofstream(folder_.Path("huge")) << "[s]\n";
-    std::filesystem::resize_file(folder_.Path("huge"), (8U << 20) + 1);
+    fs::resize_file(folder_.Path("huge"), (8U << 20) + 1);
     folder_.Write("file", "[s]\nk=\"v\"\n");
     const std::string below = file_ + "/below";
     // clang-format off
@@ -349,9 +336,9 @@ TEST_F(SectionFile, AWriteThatFailsLeavesTheOldFileAndNothingElse) {
 }
 
 TEST_F(SectionFile, ModeOwnerAndLinksAreKept) {
-    std::filesystem::create_directory(folder_.Path("real"));
-    std::filesystem::create_symlink("real/target", folder_.Path("link"));
-    std::filesystem::create_symlink("link", file_);
+    fs::create_directory(folder_.Path("real"));
+    fs::create_symlink("real/target", folder_.Path("link"));
+    fs::create_symlink("link", file_);
     const mode_t mask = umask(022);
     ASSERT_EQ(KAPICFileAddSection(file_.c_str(), "s", Hash{}, nullptr), 1) << "the target is made";
     const std::string target = folder_.Path("real/target");
@@ -368,8 +355,7 @@ TEST_F(SectionFile, ModeOwnerAndLinksAreKept) {
     EXPECT_EQ(status.st_mode & 07777, 0666U);
     EXPECT_EQ(status.st_uid, root ? 12345U : geteuid());
     EXPECT_EQ(status.st_gid, root ? 23456U : getegid());
-    EXPECT_TRUE(std::filesystem::is_symlink(file_) &&
-                std::filesystem::is_symlink(folder_.Path("link")));
+    EXPECT_TRUE(fs::is_symlink(file_) && fs::is_symlink(folder_.Path("link")));
     EXPECT_EQ(test::ReadFile(target), "[s]\n[t]\n");
 }
 

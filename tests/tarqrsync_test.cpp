@@ -1,12 +1,3 @@
-#include <fcntl.h>
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <signal.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <stdexcept>
-
 #include "platform/internal/child_process.h"
 #include "platform/internal/unique_fd.h"
 #include "platform/tarqrsync/answer_file.h"
@@ -14,21 +5,14 @@
 #include "platform/tarqrsync/explain.h"
 #include "platform/tarqrsync/message_keeper.h"
 #include "platform/tarqrsync/output_parser.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace TARQ::Backup {
 namespace {
 
 using tarq_internal::ChildResult;
 using tarq_internal::ChildSetup;
-using testing::AllOf;
-using testing::Contains;
-using testing::ElementsAre;
-using testing::EndsWith;
-using testing::HasSubstr;
-using testing::IsSupersetOf;
-using testing::Not;
-using testing::StartsWith;
+using namespace testing;
 
 TEST(Answer, OnlyAPlainDecimalStatusInTheFirstLineIsTaken) {
     struct Case {

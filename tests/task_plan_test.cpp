@@ -1,15 +1,12 @@
 #include "programs/zel_daemon/task_plan.h"
 
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
 #include "tests/support/schedules.h"
+#include "tests/support/testing.h"
 
 namespace {
 
 using namespace test;
-using testing::ElementsAre;
-using testing::IsEmpty;
+using namespace testing;
 using zel_daemon::TaskPlan;
 
 struct TestClock : zel_daemon::Clock {

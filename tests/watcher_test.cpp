@@ -1,37 +1,16 @@
 #include "programs/zel_daemon/watcher.h"
 
-#include <fcntl.h>
-#include <gmock/gmock.h>
-#include <limits.h>
 #include <poll.h>
 #include <sched.h>
 #include <sys/inotify.h>
 #include <sys/mount.h>
-#include <sys/stat.h>
 #include <sys/syscall.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <atomic>
-#include <cerrno>
-#include <filesystem>
-#include <fstream>
-#include <functional>
-#include <map>
-#include <random>
-#include <set>
-#include <string>
-#include <thread>
-#include <vector>
-
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace {
 
-namespace fs = std::filesystem;
-using testing::Contains;
-using testing::ElementsAre;
-using testing::IsEmpty;
+using namespace testing;
 using zel_daemon::Watcher;
 using zel_daemon::WatchLoss;
 

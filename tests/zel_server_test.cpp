@@ -1,10 +1,4 @@
 // The server's side: what arrives from outside, and who may do what.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
-
-#include <cstdlib>
-#include <filesystem>
 
 #include "ZEL/is_syncedshare.h"
 #include "programs/common/server_status.h"
@@ -15,12 +9,11 @@
 #include "programs/zel_server/registry.h"
 #include "programs/zel_server/rsyncd_config.h"
 #include "programs/zel_server/transfer.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 using namespace programs;
 using namespace zel_server;
-using testing::ElementsAre;
-using testing::HasSubstr;
+using namespace testing;
 
 namespace {
 
@@ -78,7 +71,7 @@ protected:
     ServerTest() {
         for (const std::string& folder :
              {ShareModules(), AdminModules(), root_.Path("storage"), root_.Path("disk2")}) {
-            std::filesystem::create_directories(folder);
+            fs::create_directories(folder);
         }
         config_.port = 8873;
         config_.storage = root_.Path("storage");
@@ -154,7 +147,7 @@ TEST_F(ServerTest, APushGoesFromPairingToCompletion) {
               kDone);
     EXPECT_EQ(State("docs").running_id, "A");
     EXPECT_EQ(TARQZELIsSyncedShare("docs"), 1);
-    EXPECT_TRUE(std::filesystem::is_directory(root_.Path("storage/docs")));
+    EXPECT_TRUE(fs::is_directory(root_.Path("storage/docs")));
     EXPECT_THAT(test::ReadFile(ShareModules() + "/docs.conf"),
                 HasSubstr("[docs]\n    path = " + root_.Path("storage/docs")));
     EXPECT_EQ(Do("ZEL_UpdateTaskStatus", {{"taskName", "t"}}).status, kDone);
@@ -230,7 +223,7 @@ TEST_F(ServerTest, NamesNeverReachOutsideTheirPlace) {
                   kBadArgument)
             << volume;
     }
-    EXPECT_TRUE(std::filesystem::is_empty(root_.Path("storage")));
+    EXPECT_TRUE(fs::is_empty(root_.Path("storage")));
     // Volumes that the server does not have, nested mounts among them, mean the common folder.
     for (const char* volume : {"", "volume1", "mnt/data", "/etc"}) {
         EXPECT_EQ(Do("ZEL_SyncStart", {{"shareName", "s"}, {"volumeName", volume}}).status, kDone)
@@ -256,7 +249,7 @@ TEST_F(ServerTest, MissingAndOddArgumentsAreRefused) {
     EXPECT_EQ(Pair("A", "a:..:b"), kBadArgument);
     config_.encryption = false;
     EXPECT_EQ(Start("docs", "A", "alice", {{"isEncrypt", "1"}}), kNoEncryption);
-    std::filesystem::remove_all(root_.Path("storage"));
+    fs::remove_all(root_.Path("storage"));
     EXPECT_EQ(Start("docs"), kStorage);
 }
 
@@ -291,7 +284,7 @@ TEST_F(ServerTest, TheOutcomeOfADataRunIsRecordedAndAnAnswerRemoved) {
     Admit("zel_command", "alice", {});
     setenv("RSYNC_PID", "4711", 1);
     EXPECT_EQ(EndTransfer(), 0);
-    EXPECT_TRUE(std::filesystem::is_empty(folder));
+    EXPECT_TRUE(fs::is_empty(folder));
 }
 
 TEST_F(ServerTest, AccountsAreKeptInAPrivateFile) {

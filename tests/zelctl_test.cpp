@@ -1,16 +1,9 @@
 // What zelctl says to the daemon and makes of its answers, with the program as people run it and a
 // daemon that the test plays; and the parsers behind it.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
 #include <sys/time.h>
 
-#include <atomic>
-#include <filesystem>
-#include <functional>
 #include <mutex>
 #include <nlohmann/json.hpp>
-#include <thread>
 
 #include "ZEL/ipc.h"
 #include "ZEL/stream.h"
@@ -24,15 +17,12 @@
 #include "programs/zelctl/samba.h"
 #include "programs/zelctl/task_file.h"
 #include "tests/integration/client_and_server.h"
+#include "tests/support/testing.h"
 
 using programs::DescribeSchedule;
 using programs::ScheduleWords;
 using test::Outcome;
-using testing::AllOf;
-using testing::ElementsAre;
-using testing::HasSubstr;
-using testing::IsEmpty;
-using testing::Not;
+using namespace testing;
 using ZEL::PObject;
 
 namespace {
@@ -719,7 +709,7 @@ TEST(TaskDryRun, ListsWhatTheTaskWouldSend) {
         std::string Path(const std::string& name) const { return folder_.Path(name); }
     };
     const Whole whole;
-    std::filesystem::create_directories(whole.Path("client/var/run"));
+    fs::create_directories(whole.Path("client/var/run"));
     test::Must(whole.Client(
         {"push", "docs", "-s", "127.0.0.1", "-u", "alice", "--password-file", "-", "-q"},
         "secret\n"));

@@ -1,29 +1,14 @@
 // A whole client and a whole server: the programs as people run them, on a real rsync daemon and a
 // real sshd.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <signal.h>
 #include <sys/mount.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <atomic>
-#include <chrono>
-#include <filesystem>
-#include <fstream>
-#include <thread>
 
 #include "tests/integration/client_and_server.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
-namespace fs = std::filesystem;
 using test::Must;
 using test::Outcome;
 using test::RunProgram;
-using testing::AllOf;
-using testing::HasSubstr;
-using testing::Not;
+using namespace testing;
 
 namespace {
 

@@ -1,25 +1,13 @@
 #include "tarq/rsync_wrapper.h"
 
 #include <dirent.h>
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <signal.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <algorithm>
-#include <chrono>
-#include <filesystem>
-#include <fstream>
-#include <map>
-#include <set>
 
 #include "tests/integration/servers.h"
 #include "tests/support/syslog_capture.h"
+#include "tests/support/testing.h"
 
 namespace {
 
-namespace fs = std::filesystem;
 using TARQ::Backup::RsyncWrapper;
 using TARQ::Backup::RunCause;
 using TARQ::Backup::RunChange;
@@ -27,14 +15,7 @@ using TARQ::Backup::RunOptions;
 using TARQ::Backup::RunProgress;
 using TARQ::Backup::RunReport;
 using TARQ::Backup::ScopedRunOptions;
-using testing::AllOf;
-using testing::Contains;
-using testing::HasSubstr;
-using testing::IsEmpty;
-using testing::IsSupersetOf;
-using testing::Not;
-using testing::StartsWith;
-using testing::UnorderedElementsAre;
+using namespace testing;
 
 /// A client with a root folder of its own, beside a daemon with the module "data".
 class RsyncWrapperTest : public testing::Test {
