@@ -64,33 +64,11 @@ TEST_F(PushTest, ADryRunAtAServerWithoutACopyChangesNothingThere) {
 }
 
 TEST_F(PushTest, EachFailureHasItsOwnErrorAndTheNextPushCompletesTheCopy) {
-    Outcome failed = Push({}, "wrong");
-    EXPECT_EQ(failed.exit_code, 1);
-    EXPECT_THAT(failed.output, HasSubstr("password"));
-
-    failed = Client(
-        {"push", "docs", "-s", "no-such-server.invalid", "-u", "alice", "--password-file", "-"},
-        "secret\n");
-    EXPECT_EQ(failed.exit_code, 1);
-    EXPECT_THAT(failed.output, HasSubstr("cannot be looked up"));
-
     StopServer();
-    failed = Push();
+    Outcome failed = Push();
     EXPECT_EQ(failed.exit_code, 1);
     EXPECT_THAT(failed.output, HasSubstr("refused"));
     StartServer();
-
-    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nrsync=\"/nonexistent/rsync\"\n");
-    EXPECT_THAT(Push().output, HasSubstr("/nonexistent/rsync cannot be started"));
-    const std::string old = folder_.Write(
-        "rsync",
-        "#!/bin/sh\n[ \"$1\" = --version ] && echo 'rsync  version 3.1.3  "
-        "protocol version 31' && exit\necho 'rsync: --early-input: unknown option' >&2\n"
-        "exit 1\n");
-    chmod(old.c_str(), 0755);
-    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nrsync=\"" + old + "\"\n");
-    EXPECT_THAT(Push().output, HasSubstr("rsync 3.1.3, which is too old"));
-    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\n");
 
     Must(Server({"disable"}));
     failed = Push();
@@ -257,7 +235,7 @@ TEST_F(PushTest, CommandsOfMischiefChangeNothing) {
     EXPECT_TRUE(fs::is_empty(folder_.Path("server/var/run/zel_server/alice")));
 }
 
-TEST_F(PushTest, SshReachesTheSameServerAndAChangedHostKeyIsRefused) {
+TEST_F(PushTest, SshReachesTheSameServer) {
     if (!test::SshServer::Available()) {
         GTEST_SKIP() << "this machine cannot run an ssh server for the test";
     }
@@ -269,14 +247,6 @@ TEST_F(PushTest, SshReachesTheSameServerAndAChangedHostKeyIsRefused) {
     const std::vector<std::string> over_ssh = {"--ssh", "--ssh-port", std::to_string(ssh.Port())};
     ExpectNextPushCompletes(over_ssh, user);
     EXPECT_THAT(ssh.Log(), HasSubstr("Accepted publickey"));
-
-    Write("more", "m");
-    ssh.ChangeHostKey();
-    const Outcome refused = Push(over_ssh, "secret", user);
-    EXPECT_EQ(refused.exit_code, 1);
-    EXPECT_THAT(refused.output, AllOf(HasSubstr("host key"), HasSubstr("tarqrsync_known_hosts")));
-    fs::remove(folder_.Path("client/usr/tarq/etc/tarqrsync_known_hosts"));
-    ExpectNextPushCompletes(over_ssh, user);
 }
 
 }  // namespace
