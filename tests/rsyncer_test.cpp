@@ -367,6 +367,7 @@ TEST_F(RsyncerTest, CommandsThatAreAcceptedAreNotExplained) {
 
 TEST_F(RsyncerTest, AKeyFileTravelsOverSshWhateverTheTaskSays) {
     Connect();
+    root_.Write("usr/tarq/etc/.encrypt/@docs", "a key that nothing is encrypted with");
     EXPECT_EQ(rsyncer_.SyncEncryptKey("docs"), 0);
     EXPECT_EQ(rsyncer_.SyncEncryptKey("vault"), 0);
     EXPECT_THAT(world_.runs, IsEmpty());

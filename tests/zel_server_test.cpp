@@ -88,16 +88,18 @@ protected:
               const std::string& account = "alice") {
         return Execute(config_, account, Command{name, client, params});
     }
-    int Pair(const std::string& client = "A", const std::string& shares = "docs",
-             bool dry_run = false) {
+    Answer PairingAnswer(const std::string& client, const std::string& shares,
+                         bool dry_run = false) {
         return Do("ZEL_PairingMultiSrc",
                   {{"serverName", "nas"},
                    {"syncShares", shares},
                    {"dryRun", dry_run ? "yes" : "no"},
                    {"outfile", "/tmp/x"},
                    {"requireEncryptionShareSupport", "no"}},
-                  client)
-            .status;
+                  client);
+    }
+    int Pair(const std::string& client = "A", const std::string& shares = "docs") {
+        return PairingAnswer(client, shares).status;
     }
     int Start(const std::string& share, const std::string& client = "A",
               const std::string& account = "alice", Params more = {}) {
@@ -139,7 +141,7 @@ const std::vector<std::string> kRead = {"--server", "--sender", "-logDtpre.iLsfx
 TEST_F(ServerTest, APushGoesFromPairingToCompletion) {
     EXPECT_EQ(Do("ZEL_GetProtocolVer", {{"outfile", "/x"}}).body, "1\n");
     EXPECT_EQ(Start("docs"), kNotPaired);
-    EXPECT_EQ(Pair("A", "docs", true), kDone);
+    EXPECT_EQ(PairingAnswer("A", "docs", true).status, kDone);
     EXPECT_EQ(Start("docs"), kNotPaired);  // the dry run has changed nothing
     EXPECT_EQ(Pair(), kDone);
     EXPECT_EQ(Start("docs", "A", "alice",
@@ -178,13 +180,7 @@ TEST_F(ServerTest, AnotherClientOrAccountNeverGetsAtAShare) {
     EXPECT_EQ(Start("docs", "B"), kConflicts);
     EXPECT_EQ(Start("Docs"), kNameTaken);
     EXPECT_EQ(Start("docs", "A", "mallory"), kOtherAccount);
-    const Answer pairing = Do("ZEL_PairingMultiSrc",
-                              {{"serverName", "nas"},
-                               {"syncShares", "free:docs"},
-                               {"dryRun", "no"},
-                               {"outfile", "x"},
-                               {"requireEncryptionShareSupport", "no"}},
-                              "B");
+    const Answer pairing = PairingAnswer("B", "free:docs");
     EXPECT_EQ(pairing.status, kConflicts);
     EXPECT_EQ(pairing.body, "docs\n");
 }

@@ -21,6 +21,7 @@
 
 using programs::DescribeSchedule;
 using programs::ScheduleWords;
+using test::Ended;
 using test::Outcome;
 using namespace testing;
 using ZEL::PObject;
@@ -316,8 +317,9 @@ private:
     std::thread thread_;
 };
 
-PObject Success() {
+PObject Success(const PObject::Map& more = {}) {
     PObject reply;
+    reply = more;
     reply["result"] = 0;
     return reply;
 }
@@ -383,9 +385,7 @@ TEST_F(Zelctl, WithoutADaemonEveryCommandSaysWhatToDo) {
                                                     {"export"},
                                                     {"task", "watch"},
                                                     AddCommand({})}) {
-        const Outcome outcome = Run(command);
-        EXPECT_EQ(outcome.exit_code, 3) << command[1];
-        EXPECT_THAT(outcome.output, HasSubstr("systemctl start zel_daemon")) << command[1];
+        EXPECT_THAT(Run(command), Ended(3, "systemctl start zel_daemon")) << command[1];
     }
     EXPECT_THAT(Run({"tusk"}).output, HasSubstr("no command 'tusk'"));
     EXPECT_THAT(Run({"task", "lost"}).output, HasSubstr("no command 'task lost'"));
@@ -394,9 +394,7 @@ TEST_F(Zelctl, WithoutADaemonEveryCommandSaysWhatToDo) {
 
 TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
     FakeDaemon daemon(Socket(), [](const PObject& request) {
-        PObject reply = Success();
-        reply["task"] = request;
-        return reply;
+        return Success({{"task", request}});
     });
     const Outcome added =
         Run(AddCommand({"--weekly", "daily", "--at", "08:00", "--every", "2h", "--times", "3",
@@ -423,19 +421,15 @@ TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
         {{"--password", "hunter2"}, "not expected"},
     };
     for (const auto& [more, text] : refused) {
-        const Outcome outcome = Run(AddCommand(more));
-        EXPECT_NE(outcome.exit_code, 0) << text;
-        EXPECT_THAT(outcome.output, HasSubstr(text));
+        EXPECT_THAT(Run(AddCommand(more)), Not(Ended(0)));
+        EXPECT_THAT(Run(AddCommand(more)).output, HasSubstr(text));
     }
     EXPECT_EQ(daemon.Requests().size(), 1U);
 }
 
 TEST_F(Zelctl, EditSendsOnlyWhatChanges) {
-    FakeDaemon daemon(Socket(), [](const PObject& request) {
-        PObject reply = Success();
-        reply["task"] = SomeTask("nightly");
-        reply["task"].asMap().erase("pswd");
-        return request["command"].asString() == "task_add" ? Refusal(-8, "taken") : reply;
+    FakeDaemon daemon(Socket(), [](const PObject&) {
+        return Success({{"task", SomeTask("nightly")}});
     });
     EXPECT_EQ(Run({"task", "edit", "nightly", "--at", "09:00", "--no-ssh", "--server", "10.0.0.1",
                    "--rename", "daily", "--user", "alice", "--no-exclude"})
@@ -478,9 +472,9 @@ TEST_F(Zelctl, ListsAreReadAsRowsOrAsMapsAndNothingInThemReachesTheTerminal) {
         programs::TaskRow row;
         row.name = "in rows";
         row.note = "disk\302\233 full";
-        PObject reply = Success();
-        reply["rows"].asArray().emplace_back(PackTaskRow(row));
-        return knows_rows ? reply : Refusal(-4, "unknown key");
+        PObject rows;
+        rows.asArray().emplace_back(PackTaskRow(row));
+        return knows_rows ? Success({{"rows", rows}}) : Refusal(-4, "unknown key");
     });
     EXPECT_THAT(Run({"task", "list"}).output,
                 AllOf(HasSubstr("NAME"), HasSubstr("in rows  "), Not(HasSubstr("\302\233"))));
@@ -500,9 +494,7 @@ TEST_F(Zelctl, RunWaitsForItsOwnRunAndExitsByItsResult) {
     int result = 1;
     FakeDaemon daemon(Socket(), [&](const PObject& request) {
         if (request["command"].asString() != "watch") {
-            PObject reply = Success();
-            reply["after"] = 6;
-            return reply;
+            return Success({{"after", 6}});
         }
         // The run before this one failed; that is not what is waited for.
         PObject ended = Brief("a", 0, result, 7);
@@ -514,13 +506,9 @@ TEST_F(Zelctl, RunWaitsForItsOwnRunAndExitsByItsResult) {
         return replies;
     });
     EXPECT_EQ(Run({"task", "run", "a"}).exit_code, 0);
-    Outcome outcome = Run({"task", "run", "a", "--wait"});
-    EXPECT_EQ(outcome.exit_code, 0) << outcome.output;
-    EXPECT_THAT(outcome.output, HasSubstr("a: done in 1:05"));
+    EXPECT_THAT(Run({"task", "run", "a", "--wait"}), Ended(0, "a: done in 1:05"));
     result = 2;
-    outcome = Run({"task", "run", "a", "--wait"});
-    EXPECT_EQ(outcome.exit_code, 1);
-    EXPECT_THAT(outcome.output, HasSubstr("No space left in /copies"));
+    EXPECT_THAT(Run({"task", "run", "a", "--wait"}), Ended(1, "No space left in /copies"));
     result = 3;
     EXPECT_EQ(Run({"task", "run", "a", "-w"}).exit_code, 5);
     EXPECT_EQ(Run({"task", "run", "a", "b", "-w"}).exit_code, 5) << "b has gone";
@@ -528,16 +516,14 @@ TEST_F(Zelctl, RunWaitsForItsOwnRunAndExitsByItsResult) {
 
 TEST_F(Zelctl, AnInterruptLeavesTheRunGoing) {
     FakeDaemon daemon(Socket(), [&](const PObject& request) {
-        PObject reply = Success();
-        reply["after"] = 6;
-        return request["command"].asString() == "watch" ? TasksReply({Brief("a", 2, 0, 6)}) : reply;
+        return request["command"].asString() == "watch" ? TasksReply({Brief("a", 2, 0, 6)})
+                                                        : Success({{"after", 6}});
     });
     // The shell sends the interrupt to the very process that it becomes.
     const std::string script =
         "(sleep 1; kill -INT $$) & exec " + std::string(ZELCTL) + " task run a --wait";
-    const Outcome outcome = test::RunProgram(root_.Path(), {"sh", "-c", script});
-    EXPECT_EQ(outcome.exit_code, 5);
-    EXPECT_THAT(outcome.output, HasSubstr("the run of 'a' goes on"));
+    EXPECT_THAT(test::RunProgram(root_.Path(), {"sh", "-c", script}),
+                Ended(5, "the run of 'a' goes on"));
     EXPECT_THAT(daemon.Requests(), ElementsAre(HasSubstr("task_run"), HasSubstr("watch")));
 }
 
@@ -564,9 +550,7 @@ TEST_F(Zelctl, ATerminalIsDrawnInPlaceWithinItsWindowAndLeftAsItWas) {
         tasks.back()["progress_percent"] = 40;
         PObject replies;
         replies.asArray() = {TasksReply(tasks), TasksReply(tasks)};
-        PObject started = Success();
-        started["after"] = 1;
-        return request["command"].asString() == "watch" ? replies : started;
+        return request["command"].asString() == "watch" ? replies : Success({{"after", 1}});
     });
     const auto on_terminal = [&](const std::string& command) {
         const std::string script =
@@ -713,10 +697,9 @@ TEST(TaskDryRun, ListsWhatTheTaskWouldSend) {
         EXPECT_EQ(request["secrets"].asInt32(), 1);
         return reply;
     });
-    const Outcome listed = whole.Client({"task", "run", "t", "--dry-run"});
-    EXPECT_EQ(listed.exit_code, 0) << listed.output;
-    EXPECT_THAT(listed.output, AllOf(HasSubstr("send    new"), HasSubstr("1 file (1 B) would be"),
-                                     Not(HasSubstr("left.tmp"))));
+    EXPECT_THAT(whole.Client({"task", "run", "t", "--dry-run"}).output,
+                AllOf(HasSubstr("send    new"), HasSubstr("1 file (1 B) would be"),
+                      Not(HasSubstr("left.tmp"))));
 }
 
 TEST_F(Zelctl, ExportAndImportTakeAllAlongAndFaultsAddNothing) {

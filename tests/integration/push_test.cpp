@@ -5,6 +5,7 @@
 #include "tests/integration/client_and_server.h"
 #include "tests/support/testing.h"
 
+using test::Ended;
 using test::Must;
 using test::Outcome;
 using test::RunProgram;
@@ -27,8 +28,7 @@ protected:
     }
     void ExpectNextPushCompletes(const std::vector<std::string>& more = {},
                                  const std::string& user = "alice") {
-        const Outcome pushed = Push(more, "secret", user);
-        EXPECT_EQ(pushed.exit_code, 0) << pushed.output;
+        EXPECT_THAT(Push(more, "secret", user), Ended(0));
         ExpectCopyIsComplete();
     }
 };
@@ -42,8 +42,8 @@ TEST_F(PushTest, OnlyTheChangeTravelsAndADeletionIsOne) {
 
     Write("new", "n");
     fs::remove(source_ + "/a.txt");
-    const Outcome listed = Push({"--dry-run"});
-    EXPECT_THAT(listed.output, AllOf(HasSubstr("send    new (1 B)"), HasSubstr("delete  a.txt")));
+    EXPECT_THAT(Push({"--dry-run"}).output,
+                AllOf(HasSubstr("send    new (1 B)"), HasSubstr("delete  a.txt")));
     EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
     EXPECT_THAT(Push().output, HasSubstr("1 file sent, 1 deleted"));
     ExpectCopyIsComplete();
@@ -65,21 +65,15 @@ TEST_F(PushTest, ADryRunAtAServerWithoutACopyChangesNothingThere) {
 
 TEST_F(PushTest, EachFailureHasItsOwnErrorAndTheNextPushCompletesTheCopy) {
     StopServer();
-    Outcome failed = Push();
-    EXPECT_EQ(failed.exit_code, 1);
-    EXPECT_THAT(failed.output, HasSubstr("refused"));
+    EXPECT_THAT(Push(), Ended(1, "refused"));
     StartServer();
 
     Must(Server({"disable"}));
-    failed = Push();
-    EXPECT_EQ(failed.exit_code, 4);
-    EXPECT_THAT(failed.output, HasSubstr("switched off"));
+    EXPECT_THAT(Push(), Ended(4, "switched off"));
     Must(Server({"enable"}));
 
     fs::rename(storage_, storage_ + ".away");
-    failed = Push();
-    EXPECT_EQ(failed.exit_code, 4);
-    EXPECT_THAT(failed.output, HasSubstr("storage folder is not there"));
+    EXPECT_THAT(Push(), Ended(4, "storage folder is not there"));
     fs::rename(storage_ + ".away", storage_);
     ExpectNextPushCompletes();
 }
@@ -122,10 +116,8 @@ TEST_F(PushTest, AnInterruptedPushEndsInOrder) {
         RunProgram("",
                    {"pkill", "-INT", "-f", "--", std::string(ZELCTL) + " push docs -s 127.0.0.1"});
     });
-    const Outcome ended = Client(slow, "secret\n");
+    EXPECT_THAT(Client(slow, "secret\n"), Ended(5, "ended by the user"));
     interrupt.join();
-    EXPECT_EQ(ended.exit_code, 5);
-    EXPECT_THAT(ended.output, HasSubstr("ended by the user"));
     // The server knows that nobody pushes any more.
     EXPECT_THAT(Server({"shares"}).output, Not(HasSubstr("being pushed")));
     ExpectNextPushCompletes();
@@ -148,9 +140,7 @@ TEST_F(PushTest, AnUnreadableSourceOrAnotherVolumeNeverLeadsToDeletions) {
     elsewhere.insert(volume + 9, "mnt/unplugged-");
     std::ofstream(catalogue) << elsewhere;
     fs::remove(source_ + "/a.txt");
-    const Outcome refused = Push();
-    EXPECT_EQ(refused.exit_code, 3);
-    EXPECT_THAT(refused.output, HasSubstr("not mounted where it was"));
+    EXPECT_THAT(Push(), Ended(3, "not mounted where it was"));
     EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
     std::ofstream(catalogue) << good;
     ExpectNextPushCompletes();
@@ -166,9 +156,7 @@ TEST_F(PushTest, AFullDiskAtTheServerIsSaidAndThenHealed) {
     EXPECT_EQ(Push().exit_code, 0);
     std::ofstream(source_ + "/large") << std::string(8 << 20, 'x');
     fs::remove(source_ + "/a.txt");
-    const Outcome full = Push();
-    EXPECT_EQ(full.exit_code, 1);
-    EXPECT_THAT(full.output, HasSubstr("full"));
+    EXPECT_THAT(Push(), Ended(1, "full"));
     EXPECT_TRUE(fs::exists(folder_.Path("small/docs/a.txt")));
     EXPECT_EQ(mount("tmpfs", folder_.Path("small").c_str(), "tmpfs", MS_REMOUNT, "size=16m"), 0);
     EXPECT_EQ(Push().exit_code, 0);
@@ -179,9 +167,7 @@ TEST_F(PushTest, AFullDiskAtTheServerIsSaidAndThenHealed) {
 TEST_F(PushTest, AnotherAccountOrClientIsKeptOut) {
     Must(Server({"account", "add", "mallory", "--password-file", "-"}, "secret\n"));
     ExpectNextPushCompletes();
-    const Outcome other = Push({}, "secret", "mallory");
-    EXPECT_EQ(other.exit_code, 4);
-    EXPECT_THAT(other.output, HasSubstr("belongs to another client or account"));
+    EXPECT_THAT(Push({}, "secret", "mallory"), Ended(4, "belongs to another client or account"));
     // Nor past the command line, straight at the module.
     const std::string password = folder_.Write("password", "secret\n");
     chmod(password.c_str(), 0600);

@@ -51,12 +51,14 @@ protected:
         return wrapper.execute(cancelled);
     }
 
-    int Command(const std::list<std::string>& lines) {
+    int Command(const std::list<std::string>& lines,
+                const std::function<bool()>& cancelled = nullptr) {
         RsyncWrapper wrapper;
         Prepare(wrapper);
         wrapper.setListOnly(true);
+        wrapper.setDebugLog(true);
         wrapper.setTarqCustCmdRule(lines);
-        return RunWith(wrapper);
+        return RunWith(wrapper, {}, cancelled);
     }
 
     /// Copies `source` to the module, with what `set` says beside.
@@ -271,12 +273,8 @@ TEST_F(RsyncWrapperTest, TheSystemLogGetsTheExplanationOfAFailureAndNothingElse)
 TEST_F(RsyncWrapperTest, APasswordIsInNoArgumentNoEnvironmentAndNoFileOfARun) {
     ServeCommands("cat > /dev/null; sleep 1");
     const std::string secret = test::RsyncDaemon::kPassword;
-    RsyncWrapper wrapper;
-    Prepare(wrapper);
-    wrapper.setDebugLog(true);
-    wrapper.setTarqCustCmdRule({"command=\"X\""});
     bool seen_rsync = false;
-    RunWith(wrapper, {}, [&] {
+    Command({"command=\"X\""}, [&] {
         for (const std::string& text : OtherProcesses()) {
             EXPECT_THAT(text, Not(HasSubstr(secret)));
             seen_rsync = seen_rsync || text.find("--early-input=") != std::string::npos;
@@ -304,12 +302,10 @@ TEST_F(RsyncWrapperTest, ACancelledRunEndsWithinASecondAndLeavesNothing) {
     for (const std::string& program : {std::string("rsync"), deaf}) {
         SCOPED_TRACE(program);
         Configure("rsync=\"" + program + "\"\n");
-        RsyncWrapper wrapper;
-        Prepare(wrapper);
-        wrapper.setTarqCustCmdRule({"command=\"X\""});
         const auto asked = std::chrono::steady_clock::now() + std::chrono::milliseconds(300);
-        EXPECT_EQ(RunWith(wrapper, {}, [&] { return std::chrono::steady_clock::now() > asked; }),
-                  20);
+        EXPECT_EQ(
+            Command({"command=\"X\""}, [&] { return std::chrono::steady_clock::now() > asked; }),
+            20);
         EXPECT_LT(std::chrono::steady_clock::now() - asked, std::chrono::seconds(1));
         EXPECT_EQ(report_.explanation, "the run was cancelled");
         EXPECT_EQ(CountProcesses("54321"), 0U);
