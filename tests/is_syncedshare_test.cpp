@@ -107,9 +107,7 @@ TEST_F(Registry, IsMadeEmptyByTheFirstReaderOrWriter) {
     Hash hash;
     EXPECT_EQ(ZELGetServerInfo("PairedClientInfo", hash), 0);
     umask(mask);
-    struct stat status {};
-    ASSERT_EQ(stat(path_.c_str(), &status), 0);
-    EXPECT_EQ(status.st_mode & 0777U, 0644U);
+    EXPECT_EQ(test::ModeOf(path_), 0644U);
     EXPECT_EQ(Text(), "");
 
     unlink(path_.c_str());

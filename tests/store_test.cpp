@@ -44,11 +44,6 @@ std::string Fault(const std::function<void()>& work) {
     return "none";
 }
 
-mode_t ModeOf(const std::string& path) {
-    struct stat info = {};
-    return stat(path.c_str(), &info) == 0 ? info.st_mode & 07777 : 0;
-}
-
 class StoreTest : public testing::Test {
 protected:
     void Reopen() {
@@ -221,13 +216,13 @@ TEST_F(StoreTest, WhatWasCutOffHasFailedAndWaitsAgain) {
 
 TEST_F(StoreTest, IsForTheDaemonAlone) {
     store_->AddTask(Task("a"));
-    EXPECT_EQ(ModeOf(folder_.Path("daemon")), 0700U);
-    EXPECT_EQ(ModeOf(path_), 0600U);
-    EXPECT_EQ(ModeOf(path_ + "-wal"), 0600U);
+    EXPECT_EQ(test::ModeOf(folder_.Path("daemon")), 0700U);
+    EXPECT_EQ(test::ModeOf(path_), 0600U);
+    EXPECT_EQ(test::ModeOf(path_ + "-wal"), 0600U);
     store_.reset();
     chmod(path_.c_str(), 0644);
     Reopen();
-    EXPECT_EQ(ModeOf(path_), 0600U);
+    EXPECT_EQ(test::ModeOf(path_), 0600U);
 }
 
 TEST_F(StoreTest, AFileThatIsNoStoreOfThisProgramIsRefusedAndLeftAsItIs) {

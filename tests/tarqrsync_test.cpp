@@ -156,8 +156,6 @@ TEST(Explanation, ComesFromTheWordsAndTheKindOfRun) {
              {ssh, 12, "ssh: connect to host nas port 22: Connection timed out\n", 35,
               "nas did not answer on ssh"},
              {ssh, 12, "Host key verification failed.\n", 5, "the host key of nas has changed"},
-             {copy, 12, "rsync: connection unexpectedly closed\n", 12,
-              "the connection to nas broke"},
              {copy, 77, "", 77, "rsync failed with exit code 77"},
          }) {
         SCOPED_TRACE(c.messages);

@@ -289,9 +289,7 @@ TEST_F(ServerTest, AccountsAreKeptInAPrivateFile) {
     EXPECT_TRUE(SetAccount("alice", "new"));
     EXPECT_THAT(*Accounts(), ElementsAre("alice", "bob"));
     EXPECT_EQ(test::ReadFile(SecretsFile()), "alice:new\nbob:two:three\n");
-    struct stat info = {};
-    ASSERT_EQ(stat(SecretsFile().c_str(), &info), 0);
-    EXPECT_EQ(info.st_mode & 0777U, 0600U);
+    EXPECT_EQ(test::ModeOf(SecretsFile()), 0600U);
     EXPECT_TRUE(RemoveAccount("alice"));
     EXPECT_FALSE(RemoveAccount("alice"));
     EXPECT_THAT(*Accounts(), ElementsAre("bob"));

@@ -87,10 +87,6 @@ int TARQSystemdStop(const char* unit) {
 
 namespace {
 
-unsigned int ModeOf(const std::string& path) {
-    return static_cast<unsigned int>(fs::status(path).permissions());
-}
-
 class Zel : public testing::Test {
 protected:
     Zel() { host = {}; }
@@ -290,7 +286,7 @@ TEST_F(Zel, TempFilesAreNewEmptyAndPrivate) {
     const std::string path = ZEL::GetTempFile();
     ASSERT_EQ(path.rfind(root_.Path("tmp/ZEL/temp."), 0), 0U) << path;
     EXPECT_NE(ZEL::GetTempFile(), path);
-    EXPECT_EQ(ModeOf(path), 0600U);
+    EXPECT_EQ(test::ModeOf(path), 0600U);
     EXPECT_EQ(fs::file_size(path), 0U);
     ZEL::PutTempFile("");
     ZEL::PutTempFile(path);
@@ -308,7 +304,7 @@ TEST_F(Zel, ALockIsHeldFromExLockToUnLockOrTheEnd) {
     const auto is_free = [&] { return system(("flock -n '" + path + "' true").c_str()) == 0; };
     {
         ZEL::SimpleFileLock lock = factory.GetLock();
-        EXPECT_EQ(ModeOf(path), 0600U);
+        EXPECT_EQ(test::ModeOf(path), 0600U);
         EXPECT_EQ(lock.UnLock(), 0);
         EXPECT_EQ(lock.ExLock() + lock.ExLock(), 0);
         EXPECT_FALSE(is_free());

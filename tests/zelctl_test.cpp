@@ -30,30 +30,22 @@ namespace {
 
 // ---- Schedules in words ----
 
-// In the order of the options: on change, weekly, monthly, yearly, once, at, every, times.
+// One option with its days, and the times that go with it.
 ScheduleWords Words(const std::string& option, const std::string& days, const std::string& at = "",
                     const std::string& every = "", int times = -1) {
+    const auto value = [](bool given, const auto& text) {
+        return given ? std::optional(text) : std::nullopt;
+    };
     ScheduleWords words;
     words.manual = option == "manual";
     words.on_change = option == "on-change";
-    const auto set = [&](const char* name, std::optional<std::string>& value) {
-        if (option == name) {
-            value = days;
-        }
-    };
-    set("weekly", words.weekly);
-    set("monthly", words.monthly);
-    set("yearly", words.yearly);
-    set("once", words.once);
-    if (!at.empty()) {
-        words.at = at;
-    }
-    if (!every.empty()) {
-        words.every = every;
-    }
-    if (times >= 0) {
-        words.times = static_cast<unsigned int>(times);
-    }
+    words.weekly = value(option == "weekly", days);
+    words.monthly = value(option == "monthly", days);
+    words.yearly = value(option == "yearly", days);
+    words.once = value(option == "once", days);
+    words.at = value(!at.empty(), at);
+    words.every = value(!every.empty(), every);
+    words.times = value(times >= 0, static_cast<unsigned int>(times));
     return words;
 }
 
@@ -711,9 +703,7 @@ TEST_F(Zelctl, ExportAndImportTakeAllAlongAndFaultsAddNothing) {
     const std::string file = root_.Path("tasks.json");
     EXPECT_EQ(Run({"export", "--with-passwords"}).exit_code, 2);
     EXPECT_EQ(Run({"export", file, "--with-passwords"}).exit_code, 0);
-    struct stat info = {};
-    ASSERT_EQ(stat(file.c_str(), &info), 0);
-    EXPECT_EQ(info.st_mode & 0777, 0600U);
+    EXPECT_EQ(test::ModeOf(file), 0600U);
     EXPECT_THAT(Run({"import", file}).output, HasSubstr("--replace"));
     const size_t asked = daemon.Requests().size();
     EXPECT_EQ(Run({"import", file, "--replace"}).exit_code, 0);
