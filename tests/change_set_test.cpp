@@ -1,15 +1,9 @@
 #include "programs/zel_daemon/change_set.h"
-
-#include <gmock/gmock.h>
-
-#include <algorithm>
-#include <random>
-#include <string>
-#include <vector>
+#include "tests/support/testing.h"
 
 namespace {
 
-using testing::ElementsAre;
+using namespace testing;
 using zel_daemon::ChangeSet;
 using Paths = std::vector<std::string>;
 

@@ -1,23 +1,15 @@
 #include "ZEL/channel.h"
 
-#include <fcntl.h>
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <sys/resource.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
-#include <cstring>
-#include <thread>
 
 #include "ZEL/internal/cert_name.h"
 #include "ZEL/ipc.h"
 #include "ZEL/log.h"
 #include "tests/support/log_capture.h"
 #include "tests/support/sockets.h"
+#include "tests/support/testing.h"
 
-using testing::AllOf;
-using testing::HasSubstr;
+using namespace testing;
 using ZEL::Channel;
 
 namespace {

@@ -1,18 +1,12 @@
 #include "ZEL/ipc.h"
 
 #include <arpa/inet.h>
-#include <fcntl.h>
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
-#include <thread>
 
 #include "ZEL/log.h"
 #include "tests/support/log_capture.h"
+#include "tests/support/testing.h"
 
-using testing::HasSubstr;
+using namespace testing;
 using ZEL::IPCListener;
 using ZEL::IPCSender;
 using ZEL::PObject;

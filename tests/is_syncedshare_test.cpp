@@ -1,18 +1,11 @@
 #include "ZEL/is_syncedshare.h"
 
 #include <dlfcn.h>
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
 #include <syslog.h>
-#include <unistd.h>
-
-#include <algorithm>
-#include <filesystem>
 
 #include "tests/support/string_hash.h"
 #include "tests/support/syslog_capture.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace {
 
@@ -60,10 +53,7 @@ FRONT(int, KAPICIFileModifySection, (Str p, Str s, int r, Hash_ h, int a, int b)
 namespace {
 
 using test::Hash;
-using testing::ElementsAre;
-using testing::HasSubstr;
-using testing::IsEmpty;
-using testing::MatchesRegex;
+using namespace testing;
 
 class Registry : public testing::Test {
 protected:
@@ -117,21 +107,19 @@ TEST_F(Registry, IsMadeEmptyByTheFirstReaderOrWriter) {
     Hash hash;
     EXPECT_EQ(ZELGetServerInfo("PairedClientInfo", hash), 0);
     umask(mask);
-    struct stat status {};
-    ASSERT_EQ(stat(path_.c_str(), &status), 0);
-    EXPECT_EQ(status.st_mode & 0777U, 0644U);
+    EXPECT_EQ(test::ModeOf(path_), 0644U);
     EXPECT_EQ(Text(), "");
 
     unlink(path_.c_str());
     char buffer[8] = "";
     EXPECT_EQ(ZELServerGetShare("a", "k", buffer, 0), -1);
     EXPECT_EQ(ZELServerGetShare("a", nullptr, buffer, 8), -1);
-    EXPECT_FALSE(std::filesystem::exists(path_)) << "bad arguments touch nothing";
+    EXPECT_FALSE(fs::exists(path_)) << "bad arguments touch nothing";
     EXPECT_EQ(ZELServerGetShare("a", "k", buffer, 8), -1);
     EXPECT_EQ(KAPICErrGet(), 0x2200);
-    EXPECT_TRUE(std::filesystem::exists(path_));
+    EXPECT_TRUE(fs::exists(path_));
 
-    std::filesystem::remove_all(root_.Path("usr"));
+    fs::remove_all(root_.Path("usr"));
     EXPECT_EQ(ZELCheckServerInfo(), -1);
     EXPECT_LT(ZELGetServerInfo("PairedClientInfo", hash), 0);
     EXPECT_EQ(TARQUISetZEL(1, nullptr, nullptr), -1);
@@ -178,7 +166,7 @@ TEST_F(Registry, AWriteThatFailsSaysWhatFailed) {
         EXPECT_EQ(Text(), old);
         EXPECT_EQ(ZELServerUpdateShare("a", values), 0) << "the lock was given back";
     }
-    std::filesystem::remove_all(root_.Path("usr"));
+    fs::remove_all(root_.Path("usr"));
     EXPECT_EQ(ZELServerUpdateShare("a", Hash{}), -1);
     const std::string opened =
         "Failed to open file " + at + ", errno=[2/No such file or directory]";
@@ -285,7 +273,7 @@ TEST_F(Registry, AnAdmissionCheckThatCannotBeFinishedAdmitsNobody) {
         EXPECT_EQ(Admit({"photos"}, "A"), "206") << operation;
         EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre(text, last));
     }
-    std::filesystem::remove_all(root_.Path("usr"));
+    fs::remove_all(root_.Path("usr"));
     EXPECT_EQ(Admit({"photos"}, "A"), "206");
     EXPECT_THAT(test::TakeSyslogTexts(), ElementsAre("Failed to check server info.\n", converted));
     Write("[SHARE_PHOTOS]|RunningID=B|");

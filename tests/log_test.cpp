@@ -1,20 +1,11 @@
 #include "ZEL/log.h"
 
-#include <errno.h>
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
-#include <filesystem>
-#include <sstream>
-#include <thread>
-
 #include "tests/support/syslog_capture.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace {
 
-using testing::ElementsAre;
-using testing::MatchesRegex;
+using namespace testing;
 using ZEL::Logger;
 
 constexpr size_t kTimeSize = sizeof "Nov 21 11:35:07 " - 1;
@@ -59,7 +50,7 @@ TEST_F(Log, SystemLogGetsAllThatPassesTheLevelAtPriorityErrorAndAtFirstErrorsAlo
     ASSERT_EQ(lines.size(), 2U);
     EXPECT_EQ(lines[0].text + lines[1].text, "[ERROR] 7\n[DEBUG] x\n");
     EXPECT_EQ(lines[1].priority, 3);
-    EXPECT_FALSE(std::filesystem::exists(path_));
+    EXPECT_FALSE(fs::exists(path_));
 }
 
 TEST_F(Log, StandardStreamsGetTheTimeInFrontAsStandardOutputDoesAfterAFile) {
@@ -106,7 +97,7 @@ TEST_F(Log, RotatesAboveOneMebibyteOfItsOwnLines) {
     ASSERT_EQ(OpenFile(2), 0);
     WriteLine(0x100000 - 100, 'a');
     WriteLine(100, 'b');
-    EXPECT_FALSE(std::filesystem::exists(path_ + "_0"));
+    EXPECT_FALSE(fs::exists(path_ + "_0"));
     WriteLine(100, 'c');
     EXPECT_EQ(test::ReadFile(path_), "");
     EXPECT_EQ(test::ReadFile(path_ + "_0").size(), 2 * 0x100000U + 101);
@@ -118,7 +109,7 @@ TEST_F(Log, KeepsOneRotatedFileFewerThanTheCount) {
     // What remains of the rotations of a, b, c and d.
     for (const auto& [rotate_count, letters] :
          {std::pair(0, "-d---"), {1, "-d---"}, {2, "-d---"}, {4, "-dcb-"}}) {
-        std::filesystem::remove(path_ + "_0");
+        fs::remove(path_ + "_0");
         ASSERT_EQ(OpenFile(rotate_count), 0);
         for (const char fill : {'a', 'b', 'c', 'd'}) {
             WriteLine(0x100001, fill);
@@ -129,14 +120,14 @@ TEST_F(Log, KeepsOneRotatedFileFewerThanTheCount) {
 
 TEST_F(Log, AFailedRotationIsReportedAndSilencesTheLogUntilItIsSetUpAgain) {
     ASSERT_EQ(OpenFile(2), 0);
-    std::filesystem::remove(path_);
+    fs::remove(path_);
     WriteLine(0x100001, 'a');
     EXPECT_THAT(test::TakeSyslogTexts(),
                 ElementsAre("ZEL/log:145 failed to rename old_name '" + path_ +
                                 "_0' to new_name '" + path_ + "_1'.",
                             "ZEL/log:152 failed to remove old_name '" + path_ + "_1'."));
     WriteLine(100, 'b');
-    EXPECT_FALSE(std::filesystem::exists(path_));
+    EXPECT_FALSE(fs::exists(path_));
     ASSERT_EQ(OpenFile(1), 0);
     WriteLine(100, 'c');
     EXPECT_EQ(FirstLetters(), "c----");
@@ -156,7 +147,7 @@ TEST_F(Log, LinesOfSeveralThreadsStayWholeAcrossRotations) {
         thread.join();
     }
     int lines = 0;
-    for (const auto& entry : std::filesystem::directory_iterator(folder_.Path())) {
+    for (const auto& entry : fs::directory_iterator(folder_.Path())) {
         std::istringstream text(test::ReadFile(entry.path()));
         for (std::string line; std::getline(text, line); ++lines) {
             ASSERT_EQ(line.size(), 4095U);

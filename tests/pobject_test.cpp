@@ -1,10 +1,5 @@
 #include "ZEL/pobject.h"
-
-#include <gtest/gtest.h>
-
-#include <climits>
-#include <stdexcept>
-#include <utility>
+#include "tests/support/testing.h"
 
 using ZEL::PObject;
 

@@ -1,18 +1,11 @@
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <sched.h>
-#include <signal.h>
 #include <sys/mount.h>
 #include <sys/ptrace.h>
 #include <sys/resource.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <filesystem>
 
 #include "ZEL/is_syncedshare.h"
 #include "tests/support/string_hash.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace {
 
@@ -22,7 +15,7 @@ class Crash : public testing::Test {
 protected:
     std::vector<std::string> Entries() const {
         std::vector<std::string> names;
-        for (const auto& entry : std::filesystem::directory_iterator(root_.Path("usr/tarq/etc"))) {
+        for (const auto& entry : fs::directory_iterator(root_.Path("usr/tarq/etc"))) {
             names.push_back(entry.path().filename());
         }
         return names;

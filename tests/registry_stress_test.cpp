@@ -1,17 +1,10 @@
 // Many processes on one registry, for ZEL_STRESS_SECONDS (10 unless set).
-#include <gtest/gtest.h>
-#include <signal.h>
-#include <sys/wait.h>
 #include <time.h>
-#include <unistd.h>
-
-#include <cstdlib>
-#include <functional>
 
 #include "ZEL/is_syncedshare.h"
 #include "tarq/root_path.h"
 #include "tests/support/string_hash.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace {
 

@@ -1,25 +1,15 @@
-// The driver against a wrapper, a share catalogue and a host that this program puts in front of the
-// real ones.
+// The driver against a wrapper and a network that this program puts in front of the real ones;
+// shares and host are the platform's own, configured below a root folder.
 #include "ZEL/rsyncer.h"
-
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
-#include <cstring>
-#include <filesystem>
-#include <fstream>
-#include <map>
 
 #include "tarq/hacore.h"
 #include "tarq/netsdk.h"
 #include "tarq/sdk.h"
 #include "tarq/share.h"
 #include "tests/support/log_capture.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
-using testing::ElementsAre;
-using testing::HasSubstr;
-using testing::IsEmpty;
+using namespace testing;
 
 namespace {
 
@@ -31,18 +21,10 @@ struct World {
     };
     std::map<std::string, std::vector<Answer>> answers;  // by command name; the last one stays
     std::vector<int> copy_statuses = {0};
-    std::string serial = "SN1";
-    struct ShareFacts {
-        std::string path;
-        unsigned int flags;
-    };
-    std::map<std::string, ShareFacts> shares;
-    std::string key_file;
     int addresses = 2;
 
     std::vector<std::vector<std::string>> commands;  // lines of each command sent
     std::vector<std::string> runs;                   // setter calls of each run, in order
-    std::vector<std::string> looked_up;              // shares asked for
     int errors_logged = 0;
 
     World::Answer Next(const std::string& command) {
@@ -142,60 +124,15 @@ void RsyncWrapper::logError() {
 }  // namespace TARQ
 
 extern "C" {
-int TARQShareGet(const char* name, TARQShare* share) {
-    world->looked_up.push_back(name);
-    const auto found = world->shares.find(name);
-    if (found == world->shares.end()) {
-        KAPICErrSetEx(TARQ_ERR_NO_SHARE, "test", 1);
-        return -1;
-    }
-    *share = new TARQShareRec{strdup(name), strdup(found->second.path.c_str()), found->second.flags,
-                              256};
-    return 0;
-}
-void TARQShareFree(TARQShare share) {
-    if (share != nullptr) {
-        free(share->name);
-        free(share->path);
-        delete share;
-    }
-}
-int KAPIShareEncryptPathGet(const char* path, char* buffer, int size) {
-    snprintf(buffer, static_cast<size_t>(size), "%s.enc", path);
-    return 0;
-}
-int KAPIShareIsEncryptionGet(TARQShare share, int* result) {
-    *result = (share->flags & TARQ_SHARE_ENCRYPTED) != 0;
-    return 0;
-}
-int KAPIShareIsAutoDecryptGet(TARQShare share, int* result) {
-    *result = (share->flags & TARQ_SHARE_AUTO_MOUNT) != 0;
-    return 0;
-}
 int TARQShareEncAutoKeyFileGet(TARQShare, char*, int) {
     return -1;
-}
-int TARQShareEncKeyFileGet(TARQShare, char* buffer, int size) {
-    snprintf(buffer, static_cast<size_t>(size), "%s", world->key_file.c_str());
-    return 0;
 }
 int VolumePathParseEx(const char*, TARQVolumePath* volume) {
     strcpy(volume->path, "/volume1");
     volume->type = 1;
     return 0;
 }
-int TARQHAIsRunning(void) {
-    return 0;
-}
-int KAPIGetSerialNumber(char* buffer, int size) {
-    snprintf(buffer, static_cast<size_t>(size), "%s", world->serial.c_str());
-    return 0;
-}
 int KAPINetGetInterfaceInfo(KAPINetInterface*, int, int) {
-    return 0;
-}
-int TARQLnxGetHostname(char* buffer) {
-    strcpy(buffer, "nas");
     return 0;
 }
 int TARQNetLookupIP(const char*, TARQNetAddress* records, int, int) {
@@ -213,8 +150,8 @@ protected:
     RsyncerTest() {
         world = &world_;
         world_.answers["ZEL_GetProtocolVer"] = {{0, "1\n"}};
-        world_.shares["docs"] = {root_.Path("docs"), 0x80};
-        world_.shares["vault"] = {root_.Path("vault"), 0x2};
+        Share("vault.key", "encrypted");
+        SetSerial("SN1");
         root_.Write("docs/sub/file", "x");
         root_.Write("vault.enc/file", "x");
         info_.SetUser("alice");
@@ -230,7 +167,20 @@ protected:
         world_.runs.clear();
     }
     std::string Text() const { return log_.Text(); }
+    void SetSerial(const std::string& serial) const {
+        root_.Write("usr/tarq/etc/tarqsdk.conf",
+                    "[device]\nserial=\"" + serial + "\"\nhostname=\"nas\"\n");
+    }
+    /// The shares "docs", with ACLs, and "vault", with a key file and flags.
+    void Share(const std::string& key_file, const std::string& vault_flags) const {
+        const std::string vault = root_.Path("vault");
+        root_.Write(kCatalogue, "[docs]\npath=\"" + root_.Path("docs") +
+                                    "\"\nflags=\"acl\"\nkey_length=\"256\"\n[vault]\npath=\"" +
+                                    vault + "\"\nflags=\"" + vault_flags + "\"\nencrypted_path=\"" +
+                                    vault + ".enc\"\nkey_file=\"" + root_.Path(key_file) + "\"\n");
+    }
 
+    static constexpr char kCatalogue[] = "usr/tarq/etc/tarqshare.conf";
     test::TempRoot root_;
     World world_;
     test::LogCapture log_{3};  // errors only
@@ -292,7 +242,7 @@ TEST_F(RsyncerTest, TestServerReportsTheLastVerdictAndKeepsTheRightAddress) {
 }
 
 TEST_F(RsyncerTest, WithoutAClientIdentityNothingIsSent) {
-    world_.serial = "";
+    SetSerial("");
     EXPECT_EQ(rsyncer_.Initialize(info_), 213);
     EXPECT_EQ(rsyncer_.SendBeacon("t", status_), -1);
     EXPECT_EQ(status_, -7);
@@ -312,7 +262,6 @@ TEST_F(RsyncerTest, MultiPairingNamesTheSharesAndReadsTheConflicts) {
     EXPECT_EQ(status_, 214);
     EXPECT_THAT(conflicts, ElementsAre("before", "a", "", "b"));
     // The scan ends at the first encrypted share: the unknown one behind it is no failure.
-    EXPECT_THAT(world_.looked_up, ElementsAre("docs", "vault"));
     ASSERT_EQ(world_.commands.size(), 1U);
     const std::vector<std::string>& lines = world_.commands[0];
     EXPECT_THAT(lines, ElementsAre("command=\"ZEL_PairingMultiSrc\"", "clientID=\"SN1\"",
@@ -333,7 +282,7 @@ TEST_F(RsyncerTest, MultiPairingNamesTheSharesAndReadsTheConflicts) {
         HasSubstr("Fail to open conflict share file\n[ERROR] ZEL/rsyncer(N): Fail to parse out "
                   "conflict shares\n"));
     EXPECT_THAT(Text(), HasSubstr("MultiPairing: Share list is empty\n"));
-    EXPECT_TRUE(std::filesystem::is_empty(root_.Path("tmp/ZEL")));
+    EXPECT_TRUE(fs::is_empty(root_.Path("tmp/ZEL")));
 }
 
 TEST_F(RsyncerTest, AnOldServerIsNotToldTheShares) {
@@ -385,10 +334,9 @@ TEST_F(RsyncerTest, ADataRunGoesIntoTheSharesModule) {
     EXPECT_EQ(rsyncer_.RunSync(1, "vault", "/", {}, status_), 0);
     EXPECT_THAT(world_.runs[2], HasSubstr("src=" + root_.Path("vault.enc") +
                                           "/ dest=alice:secret@10.0.0.1::@vault@|"));
-    // The host was asked once for each share.
-    EXPECT_THAT(world_.looked_up, ElementsAre("docs", "vault"));
-
-    // Statuses come back as they are, and any but 0 is explained, 207 too.
+    // The host is asked once for each share. Statuses come back as they are, and any but 0 is
+    // explained, 207 too.
+    fs::remove(root_.Path(kCatalogue));
     world_.copy_statuses = {207};
     EXPECT_EQ(rsyncer_.RunSync(1, "docs", "/", {}, status_), 0);
     EXPECT_EQ(status_, 207);
@@ -419,22 +367,21 @@ TEST_F(RsyncerTest, CommandsThatAreAcceptedAreNotExplained) {
 
 TEST_F(RsyncerTest, AKeyFileTravelsOverSshWhateverTheTaskSays) {
     Connect();
+    root_.Write("usr/tarq/etc/.encrypt/@docs", "a key that nothing is encrypted with");
     EXPECT_EQ(rsyncer_.SyncEncryptKey("docs"), 0);
-    world_.key_file = root_.Path("no such key");
     EXPECT_EQ(rsyncer_.SyncEncryptKey("vault"), 0);
     EXPECT_THAT(world_.runs, IsEmpty());
 
-    world_.key_file = root_.Write("vault.key", "key");
+    const std::string key = root_.Write("vault.key", "key");
     world_.copy_statuses = {12};
     EXPECT_EQ(rsyncer_.SyncEncryptKey("vault"), 12);
     EXPECT_EQ(world_.runs[0],
               std::string(kDefaults) +
                   "setSsh=0 setDebugLog=1 timeout=600 setCompress=0 setDeltaCopy=0 setSsh=1 "
                   "port=2222 excludes=0 src=" +
-                  world_.key_file +
-                  " dest=alice:secret@10.0.0.1::/usr/tarq/etc/.encrypt|vault plain");
+                  key + " dest=alice:secret@10.0.0.1::/usr/tarq/etc/.encrypt|vault plain");
 
-    world_.shares["vault"].flags |= TARQ_SHARE_AUTO_MOUNT;
+    Share("vault.key", "encrypted auto_mount");
     EXPECT_EQ(rsyncer_.SyncEncryptKey("vault"), 300);
     EXPECT_EQ(rsyncer_.SyncEncryptKey("unknown"), 300);
     EXPECT_THAT(Text(), HasSubstr("Fail to get auto key file path for share 'vault', errno=["));

@@ -1,18 +1,12 @@
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <limits.h>
-
 #include <bitset>
-#include <functional>
-#include <random>
 
 #include "tests/support/log_capture.h"
 #include "tests/support/schedules.h"
+#include "tests/support/testing.h"
 
 namespace {
 
-using testing::ElementsAre;
-using testing::IsEmpty;
+using namespace testing;
 using ZEL::Schedule;
 using namespace test;
 
@@ -96,9 +90,7 @@ TEST(Schedule, ValidateLogsTheFirstFault) {
 
 TEST(Schedule, NextRun) {
     const char* const berlin = "Europe/Berlin";
-    const Schedule monday = Make("weekly", "0100000", 8);
     const Schedule daily = Make("weekly", "1111111", 8);
-    const Schedule hourly = Make("weekly", "1111111", 8, 3600, 3);
     const Schedule fifth = Make("monthly", "2014-01-05", 8);
     const Schedule last_day = Make("monthly", "2014-01-31", 8);
     const Schedule leap_day = Make("yearly", "2016-02-29", 8);
@@ -108,18 +100,11 @@ TEST(Schedule, NextRun) {
         const Schedule& schedule;
         const char *from, *next;  // in UTC; next is the epoch where there is none
     } const cases[] = {
-        {"UTC", monday, "2015-03-16 07:59:00", "2015-03-16 08:00:00"},
-        {"UTC", monday, "2015-03-16 08:00:00", "2015-03-23 08:00:00"},
-        {"UTC", hourly, "2015-03-16 09:30:00", "2015-03-16 10:00:00"},
-        {"UTC", hourly, "2015-12-31 11:00:00", "2016-01-01 08:00:00"},
         {"UTC", last_day, "2015-04-15 12:00:00", "2015-05-01 08:00:00"},
         {"UTC", last_day, "2015-05-01 08:00:00", "2015-05-31 08:00:00"},
         {"UTC", leap_day, "2015-02-10 00:00:00", "2015-03-01 08:00:00"},
-        {"UTC", leap_day, "2015-03-01 07:00:00", "2015-03-01 08:00:00"},
         {"UTC", leap_day, "2015-03-01 08:00:00", "2016-03-01 08:00:00"},  // a year after that day
         {"UTC", leap_day, "2016-01-01 00:00:00", "2016-02-29 08:00:00"},
-        {"UTC", once, "2015-01-01 00:00:00", "2015-04-20 08:00:00"},
-        {"UTC", once, "2015-04-20 08:00:00", "2015-04-20 08:01:00"},
         {"UTC", once, "2015-04-20 08:01:00", "1970-01-01 00:00:00"},
         // A start is read with the daylight flag that the search reaches its day with.
         {berlin, daily, "2025-03-29 08:00:00", "2025-03-30 07:00:00"},  // 09:00 in summer

@@ -1,30 +1,16 @@
 #include "programs/zel_daemon/store.h"
 
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <poll.h>
-#include <signal.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <filesystem>
-#include <map>
-#include <random>
-#include <set>
 
 #include "programs/zel_daemon/store_schema.h"
 #include "tests/support/full_disk.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/schedules.h"
+#include "tests/support/testing.h"
 
 namespace {
 
 using namespace std::string_literals;
-using testing::AllOf;
-using testing::ElementsAre;
-using testing::HasSubstr;
-using testing::IsEmpty;
-using testing::UnorderedElementsAre;
+using namespace testing;
 using zel_daemon::Database;
 using zel_daemon::Query;
 using zel_daemon::RunReason;
@@ -59,11 +45,6 @@ std::string Fault(const std::function<void()>& work) {
     return "none";
 }
 
-mode_t ModeOf(const std::string& path) {
-    struct stat info = {};
-    return stat(path.c_str(), &info) == 0 ? info.st_mode & 07777 : 0;
-}
-
 class StoreTest : public testing::Test {
 protected:
     void Reopen() {
@@ -74,19 +55,15 @@ protected:
         return Fault([&] { const Store store(path_); });
     }
     // The waiting changes, as "share path".
-    std::vector<std::string> Pending(uint64_t task) {
+    std::vector<std::string> Pending(uint64_t task, std::vector<uint64_t>* ids = nullptr) {
         std::vector<std::string> pending;
         for (const ZEL::Event& event : store_->PendingEvents(task)) {
             pending.push_back(event.GetShareName() + " " + event.GetRelativePath());
+            if (ids != nullptr) {
+                ids->push_back(event.GetID());
+            }
         }
         return pending;
-    }
-    std::vector<uint64_t> PendingIds(uint64_t task) {
-        std::vector<uint64_t> ids;
-        for (const ZEL::Event& event : store_->PendingEvents(task)) {
-            ids.push_back(event.GetID());
-        }
-        return ids;
     }
     // What a person sees in the shell.
     std::string Shell(const std::string& statement) const {
@@ -102,26 +79,10 @@ protected:
 
 TEST_F(StoreTest, KeepsEveryFieldOfATask) {
     TaskRecord record;
-    ZEL::PObject map;
-    map = ZEL::PObject::Map{{"user", "5"},  // text, though it looks like a number
-                            {"pswd", "p\xff"},
-                            {"server_ip", "10.0.0.5"},
-                            {"server_name", "cellar"},
-                            {"block", 1},
-                            {"ssh", 1},
-                            {"ssh_port", 2222},
-                            {"max_bandwidth", -1},
-                            {"rsync_timeout", 900},
-                            {"schedule_mode", 4},
-                            {"week_schd", "0100010"},
-                            {"repeat_times_in_day", -3},
-                            {"period_hour", 1},
-                            {"period_minute", 30},
-                            {"schedule_begin_year", 16},
-                            {"schedule_begin_month", 2},
-                            {"schedule_begin_day", 29},
-                            {"schedule_begin_hour", 8},
-                            {"schedule_begin_min", 31}};
+    ZEL::PObject map = test::FullTask();
+    map["user"] = "5";  // text, though it looks like a number
+    map["pswd"] = "p\xff";
+    map["repeat_times_in_day"] = -3;
     ZEL::PObj2SyncTask(map, record.task);
     record.task.GetInfo().SetName("n\xffi\0ghtly"s);
     record.task.GetInfo().SetShareList({"photo", "\xfe\0x"s, "it's \"q\"\n", ""});
@@ -168,9 +129,8 @@ TEST_F(StoreTest, AChangeWaitsOnceAndOnceMoreWhileItIsBeingSent) {
     store_->AddEvents(task, "s", {"/z", "/\xff\n", "/z", "/a"});
     store_->AddEvents(task, "t", {"/z"});
     store_->AddEvents(other, "s", {"/z"});
-    EXPECT_THAT(Pending(task), ElementsAre("s /z", "s /\xff\n", "s /a", "t /z"));
-
-    const std::vector<uint64_t> ids = PendingIds(task);
+    std::vector<uint64_t> ids;
+    EXPECT_THAT(Pending(task, &ids), ElementsAre("s /z", "s /\xff\n", "s /a", "t /z"));
     store_->MarkSending({ids[0], ids[1], ids[3]});
     store_->AddEvents(task, "s", {"/z", "/a"});
     EXPECT_THAT(Pending(task), ElementsAre("s /a", "s /z"));
@@ -194,6 +154,8 @@ TEST_F(StoreTest, KeepsTheLastRunsOfEachTask) {
     RunRecord run;
     run.id = store_->BeginRun(task, RunReason::kRetry, 100);
     run.task_id = task;
+    run.reason = RunReason::kRetry;
+    run.start = 100;
     run.end = 160;
     run.result = ZEL::TASK_RESULT_FAILED;
     run.status = 23;
@@ -203,15 +165,14 @@ TEST_F(StoreTest, KeepsTheLastRunsOfEachTask) {
     run.bytes_sent = 3;
     run.rsync_runs = 4;
     store_->EndRun(run);
-    const RunRecord kept = store_->Runs(task, 5).at(0);
-    EXPECT_EQ(kept.id, run.id);
-    EXPECT_EQ(kept.task_id, task);
-    EXPECT_EQ(kept.reason, RunReason::kRetry);
-    EXPECT_EQ(kept.start * 1000 + kept.end, 100160);
-    EXPECT_EQ(kept.result * 100 + kept.status, 223);
-    EXPECT_EQ(kept.error, run.error);
-    EXPECT_EQ(kept.files_sent, UINT64_MAX);
-    EXPECT_EQ(kept.files_deleted * 100 + kept.bytes_sent * 10 + kept.rsync_runs, 234U);
+    const auto text = [](const RunRecord& of) {
+        std::ostringstream all;
+        all << of.id << of.task_id << static_cast<int>(of.reason) << " " << of.start << of.end
+            << of.result << of.status << of.error << of.files_sent << of.files_deleted
+            << of.bytes_sent << of.rsync_runs;
+        return all.str();
+    };
+    EXPECT_EQ(text(store_->Runs(task, 5).at(0)), text(run));
 
     const uint64_t others = store_->BeginRun(other, RunReason::kRequest, 50);
     uint64_t last = 0;
@@ -241,7 +202,9 @@ TEST_F(StoreTest, WhatWasCutOffHasFailedAndWaitsAgain) {
     const uint64_t task = store_->AddTask(Task("a"));
     const uint64_t run = store_->BeginRun(task, RunReason::kChange, 100);
     store_->AddEvents(task, "s", {"/a", "/b"});
-    store_->MarkSending(PendingIds(task));
+    std::vector<uint64_t> ids;
+    Pending(task, &ids);
+    store_->MarkSending(ids);
     store_->AddEvents(task, "s", {"/b"});
     Reopen();
     const RunRecord cut = store_->Runs(task, 1).at(0);
@@ -254,13 +217,13 @@ TEST_F(StoreTest, WhatWasCutOffHasFailedAndWaitsAgain) {
 
 TEST_F(StoreTest, IsForTheDaemonAlone) {
     store_->AddTask(Task("a"));
-    EXPECT_EQ(ModeOf(folder_.Path("daemon")), 0700U);
-    EXPECT_EQ(ModeOf(path_), 0600U);
-    EXPECT_EQ(ModeOf(path_ + "-wal"), 0600U);
+    EXPECT_EQ(test::ModeOf(folder_.Path("daemon")), 0700U);
+    EXPECT_EQ(test::ModeOf(path_), 0600U);
+    EXPECT_EQ(test::ModeOf(path_ + "-wal"), 0600U);
     store_.reset();
     chmod(path_.c_str(), 0644);
     Reopen();
-    EXPECT_EQ(ModeOf(path_), 0600U);
+    EXPECT_EQ(test::ModeOf(path_), 0600U);
 }
 
 TEST_F(StoreTest, AFileThatIsNoStoreOfThisProgramIsRefusedAndLeftAsItIs) {

@@ -1,22 +1,16 @@
 #include "ZEL/stream.h"
 
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
-#include <atomic>
-#include <cstdlib>
 #include <new>
-#include <thread>
-#include <utility>
 
 #include "ZEL/log.h"
 #include "tests/support/log_capture.h"
 #include "tests/support/sockets.h"
+#include "tests/support/testing.h"
 
 using test::Hex;
 using test::RawPeer;
 using test::Unhex;
-using testing::Contains;
+using namespace testing;
 using ZEL::PObject;
 using ZEL::PStream;
 

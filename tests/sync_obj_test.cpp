@@ -1,11 +1,9 @@
 #include "ZEL/sync_obj.h"
 
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
 #include "tarq/core.h"
 #include "tarq/share.h"
 #include "tests/support/log_capture.h"
+#include "tests/support/testing.h"
 
 namespace {
 
@@ -26,7 +24,7 @@ int TARQShareIsInSharebin(const char* name) {
 
 namespace {
 
-using testing::ElementsAre;
+using namespace testing;
 using ZEL::SyncInfo;
 using ZEL::TaskInfo;
 

@@ -1,22 +1,10 @@
 #include <dlfcn.h>
-#include <fcntl.h>
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <signal.h>
 #include <sys/ipc.h>
 #include <sys/sem.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <atomic>
-#include <filesystem>
-#include <fstream>
-#include <thread>
 
 #include "tarq/core.h"
 #include "tests/support/string_hash.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 // System calls that fail on demand, in front of the C library's.
 namespace {
@@ -62,8 +50,7 @@ FRONT(ssize_t, pread64, (int fd, void* bytes, size_t size, off64_t at),
 namespace {
 
 using test::Hash;
-using testing::ElementsAre;
-using testing::HasSubstr;
+using namespace testing;
 
 std::vector<std::string> Sections(const std::string& path) {
     KAPICSzList list = KAPICSzListAlloc(16);
@@ -96,7 +83,7 @@ protected:
     }
     std::vector<std::string> Entries() const {
         std::vector<std::string> names;
-        for (const auto& entry : std::filesystem::directory_iterator(folder_.Path())) {
+        for (const auto& entry : fs::directory_iterator(folder_.Path())) {
             names.push_back(entry.path().filename());
         }
         return names;
@@ -239,32 +226,35 @@ TEST_F(SectionFile, WritesChangeTheirSectionAlone) {
     const std::string base = "# top\n[a]\n\tk=\"1\"\n\tl=\"2\"\n\n# about b\n[b]\nk=\"3\"";
     const Hash k{{"k", "9"}};
     const Hash both{{"l", "8"}, {"m", "7"}};
-    const auto expect = [this](int result, int expected_result, const std::string& expected,
-                               int line) {
-        EXPECT_EQ(result, expected_result) << "line " << line;
-        EXPECT_EQ(test::ReadFile(file_), expected) << "line " << line;
+    // What the file is after it was changed; the next change finds it as it was.
+    const auto after = [&](int result) {
+        EXPECT_EQ(result, 1);
+        const std::string text = test::ReadFile(file_);
+        folder_.Write("file", base);
+        return text;
     };
     const char* path = file_.c_str();
     folder_.Write("file", base);
-    expect(KAPICFileSetSection(path, "a", 0, k, "\t%s=\"%s\"\n"), 1,
-           "# top\n[a]\n\tk=\"9\"\n\n# about b\n[b]\nk=\"3\"", __LINE__);
-    folder_.Write("file", base);
-    expect(KAPICIFileModifySection(path, "a", 0, both, 1, 0), 1,
-           "# top\n[a]\n\tk=\"1\"\n\tl=\"8\"\nm=\"7\"\n\n# about b\n[b]\nk=\"3\"", __LINE__);
-    folder_.Write("file", base);
-    expect(KAPICIFileModifySection(path, "b", 0, k, 1, 0), 1,
-           "# top\n[a]\n\tk=\"1\"\n\tl=\"2\"\n\n# about b\n[b]\nk=\"9\"\n", __LINE__);
-    folder_.Write("file", base);
-    expect(KAPICIFileModifySection(path, "c", 0, k, 1, 0), 0, base, __LINE__);
-    expect(KAPICFileRemoveSection(path, "c"), 0, base, __LINE__);
-    expect(KAPICFileSetSection(path, "c", 0, k, nullptr), 1, base + "\n[c]\nk=\"9\"\n", __LINE__);
-    expect(KAPICFileAddSection(path, "a", both, nullptr), 1,
-           base + "\n[c]\nk=\"9\"\n[a]\nl=\"8\"\nm=\"7\"\n", __LINE__);
-    expect(KAPICFileSetSection(path, "a", 0, Hash{}, nullptr), 1,
-           "# top\n[a]\n\n# about b\n[b]\nk=\"3\"\n[c]\nk=\"9\"\n", __LINE__);
+    EXPECT_EQ(after(KAPICFileSetSection(path, "a", 0, k, "\t%s=\"%s\"\n")),
+              "# top\n[a]\n\tk=\"9\"\n\n# about b\n[b]\nk=\"3\"");
+    EXPECT_EQ(after(KAPICIFileModifySection(path, "a", 0, both, 1, 0)),
+              "# top\n[a]\n\tk=\"1\"\n\tl=\"8\"\nm=\"7\"\n\n# about b\n[b]\nk=\"3\"");
+    EXPECT_EQ(after(KAPICIFileModifySection(path, "b", 0, k, 1, 0)),
+              "# top\n[a]\n\tk=\"1\"\n\tl=\"2\"\n\n# about b\n[b]\nk=\"9\"\n");
+    EXPECT_EQ(after(KAPICFileSetSection(path, "a", 0, Hash{}, nullptr)),
+              "# top\n[a]\n\n# about b\n[b]\nk=\"3\"");
+    EXPECT_EQ(after(KAPICFileSetSection(path, "c", 0, k, nullptr)), base + "\n[c]\nk=\"9\"\n");
+    EXPECT_EQ(KAPICIFileModifySection(path, "c", 0, k, 1, 0), 0);
+    EXPECT_EQ(KAPICFileRemoveSection(path, "c"), 0);
+    EXPECT_EQ(after(KAPICFileAddSection(path, "a", both, nullptr)),
+              base + "\n[a]\nl=\"8\"\nm=\"7\"\n");
+    folder_.Write("file", base + "\n[a]\n");  // twice: all of it is the section
+    EXPECT_EQ(after(KAPICFileSetSection(path, "a", 0, k, nullptr)),
+              "# top\n[a]\nk=\"9\"\n\n# about b\n[b]\nk=\"3\"\n");
     folder_.Write("file", "[a]\nk=\"1\"\nx\nk=\"2\"\n[a]\n");
-    expect(KAPICIFileModifySection(path, "a", 0, k, 1, 0), 1, "[a]\nk=\"9\"\nx\n[a]\n", __LINE__);
-    expect(KAPICFileRemoveSection(path, "a"), 1, "", __LINE__);
+    EXPECT_EQ(KAPICIFileModifySection(path, "a", 0, k, 1, 0), 1);
+    EXPECT_EQ(test::ReadFile(file_), "[a]\nk=\"9\"\nx\n[a]\n");
+    EXPECT_EQ(after(KAPICFileRemoveSection(path, "a")), "");
 }
 
 TEST_F(SectionFile, WhatCouldBreakTheFormatIsRefused) {
@@ -302,10 +292,10 @@ TEST_F(SectionFile, AFailureIsNotAbsence) {
     EXPECT_EQ(KAPICFileGetSection(missing.c_str(), "s", hash), 0);
     EXPECT_EQ(Value(missing, "s", "k"), "no such section");
 
-    std::filesystem::create_symlink("loop", folder_.Path("loop"));
+    fs::create_symlink("loop", folder_.Path("loop"));
     ASSERT_EQ(mkfifo(folder_.Path("pipe").c_str(), 0600), 0);
     std::ofstream(folder_.Path("huge")) << "[s]\n";
-    std::filesystem::resize_file(folder_.Path("huge"), (8U << 20) + 1);
+    fs::resize_file(folder_.Path("huge"), (8U << 20) + 1);
     folder_.Write("file", "[s]\nk=\"v\"\n");
     const std::string below = file_ + "/below";
     // clang-format off
@@ -349,27 +339,25 @@ TEST_F(SectionFile, AWriteThatFailsLeavesTheOldFileAndNothingElse) {
 }
 
 TEST_F(SectionFile, ModeOwnerAndLinksAreKept) {
-    std::filesystem::create_directory(folder_.Path("real"));
-    std::filesystem::create_symlink("real/target", folder_.Path("link"));
-    std::filesystem::create_symlink("link", file_);
+    fs::create_directory(folder_.Path("real"));
+    fs::create_symlink("real/target", folder_.Path("link"));
+    fs::create_symlink("link", file_);
     const mode_t mask = umask(022);
     ASSERT_EQ(KAPICFileAddSection(file_.c_str(), "s", Hash{}, nullptr), 1) << "the target is made";
     const std::string target = folder_.Path("real/target");
-    struct stat status {};
-    ASSERT_EQ(stat(target.c_str(), &status), 0);
-    EXPECT_EQ(status.st_mode & 07777, 0644U);
+    EXPECT_EQ(test::ModeOf(target), 0644U);
     umask(077);
     ASSERT_EQ(chmod(target.c_str(), 0666), 0);
     const bool root = geteuid() == 0;
     ASSERT_EQ(root ? chown(target.c_str(), 12345, 23456) : 0, 0);
     ASSERT_EQ(KAPICFileAddSection(file_.c_str(), "t", Hash{}, nullptr), 1);
     umask(mask);
+    struct stat status {};
     ASSERT_EQ(stat(target.c_str(), &status), 0);
-    EXPECT_EQ(status.st_mode & 07777, 0666U);
+    EXPECT_EQ(test::ModeOf(target), 0666U);
     EXPECT_EQ(status.st_uid, root ? 12345U : geteuid());
     EXPECT_EQ(status.st_gid, root ? 23456U : getegid());
-    EXPECT_TRUE(std::filesystem::is_symlink(file_) &&
-                std::filesystem::is_symlink(folder_.Path("link")));
+    EXPECT_TRUE(fs::is_symlink(file_) && fs::is_symlink(folder_.Path("link")));
     EXPECT_EQ(test::ReadFile(target), "[s]\n[t]\n");
 }
 

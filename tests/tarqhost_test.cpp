@@ -1,19 +1,13 @@
 #include <dlfcn.h>
-#include <gtest/gtest.h>
 #include <netdb.h>
 #include <tarq/core.h>
 #include <tarq/hacore.h>
 #include <tarq/netsdk.h>
 #include <tarq/sdk.h>
-#include <unistd.h>
-
-#include <filesystem>
-#include <string>
-#include <vector>
 
 #include "platform/tarqnetsdk/interfaces.h"
 #include "platform/tarqsdk/identity.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace {
 
@@ -41,8 +35,6 @@ __attribute__((visibility("default"))) int getaddrinfo(const char*, const char*,
 }
 
 namespace {
-
-namespace fs = std::filesystem;
 
 class Host : public testing::Test {
 protected:

@@ -1,24 +1,15 @@
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/mount.h>
 #include <tarq/core.h>
 #include <tarq/owners.h>
 #include <tarq/share.h>
 
-#include <filesystem>
-#include <memory>
-#include <string>
-#include <thread>
-#include <vector>
-
 #include "platform/tarqshare/mount_table.h"
 #include "platform/tarqshare/volume.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace {
 
-namespace fs = std::filesystem;
 using tarq_share::FindMount;
 
 // ---- The mount table ----

@@ -1,24 +1,9 @@
-#include <gtest/gtest.h>
-#include <signal.h>
-#include <sys/wait.h>
 #include <systemd/sd-bus.h>
 #include <tarq/core.h>
 #include <tarq/systemd.h>
-#include <unistd.h>
-
-#include <atomic>
-#include <cerrno>
-#include <cstdlib>
-#include <filesystem>
-#include <functional>
-#include <memory>
-#include <string>
-#include <thread>
-#include <utility>
-#include <vector>
 
 #include "platform/tarqsystemd/bus_units.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 namespace {
 
@@ -126,7 +111,7 @@ TEST_F(Supervised, CommandThatCannotRunIsAnErrorAndLeavesNothing) {
         Configure(command);
         EXPECT_EQ(TARQSystemdStart("unit"), 0) << command;
         EXPECT_EQ(KAPICErrGet(), code) << command;
-        EXPECT_FALSE(std::filesystem::exists(pid_file_)) << command;
+        EXPECT_FALSE(fs::exists(pid_file_)) << command;
     }
 }
 

@@ -1,15 +1,12 @@
 #include "programs/zel_daemon/task_plan.h"
 
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
 #include "tests/support/schedules.h"
+#include "tests/support/testing.h"
 
 namespace {
 
 using namespace test;
-using testing::ElementsAre;
-using testing::IsEmpty;
+using namespace testing;
 using zel_daemon::TaskPlan;
 
 struct TestClock : zel_daemon::Clock {
@@ -57,7 +54,6 @@ TEST(TaskPlan, MissedRunsAreMadeUpForOnce) {
           "2015-03-21 11:30:00"}},
         {Make("once", "2015-03-15", 8), "2015-03-10 00:00:00", {"2015-03-20 12:00:00"}},
         {Make("once", "2015-03-15", 8), "2015-03-20 12:00:00", {}},
-        {Make("manual", "", 8), "2015-03-10 00:00:00", {}},
         {Make("realtime", "", 8), "2015-03-10 00:00:00", {}},
         {Make("weekly", "", 8),
          "1969-12-31 23:59:59",

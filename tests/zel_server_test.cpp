@@ -1,10 +1,4 @@
 // The server's side: what arrives from outside, and who may do what.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
-
-#include <cstdlib>
-#include <filesystem>
 
 #include "ZEL/is_syncedshare.h"
 #include "programs/common/server_status.h"
@@ -15,12 +9,11 @@
 #include "programs/zel_server/registry.h"
 #include "programs/zel_server/rsyncd_config.h"
 #include "programs/zel_server/transfer.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 using namespace programs;
 using namespace zel_server;
-using testing::ElementsAre;
-using testing::HasSubstr;
+using namespace testing;
 
 namespace {
 
@@ -78,7 +71,7 @@ protected:
     ServerTest() {
         for (const std::string& folder :
              {ShareModules(), AdminModules(), root_.Path("storage"), root_.Path("disk2")}) {
-            std::filesystem::create_directories(folder);
+            fs::create_directories(folder);
         }
         config_.port = 8873;
         config_.storage = root_.Path("storage");
@@ -95,16 +88,18 @@ protected:
               const std::string& account = "alice") {
         return Execute(config_, account, Command{name, client, params});
     }
-    int Pair(const std::string& client = "A", const std::string& shares = "docs",
-             bool dry_run = false) {
+    Answer PairingAnswer(const std::string& client, const std::string& shares,
+                         bool dry_run = false) {
         return Do("ZEL_PairingMultiSrc",
                   {{"serverName", "nas"},
                    {"syncShares", shares},
                    {"dryRun", dry_run ? "yes" : "no"},
                    {"outfile", "/tmp/x"},
                    {"requireEncryptionShareSupport", "no"}},
-                  client)
-            .status;
+                  client);
+    }
+    int Pair(const std::string& client = "A", const std::string& shares = "docs") {
+        return PairingAnswer(client, shares).status;
     }
     int Start(const std::string& share, const std::string& client = "A",
               const std::string& account = "alice", Params more = {}) {
@@ -146,7 +141,7 @@ const std::vector<std::string> kRead = {"--server", "--sender", "-logDtpre.iLsfx
 TEST_F(ServerTest, APushGoesFromPairingToCompletion) {
     EXPECT_EQ(Do("ZEL_GetProtocolVer", {{"outfile", "/x"}}).body, "1\n");
     EXPECT_EQ(Start("docs"), kNotPaired);
-    EXPECT_EQ(Pair("A", "docs", true), kDone);
+    EXPECT_EQ(PairingAnswer("A", "docs", true).status, kDone);
     EXPECT_EQ(Start("docs"), kNotPaired);  // the dry run has changed nothing
     EXPECT_EQ(Pair(), kDone);
     EXPECT_EQ(Start("docs", "A", "alice",
@@ -154,7 +149,7 @@ TEST_F(ServerTest, APushGoesFromPairingToCompletion) {
               kDone);
     EXPECT_EQ(State("docs").running_id, "A");
     EXPECT_EQ(TARQZELIsSyncedShare("docs"), 1);
-    EXPECT_TRUE(std::filesystem::is_directory(root_.Path("storage/docs")));
+    EXPECT_TRUE(fs::is_directory(root_.Path("storage/docs")));
     EXPECT_THAT(test::ReadFile(ShareModules() + "/docs.conf"),
                 HasSubstr("[docs]\n    path = " + root_.Path("storage/docs")));
     EXPECT_EQ(Do("ZEL_UpdateTaskStatus", {{"taskName", "t"}}).status, kDone);
@@ -185,13 +180,7 @@ TEST_F(ServerTest, AnotherClientOrAccountNeverGetsAtAShare) {
     EXPECT_EQ(Start("docs", "B"), kConflicts);
     EXPECT_EQ(Start("Docs"), kNameTaken);
     EXPECT_EQ(Start("docs", "A", "mallory"), kOtherAccount);
-    const Answer pairing = Do("ZEL_PairingMultiSrc",
-                              {{"serverName", "nas"},
-                               {"syncShares", "free:docs"},
-                               {"dryRun", "no"},
-                               {"outfile", "x"},
-                               {"requireEncryptionShareSupport", "no"}},
-                              "B");
+    const Answer pairing = PairingAnswer("B", "free:docs");
     EXPECT_EQ(pairing.status, kConflicts);
     EXPECT_EQ(pairing.body, "docs\n");
 }
@@ -230,7 +219,7 @@ TEST_F(ServerTest, NamesNeverReachOutsideTheirPlace) {
                   kBadArgument)
             << volume;
     }
-    EXPECT_TRUE(std::filesystem::is_empty(root_.Path("storage")));
+    EXPECT_TRUE(fs::is_empty(root_.Path("storage")));
     // Volumes that the server does not have, nested mounts among them, mean the common folder.
     for (const char* volume : {"", "volume1", "mnt/data", "/etc"}) {
         EXPECT_EQ(Do("ZEL_SyncStart", {{"shareName", "s"}, {"volumeName", volume}}).status, kDone)
@@ -256,7 +245,7 @@ TEST_F(ServerTest, MissingAndOddArgumentsAreRefused) {
     EXPECT_EQ(Pair("A", "a:..:b"), kBadArgument);
     config_.encryption = false;
     EXPECT_EQ(Start("docs", "A", "alice", {{"isEncrypt", "1"}}), kNoEncryption);
-    std::filesystem::remove_all(root_.Path("storage"));
+    fs::remove_all(root_.Path("storage"));
     EXPECT_EQ(Start("docs"), kStorage);
 }
 
@@ -291,7 +280,7 @@ TEST_F(ServerTest, TheOutcomeOfADataRunIsRecordedAndAnAnswerRemoved) {
     Admit("zel_command", "alice", {});
     setenv("RSYNC_PID", "4711", 1);
     EXPECT_EQ(EndTransfer(), 0);
-    EXPECT_TRUE(std::filesystem::is_empty(folder));
+    EXPECT_TRUE(fs::is_empty(folder));
 }
 
 TEST_F(ServerTest, AccountsAreKeptInAPrivateFile) {
@@ -300,9 +289,7 @@ TEST_F(ServerTest, AccountsAreKeptInAPrivateFile) {
     EXPECT_TRUE(SetAccount("alice", "new"));
     EXPECT_THAT(*Accounts(), ElementsAre("alice", "bob"));
     EXPECT_EQ(test::ReadFile(SecretsFile()), "alice:new\nbob:two:three\n");
-    struct stat info = {};
-    ASSERT_EQ(stat(SecretsFile().c_str(), &info), 0);
-    EXPECT_EQ(info.st_mode & 0777U, 0600U);
+    EXPECT_EQ(test::ModeOf(SecretsFile()), 0600U);
     EXPECT_TRUE(RemoveAccount("alice"));
     EXPECT_FALSE(RemoveAccount("alice"));
     EXPECT_THAT(*Accounts(), ElementsAre("bob"));

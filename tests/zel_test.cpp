@@ -1,15 +1,6 @@
 #include "ZEL/zel.h"
 
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <pthread.h>
-#include <signal.h>
-#include <sys/stat.h>
-
-#include <atomic>
-#include <chrono>
-#include <filesystem>
-#include <thread>
 
 #include "tarq/core.h"
 #include "tarq/netsdk.h"
@@ -17,12 +8,12 @@
 #include "tarq/share.h"
 #include "tarq/systemd.h"
 #include "tests/support/log_capture.h"
+#include "tests/support/testing.h"
 
 namespace {
 
 using Strings = std::vector<std::string>;
-using testing::ElementsAre;
-using testing::IsEmpty;
+using namespace testing;
 
 // What the platform's operations below answer with, and what they were asked.
 struct Host {
@@ -95,10 +86,6 @@ int TARQSystemdStop(const char* unit) {
 }
 
 namespace {
-
-unsigned int ModeOf(const std::string& path) {
-    return static_cast<unsigned int>(std::filesystem::status(path).permissions());
-}
 
 class Zel : public testing::Test {
 protected:
@@ -260,7 +247,7 @@ TEST_F(Zel, AddressesAreAskedForOnlyWhereNeededAndAFailureAppendsNone) {
     Answer("printf '\\tSERVER1'");
     EXPECT_EQ(ZEL::GetUsableIP("server1", "10.0.0.5", out), 0);
     EXPECT_THAT(host.calls, IsEmpty());
-    std::filesystem::remove(asked_);
+    fs::remove(asked_);
     EXPECT_EQ(ZEL::GetUsableIP("server1", "-option", out), 0);
     EXPECT_THAT(host.calls, ElementsAre("server120"));
     EXPECT_FALSE(ZEL::IsPathExist(asked_));
@@ -270,7 +257,7 @@ TEST_F(Zel, AddressesAreAskedForOnlyWhereNeededAndAFailureAppendsNone) {
     host.addresses = {"10.0.0.7"};
     EXPECT_EQ(ZEL::GetUsableIP("server1", "", out), -1);
     EXPECT_THAT(Faults(), IsEmpty());
-    std::filesystem::remove(root_.Path("usr/local/bin/nmblookup"));
+    fs::remove(root_.Path("usr/local/bin/nmblookup"));
     EXPECT_EQ(ZEL::GetUsableIP("server1", "10.0.0.5", out), -1);
     EXPECT_THAT(Faults(), ElementsAre("nmblookup_r: popen error"));
     EXPECT_THAT(out, IsEmpty());
@@ -299,14 +286,14 @@ TEST_F(Zel, TempFilesAreNewEmptyAndPrivate) {
     const std::string path = ZEL::GetTempFile();
     ASSERT_EQ(path.rfind(root_.Path("tmp/ZEL/temp."), 0), 0U) << path;
     EXPECT_NE(ZEL::GetTempFile(), path);
-    EXPECT_EQ(ModeOf(path), 0600U);
-    EXPECT_EQ(std::filesystem::file_size(path), 0U);
+    EXPECT_EQ(test::ModeOf(path), 0600U);
+    EXPECT_EQ(fs::file_size(path), 0U);
     ZEL::PutTempFile("");
     ZEL::PutTempFile(path);
     EXPECT_THAT(Faults(), IsEmpty());
     ZEL::PutTempFile(path);
     EXPECT_THAT(Faults(), ElementsAre("Fail to unlink temp file '" + path + "' [2]"));
-    std::filesystem::remove_all(root_.Path("tmp"));
+    fs::remove_all(root_.Path("tmp"));
     EXPECT_EQ(ZEL::GetTempFile(), "");
     EXPECT_THAT(Faults(), IsEmpty());
 }
@@ -317,7 +304,7 @@ TEST_F(Zel, ALockIsHeldFromExLockToUnLockOrTheEnd) {
     const auto is_free = [&] { return system(("flock -n '" + path + "' true").c_str()) == 0; };
     {
         ZEL::SimpleFileLock lock = factory.GetLock();
-        EXPECT_EQ(ModeOf(path), 0600U);
+        EXPECT_EQ(test::ModeOf(path), 0600U);
         EXPECT_EQ(lock.UnLock(), 0);
         EXPECT_EQ(lock.ExLock() + lock.ExLock(), 0);
         EXPECT_FALSE(is_free());

@@ -182,7 +182,7 @@ std::string ApplyRepeats(const ScheduleWords& words, ZEL::Schedule& schedule) {
     } else if (schedule.GetPeriodSeconds() > 0) {
         period = static_cast<int>(schedule.GetPeriodSeconds() / 60);
     }
-    const long times = words.times ? long{*words.times} : schedule.GetRepeatTimesInDay();
+    const int64_t times = words.times ? int64_t{*words.times} : schedule.GetRepeatTimesInDay();
     if (times > kMaxTimes) {
         return "--times: a day has at most 95 runs after the first";
     }
@@ -193,7 +193,7 @@ std::string ApplyRepeats(const ScheduleWords& words, ZEL::Schedule& schedule) {
         return "--times needs --every: the time between two runs, as in 1h30m";
     }
     // The count first: set after it, a period stands.
-    schedule.SetRepeatTimesInDay(times);
+    schedule.SetRepeatTimesInDay(static_cast<long>(times));
     if (times > 0) {
         schedule.SetPeriod(0, *period);
     }

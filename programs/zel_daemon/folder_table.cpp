@@ -22,7 +22,7 @@ template <typename HashOf>
 void FolderTable::Index<kNext>::Insert(std::deque<Folder>& folders, FolderId id,
                                        const HashOf& hash_of) {
     const auto link = [&](FolderId which) {
-        FolderId& head = heads_[hash_of(which) & (heads_.size() - 1)];
+        FolderId& head = heads_[Bucket(hash_of(which))];
         folders[which].*kNext = std::exchange(head, which);
     };
     if (count_ == heads_.size()) {
@@ -42,7 +42,7 @@ void FolderTable::Index<kNext>::Insert(std::deque<Folder>& folders, FolderId id,
 
 template <FolderId FolderTable::Folder::*kNext>
 void FolderTable::Index<kNext>::Erase(std::deque<Folder>& folders, FolderId id, uint64_t hash) {
-    FolderId* at = &heads_[hash & (heads_.size() - 1)];
+    FolderId* at = &heads_[Bucket(hash)];
     while (*at != id) {
         at = &(folders[*at].*kNext);
     }

@@ -74,13 +74,17 @@ private:
     class Index {
     public:
         FolderId First(uint64_t hash) const {
-            return heads_.empty() ? kNoFolder : heads_[hash & (heads_.size() - 1)];
+            return heads_.empty() ? kNoFolder : heads_[Bucket(hash)];
         }
         template <typename HashOf>
         void Insert(std::deque<Folder>& folders, FolderId id, const HashOf& hash_of);
         void Erase(std::deque<Folder>& folders, FolderId id, uint64_t hash);
 
     private:
+        size_t Bucket(uint64_t hash) const {
+            return static_cast<size_t>(hash & (heads_.size() - 1));
+        }
+
         std::vector<FolderId> heads_;  // as many as a power of two
         size_t count_ = 0;
     };

@@ -1,38 +1,12 @@
 #include "tests/integration/client_and_server.h"
 
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 
 #include <filesystem>
-#include <stdexcept>
-
-#include "platform/internal/child_process.h"
 
 namespace fs = std::filesystem;
 
 namespace test {
-
-Outcome RunProgram(const std::string& root, std::vector<std::string> command,
-                   const std::string& input, const std::function<bool()>& cancelled,
-                   const std::string& path) {
-    tarq_internal::ChildSetup setup;
-    setup.program = tarq_internal::FindProgram(command[0], kSearchPath);
-    setup.arguments = std::move(command);
-    setup.environment = {"LC_ALL=C", "TARQ_ROOT=" + root, "PATH=" + path};
-    setup.input = input;
-    Outcome outcome;
-    const auto append = [&](const char* bytes, size_t size) { outcome.output.append(bytes, size); };
-    const tarq_internal::ChildResult result =
-        tarq_internal::RunChild(setup, cancelled, append, append);
-    outcome.exit_code = WIFEXITED(result.wait_status) ? WEXITSTATUS(result.wait_status) : -1;
-    return outcome;
-}
-
-void Must(const Outcome& outcome) {
-    if (outcome.exit_code != 0) {
-        throw std::runtime_error(outcome.output);
-    }
-}
 
 ClientAndServer::ClientAndServer() : port_(FreePort()) {
     for (const char* folder : {"client/usr/tarq/etc", "source"}) {

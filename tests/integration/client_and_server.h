@@ -2,6 +2,8 @@
 // real rsync daemon.
 #pragma once
 
+#include <gmock/gmock.h>
+
 #include <functional>
 #include <string>
 #include <vector>
@@ -11,20 +13,11 @@
 
 namespace test {
 
-struct Outcome {
-    int exit_code = -1;
-    std::string output;  // both streams
-};
-
-constexpr char kSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
-
-/// Runs a program to its end below a root folder; `cancelled`: ends it with SIGKILL in time.
-Outcome RunProgram(const std::string& root, std::vector<std::string> command,
-                   const std::string& input = "", const std::function<bool()>& cancelled = nullptr,
-                   const std::string& path = kSearchPath);
-
-/// Throws what the program said when it has failed.
-void Must(const Outcome& outcome);
+/// Matches an Outcome with this exit code that has said `text`, among other things.
+inline testing::Matcher<Outcome> Ended(int exit_code, const std::string& text = "") {
+    return testing::AllOf(testing::Field(&Outcome::exit_code, exit_code),
+                          testing::Field(&Outcome::output, testing::HasSubstr(text)));
+}
 
 /// A server with the account "alice" (password "secret"), and a client "CLIENT-1" that knows how to
 /// find it and has the share "docs" with three files.

@@ -1,8 +1,7 @@
 // The example programs, as a reader would run them.
-#include <gtest/gtest.h>
-#include <signal.h>
 
 #include "tests/integration/certificates.h"
+#include "tests/support/testing.h"
 
 namespace {
 

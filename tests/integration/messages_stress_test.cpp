@@ -1,14 +1,10 @@
 // Many clients against one listener, and a transfer that another thread watches.
-#include <gtest/gtest.h>
-
-#include <atomic>
-#include <thread>
 
 #include "ZEL/ipc.h"
 #include "ZEL/log.h"
 #include "ZEL/stream.h"
 #include "tests/support/sockets.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 using ZEL::IPCListener;
 using ZEL::IPCSender;

@@ -1,29 +1,15 @@
 // A whole client and a whole server: the programs as people run them, on a real rsync daemon and a
 // real sshd.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <signal.h>
 #include <sys/mount.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <atomic>
-#include <chrono>
-#include <filesystem>
-#include <fstream>
-#include <thread>
 
 #include "tests/integration/client_and_server.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
-namespace fs = std::filesystem;
+using test::Ended;
 using test::Must;
 using test::Outcome;
 using test::RunProgram;
-using testing::AllOf;
-using testing::HasSubstr;
-using testing::Not;
+using namespace testing;
 
 namespace {
 
@@ -42,8 +28,7 @@ protected:
     }
     void ExpectNextPushCompletes(const std::vector<std::string>& more = {},
                                  const std::string& user = "alice") {
-        const Outcome pushed = Push(more, "secret", user);
-        EXPECT_EQ(pushed.exit_code, 0) << pushed.output;
+        EXPECT_THAT(Push(more, "secret", user), Ended(0));
         ExpectCopyIsComplete();
     }
 };
@@ -57,8 +42,8 @@ TEST_F(PushTest, OnlyTheChangeTravelsAndADeletionIsOne) {
 
     Write("new", "n");
     fs::remove(source_ + "/a.txt");
-    const Outcome listed = Push({"--dry-run"});
-    EXPECT_THAT(listed.output, AllOf(HasSubstr("send    new (1 B)"), HasSubstr("delete  a.txt")));
+    EXPECT_THAT(Push({"--dry-run"}).output,
+                AllOf(HasSubstr("send    new (1 B)"), HasSubstr("delete  a.txt")));
     EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
     EXPECT_THAT(Push().output, HasSubstr("1 file sent, 1 deleted"));
     ExpectCopyIsComplete();
@@ -79,44 +64,16 @@ TEST_F(PushTest, ADryRunAtAServerWithoutACopyChangesNothingThere) {
 }
 
 TEST_F(PushTest, EachFailureHasItsOwnErrorAndTheNextPushCompletesTheCopy) {
-    Outcome failed = Push({}, "wrong");
-    EXPECT_EQ(failed.exit_code, 1);
-    EXPECT_THAT(failed.output, HasSubstr("password"));
-
-    failed = Client(
-        {"push", "docs", "-s", "no-such-server.invalid", "-u", "alice", "--password-file", "-"},
-        "secret\n");
-    EXPECT_EQ(failed.exit_code, 1);
-    EXPECT_THAT(failed.output, HasSubstr("cannot be looked up"));
-
     StopServer();
-    failed = Push();
-    EXPECT_EQ(failed.exit_code, 1);
-    EXPECT_THAT(failed.output, HasSubstr("refused"));
+    EXPECT_THAT(Push(), Ended(1, "refused"));
     StartServer();
 
-    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nrsync=\"/nonexistent/rsync\"\n");
-    EXPECT_THAT(Push().output, HasSubstr("/nonexistent/rsync cannot be started"));
-    const std::string old = folder_.Write(
-        "rsync",
-        "#!/bin/sh\n[ \"$1\" = --version ] && echo 'rsync  version 3.1.3  "
-        "protocol version 31' && exit\necho 'rsync: --early-input: unknown option' >&2\n"
-        "exit 1\n");
-    chmod(old.c_str(), 0755);
-    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nrsync=\"" + old + "\"\n");
-    EXPECT_THAT(Push().output, HasSubstr("rsync 3.1.3, which is too old"));
-    Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\n");
-
     Must(Server({"disable"}));
-    failed = Push();
-    EXPECT_EQ(failed.exit_code, 4);
-    EXPECT_THAT(failed.output, HasSubstr("switched off"));
+    EXPECT_THAT(Push(), Ended(4, "switched off"));
     Must(Server({"enable"}));
 
     fs::rename(storage_, storage_ + ".away");
-    failed = Push();
-    EXPECT_EQ(failed.exit_code, 4);
-    EXPECT_THAT(failed.output, HasSubstr("storage folder is not there"));
+    EXPECT_THAT(Push(), Ended(4, "storage folder is not there"));
     fs::rename(storage_ + ".away", storage_);
     ExpectNextPushCompletes();
 }
@@ -159,10 +116,8 @@ TEST_F(PushTest, AnInterruptedPushEndsInOrder) {
         RunProgram("",
                    {"pkill", "-INT", "-f", "--", std::string(ZELCTL) + " push docs -s 127.0.0.1"});
     });
-    const Outcome ended = Client(slow, "secret\n");
+    EXPECT_THAT(Client(slow, "secret\n"), Ended(5, "ended by the user"));
     interrupt.join();
-    EXPECT_EQ(ended.exit_code, 5);
-    EXPECT_THAT(ended.output, HasSubstr("ended by the user"));
     // The server knows that nobody pushes any more.
     EXPECT_THAT(Server({"shares"}).output, Not(HasSubstr("being pushed")));
     ExpectNextPushCompletes();
@@ -185,9 +140,7 @@ TEST_F(PushTest, AnUnreadableSourceOrAnotherVolumeNeverLeadsToDeletions) {
     elsewhere.insert(volume + 9, "mnt/unplugged-");
     std::ofstream(catalogue) << elsewhere;
     fs::remove(source_ + "/a.txt");
-    const Outcome refused = Push();
-    EXPECT_EQ(refused.exit_code, 3);
-    EXPECT_THAT(refused.output, HasSubstr("not mounted where it was"));
+    EXPECT_THAT(Push(), Ended(3, "not mounted where it was"));
     EXPECT_TRUE(fs::exists(storage_ + "/docs/a.txt"));
     std::ofstream(catalogue) << good;
     ExpectNextPushCompletes();
@@ -203,9 +156,7 @@ TEST_F(PushTest, AFullDiskAtTheServerIsSaidAndThenHealed) {
     EXPECT_EQ(Push().exit_code, 0);
     std::ofstream(source_ + "/large") << std::string(8 << 20, 'x');
     fs::remove(source_ + "/a.txt");
-    const Outcome full = Push();
-    EXPECT_EQ(full.exit_code, 1);
-    EXPECT_THAT(full.output, HasSubstr("full"));
+    EXPECT_THAT(Push(), Ended(1, "full"));
     EXPECT_TRUE(fs::exists(folder_.Path("small/docs/a.txt")));
     EXPECT_EQ(mount("tmpfs", folder_.Path("small").c_str(), "tmpfs", MS_REMOUNT, "size=16m"), 0);
     EXPECT_EQ(Push().exit_code, 0);
@@ -216,9 +167,7 @@ TEST_F(PushTest, AFullDiskAtTheServerIsSaidAndThenHealed) {
 TEST_F(PushTest, AnotherAccountOrClientIsKeptOut) {
     Must(Server({"account", "add", "mallory", "--password-file", "-"}, "secret\n"));
     ExpectNextPushCompletes();
-    const Outcome other = Push({}, "secret", "mallory");
-    EXPECT_EQ(other.exit_code, 4);
-    EXPECT_THAT(other.output, HasSubstr("belongs to another client or account"));
+    EXPECT_THAT(Push({}, "secret", "mallory"), Ended(4, "belongs to another client or account"));
     // Nor past the command line, straight at the module.
     const std::string password = folder_.Write("password", "secret\n");
     chmod(password.c_str(), 0600);
@@ -272,7 +221,7 @@ TEST_F(PushTest, CommandsOfMischiefChangeNothing) {
     EXPECT_TRUE(fs::is_empty(folder_.Path("server/var/run/zel_server/alice")));
 }
 
-TEST_F(PushTest, SshReachesTheSameServerAndAChangedHostKeyIsRefused) {
+TEST_F(PushTest, SshReachesTheSameServer) {
     if (!test::SshServer::Available()) {
         GTEST_SKIP() << "this machine cannot run an ssh server for the test";
     }
@@ -284,14 +233,6 @@ TEST_F(PushTest, SshReachesTheSameServerAndAChangedHostKeyIsRefused) {
     const std::vector<std::string> over_ssh = {"--ssh", "--ssh-port", std::to_string(ssh.Port())};
     ExpectNextPushCompletes(over_ssh, user);
     EXPECT_THAT(ssh.Log(), HasSubstr("Accepted publickey"));
-
-    Write("more", "m");
-    ssh.ChangeHostKey();
-    const Outcome refused = Push(over_ssh, "secret", user);
-    EXPECT_EQ(refused.exit_code, 1);
-    EXPECT_THAT(refused.output, AllOf(HasSubstr("host key"), HasSubstr("tarqrsync_known_hosts")));
-    fs::remove(folder_.Path("client/usr/tarq/etc/tarqrsync_known_hosts"));
-    ExpectNextPushCompletes(over_ssh, user);
 }
 
 }  // namespace

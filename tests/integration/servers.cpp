@@ -5,6 +5,7 @@
 #include <pwd.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -26,7 +27,6 @@ namespace {
 
 constexpr milliseconds kStartLimit(10000);
 constexpr milliseconds kStep(5);
-constexpr char kPrograms[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
 
 sockaddr_in Loopback(int port) {
     sockaddr_in address = {};
@@ -44,27 +44,39 @@ bool Answers(int port) {
 
 tarq_internal::ChildSetup SetupOf(const std::vector<std::string>& command) {
     tarq_internal::ChildSetup setup;
-    setup.program = tarq_internal::FindProgram(command[0], kPrograms);
+    setup.program = tarq_internal::FindProgram(command[0], kSearchPath);
     setup.arguments = command;
-    setup.environment = {"LC_ALL=C", std::string("PATH=") + kPrograms};
+    setup.environment = {"LC_ALL=C", std::string("PATH=") + kSearchPath};
     return setup;
-}
-
-void Run(const std::vector<std::string>& command) {
-    const tarq_internal::ChildResult result =
-        tarq_internal::RunChild(SetupOf(command), nullptr, nullptr, nullptr);
-    if (result.start_error != 0 || result.wait_status != 0) {
-        throw std::runtime_error(command[0] + " failed");
-    }
 }
 
 void MakeKey(const std::string& path, const std::string& passphrase) {
     std::error_code ignored;
     fs::remove(path, ignored);
-    Run({"ssh-keygen", "-q", "-t", "ed25519", "-N", passphrase, "-C", "test", "-f", path});
+    Must(RunProgram("", {"ssh-keygen", "-q", "-t", "ed25519", "-N", passphrase, "-f", path}));
 }
 
 }  // namespace
+
+Outcome RunProgram(const std::string& root, std::vector<std::string> command,
+                   const std::string& input, const std::function<bool()>& cancelled,
+                   const std::string& path) {
+    tarq_internal::ChildSetup setup = SetupOf(command);
+    setup.environment = {"LC_ALL=C", "TARQ_ROOT=" + root, "PATH=" + path};
+    setup.input = input;
+    Outcome outcome;
+    const auto append = [&](const char* bytes, size_t size) { outcome.output.append(bytes, size); };
+    const tarq_internal::ChildResult result =
+        tarq_internal::RunChild(setup, cancelled, append, append);
+    outcome.exit_code = WIFEXITED(result.wait_status) ? WEXITSTATUS(result.wait_status) : -1;
+    return outcome;
+}
+
+void Must(const Outcome& outcome) {
+    if (outcome.exit_code != 0) {
+        throw std::runtime_error(outcome.output);
+    }
+}
 
 void ServerProcess::Start(const std::vector<std::string>& command, const std::string& log,
                           int port) {
@@ -141,7 +153,7 @@ void RsyncDaemon::AddCommandModule(const std::string& handler) {
 }
 
 bool SshServer::Available() {
-    return access(tarq_internal::FindProgram("sshd", kPrograms).c_str(), X_OK) == 0 &&
+    return access(tarq_internal::FindProgram("sshd", kSearchPath).c_str(), X_OK) == 0 &&
            (access("/run/sshd", X_OK) == 0 || mkdir("/run/sshd", 0755) == 0);
 }
 
@@ -163,7 +175,7 @@ SshServer::SshServer() : port_(FreePort()) {
 
 void SshServer::Start() {
     // sshd starts itself anew for each connection and wants its full path for that.
-    process_.Start({tarq_internal::FindProgram("sshd", kPrograms), "-D", "-e", "-f",
+    process_.Start({tarq_internal::FindProgram("sshd", kSearchPath), "-D", "-e", "-f",
                     folder_.Path("sshd_config")},
                    folder_.Path("log"), port_);
 }

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -10,6 +11,21 @@
 #include "tests/support/temp_root.h"
 
 namespace test {
+
+struct Outcome {
+    int exit_code = -1;
+    std::string output;  // both streams
+};
+
+constexpr char kSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
+
+/// Runs a program to its end below a root folder; `cancelled`: ends it with SIGKILL in time.
+Outcome RunProgram(const std::string& root, std::vector<std::string> command,
+                   const std::string& input = "", const std::function<bool()>& cancelled = nullptr,
+                   const std::string& path = kSearchPath);
+
+/// Throws what the program said when it has failed.
+void Must(const Outcome& outcome);
 
 /// A server program in the foreground. Ended, with what it has started, when destroyed or when the
 /// test dies.

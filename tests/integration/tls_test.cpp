@@ -1,10 +1,5 @@
 // TLS channels against each other and against the openssl tool.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <openssl/bio.h>
-#include <sys/socket.h>
-
-#include <thread>
 
 #include "ZEL/channel.h"
 #include "ZEL/ipc.h"
@@ -12,9 +7,9 @@
 #include "tests/integration/certificates.h"
 #include "tests/support/log_capture.h"
 #include "tests/support/sockets.h"
+#include "tests/support/testing.h"
 
-using testing::AllOf;
-using testing::HasSubstr;
+using namespace testing;
 using ZEL::Channel;
 
 namespace {

@@ -1,14 +1,10 @@
 // The library against a decoder and encoder of the wire format in another language.
-#include <gtest/gtest.h>
-
-#include <initializer_list>
-#include <sstream>
 
 #include "ZEL/ipc.h"
 #include "ZEL/stream.h"
 #include "tests/integration/command.h"
 #include "tests/support/sockets.h"
-#include "tests/support/temp_root.h"
+#include "tests/support/testing.h"
 
 using ZEL::PObject;
 

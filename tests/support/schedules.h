@@ -33,6 +33,36 @@ inline std::string UtcText(int64_t seconds) {
     return text;
 }
 
+/// The map of a task in which no field has its default, and no two fields of a type have the same
+/// value.
+inline ZEL::PObject FullTask() {
+    ZEL::PObject task, shares;
+    shares.asArray() = {"b", "a"};
+    task = ZEL::PObject::Map{{"id", UINT64_MAX},
+                             {"name", "nightly"},
+                             {"share_list", shares},
+                             {"user", "lena"},
+                             {"pswd", "secret"},
+                             {"server_ip", "10.0.0.5"},
+                             {"server_name", "cellar"},
+                             {"compress", true},
+                             {"ssh", true},
+                             {"ssh_port", 2222},
+                             {"max_bandwidth", -1},
+                             {"rsync_timeout", 900},
+                             {"schedule_mode", 4},
+                             {"week_schd", "0100010"},
+                             {"repeat_times_in_day", 3},
+                             {"period_hour", 1},
+                             {"period_minute", 30},
+                             {"schedule_begin_year", 2016},
+                             {"schedule_begin_month", 2},
+                             {"schedule_begin_day", 29},
+                             {"schedule_begin_hour", 8},
+                             {"schedule_begin_min", 30}};
+    return task;
+}
+
 /// `days`: a week of seven characters, or a begin date.
 inline ZEL::Schedule Make(const char* mode, const char* days, int hour, long period = 0,
                           long repeat = 0) {

@@ -1,6 +1,7 @@
 #include "tests/support/temp_root.h"
 
 #include <sys/sem.h>
+#include <sys/stat.h>
 
 #include <cstdlib>
 #include <filesystem>
@@ -57,6 +58,11 @@ TempRoot::~TempRoot() {
 std::string ReadFile(const std::string& path) {
     std::ifstream file(path, std::ios::binary);
     return {std::istreambuf_iterator<char>(file), {}};
+}
+
+unsigned int ModeOf(const std::string& path) {
+    struct stat info = {};
+    return stat(path.c_str(), &info) == 0 ? info.st_mode & 07777 : 0;
 }
 
 }  // namespace test

@@ -33,4 +33,7 @@ public:
 /// The whole file; empty when it cannot be read.
 std::string ReadFile(const std::string& path);
 
+/// Who may do what with a file; 0 where there is none.
+unsigned int ModeOf(const std::string& path);
+
 }  // namespace test
