@@ -10,7 +10,7 @@
 
 #include "platform/internal/unique_fd.h"
 #include "programs/zel_daemon/store_schema.h"
-#include "programs/zel_daemon/task_row.h"
+#include "programs/zel_daemon/stored_task.h"
 
 namespace zel_daemon {
 

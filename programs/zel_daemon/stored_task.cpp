@@ -1,4 +1,4 @@
-#include "programs/zel_daemon/task_row.h"
+#include "programs/zel_daemon/stored_task.h"
 
 #include <nlohmann/json.hpp>
 #include <utility>
