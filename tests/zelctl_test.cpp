@@ -684,7 +684,8 @@ TEST(TaskDryRun, ListsWhatTheTaskWouldSend) {
     FakeDaemon daemon(whole.Path("client/var/run/zel_daemon.sock"), [](const PObject& request) {
         PObject reply = Success();
         reply["task"] = SomeTask("t", "docs");
-        reply["task"]["server_name"] = "localhost";
+        reply["task"]["server_name"] = "";
+        reply["task"]["server_ip"] = "127.0.0.1";
         reply["task"]["ssh"] = 0;
         EXPECT_EQ(request["secrets"].asInt32(), 1);
         return reply;
