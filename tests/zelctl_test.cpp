@@ -90,6 +90,7 @@ TEST(ScheduleWords, FaultsNameTheOption) {
         {Words("monthly", "0"), "--monthly"},
         {Words("monthly", "32"), "--monthly"},
         {Words("yearly", "02-30"), "--yearly"},
+        {Words("yearly", "2-3-4"), "--yearly"},
         {Words("once", "2031-02-29"), "--once"},
         {Words("once", "1969-12-31"), "--once"},
         {Words("weekly", "mon", "24:00"), "--at"},
