@@ -238,8 +238,9 @@ private:
     }
 
     bool BareCopy(const std::string& source, Words options) const {
-        options.insert(options.end(), {"-rlptgo", "-D", "-A", "-X", "--numeric-ids", "--whole-file",
-                                       "--delete-after", "--timeout=600"});
+        options.insert(options.end(),
+                       {"-rlptgo", "--modify-window=-1", "-D", "-A", "-X", "--numeric-ids",
+                        "--whole-file", "--delete-after", "--timeout=600"});
         return Bare(options, {source + "/", Server("plain/")});
     }
 

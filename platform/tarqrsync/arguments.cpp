@@ -216,7 +216,9 @@ void AddReporting(const RunOptions& options, Words* arguments) {
 
 void AddCopyOptions(const InvocationContext& context, Words* arguments) {
     const Settings& settings = context.settings;
-    Append(arguments, {"-rlptgo", "--no-h", "--8-bit-output"});
+    // Times are compared to the nanosecond. rsync looks at whole seconds otherwise: what is changed
+    // twice within one, keeping its size, would stay at the first change for ever.
+    Append(arguments, {"-rlptgo", "--modify-window=-1", "--no-h", "--8-bit-output"});
     if (settings.pseudo_root) {
         // Devices and special files can be kept by a receiver that need not be root.
         arguments->push_back("-D");

@@ -364,6 +364,7 @@ struct TaskRun::Impl {
             const ScopedRunOptions watched(Reporting());
             sent = rsyncer.FinishSync(completed ? "share" : "abort", share, status);
         }
+        heard = !cancel || (sent == 0 && status == kDone);
         if (completed && (sent != 0 || status != kDone)) {
             result = Failed("the server does not confirm " + Quoted(share), status);
         }
@@ -398,6 +399,7 @@ struct TaskRun::Impl {
     RunListener listener;
     RunReport report;         // of the last thing that was run
     uint64_t rsync_runs = 0;  // copies made
+    bool heard = true;        // the server still listens when a person has had enough
     ZEL::Rsyncer rsyncer;
 };
 
@@ -429,6 +431,7 @@ Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
         names.push_back(share.share);
     }
     impl_->rsync_runs = 0;
+    impl_->heard = true;
     int ignored = 0;
     bool announced = order.announce;
     Verdict result;
@@ -446,7 +449,7 @@ Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
         announced = beacon.Stop() || announced;
     }
     totals.rsync_runs += impl_->rsync_runs;
-    if (announced) {
+    if (announced && impl_->heard) {
         const LastWord last_word;
         impl_->rsyncer.FinishSync("task", order.task, ignored);
     }

@@ -199,6 +199,14 @@ TEST_F(DaemonTest, WhatChangesOnDiskIsSoonAtTheServer) {
     EXPECT_EQ(Runs().front()["error"].asString(), "");
 }
 
+TEST_F(DaemonTest, ChangesWithinASecondThatKeepTheSizeAreAllSent) {
+    StartRealtime();
+    for (int i = 0; i < 12; ++i) {
+        Write("counter", std::to_string(i % 10));
+        AwaitEqual(std::to_string(i), 20);
+    }
+}
+
 TEST_F(DaemonTest, AFolderThatTurnsIntoALinkAgainAndAgainIsCopiedAsItIsInTheEnd) {
     StartRealtime();
     folder_.Write("outside/deep/passwd", "top secret of another size");
