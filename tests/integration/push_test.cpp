@@ -64,6 +64,23 @@ TEST_F(PushTest, ADryRunAtAServerWithoutACopyChangesNothingThere) {
 }
 
 TEST_F(PushTest, EachFailureHasItsOwnErrorAndTheNextPushCompletesTheCopy) {
+    EXPECT_THAT(Push({}, "wrong"), Ended(1, "password"));
+    EXPECT_THAT(Client({"push", "docs", "-s", "no-such-server.invalid", "-u", "alice",
+                        "--password-file", "-"},
+                       "secret\n"),
+                Ended(1, "cannot be looked up"));
+    const std::string port = "[rsync]\nport=\"" + std::to_string(port_) + "\"\n";
+    Configure(port + "rsync=\"/nonexistent/rsync\"\n");
+    EXPECT_THAT(Push().output, HasSubstr("/nonexistent/rsync cannot be started"));
+    const std::string old = folder_.Write(
+        "rsync",
+        "#!/bin/sh\n[ \"$1\" = --version ] && echo 'rsync  version 3.1.3  protocol version 31' && "
+        "exit\necho 'rsync: --early-input: unknown option' >&2\nexit 1\n");
+    chmod(old.c_str(), 0755);
+    Configure(port + "rsync=\"" + old + "\"\n");
+    EXPECT_THAT(Push().output, HasSubstr("rsync 3.1.3, which is too old"));
+    Configure(port);
+
     StopServer();
     EXPECT_THAT(Push(), Ended(1, "refused"));
     StartServer();
