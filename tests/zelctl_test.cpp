@@ -90,6 +90,7 @@ TEST(ScheduleWords, FaultsNameTheOption) {
         {Words("monthly", "0"), "--monthly"},
         {Words("monthly", "32"), "--monthly"},
         {Words("yearly", "02-30"), "--yearly"},
+        {Words("yearly", "2-3-4"), "--yearly"},
         {Words("once", "2031-02-29"), "--once"},
         {Words("once", "1969-12-31"), "--once"},
         {Words("weekly", "mon", "24:00"), "--at"},
@@ -684,7 +685,8 @@ TEST(TaskDryRun, ListsWhatTheTaskWouldSend) {
     FakeDaemon daemon(whole.Path("client/var/run/zel_daemon.sock"), [](const PObject& request) {
         PObject reply = Success();
         reply["task"] = SomeTask("t", "docs");
-        reply["task"]["server_name"] = "localhost";
+        reply["task"]["server_name"] = "";
+        reply["task"]["server_ip"] = "127.0.0.1";
         reply["task"]["ssh"] = 0;
         EXPECT_EQ(request["secrets"].asInt32(), 1);
         return reply;

@@ -263,17 +263,19 @@ std::optional<int64_t> Service::UntilNextStep(const Task& task) const {
     }
     if (task.store_retry_at > now) {
         at(task.store_retry_at);
+        return wait;  // nothing is due before
     }
     if (task.record.paused) {
         return wait;
     }
-    if (const auto retry = task.plan->UntilRetry()) {
+    const std::optional<int64_t> retry = task.plan->UntilRetry();
+    if (retry) {
         at(now + *retry);
     }
     if (const auto next = task.plan->NextRun()) {
         at(now + std::min((*next - clock_.Now()) * 1000, kLongestWaitMs));
     }
-    if (task.poll_at && !task.held) {
+    if (task.poll_at && !task.held && !retry) {
         at(*task.poll_at);
     }
     return wait;

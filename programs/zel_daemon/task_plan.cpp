@@ -3,6 +3,7 @@
 #include <time.h>
 
 #include <algorithm>
+#include <cmath>
 #include <limits>
 #include <random>
 
@@ -89,7 +90,7 @@ void TaskPlan::Failed(const RetryDelays& delays) {
     delay = std::min(delay, delays.longest);
     ++failures_;
     const double factor = 1 + kJitter * (2 * random_() - 1);
-    retry_at_ = clock_.Elapsed() + static_cast<int64_t>(static_cast<double>(delay) * factor);
+    retry_at_ = clock_.Elapsed() + std::llround(static_cast<double>(delay) * factor);
 }
 
 void TaskPlan::Settled() {
