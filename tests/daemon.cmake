@@ -9,7 +9,7 @@ if(ZEL_BUILD_PROGRAMS)
     target_compile_definitions(test_daemon PUBLIC ZEL_DAEMON="$<TARGET_FILE:zel_daemon>")
     add_dependencies(test_daemon zel_daemon)
     # The service puts its own rsync runs in front of the real ones.
-    zel_test(service_test service_test.cpp LIBRARIES test_whole daemon_parts)
+    zel_test(service_test service_test.cpp LIBRARIES test_whole daemon_parts LABELS threads)
     # ZEL_STRESS_SECONDS says how large the bursts of changes are.
     zel_test(daemon_test integration/daemon_test.cpp
         LIBRARIES test_daemon test_whole daemon_parts TIMEOUT 600 LABELS integration)
