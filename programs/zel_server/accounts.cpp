@@ -5,8 +5,8 @@
 #include <sstream>
 
 #include "ZEL/zel.h"
-#include "programs/common/text.h"
 #include "programs/common/atomic_file.h"
+#include "programs/common/text.h"
 #include "programs/zel_server/server_config.h"
 
 namespace zel_server {

@@ -8,8 +8,8 @@
 #include <cerrno>
 #include <sstream>
 
-#include "programs/common/text.h"
 #include "programs/common/atomic_file.h"
+#include "programs/common/text.h"
 #include "tarq/root_path.h"
 #include "tarq/rsync_wrapper.h"
 
