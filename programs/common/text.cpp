@@ -1,5 +1,6 @@
 #include "programs/common/text.h"
 
+#include <algorithm>
 #include <charconv>
 #include <cstdio>
 #include <ctime>
@@ -121,6 +122,15 @@ std::optional<std::string> ReadWholeFile(const std::string& path, size_t max) {
         return std::nullopt;
     }
     return content;
+}
+
+bool IsTaskName(const std::string& name) {
+    constexpr size_t kMaxBytes = 128;
+    return !name.empty() && name.size() <= kMaxBytes &&
+           std::none_of(name.begin(), name.end(), [](char c) {
+               const auto byte = static_cast<unsigned char>(c);
+               return byte < 0x20 || byte == 0x7f || c == '"' || c == '[' || c == ']';
+           });
 }
 
 }  // namespace programs

@@ -30,6 +30,10 @@ std::string Printable(const std::string& text);
 /// Whether Printable() would give the text as it is.
 bool IsPrintable(const std::string& text);
 
+/// Whether a task may be called so: 1 to 128 bytes without control characters, quotes and brackets,
+/// which the server's registry has no place for.
+bool IsTaskName(const std::string& name);
+
 /// The whole file; nothing when it cannot be read or is larger than `max` bytes.
 std::optional<std::string> ReadWholeFile(const std::string& path, size_t max);
 

@@ -16,7 +16,6 @@ using ZEL::PObject;
 
 constexpr char kExclude[] = "exclude";
 constexpr char kShares[] = "share_list";
-constexpr size_t kMaxNameBytes = 80;
 
 [[noreturn]] void Refuse(const std::string& text) {
     throw RequestError(ZEL::RESULT_INVALID_ARGUMENT, text);
@@ -60,9 +59,10 @@ void CheckKind(const std::string& key, const PObject& value) {
 }
 
 void CheckName(const std::string& name) {
-    if (name.empty() || name.size() > kMaxNameBytes || programs::Printable(name) != name) {
-        Refuse("a task's name has 1 to " + std::to_string(kMaxNameBytes) +
-               " bytes, none of them a control character: " + Shown(name));
+    if (!programs::IsTaskName(name)) {
+        Refuse(
+            "a task's name has 1 to 128 bytes, without control characters, quotes and brackets: " +
+            Shown(name));
     }
 }
 

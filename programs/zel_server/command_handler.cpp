@@ -264,7 +264,7 @@ Answer StartSync(const Request& request) {
 
 Answer UpdateTaskStatus(const Request& request) {
     const std::string* const task = request.command.Find("taskName");
-    if (task == nullptr || !IsTaskName(*task)) {
+    if (task == nullptr || !programs::IsTaskName(*task)) {
         return {kBadArgument, ""};
     }
     const int paired = RequirePaired(request.Client());
@@ -309,7 +309,7 @@ Answer FinishSync(const Request& request) {
     if (*type == "share" || *type == "abort") {
         return FinishShare(request, *name, *type == "share");
     }
-    if (*type == "task" && IsTaskName(*name)) {
+    if (*type == "task" && programs::IsTaskName(*name)) {
         return {WriteTaskStatus(*name, "idle") ? kDone : kRegistryWrite, ""};
     }
     return {kBadArgument, ""};

@@ -9,7 +9,6 @@ namespace {
 constexpr size_t kMaxShareName = 80;
 constexpr size_t kMaxAccountName = 64;
 constexpr size_t kMaxClientId = 35;
-constexpr size_t kMaxTaskName = 128;
 constexpr size_t kMaxServerName = 64;
 constexpr size_t kMaxVolumeName = 128;
 
@@ -69,10 +68,6 @@ bool IsClientId(const std::string& id) {
         }
     }
     return true;
-}
-
-bool IsTaskName(const std::string& name) {
-    return IsPlain(name, kMaxTaskName, "\"[]");
 }
 
 bool IsServerName(const std::string& name) {

@@ -17,9 +17,6 @@ bool IsAccountName(const std::string& name);
 /// and slashes.
 bool IsClientId(const std::string& id);
 
-/// A task's name: 1 to 128 bytes without control characters, quotes and brackets.
-bool IsTaskName(const std::string& name);
-
 /// 1 to 64 bytes without control characters or quotes: the name under which a client knows this
 /// server.
 bool IsServerName(const std::string& name);

@@ -5,6 +5,7 @@
 #include "ZEL/log.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/cli.h"
+#include "programs/zelctl/server.h"
 
 namespace {
 
@@ -27,6 +28,7 @@ constexpr Command kCommands[] = {
     {"pair", "Pairing with a server", DeclarePair},
     {"push", "Push shares to a server now, without the daemon", DeclarePush},
     {"next", "Show the next runs of a schedule", DeclareNext},
+    {"server", "The server on this machine: all that zel_server does", nullptr},
 };
 
 // The first word from `argv[index]` on that is no option, and the place after it; empty when there
@@ -59,6 +61,9 @@ int RunCommandLine(int argc, char** argv) {
     ExitCode result = kOk;
     int index = 1;
     const std::string wanted = NextWord(argc, argv, index);
+    if (wanted == "server") {
+        return BecomeServer(argv + index);
+    }
     bool known = wanted.empty();
     for (const Command& command : kCommands) {
         CLI::App* const declared = app.add_subcommand(command.name, command.about);

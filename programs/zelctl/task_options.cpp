@@ -11,8 +11,6 @@ namespace zelctl {
 
 namespace {
 
-constexpr size_t kMaxTaskName = 128;  // bytes; what the server keeps of one
-
 ExitCode SetShares(const std::vector<std::string>& shares, ZEL::TaskInfo& info) {
     std::set<std::string> seen;
     for (const std::string& share : shares) {
@@ -73,11 +71,7 @@ ExitCode TaskOptions::ApplyTo(ZEL::TaskInfo& info) const {
 }
 
 ExitCode CheckTaskName(const std::string& name) {
-    const bool plain = std::none_of(name.begin(), name.end(), [](char c) {
-        const unsigned char byte = static_cast<unsigned char>(c);
-        return byte < 0x20 || byte == 0x7f || c == '"' || c == '[' || c == ']';
-    });
-    if (name.empty() || name.size() > kMaxTaskName || !plain) {
+    if (!programs::IsTaskName(name)) {
         return Fail(kUsage,
                     "'%s' cannot be a task's name: it has 1 to 128 bytes, without control "
                     "characters, quotes and brackets",

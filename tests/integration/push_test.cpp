@@ -48,6 +48,9 @@ TEST_F(PushTest, OnlyTheChangeTravelsAndADeletionIsOne) {
     EXPECT_THAT(Push().output, HasSubstr("1 file sent, 1 deleted"));
     ExpectCopyIsComplete();
     EXPECT_THAT(Server({"shares", "--json"}).output, HasSubstr("\"state\": \"complete"));
+    // The one command line for both sides.
+    EXPECT_THAT(RunProgram(folder_.Path("server"), {ZELCTL, "server", "shares"}),
+                Ended(0, "CLIENT-1"));
 
     // A part of the share takes nothing else with it.
     Write("sub/c.txt", "c");

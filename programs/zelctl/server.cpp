@@ -1,0 +1,29 @@
+#include "programs/zelctl/server.h"
+
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
+#include <string>
+#include <vector>
+
+namespace zelctl {
+
+ExitCode BecomeServer(char** arguments) {
+    std::string program = "zel_server";
+    std::vector<char*> words = {program.data()};
+    for (; *arguments != nullptr; ++arguments) {
+        words.push_back(*arguments);
+    }
+    words.push_back(nullptr);
+    // The one that was installed with this program, or else any.
+    std::error_code error;
+    const std::filesystem::path own = std::filesystem::read_symlink("/proc/self/exe", error);
+    execv((own.parent_path() / program).c_str(), words.data());
+    execvp(program.c_str(), words.data());
+    return Fail(kLocal, "zel_server cannot be started: %s; is the package zel-server installed?",
+                strerror(errno));
+}
+
+}  // namespace zelctl
