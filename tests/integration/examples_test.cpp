@@ -8,7 +8,7 @@ namespace {
 // A running listener, and the address that it says it listens on.
 struct Listener {
     explicit Listener(const std::string& arguments)
-        : command(EXAMPLE_LISTENER " " + arguments + " & echo $!; wait"),
+        : command("echo $$; exec " EXAMPLE_LISTENER " " + arguments),
           pid(stoi(command.ReadLine())) {
         const std::string line = command.ReadLine();
         EXPECT_EQ(line.find("listening on "), 0U) << line;
