@@ -135,6 +135,7 @@ void ChangeSet::FoldFullest() {
         ++counts[std::string(ParentOf(key))];
     }
     std::vector<std::pair<size_t, std::string>> fullest;
+    fullest.reserve(counts.size());
     for (const auto& [folder, count] : counts) {
         fullest.emplace_back(count, folder);
     }

@@ -25,7 +25,7 @@ namespace {
 using tarq_internal::UniqueFd;
 
 // How late a timer may be, so that the machine need not wake for each alone.
-constexpr uint64_t kTimerSlackUs = 10 * 1000;
+constexpr uint64_t kTimerSlackUs = 10000;
 
 // The event library's results are negated error numbers.
 int Require(int result, const char* what) {

@@ -12,7 +12,7 @@ namespace zel_daemon {
 namespace {
 
 /// Some 2,000 events with names of usual length.
-constexpr size_t kBufferSize = 64 * 1024;
+constexpr size_t kBufferSize = size_t{64} * 1024;
 
 /// Files that were unlinked while open are told too (no IN_EXCL_UNLINK): what is written to them
 /// may show under another name in the same folder.

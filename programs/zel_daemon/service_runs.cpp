@@ -14,7 +14,7 @@ using programs::Verdict;
 using ZEL::Logger;
 
 // A store that could not be written is tried again after so long.
-constexpr int64_t kStoreRetryMs = 10 * 1000;
+constexpr int64_t kStoreRetryMs = 10000;
 // A timer for something that is far off is set again now and then.
 constexpr int64_t kLongestWaitMs = int64_t{24} * 3600 * 1000;
 

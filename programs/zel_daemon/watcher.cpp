@@ -48,7 +48,7 @@ constexpr int kStepsPerIdleTurn = 256;
 /// The second event of a move follows the first at once unless another process came in between.
 constexpr size_t kMovesInMind = 16;
 
-constexpr size_t kListBufferSize = 32 * 1024;
+constexpr size_t kListBufferSize = size_t{32} * 1024;
 
 // What is known of a folder beside its place.
 constexpr uint8_t kQueued = 1;    // waits in jobs_

@@ -77,7 +77,8 @@ int RunCommandLine(int argc, char** argv) {
                     ->get_subcommands(
                         [&](const CLI::App* lower) { return lower->check_name(below); })
                     .empty()) {
-                return NoSuchCommand(wanted + " " + below, "zelctl " + wanted);
+                const std::string words = wanted + " " + below;
+                return NoSuchCommand(words, "zelctl " + wanted);
             }
         }
     }

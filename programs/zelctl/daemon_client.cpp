@@ -29,13 +29,13 @@ std::string TooLong(const ZEL::PObject& value, const std::string& key) {
         return key;
     }
     for (const ZEL::PObject& element : value.asArray()) {
-        const std::string found = TooLong(element, key);
+        std::string found = TooLong(element, key);
         if (!found.empty()) {
             return found;
         }
     }
     for (const auto& [name, element] : value.asMap()) {
-        const std::string found = TooLong(element, name);
+        std::string found = TooLong(element, name);
         if (!found.empty()) {
             return found;
         }

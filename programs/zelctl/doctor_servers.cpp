@@ -147,6 +147,7 @@ std::vector<Endpoint> Gather(const Patient& patient) {
         endpoint.tasks.insert(task.GetInfo().GetName());
     }
     std::vector<Endpoint> list;
+    list.reserve(endpoints.size());
     for (auto& [key, endpoint] : endpoints) {
         list.push_back(std::move(endpoint));
     }

@@ -21,7 +21,7 @@ namespace {
 
 constexpr char kSocket[] = "/var/run/zel_daemon.sock";
 constexpr timeval kPatience = {10, 0};
-constexpr size_t kReadAtOnce = 256 * 1024;
+constexpr size_t kReadAtOnce = size_t{256} * 1024;
 constexpr size_t kMaxReply = size_t{256} << 20;
 
 // docs/wire-format.md

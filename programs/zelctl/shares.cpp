@@ -74,7 +74,9 @@ std::optional<std::vector<std::string>> ShareNames() {
         return std::nullopt;
     }
     std::vector<std::string> names;
-    for (int i = 0; i < KAPICSzListCount(list.get()); ++i) {
+    const int count = KAPICSzListCount(list.get());
+    names.reserve(static_cast<size_t>(count));
+    for (int i = 0; i < count; ++i) {
         names.emplace_back(KAPICSzListGet(list.get(), i));
     }
     return names;
