@@ -43,9 +43,11 @@ std::string NextWord(int argc, char** argv, int& index) {
     return "";
 }
 
-ExitCode NoSuchCommand(const std::string& words, const std::string& group) {
-    return Fail(kUsage, "there is no command '%s': '%s -h' lists them",
-                programs::Printable(words).c_str(), group.c_str());
+// `below`: the word after a command that others are below; empty: `word` itself is none.
+ExitCode NoSuchCommand(const std::string& word, const std::string& below) {
+    const std::string group = below.empty() ? "" : word + " ";
+    return Fail(kUsage, "there is no command '%s': 'zelctl %s-h' lists them",
+                programs::Printable(below.empty() ? word : group + below).c_str(), group.c_str());
 }
 
 }  // namespace
@@ -77,13 +79,12 @@ int RunCommandLine(int argc, char** argv) {
                     ->get_subcommands(
                         [&](const CLI::App* lower) { return lower->check_name(below); })
                     .empty()) {
-                const std::string words = wanted + " " + below;
-                return NoSuchCommand(words, "zelctl " + wanted);
+                return NoSuchCommand(wanted, below);
             }
         }
     }
     if (!known) {
-        return NoSuchCommand(wanted, "zelctl");
+        return NoSuchCommand(wanted, "");
     }
     app.footer(
         "'zelctl COMMAND -h' tells more.\n"
