@@ -24,6 +24,7 @@ namespace tarq_internal {
 namespace {
 
 using Clock = std::chrono::steady_clock;
+using std::chrono::microseconds;
 using std::chrono::milliseconds;
 
 // How often the caller is asked whether to go on.
@@ -35,7 +36,7 @@ constexpr milliseconds kBurialGrace(200);
 
 // How long and how often a program is watched that has done its work.
 constexpr milliseconds kEarlyEndWatch(100);
-constexpr milliseconds kEarlyEndStep(1);
+constexpr microseconds kEarlyEndStep(200);
 
 constexpr int kFirstFreeFd = 3;
 
@@ -165,7 +166,12 @@ int OpenPidFd(pid_t pid) {
 class ProcessGroup {
 public:
     explicit ProcessGroup(pid_t leader) : leader_(leader), exit_fd_(OpenPidFd(leader)) {}
-    ~ProcessGroup() { End(); }
+    ~ProcessGroup() {
+        if (!killed_) {
+            Kill();
+            AwaitBurial();
+        }
+    }
     ProcessGroup(const ProcessGroup&) = delete;
     ProcessGroup& operator=(const ProcessGroup&) = delete;
 
@@ -184,29 +190,33 @@ public:
         return result != 0 || info.si_pid == leader_;
     }
 
-    int End() {
-        if (ended_) {
-            return wait_status_;
+    // Kills what is left and reaps the leader.
+    int Kill() {
+        if (!killed_) {
+            killed_ = true;
+            Signal(SIGKILL);
+            int status = 0;
+            pid_t reaped;
+            do {
+                reaped = waitpid(leader_, &status, 0);
+            } while (reaped < 0 && errno == EINTR);
+            wait_status_ = reaped == leader_ ? status : -1;
         }
-        ended_ = true;
-        Signal(SIGKILL);
-        int status = 0;
-        pid_t reaped;
-        do {
-            reaped = waitpid(leader_, &status, 0);
-        } while (reaped < 0 && errno == EINTR);
-        wait_status_ = reaped == leader_ ? status : -1;
+        return wait_status_;
+    }
+
+    // The leader's children are buried by the system's first process, in its own time.
+    void AwaitBurial() const {
         const Clock::time_point give_up = Clock::now() + kBurialGrace;
         while (kill(-leader_, 0) == 0 && Clock::now() < give_up) {
             usleep(1000);
         }
-        return wait_status_;
     }
 
 private:
     pid_t leader_;
     UniqueFd exit_fd_;
-    bool ended_ = false;
+    bool killed_ = false;
     int wait_status_ = -1;
 };
 
@@ -321,15 +331,21 @@ void Wait(const ProcessGroup& group, const Stream& output, const Stream& error,
                                   {output.fd.Get(), POLLIN, 0},
                                   {error.fd.Get(), POLLIN, 0},
                                   {watch->Fd(), POLLIN, 0}}};
-    int timeout = group.ExitFd() >= 0 ? -1 : static_cast<int>(kAskInterval.count());
-    if (until) {
-        const auto left = std::chrono::ceil<milliseconds>(*until - Clock::now()).count();
-        timeout = static_cast<int>(std::clamp<long long>(left, 0, kAskInterval.count()));
-    }
+    std::optional<microseconds> longest;
     if (watch->IsAsking()) {
-        timeout = static_cast<int>(kEarlyEndStep.count());
+        longest = kEarlyEndStep;
+    } else if (until) {
+        const auto left = std::chrono::ceil<microseconds>(*until - Clock::now());
+        longest = std::clamp<microseconds>(left, microseconds(0), kAskInterval);
+    } else if (group.ExitFd() < 0) {
+        longest = kAskInterval;
     }
-    if (poll(fds.data(), fds.size(), timeout) > 0 && fds[3].revents != 0) {
+    timespec timeout = {};
+    if (longest) {
+        timeout.tv_nsec = static_cast<long>(longest->count() * 1000);  // less than a second
+    }
+    if (ppoll(fds.data(), fds.size(), longest ? &timeout : nullptr, nullptr) > 0 &&
+        fds[3].revents != 0) {
         watch->FdIsReadable();
     }
 }
@@ -383,7 +399,10 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
             next_step = Clock::now() + kAskInterval;
         }
     }
-    result.wait_status = group->End();
+    result.wait_status = group->Kill();
+    if (!result.ended_early) {
+        group->AwaitBurial();
+    }
     // With the whole group gone the rest is what lies in the pipes.
     for (Stream* stream : {&output, &error}) {
         while (stream->fd && stream->ReadOnce()) {

@@ -33,8 +33,7 @@ struct ChildResult {
 
 /// For a program whose work is done some time before it ends by itself.
 struct EarlyEnd {
-    int ready_fd =
-        -1;  ///< from when it is readable, `reached` is asked each millisecond for a while
+    int ready_fd = -1;  ///< from when it is readable, `reached` is asked often for a while
     std::function<bool(pid_t leader)> reached;  ///< true: the rest of the program is not needed
 };
 
@@ -46,7 +45,8 @@ using OutputHandler = std::function<void(const char* bytes, size_t size)>;
 /// `cancelled` (may be empty) is asked once before the start, where true means that nothing is
 /// started, and then several times a second. Once it says true the child's process group gets
 /// SIGTERM, and SIGKILL soon after. However the run ends, an exception from a handler included,
-/// nothing of the group is left. The child also ends when this process dies.
+/// nothing of the group is left; after an early end what is left has been killed, and is not waited
+/// for. The child also ends when this process dies.
 ///
 /// May be called from any thread. The process's signal dispositions are neither used nor changed; a
 /// process that ignores SIGCHLD, or reaps every child it finds, gets wait_status -1.

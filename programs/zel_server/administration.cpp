@@ -1,5 +1,4 @@
-#include "programs/zel_server/administration.h"
-
+// What the admin types: set-up, switch, accounts, and what there is to see.
 #include <pwd.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -13,6 +12,7 @@
 #include <nlohmann/json.hpp>
 
 #include "ZEL/is_syncedshare.h"
+#include "programs/common/command_line.h"
 #include "programs/common/table.h"
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
@@ -24,12 +24,11 @@
 #include "tarq/core.h"
 #include "tarq/root_path.h"
 
-namespace zel_server {
-
 namespace {
 
 namespace fs = std::filesystem;
 using programs::Table;
+using namespace zel_server;
 
 constexpr int kOk = 0;
 constexpr int kFailed = 1;
@@ -409,7 +408,7 @@ int ListAccounts(bool as_json) {
 
 }  // namespace
 
-int Administer(int argc, char** argv) {
+int RunCommandLine(int argc, char** argv) {
     CLI::App app{"The server of the shared-folder synchronisation: receives what clients push"};
     app.name("zel_server");
     app.require_subcommand(1);
@@ -483,5 +482,3 @@ int Administer(int argc, char** argv) {
     }
     return result;
 }
-
-}  // namespace zel_server

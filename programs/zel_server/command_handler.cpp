@@ -56,7 +56,7 @@ int RefusalOf(const std::string& share, const std::string& client, const std::st
 }
 
 // Asks the registry which of `shares` other clients push into now, under names of any letter case.
-int AskRegistry(const std::list<std::string>& shares, const std::string& client,
+int AskRegistry(const std::vector<std::string>& shares, const std::string& client,
                 std::list<std::string>& refused) {
     const TARQ::ListOwner asked(KAPICSzListAlloc(static_cast<int>(shares.size())));
     TARQ::ListOwner answer(KAPICSzListAlloc(static_cast<int>(shares.size())));
@@ -125,7 +125,7 @@ Answer PairMultiSource(const Request& request) {
         !IsServerName(*server_name)) {
         return {kBadArgument, ""};
     }
-    std::list<std::string> shares;
+    std::vector<std::string> shares;
     ZEL::SplitStringByChars(*joined, ":", shares);
     if (shares.size() > kMaxShares) {
         return {kBadArgument, ""};

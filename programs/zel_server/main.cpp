@@ -1,12 +1,11 @@
 #include <string>
 
-#include "programs/zel_server/administration.h"
+#include "programs/common/command_line.h"
 #include "programs/zel_server/command_handler.h"
 #include "programs/zel_server/transfer.h"
 
 int main(int argc, char** argv) {
-    // The rsync daemon waits for these while a client waits for it: they come before anything else
-    // is set up.
+    // The rsync daemon waits for these while a client waits for it.
     const std::string operation = argc == 2 ? argv[1] : "";
     if (operation == "handle-command") {
         return zel_server::HandleCommand();
@@ -17,5 +16,5 @@ int main(int argc, char** argv) {
     if (operation == "end-transfer") {
         return zel_server::EndTransfer();
     }
-    return zel_server::Administer(argc, argv);
+    return programs::RunFromLibrary("zel_server", "libzel_server_commands.so", 1, argc, argv);
 }

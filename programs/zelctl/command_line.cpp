@@ -1,4 +1,4 @@
-#include "programs/zelctl/command_line.h"
+#include "programs/common/command_line.h"
 
 #include <CLI/CLI.hpp>
 
