@@ -3,7 +3,11 @@
 #include <string.h>
 
 #include <algorithm>
+#include <array>
+#include <list>
 #include <new>
+#include <optional>
+#include <string_view>
 #include <utility>
 
 #include "ZEL/internal/pobject_cursor.h"
@@ -21,8 +25,50 @@ static_assert(sizeof kIndent - 1 == 2 * kIndentLevels);
 // bytes arrive.
 constexpr size_t kStringStep = 4096;
 
-// Most messages are no deeper: one allocation holds the places of all their containers.
+// Many arrays are no longer.
+constexpr size_t kUsualLength = 4;
+
+// Most messages are no deeper.
 constexpr size_t kUsualDepth = 8;
+
+// A stack whose first elements need no memory of their own, and none of which ever moves.
+template <typename T, size_t kFirst>
+class SteadyStack {
+public:
+    SteadyStack() = default;
+    ~SteadyStack() {
+        while (!IsEmpty()) {
+            Pop();
+        }
+    }
+    SteadyStack(const SteadyStack&) = delete;
+    SteadyStack& operator=(const SteadyStack&) = delete;
+
+    bool IsEmpty() const { return size_ == 0; }
+    T& Top() { return size_ <= kFirst ? *first_[size_ - 1] : rest_.back(); }
+    template <typename Argument>
+    void Push(const Argument& argument) {
+        if (size_ < kFirst) {
+            first_[size_].emplace(argument);
+        } else {
+            rest_.emplace_back(argument);
+        }
+        ++size_;
+    }
+    void Pop() {
+        --size_;
+        if (size_ < kFirst) {
+            first_[size_].reset();
+        } else {
+            rest_.pop_back();
+        }
+    }
+
+private:
+    std::array<std::optional<T>, kFirst> first_;
+    std::list<T> rest_;
+    size_t size_ = 0;
+};
 
 // Whether a step of the channel went well; a failure is told here.
 bool Passed(int code) {
@@ -54,14 +100,26 @@ unsigned long long Fold(const char* bytes, unsigned int length) {
 
 }  // namespace
 
-// The steps of one byte: by the channel's shortcut where that will do.
+// A map's entry in transfer, in the frame of the call that transfers it.
+struct PStream::Entry {
+    std::string_view key;
+    Entry* outer = nullptr;
+};
+
+// Steps that may wait, or fail, are the channel's own operations; all others are its shortcuts.
+inline Channel& PStream::Slowly(Channel& channel) {
+    ShowPath();
+    return channel;
+}
+
+// The steps of one byte.
 
 inline bool PStream::WriteByte(Channel& channel, unsigned char value) {
-    return channel.Store(&value, sizeof value) || Passed(channel.WriteByte(value));
+    return channel.Store(&value, sizeof value) || Passed(Slowly(channel).WriteByte(value));
 }
 
 inline bool PStream::ReadByte(Channel& channel, unsigned char& value) {
-    return channel.Fetch(&value, sizeof value) || Passed(channel.ReadByte(&value));
+    return channel.Fetch(&value, sizeof value) || Passed(Slowly(channel).ReadByte(&value));
 }
 
 // The body of an integer or of a string, when all of it lies in the read ring.
@@ -90,30 +148,60 @@ inline bool PStream::Take(Channel& channel, std::string& value) {
     return true;
 }
 
-// Whether an entry's value moves between ring and object without a wait and without a failure. No
-// one can tell then that its key was not in the history: that takes a look at the transfer while
-// it waits, or a failure to report. Most entries are such, and need not take the lock.
-
-inline bool PStream::GoesAtOnce(const Channel& channel, const PObject& value) {
-    constexpr size_t kLongestHead = 10;  // of a string the tag and the length, of an integer all
-    return value.isString() ? channel.CanStore(kLongestHead + value.get<std::string>().size())
-                            : !value.isContainer() && channel.CanStore(kLongestHead);
+inline void PStream::Enter(Entry& entry) {
+    entry.outer = innermost_;
+    innermost_ = &entry;
+    ++entries_;
 }
 
-inline bool PStream::ComesAtOnce(const Channel& channel) {
-    const char* bytes = channel.Ahead(3);
-    if (bytes == nullptr) {
-        return false;
+// Does nothing after KeepPath().
+inline void PStream::Leave(const Entry& entry) {
+    if (innermost_ != &entry) {
+        return;
     }
-    switch (bytes[0]) {
-        case TAG_INTEGER:
-            return channel.Ahead(2 + static_cast<size_t>(Fold(bytes + 1, 1))) != nullptr;
-        case TAG_STRING:
-            return channel.Ahead(3 + static_cast<size_t>(Fold(bytes + 1, 2))) != nullptr;
-        default:
-            return false;
+    innermost_ = entry.outer;
+    shown_ = std::min(shown_, --entries_);
+    if (entries_ == 0 && history_.size() != kept_) {
+        ShowPath();
     }
 }
+
+// Makes the history what it should be.
+void PStream::ShowPath() {
+    if (shown_ == entries_ && history_.size() == kept_ + shown_) {
+        return;
+    }
+    const std::lock_guard<std::mutex> lock(mutex_);
+    history_.resize(kept_ + entries_);
+    const Entry* entry = innermost_;
+    for (size_t i = entries_; i > shown_; --i, entry = entry->outer) {
+        history_[kept_ + i - 1] = entry->key;
+    }
+    shown_ = entries_;
+}
+
+// After a failure: the history stays as it is, and the entries, whose keys may go, are forgotten.
+void PStream::KeepPath() {
+    ShowPath();
+    kept_ = history_.size();
+    innermost_ = nullptr;
+    entries_ = shown_ = 0;
+}
+
+// An entry for as long as it is in transfer.
+class PStream::EntryInTransfer {
+public:
+    EntryInTransfer(PStream& stream, std::string_view key) : stream_(stream), entry_{key} {
+        stream.Enter(entry_);
+    }
+    ~EntryInTransfer() { stream_.Leave(entry_); }
+    EntryInTransfer(const EntryInTransfer&) = delete;
+    EntryInTransfer& operator=(const EntryInTransfer&) = delete;
+
+private:
+    PStream& stream_;
+    Entry entry_;
+};
 
 // A whole value in one direction. A value may be larger than memory: that is a failure like any
 // other.
@@ -138,7 +226,7 @@ int PStream::Send(Channel& channel, const PObject& value) {
         if (result < 0) {
             return result;
         }
-        return Passed(channel.FlushWrite(0)) ? int{RESULT_SUCCESS} : int{RESULT_IO};
+        return Passed(Slowly(channel).FlushWrite(0)) ? int{RESULT_SUCCESS} : int{RESULT_IO};
     });
 }
 
@@ -180,7 +268,7 @@ int PStream::Send(Channel& channel, unsigned long long value) {
     const unsigned long long wire = __builtin_bswap64(value << (64 - 8 * length));
     memcpy(element + 2, &wire, sizeof wire);
     if (!channel.Store(element, size_t{2} + length) &&
-        (!Passed(channel.WriteByte(TAG_INTEGER)) || !Passed(channel.WriteByte(length)) ||
+        (!Passed(Slowly(channel).WriteByte(TAG_INTEGER)) || !Passed(channel.WriteByte(length)) ||
          !Passed(channel.Write(element + 2, length)))) {
         return RESULT_IO;
     }
@@ -201,14 +289,14 @@ int PStream::SendText(Channel& channel, const char* text, size_t size) {
     const auto length = static_cast<unsigned short>(size);
     const char head[] = {TAG_STRING, static_cast<char>(length >> 8), static_cast<char>(length)};
     if (!channel.Store(head, sizeof head) &&
-        (!Passed(channel.WriteByte(TAG_STRING)) || !Passed(channel.WriteInt16(length)))) {
+        (!Passed(Slowly(channel).WriteByte(TAG_STRING)) || !Passed(channel.WriteInt16(length)))) {
         return RESULT_IO;
     }
     // A larger string than a channel can be given is refused by the channel, as it would be in full
     // length.
     if (!channel.Store(text, size) &&
-        !Passed(
-            channel.Write(text, static_cast<unsigned int>(std::min<size_t>(size, UINT32_MAX))))) {
+        !Passed(Slowly(channel).Write(
+            text, static_cast<unsigned int>(std::min<size_t>(size, UINT32_MAX))))) {
         return RESULT_IO;
     }
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s\"%s\"\n", __LINE__, Indent(),
@@ -231,7 +319,7 @@ int PStream::Recv(Channel& channel, unsigned long long& value) {
     }
     unsigned char length = 0;
     char bytes[UINT8_MAX];
-    if (!Passed(channel.ReadByte(&length)) || !Passed(channel.Read(bytes, length))) {
+    if (!Passed(Slowly(channel).ReadByte(&length)) || !Passed(channel.Read(bytes, length))) {
         return RESULT_IO;
     }
     value = Fold(bytes, length);
@@ -246,7 +334,7 @@ int PStream::Recv(Channel& channel, std::string& value) {
         return RESULT_SUCCESS;
     }
     unsigned short length = 0;
-    bool passed = Passed(channel.ReadInt16(&length));
+    bool passed = Passed(Slowly(channel).ReadInt16(&length));
     value.clear();
     value.reserve(length);
     while (passed && value.size() < length) {
@@ -289,13 +377,10 @@ int PStream::Recv(Channel& channel, std::map<std::string, PObject>& value) {
         }
         // Keys come in order, so the end is where a new one belongs.
         const auto entry = value.emplace_hint(value.end(), std::move(key), PObject());
-        const bool told = !ComesAtOnce(channel);
-        if (told) {
-            PushKey(entry->first);
-        }
+        const EntryInTransfer in_transfer(*this, entry->first);
         result = RecvObject(channel, entry->second);
-        if (told && result == 0) {
-            PopKey();
+        if (result < 0) {
+            KeepPath();
         }
     }
     return result;
@@ -312,6 +397,9 @@ int PStream::Recv(Channel& channel, std::vector<PObject>& value) {
         if (tag == TAG_END) {
             LeaveBody("]");
             break;
+        }
+        if (value.empty()) {
+            value.reserve(kUsualLength);
         }
         PObject element;
         result = RecvDispatch(channel, tag, element);
@@ -393,12 +481,15 @@ void PStream::DumpHistory() {
 }
 
 void PStream::ClearHistory() {
-    {
+    // Only the thread that transfers writes what the lock is over, so it may look unlocked.
+    if (!history_.empty() || status_total_ != 0 || status_done_ != 0) {
         const std::lock_guard<std::mutex> lock(mutex_);
         history_.clear();
         status_total_ = 0;
         status_done_ = 0;
     }
+    innermost_ = nullptr;
+    entries_ = shown_ = kept_ = 0;
     depth_ = 0;
 }
 
@@ -408,16 +499,6 @@ void PStream::GetVersion(unsigned int& major, unsigned int& minor, unsigned int&
     third = 0;
 }
 
-void PStream::PushKey(std::string key) {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    history_.push_back(std::move(key));
-}
-
-void PStream::PopKey() {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    history_.pop_back();
-}
-
 const char* PStream::Indent() const {
     return kIndent + 2 * (kIndentLevels - std::min<size_t>(depth_, kIndentLevels));
 }
@@ -425,49 +506,57 @@ const char* PStream::Indent() const {
 // A loop with a stack of its own: a sender's value may be nested deeper than the thread's stack
 // allows.
 int PStream::SendContainer(Channel& channel, const PObjectCursor& outermost) {
-    std::vector<PObjectCursor> open;
-    open.reserve(kUsualDepth);
-    int result = OpenContainer(channel, outermost, open);
-    while (result == 0 && !open.empty()) {
-        PObjectCursor& place = open.back();
-        bool told = false;  // the key of a value that is now whole is in the history
-        if (place.AtEnd()) {
-            result = CloseContainer(channel, place);
-            open.pop_back();
-            told = !open.empty() && open.back().InMap();
+    struct Level {
+        explicit Level(const PObjectCursor& container) : place(container) {}
+        PObjectCursor place;
+        std::optional<EntryInTransfer> entry;
+    };
+    SteadyStack<Level, kUsualDepth> open;
+    int result = OpenContainer(channel, outermost);
+    if (result == 0) {
+        open.Push(outermost);
+    }
+    while (result == 0 && !open.IsEmpty()) {
+        Level& level = open.Top();
+        level.entry.reset();
+        if (level.place.AtEnd()) {
+            result = CloseContainer(channel, level.place);
+            open.Pop();
+            continue;
+        }
+        if (level.place.InMap()) {
+            const std::string& key = level.place.Key();
+            const size_t hidden = !key.empty() && key.front() == '_' ? 1 : 0;
+            result = SendText(channel, key.c_str() + hidden, key.size() - hidden);
+            if (result < 0) {
+                break;
+            }
+            level.entry.emplace(*this, std::string_view(key).substr(hidden));
+        }
+        const PObject& value = level.place.Take();
+        if (!value.isContainer()) {
+            result = SendObject(channel, value);
         } else {
-            const std::string* key = place.InMap() ? &place.Key() : nullptr;
-            const size_t hidden = key != nullptr && !key->empty() && key->front() == '_' ? 1 : 0;
-            if (key != nullptr) {
-                result = SendText(channel, key->c_str() + hidden, key->size() - hidden);
-                if (result < 0) {
-                    break;
-                }
+            const PObjectCursor container = PObjectCursor::Of(value);
+            result = OpenContainer(channel, container);
+            if (result == 0) {
+                open.Push(container);
             }
-            const PObject& value = place.Take();
-            if (key != nullptr && !GoesAtOnce(channel, value)) {
-                PushKey(key->substr(hidden));
-                told = !value.isContainer();
-            }
-            result = value.isContainer() ? OpenContainer(channel, PObjectCursor::Of(value), open)
-                                         : SendObject(channel, value);
         }
-        if (told && result == 0) {
-            PopKey();
-        }
+    }
+    if (result < 0) {
+        KeepPath();
     }
     return result;
 }
 
-int PStream::OpenContainer(Channel& channel, const PObjectCursor& container,
-                           std::vector<PObjectCursor>& open) {
+int PStream::OpenContainer(Channel& channel, const PObjectCursor& container) {
     if (!WriteByte(channel, container.InMap() ? TAG_MAP : TAG_ARRAY)) {
         return RESULT_IO;
     }
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s%s\n", __LINE__, Indent(),
                    container.InMap() ? "{" : "[");
     ++depth_;
-    open.push_back(container);
     return RESULT_SUCCESS;
 }
 

@@ -108,31 +108,41 @@ public:
     void GetVersion(unsigned int& major, unsigned int& minor, unsigned int& third);
 
 private:
+    struct Entry;
+    class EntryInTransfer;
+
     template <typename Step>
     int Transfer(Step step);
-    static bool WriteByte(Channel& channel, unsigned char value);
-    static bool ReadByte(Channel& channel, unsigned char& value);
+    bool WriteByte(Channel& channel, unsigned char value);
+    bool ReadByte(Channel& channel, unsigned char& value);
     static bool Take(Channel& channel, unsigned long long& value);
     static bool Take(Channel& channel, std::string& value);
-    static bool GoesAtOnce(const Channel& channel, const PObject& value);
-    static bool ComesAtOnce(const Channel& channel);
+    Channel& Slowly(Channel& channel);
+    void Enter(Entry& entry);
+    void Leave(const Entry& entry);
+    void ShowPath();
+    void KeepPath();
     int SendText(Channel& channel, const char* text, size_t size);
-    void PushKey(std::string key);
-    void PopKey();
     const char* Indent() const;
-    int OpenContainer(Channel& channel, const PObjectCursor& container,
-                      std::vector<PObjectCursor>& open);
+    int OpenContainer(Channel& channel, const PObjectCursor& container);
     int CloseContainer(Channel& channel, const PObjectCursor& container);
     int SendContainer(Channel& channel, const PObjectCursor& outermost);
     int EnterBody(const char* bracket);
     void LeaveBody(const char* bracket);
 
-    std::vector<std::string> history_;  // keys from the outermost map to the entry in transfer
+    // Keys from the outermost map to the entry in transfer. Brought up to date before whatever may
+    // wait or fail, and at the end: of what moves at once between ring and value no one can tell
+    // that it was in between, and most entries are such.
+    std::vector<std::string> history_;
     unsigned long long status_total_ = 0;
     unsigned long long status_done_ = 0;
     std::mutex mutex_;    // over the three above
     uint32_t depth_ = 0;  // maps and arrays that are open
     std::string default_recv_location_;
+    Entry* innermost_ = nullptr;  // the entry in transfer, which leads to those around it
+    size_t entries_ = 0;          // how many they are
+    size_t shown_ = 0;            // how many of them, from the outermost on, stand in the history
+    size_t kept_ = 0;             // keys in front of them there: where an earlier transfer failed
 };
 
 template <>
