@@ -12,6 +12,7 @@
 #include <algorithm>
 #include <memory>
 #include <mutex>
+#include <utility>
 
 #include "ZEL/channel.h"
 #include "ZEL/internal/cert_name.h"
@@ -93,6 +94,9 @@ bool NewContext(SSL_CTX*& ctx, const SSL_METHOD* method) {
     // A peer that begins a new handshake in mid-stream would make writes wait for something to
     // read.
     SSL_CTX_set_options(ctx, SSL_OP_NO_RENEGOTIATION);
+    // Several records with one call of the system.
+    SSL_CTX_set_read_ahead(ctx, 1);
+    SSL_CTX_set_default_read_buffer_len(ctx, size_t{4} * SSL3_RT_MAX_PACKET_SIZE);
     SSL_CTX_set_default_passwd_cb(ctx, RefusePassphrase);
     return true;
 }
@@ -309,6 +313,19 @@ int ReadFailure(SSL* ssl, int count) {
     return RESULT_IO;
 }
 
+// As SSL_read(), but of full records as many as are there. A failure behind the first one shows
+// again at the next call.
+int ReadRecords(SSL* ssl, char* buffer, int length) {
+    ERR_clear_error();
+    int total = 0;
+    int count = 0;
+    do {
+        count = SSL_read(ssl, buffer + total, length - total);
+        total += std::max(count, 0);
+    } while (count == SSL3_RT_MAX_PLAIN_LENGTH && total < length);
+    return total > 0 ? total : count;
+}
+
 int SSLReadFd(void* handle, char* buffer, unsigned int length, const timeval& interval,
               const int* flag) {
     auto* ssl = static_cast<SSL*>(handle);
@@ -317,17 +334,21 @@ int SSLReadFd(void* handle, char* buffer, unsigned int length, const timeval& in
         return result;
     }
     const bool decrypted = ssl != nullptr && SSL_pending(ssl) > 0;
-    if (!decrypted) {
-        result = WaitReadable(TlsSocket(handle), interval, flag);
-        if (result < 0) {
-            return result;
+    // What was read ahead may hold a whole record, which no wait would see.
+    bool look = ssl != nullptr && SSL_has_pending(ssl) != 0;
+    int count = 0;
+    do {
+        if (!look) {
+            result = WaitReadable(TlsSocket(handle), interval, flag);
+            if (result < 0) {
+                return result;
+            }
         }
-    }
-    ERR_clear_error();
-    const int count = SSL_read(ssl, buffer, static_cast<int>(length));
-    if (count > 0) {
-        return TellRead(count);
-    }
+        count = ReadRecords(ssl, buffer, static_cast<int>(length));
+        if (count > 0) {
+            return TellRead(count);
+        }
+    } while (!decrypted && std::exchange(look, false) && WantsRetry(SSL_get_error(ssl, count)));
     if (decrypted) {
         Logger::LogMsg(Logger::LEVEL_WARNING,
                        "[WARNING] ZEL/channel(%d): Diagnose: SSL_read failed\n", __LINE__);
