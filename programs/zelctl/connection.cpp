@@ -1,6 +1,7 @@
 #include "programs/zelctl/connection.h"
 
 #include <arpa/inet.h>
+#include <CLI/CLI.hpp>
 
 #include "programs/common/terminal.h"
 

@@ -1,11 +1,14 @@
 // How to reach the server: the options that several commands share.
 #pragma once
 
-#include <CLI/CLI.hpp>
 #include <string>
 
 #include "ZEL/sync_obj.h"
 #include "programs/zelctl/exit_codes.h"
+
+namespace CLI {
+class App;
+}
 
 namespace zelctl {
 
