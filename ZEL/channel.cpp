@@ -89,13 +89,21 @@ int ReadFd(void* handle, char* buffer, unsigned int length, const timeval& inter
         errno = 0;  // the end of the stream sets none, and is logged with its text
         return recv(fd, buffer, length, flags);
     };
+    Patience* const patience =
+        handle == nullptr ? nullptr : &static_cast<PlainSocket*>(handle)->patience;
     ssize_t count = -1;
     const bool tried = !SeesUrgentData(handle) && !Aborted(flag);
     if (tried) {
-        count = try_recv(MSG_DONTWAIT);
+        const auto came = [&] {
+            count = try_recv(MSG_DONTWAIT);
+            return count >= 0 || errno != EAGAIN;
+        };
+        if (!came()) {
+            patience->LookForAMoment(flag, came);
+        }
     }
     if (!tried || (count < 0 && errno == EAGAIN)) {
-        const int result = WaitReadable(fd, interval, flag);
+        const int result = WaitReadable(fd, interval, flag, tried ? nullptr : patience);
         if (result < 0) {
             return result;
         }
@@ -565,7 +573,8 @@ int Channel::ConnectWithTimeout(int fd, const char* ip, int port) {
     uint64_t elapsed = 0;
     for (;;) {
         Readiness readiness;
-        const int result = WaitFd(fd, Watch::kWrite, select_interval_, abort_flag_, readiness);
+        const int result =
+            WaitFd(fd, Watch::kWrite, select_interval_, abort_flag_, nullptr, readiness);
         if (result == 0 && readiness.exception) {
             Logger::LogMsg(Logger::LEVEL_WARNING,
                            "[WARNING] ZEL/channel(%d): connect: exception set\n", __LINE__);

@@ -73,6 +73,10 @@ struct ChannelOps {
 /// served from a second ring. Each wait is made of slices of one second, between which the abort
 /// flag is looked at. A peer that goes away never raises SIGPIPE.
 ///
+/// A read looks for bytes for up to 100 microseconds, yielding the processor, before it sleeps: a
+/// peer that answers at once is not slowed down by a sleep and a wake-up. Where bytes keep coming
+/// later than that, up to 255 reads in turn sleep at once.
+///
 /// Results are 0 or a ResultCode unless said otherwise. A channel that failed is only good for
 /// Close().
 ///

@@ -26,25 +26,31 @@ int PollMilliseconds(const timeval& interval) {
     return static_cast<int>(std::clamp<int64_t>(milliseconds, 0, INT_MAX));
 }
 
-bool Aborted(const int* flag) {
-    // Another thread sets the int while this one waits.
-    return flag != nullptr && __atomic_load_n(flag, __ATOMIC_RELAXED) != 0;
-}
-
-int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Readiness& readiness) {
+int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Patience* patience,
+           Readiness& readiness) {
     const bool reading = watch == Watch::kRead;
     pollfd watched = {fd, static_cast<short>((reading ? POLLIN : POLLOUT) | POLLPRI), 0};
+    const auto ask = [&](int milliseconds) {
+        // poll() passes over a negative descriptor and reports one that is not open; both are
+        // errors here.
+        const int ready = fd < 0 ? 1 : poll(&watched, 1, milliseconds);
+        if (fd < 0 || (ready > 0 && (watched.revents & POLLNVAL) != 0)) {
+            errno = EBADF;
+            return -1;
+        }
+        return ready;
+    };
     // A socket nearly always takes more, and a look is cheaper than a wait.
-    for (bool look = !reading;; look = false) {
+    for (bool look = !reading || patience != nullptr;; look = false) {
         if (Aborted(flag)) {
             return RESULT_INTERRUPTED;
         }
-        // poll() passes over a negative descriptor and reports one that is not open; both are
-        // errors here.
-        int ready = fd < 0 ? 1 : poll(&watched, 1, look ? 0 : PollMilliseconds(interval));
-        if (fd < 0 || (ready > 0 && (watched.revents & POLLNVAL) != 0)) {
-            ready = -1;
-            errno = EBADF;
+        int ready = ask(look ? 0 : PollMilliseconds(interval));
+        if (ready == 0 && look && patience != nullptr) {
+            patience->LookForAMoment(flag, [&] {
+                ready = ask(0);
+                return ready != 0;
+            });
         }
         if (ready > 0) {
             readiness.ready = (watched.revents & (reading ? kReadEvents : kWriteEvents)) != 0;
@@ -67,9 +73,9 @@ int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Readin
     }
 }
 
-int WaitReadable(int fd, const timeval& interval, const int* flag) {
+int WaitReadable(int fd, const timeval& interval, const int* flag, Patience* patience) {
     Readiness readiness;
-    const int result = WaitFd(fd, Watch::kRead, interval, flag, readiness);
+    const int result = WaitFd(fd, Watch::kRead, interval, flag, patience, readiness);
     if (result < 0) {
         return result;
     }
@@ -89,7 +95,7 @@ int WaitReadable(int fd, const timeval& interval, const int* flag) {
 
 int WaitWritable(int fd, const timeval& interval, const int* flag) {
     Readiness readiness;
-    const int result = WaitFd(fd, Watch::kWrite, interval, flag, readiness);
+    const int result = WaitFd(fd, Watch::kWrite, interval, flag, nullptr, readiness);
     if (result < 0) {
         return result;
     }

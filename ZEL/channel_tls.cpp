@@ -177,7 +177,7 @@ void ForbidAlerts(SSL* ssl, int error) {
 
 int WaitForHandshake(SSL* ssl, Watch watch, const timeval& interval) {
     Readiness readiness;
-    const int result = WaitFd(SSL_get_fd(ssl), watch, interval, nullptr, readiness);
+    const int result = WaitFd(SSL_get_fd(ssl), watch, interval, nullptr, nullptr, readiness);
     if (result < 0) {
         return result;
     }
@@ -339,7 +339,8 @@ int SSLReadFd(void* handle, char* buffer, unsigned int length, const timeval& in
     int count = 0;
     do {
         if (!look) {
-            result = WaitReadable(TlsSocket(handle), interval, flag);
+            Patience* const patience = ssl == nullptr ? nullptr : &PatienceOf(SSL_get_rbio(ssl));
+            result = WaitReadable(TlsSocket(handle), interval, flag, patience);
             if (result < 0) {
                 return result;
             }

@@ -3,14 +3,26 @@
 #include <errno.h>
 #include <sys/socket.h>
 
-#include <cstdint>
-
 namespace ZEL {
 
 namespace {
 
+struct Data {
+    int fd;
+    Patience patience;
+};
+
+Data& DataOf(BIO* bio) {
+    return *static_cast<Data*>(BIO_get_data(bio));
+}
+
 int SocketOf(BIO* bio) {
-    return static_cast<int>(reinterpret_cast<intptr_t>(BIO_get_data(bio)));
+    return DataOf(bio).fd;
+}
+
+int Destroy(BIO* bio) {
+    delete static_cast<Data*>(BIO_get_data(bio));
+    return 1;
 }
 
 int Write(BIO* bio, const char* data, int length) {
@@ -54,6 +66,7 @@ const BIO_METHOD* MakeMethod() {
         BIO_meth_set_write(method, Write);
         BIO_meth_set_read(method, Read);
         BIO_meth_set_ctrl(method, Control);
+        BIO_meth_set_destroy(method, Destroy);
     }
     return method;
 }
@@ -64,11 +77,14 @@ BIO* NewTlsSocketBio(int fd) {
     static const BIO_METHOD* const method = MakeMethod();
     BIO* bio = fd < 0 || method == nullptr ? nullptr : BIO_new(method);
     if (bio != nullptr) {
-        // The number itself is the data. NOLINTNEXTLINE(performance-no-int-to-ptr)
-        BIO_set_data(bio, reinterpret_cast<void*>(static_cast<intptr_t>(fd)));
+        BIO_set_data(bio, new Data{fd, {}});
         BIO_set_init(bio, 1);
     }
     return bio;
+}
+
+Patience& PatienceOf(BIO* bio) {
+    return DataOf(bio).patience;
 }
 
 }  // namespace ZEL

@@ -5,7 +5,11 @@
 // would report them (its three sets are named "read", "write" and "exception").
 #pragma once
 
+#include <sched.h>
 #include <sys/time.h>
+
+#include <algorithm>
+#include <chrono>
 
 #include "ZEL/channel.h"
 
@@ -14,11 +18,49 @@ namespace ZEL {
 /// The operations of a TLS channel, whose handle is an SSL that owns its context.
 extern const ChannelOps kTlsOps;
 
+/// True when the caller has asked, through the flag (may be null), for waits to be given up.
+inline bool Aborted(const int* flag) {
+    // Another thread sets the int while this one waits.
+    return flag != nullptr && __atomic_load_n(flag, __ATOMIC_RELAXED) != 0;
+}
+
+/// Lets a reader go on looking for a moment before it sleeps. A peer that answers at once then
+/// costs neither a sleep nor a wake-up, which take many times longer than a short answer. When
+/// nothing came in that moment the next reads sleep at once: twice as many each time.
+class Patience {
+public:
+    /// Calls `came` again and again, and lets others run meanwhile, until it gives true or the
+    /// moment is over, or the flag (may be null) is set; not even once when it is not the time.
+    template <typename Came>
+    void LookForAMoment(const int* flag, Came came) {
+        if (to_skip_ > 0) {
+            --to_skip_;
+            return;
+        }
+        const auto end = std::chrono::steady_clock::now() + kMoment;
+        bool found = false;
+        do {
+            sched_yield();
+            found = came();
+        } while (!found && !Aborted(flag) && std::chrono::steady_clock::now() < end);
+        skipped_ = found ? 0 : std::min(2 * skipped_ + 1, kMostSkipped);
+        to_skip_ = skipped_;
+    }
+
+private:
+    // What a machine takes to wake a sleeper, and more.
+    static constexpr std::chrono::microseconds kMoment{100};
+    static constexpr unsigned int kMostSkipped = 255;
+    unsigned int skipped_ = 0;  // after the last look in vain
+    unsigned int to_skip_ = 0;
+};
+
 /// The handle of a plain channel, on the heap.
 struct PlainSocket {
     int fd;
-    /// Whether its peer can send urgent data, which a wait has to see before anything is written.
+    /// Whether its peer can send urgent data, which a wait has to see before anything is moved.
     bool can_be_urgent;
+    Patience patience = {};
 };
 
 enum class Watch { kRead, kWrite };
@@ -32,15 +74,13 @@ struct Readiness {
 /// A wait of `interval` in the milliseconds that poll(2) takes, rounded up; at least 0.
 int PollMilliseconds(const timeval& interval);
 
-/// True when the caller has asked, through the flag (may be null), for waits to be given up.
-bool Aborted(const int* flag);
-
-/// Waits for one interval. 0: something is in `readiness`; -1: the flag is set; -9: nothing
-/// happened; -3.
-int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Readiness& readiness);
+/// Waits for one interval, after a moment's patience where there is any (may be null). 0: something
+/// is in `readiness`; -1: the flag is set; -9: nothing happened; -3.
+int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Patience* patience,
+           Readiness& readiness);
 
 /// The wait in front of a read or write: 0 when the direction is ready, else a result code.
-int WaitReadable(int fd, const timeval& interval, const int* flag);
+int WaitReadable(int fd, const timeval& interval, const int* flag, Patience* patience);
 int WaitWritable(int fd, const timeval& interval, const int* flag);
 
 /// A read of 0 bytes is refused: -4, otherwise 0.

@@ -2,6 +2,8 @@
 
 #include <openssl/bio.h>
 
+#include "ZEL/internal/channel_socket.h"
+
 namespace ZEL {
 
 /// A BIO over a connected socket that never blocks, whatever the descriptor's flags say, and never
@@ -9,5 +11,8 @@ namespace ZEL {
 /// end of the stream is a plain 0, not an error of the BIO. Null when there is no memory or no
 /// descriptor.
 BIO* NewTlsSocketBio(int fd);
+
+/// The patience of those who read from such a BIO; the BIO's.
+Patience& PatienceOf(BIO* bio);
 
 }  // namespace ZEL

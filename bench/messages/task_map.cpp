@@ -129,8 +129,7 @@ void CompareTaskMap() {
     printf(
         "  the value: 1 map, 23 entries, 6 keys above 15 characters, 17 integers, 8 strings, 2 "
         "texts above 15 characters, 1 array, 1 array's elements\n"
-        "  sending: the list of open containers, the key path; receiving: the value, the key "
-        "path, 2 as the array grows\n");
+        "  receiving: the value, its array with room for more elements\n");
     PrintAllocations("the task map, msgpack-cxx", msgpack_pair, msgpack_map);
 }
 
