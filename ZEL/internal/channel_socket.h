@@ -15,6 +15,8 @@
 
 namespace ZEL {
 
+/// The operations of a plain channel, whose handle is a PlainSocket.
+extern const ChannelOps kPlainOps;
 /// The operations of a TLS channel, whose handle is an SSL that owns its context.
 extern const ChannelOps kTlsOps;
 
@@ -62,6 +64,9 @@ struct PlainSocket {
     bool can_be_urgent;
     Patience patience = {};
 };
+
+/// The handle of a descriptor, which becomes the channel's.
+PlainSocket* NewPlainSocket(int fd);
 
 enum class Watch { kRead, kWrite };
 
