@@ -25,6 +25,7 @@
 
 #include "ZEL/ipc.h"
 #include "ZEL/sync_obj.h"
+#include "bench/large_tree.h"
 #include "platform/internal/child_process.h"
 #include "platform/internal/unique_fd.h"
 #include "tests/integration/daemon_process.h"
@@ -233,7 +234,7 @@ public:
 
     void LargeTree(int folders) {
         const std::string tree = root_.Path("tree");
-        MakeTree(tree, folders);
+        bench::MakeTree(tree, folders);
         AddShare("tree");
         rsyncd_.Stop();  // the daemon has nobody to send the tree to
         const size_t before = ResidentKilobytes();
@@ -297,21 +298,6 @@ private:
             },
             120);
         Must(all, "not all folders are watched; see fs.inotify.max_user_watches");
-    }
-
-    /// Ten files in each tenth folder, folders ten to a folder.
-    static void MakeTree(const std::string& top, int folders) {
-        mkdir(top.c_str(), 0755);
-        Words made = {top};
-        for (size_t at = 0; static_cast<int>(made.size()) < folders; ++at) {
-            for (int i = 0; i < 10 && static_cast<int>(made.size()) < folders; ++i) {
-                made.push_back(made[at] + "/folder " + std::to_string(i));
-                mkdir(made.back().c_str(), 0755);
-            }
-            for (int i = 0; i < 10; ++i) {
-                std::ofstream(made[at] + "/file " + std::to_string(i));
-            }
-        }
     }
 
     uint64_t Switches() const {

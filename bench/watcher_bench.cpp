@@ -8,7 +8,6 @@
 // std::set of the same paths, which grows without bound. Each line ends in the ratio.
 #include <malloc.h>
 #include <sys/resource.h>
-#include <sys/stat.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -16,13 +15,13 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
-#include <fstream>
 #include <functional>
 #include <memory>
 #include <set>
 #include <string>
 #include <vector>
 
+#include "bench/large_tree.h"
 #include "programs/zel_daemon/change_set.h"
 #include "programs/zel_daemon/watcher.h"
 #include "tests/support/temp_root.h"
@@ -76,21 +75,6 @@ size_t ResidentBytes() {
     return 0;
 }
 
-/// Ten files in each tenth folder, folders ten to a folder.
-void MakeTree(const std::string& top, int folders) {
-    mkdir(top.c_str(), 0755);
-    std::vector<std::string> made = {top};
-    for (size_t at = 0; static_cast<int>(made.size()) < folders; ++at) {
-        for (int i = 0; i < 10 && static_cast<int>(made.size()) < folders; ++i) {
-            made.push_back(made[at] + "/folder " + std::to_string(i));
-            mkdir(made.back().c_str(), 0755);
-        }
-        for (int i = 0; i < 10; ++i) {
-            std::ofstream(made[at] + "/file " + std::to_string(i));
-        }
-    }
-}
-
 struct Found {
     double milliseconds;
     double cpu;
@@ -117,7 +101,7 @@ Found WatchAll(Watcher& watcher, const std::string& folder, size_t folders) {
 
 void Search(int folders) {
     const test::TempFolder root;
-    MakeTree(root.Path("tree"), folders);
+    bench::MakeTree(root.Path("tree"), folders);
     const std::string command = "find '" + root.Path("tree") + "' -type d >/dev/null";
     std::vector<double> ours, theirs, our_cpu, their_cpu;
     double longest = 0;

@@ -1,6 +1,7 @@
 #include "programs/common/task_row.h"
 
 #include <charconv>
+#include <utility>
 
 #include "programs/common/text.h"
 
@@ -22,30 +23,64 @@ const char* WordOf(const char* const (&words)[4], int number) {
     return words[number >= 0 && number < 4 ? number : 0];
 }
 
-void Pack(const std::string& text, std::string& packed) {
-    const size_t begin = packed.size();
-    packed.append(text, 0, kMaxText);
-    for (size_t i = begin; i < packed.size(); ++i) {
-        if (static_cast<unsigned char>(packed[i]) < 0x20) {
-            packed[i] = '?';
-        }
-    }
-    packed += kSeparator;
+// The fields in the order that they are packed in.
+template <typename Row, typename Visit>
+void EachField(Row& row, Visit& visit) {
+    visit(row.name);
+    visit(row.shares);
+    visit(row.server);
+    visit(row.schedule);
+    visit(row.status);
+    visit(row.result);
+    visit(row.last_end);
+    visit(row.next_run);
+    visit(row.retry_in);
+    visit(row.percent);
+    visit(row.pending);
+    visit(row.note);
 }
 
-template <typename T>
-void Pack(const std::optional<T>& number, std::string& packed) {
-    Pack(number ? std::to_string(*number) : "", packed);
-}
+/// Puts a row together, field after field.
+class Packer {
+public:
+    Packer() { packed_.reserve(256); }
+
+    void operator()(const std::string& text) {
+        const size_t begin = packed_.size();
+        packed_.append(text, 0, kMaxText);
+        for (size_t i = begin; i < packed_.size(); ++i) {
+            if (static_cast<unsigned char>(packed_[i]) < 0x20) {
+                packed_[i] = '?';
+            }
+        }
+        packed_ += kSeparator;
+    }
+    template <typename T>
+    void operator()(const T& number) {
+        (*this)(std::to_string(number));
+    }
+    template <typename T>
+    void operator()(const std::optional<T>& number) {
+        (*this)(number ? std::to_string(*number) : "");
+    }
+    std::string Packed() { return std::move(packed_); }
+
+private:
+    std::string packed_;
+};
 
 /// Takes a packed row apart, field after field.
 class Unpacker {
 public:
     explicit Unpacker(std::string_view packed) : rest_(packed) {}
 
-    void Take(std::string& text) { text = Next(); }
+    void operator()(std::string& text) { text = Next(); }
     template <typename T>
-    void Take(std::optional<T>& number) {
+    void operator()(T& number) {
+        Parse(Next(), number);
+    }
+    template <typename T>
+    void operator()(std::optional<T>& number) {
         const std::string_view text = Next();
         number.reset();
         T value = 0;
@@ -53,10 +88,6 @@ public:
             Parse(text, value);
             number = value;
         }
-    }
-    template <typename T>
-    void TakeNumber(T& number) {
-        Parse(Next(), number);
     }
     /// Whether all were there, in their form, and nothing else.
     bool Good() const { return good_ && rest_.empty(); }
@@ -86,37 +117,14 @@ private:
 }  // namespace
 
 std::string PackTaskRow(const TaskRow& row) {
-    std::string packed;
-    packed.reserve(256);
-    Pack(row.name, packed);
-    Pack(row.shares, packed);
-    Pack(row.server, packed);
-    Pack(row.schedule, packed);
-    Pack(std::to_string(row.status), packed);
-    Pack(std::to_string(row.result), packed);
-    Pack(row.last_end, packed);
-    Pack(row.next_run, packed);
-    Pack(row.retry_in, packed);
-    Pack(row.percent, packed);
-    Pack(std::to_string(row.pending), packed);
-    Pack(row.note, packed);
-    return packed;
+    Packer packer;
+    EachField(row, packer);
+    return packer.Packed();
 }
 
 bool UnpackTaskRow(std::string_view packed, TaskRow& row) {
     Unpacker fields(packed);
-    fields.Take(row.name);
-    fields.Take(row.shares);
-    fields.Take(row.server);
-    fields.Take(row.schedule);
-    fields.TakeNumber(row.status);
-    fields.TakeNumber(row.result);
-    fields.Take(row.last_end);
-    fields.Take(row.next_run);
-    fields.Take(row.retry_in);
-    fields.Take(row.percent);
-    fields.TakeNumber(row.pending);
-    fields.Take(row.note);
+    EachField(row, fields);
     return fields.Good();
 }
 
