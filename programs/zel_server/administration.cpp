@@ -412,6 +412,7 @@ int RunCommandLine(int argc, char** argv) {
     CLI::App app{"The server of the shared-folder synchronisation: receives what clients push"};
     app.name("zel_server");
     app.require_subcommand(1);
+    app.set_version_flag("--version", ZEL_VERSION);
     int result = kOk;
     bool as_json = false;
     const auto json_flag = [&](CLI::App* command) {

@@ -56,6 +56,7 @@ int RunCommandLine(int argc, char** argv) {
     CLI::App app{"Keeps shared folders in step with a paired server"};
     app.name("zelctl");
     app.require_subcommand(1);
+    app.set_version_flag("--version", ZEL_VERSION);
     app.add_flag_callback(
         "-v,--verbose",
         [] { ZEL::Logger::Initialize(ZEL::Logger::STDERR, ZEL::Logger::LEVEL_INFO, "", 0); },
