@@ -87,16 +87,19 @@ void Measure(std::vector<Contestant*> contestants, int runs) {
     }
 }
 
+// `wanted`: the largest ratio that is right; 0: there is none.
 void Print(const char* what, const Contestant& ours, const char* peer, const Contestant& theirs,
            double wanted) {
     const double our_median = Median(ours.seconds);
     const double their_median = Median(theirs.seconds);
-    std::printf(
-        "%-20s %9.2f ms, %-28s %9.2f ms: ratio %.3f (wanted: at most %.2f; fastest runs %.3f, CPU "
-        "time %.3f)\n",
-        what, our_median * 1e3, peer, their_median * 1e3, our_median / their_median, wanted,
-        Fastest(ours.seconds) / Fastest(theirs.seconds),
-        Median(ours.cpu_seconds) / Median(theirs.cpu_seconds));
+    std::printf("%-20s %9.2f ms, %-28s %9.2f ms: ratio %.3f (", what, our_median * 1e3, peer,
+                their_median * 1e3, our_median / their_median);
+    if (wanted > 0) {
+        std::printf("wanted: at most %.2f; ", wanted);
+    }
+    std::printf("fastest runs %.3f, CPU time %.3f)\n",
+                Fastest(ours.seconds) / Fastest(theirs.seconds),
+                Median(ours.cpu_seconds) / Median(theirs.cpu_seconds));
     std::fflush(stdout);
 }
 
@@ -152,7 +155,8 @@ public:
         Contestant quick = {nullptr, [&] { return BareCopy(source, {"--sockopts=TCP_NODELAY"}); }};
         Measure({&wrapper, &plain, &quick}, kCommandRuns);
         Print("100 unchanged files", wrapper, "rsync", plain, 0.5);
-        Print("100 unchanged files", wrapper, "rsync TCP_NODELAY", quick, 1.2);
+        // The peer's server asks nobody whether it may be written to.
+        Print("100 unchanged files", wrapper, "rsync TCP_NODELAY", quick, 0);
     }
 
     void Copies() {
