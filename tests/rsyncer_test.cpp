@@ -44,6 +44,10 @@ std::string ValueOf(const std::string& line) {
     return line.substr(start, line.size() - start - 1);
 }
 
+std::string Flag(const std::string& name, bool on) {
+    return name + (on ? "=1" : "=0");
+}
+
 }  // namespace
 
 // ---- The platform in front ----
@@ -59,42 +63,31 @@ struct RsyncWrapper::Impl {
 
 RsyncWrapper::RsyncWrapper() : impl_(new Impl) {}
 RsyncWrapper::~RsyncWrapper() = default;
-#define NOTE_BOOL(name)                                            \
-    void RsyncWrapper::name(bool value) {                          \
-        impl_->Note(std::string(#name "=") + (value ? "1" : "0")); \
+#define NOTE(setter, text)      \
+    void RsyncWrapper::setter { \
+        impl_->Note(text);      \
     }
-NOTE_BOOL(setDelete)
-NOTE_BOOL(setNumericIds)
-NOTE_BOOL(setTarqPseudoRoot)
-NOTE_BOOL(setSsh)
-NOTE_BOOL(setCompress)
-NOTE_BOOL(setDeltaCopy)
-NOTE_BOOL(setListOnly)
-NOTE_BOOL(setRelativePath)
-NOTE_BOOL(setTarqAcl)
-NOTE_BOOL(setDebugLog)
-void RsyncWrapper::setTarqAuth(bool a, bool b) {
-    impl_->Note(std::string("auth=") + (a && b ? "11" : "?"));
-}
-void RsyncWrapper::setPort(int port) {
-    impl_->Note("port=" + std::to_string(port));
-}
-void RsyncWrapper::setTimeout(int seconds) {
-    impl_->Note("timeout=" + std::to_string(seconds));
-}
+NOTE(setDelete(bool on), Flag("setDelete", on))
+NOTE(setNumericIds(bool on), Flag("setNumericIds", on))
+NOTE(setTarqPseudoRoot(bool on), Flag("setTarqPseudoRoot", on))
+NOTE(setSsh(bool on), Flag("setSsh", on))
+NOTE(setCompress(bool on), Flag("setCompress", on))
+NOTE(setDeltaCopy(bool on), Flag("setDeltaCopy", on))
+NOTE(setListOnly(bool on), Flag("setListOnly", on))
+NOTE(setRelativePath(bool on), Flag("setRelativePath", on))
+NOTE(setTarqAcl(bool on), Flag("setTarqAcl", on))
+NOTE(setDebugLog(bool on), Flag("setDebugLog", on))
+NOTE(setTarqAuth(bool on, bool both), Flag("auth", on&& both))
+NOTE(setPort(int port), "port=" + std::to_string(port))
+NOTE(setTimeout(int seconds), "timeout=" + std::to_string(seconds))
+NOTE(setExcludeRule(const std::list<std::string>& rules),
+     "excludes=" + std::to_string(rules.size()))
+NOTE(setSrcPath(const std::string& path), "src=" + path)
+NOTE(setDestPath(const std::string& user, const std::string& host, const std::string& password,
+                 const std::string& module, const std::string& sub_path),
+     "dest=" + user + ":" + password + "@" + host + "::" + module + "|" + sub_path)
 void RsyncWrapper::setTarqCustCmdRule(const std::list<std::string>& lines) {
     impl_->command.assign(lines.begin(), lines.end());
-}
-void RsyncWrapper::setExcludeRule(const std::list<std::string>& rules) {
-    impl_->Note("excludes=" + std::to_string(rules.size()));
-}
-void RsyncWrapper::setSrcPath(const std::string& path) {
-    impl_->Note("src=" + path);
-}
-void RsyncWrapper::setDestPath(const std::string& user, const std::string& host,
-                               const std::string& password, const std::string& module,
-                               const std::string& sub_path) {
-    impl_->Note("dest=" + user + ":" + password + "@" + host + "::" + module + "|" + sub_path);
 }
 int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
     impl_->Note(cancelled ? "cancellable" : "plain");
@@ -185,7 +178,7 @@ protected:
     int status_ = -7;
 };
 
-constexpr char kDefaults[] = "setDelete=1 setNumericIds=1 auth=11 setTarqPseudoRoot=1 ";
+constexpr char kDefaults[] = "setDelete=1 setNumericIds=1 auth=1 setTarqPseudoRoot=1 ";
 
 TEST_F(RsyncerTest, InitializeProbesEachAddressUntilOneAnswersTheVersionCommand) {
     world_.answers["ZEL_Pairing"] = {{10}, {207}};
@@ -203,16 +196,15 @@ TEST_F(RsyncerTest, InitializeProbesEachAddressUntilOneAnswersTheVersionCommand)
 }
 
 TEST_F(RsyncerTest, TestServerReportsTheLastVerdictAndKeepsTheRightAddress) {
-    struct Case {
+    const World::Answer version = {0, "1"};
+    const struct {
         const char* name;
         World::Answer pairing, version;
-        int addresses;
-        int expected;
+        int addresses, expected;
         const char* address;
-    };
-    const Case cases[] = {
-        {"no address answers", {30}, {0, "1"}, 2, 30, ""},
-        {"the name is unknown", {0}, {0, "1"}, 0, 42, ""},
+    } cases[] = {
+        {"no address answers", {30}, version, 2, 30, ""},
+        {"the name is unknown", {0}, version, 0, 42, ""},
         {"an old server", {0}, {43}, 2, 0, "10.0.0.1"},
         {"another old server", {0}, {51}, 2, 0, "10.0.0.1"},
         // Answers, but tells no version: the last candidate stays, and its probe's status is the
@@ -221,13 +213,12 @@ TEST_F(RsyncerTest, TestServerReportsTheLastVerdictAndKeepsTheRightAddress) {
         {"an empty version file", {0}, {0, ""}, 1, 0, "10.0.0.1"},
         {"no version file", {0}, {0, "none"}, 1, 0, "10.0.0.1"},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
+    for (const auto& c : cases) {
         world_.answers = {{"ZEL_Pairing", {c.pairing}}, {"ZEL_GetProtocolVer", {c.version}}};
         world_.addresses = c.addresses;
         ZEL::Rsyncer rsyncer;
-        EXPECT_EQ(rsyncer.Initialize(info_), c.expected);
-        EXPECT_EQ(rsyncer.GetLatestIP(), c.address);
+        EXPECT_EQ(rsyncer.Initialize(info_), c.expected) << c.name;
+        EXPECT_EQ(rsyncer.GetLatestIP(), c.address) << c.name;
         EXPECT_FALSE(rsyncer.SupportMultiSource());
     }
 }
@@ -249,12 +240,12 @@ TEST_F(RsyncerTest, MultiPairingNamesTheSharesAndReadsTheConflicts) {
     EXPECT_THAT(conflicts, ElementsAre("before", "a", "", "b"));
     // The scan ends at the first encrypted share: the unknown one behind it is no failure.
     ASSERT_EQ(world_.commands.size(), 1U);
-    const std::vector<std::string>& lines = world_.commands[0];
-    EXPECT_THAT(lines, ElementsAre("command=\"ZEL_PairingMultiSrc\"", "clientID=\"SN1\"",
-                                   "serverName=\"nas\"", "syncShares=\"docs:vault:unknown\"",
-                                   "dryRun=\"yes\"",
-                                   testing::StartsWith("outfile=\"" + root_.Path("tmp/ZEL/temp.")),
-                                   "requireEncryptionShareSupport=\"yes\""));
+    EXPECT_THAT(
+        world_.commands[0],
+        ElementsAre("command=\"ZEL_PairingMultiSrc\"", "clientID=\"SN1\"", "serverName=\"nas\"",
+                    "syncShares=\"docs:vault:unknown\"", "dryRun=\"yes\"",
+                    testing::StartsWith("outfile=\"" + root_.Path("tmp/ZEL/temp.")),
+                    "requireEncryptionShareSupport=\"yes\""));
 
     EXPECT_EQ(rsyncer_.DoPairing(false, {"docs"}, conflicts, status_), 0);
     EXPECT_EQ(conflicts.size(), 4U);
@@ -264,12 +255,10 @@ TEST_F(RsyncerTest, MultiPairingNamesTheSharesAndReadsTheConflicts) {
         EXPECT_EQ(rsyncer_.DoPairing(false, shares, conflicts, status_), -1);
     }
     EXPECT_TRUE(fs::is_empty(root_.Path("tmp/ZEL")));
-}
 
-TEST_F(RsyncerTest, AnOldServerIsNotToldTheShares) {
+    // An old server is not told the shares.
     world_.answers["ZEL_GetProtocolVer"] = {{43}};
     Connect();
-    std::list<std::string> conflicts = {"left over"};
     EXPECT_EQ(rsyncer_.DoPairing(false, {"docs"}, conflicts, status_), 0);
     EXPECT_THAT(conflicts, IsEmpty());
     EXPECT_THAT(world_.commands[0], ElementsAre("command=\"ZEL_Pairing\"", "clientID=\"SN1\"",
