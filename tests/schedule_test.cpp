@@ -10,20 +10,12 @@ using namespace testing;
 using ZEL::Schedule;
 using namespace test;
 
-TEST(Schedule, SettersKeepModePeriodAndWeekSound) {
+TEST(Schedule, SettersKeepModeAndWeekSound) {
     Schedule schedule;
     schedule.SetModeByStr("Once");
     EXPECT_EQ(schedule.GetModeStr(), "manual");
     schedule.SetMode(static_cast<ZEL::SCHD_MODE>(0xffffffff));
     EXPECT_EQ(schedule.GetModeStr(), "weekly");
-
-    schedule.SetPeriod(5430);
-    EXPECT_EQ(schedule.GetPeriodHourPart() * 100 + schedule.GetPeriodMinutePart(), 130);
-    schedule.SetRepeatTimesInDay(0);
-    EXPECT_EQ(schedule.GetPeriodSeconds(), 0);
-    schedule.SetRepeatTimesInDay(4);
-    schedule.SetPeriod(0, 0);
-    EXPECT_EQ(schedule.GetRepeatTimesInDay(), 0);
 
     for (const auto& [given, kept] : {std::pair("0x00000abc", "0100000"),
                                       {"1000001", "1000001"},

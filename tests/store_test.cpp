@@ -64,13 +64,6 @@ protected:
         }
         return pending;
     }
-    // What a person sees in the shell.
-    std::string Shell(const std::string& statement) const {
-        Database database(path_);
-        Query query(database, statement);
-        return query.Next() ? query.Text() : "";
-    }
-
     const test::TempFolder folder_;
     const std::string path_ = folder_.Path("daemon/tasks.db");
     std::unique_ptr<Store> store_ = std::make_unique<Store>(path_);
@@ -100,9 +93,10 @@ TEST_F(StoreTest, KeepsEveryFieldOfATask) {
     record.whole_due = true;
     store_->UpdateTask(record);
     EXPECT_EQ(Text(store_->Tasks()[0]), Text(record));
-    EXPECT_EQ(Shell("SELECT name FROM tasks WHERE name = 'Fotos täglich' AND ssh_port = 2222"),
-              "Fotos täglich");
-    EXPECT_EQ(Shell("SELECT share_list FROM tasks"), R"(["photo",[254,0,120],"it's \"q\"\n",""])");
+    Database database(path_);
+    Query query(database, "SELECT share_list FROM tasks WHERE name = 'Fotos täglich'");
+    ASSERT_TRUE(query.Next());
+    EXPECT_EQ(query.Text(), R"(["photo",[254,0,120],"it's \"q\"\n",""])");
 }
 
 TEST_F(StoreTest, NamesAreUniqueAndIdsAreNeverUsedAgain) {
@@ -115,7 +109,6 @@ TEST_F(StoreTest, NamesAreUniqueAndIdsAreNeverUsedAgain) {
     EXPECT_THAT(Fault([&] { store_->UpdateTask(renamed); }), HasSubstr("choose another"));
     renamed.task.SetID(second + 1);
     EXPECT_THAT(Fault([&] { store_->UpdateTask(renamed); }), HasSubstr("no such task"));
-    EXPECT_EQ(store_->Tasks()[1].Name(), "b");
     store_->RemoveTask(second);
     EXPECT_GT(store_->AddTask(Task("b")), second);
     store_->RemoveTask(first);
@@ -180,12 +173,10 @@ TEST_F(StoreTest, KeepsTheLastRunsOfEachTask) {
     ASSERT_EQ(runs.size(), Store::kRunsKept + 0U);
     EXPECT_EQ(runs.front().id, last);
     EXPECT_EQ(runs.back().start, 200);
-    EXPECT_EQ(store_->Runs(task, 3).size(), 3U);
     EXPECT_THAT(store_->LastRuns(),
                 ElementsAre(Field(&RunRecord::id, last), Field(&RunRecord::id, others)));
 
     store_->RemoveTask(task);
-    EXPECT_THAT(store_->Runs(task, 1000), IsEmpty());
     store_->EndRun(run);
     EXPECT_EQ(store_->LastRuns().size(), 1U);
     EXPECT_THAT(Fault([&] { store_->BeginRun(task, RunReason::kChange, 1); }),
