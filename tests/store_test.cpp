@@ -144,25 +144,14 @@ TEST_F(StoreTest, KeepsTheLastRunsOfEachTask) {
     const uint64_t task = store_->AddTask(Task("a"));
     const uint64_t other = store_->AddTask(Task("b"));
     store_->AddTask(Task("has not run"));
-    RunRecord run;
-    run.id = store_->BeginRun(task, RunReason::kRetry, 100);
-    run.start = 100;
-    run.end = 160;
-    run.result = ZEL::TASK_RESULT_FAILED;
-    run.status = 23;
-    run.error = "share 'x\xff': cannot be read";
-    run.files_sent = UINT64_MAX;
-    run.files_deleted = 2;
-    run.bytes_sent = 3;
-    run.rsync_runs = 4;
+    const std::string error = "share 'x\xff': cannot be read";
+    const uint64_t id = store_->BeginRun(task, RunReason::kRetry, 100);
+    const RunRecord run = {id, task,  RunReason::kRetry, 100, 160, ZEL::TASK_RESULT_FAILED,
+                           23, error, UINT64_MAX,        2,   3,   4};
     store_->EndRun(run);
-    const auto text = [](const RunRecord& of) {
-        std::ostringstream all;
-        all << of.id << " " << of.start << of.end << of.result << of.status << of.error
-            << of.files_sent << of.files_deleted << of.bytes_sent << of.rsync_runs;
-        return all.str();
-    };
-    EXPECT_EQ(text(store_->Runs(task, 5).at(0)), text(run));
+    EXPECT_THAT(store_->Runs(task, 5),
+                ElementsAre(FieldsAre(id, task, RunReason::kRetry, 100, 160,
+                                      ZEL::TASK_RESULT_FAILED, 23, error, UINT64_MAX, 2, 3, 4)));
 
     const uint64_t others = store_->BeginRun(other, RunReason::kRequest, 50);
     uint64_t last = 0;
@@ -194,6 +183,7 @@ TEST_F(StoreTest, WhatWasCutOffHasFailedAndWaitsAgain) {
     EXPECT_EQ(store_->Runs(task, 1).at(0).result, ZEL::TASK_RESULT_FAILED);
     EXPECT_EQ(store_->Runs(task, 1).at(0).end, 100);
     EXPECT_THAT(Pending(task), ElementsAre("s /a", "s /b"));
+    EXPECT_EQ(store_->CountEvents(task), 2U);
 }
 
 TEST_F(StoreTest, IsForTheDaemonAlone) {

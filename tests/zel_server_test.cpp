@@ -27,30 +27,21 @@ TEST(CommandText, IsTakenToTheLetterOrRefusedWhole) {
     EXPECT_EQ(*command->Find("name") + *command->Find("empty"), "a b=c");
 
     const std::string session = "session=\"" + kSession + "\"\n";
+    const std::string name = session + "command=\"X\"\n";
     const std::string cases[] = {
-        "",
-        session,
-        kHead + "\n",
-        kHead + "key=value\n",
-        kHead + "key=\"v\n",
-        kHead + "key=\"\"\"\n",
-        kHead + "k=\"1\"\nk=\"2\"\n",  // repeated
-        kHead + "command=\"Y\"\n",
-        kHead + "clientID=\"SN2\"\n",  // a forged second one
-        kHead + session,
-        kHead + "k=\"a\x01b\"\n",
-        kHead + "k=\"a\rb\"\n",
-        kHead + std::string("k=\"a\0b\"\n", 8),
-        kHead + "k1=\"v\"\n",
-        kHead + "=\"v\"\n",
-        kHead + " k=\"v\"\n",
-        session + "clientID=\"SN1\"\ncommand=\"X\"\n",  // out of order
-        session + "command=\"X\"\nclientID=\"\"\n",
-        session + "command=\"\"\nclientID=\"SN1\"\n",
-        session + "command=\"X\"\nclientID=\"a]b\"\n",
-        session + "command=\"X\"\nclientID=\"" + std::string(36, 'x') + "\"\n",
+        // In a line.
+        kHead + "\n", kHead + "key=value\n", kHead + "key=\"v\n", kHead + "key=\"\"\"\n",
+        kHead + "k=\"a\x01b\"\n", kHead + "k=\"a\rb\"\n", kHead + std::string("k=\"a\0b\"\n", 8),
+        kHead + "k1=\"v\"\n", kHead + "=\"v\"\n", kHead + " k=\"v\"\n",
         kHead + "k=\"" + std::string(5 * 1024, 'x') + "\"\n",
-    };
+        // Twice: a forged second one.
+        kHead + "k=\"1\"\nk=\"2\"\n", kHead + "command=\"Y\"\n", kHead + "clientID=\"SN2\"\n",
+        kHead + session,
+        // Missing, out of order or empty.
+        "", session, session + "clientID=\"SN1\"\ncommand=\"X\"\n", name + "clientID=\"\"\n",
+        session + "command=\"\"\nclientID=\"SN1\"\n",
+        // A client that there cannot be.
+        name + "clientID=\"a]b\"\n", name + "clientID=\"" + std::string(36, 'x') + "\"\n"};
     for (const std::string& text : cases) {
         EXPECT_FALSE(ParseCommand(text)) << text;
     }
