@@ -218,6 +218,19 @@ TEST_F(ServerTest, MissingAndOddArgumentsAreRefused) {
     EXPECT_EQ(Start("docs"), kStorage);
 }
 
+TEST_F(ServerTest, ABeaconShowsThatATaskRunsUntilItFinishes) {
+    ASSERT_EQ(Pair(), kDone);
+    for (const bool busy : {true, false}) {
+        EXPECT_EQ(
+            busy ? Do("ZEL_UpdateTaskStatus", {{"taskName", "t"}}).status : Finish("task", "t"),
+            kDone);
+        zel_svr_status status = {};
+        EXPECT_EQ(zel_svr_get_status(&status), 0);
+        EXPECT_EQ(status.busy, busy);
+        zel_svr_put_status(&status);
+    }
+}
+
 TEST_F(ServerTest, TheSingleClientStaysPairedWhenASecondComes) {
     ASSERT_EQ(TARQUISetZEL(1, "OLD", "nas-old"), 0);
     EXPECT_EQ(IsPaired("OLD"), Paired::kYes);
