@@ -122,10 +122,12 @@ TEST(Explanation, ComesFromTheWordsAndTheKindOfRun) {
     }
 }
 
-TEST(Arguments, EachTransportGetsItsOwnWayAndNoneShowsThePassword) {
+/// What only odd names and addresses show: plain ones are seen to work against real servers.
+TEST(Arguments, OddNamesAndAddressesComeThroughAndAPasswordIsNone) {
     const test::TempRoot root;
     PrivateFolder folder;
     Config config;
+    config.ssh_options = {"-J", "it's"};
     Settings settings;
     settings.account = true;
     settings.user = "bob";
@@ -137,32 +139,23 @@ TEST(Arguments, EachTransportGetsItsOwnWayAndNoneShowsThePassword) {
         return CopyInvocation({settings, config, {}, false, false, ""}, &folder);
     };
     Invocation made = build();
-    EXPECT_THAT(made.arguments, IsSupersetOf({"--port=873", "--password-file=-"}));
     EXPECT_THAT(std::vector<std::string>(made.arguments.end() - 3, made.arguments.end()),
                 ElementsAre("--", "./rel:ative", "bob@[fe80::1%eth0]::data/"));
-    EXPECT_EQ(made.input, "secret\n");
-    EXPECT_THAT(made.environment, Contains("LC_ALL=C"));
 
     settings.ssh = true;
-    settings.port = 2222;
-    config.ssh_options = {"-J", "it's"};
     made = build();
-    EXPECT_THAT(made.environment, Contains("SSH_ASKPASS_REQUIRE=force"));
     EXPECT_THAT(made.environment,
-                Contains(AllOf(
-                    StartsWith("RSYNC_CONNECT_PROG='ssh' '-J' 'it'\\''s' '-p' '2222' '-l' 'bob'"),
-                    EndsWith("'-W' '127.0.0.1:873' '--' 'fe80::1%%eth0'"))));
-    EXPECT_THAT(made.arguments, Each(Not(AnyOf(StartsWith("--port"), HasSubstr("secret\n")))));
+                Contains(AllOf(StartsWith("RSYNC_CONNECT_PROG='ssh' '-J' 'it'\\''s'"),
+                               EndsWith("'-W' '127.0.0.1:873' '--' 'fe80::1%%eth0'"))));
+    EXPECT_THAT(made.arguments, Each(Not(HasSubstr("secret\n"))));
     EXPECT_THAT(made.environment, Each(Not(HasSubstr("secret\n"))));
 
     settings.module = "/a dir";
-    settings.sub_path = "sub";
     settings.password.clear();
     made = build();
     EXPECT_THAT(made.arguments, Contains(AllOf(StartsWith("--rsh='ssh' '-J' 'it''s'"),
                                                HasSubstr("BatchMode=yes"))));
-    EXPECT_EQ(made.arguments.back(), "[fe80::1%eth0]:/a dir/sub");
-    EXPECT_EQ(made.input, "");
+    EXPECT_EQ(made.arguments.back(), "[fe80::1%eth0]:/a dir/");
 }
 
 /// What `script` writes; `setup` says the rest.
