@@ -27,6 +27,11 @@ std::string OtherProcesses() {
     return text;
 }
 
+/// A plain answer: a failure shall not print the environment of all that runs.
+bool Has(const std::string& text, const std::string& words) {
+    return text.find(words) != std::string::npos;
+}
+
 /// A client with a root folder of its own, beside a daemon with the module "data".
 class RsyncWrapperTest : public testing::Test {
 protected:
@@ -98,7 +103,7 @@ protected:
 
     void ExpectNothingLeft() const {
         EXPECT_THAT(Tree(root_.Path("tmp")), ElementsAre("ZEL"));
-        EXPECT_THAT(OtherProcesses(), Not(HasSubstr("--early-input=" + root_.Path())));
+        EXPECT_FALSE(Has(OtherProcesses(), "--early-input=" + root_.Path()));
     }
 
     static constexpr const char* kPassword = test::RsyncDaemon::kPassword;
@@ -204,7 +209,7 @@ TEST_F(RsyncWrapperTest, FailuresHaveTheirStatusAndSayInPlainWordsWhatIsWrong) {
         EXPECT_THAT(report_.explanation, AllOf(HasSubstr(words), Not(HasSubstr(kPassword))));
         EXPECT_THAT(test::TakeSyslogTexts(), Contains(HasSubstr(words)));
         EXPECT_EQ(report_.cause == RunCause::UNKNOWN_MODULE,
-                  report_.explanation.find("Unknown module") != std::string::npos);
+                  Has(report_.explanation, "Unknown module"));
     }
     EXPECT_THAT(Tree(module_), IsEmpty());
 }
@@ -233,10 +238,10 @@ TEST_F(RsyncWrapperTest, ARunShowsItsPasswordNowhereAndEndsWithinASecondOfItsCan
         EXPECT_LT(std::chrono::steady_clock::now() - asked, std::chrono::seconds(1));
         EXPECT_EQ(report_.explanation, "the run was cancelled");
         seen += ReadFile(root_.Path("var/log/tarqrsync.log"));
-        EXPECT_THAT(seen, AllOf(HasSubstr("--early-input=" + root_.Path()), HasSubstr("session="),
-                                Not(HasSubstr(kPassword))));
+        EXPECT_TRUE(Has(seen, "--early-input=" + root_.Path()) && Has(seen, "session="));
+        EXPECT_FALSE(Has(seen, kPassword));
         ExpectNothingLeft();
-        EXPECT_THAT(OtherProcesses(), Not(HasSubstr("54321")));
+        EXPECT_FALSE(Has(OtherProcesses(), "54321"));
     }
 }
 
@@ -469,11 +474,11 @@ TEST_F(RsyncWrapperSshTest, APassphraseIsSeenNowhereAndACancelledRunLeavesNoSsh)
         return ++asked > 5;
     };
     EXPECT_EQ(Over(kPassphrase, command_, look), 20);
-    EXPECT_THAT(seen, Not(HasSubstr(kPassphrase)));
+    EXPECT_FALSE(Has(seen, kPassphrase));
     // In the words of ssh itself: rsync holds the same ones quoted.
     const std::string words = "UserKnownHostsFile=\"" + known_hosts_ + "\"" + '\0';
-    EXPECT_THAT(seen, HasSubstr(words));
-    EXPECT_THAT(OtherProcesses(), Not(HasSubstr(words)));
+    EXPECT_TRUE(Has(seen, words));
+    EXPECT_FALSE(Has(OtherProcesses(), words));
     ExpectNothingLeft();
 }
 
