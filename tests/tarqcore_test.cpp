@@ -240,31 +240,29 @@ TEST_F(SectionFile, WritesChangeTheirSectionAlone) {
 }
 
 TEST_F(SectionFile, WhatCouldBreakTheFormatIsRefused) {
-    const char* path = file_.c_str();
-    folder_.Write("file", "[s]\nold=\"1\"\n");
-    const auto refused = [&](const char* section, const char* key, const char* value,
-                             const char* format) {
-        SCOPED_TRACE(std::string(section) + "|" + key + "|" + value);
+    // clang-format off
+    for (const auto& [section, key, value, format] :
+         std::vector<std::tuple<const char*, const char*, const char*, const char*>>{
+         {"a\nb", "k", "v", "%s=%s\n"}, {"a\rb", "k", "v", "%s=%s\n"}, {"a]b", "k", "v", "%s=%s\n"},
+         {"s", "", "v", nullptr}, {"s", "k=", "v", nullptr}, {"s", "\"k", "v", nullptr},
+         {"s", "k\nl", "v", nullptr}, {"s", "k\r", "v", nullptr}, {"s", "#k", "v", nullptr},
+         {"s", "[k", "v", nullptr}, {"s", " k", "v", nullptr}, {"s", "k", "v\nw", nullptr},
+         {"s", "k", "v\r", nullptr}, {"s", "k", "v", "%s=%d\n"}, {"s", "k", "v", "%s=\"%s\""},
+         {"s", "k", "v", "%s\n"}, {"s", "k", "v", "\n%s=\"%s\"\n"}, {"s", "k", "v", ""},
+         {"s", "k", "\"v\"", "%s=%s\n"}, {"s", "k", "v", "x%s=\"%s\"\n"}}) {
+        // clang-format on
+        folder_.Write("file", "[s]\nold=\"1\"\n");
         const Hash values{{key, value}};
+        const char* path = file_.c_str();
         KAPICErrSetEx(0, "", 0);
+        SCOPED_TRACE(std::string(section) + "|" + key + "|" + value);
         EXPECT_EQ(KAPICFileSetSection(path, section, 0, values, format), -1);
         EXPECT_EQ(KAPICErrGet(), 0xD00);
         EXPECT_EQ(KAPICFileAddSection(path, section, values, format), -1);
-        EXPECT_TRUE(format || KAPICIFileModifySection(path, section, 0, values, 1, 0) == -1);
+        if (format == nullptr) {
+            EXPECT_EQ(KAPICIFileModifySection(path, section, 0, values, 1, 0), -1);
+        }
         EXPECT_EQ(test::ReadFile(file_), "[s]\nold=\"1\"\n");
-    };
-    for (const char* section : {"a\nb", "a\rb", "a]b"}) {
-        refused(section, "k", "v", "%s=%s\n");
-    }
-    for (const char* key : {"", "k=", "\"k", "k\nl", "k\r", "#k", "[k", " k"}) {
-        refused("s", key, "v", nullptr);
-    }
-    refused("s", "k", "v\nw", nullptr);
-    refused("s", "k", "v\r", nullptr);
-    refused("s", "k", "\"v\"", "%s=%s\n");
-    for (const char* format :
-         {"%s=%d\n", "%s=\"%s\"", "%s\n", "\n%s=\"%s\"\n", "", "x%s=\"%s\"\n"}) {
-        refused("s", "k", "v", format);
     }
 }
 

@@ -89,10 +89,8 @@ TEST_F(Host, LongSerialsStayApartAndAreTheSameInEveryRoom) {
     }
 }
 
-TEST_F(Host, NameIsTheKernelsUnlessConfigured) {
-    char kernel[65], name[64];
-    ASSERT_EQ(gethostname(kernel, sizeof kernel) + TARQLnxGetHostname(name), 0);
-    EXPECT_EQ(name, std::string(kernel).substr(0, 63));
+TEST_F(Host, NameIsCutToItsRoomAndOneThatBreaksACommandIsNone) {
+    char name[64];
     Configure("[device]\nhostname=\"" + std::string(70, 'n') + "\"\n");
     EXPECT_EQ(TARQLnxGetHostname(name), 0);
     EXPECT_EQ(name, std::string(63, 'n'));
@@ -166,14 +164,12 @@ TEST_F(Host, NameLookupGivesIpv4FirstAndEachAddressOnceAndTellsAnUnknownNameFrom
     EXPECT_EQ(KAPICErrGet(), TARQ_ERR_LOOKUP);
 }
 
-TEST_F(Host, HighAvailabilityIsWhatIsConfigured) {
+TEST_F(Host, HighAvailabilityMacIsOneOfADeviceOrNone) {
     char mac[18] = "#";
-    EXPECT_EQ(TARQHAIsRunning(), 0);
     Configure(
         "[pair]\nrunning=\"yes\"\nmac0=\"02-00-5E-AB-0C-FF\"\nmac1=\"01:00:5e:00:00:01\"\n"
         "mac2=\"00:00:00:00:00:00\"\nmac3=\"02:00:5e:ab:0c\"\nmac4=\"02:00:5e:ab:0c:fg\"\n",
         "tarqha.conf");
-    EXPECT_EQ(TARQHAIsRunning(), 1);
     EXPECT_EQ(TARQHAGetMac(0, mac, sizeof mac), 0);
     EXPECT_STREQ(mac, "02:00:5e:ab:0c:ff");
     for (const int index : {-1, 1, 2, 3, 4, 5}) {
