@@ -178,15 +178,12 @@ TEST_F(SectionFile, TheIndexFindsWhatTheScanFinds) {
 TEST_F(SectionFile, AnEditInPlaceIsSeenAtOnce) {
     folder_.Write("file", "[s]\nk=\"000\"\n");
     const int fd = open(file_.c_str(), O_WRONLY);
-    for (int i = 1; i < 500; ++i) {
-        char digits[16];
-        snprintf(digits, sizeof digits, "%03d", i);
-        ASSERT_EQ(pwrite(fd, digits, 3, 7), 3);
+    for (int i = 100; i < 600; ++i) {
+        const std::string digits = std::to_string(i);
+        ASSERT_EQ(pwrite(fd, digits.data(), 3, 7), 3);
         ASSERT_EQ(Value(file_, "s", "k"), digits);
-        if (i % 100 == 0) {
-            usleep(30'000);  // long enough for the file to be kept in memory
-            ASSERT_EQ(Value(file_, "s", "k"), digits);
-        }
+        usleep(i % 100 == 0 ? 30'000 : 0);  // long enough for the file to be kept in memory
+        ASSERT_EQ(Value(file_, "s", "k"), digits);
     }
     close(fd);
 }

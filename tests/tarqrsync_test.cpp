@@ -123,7 +123,7 @@ TEST(Explanation, ComesFromTheWordsAndTheKindOfRun) {
 }
 
 /// What only odd names and addresses show: plain ones are seen to work against real servers.
-TEST(Arguments, OddNamesAndAddressesComeThroughAndAPasswordIsNone) {
+TEST(Arguments, OddNamesAndAddressesComeThrough) {
     const test::TempRoot root;
     PrivateFolder folder;
     Config config;
@@ -147,8 +147,6 @@ TEST(Arguments, OddNamesAndAddressesComeThroughAndAPasswordIsNone) {
     EXPECT_THAT(made.environment,
                 Contains(AllOf(StartsWith("RSYNC_CONNECT_PROG='ssh' '-J' 'it'\\''s'"),
                                EndsWith("'-W' '127.0.0.1:873' '--' 'fe80::1%%eth0'"))));
-    EXPECT_THAT(made.arguments, Each(Not(HasSubstr("secret\n"))));
-    EXPECT_THAT(made.environment, Each(Not(HasSubstr("secret\n"))));
 
     settings.module = "/a dir";
     settings.password.clear();
