@@ -268,9 +268,11 @@ TEST_F(RsyncWrapperTest, ACopyMirrorsContentAttributesAndDeletions) {
     EXPECT_EQ(Copy([](auto& w) { w.setDelete(false); }), 0);
     std::vector<std::string> listed;
     RunOptions options;
-    options.on_change = [&](const RunChange& c) { listed.push_back(c.path); };
+    options.on_change = [&](const RunChange& c) {
+        listed.push_back(std::to_string(c.kind) + " " + std::to_string(c.length) + " " + c.path);
+    };
     EXPECT_EQ(Copy([](auto& w) { w.setListOnly(true); }, options), 0);
-    EXPECT_THAT(listed, IsSupersetOf({"new\nline", "kept"}));
+    EXPECT_THAT(listed, IsSupersetOf({"0 0 new\nline", "0 7 a/file", "0 3 kept", "2 0 ./"}));
 }
 
 TEST_F(RsyncWrapperTest, ARelativeSubTreeDeletesNothingOutsideOfIt) {
