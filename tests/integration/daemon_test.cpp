@@ -47,14 +47,12 @@ protected:
                           more);
     }
     static PObject TaskOf(ZEL::SCHD_MODE mode = ZEL::SCHD_MODE_REALTIME) {
-        PObject request = Request("task_add");
-        request["name"] = "t";
-        request["share_list"].asArray().emplace_back("docs");
-        request["server_ip"] = "127.0.0.1";
-        request["user"] = "alice";
-        request["pswd"] = "secret";
-        request["schedule_mode"] = static_cast<int>(mode);
-        return request;
+        PObject task;
+        task = PObject::Map{{"command", "task_add"},    {"name", "t"},
+                            {"server_ip", "127.0.0.1"}, {"user", "alice"},
+                            {"pswd", "secret"},         {"schedule_mode", static_cast<int>(mode)}};
+        task["share_list"].asArray().emplace_back("docs");
+        return task;
     }
     void AddTask(ZEL::SCHD_MODE mode = ZEL::SCHD_MODE_REALTIME) {
         ASSERT_EQ(Result(TaskOf(mode)), 0);
@@ -117,8 +115,10 @@ TEST_F(DaemonTest, WhatChangesOnDiskIsSoonAtTheServer) {
         {"rename", [&] { fs::rename(in("new"), in("renamed")); }},
         {"delete", [&] { fs::remove(in("renamed")); }},
         {"a tree moved in", [&] { fs::rename(outside + "/tree", in("tree")); }},
+        {"changed below", [&] { Write("tree/deep/x", "changed"); }},
         {"a tree renamed", [&] { fs::rename(in("tree"), in("sub/tree2")); }},
         {"a tree moved out", [&] { fs::rename(in("sub/tree2"), outside + "/tree"); }},
+        {"a dangling link", [&] { fs::create_symlink("/nowhere", in("dangling")); }},
         {"a link to a folder outside", [&] { fs::create_symlink(outside, in("out")); }},
         {"a folder, then a link in its place",
          [&] {
@@ -154,10 +154,7 @@ TEST_F(DaemonTest, WhatChangesOnDiskIsSoonAtTheServer) {
         }
     }
     EXPECT_EQ(Runs().front()["error"].asString(), "");
-}
-
-TEST_F(DaemonTest, ChangesWithinASecondThatKeepTheSizeAreAllSent) {
-    StartRealtime();
+    // Changes within a second that keep the size.
     for (int i = 0; i < 12; ++i) {
         Write("counter", std::to_string(i % 10));
         AwaitEqual(std::to_string(i), 20);
@@ -380,17 +377,22 @@ TEST_F(DaemonTest, ABadRequestIsRefusedInWordsAndChangesNothing) {
     } cases[] = {
         {PObject(), "command", {"no such", "task_show", "", 5, unknown}},
         {Request("task_show"), "task", {"none", 7, unknown}},
+        {Request("task_run"), "task", {"none"}},
         {Request("task_cancel"), "task", {"t", "none"}},
+        {Request("watch"), "task", {"none"}},
         {Request("task_list"), "brief", {"yes", 2}},
         {Request("task_list"), "colour", {1}},
         {Request("task_log", "t"), "limit", {-1, 100000, "x"}},
         {add, "share_list", {"docs", numbers, unknown, many, PObject()}},
         {add, "name", {"t", "a\nb", "", std::string(60000, 'n'), 5}},
         {add, "schedule_mode", {"x", 99}},
+        {add, "rsync_timeout", {5}},
         {add, "ssh_port", {1 << 20}},
         {add, "user", {""}},
+        {add, "paused", {1}},
         {add, "", {1}},
         {Request("task_edit", "t"), "id", {9}},
+        {Request("task_edit", "t"), "name", {""}},
         {Request("task_edit", "t"), "share_list", {PObject(), unknown}},
     };
     std::vector<PObject> requests = {"text", 7, PObject(), unknown};  // no maps

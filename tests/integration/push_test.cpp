@@ -62,6 +62,8 @@ TEST_F(PushTest, OnlyTheChangeTravelsAndADeletionIsOne) {
 
 TEST_F(PushTest, EachFailureHasItsOwnErrorAndTheNextPushCompletesTheCopy) {
     EXPECT_THAT(Push("", "wrong"), Ended(1, "password"));
+    EXPECT_THAT(Client("push docs -s no.such.invalid -u alice --password-file -", "secret\n"),
+                Ended(1, "cannot be looked up"));
     StopServer();
     EXPECT_THAT(Push(), Ended(1, "refused"));
     StartServer();
@@ -162,6 +164,8 @@ TEST_F(PushTest, CommandsOfMischiefChangeNothing) {
     const std::pair<std::string, std::string> cases[] = {
         {start + "shareName=\"../../etc\"\n", "status=\"201\"\n"},
         {start + "shareName=\"x\"\ncommand=\"ZEL_Pairing\"\n", "status=\"201\"\n"},
+        {head + "command=\"ZEL_Pairing\"\nclientID=\"C\"\nserverName=\"x\ndryRun=\"no\"\"\n",
+         "status=\"201\"\n"},
         {start + "shareName=\"x\"\n" + std::string(4800, '#'), "status=\"201\"\n"},
         {std::string(5000, '\xff'), ""},
         {"", ""},
