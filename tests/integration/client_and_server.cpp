@@ -1,27 +1,43 @@
 #include "tests/integration/client_and_server.h"
 
 #include <gtest/gtest.h>
-
-#include <filesystem>
-
-namespace fs = std::filesystem;
+#include <sys/mount.h>
 
 namespace test {
 
+Outcome Zelctl(const std::string& root, const std::string& arguments, const std::string& input,
+               const std::string& before) {
+    return RunProgram(root, {"sh", "-c", before + "exec " ZELCTL " " + arguments}, input);
+}
+
 ClientAndServer::ClientAndServer() : port_(FreePort()) {
-    for (const char* folder : {"client/usr/tarq/etc", "source"}) {
-        fs::create_directories(folder_.Path(folder));
-    }
-    Must(Server({"setup", "--storage", storage_, "--port", std::to_string(port_), "--address",
-                 "127.0.0.1"}));
-    Must(Server({"account", "add", "alice", "--password-file", "-"}, "secret\n"));
+    SetUpServer();
+    Must(Server("account add alice --password-file -", "secret\n"));
     StartServer();
     Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\n");
     folder_.Write("client/usr/tarq/etc/tarqsdk.conf", "[device]\nserial=\"CLIENT-1\"\n");
     Write("a.txt", "alpha");
     Write("sub/b.txt", "beta");
     Write("-n\n odd \xc3\xa4", "odd");
-    Must(Client({"share", "add", "docs", source_}));
+    Must(Client("share add docs " + source_));
+}
+
+ClientAndServer::~ClientAndServer() {
+    umount2(storage_.c_str(), MNT_DETACH);
+}
+
+void ClientAndServer::SetUpServer() const {
+    Must(Server("setup --address 127.0.0.1 --storage " + storage_ + " --port " +
+                std::to_string(port_)));
+}
+
+bool ClientAndServer::PutStorageOnDisk(const std::string& size) {
+    const unsigned long again = on_disk_ ? MS_REMOUNT : 0;
+    on_disk_ = mount("tmpfs", storage_.c_str(), "tmpfs", again, ("size=" + size).c_str()) == 0;
+    if (on_disk_) {
+        SetUpServer();  // which notes the disk
+    }
+    return on_disk_;
 }
 
 void ClientAndServer::StartServer() {
@@ -38,25 +54,18 @@ void ClientAndServer::Write(const std::string& name, const std::string& content)
     folder_.Write("source/" + name, content);
 }
 
-Outcome ClientAndServer::Server(std::vector<std::string> arguments,
-                                const std::string& input) const {
-    arguments.insert(arguments.begin(), ZEL_SERVER);
-    return RunProgram(folder_.Path("server"), arguments, input);
+Outcome ClientAndServer::Server(const std::string& arguments, const std::string& input) const {
+    return RunProgram(folder_.Path("server"), {"sh", "-c", "exec " ZEL_SERVER " " + arguments},
+                      input);
 }
 
-Outcome ClientAndServer::Client(std::vector<std::string> arguments, const std::string& input,
-                                const std::function<bool()>& cancelled) const {
-    arguments.insert(arguments.begin(), ZELCTL);
-    return RunProgram(folder_.Path("client"), arguments, input, cancelled);
-}
-
-std::string ClientAndServer::Differences(const std::string& share) const {
-    const Outcome compared = RunProgram("", {"diff", "-r", source_, storage_ + "/" + share});
-    return compared.exit_code == 0 ? "" : "differs: " + compared.output;
+Outcome ClientAndServer::Client(const std::string& arguments, const std::string& input,
+                                const std::string& before) const {
+    return Zelctl(folder_.Path("client"), arguments, input, before);
 }
 
 void ClientAndServer::ExpectCopyIsComplete() const {
-    EXPECT_EQ(Differences(), "");
+    EXPECT_EQ(RunProgram("", {"diff", "-r", source_, storage_ + "/docs"}).output, "");
 }
 
 }  // namespace test

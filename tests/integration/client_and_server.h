@@ -4,9 +4,7 @@
 
 #include <gmock/gmock.h>
 
-#include <functional>
 #include <string>
-#include <vector>
 
 #include "tests/integration/servers.h"
 #include "tests/support/temp_root.h"
@@ -19,11 +17,17 @@ inline testing::Matcher<Outcome> Ended(int exit_code, const std::string& text = 
                           testing::Field(&Outcome::output, testing::HasSubstr(text)));
 }
 
+/// Runs zelctl below a root folder with arguments as a shell takes them. `before`: what the shell
+/// does before it becomes the program.
+Outcome Zelctl(const std::string& root, const std::string& arguments, const std::string& input = "",
+               const std::string& before = "");
+
 /// A server with the account "alice" (password "secret"), and a client "CLIENT-1" that knows how to
 /// find it and has the share "docs" with three files.
 class ClientAndServer {
 public:
     ClientAndServer();
+    ~ClientAndServer();
 
     void StartServer();
     void StopServer() { daemon_.Stop(); }
@@ -33,13 +37,20 @@ public:
     /// Writes a file of the share.
     void Write(const std::string& name, const std::string& content) const;
 
-    Outcome Server(std::vector<std::string> arguments, const std::string& input = "") const;
-    Outcome Client(std::vector<std::string> arguments, const std::string& input = "",
-                   const std::function<bool()>& cancelled = nullptr) const;
+    /// Run zel_server and zelctl, see Zelctl().
+    Outcome Server(const std::string& arguments, const std::string& input = "") const;
+    Outcome Client(const std::string& arguments, const std::string& input = "",
+                   const std::string& before = "") const;
 
-    /// What differs between the share and its copy; empty when nothing does.
-    std::string Differences(const std::string& share = "docs") const;
+    /// Gives the server's storage a disk of its own, or that one another size. False where the test
+    /// may mount none.
+    bool PutStorageOnDisk(const std::string& size);
     void ExpectCopyIsComplete() const;
+
+private:
+    void SetUpServer() const;
+
+    bool on_disk_ = false;
 
 protected:
     TempFolder folder_;
