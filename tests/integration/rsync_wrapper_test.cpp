@@ -374,6 +374,22 @@ TEST_F(RsyncWrapperTest, AKilledPushNeverLeavesHalfAFileUnderItsNameAndTheNextOn
     }
 }
 
+TEST_F(RsyncWrapperTest, AnRsyncThatIsMissingOrTooOldIsNamed) {
+    Configure("rsync=\"no-such-rsync\"\n");
+    EXPECT_EQ(Copy(), 127);
+    EXPECT_EQ(report_.explanation, "the program no-such-rsync is not installed");
+    const std::string old = Script(
+        "old",
+        "[ \"$1\" = --version ] && { echo 'rsync  version 3.1.3  protocol version 31'; exit; }\n"
+        "echo 'rsync: --early-input=x: unknown option' >&2; exit 1\n");
+    Configure("rsync=\"" + old + "\"\n");
+    EXPECT_EQ(Command({"command=\"X\""}), 1);
+    EXPECT_THAT(report_.explanation, StartsWith(old + " is rsync 3.1.3, which is too old"));
+    root_.Write("usr/tarq/etc/tarqrsync.conf", "[rsync]\nport=\"many\"\n");
+    EXPECT_EQ(Copy(), 1);
+    EXPECT_THAT(report_.explanation, HasSubstr("port 'many'"));
+}
+
 TEST_F(RsyncWrapperTest, TheDebugLogIsRotatedAndAFolderWithoutRightsIsNoFailure) {
     AddToSource("file");
     const auto logged = [](RsyncWrapper& w) { w.setDebugLog(true); };
