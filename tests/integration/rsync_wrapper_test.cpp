@@ -375,6 +375,7 @@ TEST_F(RsyncWrapperTest, AKilledPushNeverLeavesHalfAFileUnderItsNameAndTheNextOn
 }
 
 TEST_F(RsyncWrapperTest, AnRsyncThatIsMissingOrTooOldIsNamed) {
+    AddToSource("file");
     Configure("rsync=\"no-such-rsync\"\n");
     EXPECT_EQ(Copy(), 127);
     EXPECT_EQ(report_.explanation, "the program no-such-rsync is not installed");
