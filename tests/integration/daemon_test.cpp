@@ -187,8 +187,9 @@ TEST_F(DaemonTest, AFloodOfChangesCostsFewRuns) {
 }
 
 TEST_F(DaemonTest, AnOverflowOfTheQueueIsMadeUpForByOneComparison) {
-    Write("over0/watched", "");
-    Write("over1/watched", "");
+    for (const char* watched : {"over0/watched", "over1/watched", "elsewhere/watched"}) {
+        Write(watched, "");
+    }
     StartRealtime();
     const uint64_t before = RsyncRuns();
     std::ifstream queue("/proc/sys/fs/inotify/max_queued_events");
@@ -198,6 +199,7 @@ TEST_F(DaemonTest, AnOverflowOfTheQueueIsMadeUpForByOneComparison) {
     for (int i = 0; i < events / 2 + 100; ++i) {  // each is made and closed
         Write("over" + std::to_string(i % 2) + "/" + std::to_string(i), "");
     }
+    Write("elsewhere/lost", "");  // nothing else tells of this folder
     zel_.Signal(SIGCONT);
     AwaitEqual("overflow");
     EXPECT_THAT(zel_.Log(), HasSubstr("too many changes at once; it is compared whole"));
