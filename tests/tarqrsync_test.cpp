@@ -16,15 +16,16 @@ using namespace testing;
 
 TEST(Answer, OnlyAPlainDecimalStatusInTheFirstLineIsTaken) {
     Answer answer;
-    EXPECT_TRUE(ParseAnswer(std::string("status=\"999999999\"\n\0z", 21), &answer));
+    const std::string text("status=\"999999999\"\n\0z", 21);
+    EXPECT_TRUE(ParseAnswer(text, &answer));
     EXPECT_EQ(answer.status, 999999999);
     EXPECT_EQ(answer.content, std::string("\0z", 2));
     for (const char* number : {"1000000000", "00", "-1", "+1", " 1", "1 ", ""}) {
         EXPECT_FALSE(ParseAnswer("status=\"" + std::string(number) + "\"\n", &answer)) << number;
     }
-    for (const char* text : {"status=\"1\"", "status=\"1\" \n", "status=\"\n", "xstatus=\"1\"\n",
-                             "\nstatus=\"1\"\n", ""}) {
-        EXPECT_FALSE(ParseAnswer(text, &answer)) << text;
+    for (const char* no_answer : {"status=\"1\"", "status=\"1\" \n", "status=\"\n",
+                                  "xstatus=\"1\"\n", "\nstatus=\"1\"\n", ""}) {
+        EXPECT_FALSE(ParseAnswer(no_answer, &answer)) << no_answer;
     }
     EXPECT_EQ(OutfileOf({"command=\"a\"", "outfile=\"/tmp/x y\"", "outfile=\"/no\""}), "/tmp/x y");
     for (const char* line : {"outfile=\"", "outfile=\"\"", "myoutfile=\"/x\"", "outfile=/x", ""}) {
