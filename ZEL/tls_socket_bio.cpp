@@ -3,6 +3,9 @@
 #include <errno.h>
 #include <sys/socket.h>
 
+#include <memory>
+#include <new>
+
 namespace ZEL {
 
 namespace {
@@ -75,9 +78,13 @@ const BIO_METHOD* MakeMethod() {
 
 BIO* NewTlsSocketBio(int fd) {
     static const BIO_METHOD* const method = MakeMethod();
-    BIO* bio = fd < 0 || method == nullptr ? nullptr : BIO_new(method);
+    if (fd < 0 || method == nullptr) {
+        return nullptr;
+    }
+    std::unique_ptr<Data> data(new (std::nothrow) Data{fd, {}});
+    BIO* bio = data == nullptr ? nullptr : BIO_new(method);
     if (bio != nullptr) {
-        BIO_set_data(bio, new Data{fd, {}});
+        BIO_set_data(bio, data.release());
         BIO_set_init(bio, 1);
     }
     return bio;
