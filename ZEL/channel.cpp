@@ -15,14 +15,16 @@
 #include <typeinfo>
 
 #include "ZEL/internal/channel_socket.h"
-#include "ZEL/internal/unique_fd.h"
 #include "ZEL/log.h"
+#include "base/unique_fd.h"
 
 namespace ZEL {
 
 static_assert(__BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__, "Convert() makes wire order by reversing");
 
 namespace {
+
+using base::UniqueFd;
 
 using std::chrono::steady_clock;
 

@@ -13,13 +13,15 @@
 #include <algorithm>
 
 #include "ZEL/internal/channel_socket.h"
-#include "ZEL/internal/unique_fd.h"
 #include "ZEL/log.h"
 #include "ZEL/stream.h"
+#include "base/unique_fd.h"
 
 namespace ZEL {
 
 namespace {
+
+using base::UniqueFd;
 
 constexpr int kBacklog = 8;
 constexpr unsigned int kChannelCapacity = 81920;

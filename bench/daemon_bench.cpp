@@ -25,9 +25,9 @@
 
 #include "ZEL/ipc.h"
 #include "ZEL/sync_obj.h"
+#include "base/unique_fd.h"
 #include "bench/large_tree.h"
 #include "platform/internal/child_process.h"
-#include "platform/internal/unique_fd.h"
 #include "tests/integration/daemon_process.h"
 #include "tests/integration/servers.h"
 
@@ -154,7 +154,7 @@ public:
         const std::string copy = root_.Path("storage/data");
         Must(test::Await([&] { return fs::exists(copy + "/first") && IsIdle("changes"); }),
              "the first copy was not made");
-        const tarq_internal::UniqueFd watch(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+        const base::UniqueFd watch(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
         Must(inotify_add_watch(watch.Get(), copy.c_str(), IN_MOVED_TO) >= 0, "inotify");
         int number = 0;
         const auto change = [&] { root_.Write("data/file", std::to_string(++number)); };

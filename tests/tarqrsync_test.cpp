@@ -1,5 +1,5 @@
+#include "base/unique_fd.h"
 #include "platform/internal/child_process.h"
-#include "platform/internal/unique_fd.h"
 #include "platform/tarqrsync/answer_file.h"
 #include "platform/tarqrsync/arguments.h"
 #include "platform/tarqrsync/explain.h"
@@ -170,7 +170,7 @@ std::string Shell(const std::string& script, ChildResult* result, ChildSetup set
 
 TEST(ChildProcess, InheritsNothingOfTheHost) {
     constexpr int kLeaked = 77;  // not close-on-exec
-    const tarq_internal::UniqueFd leaked(dup2(STDERR_FILENO, kLeaked));
+    const base::UniqueFd leaked(dup2(STDERR_FILENO, kLeaked));
     signal(SIGUSR1, SIG_IGN);
     sigset_t blocked, before;
     sigemptyset(&blocked);

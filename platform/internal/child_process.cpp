@@ -16,12 +16,14 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 #include "platform/internal/write_all.h"
 
 namespace tarq_internal {
 
 namespace {
+
+using base::UniqueFd;
 
 using Clock = std::chrono::steady_clock;
 using std::chrono::microseconds;

@@ -9,10 +9,12 @@
 #include <cerrno>
 #include <cstring>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 
 namespace tarq_internal {
 namespace {
+
+using base::UniqueFd;
 
 constexpr int kHashCapacity = 16;
 

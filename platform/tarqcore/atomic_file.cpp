@@ -6,14 +6,14 @@
 #include <sys/file.h>
 #include <unistd.h>
 
+#include "base/unique_fd.h"
 #include "platform/internal/error.h"
-#include "platform/internal/unique_fd.h"
 
 namespace tarqcore {
 namespace {
 
+using base::UniqueFd;
 using tarq_internal::Fail;
-using tarq_internal::UniqueFd;
 
 // Names that writers of one file may hold at the same time.
 constexpr int kTemporaryNames = 16;

@@ -8,10 +8,10 @@
 #include <string>
 #include <string_view>
 
+#include "base/unique_fd.h"
 #include "platform/internal/error.h"
-#include "platform/internal/unique_fd.h"
 
-using tarq_internal::UniqueFd;
+using base::UniqueFd;
 
 namespace {
 

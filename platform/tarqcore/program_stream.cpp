@@ -12,12 +12,12 @@
 #include <mutex>
 #include <vector>
 
+#include "base/unique_fd.h"
 #include "platform/internal/error.h"
-#include "platform/internal/unique_fd.h"
 
+using base::UniqueFd;
 using tarq_internal::Fail;
 using tarq_internal::Guarded;
-using tarq_internal::UniqueFd;
 
 namespace {
 

@@ -10,14 +10,14 @@
 #include <mutex>
 #include <string_view>
 
+#include "base/unique_fd.h"
 #include "platform/internal/error.h"
-#include "platform/internal/unique_fd.h"
 
 namespace tarqcore {
 namespace {
 
+using base::UniqueFd;
 using tarq_internal::Fail;
-using tarq_internal::UniqueFd;
 
 // Files whose images are kept: the registry, the share catalogue, a few configuration files.
 constexpr size_t kMaxCachedFiles = 8;

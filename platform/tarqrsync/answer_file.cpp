@@ -8,7 +8,7 @@
 #include <cerrno>
 #include <charconv>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 #include "platform/internal/write_all.h"
 
 namespace TARQ {
@@ -51,8 +51,7 @@ bool ParseAnswer(std::string_view text, Answer* answer) {
 
 bool ReadAnswerFile(const std::string& path, std::string* text) {
     // Without O_NONBLOCK the opening of a FIFO would wait for a writer.
-    const tarq_internal::UniqueFd fd(
-        open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+    const base::UniqueFd fd(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
     struct stat info;
     if (!fd || fstat(fd.Get(), &info) != 0) {
         return false;
@@ -81,7 +80,7 @@ bool ReadAnswerFile(const std::string& path, std::string* text) {
 }
 
 bool WriteOutfile(const std::string& path, const std::string& content) {
-    const tarq_internal::UniqueFd fd(open(
+    const base::UniqueFd fd(open(
         path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0600));
     return fd && tarq_internal::WriteAll(fd.Get(), content);
 }

@@ -10,7 +10,7 @@
 #include <filesystem>
 #include <system_error>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 #include "platform/internal/write_all.h"
 #include "tarq/root_path.h"
 
@@ -43,7 +43,7 @@ std::string PrivateFolder::Path(const std::string& name) {
 std::string PrivateFolder::Write(const std::string& name, const std::string& content,
                                  bool executable) {
     std::string path = Path(name);
-    const tarq_internal::UniqueFd fd(
+    const base::UniqueFd fd(
         open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, executable ? 0700 : 0600));
     if (!fd || !tarq_internal::WriteAll(fd.Get(), content)) {
         throw PrivateFileError("cannot write " + path);

@@ -14,9 +14,9 @@
 #include <charconv>
 #include <cstring>
 
+#include "base/unique_fd.h"
 #include "platform/internal/child_process.h"
 #include "platform/internal/config.h"
-#include "platform/internal/unique_fd.h"
 #include "platform/tarqrsync/answer_file.h"
 #include "platform/tarqrsync/message_keeper.h"
 #include "tarq/root_path.h"
@@ -50,7 +50,7 @@ std::string PrepareLog() {
     if (stat(path.c_str(), &info) == 0 && info.st_size >= kMaxLogBytes) {
         rename(path.c_str(), (path + ".1").c_str());
     }
-    const tarq_internal::UniqueFd log(open(
+    const base::UniqueFd log(open(
         path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0640));
     const bool usable =
         log && fstat(log.Get(), &info) == 0 && S_ISREG(info.st_mode) && info.st_size < kMaxLogBytes;
@@ -153,7 +153,7 @@ public:
 
 private:
     std::string answer_file_;
-    tarq_internal::UniqueFd notify_;
+    base::UniqueFd notify_;
 };
 
 }  // namespace

@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 #include "platform/tarqshare/volume.h"
 
 namespace tarq_share {
@@ -56,7 +56,7 @@ public:
     explicit operator bool() const { return locked_; }
 
 private:
-    tarq_internal::UniqueFd file_;
+    base::UniqueFd file_;
     bool locked_ = false;
 };
 

@@ -15,9 +15,9 @@
 #include <optional>
 #include <string>
 
+#include "base/unique_fd.h"
 #include "platform/internal/config.h"
 #include "platform/internal/error.h"
-#include "platform/internal/unique_fd.h"
 #include "platform/tarqshare/catalogue.h"
 #include "platform/tarqshare/mount_table.h"
 #include "platform/tarqshare/volume.h"
@@ -26,10 +26,10 @@ static_assert(sizeof(TARQVolumePath) == 132, "callers know the record by its siz
 
 namespace {
 
+using base::UniqueFd;
 using tarq_internal::CopyOut;
 using tarq_internal::Fail;
 using tarq_internal::Guarded;
-using tarq_internal::UniqueFd;
 using tarq_share::FindVolume;
 using tarq_share::IsWithin;
 using tarq_share::ReadShare;

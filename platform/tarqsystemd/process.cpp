@@ -23,10 +23,10 @@ extern "C" {  // the header has no such thing of its own
 namespace tarq_systemd {
 namespace {
 
+using base::UniqueFd;
 using std::chrono::duration_cast;
 using std::chrono::milliseconds;
 using std::chrono::steady_clock;
-using tarq_internal::UniqueFd;
 
 constexpr int kStartTimeField = 22;  // of /proc/<pid>/stat, counted from 1
 constexpr int kLinkFd = 3;  // in the background process: the first after the standard streams

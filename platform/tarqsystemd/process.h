@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 
 namespace tarq_systemd {
 
@@ -37,10 +37,10 @@ public:
     bool WaitForEnd(std::chrono::milliseconds limit) const;
 
 private:
-    Process(pid_t pid, tarq_internal::UniqueFd handle) : pid_(pid), handle_(std::move(handle)) {}
+    Process(pid_t pid, base::UniqueFd handle) : pid_(pid), handle_(std::move(handle)) {}
 
     pid_t pid_;
-    tarq_internal::UniqueFd handle_;
+    base::UniqueFd handle_;
 };
 
 /// Splits a command into words at blanks; what stands in single or double quotes is taken as it
@@ -61,12 +61,10 @@ public:
     bool Release();
 
 private:
-    BackgroundLaunch(ProcessId id, tarq_internal::UniqueFd link)
-        : id_(id), link_(std::move(link)) {}
+    BackgroundLaunch(ProcessId id, base::UniqueFd link) : id_(id), link_(std::move(link)) {}
 
     ProcessId id_;
-    tarq_internal::UniqueFd
-        link_;  ///< to the waiting process; its end closes when the command runs
+    base::UniqueFd link_;  ///< to the waiting process; its end closes when the command runs
 };
 
 }  // namespace tarq_systemd

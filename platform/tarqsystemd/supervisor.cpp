@@ -15,16 +15,16 @@
 #include <sstream>
 #include <vector>
 
+#include "base/unique_fd.h"
 #include "platform/internal/config.h"
-#include "platform/internal/unique_fd.h"
 #include "platform/tarqsystemd/process.h"
 
 namespace tarq_systemd {
 namespace {
 
+using base::UniqueFd;
 using std::chrono::seconds;
 using tarq_internal::ReadResult;
-using tarq_internal::UniqueFd;
 
 constexpr char kConfiguration[] = "/usr/tarq/etc/tarqsystemd.conf";
 constexpr char kRunFolder[] = "/var/run/";

@@ -7,14 +7,14 @@
 #include <cerrno>
 #include <cstdio>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 #include "platform/internal/write_all.h"
 
 namespace programs {
 
 namespace {
 
-using tarq_internal::UniqueFd;
+using base::UniqueFd;
 
 void SyncFolderOf(const std::string& path) {
     const UniqueFd folder(

@@ -1,9 +1,7 @@
 #include "programs/common/task_run.h"
 
 #include <fcntl.h>
-#include <linux/openat2.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -15,7 +13,8 @@
 
 #include "ZEL/rsyncer.h"
 #include "ZEL/zel.h"
-#include "platform/internal/unique_fd.h"
+#include "base/open_beneath.h"
+#include "base/unique_fd.h"
 #include "programs/common/server_status.h"
 #include "programs/common/text.h"
 
@@ -152,12 +151,8 @@ bool IsBelow(const std::string& path, const std::string& folder) {
 // `folder`) that no link on the way leads to, so that nothing outside the share is ever sent. A
 // link is sent with the folder that it is in.
 bool IsPresent(int folder, const std::string& path) {
-    open_how how = {};
-    how.flags = O_PATH | O_NOFOLLOW | O_CLOEXEC;
-    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS;
-    const char* below = path.c_str() + path.find_first_not_of('/');
-    const tarq_internal::UniqueFd entry(
-        static_cast<int>(syscall(SYS_openat2, folder, below, &how, sizeof how)));
+    const base::UniqueFd entry =
+        base::OpenBeneath(folder, path.substr(path.find_first_not_of('/')), O_PATH);
     struct stat info = {};
     return entry && fstat(entry.Get(), &info) == 0 && !S_ISLNK(info.st_mode);
 }
@@ -166,7 +161,7 @@ bool IsPresent(int folder, const std::string& path) {
 // where the deletion is seen. No path is below another one.
 std::vector<std::string> PresentPaths(const std::string& folder,
                                       const std::vector<std::string>& paths) {
-    const tarq_internal::UniqueFd root(open(folder.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    const base::UniqueFd root(open(folder.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
     std::vector<std::string> present;
     for (std::string path : paths) {
         while (path.find_first_not_of('/') != std::string::npos && !IsPresent(root.Get(), path)) {

@@ -13,7 +13,7 @@ namespace zel_daemon {
 
 namespace {
 
-using tarq_internal::UniqueFd;
+using base::UniqueFd;
 
 // The starter: 0 once the daemon is ready, what it ended with otherwise.
 [[noreturn]] void WaitForReady(UniqueFd ready, pid_t daemon) {

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 
 namespace zel_daemon {
 
@@ -14,7 +14,7 @@ public:
     void Ready();
 
 private:
-    tarq_internal::UniqueFd ready_;
+    base::UniqueFd ready_;
 };
 
 }  // namespace zel_daemon

@@ -16,13 +16,13 @@
 #include <system_error>
 #include <utility>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 
 namespace zel_daemon {
 
 namespace {
 
-using tarq_internal::UniqueFd;
+using base::UniqueFd;
 
 // How late a timer may be, so that the machine need not wake for each alone.
 constexpr uint64_t kTimerSlackUs = 10000;

@@ -7,7 +7,7 @@
 #include <optional>
 #include <string_view>
 
-#include "ZEL/internal/unique_fd.h"
+#include "base/unique_fd.h"
 
 namespace zel_daemon {
 
@@ -38,7 +38,7 @@ public:
     bool Buffered() const { return at_ < size_; }
 
 private:
-    ZEL::UniqueFd fd_;
+    base::UniqueFd fd_;
     std::unique_ptr<char[]> buffer_;
     size_t size_ = 0;
     size_t at_ = 0;

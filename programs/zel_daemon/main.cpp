@@ -12,7 +12,7 @@
 #include <thread>
 
 #include "ZEL/log.h"
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 #include "programs/common/task_run.h"
 #include "programs/zel_daemon/background.h"
 #include "programs/zel_daemon/daemon_config.h"
@@ -54,9 +54,9 @@ void StartLog(const Options& options) {
 }
 
 // Two daemons on one store would run every task twice. The lock goes with the process.
-tarq_internal::UniqueFd TakeLock() {
+base::UniqueFd TakeLock() {
     const std::string path = TARQ::RootPath(kLockPath);
-    tarq_internal::UniqueFd lock(open(path.c_str(), O_CREAT | O_RDWR | O_CLOEXEC, 0600));
+    base::UniqueFd lock(open(path.c_str(), O_CREAT | O_RDWR | O_CLOEXEC, 0600));
     if (!lock) {
         throw std::runtime_error("cannot open " + path + ": " + strerror(errno));
     }
@@ -102,7 +102,7 @@ void Serve(const Options& options) {
     }
     StartLog(options);
     PrepareFolders();
-    const tarq_internal::UniqueFd lock = TakeLock();
+    const base::UniqueFd lock = TakeLock();
     const DaemonConfig config = ReadConfigOrThrow();
 
     EventLoop loop;

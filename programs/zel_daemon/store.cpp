@@ -8,7 +8,7 @@
 #include <cerrno>
 #include <system_error>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 #include "programs/zel_daemon/store_schema.h"
 #include "programs/zel_daemon/stored_task.h"
 
@@ -16,7 +16,7 @@ namespace zel_daemon {
 
 namespace {
 
-using tarq_internal::UniqueFd;
+using base::UniqueFd;
 
 constexpr char kStopped[] = "the daemon was stopped";
 

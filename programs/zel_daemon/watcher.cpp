@@ -15,10 +15,8 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <limits.h>
-#include <linux/openat2.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -29,6 +27,7 @@
 #include <utility>
 #include <vector>
 
+#include "base/open_beneath.h"
 #include "programs/zel_daemon/folder_table.h"
 #include "programs/zel_daemon/inotify.h"
 
@@ -36,7 +35,7 @@ namespace zel_daemon {
 
 namespace {
 
-using ZEL::UniqueFd;
+using base::UniqueFd;
 
 /// Work goes in turns of some events and some steps of search: enough events that the kernel's
 /// queue does not overflow meanwhile (16,384 unless set otherwise), and enough steps that a flood
@@ -64,11 +63,8 @@ bool IsGone(int error) {
 
 /// Opens the folder at `path` below `root`, which no symbolic link on the way leads to.
 UniqueFd OpenFolder(int root, const std::string& path) {
-    open_how how = {};
-    how.flags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
-    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS;
-    const char* relative = path.empty() ? "." : path.c_str() + 1;
-    return UniqueFd(static_cast<int>(syscall(SYS_openat2, root, relative, &how, sizeof(how))));
+    return base::OpenBeneath(root, path.empty() ? path : path.substr(1),
+                             O_RDONLY | O_DIRECTORY | O_NONBLOCK);
 }
 
 bool IsFolder(int parent, const dirent64& entry) {

@@ -16,7 +16,7 @@ constexpr char kName[] = "localtime";
 }  // namespace
 
 ZoneWatch::ZoneWatch() {
-    tarq_internal::UniqueFd fd(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+    base::UniqueFd fd(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
     if (fd && inotify_add_watch(fd.Get(), kFolder, IN_CREATE | IN_MOVED_TO | IN_CLOSE_WRITE) >= 0) {
         fd_ = std::move(fd);
     }

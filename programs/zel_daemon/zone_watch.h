@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 
 namespace zel_daemon {
 
@@ -18,7 +18,7 @@ public:
     bool Changed();
 
 private:
-    tarq_internal::UniqueFd fd_;
+    base::UniqueFd fd_;
 };
 
 }  // namespace zel_daemon

@@ -9,14 +9,14 @@
 #include <ctime>
 #include <memory>
 
-#include "platform/internal/unique_fd.h"
+#include "base/unique_fd.h"
 #include "programs/zel_server/server_config.h"
 
 namespace zel_server {
 
 namespace {
 
-using tarq_internal::UniqueFd;
+using base::UniqueFd;
 
 // Long after any client has taken its answer; a connection that died before leaves one behind.
 constexpr time_t kStaleAfter = 600;

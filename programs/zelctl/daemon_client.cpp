@@ -7,8 +7,8 @@
 #include <cerrno>
 #include <cstring>
 
-#include "ZEL/internal/unique_fd.h"
 #include "ZEL/stream.h"
+#include "base/unique_fd.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/interrupt.h"
 #include "tarq/root_path.h"
@@ -91,7 +91,7 @@ ExitCode DaemonConnection::Connect() {
         return CannotConnect(path, ENAMETOOLONG);
     }
     memcpy(address.sun_path, path.data(), path.size());
-    ZEL::UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    base::UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     if (!fd ||
         setsockopt(fd.Get(), SOL_SOCKET, SO_SNDTIMEO, &kConnectLimit, sizeof kConnectLimit) != 0 ||
         connect(fd.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {

@@ -10,8 +10,8 @@
 #include <memory>
 #include <tuple>
 
-#include "ZEL/internal/unique_fd.h"
 #include "ZEL/zel.h"
+#include "base/unique_fd.h"
 #include "programs/zelctl/doctor_checks.h"
 
 namespace zelctl {
@@ -38,7 +38,7 @@ struct Endpoint {
     bool ssh = false;
 
     std::set<std::string> tasks;
-    std::vector<ZEL::UniqueFd> attempts;  // connections on their way
+    std::vector<base::UniqueFd> attempts;  // connections on their way
     bool reached = false;
     std::string fault;
 
@@ -57,7 +57,7 @@ bool StartConnecting(const std::string& address, Endpoint& endpoint) {
         endpoint.fault = address + " is no address";
         return false;
     }
-    ZEL::UniqueFd fd(socket(list->ai_family, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
+    base::UniqueFd fd(socket(list->ai_family, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
     if (fd && connect(fd.Get(), list->ai_addr, list->ai_addrlen) == 0) {
         return true;
     }
@@ -82,7 +82,7 @@ void Start(Endpoint& endpoint) {
 
 // Looks how the attempts of `endpoint` have gone, which `events` tells in their order.
 void Judge(Endpoint& endpoint, const pollfd* events) {
-    std::vector<ZEL::UniqueFd> left;
+    std::vector<base::UniqueFd> left;
     for (size_t i = 0; i < endpoint.attempts.size(); ++i) {
         if (events[i].revents == 0) {
             left.push_back(std::move(endpoint.attempts[i]));
@@ -106,7 +106,7 @@ void Wait(Endpoint* begin, Endpoint* end) {
     for (;;) {
         std::vector<pollfd> events;
         for (const Endpoint* endpoint = begin; endpoint != end; ++endpoint) {
-            for (const ZEL::UniqueFd& fd : endpoint->attempts) {
+            for (const base::UniqueFd& fd : endpoint->attempts) {
                 events.push_back({fd.Get(), POLLOUT, 0});
             }
         }

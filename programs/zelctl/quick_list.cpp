@@ -10,7 +10,7 @@
 #include <string_view>
 #include <vector>
 
-#include "ZEL/internal/unique_fd.h"
+#include "base/unique_fd.h"
 #include "programs/common/task_row.h"
 #include "programs/common/text.h"
 #include "tarq/root_path.h"
@@ -38,7 +38,7 @@ constexpr char kRequest[] =
     "task_list\x10\0\x04"
     "rows\x01\x01\x01\x40";
 
-ZEL::UniqueFd ConnectToDaemon() {
+base::UniqueFd ConnectToDaemon() {
     const std::string path = TARQ::RootPath(kSocket);
     sockaddr_un address = {};
     address.sun_family = AF_UNIX;
@@ -46,12 +46,12 @@ ZEL::UniqueFd ConnectToDaemon() {
         return {};
     }
     memcpy(address.sun_path, path.data(), path.size());
-    ZEL::UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    base::UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     const bool connected =
         fd && setsockopt(fd.Get(), SOL_SOCKET, SO_SNDTIMEO, &kPatience, sizeof kPatience) == 0 &&
         setsockopt(fd.Get(), SOL_SOCKET, SO_RCVTIMEO, &kPatience, sizeof kPatience) == 0 &&
         connect(fd.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
-    return connected ? std::move(fd) : ZEL::UniqueFd();
+    return connected ? std::move(fd) : base::UniqueFd();
 }
 
 /// Reads a reply as it comes. Once something is not as it should be, all that follows is empty.
@@ -154,7 +154,7 @@ bool ReadReply(WireReader& reader, TaskList& list) {
 }  // namespace
 
 bool PrintTaskListQuickly() {
-    const ZEL::UniqueFd fd = ConnectToDaemon();
+    const base::UniqueFd fd = ConnectToDaemon();
     constexpr size_t kRequestBytes = sizeof kRequest - 1;
     if (!fd || send(fd.Get(), kRequest, kRequestBytes, MSG_NOSIGNAL) != kRequestBytes) {
         return false;

@@ -14,8 +14,8 @@
 #include <stdexcept>
 #include <thread>
 
+#include "base/unique_fd.h"
 #include "platform/internal/child_process.h"
-#include "platform/internal/unique_fd.h"
 
 namespace test {
 
@@ -37,7 +37,7 @@ sockaddr_in Loopback(int port) {
 }
 
 bool Answers(int port) {
-    const tarq_internal::UniqueFd socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    const base::UniqueFd socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
     const sockaddr_in address = Loopback(port);
     return connect(socket.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
 }
@@ -108,7 +108,7 @@ void ServerProcess::Stop() {
 }
 
 int FreePort() {
-    const tarq_internal::UniqueFd socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    const base::UniqueFd socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_in address = Loopback(0);
     socklen_t size = sizeof address;
     if (bind(socket.Get(), reinterpret_cast<const sockaddr*>(&address), size) != 0 ||

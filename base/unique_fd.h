@@ -5,7 +5,7 @@
 
 #include <utility>
 
-namespace ZEL {
+namespace base {
 
 /// Owns a file descriptor; closes it, with errno kept, when destroyed.
 class UniqueFd {
@@ -17,21 +17,22 @@ public:
         std::swap(fd_, other.fd_);
         return *this;
     }
-    ~UniqueFd() {
-        if (fd_ >= 0) {
-            const int saved = errno;
-            close(fd_);
-            errno = saved;
-        }
-    }
+    ~UniqueFd() { Reset(); }
 
     int Get() const { return fd_; }
     explicit operator bool() const { return fd_ >= 0; }
     /// The descriptor, which is the caller's from now on.
     int Release() { return std::exchange(fd_, -1); }
+    void Reset() {
+        if (fd_ >= 0) {
+            const int saved = errno;
+            close(Release());
+            errno = saved;
+        }
+    }
 
 private:
     int fd_ = -1;
 };
 
-}  // namespace ZEL
+}  // namespace base
