@@ -6,9 +6,11 @@
 #include <limits.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
+#include <stdlib.h>
 #include <string.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cstdint>
@@ -70,6 +72,17 @@ const char* ResultText(int code) {
     return code < RESULT_READ_ONLY || code > 0 ? "Unknown error" : texts[-code];
 }
 
+// What the system lets a program ask for with SO_SNDBUF, in bytes; 0 when it cannot be read.
+int LargestSendBuffer() {
+    static const int largest = [] {
+        const UniqueFd file(open("/proc/sys/net/core/wmem_max", O_RDONLY | O_CLOEXEC));
+        char text[32] = "";
+        const ssize_t count = file ? read(file.Get(), text, sizeof text - 1) : 0;
+        return count > 0 ? atoi(text) : 0;
+    }();
+    return largest;
+}
+
 // Keeps sender and receiver from waiting for each other. What cannot be set is left as it is.
 void TuneForThroughput(int fd, unsigned int capacity) {
     // Writes are gathered here already: a message's last small packet must not wait for the
@@ -80,10 +93,16 @@ void TuneForThroughput(int fd, unsigned int capacity) {
         return;
     }
     // A unix socket counts as writable while a quarter of its buffer at most is taken. That quarter
-    // shall hold two full rings; the kernel doubles what it is asked for.
-    const auto bytes =
-        static_cast<int>(std::min(capacity, static_cast<unsigned int>(INT_MAX / 4)) * 4);
-    setsockopt(fd, SOL_SOCKET, SO_SNDBUF, &bytes, sizeof bytes);
+    // shall hold two full rings; the kernel doubles what it is asked for, and cuts it at a limit of
+    // the system first. A buffer that is larger already, as it comes or by the caller's wish,
+    // stays.
+    const int wanted =
+        static_cast<int>(std::min<int64_t>(int64_t{capacity} * 4, LargestSendBuffer()));
+    int present = 0;
+    socklen_t size = sizeof present;
+    if (getsockopt(fd, SOL_SOCKET, SO_SNDBUF, &present, &size) == 0 && present / 2 < wanted) {
+        setsockopt(fd, SOL_SOCKET, SO_SNDBUF, &wanted, sizeof wanted);
+    }
 }
 
 }  // namespace
@@ -360,7 +379,7 @@ int Channel::FlushWrite(int count) {
     }
     Logger::LogMsg(Logger::LEVEL_DEBUG,
                    "[DEBUG] ZEL/channel(%d): FlushWrite: flush at least %d bytes\n", __LINE__,
-                   count);
+                   static_cast<int>(wanted));
     return RESULT_SUCCESS;
 }
 

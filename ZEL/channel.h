@@ -73,6 +73,10 @@ struct ChannelOps {
 /// served from a second ring. Each wait is made of slices of one second, between which the abort
 /// flag is looked at. A peer that goes away never raises SIGPIPE.
 ///
+/// Urgent data on a TCP connection is an error at the next transfer: no peer of ours sends any. On
+/// a unix socket it is one only where a transfer has to wait: a look before each transfer would
+/// cost as much as the transfer, for what kernels know there only since 5.15.
+///
 /// A read looks for bytes for up to 100 microseconds, yielding the processor, before it sleeps: a
 /// peer that answers at once is not slowed down by a sleep and a wake-up. Where bytes keep coming
 /// later than that, up to 255 reads in turn sleep at once.

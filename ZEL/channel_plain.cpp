@@ -82,7 +82,7 @@ int WriteFd(void* handle, const char* data, unsigned int length, const timeval& 
         count = try_send();
     }
     if (!tried || (count < 0 && errno == EAGAIN)) {
-        const int result = WaitWritable(fd, interval, flag);
+        const int result = WaitWritable(fd, interval, flag, "exception occurs");
         if (result < 0) {
             return result;
         }

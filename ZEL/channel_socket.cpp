@@ -93,15 +93,15 @@ int WaitReadable(int fd, const timeval& interval, const int* flag, Patience* pat
     return RESULT_SUCCESS;
 }
 
-int WaitWritable(int fd, const timeval& interval, const int* flag) {
+int WaitWritable(int fd, const timeval& interval, const int* flag, const char* urgent_text) {
     Readiness readiness;
     const int result = WaitFd(fd, Watch::kWrite, interval, flag, nullptr, readiness);
     if (result < 0) {
         return result;
     }
     if (readiness.exception) {
-        Logger::LogMsg(Logger::LEVEL_WARNING,
-                       "[WARNING] ZEL/channel(%d): WriteFd: exception occurs\n", __LINE__);
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/channel(%d): WriteFd: %s\n", __LINE__,
+                       urgent_text);
         return RESULT_IO;
     }
     if (!readiness.ready) {

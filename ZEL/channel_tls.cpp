@@ -363,7 +363,7 @@ int SSLReadFd(void* handle, char* buffer, unsigned int length, const timeval& in
 int SSLWriteFd(void* handle, const char* data, unsigned int length, const timeval& interval,
                const int* flag) {
     auto* ssl = static_cast<SSL*>(handle);
-    const int result = WaitWritable(TlsSocket(handle), interval, flag);
+    const int result = WaitWritable(TlsSocket(handle), interval, flag, "exception set");
     if (result < 0) {
         return result;
     }

@@ -48,20 +48,22 @@ std::string RotatedName(const std::string& path, int number) {
     return name;
 }
 
-// The local time in front of a line. It is made once a second and kept for that second's other
-// lines; the log's lock guards it.
+// The local time in front of a line. Its text is kept for the other lines of the same second in the
+// same zone; the log's lock guards it.
 class TimePrefix {
 public:
     // The number of bytes written, or EOF.
     int Write(FILE* stream) {
         const time_t now = time(nullptr);
         if (now != second_) {
+            tzset();  // localtime_r() alone goes on with the zone that the process began with
+        }
+        struct tm local = {};
+        const bool known = localtime_r(&now, &local) != nullptr;
+        if (now != second_ || local.tm_gmtoff != offset_) {
             second_ = now;
-            length_ = 0;
-            struct tm local = {};
-            if (localtime_r(&now, &local) != nullptr) {
-                length_ = strftime(text_, sizeof text_, "%b %d %H:%M:%S ", &local);
-            }
+            offset_ = local.tm_gmtoff;
+            length_ = known ? strftime(text_, sizeof text_, "%b %d %H:%M:%S ", &local) : 0;
             text_[length_] = '\0';
         }
         return fputs(text_, stream) == EOF ? EOF : static_cast<int>(length_);
@@ -69,6 +71,7 @@ public:
 
 private:
     time_t second_ = -1;  // that text_ tells
+    long offset_ = 0;     // of its zone from UTC
     char text_[512] = "";
     size_t length_ = 0;  // of text_
 };

@@ -192,6 +192,22 @@ TEST(Channel, ANewConnectionClosesTheOldOneAndUrgentDataEndsItsReads) {
     close(fd);
 }
 
+TEST(Channel, ASendBufferIsNeverMadeSmaller) {
+    const auto buffer_of = [](int fd) {
+        int bytes = 0;
+        socklen_t size = sizeof bytes;
+        getsockopt(fd, SOL_SOCKET, SO_SNDBUF, &bytes, &size);
+        return bytes;
+    };
+    for (const unsigned int capacity : {64U, 0x14000U, 1U << 30}) {
+        const test::RawPeer peer;
+        const int before = buffer_of(peer.channel_fd);
+        Channel channel(capacity);
+        ASSERT_EQ(channel.Open(dup(peer.channel_fd), true), 0);
+        EXPECT_GE(buffer_of(peer.channel_fd), before) << capacity;
+    }
+}
+
 TEST(Channel, DescriptorsAboveAThousandWork) {
     rlimit limit = {};
     getrlimit(RLIMIT_NOFILE, &limit);

@@ -86,7 +86,8 @@ int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Patien
 
 /// The wait in front of a read or write: 0 when the direction is ready, else a result code.
 int WaitReadable(int fd, const timeval& interval, const int* flag, Patience* patience);
-int WaitWritable(int fd, const timeval& interval, const int* flag);
+/// `urgent_text`: what a write's log line says of urgent data; the two modes say it differently.
+int WaitWritable(int fd, const timeval& interval, const int* flag, const char* urgent_text);
 
 /// A read of 0 bytes is refused: -4, otherwise 0.
 int RefuseEmptyRead(unsigned int length);
