@@ -1,0 +1,1 @@
+zel_test(open_beneath_test open_beneath_test.cpp LIBRARIES base)
