@@ -325,6 +325,20 @@ TEST_F(Zelctl, WithoutADaemonEveryCommandSaysWhatToDo) {
     EXPECT_EQ(Run("task show").exit_code, 2);
 }
 
+TEST_F(Zelctl, HelpIsForPeopleAndFitsATerminal) {
+    for (const char* command :
+         {"", "task", "task add", "task edit", "task log", "task next", "task run", "share",
+          "share import", "push", "pair check", "next", "export", "import", "doctor", "server",
+          "server setup", "server account add"}) {
+        const Outcome help = Run(std::string("help ") + command);
+        EXPECT_THAT(help, Ended(0, "Usage:")) << command;
+        EXPECT_THAT(help.output, Not(testing::ContainsRegex("[{}]|TEXT|INT|REQUIRED|[^\n]{81}")));
+    }
+    EXPECT_THAT(Run("task next x --count 0"), Ended(2, "from 1 to 1000, not '0'"));
+    EXPECT_THAT(Run("task add x --share"), Ended(2, "--share needs a value"));
+    EXPECT_THAT(Run("task rm x y"), Ended(2, "one word too many: 'y'"));
+}
+
 TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
     FakeDaemon daemon(root_.Path(), [](const PObject& request) {
         return Success({{"task", request}});
@@ -348,7 +362,7 @@ TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
         {"--share none", "share 'none'"},
         {"--share docs", "given twice"},
         {"--exclude " + std::string(65536, 'x'), "'exclude' is too long"},
-        {"--password hunter2", "not expected"},
+        {"--password hunter2", "no option '--password'"},
     };
     for (const auto& [more, text] : refused) {
         EXPECT_THAT(Add(more), AllOf(Not(Ended(0)), Field(&Outcome::output, HasSubstr(text))));

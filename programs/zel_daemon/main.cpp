@@ -4,7 +4,6 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
-#include <CLI/CLI.hpp>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
@@ -13,6 +12,7 @@
 
 #include "ZEL/log.h"
 #include "base/unique_fd.h"
+#include "programs/common/help.h"
 #include "programs/common/task_run.h"
 #include "programs/zel_daemon/background.h"
 #include "programs/zel_daemon/daemon_config.h"
@@ -165,22 +165,23 @@ void Serve(const Options& options) {
 int main(int argc, char** argv) {
     CLI::App app{"Keeps the sync tasks of this machine, and runs each when it is due"};
     app.name("zel_daemon");
-    app.set_version_flag("--version", ZEL_VERSION);
+    programs::SpeakPlainly(app, false);
+    app.set_version_flag("--version", ZEL_VERSION, "Show the version");
     Options options;
     app.add_flag("--foreground", options.foreground, "Stay in the foreground");
-    app.add_option("--log", options.log, "syslog, stderr, or a file's path")->capture_default_str();
-    const std::map<std::string, int> levels = {{"error", Logger::LEVEL_ERROR},
-                                               {"warning", Logger::LEVEL_WARNING},
-                                               {"note", Logger::LEVEL_NOTE},
-                                               {"info", Logger::LEVEL_INFO},
-                                               {"debug", Logger::LEVEL_DEBUG}};
+    app.add_option("--log", options.log, "syslog, stderr, or a file's path")
+        ->option_text("WHERE")
+        ->capture_default_str();
     app.add_option("--log-level", options.level, "error, warning, note, info or debug")
-        ->transform(CLI::CheckedTransformer(levels, CLI::ignore_case))
+        ->transform(programs::OneOf({{"error", Logger::LEVEL_ERROR},
+                                     {"warning", Logger::LEVEL_WARNING},
+                                     {"note", Logger::LEVEL_NOTE},
+                                     {"info", Logger::LEVEL_INFO},
+                                     {"debug", Logger::LEVEL_DEBUG}}))
         ->default_str("note");
-    try {
-        app.parse(argc, argv);
-    } catch (const CLI::ParseError& error) {
-        return app.exit(error) == 0 ? kEnded : kUsage;
+    const int ended = programs::Parse(app, programs::CommandWords(argc, argv), kUsage);
+    if (ended >= 0) {
+        return ended;
     }
     try {
         Serve(options);

@@ -3,7 +3,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <CLI/CLI.hpp>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -13,6 +12,7 @@
 
 #include "ZEL/is_syncedshare.h"
 #include "programs/common/command_line.h"
+#include "programs/common/help.h"
 #include "programs/common/table.h"
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
@@ -411,8 +411,9 @@ int ListAccounts(bool as_json) {
 int RunCommandLine(int argc, char** argv) {
     CLI::App app{"The server of the shared-folder synchronisation: receives what clients push"};
     app.name("zel_server");
+    programs::SpeakPlainly(app, true);
     app.require_subcommand(1);
-    app.set_version_flag("--version", ZEL_VERSION);
+    app.set_version_flag("--version", ZEL_VERSION, "Show the version");
     int result = kOk;
     bool as_json = false;
     const auto json_flag = [&](CLI::App* command) {
@@ -423,14 +424,19 @@ int RunCommandLine(int argc, char** argv) {
     CLI::App* const setup_command =
         app.add_subcommand("setup", "Write the configuration of the rsync daemon");
     setup_command->add_option("--storage", setup.storage, "Folder that receives the shares")
+        ->option_text("FOLDER")
         ->required();
-    setup_command->add_option("--volume", setup.volumes,
-                              "NAME=FOLDER for clients whose volume has that name");
-    setup_command->add_option("--port", setup.port, "Port to listen on (873; with TARQ_ROOT 8873)")
-        ->check(CLI::Range(1, 65535));
-    setup_command->add_option("--address", setup.address, "Address to listen on (all)");
-    setup_command->add_option("--user", setup.user,
-                              "System user that owns the copies, as root (zel)");
+    setup_command
+        ->add_option("--volume", setup.volumes,
+                     "Another folder, for clients whose volume has that name")
+        ->option_text("NAME=FOLDER");
+    setup_command->add_option("--port", setup.port, "Port to listen on")
+        ->default_str("873, with TARQ_ROOT 8873")
+        ->check(programs::Between(1, 65535));
+    setup_command->add_option("--address", setup.address, "Address to listen on")
+        ->default_str("all");
+    setup_command->add_option("--user", setup.user, "System user that owns the copies, as root")
+        ->default_str("zel");
     setup_command->add_flag("--no-encryption", setup.no_encryption, "Refuse encrypted shares");
     setup_command->callback([&] { result = Setup(setup); });
 
@@ -452,7 +458,8 @@ int RunCommandLine(int argc, char** argv) {
     std::string released;
     CLI::App* const shares = app.add_subcommand("shares", "List the shares, or release one");
     json_flag(shares);
-    shares->add_option("--release", released, "Let another client or account take this share over");
+    shares->add_option("--release", released, "Let another client or account take this share over")
+        ->option_text("SHARE");
     shares->callback(
         [&] { result = released.empty() ? ListShares(as_json) : ReleaseShare(released); });
 
@@ -474,12 +481,9 @@ int RunCommandLine(int argc, char** argv) {
 
     // The rsync daemon calls these three; main() takes them before it comes here.
     app.footer(
-        "The rsync daemon calls 'handle-command', 'admit-transfer' and 'end-transfer' by itself.\n"
+        "The rsync daemon itself calls 'handle-command', 'admit-transfer' and\n"
+        "'end-transfer'.\n"
         "Exit codes: 0 done, 1 failed, 2 wrong usage.");
-    try {
-        app.parse(argc, argv);
-    } catch (const CLI::ParseError& error) {
-        return app.exit(error) == 0 ? kOk : kUsage;
-    }
-    return result;
+    const int ended = programs::Parse(app, programs::CommandWords(argc, argv), kUsage);
+    return ended >= 0 ? ended : result;
 }

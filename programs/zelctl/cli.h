@@ -2,8 +2,7 @@
 // what is below one, on an app of its own; the command that runs leaves its exit code in `result`.
 #pragma once
 
-#include <CLI/CLI.hpp>
-
+#include "programs/common/help.h"
 #include "programs/zelctl/exit_codes.h"
 
 namespace zelctl {

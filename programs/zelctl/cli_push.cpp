@@ -26,8 +26,11 @@ void DeclarePush(CLI::App& push, ExitCode& result) {
                        : "";
         });
     push.add_option("--exclude", options.excludes,
-                    "rsync pattern of files that stay behind (may be repeated)");
-    push.add_option("--bwlimit", options.bandwidth_limit, "Limit in KiB a second (0: none)");
+                    "rsync pattern of files that stay behind (may be repeated)")
+        ->option_text("PATTERN");
+    push.add_option("--bwlimit", options.bandwidth_limit, "Limit in KiB a second (0: none)")
+        ->option_text("KIB")
+        ->check(programs::WholeNumber());
     push.add_flag("-n,--dry-run", options.dry_run, "Only list what would be sent and deleted");
     push.add_flag("-q,--quiet", options.quiet, "Say nothing but errors");
     push.callback([&result] { result = Push(options); });
@@ -38,19 +41,28 @@ void DeclareNext(CLI::App& next, ExitCode& result) {
     next.add_option("--mode", options.mode, "manual, realtime, weekly, monthly, yearly or once")
         ->capture_default_str();
     next.add_option("--week", options.week, "Weekdays, Sunday first, 1 for a run day")
+        ->option_text("DAYS")
         ->capture_default_str();
     next.add_option("--begin", options.begin, "Date whose day, month or year counts")
+        ->option_text("YYYY-MM-DD")
         ->capture_default_str();
     next.add_option("--start", options.start, "Time of the first run of a day")
+        ->option_text("HH:MM")
         ->capture_default_str();
     next.add_option("--repeat", options.repeat, "Further runs on the same day")
-        ->check(CLI::Range(0, 95))
+        ->option_text("NUMBER")
+        ->check(programs::Between(0, 95))
         ->capture_default_str();
-    next.add_option("--period", options.period, "Time between them")->capture_default_str();
+    next.add_option("--period", options.period, "Time between them")
+        ->option_text("HH:MM")
+        ->capture_default_str();
     next.add_option("--count", options.count, "How many runs to show")
-        ->check(CLI::Range(1, 1000))
+        ->option_text("NUMBER")
+        ->check(programs::Between(1, 1000))
         ->capture_default_str();
-    next.add_option("--from", options.from, "Moment to count from, 'YYYY-MM-DD HH:MM' (now)");
+    next.add_option("--from", options.from,
+                    "Moment to count from, 'YYYY-MM-DD HH:MM' (now unless given)")
+        ->option_text("MOMENT");
     next.add_flag("--json", options.as_json, "Write JSON, for programs");
     next.callback([&result] { result = ShowNextRuns(options); });
 }

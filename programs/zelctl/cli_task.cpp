@@ -7,9 +7,10 @@ namespace zelctl {
 namespace {
 
 constexpr char kScheduleHelp[] =
-    "When it runs: one of --manual, --on-change, --weekly, --monthly, --yearly and --once.\n"
-    "The last four run at --at, and with --every and --times again on the same day, as in\n"
-    "    --weekly weekdays --at 08:00 --every 2h --times 3     (at 08:00, 10:00, 12:00, 14:00)";
+    "It runs by one of --manual, --on-change, --weekly, --monthly, --yearly, --once.\n"
+    "The last four run at --at, and with --every and --times again on the same day:\n"
+    "    --weekly weekdays --at 08:00 --every 2h --times 3\n"
+    "runs at 08:00, 10:00, 12:00 and 14:00.";
 
 /// What `task add` and `task edit` are given.
 struct TaskArguments {
@@ -36,7 +37,7 @@ void AddSwitch(CLI::App& command, const std::string& name, std::optional<bool>& 
         "--" + name + ",!--no-" + name, [&value](int64_t count) { value = count > 0; }, about);
 }
 
-void AddScheduleOptions(CLI::App& command, programs::ScheduleWords& words) {
+void AddScheduleOptions(CLI::App& command, programs::ScheduleWords& words, bool required) {
     const char* const group = "When it runs";
     command.add_flag("--manual", words.manual, "Only when asked to")->group(group);
     command.add_flag("--on-change", words.on_change, "As soon as something has changed")
@@ -44,19 +45,31 @@ void AddScheduleOptions(CLI::App& command, programs::ScheduleWords& words) {
     command
         .add_option("--weekly", words.weekly,
                     "On these days: mon,thu or monday,thursday; daily, weekdays, weekends")
+        ->option_text("DAYS")
         ->group(group);
     command
         .add_option("--monthly", words.monthly,
                     "On this day of each month (in a month without it, on a day of the next)")
+        ->option_text("DAY")
         ->group(group);
-    command.add_option("--yearly", words.yearly, "On this date MM-DD of each year")->group(group);
-    command.add_option("--once", words.once, "On this date YYYY-MM-DD alone")->group(group);
-    command.add_option("--at", words.at, "Time HH:MM of a day's first run (00:00)")->group(group);
+    command.add_option("--yearly", words.yearly, "On this date of each year")
+        ->option_text("MM-DD")
+        ->group(group);
+    command.add_option("--once", words.once, "On this date alone")
+        ->option_text("YYYY-MM-DD")
+        ->group(group);
+    command.add_option("--at", words.at, "When a day's first run begins")
+        ->default_str(required ? "00:00" : "")
+        ->option_text("HH:MM")
+        ->group(group);
     command.add_option("--every", words.every, "Time between a day's runs: 90m, 2h or 1h30m")
+        ->option_text("TIME")
         ->group(group);
     command
         .add_option("--times", words.times,
                     "How many runs follow the first one on the same day: 3 makes 4 runs; 0: none")
+        ->option_text("NUMBER")
+        ->check(programs::WholeNumber())
         ->group(group);
 }
 
@@ -73,17 +86,22 @@ void AddTaskOptions(CLI::App& command, TaskArguments& arguments, bool required) 
     command.add_option("--password-file", arguments.password_file,
                        "File with the account's password ('-': standard input)");
     AddSwitch(command, "ssh", options.ssh, "Carry everything through ssh");
-    command.add_option("--ssh-port", options.ssh_port, "Port of the ssh server (22)")
-        ->check(CLI::Range(1, 65535));
+    command.add_option("--ssh-port", options.ssh_port, "Port of the ssh server")
+        ->default_str(required ? "22" : "")
+        ->check(programs::Between(1, 65535));
     command
-        .add_option("--timeout", options.timeout,
-                    "Give up when nothing moves for so many seconds (600)")
-        ->check(CLI::Range(600, 86400));
+        .add_option("--timeout", options.timeout, "Give up when nothing moves for so many seconds")
+        ->default_str(required ? "600" : "")
+        ->option_text("SECONDS")
+        ->check(programs::Between(600, 86400));
     AddSwitch(command, "compress", options.compress, "Compress on the way");
     AddSwitch(command, "delta", options.delta, "Send only the changed blocks of files");
-    command.add_option("--exclude", arguments.excludes, "rsync patterns of files that stay behind");
-    command.add_option("--bwlimit", options.bandwidth_limit, "Limit in KiB a second (0: none)");
-    AddScheduleOptions(command, options.schedule);
+    command.add_option("--exclude", arguments.excludes, "rsync patterns of files that stay behind")
+        ->option_text("PATTERN");
+    command.add_option("--bwlimit", options.bandwidth_limit, "Limit in KiB a second (0: none)")
+        ->option_text("KIB")
+        ->check(programs::WholeNumber());
+    AddScheduleOptions(command, options.schedule, required);
     command.footer(kScheduleHelp);
 }
 
@@ -110,7 +128,7 @@ void DeclareChanging(CLI::App& task, ExitCode& result, TaskArguments& arguments)
     CLI::App* const edit =
         task.add_subcommand("edit", "Change a task; what is not given stays as it is");
     AddTaskOptions(*edit, arguments, false);
-    edit->add_option("--rename", arguments.new_name, "Another name for it");
+    edit->add_option("--rename", arguments.new_name, "Another name for it")->option_text("NAME");
     edit->add_flag("--password", arguments.new_password, "Ask for another password");
     edit->add_flag("--no-exclude", arguments.no_excludes, "No file stays behind any more");
     edit->callback([&result, &arguments] {
@@ -162,13 +180,17 @@ void DeclareTask(CLI::App& task, ExitCode& result) {
                    "task_resume", "runs by its schedule again");
 
     CLI::App* const log = AddNamed(task, "log", "Show a task's runs, newest first", name);
-    log->add_option("--limit", limit, "How many")->check(CLI::Range(1, 200))->capture_default_str();
+    log->add_option("--limit", limit, "How many")
+        ->option_text("NUMBER")
+        ->check(programs::Between(1, 200))
+        ->capture_default_str();
     log->add_flag("--json", as_json, "Write JSON, for programs");
     log->callback([&result] { result = ShowTaskLog(name, limit, as_json); });
 
     CLI::App* const next = AddNamed(task, "next", "Show when a task runs next", name);
     next->add_option("--count", count, "How many runs to show")
-        ->check(CLI::Range(1, 1000))
+        ->option_text("NUMBER")
+        ->check(programs::Between(1, 1000))
         ->capture_default_str();
     next->add_flag("--json", as_json, "Write JSON, for programs");
     next->callback([&result] { result = ShowTaskRuns(name, count, as_json); });

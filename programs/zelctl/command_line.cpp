@@ -1,8 +1,7 @@
 #include "programs/common/command_line.h"
 
-#include <CLI/CLI.hpp>
-
 #include "ZEL/log.h"
+#include "programs/common/help.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/cli.h"
 #include "programs/zelctl/server.h"
@@ -31,12 +30,12 @@ constexpr Command kCommands[] = {
     {"server", "The server on this machine: all that zel_server does", nullptr},
 };
 
-// The first word from `argv[index]` on that is no option, and the place after it; empty when there
+// The first word from `words[index]` on that is no option, and the place after it; empty when there
 // is none.
-std::string NextWord(int argc, char** argv, int& index) {
-    while (index < argc) {
-        const char* const word = argv[index++];
-        if (word[0] != '-') {
+std::string NextWord(const std::vector<std::string>& words, size_t& index) {
+    while (index < words.size()) {
+        const std::string& word = words[index++];
+        if (!word.empty() && word.front() != '-') {
             return word;
         }
     }
@@ -55,17 +54,19 @@ ExitCode NoSuchCommand(const std::string& word, const std::string& below) {
 int RunCommandLine(int argc, char** argv) {
     CLI::App app{"Keeps shared folders in step with a paired server"};
     app.name("zelctl");
+    programs::SpeakPlainly(app, true);
     app.require_subcommand(1);
-    app.set_version_flag("--version", ZEL_VERSION);
+    app.set_version_flag("--version", ZEL_VERSION, "Show the version");
     app.add_flag_callback(
         "-v,--verbose",
         [] { ZEL::Logger::Initialize(ZEL::Logger::STDERR, ZEL::Logger::LEVEL_INFO, "", 0); },
         "Write the library's log to standard error instead of the system log");
     ExitCode result = kOk;
-    int index = 1;
-    const std::string wanted = NextWord(argc, argv, index);
+    const std::vector<std::string> words = programs::CommandWords(argc, argv);
+    size_t index = 0;
+    const std::string wanted = NextWord(words, index);
     if (wanted == "server") {
-        return BecomeServer(argv + index);
+        return BecomeServer({words.begin() + static_cast<std::ptrdiff_t>(index), words.end()});
     }
     bool known = wanted.empty();
     for (const Command& command : kCommands) {
@@ -74,7 +75,7 @@ int RunCommandLine(int argc, char** argv) {
         if (wanted == command.name) {
             command.declare(*declared, result);
             known = true;
-            const std::string below = NextWord(argc, argv, index);
+            const std::string below = NextWord(words, index);
             if (declared->get_require_subcommand_min() > 0 && !below.empty() &&
                 declared
                     ->get_subcommands(
@@ -88,13 +89,9 @@ int RunCommandLine(int argc, char** argv) {
         return NoSuchCommand(wanted, "");
     }
     app.footer(
-        "'zelctl COMMAND -h' tells more.\n"
-        "Exit codes: 0 done, 1 failed on the way, 2 wrong usage, 3 a problem on this machine,\n"
-        "4 the server refuses, 5 ended by the user.");
-    try {
-        app.parse(argc, argv);
-    } catch (const CLI::ParseError& error) {
-        return app.exit(error) == 0 ? kOk : kUsage;
-    }
-    return result;
+        "'zelctl help COMMAND' tells more.\n"
+        "Exit codes: 0 done, 1 failed on the way, 2 wrong usage, 3 a problem on this\n"
+        "machine, 4 the server refuses, 5 ended by the user.");
+    const int ended = programs::Parse(app, words, kUsage);
+    return ended >= 0 ? ended : result;
 }

@@ -1,8 +1,8 @@
 #include "programs/zelctl/connection.h"
 
 #include <arpa/inet.h>
-#include <CLI/CLI.hpp>
 
+#include "programs/common/help.h"
 #include "programs/common/terminal.h"
 
 namespace zelctl {
@@ -25,10 +25,11 @@ void ConnectionOptions::AddTo(CLI::App* command) {
         "File with the account's password ('-': standard input); else it is asked for");
     command->add_flag("--ssh", ssh, "Carry everything through ssh");
     command->add_option("--ssh-port", ssh_port, "Port of the ssh server")
-        ->check(CLI::Range(1, 65535))
+        ->check(programs::Between(1, 65535))
         ->capture_default_str();
     command->add_option("--timeout", timeout, "Give up when nothing moves for so many seconds")
-        ->check(CLI::Range(600, 86400))
+        ->option_text("SECONDS")
+        ->check(programs::Between(600, 86400))
         ->capture_default_str();
     command->add_flag("--compress", compress, "Compress on the way");
     command->add_flag("--delta", delta, "Send only the changed blocks of files");

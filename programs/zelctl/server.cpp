@@ -5,16 +5,14 @@
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
-#include <string>
-#include <vector>
 
 namespace zelctl {
 
-ExitCode BecomeServer(char** arguments) {
+ExitCode BecomeServer(const std::vector<std::string>& arguments) {
     std::string program = "zel_server";
     std::vector<char*> words = {program.data()};
-    for (; *arguments != nullptr; ++arguments) {
-        words.push_back(*arguments);
+    for (const std::string& argument : arguments) {
+        words.push_back(const_cast<char*>(argument.c_str()));
     }
     words.push_back(nullptr);
     // The one that was installed with this program, or else any.
