@@ -121,6 +121,17 @@ TEST(Explanation, ComesFromTheWordsAndTheKindOfRun) {
         EXPECT_EQ(verdict.status, status) << messages;
         EXPECT_THAT(verdict.first_line, StartsWith(first_line));
     }
+
+    // A source that is being changed is told from one that cannot be read.
+    const std::string open = "rsync: [sender] send_files failed to open \"/x (2)\": ";
+    const std::string busy = open + "Is a directory (21)\nfile has vanished: \"/y\"\n" + open +
+                             "Too many levels of symbolic links (40)\n" +
+                             "ERROR: z failed verification -- update discarded.\n\n" +
+                             "rsync error: some files/attrs were not transferred (see above)\n";
+    EXPECT_EQ(Judge({copy, Config(), 23, busy}).cause, RunCause::BUSY_SOURCE);
+    EXPECT_EQ(Judge({copy, Config(), 23, busy + open + "Permission denied (13)\n"}).cause,
+              RunCause::UNREADABLE_SOURCE);
+    EXPECT_EQ(Judge({copy, Config(), 23, denied}).cause, RunCause::NONE);
 }
 
 /// What only odd names and addresses show: plain ones are seen to work against real servers.

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cctype>
 #include <initializer_list>
+#include <iterator>
 #include <string_view>
 #include <utility>
 
@@ -222,14 +223,62 @@ bool IsUnreadableSource(const RunFacts& facts) {
            !facts.settings.list_only && Contains(facts.messages, kSourceComplaint);
 }
 
-Verdict UnreadableSource(const RunFacts& facts) {
+// A name that led to something else, or to nothing, when rsync came back to it ends the complaint
+// with one of these: ENOENT, ENOTDIR, EISDIR, ELOOP, ENODATA (the file was cut short).
+constexpr std::string_view kFleetingErrors[] = {" (2)", " (20)", " (21)", " (40)", " (61)"};
+// What else rsync writes in such a run.
+constexpr std::string_view kFleetingWords[] = {
+    "file has vanished: ", "directory has vanished: ", "IO error encountered -- skipping",
+    "rsync error: some files/attrs were not transferred"};
+constexpr std::string_view kChangedWhileSent = " failed verification -- update ";
+
+bool StartsWith(std::string_view text, std::string_view words) {
+    return text.substr(0, words.size()) == words;
+}
+
+bool EndsWith(std::string_view text, std::string_view words) {
+    return text.size() >= words.size() && text.substr(text.size() - words.size()) == words;
+}
+
+bool IsFleeting(std::string_view line) {
+    if (Contains(line, kSourceComplaint)) {
+        return std::any_of(std::begin(kFleetingErrors), std::end(kFleetingErrors),
+                           [line](std::string_view error) { return EndsWith(line, error); });
+    }
+    return line.empty() || Contains(line, kChangedWhileSent) ||
+           std::any_of(std::begin(kFleetingWords), std::end(kFleetingWords),
+                       [line](std::string_view words) { return StartsWith(line, words); });
+}
+
+// Whether all that rsync complains of comes from a source that is being changed. One line of any
+// other kind, and it does not.
+bool IsBusySource(const RunFacts& facts) {
+    std::string_view rest = facts.messages;
+    if (facts.exit_code != kExitPartial || facts.settings.is_command ||
+        !(Contains(rest, kSourceComplaint) || Contains(rest, kChangedWhileSent))) {
+        return false;
+    }
+    while (!rest.empty()) {
+        const std::string_view line = rest.substr(0, rest.find('\n'));
+        if (!IsFleeting(line)) {
+            return false;
+        }
+        rest.remove_prefix(std::min(line.size() + 1, rest.size()));
+    }
+    return true;
+}
+
+Verdict IncompleteSource(const RunFacts& facts, RunCause cause) {
     const std::string_view messages = facts.messages;
-    std::string line = "the source cannot be read in full: " +
-                       std::string(LineAt(messages, messages.find(kSourceComplaint)));
+    const std::string_view found =
+        Contains(messages, kSourceComplaint) ? kSourceComplaint : kChangedWhileSent;
+    std::string line = (cause == RunCause::BUSY_SOURCE ? "the source changed while it was read: "
+                                                       : "the source cannot be read in full: ") +
+                       std::string(LineAt(messages, messages.find(found)));
     if (facts.settings.delete_missing) {
         line += "; nothing was deleted at the destination";
     }
-    return {facts.exit_code, RunCause::NONE, line};
+    return {facts.exit_code, cause, line};
 }
 
 Verdict FromWords(const RunFacts& facts, int status) {
@@ -269,8 +318,11 @@ Verdict FromWords(const RunFacts& facts, int status) {
 }  // namespace
 
 Verdict Judge(const RunFacts& facts) {
+    if (IsBusySource(facts)) {
+        return IncompleteSource(facts, RunCause::BUSY_SOURCE);
+    }
     if (IsUnreadableSource(facts)) {
-        return UnreadableSource(facts);
+        return IncompleteSource(facts, RunCause::UNREADABLE_SOURCE);
     }
     // These two say all by their number: what else was written has no part in it.
     const bool plain = facts.exit_code == kExitVanished || facts.exit_code == STATUS_TIMEOUT;

@@ -38,8 +38,11 @@ struct RunChange {
 
 /// Why a run failed, where callers act on it; the explanation is for people.
 enum class RunCause {
-    NONE,           ///< it did not fail, or for a reason of no name here
-    UNKNOWN_MODULE  ///< the server's daemon has no module of that name
+    NONE,               ///< it did not fail, or for a reason of no name here
+    UNKNOWN_MODULE,     ///< the server's daemon has no module of that name
+    UNREADABLE_SOURCE,  ///< something of the source cannot be read; the rest was copied
+    BUSY_SOURCE  ///< only what changed while it was read is missing: another run may find it at
+                 ///< rest
 };
 
 /// What a finished run came to.
