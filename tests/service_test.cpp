@@ -153,6 +153,21 @@ private:
     Task task_;
 };
 
+/// No thread can be started in its scope: none has memory for its stack.
+class NoThreads {
+public:
+    NoThreads() {
+        pthread_getattr_default_np(&before_);
+        pthread_attr_t after = before_;
+        pthread_attr_setstacksize(&after, SIZE_MAX / 4);
+        pthread_setattr_default_np(&after);
+    }
+    ~NoThreads() { pthread_setattr_default_np(&before_); }
+
+private:
+    pthread_attr_t before_;
+};
+
 class ServiceTest : public testing::Test {
 protected:
     ServiceTest() {
@@ -357,6 +372,19 @@ TEST_F(ServiceTest, NoShareIsCopiedTwiceAtATimeAndNoMoreTasksRunThanWorkers) {
     }
     EXPECT_EQ(copies_.most_at_a_time, 2);
     EXPECT_FALSE(copies_.share_shared);
+}
+
+TEST_F(ServiceTest, WithoutAThreadARunFailsAndIsMadeLater) {
+    Add("t", "manual");
+    {
+        const NoThreads none;
+        RequestRun();
+        EXPECT_THAT(State("t").last->error, HasSubstr("TasksMax="));
+        EXPECT_EQ(State("t").last->result, ZEL::TASK_RESULT_FAILED);
+    }
+    Pass(15);
+    EXPECT_THAT(NewRuns(), ElementsAre(HasSubstr("request"), HasSubstr("retry")));
+    EXPECT_EQ(State("t").last->result, ZEL::TASK_RESULT_SUCCESS);
 }
 
 TEST_F(ServiceTest, AStoreThatCannotBeWrittenForAWhileLosesNothing) {

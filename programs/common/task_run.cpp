@@ -8,9 +8,11 @@
 #include <chrono>
 #include <condition_variable>
 #include <mutex>
+#include <system_error>
 #include <thread>
 #include <utility>
 
+#include "ZEL/log.h"
 #include "ZEL/rsyncer.h"
 #include "ZEL/zel.h"
 #include "base/open_beneath.h"
@@ -77,7 +79,15 @@ public:
 class Beacon {
 public:
     Beacon(const ZEL::SyncInfo& info, std::string task) : info_(info), task_(std::move(task)) {
-        thread_ = std::thread([this] { Run(); });
+        try {
+            thread_ = std::thread([this] { Run(); });
+        } catch (const std::system_error& error) {
+            // As one that fails: no reason to end the run.
+            ZEL::Logger::LogMsg(ZEL::Logger::LEVEL_WARNING,
+                                "[WARNING] task_run(%d): no thread to tell the server that the "
+                                "run is alive: %s\n",
+                                __LINE__, error.what());
+        }
     }
     ~Beacon() { Stop(); }
     Beacon(const Beacon&) = delete;

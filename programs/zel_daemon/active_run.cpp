@@ -1,8 +1,10 @@
 #include "programs/zel_daemon/active_run.h"
 
+#include <system_error>
 #include <utility>
 
 #include "ZEL/zel.h"
+#include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {
 
@@ -65,8 +67,12 @@ Verdict Connection::Ensure(const std::list<std::string>& shares) {
 ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, RunPlan plan,
                      OnProgress on_progress, OnEnd on_end)
     : connection_(std::move(connection)), plan_(std::move(plan)) {
-    thread_ = std::thread([this, &loop, on_progress = std::move(on_progress),
-                           on_end = std::move(on_end)] { Work(loop, on_progress, on_end); });
+    try {
+        thread_ =
+            std::thread([this, &loop, on_progress, on_end] { Work(loop, on_progress, on_end); });
+    } catch (const std::system_error& error) {
+        End(loop, on_end, {programs::Trouble::kLocal, 0, ReasonOf(error.code().value())}, {});
+    }
 }
 
 ActiveRun::~ActiveRun() {
@@ -74,7 +80,9 @@ ActiveRun::~ActiveRun() {
     if (!ended_) {
         Cancel();
     }
-    thread_.join();
+    if (thread_.joinable()) {
+        thread_.join();
+    }
 }
 
 void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd& on_end) {
@@ -93,6 +101,11 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
         verdict = {programs::Trouble::kLocal, 0, error.what()};
     }
     connection_->on_progress = nullptr;
+    End(loop, on_end, verdict, totals);
+}
+
+void ActiveRun::End(EventLoop& loop, const OnEnd& on_end, const Verdict& verdict,
+                    const RunTotals& totals) {
     loop.Post([this, alive = alive_, on_end, verdict, totals] {
         if (*alive) {
             ended_ = true;

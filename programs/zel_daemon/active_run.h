@@ -56,8 +56,8 @@ public:
         std::function<void(const std::string& share, const TARQ::Backup::RunProgress&)>;
     using OnEnd = std::function<void(const programs::Verdict&, const programs::RunTotals&)>;
 
-    /// Starts it. Both functions are called on the loop's thread; nothing is, once this object is
-    /// gone.
+    /// Starts it; without a thread to be had it ends as failed. Both functions are called on the
+    /// loop's thread, after this; nothing is, once this object is gone.
     ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, RunPlan plan,
               OnProgress on_progress, OnEnd on_end);
     /// Cancels and waits for the end.
@@ -74,6 +74,8 @@ public:
 private:
     void Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd& on_end);
     programs::Verdict Run(programs::RunTotals& totals);
+    void End(EventLoop& loop, const OnEnd& on_end, const programs::Verdict& verdict,
+             const programs::RunTotals& totals);
 
     std::shared_ptr<Connection> connection_;
     RunPlan plan_;

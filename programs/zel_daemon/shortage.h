@@ -1,0 +1,12 @@
+// Words for what the system had no more of.
+#pragma once
+
+#include <string>
+
+namespace zel_daemon {
+
+/// What the error number `error` says, with the limit to raise when it is one that the daemon has
+/// reached. EAGAIN is that of a thread or process that could not be started.
+std::string ReasonOf(int error);
+
+}  // namespace zel_daemon
