@@ -37,7 +37,8 @@ TEST(Answer, OnlyAPlainDecimalStatusInTheFirstLineIsTaken) {
 TEST(OutputParser, HandsOnTheSameHoweverTheOutputIsCut) {
     const std::string output =
         "\r          32768   0%    0.00kB/s    0:00:00  "
-        "\r       10518528  33%    9.50MB/s    0:00:02 (xfr#1, ir-chk=3/9)"
+        "\r       10518528  33%    9.50MB/s    0:00:02 (xfr#1, ir-chk=3/9)\n@@ .f          7 in "
+        "step"
         "\n@@ <f+++++++++ 12 dir/new\\#012line\\#134#012\n@@ *deleting   0 old dir/\n"
         "@@ .d..t...... 4096 ./\n@@ broken\nskipping directory x\n" +
         std::string(70000, 'x') +
@@ -61,14 +62,14 @@ TEST(OutputParser, HandsOnTheSameHoweverTheOutputIsCut) {
         parser.Finish();
         parser.FillReport(&report);
         for (const uint64_t number :
-             {last.bytes_done, uint64_t(last.percent), last.bytes_per_second, last.files_left,
+             {last.bytes_done, uint64_t(last.percent), last.bytes_per_second, last.files_checked,
               last.files_total, report.files_total, report.files_sent, report.files_deleted,
               report.bytes_total, report.bytes_sent, report.bytes_received}) {
             said << number << " ";
         }
         // More bytes sent than any connection carries are none.
         EXPECT_EQ(said.str(),
-                  "0 12 dir/new\nline\\#012|1 0 old dir/|2 0 ./|10518528 33 9961472 3 9 "
+                  "0 12 dir/new\nline\\#012|1 0 old dir/|2 0 ./|10518528 0 9961472 9 9 "
                   "7 4 3 18446744073709551615 0 93 ");
         EXPECT_THAT(parser.OtherText(), StartsWith("@@ broken\nskipping directory x\n"));
         EXPECT_FALSE(last.totals_final);

@@ -7,6 +7,7 @@
 
 #include "ZEL/ipc.h"
 #include "ZEL/stream.h"
+#include "programs/common/run_progress.h"
 #include "programs/common/schedule_words.h"
 #include "programs/common/task_row.h"
 #include "programs/common/text.h"
@@ -113,7 +114,7 @@ TEST(TaskRow, TravelsWholeAndNoTextBreaksOut) {
     row.name = "a\x1f\n";
     row.shares = std::string(100000, 's');
     row.status = 2;
-    row.percent = 45;
+    row.progress = "running 45%";
     row.pending = UINT64_MAX;
     const std::string packed = PackTaskRow(row);
     EXPECT_LT(packed.size(), 65536U);
@@ -477,7 +478,10 @@ TEST_F(Zelctl, ATerminalIsDrawnInPlaceWithinItsWindowAndLeftAsItWas) {
             tasks.push_back(Brief("idle" + std::to_string(i), 0, 1, 1));
         }
         tasks.push_back(Brief("busy\t", 2, 1, 1));
-        tasks.back()["progress_percent"] = 40;
+        TARQ::Backup::RunProgress progress;
+        progress.percent_of = TARQ::Backup::RunProgress::BYTES;
+        progress.percent = 40;
+        programs::AddProgress("docs", progress, tasks.back());
         return request["command"].asString() == "watch"
                    ? Replies({TasksReply(tasks), TasksReply(tasks)})
                    : Success({{"after", 1}});
@@ -503,10 +507,12 @@ TEST_F(Zelctl, EachVerbAsksForWhatItSaysAndShowsTheAnswer) {
     PObject task = SomeTask("t");
     task["status"] = 2;
     task["run"] = 9;
-    task["progress_share"] = "docs";
-    task["progress_bytes"] = 1048576;
-    task["progress_rate"] = 104857;
-    task["progress_percent"] = 50;
+    TARQ::Backup::RunProgress progress;
+    progress.percent_of = TARQ::Backup::RunProgress::BYTES;
+    progress.percent = 50;
+    progress.bytes_done = 1048576;
+    progress.bytes_per_second = 104857;
+    programs::AddProgress("docs", progress, task);
     PObject run;
     run = PObject::Map{{"run", 9},           {"start", 1000},
                        {"end", 1100},        {"sync_result", 2},
@@ -527,7 +533,7 @@ TEST_F(Zelctl, EachVerbAsksForWhatItSaysAndShowsTheAnswer) {
         {"task pause t", R"("task_pause", "task": "t")", "is paused"},
         {"task resume t", R"("task_resume", "task": "t")", "runs by its"},
         {"task show t", R"("task_show", "task": "t")",
-         "progress         docs: 1.0 MiB, 102 KiB/s, 0:09 left"},
+         "progress         docs: 50%  1.0 MiB, 102 KiB/s, 0:09 left"},
         {"task show t --json", R"("task_show", "task": "t")", "\"state\": \"running\""},
         {"task next t --count 5 --json", R"("task_show", "task": "t")", "13:00:00"},
         {"task log t --limit 7", R"("task_log", "limit": 7, "task": "t")",

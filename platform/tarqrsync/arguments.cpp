@@ -197,9 +197,11 @@ void AddRules(const Settings& settings, PrivateFolder* folder, Words* arguments)
 
 void AddReporting(const RunOptions& options, Words* arguments) {
     if (options.on_progress) {
-        Append(arguments, {"--info=progress2", "--outbuf=N"});
+        // How many files there are is told before any is sent, and then each as it is checked, the
+        // ones that are in step as well (-ii).
+        Append(arguments, {"--info=progress2,flist2", "--outbuf=N", "-ii"});
     }
-    if (options.on_change) {
+    if (options.on_change || options.on_progress) {
         arguments->push_back("--out-format=" + std::string(kChangeMark) + "%i %l %n");
     }
     if (options.report != nullptr) {

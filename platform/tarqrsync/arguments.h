@@ -18,7 +18,7 @@ struct Invocation {
     std::string input;                     ///< standard input: the daemon's password
 };
 
-/// What starts a line of RunChange on rsync's output.
+/// What starts an entry's line on rsync's output.
 constexpr char kChangeMark[] = "@@ ";
 
 /// Beside the settings, what decides how rsync is called.

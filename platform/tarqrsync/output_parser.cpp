@@ -11,8 +11,10 @@ namespace Backup {
 
 namespace {
 
-// Progress comes with each file: a listener hears of it no more often than this.
+// Progress comes with each file: a listener hears of it no more often than the first, and when
+// nothing comes no less often than about the second.
 constexpr std::chrono::milliseconds kProgressInterval(200);
+constexpr std::chrono::milliseconds kSilentInterval(900);
 // A name of PATH_MAX bytes, each escaped as four, and the figures before it.
 constexpr size_t kMaxLine = size_t{64} * 1024;
 constexpr size_t kMaxOtherText = 4096;
@@ -21,6 +23,8 @@ constexpr std::string_view kDeleting = "*deleting";
 constexpr std::string_view kDeletingPlain = "deleting ";
 // The letters that tell what happens to an entry, and of which kind it is.
 constexpr size_t kItemizeWidth = 11;
+constexpr char kNewEntry = '+';
+constexpr std::string_view kTopFolder = "./";
 
 // A reader of the words and numbers of a line.
 class Scanner {
@@ -137,8 +141,19 @@ void OutputParser::Feed(std::string_view bytes) {
 void OutputParser::Finish() {
     Feed("\n");
     if (held_back_) {
-        options_.on_progress(*held_back_);
-        held_back_.reset();
+        TellProgress();
+    }
+}
+
+void OutputParser::Tick(unsigned int seconds_still) {
+    if (!options_.on_progress) {
+        return;
+    }
+    progress_.seconds_still = seconds_still;
+    const auto now = std::chrono::steady_clock::now();
+    if (now >= next_progress_ &&
+        (held_back_ || now >= next_progress_ + kSilentInterval - kProgressInterval)) {
+        TellProgress();
     }
 }
 
@@ -150,51 +165,77 @@ void OutputParser::FillReport(RunReport* report) const {
 }
 
 void OutputParser::TakeLine(std::string_view line) {
-    const bool known =
-        TakeProgress(line) || TakeChange(line) || TakeListed(line) || TakeFigure(line);
+    const bool known = TakeEntry(line) || TakeProgress(line) || TakeFound(line) ||
+                       TakeListed(line) || TakeFigure(line);
     if (!known && !line.empty() && other_text_.size() + line.size() < kMaxOtherText) {
         other_text_.append(line).append("\n");
     }
 }
 
+// " 10100 files..." while rsync looks for files, then "10103 files to consider".
+bool OutputParser::TakeFound(std::string_view line) {
+    Scanner scanner(line);
+    uint64_t found = 0;
+    if (!options_.on_progress || !scanner.SkipSpaces().Read(&found) || !scanner.Literal(" file")) {
+        return false;
+    }
+    const std::string_view rest = scanner.Rest();
+    const bool all = rest == " to consider" || rest == "s to consider";
+    if (!all && rest != "s...") {
+        return false;
+    }
+    progress_.files_total = std::max(progress_.files_total, found);
+    progress_.totals_final = progress_.totals_final || all;
+    held_back_ = true;
+    return true;
+}
+
 // "   21004288  66%    9.77MB/s    0:00:01 (xfr#1, to-chk=4/6)"; the last part comes with each
-// file's end, and says ir-chk until all files are known.
+// file's end, and says ir-chk until all files are known. The bytes are those of the files that were
+// sent, the percentage is of the bytes of all files.
 bool OutputParser::TakeProgress(std::string_view line) {
     if (!options_.on_progress) {
         return false;
     }
     Scanner scanner(line);
-    RunProgress now = progress_;
-    if (!scanner.SkipSpaces().Read(&now.bytes_done) || !scanner.SkipSpaces().Read(&now.percent) ||
-        !scanner.Literal("%") || !ReadRate(&scanner.SkipSpaces(), &now.bytes_per_second)) {
+    uint64_t bytes = 0;
+    uint64_t rate = 0;
+    unsigned int percent = 0;
+    if (!scanner.SkipSpaces().Read(&bytes) || !scanner.SkipSpaces().Read(&percent) ||
+        !scanner.Literal("%") || !ReadRate(&scanner.SkipSpaces(), &rate)) {
         return false;
     }
-    now.percent = std::min(now.percent, 100U);
+    progress_.bytes_done = bytes;
+    progress_.bytes_per_second = rate;
+    percent_of_bytes_ = percent;
+    progress_.file_bytes =
+        std::min(bytes - std::min(bytes, bytes_before_file_), progress_.file_length);
     scanner.SkipSpaces().Word();  // the time left, which is the listener's to work out
-    uint64_t sent = 0;
-    if (scanner.SkipSpaces().Literal("(xfr#") && scanner.Read(&sent) && scanner.Literal(", ")) {
-        now.totals_final = scanner.Literal("to-chk=");
-        if ((now.totals_final || scanner.Literal("ir-chk=")) && scanner.Read(&now.files_left) &&
-            scanner.Literal("/")) {
-            scanner.Read(&now.files_total);
+    uint64_t number = 0;
+    if (scanner.SkipSpaces().Literal("(xfr#") && scanner.Read(&number) && scanner.Literal(", ")) {
+        EndFile();
+        const bool all_found = scanner.Literal("to-chk=");
+        uint64_t left = 0;
+        uint64_t total = 0;
+        if ((all_found || scanner.Literal("ir-chk=")) && scanner.Read(&left) &&
+            scanner.Literal("/") && scanner.Read(&total) && left <= total) {
+            progress_.totals_final = all_found;
+            progress_.files_total = std::max(progress_.files_total, total);
+            progress_.files_checked = std::max(progress_.files_checked, total - left);
         }
     }
-    progress_ = now;
-    const auto time = std::chrono::steady_clock::now();
-    if (time < next_progress_) {
-        held_back_ = now;
-        return true;
+    held_back_ = true;
+    if (std::chrono::steady_clock::now() >= next_progress_) {
+        TellProgress();
     }
-    next_progress_ = time + kProgressInterval;
-    held_back_.reset();
-    options_.on_progress(now);
     return true;
 }
 
-// "@@ <f+++++++++ 31457280 folder/name", "@@ *deleting   0 name".
-bool OutputParser::TakeChange(std::string_view line) {
+// "@@ <f+++++++++ 31457280 folder/name", "@@ *deleting   0 name", and "@@ .f          12 name" for
+// what is as it should be.
+bool OutputParser::TakeEntry(std::string_view line) {
     Scanner scanner(line);
-    if (!options_.on_change || !scanner.Literal(kChangeMark)) {
+    if ((!options_.on_change && !options_.on_progress) || !scanner.Literal(kChangeMark)) {
         return false;
     }
     const std::string_view itemized = scanner.Take(kItemizeWidth);
@@ -202,7 +243,6 @@ bool OutputParser::TakeChange(std::string_view line) {
     if (!scanner.Literal(" ") || !scanner.Read(&change.length) || !scanner.Literal(" ")) {
         return false;
     }
-    change.path = UnescapeName(scanner.Rest());
     if (itemized.substr(0, kDeleting.size()) == kDeleting) {
         change.kind = RunChange::DELETE;
         ++deletions_told_;
@@ -212,8 +252,65 @@ bool OutputParser::TakeChange(std::string_view line) {
     if (change.kind != RunChange::SEND) {
         change.length = 0;
     }
-    options_.on_change(change);
+    const bool differs = itemized.find_first_not_of(' ', 2) != std::string_view::npos;
+    if (differs) {
+        change.path = UnescapeName(scanner.Rest());
+    }
+    if (options_.on_progress && change.kind != RunChange::DELETE) {
+        NoteEntry(itemized, change);
+    }
+    if (options_.on_change && differs) {
+        options_.on_change(change);
+    }
     return true;
+}
+
+// The line of a file that is sent comes before its bytes, any other once its entry is done.
+void OutputParser::NoteEntry(std::string_view itemized, const RunChange& entry) {
+    EndFile();
+    const bool is_new = itemized[itemized.size() - 1] == kNewEntry;
+    if (entry.path == kTopFolder && progress_.files_checked == 0) {
+        // The server may have made the copy's folder just now: nobody has given it its mode yet.
+        new_copy_ = is_new || itemized.find('p') != std::string_view::npos;
+    } else {
+        new_copy_ = new_copy_ && is_new;
+    }
+    if (entry.kind == RunChange::SEND) {
+        progress_.file = entry.path;
+        progress_.file_length = entry.length;
+        progress_.file_bytes = 0;
+        bytes_before_file_ = progress_.bytes_done;
+    } else {
+        ++progress_.files_checked;
+    }
+    held_back_ = true;
+}
+
+void OutputParser::EndFile() {
+    if (!progress_.file.empty()) {
+        ++progress_.files_checked;
+        progress_.file.clear();
+        progress_.file_bytes = 0;
+        progress_.file_length = 0;
+    }
+}
+
+void OutputParser::TellProgress() {
+    held_back_ = false;
+    next_progress_ = std::chrono::steady_clock::now() + kProgressInterval;
+    RunProgress& now = progress_;
+    now.files_total = std::max(now.files_total, now.files_checked);
+    now.percent_of = RunProgress::NOTHING;
+    now.percent = 0;
+    if (now.totals_final && now.files_total > 0) {
+        const bool bytes = new_copy_ && now.bytes_done > 0;
+        now.percent_of = bytes ? RunProgress::BYTES : RunProgress::FILES;
+        const uint64_t of_files = now.files_checked * 100 / now.files_total;
+        now.percent = bytes ? percent_of_bytes_ : static_cast<unsigned int>(of_files);
+        // rsync rounds, and a file without bytes may still be to come.
+        now.percent = std::min(now.percent, now.files_checked < now.files_total ? 99U : 100U);
+    }
+    options_.on_progress(now);
 }
 
 // "-rw-r--r--    31457280 2026/11/21 11:37:51 folder/name".

@@ -1,7 +1,6 @@
 #pragma once
 
 #include <chrono>
-#include <optional>
 #include <string>
 #include <string_view>
 
@@ -10,8 +9,9 @@
 namespace TARQ {
 namespace Backup {
 
-/// Reads what rsync writes to its standard output: progress, changes, listed files and closing
-/// figures. Hands them on as they come, and keeps the text of lines that are none of these.
+/// Reads what rsync writes to its standard output: a line for each entry that it has checked,
+/// progress, listed files and closing figures. Hands them on as they come, and keeps the text of
+/// lines that are none of these.
 class OutputParser {
 public:
     /// `options` must outlive the parser. `listing`: the run lists files, each of which is handed
@@ -20,6 +20,8 @@ public:
 
     /// Takes the next piece of output, of any size.
     void Feed(std::string_view bytes);
+    /// Hands on the progress of now, with its time without movement, when it is time to.
+    void Tick(unsigned int seconds_still);
     /// The output has ended: a last line without a newline counts, progress that was held back is
     /// handed on.
     void Finish();
@@ -31,18 +33,28 @@ public:
 
 private:
     void TakeLine(std::string_view line);
+    bool TakeFound(std::string_view line);
     bool TakeProgress(std::string_view line);
-    bool TakeChange(std::string_view line);
+    bool TakeEntry(std::string_view line);
     bool TakeListed(std::string_view line);
     bool TakeFigure(std::string_view line);
+
+    void NoteEntry(std::string_view itemized, const RunChange& entry);
+    void EndFile();
+    void TellProgress();
 
     const RunOptions& options_;
     const bool listing_;
     std::string line_;           // the start of a line whose end has not come
     bool line_dropped_ = false;  // that line is too long to mean anything
-    std::optional<RunProgress> held_back_;
+
     RunProgress progress_;
+    unsigned int percent_of_bytes_ = 0;  // as rsync gives it
+    uint64_t bytes_before_file_ = 0;
+    bool new_copy_ = false;  // nothing that was checked so far had been at the destination
+    bool held_back_ = false;
     std::chrono::steady_clock::time_point next_progress_;
+
     RunReport figures_;
     uint64_t deletions_told_ = 0;  // the closing figure may leave out the last ones
     std::string other_text_;

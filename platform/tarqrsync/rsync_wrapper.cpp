@@ -13,7 +13,7 @@ namespace Backup {
 
 namespace {
 
-// The cause stands in the first line; the system log is not the place for a line a file.
+// The cause stands in the explanation; the system log is not the place for a line a file.
 constexpr int kMaxLoggedLines = 20;
 
 thread_local const RunOptions* current_options = nullptr;
@@ -37,6 +37,7 @@ ScopedRunOptions::~ScopedRunOptions() {
 struct RsyncWrapper::Impl {
     Settings settings;
     std::string explanation;
+    std::string details;
 };
 
 RsyncWrapper::RsyncWrapper() : impl_(new Impl) {}
@@ -125,6 +126,7 @@ int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
     Run run(impl_->settings, options);
     const int status = run.Execute(cancelled);
     impl_->explanation = run.Outcome().explanation;
+    impl_->details = run.Outcome().details;
     if (options.report != nullptr) {
         *options.report = run.Outcome();
     }
@@ -132,7 +134,10 @@ int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
 }
 
 void RsyncWrapper::logError() {
-    std::istringstream lines(impl_->explanation);
+    if (impl_->explanation.empty()) {
+        return;
+    }
+    std::istringstream lines(impl_->explanation + "\n" + impl_->details);
     int count = 0;
     for (std::string line; count < kMaxLoggedLines && std::getline(lines, line); ++count) {
         syslog(LOG_ERR, "tarqrsync: %s", line.c_str());

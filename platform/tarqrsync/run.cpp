@@ -12,6 +12,7 @@
 #include <array>
 #include <cerrno>
 #include <charconv>
+#include <chrono>
 #include <cstring>
 
 #include "base/unique_fd.h"
@@ -26,6 +27,7 @@ namespace Backup {
 
 namespace {
 
+using std::chrono::steady_clock;
 using tarq_internal::ChildResult;
 using tarq_internal::ChildSetup;
 
@@ -269,6 +271,7 @@ int Run::RunCopy(const std::function<bool()>& cancelled) {
 int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invocation,
                   OutputParser* parser, const ChildLimits& limits) {
     outcome_.explanation.clear();
+    outcome_.details.clear();
     messages_.clear();
     ChildSetup setup;
     setup.program = tarq_internal::FindProgram(config_.rsync, PathVariable(invocation.environment));
@@ -282,12 +285,21 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     }
 
     MessageKeeper keeper;
+    auto last_moved = steady_clock::now();
     const ChildResult result = tarq_internal::RunChild(
-        setup, cancelled,
-        [parser](const char* bytes, size_t size) {
+        setup,
+        [&] {
+            const auto still = steady_clock::now() - last_moved;
+            parser->Tick(static_cast<unsigned int>(
+                std::chrono::duration_cast<std::chrono::seconds>(still).count()));
+            return cancelled && cancelled();
+        },
+        [&](const char* bytes, size_t size) {
+            last_moved = steady_clock::now();
             parser->Feed({bytes, size});
         },
-        [&keeper](const char* bytes, size_t size) {
+        [&](const char* bytes, size_t size) {
+            last_moved = steady_clock::now();
             keeper.Feed({bytes, size});
         },
         limits.early_end);
@@ -327,9 +339,10 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
 }
 
 int Run::Fail(int status, const std::string& first_line) {
-    outcome_.explanation = messages_.empty() ? first_line : first_line + "\n" + messages_;
-    while (!outcome_.explanation.empty() && outcome_.explanation.back() == '\n') {
-        outcome_.explanation.pop_back();
+    outcome_.explanation = first_line;
+    outcome_.details = messages_;
+    while (!outcome_.details.empty() && outcome_.details.back() == '\n') {
+        outcome_.details.pop_back();
     }
     return status;
 }

@@ -35,7 +35,7 @@ void EachField(Row& row, Visit& visit) {
     visit(row.last_end);
     visit(row.next_run);
     visit(row.retry_in);
-    visit(row.percent);
+    visit(row.progress);
     visit(row.pending);
     visit(row.note);
 }
@@ -138,7 +138,7 @@ const char* TaskResultWord(int result) {
 
 std::string TaskStateWords(const TaskRow& row) {
     if (row.status == kRunning) {
-        return row.percent ? "running " + std::to_string(*row.percent) + "%" : "running";
+        return row.progress.empty() ? "running" : row.progress;
     }
     return row.retry_in ? "retry in " + HumanDuration(*row.retry_in) : TaskStatusWord(row.status);
 }

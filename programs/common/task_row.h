@@ -20,7 +20,7 @@ struct TaskRow {
     std::optional<int64_t> last_end;  ///< seconds since the epoch
     std::optional<int64_t> next_run;
     std::optional<uint64_t> retry_in;  ///< seconds
-    std::optional<uint64_t> percent;   ///< of the run that is under way
+    std::string progress;              ///< of the run that is under way, in words
     uint64_t pending = 0;              ///< changes
     std::string note;                  ///< empty when all is well
 };
@@ -37,7 +37,7 @@ bool UnpackTaskRow(std::string_view packed, TaskRow& row);
 const char* TaskStatusWord(int status);
 /// "done", "failed", "cancelled", "not yet"
 const char* TaskResultWord(int result);
-/// "running 45%", "retry in 0:20", or the status
+/// "running 45%", "nothing has moved for 2:10", "retry in 0:20", or the status
 std::string TaskStateWords(const TaskRow& row);
 /// "done 2026-11-21 08:30:00"
 std::string TaskLastRunWords(const TaskRow& row);

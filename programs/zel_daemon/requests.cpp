@@ -10,6 +10,7 @@
 
 #include "ZEL/channel.h"
 #include "ZEL/log.h"
+#include "programs/common/run_progress.h"
 #include "programs/common/schedule_words.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/store.h"
@@ -26,26 +27,13 @@ constexpr unsigned int kLogLimit = 20;
 
 // Keys of a task that are the daemon's own: an exported task has them, and they are passed over.
 const std::set<std::string>& StateKeys() {
-    static const std::set<std::string> keys = {"id",
-                                               "schedule",
-                                               "status",
-                                               "sync_result",
-                                               "next_run",
-                                               "retry_in",
-                                               "pending",
-                                               "note",
-                                               "run",
-                                               "progress_share",
-                                               "progress_percent",
-                                               "progress_bytes",
-                                               "progress_rate",
-                                               "progress_files_left",
-                                               "progress_files_total",
-                                               "last_run",
-                                               "last_start",
-                                               "last_end",
-                                               "last_status",
-                                               "last_error"};
+    static const std::set<std::string> keys = [] {
+        std::set<std::string> all = {
+            "id",   "schedule", "status",   "sync_result", "next_run", "retry_in",    "pending",
+            "note", "run",      "last_run", "last_start",  "last_end", "last_status", "last_error"};
+        all.insert(programs::ProgressKeys().begin(), programs::ProgressKeys().end());
+        return all;
+    }();
     return keys;
 }
 
@@ -318,7 +306,7 @@ programs::TaskRow Requests::RowOf(const TaskRecord& record) const {
         row.retry_in = static_cast<uint64_t>(*state.retry_in);
     }
     if (state.active != nullptr && !state.active->progress_share.empty()) {
-        row.percent = state.active->progress.percent;
+        row.progress = programs::ProgressState(state.active->progress);
     }
     row.pending = state.pending;
     row.note = state.note;
@@ -351,14 +339,8 @@ void Requests::AddState(const TaskRecord& record, PObject& map) const {
         return;
     }
     map["run"] = Number(state.active->Plan().record.id);
-    const TARQ::Backup::RunProgress& progress = state.active->progress;
     if (!state.active->progress_share.empty()) {
-        map["progress_share"] = state.active->progress_share;
-        map["progress_percent"] = progress.percent;
-        map["progress_bytes"] = Number(progress.bytes_done);
-        map["progress_rate"] = Number(progress.bytes_per_second);
-        map["progress_files_left"] = Number(progress.files_left);
-        map["progress_files_total"] = Number(progress.files_total);
+        programs::AddProgress(state.active->progress_share, state.active->progress, map);
     }
 }
 

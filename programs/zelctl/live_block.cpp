@@ -48,6 +48,10 @@ bool LiveBlock::Possible() {
     return isatty(STDOUT_FILENO) != 0;
 }
 
+size_t LiveBlock::Columns() {
+    return GetWindowSize().columns;
+}
+
 void LiveBlock::Draw(const std::vector<std::string>& lines) {
     const WindowSize window = GetWindowSize();
     const size_t room = window.rows - 1;  // the cursor's own row

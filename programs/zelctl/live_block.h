@@ -19,6 +19,8 @@ public:
 
     /// Whether standard output is a terminal.
     static bool Possible();
+    /// The width of its window.
+    static size_t Columns();
 
     /// Shows these lines, which must be printable, in place of those of before.
     void Draw(const std::vector<std::string>& lines);

@@ -1,70 +1,33 @@
 #include "programs/zelctl/progress.h"
 
-#include <unistd.h>
-
 #include <cstdio>
 
+#include "programs/common/run_progress.h"
 #include "programs/common/text.h"
 
 namespace zelctl {
 
 namespace {
 
-using std::chrono::milliseconds;
-using std::chrono::seconds;
-using std::chrono::steady_clock;
-
-constexpr int kBarWidth = 24;
-constexpr milliseconds kRedrawEvery(100);
-constexpr seconds kLineEvery(10);
-
-std::string TimeLeft(const TARQ::Backup::RunProgress& progress) {
-    if (!progress.totals_final || progress.percent == 0 || progress.bytes_per_second == 0) {
-        return "";
-    }
-    const uint64_t left = progress.bytes_done / progress.percent * (100 - progress.percent);
-    return ", " + programs::HumanDuration(left / progress.bytes_per_second) + " left";
-}
+constexpr std::chrono::seconds kLineEvery(10);
 
 }  // namespace
 
-ProgressDisplay::ProgressDisplay(bool quiet)
-    : quiet_(quiet), on_terminal_(isatty(STDOUT_FILENO) != 0) {}
-
 void ProgressDisplay::Show(const std::string& share, const TARQ::Backup::RunProgress& progress) {
-    const auto now = steady_clock::now();
-    const bool first = last_ == steady_clock::time_point();
-    if (quiet_ || (!first && now - last_ < (on_terminal_ ? milliseconds(kRedrawEvery)
-                                                         : milliseconds(kLineEvery)))) {
+    if (quiet_) {
         return;
     }
-    last_ = now;
-    const std::string done = programs::HumanBytes(progress.bytes_done);
-    const std::string rate = programs::HumanBytes(progress.bytes_per_second);
-    if (on_terminal_) {
-        printf("\r%s [%s] %3u%%  %s, %s/s%s\033[K", programs::Printable(share).c_str(),
-               ProgressBar(progress.percent).c_str(), progress.percent, done.c_str(), rate.c_str(),
-               TimeLeft(progress).c_str());
-        drawn_ = true;
-    } else if (!first) {
-        printf("%s: %u%%, %s, %s/s%s\n", programs::Printable(share).c_str(), progress.percent,
-               done.c_str(), rate.c_str(), TimeLeft(progress).c_str());
+    if (LiveBlock::Possible()) {
+        block_.Draw({programs::ProgressLine(share, progress, LiveBlock::Columns())});
+        return;
     }
-    fflush(stdout);
-}
-
-void ProgressDisplay::Clear() {
-    if (drawn_) {
-        fputs("\r\033[K", stdout);
+    const auto now = std::chrono::steady_clock::now();
+    if (now - last_line_ >= kLineEvery) {
+        last_line_ = now;
+        printf("%s: %s\n", programs::Printable(share).c_str(),
+               programs::ProgressWords(progress).c_str());
         fflush(stdout);
-        drawn_ = false;
     }
-}
-
-std::string ProgressBar(unsigned int percent) {
-    const int filled = static_cast<int>(percent) * kBarWidth / 100;
-    return std::string(static_cast<size_t>(filled), '#') +
-           std::string(static_cast<size_t>(kBarWidth - filled), '.');
 }
 
 std::string Summary(const TARQ::Backup::RunReport& report, double elapsed) {

@@ -6,11 +6,11 @@
 #include <map>
 
 #include "ZEL/sync_obj.h"
+#include "programs/common/run_progress.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/daemon_client.h"
 #include "programs/zelctl/interrupt.h"
 #include "programs/zelctl/live_block.h"
-#include "programs/zelctl/progress.h"
 #include "programs/zelctl/push.h"
 #include "programs/zelctl/task_view.h"
 
@@ -63,17 +63,16 @@ const PObject* FindTask(const PObject::Array& tasks, const std::string& name) {
     return found == tasks.end() ? nullptr : &*found;
 }
 
-std::string ProgressLine(const PObject& task) {
-    const std::string name = Printable(task["name"].asString());
-    if (task["status"].asInt32() != ZEL::TASK_STATUS_RUNNING) {
-        return name + ": " + programs::TaskStateWords(RowOf(task));
+std::string WaitingLine(const PObject& task) {
+    const std::string name = task["name"].asString();
+    const std::string share = task["progress_share"].asString();
+    if (task["status"].asInt32() != ZEL::TASK_STATUS_RUNNING || share.empty()) {
+        return Printable(name) + ": " + programs::TaskStateWords(RowOf(task));
     }
-    const unsigned int percent = std::min(task["progress_percent"].asUInt32(), 100U);
-    const std::string share = Printable(task["progress_share"].asString());
-    char number[8];
-    snprintf(number, sizeof number, "%3u%%", percent);
-    return name + (share.empty() ? "" : " " + share) + " [" + ProgressBar(percent) + "] " + number +
-           "  " + ProgressWords(task);
+    const TARQ::Backup::RunProgress progress = programs::ProgressOf(task);
+    const std::string what = name == share ? name : name + " " + share;
+    return LiveBlock::Possible() ? programs::ProgressLine(what, progress, LiveBlock::Columns())
+                                 : Printable(what) + ": " + programs::ProgressWords(progress);
 }
 
 /// The runs that a person waits for.
@@ -94,7 +93,7 @@ public:
                 Note(task == nullptr ? Gone(run->first) : Ended(*task));
                 run = left_.erase(run);
             } else {
-                lines.push_back(ProgressLine(*task));
+                lines.push_back(WaitingLine(*task));
                 ++run;
             }
         }

@@ -4,6 +4,7 @@
 #include <nlohmann/json.hpp>
 
 #include "ZEL/sync_obj.h"
+#include "programs/common/run_progress.h"
 #include "programs/common/schedule_words.h"
 #include "programs/common/text.h"
 
@@ -98,7 +99,9 @@ programs::TaskRow RowOf(const PObject& task) {
     row.last_end = NumberOf<int64_t>(task["last_end"]);
     row.next_run = NumberOf<int64_t>(task["next_run"]);
     row.retry_in = NumberOf<uint64_t>(task["retry_in"]);
-    row.percent = NumberOf<uint64_t>(task["progress_percent"]);
+    if (task["progress_share"].isString()) {
+        row.progress = programs::ProgressState(programs::ProgressOf(task));
+    }
     row.pending = task["pending"].asUInt64();
     row.note = task["note"].asString();
     return row;
@@ -119,17 +122,6 @@ std::string ScheduleOf(const PObject& task) {
 std::string ServerOf(const PObject& task) {
     std::string name = task["server_name"].asString();
     return name.empty() ? task["server_ip"].asString() : name;
-}
-
-std::string ProgressWords(const PObject& task) {
-    const uint64_t done = task["progress_bytes"].asUInt64();
-    const uint64_t rate = task["progress_rate"].asUInt64();
-    const uint64_t percent = task["progress_percent"].asUInt64();
-    std::string words = programs::HumanBytes(done) + ", " + programs::HumanBytes(rate) + "/s";
-    if (percent > 0 && percent <= 100 && rate > 0) {
-        words += ", " + programs::HumanDuration(done / percent * (100 - percent) / rate) + " left";
-    }
-    return words;
 }
 
 std::string OneLine(const std::string& text) {
@@ -189,8 +181,9 @@ void PrintTask(const PObject& task, bool as_json) {
     facts.Add("schedule", ScheduleOf(task));
     facts.Add("next run", TimeOf(task["next_run"], "-"));
     facts.Add("state", programs::TaskStateWords(RowOf(task)));
-    if (task["run"].isInteger()) {
-        facts.Add("progress", task["progress_share"].asString() + ": " + ProgressWords(task));
+    if (task["progress_share"].isString()) {
+        facts.Add("progress", task["progress_share"].asString() + ": " +
+                                  programs::ProgressWords(programs::ProgressOf(task)));
     }
     facts.Add("last run", programs::TaskLastRunWords(RowOf(task)));
     facts.Add("error", OneLine(task["last_error"].asString()));

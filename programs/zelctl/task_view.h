@@ -17,9 +17,6 @@ programs::TaskRow RowOf(const ZEL::PObject& task);
 std::string ScheduleOf(const ZEL::PObject& task);
 /// The server's name, or its address.
 std::string ServerOf(const ZEL::PObject& task);
-/// "1.5 MiB of it, 2.0 MiB/s, 0:20 left" of the run that is under way
-std::string ProgressWords(const ZEL::PObject& task);
-
 /// An error, which may have several lines, as one.
 std::string OneLine(const std::string& text);
 

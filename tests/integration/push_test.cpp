@@ -65,7 +65,7 @@ TEST_F(PushTest, EachFailureHasItsOwnErrorAndTheNextPushCompletesTheCopy) {
     EXPECT_THAT(Client("push docs -s no.such.invalid -u alice --password-file -", "secret\n"),
                 Ended(1, "cannot be looked up"));
     StopServer();
-    EXPECT_THAT(Push(), Ended(1, "refused"));
+    EXPECT_THAT(Push(), Ended(1, "refuses"));
     StartServer();
     Must(Server("disable"));
     EXPECT_THAT(Push(), Ended(4, "switched off"));

@@ -209,7 +209,7 @@ TEST_F(RsyncWrapperTest, FailuresHaveTheirStatusAndSayInPlainWordsWhatIsWrong) {
         EXPECT_THAT(report_.explanation, AllOf(HasSubstr(words), Not(HasSubstr(kPassword))));
         EXPECT_THAT(test::TakeSyslogTexts(), Contains(HasSubstr(words)));
         EXPECT_EQ(report_.cause == RunCause::UNKNOWN_MODULE,
-                  Has(report_.explanation, "Unknown module"));
+                  Has(report_.details, "Unknown module"));
     }
     EXPECT_THAT(Tree(module_), IsEmpty());
 }

@@ -16,15 +16,26 @@ namespace Backup {
 
 #pragma GCC visibility push(default)
 
-/// How far a copy has come. rsync finds files while it copies, so the totals grow until
-/// `totals_final`.
+/// How far a copy has come. What rsync does not tell is left at its default, never guessed.
 struct RunProgress {
-    uint64_t bytes_done = 0;   ///< bytes of file content handled so far
-    unsigned int percent = 0;  ///< 0..100 of what is known so far
+    /// What `percent` is a share of.
+    enum Basis {
+        NOTHING,  ///< there is no percentage: the search for files goes on
+        FILES,    ///< files checked of all files; what is sent of them is not known beforehand
+        BYTES     ///< bytes of all files: the destination was empty, so that all of them travel
+    };
+    Basis percent_of = NOTHING;
+    unsigned int percent = 0;    ///< 0..100; 100 only when nothing is left to send
+    uint64_t files_checked = 0;  ///< files, folders and links that are as they should be
+    uint64_t files_total = 0;    ///< found so far
+    bool totals_final = false;   ///< the search for files has ended
+    uint64_t bytes_done = 0;     ///< content of the files that had to be sent, so far
     uint64_t bytes_per_second = 0;
-    uint64_t files_left = 0;    ///< files not looked at yet
-    uint64_t files_total = 0;   ///< files found so far
-    bool totals_final = false;  ///< the search for files has ended
+    std::string file;          ///< being sent, as RunChange::path has it; empty between files
+    uint64_t file_bytes = 0;   ///< of that file, so far
+    uint64_t file_length = 0;  ///< of that file
+    /// Since when nothing has moved: no byte of the connection, no word of rsync's.
+    unsigned int seconds_still = 0;
 };
 
 /// One difference that a run makes, or with a dry run would make, at the destination; or an entry
@@ -49,10 +60,10 @@ enum class RunCause {
 struct RunReport {
     int status = -1;  ///< what execute() returned; -1 until then
     RunCause cause = RunCause::NONE;
-    std::string
-        explanation;  ///< why it failed, one or more lines for a person; empty after success
-    uint64_t files_total = 0;     ///< files, folders and links looked at
-    uint64_t files_sent = 0;      ///< regular files whose content travelled
+    std::string explanation;   ///< why it failed, in one sentence for a person; empty after success
+    std::string details;       ///< what rsync and ssh wrote about it, line by line; may be empty
+    uint64_t files_total = 0;  ///< files, folders and links looked at
+    uint64_t files_sent = 0;   ///< regular files whose content travelled
     uint64_t files_deleted = 0;   ///< entries deleted at the destination
     uint64_t bytes_total = 0;     ///< size of all files looked at
     uint64_t bytes_sent = 0;      ///< bytes that this side wrote to the connection
@@ -64,8 +75,8 @@ struct RunOptions {
     unsigned int bandwidth_limit = 0;  ///< KiB a second; 0: no limit
     bool dry_run = false;              ///< copies only: change nothing at the destination
     std::function<void(const RunProgress&)>
-        on_progress;  ///< called on the running thread, with files that end and once a second, at
-                      ///< most five times a second
+        on_progress;  ///< called on the running thread, at least once a second and at most five
+                      ///< times
     std::function<void(const RunChange&)>
         on_change;                ///< called on the running thread, in rsync's order
     RunReport* report = nullptr;  ///< filled when the run ends; the caller's
