@@ -195,7 +195,7 @@ std::string ProgressWords(const RunProgress& progress) {
 }
 
 std::string ProgressLine(const std::string& what, const RunProgress& progress, size_t columns) {
-    std::string line = LastColumns(Printable(what), std::max(columns / 4, kShortestName)) + " ";
+    std::string line = LastColumns(Printable(what), std::max(columns / 3, kShortestName)) + " ";
     if (IsStalled(progress)) {
         return line + ProgressWords(progress);
     }
