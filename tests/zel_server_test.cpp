@@ -7,8 +7,11 @@
 #include "programs/zel_server/command.h"
 #include "programs/zel_server/command_handler.h"
 #include "programs/zel_server/registry.h"
+#include "programs/zel_server/registry_repair.h"
 #include "programs/zel_server/rsyncd_config.h"
+#include "programs/zel_server/shipped_unit.h"
 #include "programs/zel_server/transfer.h"
+#include "programs/zel_server/unit.h"
 #include "tests/support/testing.h"
 
 using namespace programs;
@@ -66,6 +69,7 @@ protected:
         EXPECT_TRUE(SaveServerConfig(config_));
         EXPECT_NE(RecordDiskOf(config_.storage), "");
         EXPECT_NE(RecordDiskOf(root_.Path("disk2")), "");
+        EXPECT_EQ(TARQUISetZEL(1, nullptr, nullptr), 0);
     }
 
     using Params = std::map<std::string, std::string>;
@@ -261,6 +265,77 @@ TEST_F(ServerTest, TheOutcomeOfADataRunIsRecordedAndAnAnswerRemoved) {
     setenv("RSYNC_PID", "4711", 1);
     EXPECT_EQ(EndTransfer(), 0);
     EXPECT_TRUE(fs::is_empty(folder));
+}
+
+// Wherever the file may have been cut, and for a file of the same size without content.
+TEST_F(ServerTest, NobodyGetsAtAShareThatTheRegistryHasLost) {
+    ASSERT_EQ(Pair("A"), kDone);
+    ASSERT_EQ(Start("docs"), kDone);
+    ASSERT_EQ(Finish("share", "docs"), kDone);
+    ASSERT_EQ(Pair("B", "other"), kDone);
+    const std::string whole = test::ReadFile(RegistryFile());
+    const auto others = [&] {
+        EXPECT_NE(Start("docs", "B"), kDone);
+        EXPECT_NE(Start("docs", "A", "mallory"), kDone);
+        EXPECT_NE(Admit("docs", "mallory", kRead), 0);
+        EXPECT_NE(PairingAnswer("B", "docs", "yes").status, kDone);
+    };
+    std::vector<std::string> damaged = {std::string(whole.size(), '\0')};
+    constexpr size_t kStep = 7;  // 1 passes too, and takes half a minute
+    for (size_t size = 0; size < whole.size(); size += kStep) {
+        damaged.push_back(whole.substr(0, size));
+    }
+    for (const std::string& content : damaged) {
+        SCOPED_TRACE(content);
+        root_.Write("usr/tarq/etc/tarqZEL.info", content);
+        others();
+        const auto damage = FindDamage();
+        ASSERT_TRUE(damage);
+        EXPECT_THAT(damage->ownerless, IsEmpty());
+        ASSERT_TRUE(damage->None() || MendRegistry(*damage, config_));
+        EXPECT_TRUE(FindDamage()->None());
+        others();
+        EXPECT_EQ(Pair("A"), kDone);
+        EXPECT_EQ(Start("docs"), kDone);
+        EXPECT_EQ(State("docs").path, root_.Path("storage/docs"));
+    }
+}
+
+TEST_F(ServerTest, AnOwnerThatNothingNamesIsNotMadeUp) {
+    ASSERT_EQ(Pair("A"), kDone);
+    ASSERT_EQ(Start("docs"), kDone);
+    // As an earlier version wrote it.
+    root_.Write("usr/tarq/etc/zel_server/shares.d/docs.conf",
+                "[docs]\n    path = " + root_.Path("storage/docs") + "\n");
+    root_.Write("usr/tarq/etc/tarqZEL.info", "");
+    config_.switched_off = true;
+    ASSERT_THAT(FindDamage()->ownerless, ElementsAre("docs"));
+    ASSERT_TRUE(MendRegistry(*FindDamage(), config_));
+    EXPECT_EQ(Start("docs"), kSwitchedOff);
+    ASSERT_EQ(TARQUISetZEL(1, nullptr, nullptr), 0);
+    EXPECT_EQ(Pair("A"), kRegistryRead);
+    EXPECT_EQ(Pair("A", "other"), kDone);
+    EXPECT_EQ(Start("docs"), kRegistryRead);
+}
+
+TEST(Confinement, FollowsTheUnitAndWhatTheAdminHasMadeOfIt) {
+    const Confinement shipped(kShippedUnit);
+    for (const char* folder : {"/tmp", "/tmp/copies", "/var/tmp/x", "/usr", "/usr/local/nas",
+                               "/usr/tarq/x", "/etc/copies", "/boot/x", "/dev/shm", "/sys/x"}) {
+        EXPECT_NE(shipped.Forbids(folder), "") << folder;
+    }
+    for (const char* folder : {"/srv/copies", "/tmpfiles", "/usrlocal", "/home/nas", "/root/x",
+                               "/mnt/etc", "/usr/tarq/etc/x", "/"}) {
+        EXPECT_EQ(shipped.Forbids(folder), "") << folder;
+    }
+    const Confinement shown(
+        "ProtectSystem=strict\nProtectHome=read-only\nPrivateTmp=no\n"
+        "ReadWritePaths=-/srv/copies /home/nas\nInaccessiblePaths=/srv/copies/private\n");
+    EXPECT_EQ(shown.Forbids("/srv/copies/x"), "");
+    EXPECT_EQ(shown.Forbids("/home/nas"), "");
+    EXPECT_EQ(shown.Forbids("/home/other"), "ProtectHome=read-only");
+    EXPECT_EQ(shown.Forbids("/tmp/x"), "ProtectSystem=strict");
+    EXPECT_EQ(shown.Forbids("/srv/copies/private/x"), "InaccessiblePaths");
 }
 
 TEST_F(ServerTest, AccountsAreKeptInAPrivateFile) {

@@ -18,7 +18,8 @@ std::string ServerStatusText(int status) {
         case kRegistryWrite:
             return "the server cannot write its registry: is its disk full?";
         case kRegistryRead:
-            return "the server cannot read its registry";
+            return "the server cannot read its registry, or has found it damaged: run 'zel_server "
+                   "status' there";
         case kSwitchedOff:
             return "the server is switched off: run 'zel_server enable' there";
         case kNotPaired:
@@ -40,6 +41,9 @@ std::string ServerStatusText(int status) {
             return "the server holds a share whose name differs only in letter case or blanks";
         case kNotRunning:
             return "the share is not being pushed by this client and account";
+        case kServerFault:
+            return "the server's program failed: its system log says why (journalctl -t zel_server "
+                   "there)";
         default:
             return "";
     }

@@ -19,7 +19,8 @@ enum ServerStatus : int {
     kNoEncryption = 215,
     kStorage = 216,
     kNameTaken = 217,
-    kNotRunning = 218
+    kNotRunning = 218,
+    kServerFault = 219
 };
 
 /// What a status of a server command means and what to do about it, for a person; empty for one

@@ -90,4 +90,21 @@ std::optional<std::string> ReadPassword(const std::string& file, const std::stri
     return line;
 }
 
+std::optional<std::string> ReadNewPassword(const std::string& file, const std::string& prompt,
+                                           std::string& error) {
+    const auto password = ReadPassword(file, prompt, error);
+    std::string again;
+    if (password && file.empty() && (!TypeAtTerminal("Once more: ", again) || again != *password)) {
+        error = "the two passwords are not the same";
+        return std::nullopt;
+    }
+    return password;
+}
+
+bool Confirm(const std::string& question) {
+    std::fprintf(stderr, "%s [y/N] ", question.c_str());
+    std::string answer;
+    return ReadLine(std::cin, answer) && (answer == "y" || answer == "Y" || answer == "yes");
+}
+
 }  // namespace programs

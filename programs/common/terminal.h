@@ -11,4 +11,11 @@ namespace programs {
 std::optional<std::string> ReadPassword(const std::string& file, const std::string& prompt,
                                         std::string& error);
 
+/// The same for a password that is set here: one that is typed is asked for twice.
+std::optional<std::string> ReadNewPassword(const std::string& file, const std::string& prompt,
+                                           std::string& error);
+
+/// Asks at the terminal; true when the answer is yes.
+bool Confirm(const std::string& question);
+
 }  // namespace programs

@@ -1,12 +1,9 @@
-// What the admin types: set-up, switch, accounts, and what there is to see.
-#include <pwd.h>
-#include <sys/stat.h>
+// What the admin types: the command line, and what is short enough to stand beside it.
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
-#include <cstring>
-#include <filesystem>
 #include <limits>
 #include <nlohmann/json.hpp>
 
@@ -17,288 +14,120 @@
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/accounts.h"
+#include "programs/zel_server/complaint.h"
 #include "programs/zel_server/names.h"
 #include "programs/zel_server/registry.h"
-#include "programs/zel_server/rsyncd_config.h"
+#include "programs/zel_server/registry_repair.h"
+#include "programs/zel_server/serve.h"
 #include "programs/zel_server/server_config.h"
+#include "programs/zel_server/setup.h"
+#include "programs/zel_server/share_module.h"
+#include "programs/zel_server/status.h"
 #include "tarq/core.h"
-#include "tarq/root_path.h"
 
 namespace {
 
-namespace fs = std::filesystem;
+using Json = nlohmann::ordered_json;
 using programs::Table;
 using namespace zel_server;
 
-constexpr int kOk = 0;
-constexpr int kFailed = 1;
-constexpr int kUsage = 2;
-
-constexpr int kSystemPort = 873;  // rsync's own; only root may listen there
-constexpr int kUnprivilegedPort = 8873;
-constexpr char kStorageUser[] = "zel";
 constexpr char kMultiSourceMarker[] = "ZELMULTI-SRC-SUPPORT";
 
-int Fail(const std::string& message) {
-    fprintf(stderr, "zel_server: %s\n", message.c_str());
-    return kFailed;
+int FailedOnRegistry(const char* what) {
+    return Complain(std::string("cannot ") + what + " the registry " + RegistryFile() + ": " +
+                    KAPICErrText(KAPICErrGet()));
 }
 
-int FailErrno(const std::string& what) {
-    return Fail(what + ": " + strerror(errno));
-}
+// ---- Switch ----
 
-std::string ThisProgram() {
-    std::error_code error;
-    return fs::read_symlink("/proc/self/exe", error);
-}
-
-// ---- Set-up ----
-
-struct SetupOptions {
-    std::string storage;
-    std::vector<std::string> volumes;  // NAME=FOLDER
-    std::string address;
-    std::string user;
-    int port = 0;
-    bool no_encryption = false;
-};
-
-bool MakeFolders(std::string& failed) {
-    for (const std::string& folder : {ConfigFolder(), ShareModules(), AdminModules(),
-                                      AnswerFolder(), TARQ::RootPath("/var/log")}) {
-        std::error_code error;
-        fs::create_directories(folder, error);
-        if (error) {
-            failed = folder + ": " + error.message();
-            return false;
-        }
-    }
-    return true;
-}
-
-// The system user that owns the copies when the daemon runs as root, made when it is missing.
-bool HaveStorageUser(const std::string& user) {
-    if (getpwnam(user.c_str()) != nullptr) {
-        return true;
-    }
-    FILE* const useradd =
-        KAPICPopen("/usr/sbin/useradd", "r", "--system", "--no-create-home", "--shell",
-                   "/usr/sbin/nologin", user.c_str(), static_cast<const char*>(nullptr));
-    return useradd != nullptr && KAPICPclose(useradd) == 0 && getpwnam(user.c_str()) != nullptr;
-}
-
-// Makes a storage folder and says which disk it is on.
-int TakeFolder(const std::string& folder) {
-    if (!IsPlainPath(folder)) {
-        return Fail(
-            "'" + folder +
-            "' cannot be a storage folder: give an absolute path without quotes, '%' or '\\'");
-    }
-    std::error_code error;
-    fs::create_directories(folder, error);
-    if (error) {
-        return Fail("cannot make the storage folder '" + folder + "': " + error.message());
-    }
-    const std::string disk = RecordDiskOf(folder);
-    if (disk.empty()) {
-        return Fail("cannot tell which disk '" + folder +
-                    "' is on: " + KAPICErrText(KAPICErrGet()));
-    }
-    printf("Storage: %s, on the disk mounted at %s\n", folder.c_str(), disk.c_str());
-    return kOk;
-}
-
-int Setup(const SetupOptions& options) {
-    const bool is_system = TARQ::RootFolder().empty();
-    if (is_system && geteuid() != 0) {
-        return Fail("run it as root, or set TARQ_ROOT to a folder of yours to run a server in it");
-    }
-    if (!is_system && !IsPlainPath(TARQ::RootFolder())) {
-        return Fail("TARQ_ROOT must be an absolute path without quotes, '%' or '\\'");
-    }
-    ServerConfig config;
-    config.port = options.port != 0 ? options.port : is_system ? kSystemPort : kUnprivilegedPort;
-    config.address = options.address;
-    config.storage = fs::path(options.storage).lexically_normal();
-    config.encryption = !options.no_encryption;
-    config.program = ThisProgram();
-    if (config.storage.size() > 1 && config.storage.back() == '/') {
-        config.storage.pop_back();
-    }
-    if (!IsPlainPath(config.program)) {
-        return Fail("zel_server must be installed at a path without quotes, '%' or '\\'");
-    }
-    for (const std::string& volume : options.volumes) {
-        const size_t equals = volume.find('=');
-        const std::string name = volume.substr(0, equals);
-        if (equals == std::string::npos || !IsShareName(name)) {
-            fprintf(stderr, "zel_server: --volume takes NAME=FOLDER, not '%s'\n", volume.c_str());
-            return kUsage;
-        }
-        config.volumes[name] = volume.substr(equals + 1);
-    }
-    // A server in a folder of its own leaves the machine's users alone.
-    if (is_system) {
-        config.user = options.user.empty() ? kStorageUser : options.user;
-        if (!HaveStorageUser(config.user)) {
-            return Fail("cannot make the system user '" + config.user + "' that owns the copies");
-        }
-    }
-    std::string failed;
-    if (!MakeFolders(failed)) {
-        return Fail("cannot make " + failed);
-    }
-    int result = TakeFolder(config.storage);
-    for (const auto& volume : config.volumes) {
-        result = result == kOk ? TakeFolder(volume.second) : result;
-    }
-    if (result != kOk) {
-        return result;
-    }
-    if (!SaveServerConfig(config) || !WriteRsyncdConfig(config)) {
-        return FailErrno("cannot write the configuration in " + ConfigFolder());
-    }
-    if (TARQUISetZEL(1, nullptr, nullptr) != 0) {
-        return Fail("cannot write the registry " + RegistryFile());
-    }
-    printf("Written: %s\n         (your own modules go into %s)\n\nNext:\n", RsyncdConfig().c_str(),
-           AdminModules().c_str());
-    printf("  zel_server account add NAME     an account for each client\n  %s\n",
-           StartCommand().c_str());
-    printf("The server then listens on port %d.\n", config.port);
-    if (is_system && ZEL::IsPathExist("/etc/rsyncd.conf")) {
-        printf(
-            "\n/etc/rsyncd.conf is left alone. If an rsync daemon of yours listens on the same "
-            "port, move its modules "
-            "into\n%s, or choose another --port.\n",
-            AdminModules().c_str());
-    }
-    return kOk;
-}
-
-// ---- Switch and pairing ----
-
+// In the registry, where it counts, and in the configuration, should the registry be lost.
 int SetSwitch(bool on) {
+    auto config = LoadServerConfig();
+    if (!config) {
+        return Complain(kNotSetUp);
+    }
     const RegistryLock lock;
     if (!lock.Held() || TARQUISetZEL(on ? 1 : 0, nullptr, nullptr) != 0) {
-        return Fail("cannot write the registry " + RegistryFile() +
-                    ": is the server set up, and are you its owner?");
+        return FailedOnRegistry("write");
+    }
+    config->switched_off = !on;
+    if (!SaveServerConfig(*config)) {
+        return ComplainErrno("cannot write " + ConfigFile());
     }
     puts(on ? "The server accepts clients." : "The server refuses all clients.");
-    return kOk;
+    return kExitOk;
 }
+
+// ---- A damaged registry ----
+
+int Repair() {
+    const auto config = LoadServerConfig();
+    if (!config) {
+        return Complain(kNotSetUp);
+    }
+    const RegistryLock lock;
+    const auto damage = lock.Held() ? FindDamage() : std::nullopt;
+    if (!damage) {
+        return FailedOnRegistry("read");
+    }
+    if (damage->None()) {
+        puts("The registry is whole: nothing to do.");
+        return kExitOk;
+    }
+    if (damage->switch_lost || !damage->shares.empty()) {
+        if (!MendRegistry(*damage, *config)) {
+            return ComplainErrno("cannot write the registry " + RegistryFile());
+        }
+        printf("Mended:  %s again with their owners; the service is switched %s\n",
+               programs::Count(damage->shares.size(), "share").c_str(),
+               ReadSwitch() == Switch::kOn ? "on" : "off");
+        printf("Kept:    %s, the damaged file\n", DamagedCopy().c_str());
+        puts("Clients that were forgotten pair again by themselves.");
+    }
+    for (const std::string& share : damage->ownerless) {
+        printf(
+            "Closed:  share '%s', as nothing tells to whom it belongs: 'zel_server shares "
+            "--release' "
+            "gives it to\n         the next client and account that push it\n",
+            programs::Printable(share).c_str());
+    }
+    return damage->ownerless.empty() ? kExitOk : kExitFailed;
+}
+
+// ---- Pairing ----
 
 int ResetPair() {
     const RegistryLock lock;
     Section pairing;
     if (!lock.Held() || ReadSection("PairedClientInfo", pairing) == ReadResult::kFailed) {
-        return Fail("cannot read the registry " + RegistryFile());
+        return FailedOnRegistry("read");
     }
     if (pairing["clientID"] == kMultiSourceMarker) {
         puts("The server serves several clients already: nothing to do.");
-        return kOk;
+        return kExitOk;
     }
     if (zel_svr_reset_pair() != 0) {
-        return Fail("cannot write the registry " + RegistryFile());
+        return FailedOnRegistry("write");
     }
     puts("The server now serves several clients; the one that was paired stays paired.");
-    return kOk;
+    return kExitOk;
 }
 
 // ---- What there is ----
 
-class ServerStatus {
-public:
-    ServerStatus() : read_(zel_svr_get_status(&status_) == 0) {}
-    ~ServerStatus() {
-        if (read_) {
-            zel_svr_put_status(&status_);
-        }
-    }
-    ServerStatus(const ServerStatus&) = delete;
-    ServerStatus& operator=(const ServerStatus&) = delete;
-
-    bool Read() const { return read_; }
-    bool Serving() const { return status_.enabled != 0; }
-    bool Busy() const { return status_.busy != 0; }
-    std::string Client() const { return status_.client_id != nullptr ? status_.client_id : ""; }
-
-private:
-    zel_svr_status status_ = {};
-    bool read_;
-};
-
-int ShowStatus(bool as_json) {
-    const auto config = LoadServerConfig();
-    if (!config) {
-        return Fail("not set up: run 'zel_server setup --storage FOLDER'");
-    }
-    const ServerStatus status;
-    if (!status.Read()) {
-        return Fail("cannot read the registry " + RegistryFile());
-    }
-    const bool several = status.Client() == kMultiSourceMarker;
-    const std::string pairing = several                   ? "several clients"
-                                : status.Client().empty() ? "none"
-                                                          : status.Client();
-    std::error_code error;
-    const fs::space_info space = fs::space(config->storage, error);
-    if (as_json) {
-        const nlohmann::ordered_json object = {
-            {"switched_on", IsSwitchedOn()},
-            {"daemon_running", KAPICProcAliveByPidFile(PidFile().c_str()) != 0},
-            {"serving", status.Serving()},
-            {"busy", status.Busy()},
-            {"paired", pairing},
-            {"port", config->port},
-            {"storage", config->storage},
-            {"storage_there", IsStorageThere(config->storage)},
-            {"free_bytes", error ? 0 : space.available}};
-        puts(object.dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace).c_str());
-        return kOk;
-    }
-    printf("Switch:   %s\n", IsSwitchedOn() ? "on" : "off");
-    printf("Daemon:   %s\n",
-           KAPICProcAliveByPidFile(PidFile().c_str()) != 0 ? "running" : "not running");
-    printf("Serving:  %s\n", status.Serving() ? "yes" : "no");
-    printf("Busy:     %s\n", status.Busy() ? "yes" : "no");
-    printf("Paired:   %s\n", programs::Printable(pairing).c_str());
-    printf("Port:     %d\n", config->port);
-    printf("Storage:  %s (%s)\n", config->storage.c_str(),
-           !IsStorageThere(config->storage) ? "NOT THERE"
-           : error                          ? "free space unknown"
-                   : (programs::HumanBytes(space.available) + " free").c_str());
-    return kOk;
-}
-
-// The names behind `prefix` of all such sections; nothing, with the complaint made, when they
-// cannot be read.
-std::optional<std::vector<std::string>> NamesOf(const std::string& prefix) {
+int ListClients(bool as_json) {
     const auto sections = SectionNames();
     if (!sections) {
-        Fail("cannot read the registry " + RegistryFile());
-        return std::nullopt;
-    }
-    std::vector<std::string> names;
-    for (const std::string& section : *sections) {
-        if (section.compare(0, prefix.size(), prefix) == 0) {
-            names.push_back(section.substr(prefix.size()));
-        }
-    }
-    return names;
-}
-
-int ListClients(bool as_json) {
-    const auto clients = NamesOf("CLIENTID_");
-    if (!clients) {
-        return kFailed;
+        return FailedOnRegistry("read");
     }
     Table table({"CLIENT", "KNOWS THIS SERVER AS"});
-    for (const std::string& client : *clients) {
-        Section section;
-        ReadSection("CLIENTID_" + client, section);
-        table.Add({client, section["ServerName"]});
+    const std::string prefix = "CLIENTID_";
+    for (const std::string& name : *sections) {
+        if (name.compare(0, prefix.size(), prefix) == 0) {
+            Section section;
+            ReadSection(name, section);
+            table.Add({name.substr(prefix.size()), section["ServerName"]});
+        }
     }
     Section pairing;
     ReadSection("PairedClientInfo", pairing);
@@ -306,104 +135,177 @@ int ListClients(bool as_json) {
         table.Add({pairing["clientID"], pairing["serverName"]});
     }
     table.Print(as_json);
-    return kOk;
+    return kExitOk;
 }
 
-std::string OutcomeOf(const ShareState& state) {
+// How a share is: in a word for programs, and for people.
+struct Outcome {
+    const char* word;
+    const char* text;
+    bool ended;  // by a push whose time is known
+};
+
+Outcome OutcomeOf(const ShareState& state, bool damaged) {
+    if (damaged) {
+        return {"damaged", "damaged: run 'zel_server repair'", false};
+    }
     if (!state.running_id.empty()) {
-        return "being pushed";
+        return {"running", "being pushed", false};
     }
     if (state.last_result.empty()) {
-        return "never pushed";
+        return {"new", "never pushed", false};
     }
-    const auto time = programs::ParseNumber(state.last_time, std::numeric_limits<time_t>::max());
-    const std::string when = time ? " " + programs::HumanTime(static_cast<int64_t>(*time)) : "";
-    if (state.last_result == "0") {
-        return "complete" + when;
+    if (state.last_result == kMended) {
+        return {"unknown", "not known until the next push", false};
     }
-    return (state.last_result == kEndedByClient
-                ? "not complete"
-                : "not complete (rsync " + state.last_result + ")") +
-           when;
+    return state.last_result == "0" ? Outcome{"complete", "complete", true}
+                                    : Outcome{"incomplete", "not complete", true};
+}
+
+std::string OutcomeText(const Outcome& outcome, const std::optional<uint64_t>& status,
+                        const std::optional<uint64_t>& time) {
+    std::string text = outcome.text;
+    if (outcome.ended && status && *status != 0) {
+        text += " (rsync " + std::to_string(*status) + ")";
+    }
+    return outcome.ended && time ? text + " " + programs::HumanTime(static_cast<int64_t>(*time))
+                                 : text;
+}
+
+Json OrNull(const std::optional<uint64_t>& number) {
+    return number ? Json(*number) : Json(nullptr);
 }
 
 int ListShares(bool as_json) {
-    const auto shares = NamesOf("SHARE_");
-    if (!shares) {
-        return kFailed;
+    const auto names = KnownShares();
+    if (!names) {
+        return FailedOnRegistry("read");
     }
     Table table({"SHARE", "CLIENT", "ACCOUNT", "STATE", "FOLDER"});
-    for (const std::string& share : *shares) {
+    Json rows = Json::array();
+    for (const std::string& name : *names) {
         ShareState state;
-        ReadShare(share, state);
-        table.Add({share, state.Owner(), state.account, OutcomeOf(state), state.path});
+        const bool damaged = ReadShare(name, state) != ReadResult::kRead;
+        const Outcome outcome = OutcomeOf(state, damaged);
+        const auto status = programs::ParseNumber(state.last_result, 255);
+        const auto time =
+            programs::ParseNumber(state.last_time, std::numeric_limits<time_t>::max());
+        if (as_json) {
+            rows.push_back({{"share", name},
+                            {"client", state.Owner()},
+                            {"account", state.account},
+                            {"state", outcome.word},
+                            {"rsync_status", OrNull(status)},
+                            {"time", OrNull(time)},
+                            {"folder", state.path}});
+        } else {
+            table.Add({name, state.Owner(), state.account, OutcomeText(outcome, status, time),
+                       state.path});
+        }
     }
-    table.Print(as_json);
-    return kOk;
+    if (as_json) {
+        puts(rows.dump(2, ' ', false, Json::error_handler_t::replace).c_str());
+    } else {
+        table.Print(false);
+    }
+    return kExitOk;
 }
 
 int ReleaseShare(const std::string& share) {
+    const auto config = LoadServerConfig();
+    if (!config) {
+        return Complain(kNotSetUp);
+    }
     const RegistryLock lock;
     ShareState state;
-    if (!lock.Held() || ReadShare(share, state) != ReadResult::kRead) {
-        return Fail("there is no share '" + share + "': see 'zel_server shares'");
+    const ReadResult read = lock.Held() ? ReadShare(share, state) : ReadResult::kFailed;
+    if (read == ReadResult::kFailed) {
+        return FailedOnRegistry("read");
+    }
+    if (read == ReadResult::kMissing) {
+        return Complain("there is no share '" + programs::Printable(share) +
+                        "': see 'zel_server shares'");
+    }
+    const auto module = ReadShareModule(share);
+    if (read == ReadResult::kDamaged && module) {
+        state.module = module->module;
+        state.path = module->path;
+        state.last_result = kMended;
     }
     state.running_id.clear();
     state.complete_id.clear();
     state.account.clear();
     if (!WriteShare(share, state)) {
-        return Fail("cannot write the registry " + RegistryFile());
+        return FailedOnRegistry("write");
+    }
+    if (!state.path.empty() && !WriteShareModule(*config, share, state)) {
+        return ComplainErrno("cannot write the module of the share in " + ShareModules());
     }
     printf(
         "Share '%s' belongs to nobody now; the next client and account that push it get it, copy "
         "included.\n",
-        share.c_str());
-    return kOk;
+        programs::Printable(share).c_str());
+    return kExitOk;
 }
 
 // ---- Accounts ----
 
-int AddAccount(const std::string& name, const std::string& password_file) {
+int AddAccount(const std::string& name, const std::string& password_file, bool reset) {
     if (!IsAccountName(name)) {
         fprintf(stderr,
                 "zel_server: '%s' cannot be an account: use letters, digits and . _ - @ +, a "
                 "letter or digit first\n",
                 programs::Printable(name).c_str());
-        return kUsage;
+        return kExitUsage;
+    }
+    const auto names = Accounts();
+    if (!names) {
+        return ComplainErrno("cannot read " + SecretsFile());
+    }
+    const bool is_new = std::find(names->begin(), names->end(), name) == names->end();
+    const bool is_typed = password_file.empty() && isatty(STDIN_FILENO) != 0;
+    if (!is_new && is_typed && !reset &&
+        !programs::Confirm("There is an account '" + name +
+                           "': give it another password, so that clients with the old one are "
+                           "refused?")) {
+        return Complain("nothing was changed");
     }
     std::string error;
     const auto password =
-        programs::ReadPassword(password_file, "Password for " + name + ": ", error);
+        programs::ReadNewPassword(password_file, "Password for " + name + ": ", error);
     if (!password) {
-        return Fail(error);
+        return Complain(error);
     }
     if (!SetAccount(name, *password)) {
-        return FailErrno("cannot write " + SecretsFile() + " (is the server set up?)");
+        return ComplainErrno("cannot write " + SecretsFile() + " (is the server set up?)");
     }
-    printf("Account '%s' may log in.\n", name.c_str());
-    return kOk;
+    printf(is_new ? "Account '%s' may log in.\n"
+                  : "Account '%s' was there already: it has the new password now, and the old one "
+                    "no longer holds.\n",
+           name.c_str());
+    return kExitOk;
 }
 
 int DropAccount(const std::string& name) {
     if (!RemoveAccount(name)) {
-        return errno == ENOENT ? Fail("there is no account '" + name + "'")
-                               : FailErrno("cannot write " + SecretsFile());
+        return errno == ENOENT ? Complain("there is no account '" + name + "'")
+                               : ComplainErrno("cannot write " + SecretsFile());
     }
     printf("Account '%s' may no longer log in; its shares' copies stay.\n", name.c_str());
-    return kOk;
+    return kExitOk;
 }
 
 int ListAccounts(bool as_json) {
     const auto names = Accounts();
     if (!names) {
-        return FailErrno("cannot read " + SecretsFile());
+        return ComplainErrno("cannot read " + SecretsFile());
     }
     Table table({"ACCOUNT"});
     for (const std::string& name : *names) {
         table.Add({name});
     }
     table.Print(as_json);
-    return kOk;
+    return kExitOk;
 }
 
 }  // namespace
@@ -414,7 +316,7 @@ int RunCommandLine(int argc, char** argv) {
     programs::SpeakPlainly(app, true);
     app.require_subcommand(1);
     app.set_version_flag("--version", ZEL_VERSION, "Show the version");
-    int result = kOk;
+    int result = kExitOk;
     bool as_json = false;
     const auto json_flag = [&](CLI::App* command) {
         command->add_flag("--json", as_json, "Write JSON, for programs");
@@ -422,7 +324,7 @@ int RunCommandLine(int argc, char** argv) {
 
     SetupOptions setup;
     CLI::App* const setup_command =
-        app.add_subcommand("setup", "Write the configuration of the rsync daemon");
+        app.add_subcommand("setup", "Configure the server, and have its rsync daemon run");
     setup_command->add_option("--storage", setup.storage, "Folder that receives the shares")
         ->option_text("FOLDER")
         ->required();
@@ -448,6 +350,12 @@ int RunCommandLine(int argc, char** argv) {
         result = ResetPair();
     });
 
+    app.add_subcommand("repair", "Put back what a damaged registry has lost")->callback([&] {
+        result = Repair();
+    });
+    app.add_subcommand("serve", "Run the rsync daemon in the foreground, as the unit does")
+        ->callback([&] { result = Serve(); });
+
     CLI::App* const status = app.add_subcommand("status", "Show whether the server serves");
     json_flag(status);
     status->callback([&] { result = ShowStatus(as_json); });
@@ -471,7 +379,9 @@ int RunCommandLine(int argc, char** argv) {
     add->add_option("name", name, "The account")->required();
     add->add_option("--password-file", password_file,
                     "File with the password ('-': standard input)");
-    add->callback([&] { result = AddAccount(name, password_file); });
+    bool reset = false;
+    add->add_flag("--reset", reset, "Do not ask before an account gets another password");
+    add->callback([&] { result = AddAccount(name, password_file, reset); });
     CLI::App* const remove = account->add_subcommand("rm", "Remove an account");
     remove->add_option("name", name, "The account")->required();
     remove->callback([&] { result = DropAccount(name); });
@@ -484,6 +394,6 @@ int RunCommandLine(int argc, char** argv) {
         "The rsync daemon itself calls 'handle-command', 'admit-transfer' and\n"
         "'end-transfer'.\n"
         "Exit codes: 0 done, 1 failed, 2 wrong usage.");
-    const int ended = programs::Parse(app, programs::CommandWords(argc, argv), kUsage);
+    const int ended = programs::Parse(app, programs::CommandWords(argc, argv), kExitUsage);
     return ended >= 0 ? ended : result;
 }

@@ -1,5 +1,6 @@
 #include "programs/zel_server/command_handler.h"
 
+#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -8,6 +9,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <exception>
+#include <new>
 #include <vector>
 
 #include "ZEL/is_syncedshare.h"
@@ -16,7 +19,7 @@
 #include "programs/common/text.h"
 #include "programs/zel_server/names.h"
 #include "programs/zel_server/registry.h"
-#include "programs/zel_server/rsyncd_config.h"
+#include "programs/zel_server/share_module.h"
 #include "tarq/owners.h"
 
 namespace zel_server {
@@ -46,7 +49,8 @@ std::optional<bool> YesNo(const std::string* value) {
 // Why `account` of `client` may not have the share; kDone when it may.
 int RefusalOf(const std::string& share, const std::string& client, const std::string& account) {
     ShareState state;
-    if (ReadShare(share, state) == ReadResult::kFailed) {
+    const ReadResult read = ReadShare(share, state);
+    if (read == ReadResult::kFailed || read == ReadResult::kDamaged) {
         return kRegistryRead;
     }
     if (!state.Owner().empty() && state.Owner() != client) {
@@ -251,15 +255,17 @@ Answer StartSync(const Request& request) {
     if (state.path.empty() || state.path.substr(state.path.rfind('/') + 1) != state.module) {
         state.path = StorageFor(request.config, start->volume) + "/" + state.module;
     }
-    if (!IsStorageThere(state.path.substr(0, state.path.rfind('/'))) ||
-        !MakeShareFolder(request.config, state.path) ||
-        !WriteShareModule(request.config, start->share, state.module, state.path)) {
+    if (CheckStorage(state.path.substr(0, state.path.rfind('/'))) != StorageState::kReady ||
+        !MakeShareFolder(request.config, state.path)) {
         return {kStorage, ""};
     }
     state.running_id = request.Client();
     state.account = request.account;
     state.last_result.clear();
-    return {WriteShare(start->share, state) ? kDone : kRegistryWrite, ""};
+    if (!WriteShare(start->share, state)) {
+        return {kRegistryWrite, ""};
+    }
+    return {WriteShareModule(request.config, start->share, state) ? kDone : kStorage, ""};
 }
 
 Answer UpdateTaskStatus(const Request& request) {
@@ -279,7 +285,8 @@ Answer FinishShare(const Request& request, const std::string& share, bool comple
         return {kBadArgument, ""};
     }
     ShareState state;
-    if (ReadShare(share, state) == ReadResult::kFailed) {
+    const ReadResult read = ReadShare(share, state);
+    if (read == ReadResult::kFailed || read == ReadResult::kDamaged) {
         return {kRegistryRead, ""};
     }
     if (state.running_id != request.Client() || state.account != request.account) {
@@ -349,11 +356,29 @@ std::string ReadStandardInput() {
     return text;
 }
 
+// Whatever goes wrong on the way, the client is told by a status.
+Answer AnswerTo(const std::string& text, const std::string& account) {
+    try {
+        const std::optional<ServerConfig> config = LoadServerConfig();
+        const std::optional<Command> command = ParseCommand(text);
+        return !config    ? Answer{kStorage, ""}
+               : !command ? Answer{kBadArgument, ""}
+                          : Execute(*config, account, *command);
+    } catch (const std::bad_alloc&) {
+        return {kNoMemory, ""};
+    } catch (const std::exception& error) {
+        syslog(LOG_ERR, "zel_server: a command of account [%s] failed: %s", account.c_str(),
+               error.what());
+        return {kServerFault, ""};
+    }
+}
+
 }  // namespace
 
 Answer Execute(const ServerConfig& config, const std::string& account, const Command& command) {
-    if (!IsSwitchedOn()) {
-        return {kSwitchedOff, ""};
+    const Switch on = ReadSwitch();
+    if (on != Switch::kOn) {
+        return {on == Switch::kOff ? kSwitchedOff : kRegistryRead, ""};
     }
     for (const CommandEntry& entry : kCommands) {
         if (command.name == entry.name) {
@@ -378,14 +403,7 @@ int HandleCommand() {
         puts("This module takes commands of the synchronisation service only.");
         return 1;
     }
-    const std::optional<ServerConfig> config = LoadServerConfig();
-    const std::optional<Command> command = ParseCommand(text);
-    Answer answer{kBadArgument, ""};
-    if (!config) {
-        answer.status = kStorage;
-    } else if (command) {
-        answer = Execute(*config, account, *command);
-    }
+    const Answer answer = AnswerTo(text, account);
     if (!PrepareAnswers(account) || !WriteAnswer(account, *session, connection, answer)) {
         printf("The server cannot write its answer: %s\n", strerror(errno));
         return 1;

@@ -2,6 +2,7 @@
 
 #include "ZEL/is_syncedshare.h"
 #include "programs/zel_server/server_config.h"
+#include "programs/zel_server/share_module.h"
 #include "tarq/owners.h"
 
 namespace zel_server {
@@ -34,6 +35,13 @@ constexpr ShareKey kShareKeys[] = {
     {"LastResult", &ShareState::last_result},
     {"LastTime", &ShareState::last_time},
 };
+
+// Whether a value is as it was written. No value has a quote: one that begins with it has lost the
+// end of its line.
+bool IsWhole(const Section& section, const char* key) {
+    const auto found = section.find(key);
+    return found != section.end() && found->second.find('"') == std::string::npos;
+}
 
 }  // namespace
 
@@ -72,7 +80,17 @@ ReadResult ReadShare(const std::string& share, ShareState& state) {
     Section section;
     const ReadResult result = ReadSection("SHARE_" + share, section);
     state = ShareState();
+    if (result == ReadResult::kFailed) {
+        return result;
+    }
+    if (result == ReadResult::kMissing) {
+        return HasShareModule(share) ? ReadResult::kDamaged : result;
+    }
     for (const ShareKey& entry : kShareKeys) {
+        if (!IsWhole(section, entry.key)) {
+            state = ShareState();
+            return ReadResult::kDamaged;
+        }
         state.*entry.member = section[entry.key];
     }
     return result;
@@ -98,10 +116,11 @@ bool WriteTaskStatus(const std::string& task, const std::string& status) {
     return hash && ZELServerUpdateTask(task.c_str(), hash.get()) == 0;
 }
 
-bool IsSwitchedOn() {
+Switch ReadSwitch() {
     Section pairing;
-    return ReadSection("PairedClientInfo", pairing) != ReadResult::kFailed &&
-           pairing["zelEnabled"] != "no";
+    const bool known = ReadSection("PairedClientInfo", pairing) == ReadResult::kRead;
+    const std::string enabled = known ? pairing["zelEnabled"] : "";
+    return enabled == "yes" ? Switch::kOn : enabled == "no" ? Switch::kOff : Switch::kUnknown;
 }
 
 Paired IsPaired(const std::string& client_id) {

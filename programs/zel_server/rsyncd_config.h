@@ -7,20 +7,14 @@
 
 namespace zel_server {
 
-/// Writes rsyncd.conf: the daemon's own part, the command module, and the folders of the shares'
-/// and the admin's modules. False, with errno set, on failure.
+/// Writes rsyncd.conf, if it is not there already word for word: the daemon's own part, the command
+/// module, and the folders of the shares' and the admin's modules. False, with errno set, on
+/// failure.
 bool WriteRsyncdConfig(const ServerConfig& config);
 
-/// Makes a share's folder, if it is not there yet, for the user that owns the copies.
-bool MakeShareFolder(const ServerConfig& config, const std::string& path);
-
-/// Writes the module of one share, if it is not there already word for word. The daemon knows it
-/// from the next connection on.
-bool WriteShareModule(const ServerConfig& config, const std::string& share,
-                      const std::string& module, const std::string& path);
-
-/// The command that starts the daemon, for a person to type.
-std::string StartCommand();
+/// An exec line of the daemon, which a shell reads and then is. The root folder is named: the
+/// daemon may have been started without.
+std::string ExecLine(const ServerConfig& config, const char* operation);
 
 /// Whether a path can stand in the daemon's configuration and in its exec lines.
 bool IsPlainPath(const std::string& path);

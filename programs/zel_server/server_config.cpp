@@ -1,6 +1,10 @@
 #include "programs/zel_server/server_config.h"
 
+#include <sys/stat.h>
 #include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
 
 #include "programs/common/text.h"
 #include "tarq/owners.h"
@@ -45,6 +49,16 @@ std::string MountPathOf(const std::string& folder) {
 
 }  // namespace
 
+std::vector<std::string> ServerConfig::Folders() const {
+    std::vector<std::string> folders = {storage};
+    for (const auto& volume : volumes) {
+        if (std::find(folders.begin(), folders.end(), volume.second) == folders.end()) {
+            folders.push_back(volume.second);
+        }
+    }
+    return folders;
+}
+
 std::string ConfigFolder() {
     return TARQ::RootPath("/usr/tarq/etc/zel_server");
 }
@@ -88,6 +102,7 @@ std::optional<ServerConfig> LoadServerConfig() {
     config.encryption = Value(values, "encryption") != "no";
     config.user = Value(values, "user");
     config.program = Value(values, "program");
+    config.switched_off = Value(values, "switch") == "off";
     if (!port || *port == 0 || config.storage.empty() || config.program.empty()) {
         return std::nullopt;
     }
@@ -109,7 +124,8 @@ bool SaveServerConfig(const ServerConfig& config) {
                                        {"storage", config.storage},
                                        {"encryption", config.encryption ? "yes" : "no"},
                                        {"user", config.user},
-                                       {"program", config.program}}) &&
+                                       {"program", config.program},
+                                       {"switch", config.switched_off ? "off" : "on"}}) &&
            SetSection(kVolumesSection, config.volumes);
 }
 
@@ -118,12 +134,29 @@ std::string StorageFor(const ServerConfig& config, const std::string& volume_nam
     return volume != config.volumes.end() ? volume->second : config.storage;
 }
 
-bool IsStorageThere(const std::string& folder) {
-    TARQ::HashOwner disks;
+StorageState CheckStorage(const std::string& folder) {
+    struct stat info = {};
+    if (stat(folder.c_str(), &info) != 0) {
+        return errno == EACCES ? StorageState::kNotPermitted : StorageState::kAbsent;
+    }
     // A storage disk that is not mounted leaves an empty folder on another disk: nothing may be put
     // there.
-    return access(folder.c_str(), W_OK | X_OK) == 0 && GetSection(kDisksSection, disks) &&
-           Value(disks, folder.c_str()) == MountPathOf(folder);
+    const std::string disk = RecordedDiskOf(folder);
+    if (disk.empty() || disk != MountPathOf(folder)) {
+        return StorageState::kOtherDisk;
+    }
+    if (!S_ISDIR(info.st_mode)) {
+        return StorageState::kAbsent;
+    }
+    if (access(folder.c_str(), W_OK | X_OK) == 0) {
+        return StorageState::kReady;
+    }
+    return errno == EROFS ? StorageState::kReadOnly : StorageState::kNotPermitted;
+}
+
+std::string RecordedDiskOf(const std::string& folder) {
+    TARQ::HashOwner disks;
+    return GetSection(kDisksSection, disks) ? Value(disks, folder.c_str()) : "";
 }
 
 std::string RecordDiskOf(const std::string& folder) {

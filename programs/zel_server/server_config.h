@@ -5,6 +5,7 @@
 #include <map>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace zel_server {
 
@@ -17,6 +18,11 @@ struct ServerConfig {
     bool encryption = true;  ///< encrypted shares are accepted
     std::string user;        ///< system user that owns the copies; empty: who runs the daemon
     std::string program;     ///< path of zel_server, for the daemon's exec lines
+    bool switched_off =
+        false;  ///< the registry's switch as the admin last turned it, should that be lost
+
+    /// All folders that receive shares, the common one first, each once.
+    std::vector<std::string> Folders() const;
 };
 
 /// The fixed places, below the root folder.
@@ -39,11 +45,14 @@ bool SaveServerConfig(const ServerConfig& config);
 /// The folder for shares of the volume that a client names: that volume's, or the common one.
 std::string StorageFor(const ServerConfig& config, const std::string& volume_name);
 
-/// Whether a storage folder is there, writable, and on the disk that it was on at set-up.
-bool IsStorageThere(const std::string& folder);
+/// How a storage folder is. kOtherDisk: not on the disk that it was on at set-up.
+enum class StorageState { kReady, kAbsent, kOtherDisk, kReadOnly, kNotPermitted };
+StorageState CheckStorage(const std::string& folder);
 
-/// Remembers which disk `folder` is on, for IsStorageThere; its mount path, empty when that cannot
-/// be told or written.
+/// Remembers which disk `folder` is on, for CheckStorage; its mount path, empty when that cannot be
+/// told or written.
 std::string RecordDiskOf(const std::string& folder);
+/// The mount path that was remembered; empty when none was.
+std::string RecordedDiskOf(const std::string& folder);
 
 }  // namespace zel_server

@@ -67,10 +67,15 @@ int AdmitTransfer() {
     if (!IsShareName(share) || !IsAccountName(connection.account)) {
         return Refuse("This share takes pushes of the synchronisation service only.");
     }
-    if (!IsSwitchedOn()) {
+    const Switch on = ReadSwitch();
+    const ReadResult read = ReadShare(share, state);
+    if (on == Switch::kUnknown || read == ReadResult::kDamaged || read == ReadResult::kFailed) {
+        return Refuse("The server's registry is damaged: see 'zel_server status' there.");
+    }
+    if (on == Switch::kOff) {
         return Refuse("The synchronisation service is switched off.");
     }
-    if (ReadShare(share, state) != ReadResult::kRead || state.module != connection.module) {
+    if (read != ReadResult::kRead || state.module != connection.module) {
         return Refuse("This share is not known to the synchronisation service.");
     }
     if (state.account != connection.account) {

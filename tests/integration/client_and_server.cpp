@@ -26,8 +26,8 @@ ClientAndServer::~ClientAndServer() {
     umount2(storage_.c_str(), MNT_DETACH);
 }
 
-void ClientAndServer::SetUpServer() const {
-    Must(Server("setup --address 127.0.0.1 --storage " + storage_ + " --port " +
+void ClientAndServer::SetUpServer(const std::string& address) const {
+    Must(Server("setup --address " + address + " --storage " + storage_ + " --port " +
                 std::to_string(port_)));
 }
 
@@ -41,8 +41,7 @@ bool ClientAndServer::PutStorageOnDisk(const std::string& size) {
 }
 
 void ClientAndServer::StartServer() {
-    daemon_.Start({"rsync", "--daemon", "--no-detach",
-                   "--config=" + folder_.Path("server/usr/tarq/etc/zel_server/rsyncd.conf")},
+    daemon_.Start({"env", "TARQ_ROOT=" + folder_.Path("server"), ZEL_SERVER, "serve"},
                   folder_.Path("daemon.log"), port_);
 }
 

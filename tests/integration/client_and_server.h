@@ -48,11 +48,11 @@ public:
     void ExpectCopyIsComplete() const;
 
 private:
-    void SetUpServer() const;
-
     bool on_disk_ = false;
 
 protected:
+    void SetUpServer(const std::string& address = "127.0.0.1") const;
+
     TempFolder folder_;
     const std::string source_ = folder_.Path("source");
     const std::string storage_ = folder_.Path("server/storage");

@@ -1,5 +1,7 @@
 // A whole client and a whole server: the programs as people run them, on a real rsync daemon and a
 // real sshd.
+#include <sys/mount.h>
+
 #include <regex>
 
 #include "tests/integration/client_and_server.h"
@@ -183,6 +185,63 @@ TEST_F(PushTest, CommandsOfMischiefChangeNothing) {
     EXPECT_TRUE(fs::is_empty(folder_.Path("server/var/run/zel_server/alice")));
 }
 
+TEST_F(PushTest, StatusNamesWhatKeepsPushesOut) {
+    EXPECT_THAT(Server("status --json"), Ended(0, "\"pushes_can_succeed\": true"));
+    const auto expect = [&](const std::string& what, const std::string& mend) {
+        EXPECT_THAT(Server("status"),
+                    AllOf(Ended(1, what), Field(&test::Outcome::output, HasSubstr(mend))));
+        EXPECT_NE(Push().exit_code, 0) << what;
+    };
+    Must(Server("disable"));
+    SetUpServer();  // leaves the switch as it is
+    expect("switched off", "zel_server enable");
+    Must(Server("enable"));
+    fs::rename(storage_, storage_ + ".away");
+    expect("is not there", "mount its disk");
+    fs::rename(storage_ + ".away", storage_);
+    if (PutStorageOnDisk("4M")) {
+        ASSERT_EQ(mount("", storage_.c_str(), "", MS_REMOUNT | MS_RDONLY, nullptr), 0);
+        expect("mounted read-only", "remount,rw");
+        umount2(storage_.c_str(), MNT_DETACH);
+        expect("not on the disk mounted at", "run 'zel_server setup' again");
+        SetUpServer();
+    }
+    fs::permissions(folder_.Path("server/usr/tarq/etc/zel_server/rsyncd.secrets"),
+                    fs::perms::others_read, fs::perm_options::add);
+    expect("open to others", "chmod 600");
+    Must(Server("account rm alice"));
+    expect("no account may log in", "zel_server account add");
+    Must(Server("account add alice --password-file -", "secret\n"));
+    EXPECT_THAT(Server("account add alice --password-file -", "secret\n"),
+                Ended(0, "was there already"));
+    ExpectNextPushCompletes();
+
+    StopServer();
+    expect("the rsync daemon is not running", "zel_server serve");
+    test::ServerProcess other;
+    other.Start({"python3", "-m", "http.server", std::to_string(port_), "--bind", "127.0.0.1"},
+                folder_.Path("other.log"), port_);
+    expect("held by python3, process ", "choose another --port");
+    EXPECT_THAT(Server("setup --address 127.0.0.1 --storage " + folder_.Path("new") + " --port " +
+                       std::to_string(port_)),
+                Ended(1, "held by python3, process "));
+    EXPECT_FALSE(fs::exists(folder_.Path("new")));
+}
+
+TEST_F(PushTest, ARegistryThatWasCutIsMendedByTheCommandThatStatusNames) {
+    ExpectNextPushCompletes();
+    const std::string registry = folder_.Path("server/usr/tarq/etc/tarqZEL.info");
+    for (const uintmax_t size : {fs::file_size(registry) / 2, uintmax_t{0}}) {
+        fs::resize_file(registry, size);
+        EXPECT_THAT(Server("status"), Ended(1, "zel_server repair"));
+        EXPECT_EQ(Push().exit_code, 4);
+        Must(Server("repair"));
+        EXPECT_THAT(Server("status"), Ended(0));
+        EXPECT_THAT(Server("shares"), Ended(0, "CLIENT-1"));
+        ExpectNextPushCompletes();
+    }
+}
+
 TEST_F(PushTest, SshReachesTheSameServer) {
     if (!test::SshServer::Available()) {
         GTEST_SKIP() << "this machine cannot run an ssh server for the test";
@@ -192,6 +251,11 @@ TEST_F(PushTest, SshReachesTheSameServer) {
     Must(Server("account add " + user + " --password-file -", "secret\n"));
     Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nssh_options=\"-i " +
               ssh.ClientKey() + "\"\n");
+    // Whatever address the daemon was given, ssh arrives at the loopback address.
+    StopServer();
+    SetUpServer("127.0.0.2");
+    StartServer();
+    EXPECT_THAT(Server("status"), Ended(0, "of 127.0.0.2"));
     ExpectNextPushCompletes("--ssh --ssh-port " + std::to_string(ssh.Port()), user);
     EXPECT_THAT(ssh.Log(), HasSubstr("Accepted publickey"));
 }

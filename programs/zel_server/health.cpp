@@ -1,0 +1,354 @@
+#include "programs/zel_server/health.h"
+
+#include <pwd.h>
+#include <sys/stat.h>
+#include <sys/statvfs.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <filesystem>
+
+#include "programs/common/text.h"
+#include "programs/zel_server/accounts.h"
+#include "programs/zel_server/registry_repair.h"
+#include "programs/zel_server/serve.h"
+#include "programs/zel_server/share_module.h"
+#include "tarq/core.h"
+#include "tarq/root_path.h"
+
+namespace zel_server {
+
+namespace {
+
+namespace fs = std::filesystem;
+using programs::Count;
+using programs::Printable;
+
+// A push needs more than this for its own bookkeeping.
+constexpr uint64_t kFullBelow = 1048576;
+constexpr size_t kNamed = 3;  // so many are named before the rest is counted
+constexpr size_t kMaxPidFile = 64;
+
+std::string InQuotes(const std::string& text) {
+    return "'" + Printable(text) + "'";
+}
+
+// "'a', 'b', 'c' and 4 more".
+std::string Listed(const std::vector<std::string>& names) {
+    std::string text;
+    for (size_t i = 0; i < std::min(names.size(), kNamed); ++i) {
+        text += (i == 0 ? "" : ", ") + InQuotes(names[i]);
+    }
+    return names.size() <= kNamed
+               ? text
+               : text + " and " + std::to_string(names.size() - kNamed) + " more";
+}
+
+struct timespec ChangeOf(const std::string& path) {
+    struct stat info = {};
+    return stat(path.c_str(), &info) == 0 ? info.st_mtim : timespec{};
+}
+
+bool IsNewer(const struct timespec& a, const struct timespec& b) {
+    return a.tv_sec != b.tv_sec ? a.tv_sec > b.tv_sec : a.tv_nsec > b.tv_nsec;
+}
+
+std::optional<pid_t> PidInFile() {
+    if (KAPICProcAliveByPidFile(PidFile().c_str()) == 0) {
+        return std::nullopt;
+    }
+    const std::string text = programs::ReadWholeFile(PidFile(), kMaxPidFile).value_or("");
+    const auto pid = programs::ParseNumber(text.substr(0, text.find('\n')), INT32_MAX);
+    return pid && IsOurDaemon(static_cast<pid_t>(*pid)) ? std::optional<pid_t>(*pid) : std::nullopt;
+}
+
+class Examination {
+public:
+    explicit Examination(const ServerConfig& config) : config_(config) {}
+
+    Health Run() {
+        LookAtRegistry();
+        LookAtDaemon();
+        LookAtAccounts();
+        for (const std::string& folder : config_.Folders()) {
+            LookAtStorage(folder);
+        }
+        LookAtCopies();
+        return std::move(health_);
+    }
+
+private:
+    void Found(const std::string& what, const std::string& mend, bool stops_pushes = true) {
+        health_.problems.push_back({what, mend, stops_pushes});
+    }
+
+    void LookAtRegistry() {
+        const auto damage = FindDamage();
+        if (!damage) {
+            health_.registry = "unreadable";
+            Found("the registry " + RegistryFile() + " or the folder " + ShareModules() +
+                      " cannot be read: " + KAPICErrText(KAPICErrGet()),
+                  geteuid() == 0 ? "if the file is no longer one, move it away and run "
+                                   "'zel_server repair'"
+                                 : "look as root");
+            return;
+        }
+        health_.registry = damage->None() ? "whole" : "damaged";
+        if (damage->switch_lost || !damage->shares.empty()) {
+            Found("the registry " + RegistryFile() + " is damaged: it has lost " +
+                      (damage->shares.empty() ? "the service's switch"
+                                              : Count(damage->shares.size(), "share") + " (" +
+                                                    Listed(damage->shares) + ")") +
+                      "; clients are refused",
+                  "zel_server repair");
+        }
+        if (!damage->ownerless.empty()) {
+            Found("the registry has lost to whom " + Listed(damage->ownerless) +
+                      " belongs, and nothing else tells; nobody may push there",
+                  "zel_server shares --release NAME: the next client and account that push it own "
+                  "it");
+        }
+        health_.on = ReadSwitch();
+        if (health_.on == Switch::kOff) {
+            Found("the service is switched off", "zel_server enable");
+        }
+        shares_ = KnownShares().value_or(std::vector<std::string>());
+        health_.shares = shares_.size();
+    }
+
+    // The unit's state, what listens, and whether that is what is configured.
+    void LookAtDaemon() {
+        Health& now = health_;
+        now.unit = AskUnit();
+        now.listeners = ListenersOn(config_.port);
+        now.other_holder = OtherHolder(config_, now.listeners);
+        now.daemon = PidInFile();
+        for (const Listener& listener : now.listeners) {
+            if (!now.daemon && IsOurDaemon(listener.pid)) {
+                now.daemon = listener.pid;
+            }
+        }
+        // Whose sockets those are is not for everybody to see.
+        const bool blind = geteuid() != 0 && now.daemon && !now.listeners.empty();
+        now.listens = blind || ServesAll(config_, now.listeners);
+        now.configuration_newer =
+            now.daemon && IsNewer(ChangeOf(RsyncdConfig()), ChangeOf(PidFile()));
+        const std::string restart = now.unit.managed ? "systemctl restart zel_rsyncd"
+                                                     : "end it, and run 'zel_server serve'";
+        if (!now.listens) {
+            FoundSilent(restart);
+        } else if (now.configuration_newer) {
+            Found("the rsync daemon runs with an older configuration", restart, false);
+        }
+        if (now.unit.managed && !now.unit.enabled && !now.unit.masked) {
+            Found("the rsync daemon will not start with the machine", "systemctl enable zel_rsyncd",
+                  false);
+        }
+        if (now.unit.managed && now.listens && now.unit.active != "active") {
+            Found("the rsync daemon was started by hand, the unit zel_rsyncd is " + now.unit.active,
+                  "end process " + std::to_string(now.daemon.value_or(0)) +
+                      ", then systemctl start zel_rsyncd",
+                  false);
+        }
+    }
+
+    // Why nothing of ours answers where clients ask.
+    void FoundSilent(const std::string& restart) {
+        const Health& now = health_;
+        const std::string port = "port " + std::to_string(config_.port);
+        if (now.unit.masked) {
+            Found("the unit zel_rsyncd is masked",
+                  "systemctl unmask zel_rsyncd, then systemctl enable --now zel_rsyncd");
+        } else if (now.other_holder) {
+            Found(port + " is held by " + NameOf(*now.other_holder),
+                  "end that, or choose another --port with 'zel_server setup'");
+        } else if (now.daemon) {
+            Found("the rsync daemon runs, but does not listen on all of " + port +
+                      " that is configured",
+                  restart);
+        } else if (now.unit.managed) {
+            Found("the rsync daemon is not running: the unit zel_rsyncd is " + now.unit.active +
+                      (now.unit.active == "failed" ? " (" + now.unit.result + ")" : ""),
+                  "systemctl start zel_rsyncd; journalctl -u zel_rsyncd says why it ended");
+        } else {
+            Found("the rsync daemon is not running", "zel_server serve");
+        }
+    }
+
+    void LookAtAccounts() {
+        struct stat info = {};
+        const auto names = Accounts();
+        if (names) {
+            health_.accounts = names->size();
+        }
+        if (!names && errno == EACCES && geteuid() != 0) {
+            return;
+        }
+        if (!names) {
+            Found("the accounts in " + SecretsFile() + " cannot be read",
+                  "zel_server account list says why");
+        } else if (names->empty()) {
+            Found("no account may log in", "zel_server account add NAME");
+        } else if (stat(SecretsFile().c_str(), &info) == 0 &&
+                   ((info.st_mode & (S_IROTH | S_IWOTH)) != 0 ||
+                    (geteuid() == 0 && info.st_uid != 0))) {
+            Found("rsync does not use " + SecretsFile() + ", which is open to others",
+                  "chmod 600 " + SecretsFile() + " && chown " +
+                      (geteuid() == 0 ? "root" : std::to_string(geteuid())) + " " + SecretsFile());
+        }
+    }
+
+    void LookAtStorage(const std::string& folder) {
+        StorageHealth storage;
+        storage.folder = folder;
+        storage.state = CheckStorage(folder);
+        struct statvfs space = {};
+        if (storage.state != StorageState::kAbsent && storage.state != StorageState::kOtherDisk &&
+            statvfs(folder.c_str(), &space) == 0) {
+            storage.free_bytes = static_cast<uint64_t>(space.f_bavail) * space.f_frsize;
+            storage.full =
+                *storage.free_bytes < kFullBelow || (space.f_files != 0 && space.f_favail == 0);
+        }
+        FoundInStorage(storage);
+        health_.storage.push_back(storage);
+    }
+
+    void FoundInStorage(const StorageHealth& storage) {
+        const std::string named = "the storage folder " + storage.folder;
+        const std::string disk = RecordedDiskOf(storage.folder);
+        std::error_code error;
+        const std::string why =
+            health_.unit.confinement.Forbids(fs::weakly_canonical(storage.folder, error));
+        switch (storage.state) {
+            case StorageState::kAbsent:
+                return Found(named + " is not there",
+                             "mount its disk" + (disk.empty() ? "" : " at " + disk) +
+                                 ", or run 'zel_server setup' to make it anew");
+            case StorageState::kOtherDisk:
+                return Found(
+                    named + " is not on the disk mounted at " + disk + " any more",
+                    "mount that disk; if the storage has moved, run 'zel_server setup' again");
+            case StorageState::kReadOnly:
+                return Found(named + " is on a disk that is mounted read-only",
+                             "mount -o remount,rw " + disk +
+                                 "; a disk that became so by itself may be failing: see dmesg");
+            case StorageState::kNotPermitted:
+                return Found(named + " may not be written by this user",
+                             "look at its owner and mode: ls -ld " + storage.folder);
+            case StorageState::kReady:
+                break;
+        }
+        if (!why.empty()) {
+            Found("the unit zel_rsyncd cannot write to " + storage.folder + " (" + why + ")",
+                  "move the storage, and run 'zel_server setup' for its new folder");
+        } else if (storage.full) {
+            Found("the disk of " + storage.folder + " is full", "make room on it");
+        }
+    }
+
+    // Where the copies of known shares lie, and whether the daemon will be able to change them.
+    void LookAtCopies() {
+        if (!config_.user.empty() && getpwnam(config_.user.c_str()) == nullptr) {
+            Found("there is no user '" + config_.user + "', to whom the copies belong",
+                  "zel_server setup --storage " + config_.storage + ", which makes it");
+            return;
+        }
+        std::vector<std::string> copies;
+        for (const std::string& share : shares_) {
+            ShareState state;
+            if (ReadShare(share, state) == ReadResult::kRead) {
+                copies.push_back(state.path);
+            }
+        }
+        const std::vector<std::string> foreign = ForeignFolders(config_, copies);
+        if (!foreign.empty()) {
+            health_.problems.push_back(ForeignCopies(config_, foreign));
+        }
+    }
+
+    const ServerConfig& config_;
+    Health health_;
+    std::vector<std::string> shares_;
+};
+
+}  // namespace
+
+bool Health::PushesCanSucceed() const {
+    return std::none_of(problems.begin(), problems.end(),
+                        [](const Problem& problem) { return problem.stops_pushes; });
+}
+
+Health Examine(const ServerConfig& config) {
+    return Examination(config).Run();
+}
+
+std::optional<Listener> OtherHolder(const ServerConfig& config,
+                                    const std::vector<Listener>& listeners) {
+    for (const std::string& address : ServedAddresses(config)) {
+        const std::vector<std::string> numbers = NumericAddresses(address);
+        for (const Listener& listener : listeners) {
+            const bool same =
+                address.empty() || listener.IsEverywhere() ||
+                std::find(numbers.begin(), numbers.end(), listener.address) != numbers.end();
+            const bool seen = listener.pid != 0 || geteuid() == 0;
+            if (same && seen && !IsOurDaemon(listener.pid)) {
+                return listener;
+            }
+        }
+    }
+    return std::nullopt;
+}
+
+std::string NameOf(const Listener& listener) {
+    return listener.pid == 0
+               ? "somebody who cannot be seen from here"
+               : Printable(listener.program) + ", process " + std::to_string(listener.pid);
+}
+
+std::vector<std::string> ForeignFolders(const ServerConfig& config,
+                                        const std::vector<std::string>& folders) {
+    const struct passwd* const owner =
+        config.user.empty() ? nullptr : getpwnam(config.user.c_str());
+    std::vector<std::string> foreign;
+    for (const std::string& folder : folders) {
+        struct stat info = {};
+        if (owner != nullptr && lstat(folder.c_str(), &info) == 0 && info.st_uid != owner->pw_uid) {
+            foreign.push_back(folder);
+        }
+    }
+    return foreign;
+}
+
+Problem ForeignCopies(const ServerConfig& config, const std::vector<std::string>& folders) {
+    struct stat info = {};
+    const bool told = lstat(folders.front().c_str(), &info) == 0;
+    std::string all = folders.size() > kNamed ? " " + config.storage : "";
+    for (size_t i = 0; i < folders.size() && folders.size() <= kNamed; ++i) {
+        all += " " + InQuotes(folders[i]);
+    }
+    return {
+        Listed(folders) + (folders.size() == 1 ? " belongs" : " belong") + " to " +
+            (told ? "the user with the number " + std::to_string(info.st_uid) : "another user") +
+            ", not to '" + config.user +
+            "': a disk from another server, or from before this system was installed",
+        "if these are copies: chown -hR " + config.user + ":" + all};
+}
+
+const char* Word(StorageState state) {
+    switch (state) {
+        case StorageState::kReady:
+            return "ready";
+        case StorageState::kAbsent:
+            return "absent";
+        case StorageState::kOtherDisk:
+            return "other_disk";
+        case StorageState::kReadOnly:
+            return "read_only";
+        case StorageState::kNotPermitted:
+            return "not_permitted";
+    }
+    return "";
+}
+
+}  // namespace zel_server

@@ -1,0 +1,102 @@
+#include "programs/zel_server/registry_repair.h"
+
+#include <set>
+
+#include "ZEL/is_syncedshare.h"
+#include "programs/common/atomic_file.h"
+#include "programs/common/text.h"
+#include "programs/zel_server/registry.h"
+#include "programs/zel_server/share_module.h"
+
+namespace zel_server {
+
+namespace {
+
+constexpr size_t kMaxRegistry = size_t{8} * 1024 * 1024;  // as section files have it
+
+bool KeepDamagedCopy() {
+    const auto text = programs::ReadWholeFile(RegistryFile(), kMaxRegistry);
+    return text && programs::WriteFileAtomically(DamagedCopy(), *text, 0600);
+}
+
+bool PutBack(const std::string& share) {
+    const auto module = ReadShareModule(share);
+    if (!module || !module->names_owner) {
+        return false;
+    }
+    ShareState state;
+    // It belongs to the client whose push was the last to be known, complete or not.
+    state.complete_id = module->client;
+    state.account = module->account;
+    state.module = module->module;
+    state.path = module->path;
+    state.last_result = kMended;
+    return WriteShare(share, state);
+}
+
+}  // namespace
+
+std::optional<std::vector<std::string>> KnownShares() {
+    const auto sections = SectionNames();
+    const auto modules = SharesWithModule();
+    if (!sections || !modules) {
+        return std::nullopt;
+    }
+    std::vector<std::string> shares;
+    std::set<std::string> seen;
+    const std::string prefix = "SHARE_";
+    for (const std::string& section : *sections) {
+        if (section.compare(0, prefix.size(), prefix) == 0 &&
+            seen.insert(section.substr(prefix.size())).second) {
+            shares.push_back(section.substr(prefix.size()));
+        }
+    }
+    for (const std::string& share : *modules) {
+        if (seen.insert(share).second) {
+            shares.push_back(share);
+        }
+    }
+    return shares;
+}
+
+std::optional<RegistryDamage> FindDamage() {
+    const auto shares = KnownShares();
+    if (!shares) {
+        return std::nullopt;
+    }
+    RegistryDamage damage;
+    damage.switch_lost = ReadSwitch() == Switch::kUnknown;
+    for (const std::string& share : *shares) {
+        ShareState state;
+        switch (ReadShare(share, state)) {
+            case ReadResult::kFailed:
+                return std::nullopt;
+            case ReadResult::kDamaged: {
+                const auto module = ReadShareModule(share);
+                (module && module->names_owner ? damage.shares : damage.ownerless).push_back(share);
+                break;
+            }
+            default:
+                break;
+        }
+    }
+    return damage;
+}
+
+bool MendRegistry(const RegistryDamage& damage, const ServerConfig& config) {
+    if (!KeepDamagedCopy()) {
+        return false;
+    }
+    for (const std::string& share : damage.shares) {
+        if (!PutBack(share)) {
+            return false;
+        }
+    }
+    return !damage.switch_lost || TARQUISetZEL(config.switched_off ? 0 : 1, nullptr, nullptr) == 0;
+}
+
+std::string DamagedCopy() {
+    return RegistryFile() + ".damaged";
+}
+
+}  // namespace zel_server
