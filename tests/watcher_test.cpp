@@ -4,6 +4,7 @@
 #include <sched.h>
 #include <sys/inotify.h>
 #include <sys/mount.h>
+#include <sys/resource.h>
 #include <sys/syscall.h>
 
 #include "tests/support/testing.h"
@@ -36,12 +37,16 @@ namespace {
 class WatcherTest : public testing::Test {
 protected:
     WatcherTest() {
+        EXPECT_TRUE(watcher_.Open());
         fs::create_directories(Path());
         fs::create_directories(Outside());
     }
     ~WatcherTest() override { before_watch = nullptr; }
 
-    using Losses = std::map<std::string, WatchLoss>;
+    /// Of each share, and where a folder is not watched, why.
+    using Losses = std::map<std::string, std::pair<WatchLoss::Kind, int>>;
+    static Losses Unwatched(int error) { return {{"s", {WatchLoss::kUnwatched, error}}}; }
+    static Losses Gone(const std::string& share) { return {{share, {WatchLoss::kFolderGone, 0}}}; }
 
     std::string Path(const std::string& path = "") const { return folder_.Path("s") + path; }
     std::string Outside(const std::string& path = "") const { return folder_.Path("o") + path; }
@@ -101,8 +106,9 @@ protected:
                          told_.insert(share == "s" ? path : share + ":" + path);
                          std::exchange(on_told_, [] {})();
                      },
-                     [this](const std::string& share, WatchLoss loss) {
-                         EXPECT_TRUE(losses_.emplace(share, loss).second)
+                     [this](const std::string& share, const WatchLoss& loss) {
+                         const auto what = std::pair(loss.kind, loss.error);
+                         EXPECT_TRUE(losses_.emplace(share, what).second)
                              << share << " says it twice";
                      }};
 };
@@ -208,31 +214,34 @@ TEST_F(WatcherTest, AfterAnOverflowAllIsFoundAgain) {
     fs::remove_all(Path("/goes"));
     fs::create_directories(Path("/stays/new/deep"));
     Work();
-    EXPECT_EQ(losses_, (Losses{{"s", WatchLoss::kOverflow}, {"t", WatchLoss::kOverflow}}));
+    EXPECT_EQ(losses_,
+              (Losses{{"s", {WatchLoss::kOverflow, 0}}, {"t", {WatchLoss::kOverflow, 0}}}));
     watcher_.Remove("t");
     told_.clear();
     ExpectAllWatched();
 }
 
 TEST_F(WatcherTest, WhatCannotBeWatchedIsSaidOnceInASearch) {
-    for (const auto& [error, loss] :
-         {std::pair(ENOSPC, WatchLoss::kWatchLimit), std::pair(EACCES, WatchLoss::kUnreadable)}) {
+    for (const int error : {ENOSPC, EACCES}) {
         fs::remove_all(Path());
         fs::create_directories(Path("/a/b"));
         fs::create_directories(Path("/c/d"));
         std::set<ino_t> watched;
-        before_watch = [&watched, refused = error](ino_t folder) {
+        before_watch = [&watched, error](ino_t folder) {
             return watched.size() < 3  ? watched.insert(folder), 0
                : watched.count(folder) ? 0
-                                       : refused;
+                                       : error;
         };
         Start();
-        EXPECT_EQ(TakeLosses(), (Losses{{"s", loss}}));
+        EXPECT_EQ(TakeLosses(), Unwatched(error));
         EXPECT_FALSE(watcher_.Stats("s").complete || watcher_.Stats("s").searching);
         Write("/f");
         fs::create_directories(Path("/new/below"));
         EXPECT_THAT(ToldAfterWork(), ElementsAre("/f", "/new"));
-        EXPECT_EQ(TakeLosses(), (Losses{{"s", loss}}));
+        EXPECT_EQ(TakeLosses(), Unwatched(error));
+        watcher_.SearchAgain("s");
+        Work();
+        EXPECT_EQ(TakeLosses(), Unwatched(error));
         // A folder that shows a sign of life is tried again; then nothing is missing.
         before_watch = nullptr;
         for (const char* name : {"/a", "/c", "/new", "/a/b", "/c/d"}) {
@@ -247,6 +256,24 @@ TEST_F(WatcherTest, WhatCannotBeWatchedIsSaidOnceInASearch) {
     }
 }
 
+TEST_F(WatcherTest, WithoutDescriptorsNothingIsMissedUnsaid) {
+    fs::create_directories(Path("/a/b"));
+    Start();
+    fs::create_directories(Path("/a/new/below"));
+    struct rlimit before;
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
+    const struct rlimit none = {0, before.rlim_max};
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &none), 0);
+    Work();
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);
+    EXPECT_EQ(TakeLosses(), Unwatched(EMFILE));
+    EXPECT_FALSE(watcher_.Stats("s").complete);
+    watcher_.SearchAgain("s");
+    EXPECT_THAT(ToldAfterWork(), IsSupersetOf({"/a/new", "/a/new/below"}));
+    ExpectAllWatched();
+    EXPECT_TRUE(watcher_.Stats("s").complete);
+}
+
 TEST_F(WatcherTest, APathTooLongToBeSentIsUnreadable) {
     const std::string name(200, 'n');
     Start();
@@ -258,7 +285,7 @@ TEST_F(WatcherTest, APathTooLongToBeSentIsUnreadable) {
         at = below;
     }
     Work();
-    EXPECT_EQ(TakeLosses(), (Losses{{"s", WatchLoss::kUnreadable}}));
+    EXPECT_EQ(TakeLosses(), Unwatched(ENAMETOOLONG));
     EXPECT_FALSE(watcher_.Stats("s").complete);
     EXPECT_EQ(watcher_.Stats("s").folders, 1u + (PATH_MAX - 1) / 201);
     fs::rename(Path("/" + name), Outside("/" + name));
@@ -286,7 +313,7 @@ TEST_F(WatcherTest, SaysWhenTheFolderIsGone) {
         Start();
         way();
         Work();
-        EXPECT_EQ(TakeLosses(), (Losses{{"s", WatchLoss::kFolderGone}}));
+        EXPECT_EQ(TakeLosses(), Gone("s"));
         EXPECT_FALSE(watcher_.Stats().complete);
         told_.clear();
     }
@@ -319,7 +346,7 @@ TEST_F(WatcherTest, LetsAVolumeGoAndSaysSo) {
         ExpectAllWatched("without it");
         EXPECT_EQ(umount(Path().c_str()), 0);
         Work();
-        EXPECT_EQ(TakeLosses(), (Losses{{"s", WatchLoss::kFolderGone}}));
+        EXPECT_EQ(TakeLosses(), Gone("s"));
         _exit(HasFailure());
     }
     int status = -1;
@@ -347,7 +374,7 @@ TEST_F(WatcherTest, SharesMayLieInEachOtherAndComeAndGo) {
     EXPECT_THAT(ToldAfterWork(), ElementsAre("/deep/g"));
     rename(Path("/in").c_str(), Path("/out").c_str());
     Work();
-    EXPECT_EQ(TakeLosses(), (Losses{{"inner", WatchLoss::kFolderGone}}));
+    EXPECT_EQ(TakeLosses(), Gone("inner"));
     watcher_.Remove("inner");
     told_.clear();
     ExpectAllWatched();

@@ -1,11 +1,11 @@
 #include "programs/zel_daemon/inotify.h"
 
+#include <fcntl.h>
 #include <sys/inotify.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <system_error>
 
 namespace zel_daemon {
 
@@ -21,10 +21,19 @@ constexpr uint32_t kMask = IN_CREATE | IN_DELETE | IN_MODIFY | IN_CLOSE_WRITE | 
 
 }  // namespace
 
-Inotify::Inotify() : fd_(inotify_init1(IN_NONBLOCK | IN_CLOEXEC)), buffer_(new char[kBufferSize]) {
-    if (!fd_) {
-        throw std::system_error(errno, std::generic_category(), "inotify_init1");
+Inotify::Inotify() : buffer_(new char[kBufferSize]) {}
+
+int Inotify::Open() {
+    if (fd_) {
+        return 0;
     }
+    fd_ = base::UniqueFd(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+    if (fd_) {
+        return 0;
+    }
+    const int error = errno;
+    const bool has_descriptors = !!base::UniqueFd(open("/", O_PATH | O_CLOEXEC));
+    return error == EMFILE && has_descriptors ? EUSERS : error;
 }
 
 int Inotify::Watch(int folder) {

@@ -21,14 +21,20 @@ public:
         std::string_view name;  ///< of the entry; empty: the folder itself. Valid until Next()
     };
 
-    /// Throws std::system_error when the kernel gives no instance.
     Inotify();
 
-    /// Readable when Next() has an event that was not read from the kernel yet.
+    /// Gets an instance from the kernel, unless there is one: 0, or why there is none. EUSERS: the
+    /// user has as many as it may (fs.inotify.max_user_instances), for which the kernel's own error
+    /// is the one of a process without descriptors.
+    int Open();
+
+    /// -1 without an instance. Readable when Next() has an event that was not read from the kernel
+    /// yet.
     int Fd() const { return fd_.Get(); }
 
     /// Watches an open folder: by descriptor, so that it is this folder whatever becomes of its
     /// path. Returns the watch, the same one for a folder that is watched already; -1 with errno.
+    /// REQUIRES an instance.
     int Watch(int folder);
     void Unwatch(int watch);
 

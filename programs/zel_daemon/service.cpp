@@ -26,7 +26,7 @@ Service::Service(EventLoop& loop, const Clock& clock, Store& store, const Daemon
       config_(config),
       on_change_(std::move(on_change)),
       watcher_([this](const std::string& share, const std::string& path) { OnChange(share, path); },
-               [this](const std::string& share, WatchLoss loss) { OnLoss(share, loss); }) {}
+               [this](const std::string& share, const WatchLoss& loss) { OnLoss(share, loss); }) {}
 
 Service::~Service() {
     for (auto& [id, task] : tasks_) {
@@ -70,7 +70,6 @@ void Service::Start() {
         }
         found->second->last = std::move(run);
     }
-    loop_.OnReadable(watcher_.Fd(), [this] { RunWatcher(); });
     WatchShares();
     Advance();
 }

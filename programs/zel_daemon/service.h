@@ -91,12 +91,16 @@ private:
 
     // Changes on disk.
     void OnChange(const std::string& share, const std::string& path);
-    void OnLoss(const std::string& share, WatchLoss loss);
+    void OnLoss(const std::string& share, const WatchLoss& loss);
+    void Note(const std::string& share, const std::string& note);
+    void ListenToWatcher();
     void WatchShares();
     void WatchAgain(const Task& task);
     void PostWatcher();
     void RunWatcher();
     bool IsSearching(const Task& task) const;
+    bool PollDue(const Task& task) const;
+    void SearchAgain(Task& task);
     void ForgetSettledNotes(Task& task);
     void StoreGathered(Task& task);
     bool GatherDue(const Task& task, int64_t now) const;
@@ -121,6 +125,7 @@ private:
     std::function<void()> on_change_;
     Watcher watcher_;
     std::map<std::string, std::string> watched_;  // shares and their folders
+    bool watcher_heard_ = false;                  // the loop calls when it can be read
     bool watcher_posted_ = false;                 // folders are left to search
     std::map<uint64_t, std::unique_ptr<Task>> tasks_;
     std::map<std::string, Task*> by_name_;

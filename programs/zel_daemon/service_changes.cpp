@@ -1,12 +1,15 @@
 // The service's changes on disk: what is watched, and what becomes of what is told.
 #include <algorithm>
+#include <cerrno>
 #include <iterator>
 #include <utility>
 
 #include "ZEL/log.h"
 #include "ZEL/zel.h"
+#include "programs/common/task_run.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/service_task.h"
+#include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {
 
@@ -17,10 +20,40 @@ using ZEL::Logger;
 // The watcher's share of the loop's time before others have their turn.
 constexpr std::chrono::milliseconds kWatcherSlice(20);
 
+std::string ShownShare(const std::string& share) {
+    return "share '" + programs::Printable(share) + "': ";
+}
+
+// A path may be longer than what a person reads.
+std::string Shortened(const std::string& path) {
+    constexpr size_t kShown = 200;
+    return programs::Printable(path.substr(0, kShown)) + (path.size() > kShown ? "..." : "");
+}
+
+std::string WhyUnwatched(int error) {
+    switch (error) {
+        case ENOSPC:
+            return "raise fs.inotify.max_user_watches";
+        case EUSERS:
+            return "no inotify instance is left (raise fs.inotify.max_user_instances)";
+        default:
+            return ReasonOf(error);
+    }
+}
+
 }  // namespace
+
+// Whenever shares are to be searched: an instance may be had by now.
+void Service::ListenToWatcher() {
+    if (!watcher_heard_ && watcher_.Open()) {
+        watcher_heard_ = true;
+        loop_.OnReadable(watcher_.Fd(), [this] { RunWatcher(); });
+    }
+}
 
 // Makes the watcher watch what the realtime tasks need, where it is now.
 void Service::WatchShares() {
+    ListenToWatcher();
     std::map<std::string, std::string> needed;
     for (const auto& [id, task] : tasks_) {
         if (!task->Watches()) {
@@ -28,8 +61,16 @@ void Service::WatchShares() {
         }
         for (const std::string& share : task->record.Info().GetShareList()) {
             ZEL::ShareInfo facts;
-            if (needed.count(share) == 0 && ZEL::GetShareInfo(share, facts) == 0) {
+            if (needed.count(share) != 0) {
+                continue;
+            }
+            if (ZEL::GetShareInfo(share, facts) == 0) {
                 needed[share] = facts.GetModulePath();
+            } else if (watched_.count(share) != 0) {
+                needed[share] = watched_[share];  // a look-up that fails is no news of its folder
+            } else if (task->notes.count(share) == 0) {
+                const std::string problem = programs::ShareProblem(share);
+                Note(share, problem.empty() ? ShownShare(share) + "cannot be looked up" : problem);
             }
         }
     }
@@ -101,41 +142,68 @@ void Service::OnChange(const std::string& share, const std::string& path) {
     }
 }
 
-void Service::OnLoss(const std::string& share, WatchLoss loss) {
-    const std::string shown = "share '" + programs::Printable(share) + "': ";
+// What a person should know of a share that is not watched in full.
+void Service::Note(const std::string& share, const std::string& note) {
+    bool is_news = false;
+    for (const auto& [id, task] : tasks_) {
+        if (task->Watches() && task->HasShare(share) && task->notes[share] != note) {
+            task->notes[share] = note;
+            is_news = true;
+        }
+    }
+    if (is_news) {
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] zel_daemon(%d): %s\n", __LINE__,
+                       note.c_str());
+    }
+}
+
+void Service::OnLoss(const std::string& share, const WatchLoss& loss) {
+    const std::string shown = ShownShare(share);
     const std::string often = "; it is compared whole every " +
                               programs::HumanDuration(static_cast<uint64_t>(config_.poll.count()));
-    std::string note;
-    switch (loss) {
-        case WatchLoss::kOverflow:
-            break;  // searched anew, and compared whole once
-        case WatchLoss::kWatchLimit:
-            note = shown +
-                   "not all of its folders can be watched (raise fs.inotify.max_user_watches)" +
-                   often;
+    switch (loss.kind) {
+        case WatchLoss::kOverflow:  // searched anew, and compared whole once
+            Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] zel_daemon(%d): %s\n", __LINE__,
+                           (shown + "too many changes at once; it is compared whole").c_str());
             break;
-        case WatchLoss::kUnreadable:
-            note = shown + "some of its folders cannot be read, and are not watched" + often;
+        case WatchLoss::kUnwatched:
+            Note(share, shown +
+                            (loss.path == "/" ? "its folders cannot be watched"
+                                              : "not all of its folders can be watched ('" +
+                                                    Shortened(loss.path) + "')") +
+                            ": " + WhyUnwatched(loss.error) + often);
             break;
         case WatchLoss::kFolderGone:
-            note = shown + "its folder has gone; nothing is deleted at the server" + often;
+            Note(share, shown + "its folder has gone; nothing is deleted at the server" + often);
             watched_.erase(share);
             break;
     }
-    Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] zel_daemon(%d): %s\n", __LINE__,
-                   note.empty() ? (shown + "too many changes at once; it is compared whole").c_str()
-                                : note.c_str());
     for (const auto& [id, task] : tasks_) {
         if (!task->Watches() || !task->HasShare(share)) {
             continue;
         }
         task->whole_due = true;
         task->held = false;
-        if (!note.empty()) {
-            task->notes[share] = note;
+        if (loss.kind != WatchLoss::kOverflow) {
             task->poll_at = clock_.Elapsed() + config_.poll.count() * 1000;
         }
     }
+}
+
+bool Service::PollDue(const Task& task) const {
+    return !task.active && !task.held && !task.plan->RetryWaiting() && task.poll_at &&
+           clock_.Elapsed() >= *task.poll_at;
+}
+
+// What is not watched is compared whole now and then, after another try to watch it.
+void Service::SearchAgain(Task& task) {
+    task.whole_due = true;
+    task.poll_at = clock_.Elapsed() + config_.poll.count() * 1000;
+    ListenToWatcher();
+    for (const auto& [share, note] : task.notes) {
+        watcher_.SearchAgain(share);
+    }
+    PostWatcher();
 }
 
 // What could not be watched may be watched since: a folder was made readable, a share came back.

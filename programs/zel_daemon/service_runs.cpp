@@ -35,6 +35,9 @@ void Service::Advance() {
         } catch (const StoreError& error) {
             StoreFailed(*task, error);
         }
+        if (PollDue(*task)) {
+            SearchAgain(*task);
+        }
         const std::optional<Due> what = task->active ? std::nullopt : WhatIsDue(*task);
         if (!what) {
             task->due_since = 0;
@@ -80,9 +83,8 @@ std::optional<Service::Due> Service::WhatIsDue(Task& task) {
     if (!task.record.IsRealtime() || task.held) {
         return std::nullopt;
     }
-    const bool poll_due = task.poll_at && clock_.Elapsed() >= *task.poll_at;
-    if (task.whole_due || poll_due || task.pending > 0) {
-        return Due{RunReason::kChange, task.whole_due || poll_due};
+    if (task.whole_due || task.pending > 0) {
+        return Due{RunReason::kChange, task.whole_due};
     }
     return std::nullopt;
 }

@@ -24,6 +24,7 @@
 #include <cstring>
 #include <map>
 #include <optional>
+#include <set>
 #include <utility>
 #include <vector>
 
@@ -88,8 +89,7 @@ struct Watcher::Impl {
         size_t missing = 0;
         size_t jobs = 0;  // searches that wait or are under way
         bool first_search = true;
-        bool limit_told = false;  // in this search, as is the next
-        bool unreadable_told = false;
+        std::set<int> told;  // errors of this search
     };
 
     /// A folder whose entries are being read.
@@ -124,7 +124,7 @@ struct Watcher::Impl {
 
     /// Tells `path`.
     void Tell(const Share& share) { on_change(std::string(share.name), path.empty() ? "/" : path); }
-    void Lose(const Share& share, WatchLoss loss) { on_loss(std::string(share.name), loss); }
+    void Lose(const Share& share, const WatchLoss& loss) { on_loss(std::string(share.name), loss); }
 
     // Folders
 
@@ -190,7 +190,7 @@ struct Watcher::Impl {
     void LoseRoot(Share& share) {
         Drop(std::exchange(share.root, kNoFolder));
         share.fd = UniqueFd();
-        Lose(share, WatchLoss::kFolderGone);
+        Lose(share, {WatchLoss::kFolderGone});
     }
 
     // Searching
@@ -203,7 +203,7 @@ struct Watcher::Impl {
             return;
         }
         if (share->jobs++ == 0) {
-            share->limit_told = share->unreadable_told = false;
+            share->told.clear();
         }
         marks |= kQueued;
         jobs.push_back(id);
@@ -223,24 +223,29 @@ struct Watcher::Impl {
         EndJob(share);
     }
 
-    /// A folder cannot be watched, so nothing below it is. Told once in a search. A change of its
-    /// mode, which its parent tells, brings it back; the root has to tell its own.
-    void Miss(Share& share, FolderId id, WatchLoss loss) {
+    /// The folder that Locate() was asked for last is not watched. Told once in a search for each
+    /// reason.
+    void TellUnwatched(Share& share, int error) {
+        if (share.told.insert(error).second) {
+            Lose(share, {WatchLoss::kUnwatched, error, path.empty() ? "/" : path});
+        }
+    }
+
+    /// The same, when nothing below it is watched either. A change of its mode, which its parent
+    /// tells, brings it back; the root has to tell its own.
+    void Miss(Share& share, FolderId id, int error) {
         if (id != share.root) {
             Unwatch(id);
         }
         DropChildren(id);
         SetMissing(id, true);
-        bool& told = loss == WatchLoss::kWatchLimit ? share.limit_told : share.unreadable_told;
-        if (!std::exchange(told, true)) {
-            Lose(share, loss);
-        }
+        TellUnwatched(share, error);
     }
 
     /// The folder could not be opened or watched, as errno says.
     void Failed(Share& share, FolderId id) {
         if (!IsGone(errno)) {
-            Miss(share, id, errno == ENOSPC ? WatchLoss::kWatchLimit : WatchLoss::kUnreadable);
+            Miss(share, id, errno);
         } else if (id == share.root) {
             LoseRoot(share);
         } else {
@@ -307,15 +312,16 @@ struct Watcher::Impl {
             EndJob(number);
             return;
         }
-        if (!OpenRoot(*share)) {
-            Failed(*share, share->root);
-            EndJob(number);
-            return;
-        }
         bool is_new = false;
-        UniqueFd fd = WatchFolder(*share, id, &is_new);
-        if (!fd) {
+        UniqueFd fd;
+        if (const int error = inotify.Open()) {
+            Miss(*share, id, error);
+        } else if (!OpenRoot(*share)) {
+            IsGone(errno) ? LoseRoot(*share) : Miss(*share, id, errno);
+        } else if (!(fd = WatchFolder(*share, id, &is_new))) {
             Failed(*share, id);
+        }
+        if (!fd) {
             EndJob(number);
             return;
         }
@@ -343,11 +349,10 @@ struct Watcher::Impl {
         }
         const ssize_t got = getdents64(listing->fd.Get(), list_buffer.get(), kListBufferSize);
         if (got < 0 && !IsGone(errno)) {
+            const int error = errno;
             SetMissing(id, true);
             EndListing();
-            if (!std::exchange(share->unreadable_told, true)) {
-                Lose(*share, WatchLoss::kUnreadable);
-            }
+            TellUnwatched(*share, error);
             return;
         }
         if (got <= 0) {
@@ -422,8 +427,8 @@ struct Watcher::Impl {
             Share* share = FindShare(number);
             if (share != nullptr && share->root != kNoFolder) {
                 Enqueue(share->root, true);
-                share->limit_told = share->unreadable_told = false;
-                Lose(*share, WatchLoss::kOverflow);
+                share->told.clear();
+                Lose(*share, {WatchLoss::kOverflow});
             }
         }
     }
@@ -579,6 +584,10 @@ Watcher::Watcher(OnChange on_change, OnLoss on_loss)
 
 Watcher::~Watcher() = default;
 
+bool Watcher::Open() {
+    return impl_->inotify.Open() == 0;
+}
+
 int Watcher::Fd() const {
     return impl_->inotify.Fd();
 }
@@ -605,6 +614,18 @@ void Watcher::Remove(const std::string& share) {
     }
     impl_->shares.erase(found);
     impl_->numbers.erase(number);
+}
+
+void Watcher::SearchAgain(const std::string& share) {
+    const auto number = impl_->numbers.find(share);
+    if (number == impl_->numbers.end()) {
+        return;
+    }
+    Impl::Share& found = impl_->shares.at(number->second);
+    if (found.root != kNoFolder) {
+        impl_->Enqueue(found.root, true);
+        found.told.clear();
+    }
 }
 
 bool Watcher::Work(std::chrono::milliseconds budget) {
@@ -640,6 +661,7 @@ WatchStats Watcher::Stats(const std::string& share) const {
 
 WatchStats Watcher::Stats() const {
     WatchStats all;
+    all.complete = true;
     for (const auto& [share, number] : impl_->numbers) {
         const WatchStats one = Stats(share);
         all.folders += one.folders;

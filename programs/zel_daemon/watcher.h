@@ -10,19 +10,27 @@
 namespace zel_daemon {
 
 /// Why a watcher can no longer tell all that changes in a share.
-enum class WatchLoss {
-    kOverflow,    ///< the kernel dropped events; the folders are searched anew, watching goes on
-    kWatchLimit,  ///< no more folders can be watched (fs.inotify.max_user_watches): the rest is
-                  ///< not, until Add() or an overflow has them searched anew
-    kFolderGone,  ///< the share's folder was removed, moved away, or its file system was unmounted
-    kUnreadable   ///< some folder cannot be read, or its path is longer than PATH_MAX, so what is
-                  ///< below it is not watched; one that is made readable is taken in
+struct WatchLoss {
+    enum Kind {
+        kOverflow,  ///< the kernel dropped events; the folders are searched anew, watching goes on
+        kFolderGone,  ///< the share's folder was removed, moved away, or its volume was unmounted
+        kUnwatched    ///< a folder, with all below it, is not watched. It is taken in when it shows
+                      ///< a sign of life, or is searched again
+    };
+
+    Kind kind;
+    /// Why it is not watched: an error number of opening or reading it, ENAMETOOLONG for a path
+    /// that is longer than PATH_MAX, or
+    /// ENOSPC: no more folders can be watched (fs.inotify.max_user_watches),
+    /// EUSERS: no inotify instance is to be had (fs.inotify.max_user_instances).
+    int error = 0;
+    std::string path = {};  ///< the first such folder, as OnChange would have it
 };
 
 struct WatchStats {
     size_t folders = 0;      ///< folders that are watched
     bool searching = false;  ///< folders are still being found
-    bool complete = true;    ///< all folders found are watched
+    bool complete = false;   ///< all folders found are watched
 };
 
 /// Watches whole trees: new folders are taken in as they appear, and what they hold by then is told
@@ -43,16 +51,18 @@ public:
     /// `path` begins with "/", relative to the share's folder, and names the entry that changed,
     /// appeared or went; "/" is the whole share.
     using OnChange = std::function<void(const std::string& share, const std::string& path)>;
-    using OnLoss = std::function<void(const std::string& share, WatchLoss loss)>;
+    using OnLoss = std::function<void(const std::string& share, const WatchLoss& loss)>;
 
-    /// Both are called from Work() alone, may call Add() and Remove(), and may not throw. Throws
-    /// std::system_error when inotify is not to be had.
+    /// Both are called from Work() alone, may call Add() and Remove(), and may not throw.
     Watcher(OnChange on_change, OnLoss on_loss);
     ~Watcher();
     Watcher(const Watcher&) = delete;
     Watcher& operator=(const Watcher&) = delete;
 
-    /// Readable when there is something for Work().
+    /// Gets what the kernel gives notices by, unless it has been got. False when that is not to be
+    /// had now: shares that are searched without it are told as not watched.
+    bool Open();
+    /// Readable when there is something for Work(). REQUIRES Open().
     int Fd() const;
 
     /// Watches `folder` for `share`, in place of what was watched for it before. The folders below
@@ -61,12 +71,15 @@ public:
     /// leave nothing out begins when the share is no longer searched.
     void Add(const std::string& share, const std::string& folder);
     void Remove(const std::string& share);
+    /// Searches all folders of a share again, as after an overflow: what could not be watched may
+    /// be by now, and is told again when it cannot. As Add(), this is done by Work().
+    void SearchAgain(const std::string& share);
 
     /// Reads events and searches folders for about so long. True when work is left that Fd() does
     /// not tell of, folders to search above all: call again soon. False: wait for Fd().
     bool Work(std::chrono::milliseconds budget);
 
-    /// Of one share; all zero for one that is not watched.
+    /// Of one share; none and not complete for one that is not watched.
     WatchStats Stats(const std::string& share) const;
     /// Of all shares together.
     WatchStats Stats() const;

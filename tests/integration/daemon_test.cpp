@@ -6,6 +6,7 @@
 #include "ZEL/sync_obj.h"
 #include "programs/zel_daemon/sqlite.h"
 #include "tests/integration/client_and_server.h"
+#include "tests/integration/command.h"
 #include "tests/integration/daemon_process.h"
 #include "tests/support/testing.h"
 
@@ -206,24 +207,37 @@ TEST_F(DaemonTest, AnOverflowOfTheQueueIsMadeUpForByOneComparison) {
     EXPECT_LE(RsyncRuns() - before, 12u);
 }
 
-TEST_F(DaemonTest, FoldersBeyondTheWatchLimitAreComparedNowAndThen) {
+TEST_F(DaemonTest, WhatTheKernelDoesNotWatchIsComparedNowAndThen) {
     for (int i = 0; i < 40; ++i) {
         Write("d" + std::to_string(i) + "/f", "x");
     }
     Settings("poll_seconds=\"1\"\n");
-    try {  // a limit of its own needs a user namespace of its own
-        zel_.Start({"unshare", "-Ur", "sh", "-c",
-                    "echo 20 >/proc/sys/user/max_inotify_watches && exec \"$@\"", "sh"});
-    } catch (const std::exception& error) {
-        GTEST_SKIP() << error.what();
+    const auto set = [](const std::string& limit, int value) {
+        return "echo " + std::to_string(value) + " >/proc/sys/user/max_inotify_" + limit;
+    };
+    for (const std::string limit : {"watches", "instances"}) {
+        try {  // a limit of its own needs a user namespace of its own
+            zel_.Start({"unshare", "-Ur", "sh", "-c",
+                        set(limit, limit == "watches" ? 20 : 0) + " && exec \"$@\"", "sh"});
+        } catch (const std::exception& error) {
+            GTEST_SKIP() << error.what();
+        }
+        if (limit == "watches") {
+            AddTask();
+        }
+        AwaitEqual("first");
+        EXPECT_THAT(Task()["note"].asString(), HasSubstr("raise fs.inotify.max_user_" + limit));
+        for (int i = 0; i < 40; ++i) {
+            Write("d" + std::to_string(i) + "/f", limit);
+        }
+        AwaitEqual("changed where nobody watches");
+        // Once the limit is raised, all is watched without a word from anybody.
+        test::Run("nsenter -U --preserve-credentials -t " + std::to_string(zel_.Pid()) +
+                  " sh -c '" + set(limit, 1000) + "'");
+        EXPECT_TRUE(Await([&] { return !Task().hasMember("note"); })) << Task().toString();
+        EXPECT_GT(zel_.Ask("daemon_status")["folders"].asUInt64(), 40u);
+        EXPECT_EQ(zel_.End(SIGTERM), 0);
     }
-    AddTask();
-    AwaitEqual("first");
-    EXPECT_THAT(Task()["note"].asString(), HasSubstr("raise fs.inotify.max_user_watches"));
-    for (int i = 0; i < 40; ++i) {
-        Write("d" + std::to_string(i) + "/f", "changed");
-    }
-    AwaitEqual("changed where nobody watches");
 }
 
 TEST_F(DaemonTest, AShareWhoseFolderIsAwayCostsNothingAndComesBack) {
