@@ -282,6 +282,40 @@ TEST_F(Catalogue, EncryptedShareIsWhereItsStorageIs) {
     EXPECT_EQ(places(), root_.Path("v/vault") + " /k/auto /k/exported");
 }
 
+TEST_F(Catalogue, AnotherFolderInThePlaceOfTheSharesWaitsForAPerson) {
+    constexpr char kCatalogue[] = "usr/tarq/etc/tarqshare.conf";
+    const std::string docs = Folder("v/docs");
+    const auto replace_folder = [&](const char* aside) {
+        fs::rename(docs, root_.Path(aside));
+        Folder("v/docs");
+        return ErrorOfGet("docs");
+    };
+    ASSERT_EQ(Add("docs", docs), 0);
+    EXPECT_EQ(replace_folder("v/first"), TARQ_ERR_SHARE_IDENTITY);
+    const TARQ::HashOwner was(KAPICSzHashAlloc(0));
+    const TARQ::HashOwner seen(KAPICSzHashAlloc(0));
+    EXPECT_EQ(TARQShareFactsGet("docs", was.get(), seen.get()), 0);
+    EXPECT_EQ(replace_folder("v/second"), TARQ_ERR_SHARE_IDENTITY);
+    EXPECT_EQ(ErrorOf(TARQShareConfirm("docs", seen.get())), TARQ_ERR_SHARE_IDENTITY)
+        << "what was shown has changed since";
+    EXPECT_EQ(TARQShareFactsGet("docs", was.get(), seen.get()), 0);
+    EXPECT_EQ(ErrorOf(TARQShareConfirm("docs", seen.get())), 0);
+    EXPECT_EQ(TARQShareFactsGet("docs", was.get(), seen.get()), 1);
+    EXPECT_EQ(ErrorOfGet("docs"), 0);
+
+    // A catalogue of the time before identities: the first look-up records, and the next one knows.
+    const std::string text = test::ReadFile(root_.Path(kCatalogue));
+    WriteCatalogue("# mine\n[docs]\npath=\"" + docs + "\"\n");
+    EXPECT_EQ(ErrorOfGet("docs"), 0);
+    EXPECT_THAT(test::ReadFile(root_.Path(kCatalogue)), testing::StartsWith("# mine\n"));
+    for (const char* key : {"folder_inode", "volume"}) {
+        const auto line = text.substr(text.find(std::string(key) + "="));
+        EXPECT_THAT(test::ReadFile(root_.Path(kCatalogue)),
+                    testing::HasSubstr(line.substr(0, line.find('\n'))));
+    }
+    EXPECT_EQ(replace_folder("v/third"), TARQ_ERR_SHARE_IDENTITY);
+}
+
 TEST_F(Catalogue, WritersDoNotLoseEachOthersShares) {
     std::vector<std::thread> writers;
     for (const char* writer : {"a", "b", "c", "d"}) {
@@ -319,6 +353,10 @@ TEST_F(Catalogue, EmptyMountPointIsNeverAnEmptiedShare) {
     mount_at(volume, "ramfs");
     Folder("my volume/docs");
     EXPECT_EQ(ErrorOfGet("docs"), TARQ_ERR_SHARE_VOLUME) << "a file system of another kind";
+    ASSERT_EQ(umount(volume.c_str()), 0);
+    mount_at(volume, "tmpfs");
+    Folder("my volume/docs");
+    EXPECT_EQ(ErrorOfGet("docs"), TARQ_ERR_SHARE_IDENTITY) << "another disk of the same kind";
     ASSERT_EQ(umount(volume.c_str()), 0);
 
     // What a mount hides is not there, however well its mount point fits the path.

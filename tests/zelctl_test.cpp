@@ -340,6 +340,15 @@ TEST_F(Zelctl, HelpIsForPeopleAndFitsATerminal) {
     EXPECT_THAT(Run("task rm x y"), Ended(2, "one word too many: 'y'"));
 }
 
+TEST_F(Zelctl, AShareThatTheDaemonSeesOtherwiseIsNotAdded) {
+    root_.Write("other/file", "x");
+    FakeDaemon daemon(root_.Path(), [](const PObject&) {
+        return Success({{"problem", PObject("it sees another folder there")}});
+    });
+    EXPECT_THAT(Run("share add other " + root_.Path("other")), Ended(3, "another folder there"));
+    EXPECT_THAT(Run("share list").output, Not(HasSubstr("other")));
+}
+
 TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
     FakeDaemon daemon(root_.Path(), [](const PObject& request) {
         return Success({{"task", request}});

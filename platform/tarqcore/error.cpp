@@ -47,6 +47,8 @@ const char* KAPICErrText(int code) {
             return "the folder holds, or lies in, another share's";
         case TARQ_ERR_SHARE_FOLDER:
             return "the share's folder is not there, or is no folder that can be read";
+        case TARQ_ERR_SHARE_IDENTITY:
+            return "another folder, or one on another disk, stands where the share's was";
         case TARQ_ERR_NO_KEY:
             return "no such key";
         case TARQ_ERR_NO_SECTION:

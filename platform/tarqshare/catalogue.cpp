@@ -83,6 +83,13 @@ std::optional<unsigned int> ParseFlag(const std::string& word) {
     return number;
 }
 
+/// Sets the hash's values. False with the error code set.
+bool SetAll(KAPICSzHash hash, const std::vector<std::pair<const char*, std::string>>& values) {
+    return std::all_of(values.begin(), values.end(), [hash](const auto& value) {
+        return KAPICSzHashSetValue(hash, value.first, value.second.c_str()) == 0;
+    });
+}
+
 std::string Or(const std::string& value, const std::string& otherwise) {
     return value.empty() ? otherwise : value;
 }
@@ -95,6 +102,22 @@ bool IsAbsoluteOrEmpty(const std::string& path) {
 
 bool Share::IsEncrypted() const {
     return (flags & TARQ_SHARE_ENCRYPTED) != 0;
+}
+
+std::vector<std::pair<const char*, std::string>> FactsOf(const Share& share) {
+    return {
+        {"volume", share.volume.mount_point},
+        {"volume_fs", share.volume.file_system},
+        {"volume_uuid", share.volume.uuid},
+        {"folder_fs", share.identity.file_system},
+        {"folder_fsid", share.identity.file_system_id},
+        {"folder_inode", share.identity.inode},
+        {"folder_birth", share.identity.birth},
+    };
+}
+
+bool AddFacts(const Share& share, KAPICSzHash into) {
+    return SetAll(into, FactsOf(share));
 }
 
 bool IsShareName(const std::string& name) {
@@ -190,6 +213,8 @@ std::optional<Share> ReadShare(const std::string& name) {
     }
     share.volume = {ValueOf(section, "volume"), ValueOf(section, "volume_fs"),
                     ValueOf(section, "volume_uuid"), TARQ_VOLUME_UNKNOWN};
+    share.identity = {ValueOf(section, "folder_fs"), ValueOf(section, "folder_fsid"),
+                      ValueOf(section, "folder_inode"), ValueOf(section, "folder_birth")};
     return share;
 }
 
@@ -211,23 +236,21 @@ std::optional<std::vector<std::string>> ReadShareNames() {
 
 bool WriteShare(const Share& share) {
     const TARQ::HashOwner values(KAPICSzHashAlloc(0));
-    const std::pair<const char*, std::string> lines[] = {
-        {"path", share.path},
-        {"flags", FormatFlags(share.flags)},
-        {"volume", share.volume.mount_point},
-        {"volume_fs", share.volume.file_system},
-        {"volume_uuid", share.volume.uuid},
-    };
-    if (!values) {
+    return values &&
+           SetAll(values.get(), {{"path", share.path}, {"flags", FormatFlags(share.flags)}}) &&
+           AddFacts(share, values.get()) &&
+           KAPICFileAddSection(CataloguePath().c_str(), share.name.c_str(), values.get(),
+                               nullptr) >= 1;
+}
+
+bool WriteFacts(const Share& share) {
+    const TARQ::HashOwner values(KAPICSzHashAlloc(0));
+    if (!values || !AddFacts(share, values.get())) {
         return false;
     }
-    for (const auto& [key, value] : lines) {
-        if (KAPICSzHashSetValue(values.get(), key, value.c_str()) < 0) {
-            return false;
-        }
-    }
-    return KAPICFileAddSection(CataloguePath().c_str(), share.name.c_str(), values.get(),
-                               nullptr) >= 1;
+    const int result =
+        KAPICIFileModifySection(CataloguePath().c_str(), share.name.c_str(), 0, values.get(), 1, 0);
+    return result > 0 || (result == 0 && Refuse(TARQ_ERR_NO_SHARE));
 }
 
 bool EraseShare(const std::string& name) {
@@ -237,7 +260,7 @@ bool EraseShare(const std::string& name) {
     return result > 0 || (result == 0 && Refuse(TARQ_ERR_NO_SHARE));
 }
 
-CatalogueLock::CatalogueLock()
+CatalogueLock::CatalogueLock(Patience patience)
     // Beside the catalogue, which every write replaces by another file.
     : file_(open(TARQ::RootPath(kLockFile).c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW,
                  0600)) {
@@ -245,9 +268,10 @@ CatalogueLock::CatalogueLock()
         Refuse(TARQ_ERR_OPEN_FILE);
         return;
     }
+    const int wish = patience == Patience::kWait ? LOCK_EX : LOCK_EX | LOCK_NB;
     int result = 0;
     do {
-        result = flock(file_.Get(), LOCK_EX);
+        result = flock(file_.Get(), wish);
     } while (result != 0 && errno == EINTR);
     locked_ = result == 0 || Refuse(TARQ_ERR_OPEN_FILE);
 }

@@ -1,11 +1,15 @@
 // The share catalogue: /usr/tarq/etc/tarqshare.conf below the root folder, a section a share.
 #pragma once
 
+#include <tarq/core.h>
+
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "base/unique_fd.h"
+#include "platform/tarqshare/identity.h"
 #include "platform/tarqshare/volume.h"
 
 namespace tarq_share {
@@ -20,12 +24,20 @@ struct Share {
                                  ///< encrypted shares alone
     std::string key_file;        ///< exported key, set or by default
     std::string auto_key_file;   ///< key for opening at start-up, set or by default
-    Volume volume;  ///< what was recorded when the share was added; no mount point: nothing was
+    Volume volume;      ///< what was recorded when the share was added; no mount point: nothing was
+    Identity identity;  ///< recorded, of the folder whose files travel; no kind of file system:
+                        ///< nothing was
 
     bool IsEncrypted() const;
     /// The folder whose files travel: the encrypted form's, where there is one.
     const std::string& DataFolder() const { return IsEncrypted() ? encrypted_path : path; }
 };
+
+/// What `share` is known again by, and how the catalogue calls it.
+std::vector<std::pair<const char*, std::string>> FactsOf(const Share& share);
+
+/// Sets each of them in `into`. False with the error code set.
+bool AddFacts(const Share& share, KAPICSzHash into);
 
 /// Whether a share may be given this name: see TARQShareAdd.
 bool IsShareName(const std::string& name);
@@ -45,13 +57,17 @@ std::optional<Share> ReadShare(const std::string& name);
 std::optional<std::vector<std::string>> ReadShareNames();
 /// Appends a share's section. Only with the lock held. False with the error code set.
 bool WriteShare(const Share& share);
+/// Records in a share's section what it is known by now; its other keys stay. Only with the lock
+/// held. False with the error code set.
+bool WriteFacts(const Share& share);
 /// Takes a share's section out. Only with the lock held. False with the error code set.
 bool EraseShare(const std::string& name);
 
-/// The right to write the catalogue, among all processes and threads; waits for it.
+/// The right to write the catalogue, among all processes and threads.
 class CatalogueLock {
 public:
-    CatalogueLock();
+    enum class Patience { kWait, kNone };
+    explicit CatalogueLock(Patience patience = Patience::kWait);
     /// False, with the error code set, when the lock cannot be had.
     explicit operator bool() const { return locked_; }
 

@@ -2,10 +2,10 @@
 
 #include <fcntl.h>
 #include <strings.h>
-#include <sys/stat.h>
 #include <tarq/owners.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <climits>
@@ -19,6 +19,7 @@
 #include "platform/internal/config.h"
 #include "platform/internal/error.h"
 #include "platform/tarqshare/catalogue.h"
+#include "platform/tarqshare/identity.h"
 #include "platform/tarqshare/mount_table.h"
 #include "platform/tarqshare/volume.h"
 
@@ -30,12 +31,21 @@ using base::UniqueFd;
 using tarq_internal::CopyOut;
 using tarq_internal::Fail;
 using tarq_internal::Guarded;
+using tarq_share::AddFacts;
+using tarq_share::CatalogueLock;
+using tarq_share::FactsOf;
 using tarq_share::FindVolume;
+using tarq_share::Identity;
+using tarq_share::IdentityOf;
 using tarq_share::IsWithin;
 using tarq_share::ReadShare;
 using tarq_share::ReadShareNames;
 using tarq_share::Share;
 using tarq_share::Volume;
+using tarq_share::WriteFacts;
+
+// Beside what the catalogue has of it: the folder whose files travel.
+constexpr char kPathFact[] = "path";
 
 int Answer(const std::string& text, char* buffer, int size) {
     return CopyOut(text, buffer, size) ? 0 : Fail(TARQ_ERR_BAD_PARAMETER);
@@ -51,26 +61,90 @@ std::optional<std::string> ReadableFolder(const std::string& path) {
     return real.data();
 }
 
+UniqueFd OpenFolder(const std::string& path) {
+    return UniqueFd(open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+}
+
+/// Puts the volume and the identity of the share's folder as it is now into `share`. 0, or -1.
+int LookAt(Share* share) {
+    const std::string& path = share->DataFolder();
+    const UniqueFd folder = OpenFolder(path);
+    const std::optional<Identity> identity = folder ? IdentityOf(folder.Get()) : std::nullopt;
+    if (!identity) {
+        return Fail(TARQ_ERR_SHARE_FOLDER);
+    }
+    const std::optional<Volume> volume = FindVolume(path);
+    if (!volume) {
+        return Fail(TARQ_ERR_NO_VOLUME);
+    }
+    share->volume = *volume;
+    share->identity = *identity;
+    return 0;
+}
+
+bool HasFact(KAPICSzHash seen, const char* key, const std::string& value) {
+    const char* const known = KAPICSzHashGetValue(seen, key);
+    return known != nullptr && value == known;
+}
+
+bool HasFacts(KAPICSzHash seen, const Share& share) {
+    const auto facts = FactsOf(share);
+    return std::all_of(facts.begin(), facts.end(),
+                       [seen](const auto& fact) { return HasFact(seen, fact.first, fact.second); });
+}
+
+/// Whether the share, as the catalogue has it, was where `now` says that it is.
+bool IsSamePlace(const Share& recorded, const Share& now) {
+    return (recorded.volume.mount_point.empty() || IsSameVolume(recorded.volume, now.volume)) &&
+           IsSameIdentity(recorded.identity, now.identity);
+}
+
+/// Records where the folder is now for a share that has no identity: it was added before identities
+/// were kept, or written by hand. What cannot be written now, or not by this caller, is the next
+/// one's to write: no failure.
+void AdoptIdentity(const std::string& name) {
+    const int error_before = KAPICErrGet();
+    const CatalogueLock lock(CatalogueLock::Patience::kNone);
+    const std::optional<Share> recorded = lock ? ReadShare(name) : std::nullopt;
+    if (recorded && recorded->identity.file_system.empty()) {
+        Share now = *recorded;
+        if (LookAt(&now) == 0 && IsSamePlace(*recorded, now)) {
+            if (now.volume.uuid.empty()) {
+                now.volume.uuid = recorded->volume.uuid;
+            }
+            WriteFacts(now);
+        }
+    }
+    KAPICErrSetEx(error_before, __FILE__, __LINE__);
+}
+
 /// 0 when the share's files are where they were when it was added.
 int CheckData(const Share& share) {
-    const std::string& folder = share.DataFolder();
-    if (folder.empty()) {
+    const std::string& path = share.DataFolder();
+    if (path.empty()) {
         return 0;
     }
-    struct stat status {};
-    const bool there = stat(folder.c_str(), &status) == 0;
-    const int reason = there ? ENOTDIR : errno;
+    const UniqueFd folder = OpenFolder(path);
+    const int reason = errno;
     if (!share.volume.mount_point.empty()) {
-        const std::optional<Volume> now = FindVolume(there ? folder : share.volume.mount_point);
+        const std::optional<Volume> now = FindVolume(folder ? path : share.volume.mount_point);
         if (!now || !IsSameVolume(share.volume, *now)) {
             return Fail(TARQ_ERR_SHARE_VOLUME);
         }
     }
-    if (!there || !S_ISDIR(status.st_mode)) {
+    if (!folder) {
         errno = reason;
         return Fail(TARQ_ERR_SHARE_FOLDER);
     }
-    return 0;
+    const std::optional<Identity> now = IdentityOf(folder.Get());
+    if (!now) {
+        return Fail(TARQ_ERR_SHARE_FOLDER);
+    }
+    if (share.identity.file_system.empty()) {
+        AdoptIdentity(share.name);
+        return 0;
+    }
+    return IsSameIdentity(share.identity, *now) ? 0 : Fail(TARQ_ERR_SHARE_IDENTITY);
 }
 
 bool Overlap(const std::string& a, const std::string& b) {
@@ -175,13 +249,10 @@ int TARQShareAdd(const char* name, const char* path, unsigned int flags) {
                 return Fail(TARQ_ERR_SHARE_FOLDER);
             }
         }
-        const std::optional<Volume> volume = FindVolume(share.DataFolder());
-        if (!volume) {
-            return Fail(TARQ_ERR_NO_VOLUME);
+        if (LookAt(&share) < 0) {
+            return -1;
         }
-        share.volume = *volume;
-
-        const tarq_share::CatalogueLock lock;
+        const CatalogueLock lock;
         if (!lock || CheckAgainstOthers(share) < 0) {
             return -1;
         }
@@ -194,8 +265,43 @@ int TARQShareRemove(const char* name) {
         if (name == nullptr || *name == '\0') {
             return Fail(TARQ_ERR_BAD_PARAMETER);
         }
-        const tarq_share::CatalogueLock lock;
+        const CatalogueLock lock;
         return lock && tarq_share::EraseShare(name) ? 0 : -1;
+    });
+}
+
+int TARQShareFactsGet(const char* name, KAPICSzHash recorded, KAPICSzHash now) {
+    return Guarded(-1, [&] {
+        if (name == nullptr || *name == '\0' || recorded == nullptr || now == nullptr) {
+            return Fail(TARQ_ERR_BAD_PARAMETER);
+        }
+        const std::optional<Share> share = ReadShare(name);
+        if (!share) {
+            return -1;
+        }
+        Share present = *share;
+        if (LookAt(&present) < 0 || !AddFacts(*share, recorded) || !AddFacts(present, now) ||
+            KAPICSzHashSetValue(now, kPathFact, present.DataFolder().c_str()) < 0) {
+            return -1;
+        }
+        return !share->identity.file_system.empty() && IsSamePlace(*share, present) ? 1 : 0;
+    });
+}
+
+int TARQShareConfirm(const char* name, KAPICSzHash seen) {
+    return Guarded(-1, [&] {
+        if (name == nullptr || *name == '\0' || seen == nullptr) {
+            return Fail(TARQ_ERR_BAD_PARAMETER);
+        }
+        const CatalogueLock lock;
+        std::optional<Share> share = lock ? ReadShare(name) : std::nullopt;
+        if (!share || LookAt(&*share) < 0) {
+            return -1;
+        }
+        if (!HasFacts(seen, *share) || !HasFact(seen, kPathFact, share->DataFolder())) {
+            return Fail(TARQ_ERR_SHARE_IDENTITY);
+        }
+        return WriteFacts(*share) ? 0 : -1;
     });
 }
 

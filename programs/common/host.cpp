@@ -55,7 +55,12 @@ std::string ShareProblem(const std::string& name) {
     const int found = TARQShareGet(name.c_str(), &record);
     const TARQ::ShareOwner share(record);
     if (found < 0 || !share || share->path == nullptr) {
-        return shown + ": " + KAPICErrText(KAPICErrGet()) + " (see 'zelctl share list')";
+        const int error = KAPICErrGet();
+        const std::string remedy =
+            error == TARQ_ERR_SHARE_IDENTITY
+                ? "if it is the right one: zelctl share confirm " + Printable(name)
+                : "see 'zelctl share list'";
+        return shown + ": " + KAPICErrText(error) + " (" + remedy + ")";
     }
     if (access(share->path, R_OK | X_OK) != 0) {
         return shown + ": its folder " + Printable(share->path) +

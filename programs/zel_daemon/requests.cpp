@@ -12,6 +12,7 @@
 #include "ZEL/log.h"
 #include "programs/common/run_progress.h"
 #include "programs/common/schedule_words.h"
+#include "programs/common/seen_folder.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/store.h"
 #include "programs/zel_daemon/task_map.h"
@@ -76,6 +77,13 @@ unsigned int NumberOf(const PObject& request, const char* key, unsigned int fall
     return request[key].asUInt32();
 }
 
+uint64_t BigNumberOf(const PObject& request, const char* key) {
+    if (!request[key].isInteger()) {
+        Refuse(std::string("key ") + key + " is missing or no number");
+    }
+    return request[key].asUInt64();
+}
+
 bool FlagOf(const PObject& request, const char* key) {
     return NumberOf(request, key, 0, 1) == 1;
 }
@@ -135,6 +143,7 @@ PObject Requests::Dispatch(const Peer& peer, const PObject& request) {
         {"task_pause", {"task"}, false, &Requests::TaskPause},
         {"task_resume", {"task"}, false, &Requests::TaskResume},
         {"task_log", {"task", "limit"}, false, &Requests::TaskLog},
+        {"share_check", {"path", "device", "inode", "volume"}, false, &Requests::ShareCheck},
         {"watch", {"task"}, false, &Requests::Watch},
         {"daemon_status", {}, false, &Requests::DaemonStatus},
         {"reload", {}, false, &Requests::Reload},
@@ -231,6 +240,23 @@ PObject Requests::TaskLog(const Peer&, const PObject& request) {
     PObject::Array& runs = reply["runs"].asArray();
     for (const RunRecord& run : service_.Runs(TextOf(request, "task"), limit)) {
         runs.push_back(RunToMap(run));
+    }
+    return reply;
+}
+
+PObject Requests::ShareCheck(const Peer& peer, const PObject& request) {
+    if (!peer.trusted) {
+        throw RequestError(ZEL::RESULT_NO_PERMISSION,
+                           "only root and the daemon's own user may ask what the daemon sees");
+    }
+    programs::SeenFolder seen;
+    seen.device = BigNumberOf(request, "device");
+    seen.inode = BigNumberOf(request, "inode");
+    seen.volume = TextOf(request, "volume");
+    PObject reply = Success();
+    const std::string problem = programs::DifferenceFrom(seen, TextOf(request, "path"));
+    if (!problem.empty()) {
+        reply["problem"] = problem;
     }
     return reply;
 }

@@ -44,6 +44,7 @@ private:
     ZEL::PObject TaskPause(const Peer&, const ZEL::PObject& request);
     ZEL::PObject TaskResume(const Peer&, const ZEL::PObject& request);
     ZEL::PObject TaskLog(const Peer&, const ZEL::PObject& request);
+    ZEL::PObject ShareCheck(const Peer& peer, const ZEL::PObject& request);
     ZEL::PObject Watch(const Peer&, const ZEL::PObject& request);
     ZEL::PObject DaemonStatus(const Peer&, const ZEL::PObject& request);
     ZEL::PObject Reload(const Peer&, const ZEL::PObject& request);

@@ -38,6 +38,13 @@ void DeclareShare(CLI::App& share, ExitCode& result) {
     add->add_flag("--windows", windows, "It is shared with Windows clients");
     add->callback([&result] { result = AddShare(name, path, acl, windows); });
 
+    static bool yes = false;
+    CLI::App* const confirm = share.add_subcommand(
+        "confirm", "Say that the folder that is there now is the share's, after it was replaced");
+    confirm->add_option("name", name, "The share's name")->required();
+    confirm->add_flag("-y,--yes", yes, "Do not ask");
+    confirm->callback([&result] { result = ConfirmShare(name, yes); });
+
     CLI::App* const list = share.add_subcommand("list", "List the shares");
     list->add_flag("--json", as_json, "Write JSON, for programs");
     list->callback([&result] { result = ListShares(as_json); });

@@ -39,7 +39,11 @@ std::string RemedyOfShare(const std::string& name) {
         case TARQ_ERR_NO_SHARE:
             return "zelctl share add '" + name + "' FOLDER, or take it out of the tasks";
         case TARQ_ERR_SHARE_VOLUME:
-            return "mount its disk; if the share has moved: zelctl share rm and share add";
+            return "mount its disk; if the share has moved: zelctl share confirm '" + name +
+                   "', or share rm and share add";
+        case TARQ_ERR_SHARE_IDENTITY:
+            return "mount its disk; if the folder is the right one: zelctl share confirm '" + name +
+                   "'";
         default:
             return "if the share has moved: zelctl share rm and zelctl share add";
     }

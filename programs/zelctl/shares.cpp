@@ -6,6 +6,7 @@
 #include "programs/common/task_run.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/prepare.h"
+#include "programs/zelctl/share_confirm.h"
 #include "tarq/owners.h"
 
 namespace zelctl {
@@ -40,6 +41,11 @@ ExitCode AddShare(const std::string& name, const std::string& path, bool acl, bo
     }
     if (windows) {
         flags |= TARQ_SHARE_WINDOWS;
+    }
+    const std::string unseen = DaemonsViewOf(absolute);
+    if (!unseen.empty()) {
+        return Fail(kLocal, "cannot add '%s' at %s: %s", programs::Printable(name).c_str(),
+                    programs::Printable(absolute).c_str(), unseen.c_str());
     }
     if (TARQShareAdd(name.c_str(), absolute.c_str(), flags) < 0) {
         if (KAPICErrGet() == TARQ_ERR_BAD_PARAMETER) {

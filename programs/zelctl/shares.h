@@ -10,6 +10,9 @@
 namespace zelctl {
 
 ExitCode AddShare(const std::string& name, const std::string& path, bool acl, bool windows);
+/// Shows what the share was known by and what its folder is now, and records that when a person (or
+/// `yes`) says that it is the right one.
+ExitCode ConfirmShare(const std::string& name, bool yes);
 ExitCode RemoveShare(const std::string& name);
 ExitCode ListShares(bool as_json);
 

@@ -257,6 +257,38 @@ TEST_F(DaemonTest, AShareWhoseFolderIsAwayCostsNothingAndComesBack) {
     EXPECT_EQ(Task()["note"].asString(), "");
 }
 
+TEST_F(DaemonTest, AnotherFolderInThePlaceOfTheSharesDeletesNothingUntilAPersonSaysSo) {
+    StartRealtime();
+    const auto copy = TreeOf(storage_);
+    fs::rename(source_, source_ + ".away");
+    fs::create_directories(source_);
+    ASSERT_TRUE(Await([&] {
+        return Task()["last_error"].asString().find("zelctl share confirm docs") !=
+               std::string::npos;
+    }));
+    EXPECT_EQ(TreeOf(storage_), copy);
+    EXPECT_EQ(Client("share confirm docs").exit_code, 2) << "nobody to ask";
+    EXPECT_EQ(TreeOf(storage_), copy);
+    const test::Outcome confirmed = Client("share confirm docs --yes");
+    EXPECT_EQ(confirmed.exit_code, 0);
+    EXPECT_THAT(confirmed.output, HasSubstr("deletes the whole copy"));
+    AwaitEqual("confirmed");
+
+    // Another folder of the daemon's than the person's is no share.
+    PObject check = Request("share_check");
+    struct stat info = {};
+    ASSERT_EQ(stat(source_.c_str(), &info), 0);
+    check["path"] = source_;
+    check["device"] = static_cast<unsigned long long>(info.st_dev);
+    check["inode"] = static_cast<unsigned long long>(info.st_ino);
+    check["volume"] = "/no/such/volume";
+    EXPECT_THAT(zel_.Ask(check)["problem"].asString(), HasSubstr("/no/such/volume"));
+    check["inode"] = 1;
+    EXPECT_THAT(zel_.Ask(check)["problem"].asString(), HasSubstr("another folder"));
+    check["path"] = source_ + "/none";
+    EXPECT_THAT(zel_.Ask(check)["problem"].asString(), HasSubstr("No such file"));
+}
+
 TEST_F(DaemonTest, AnOutageLosesNothingAndMakesNoHotLoop) {
     StartRealtime();
     StopServer();
@@ -398,6 +430,7 @@ TEST_F(DaemonTest, ABadRequestIsRefusedInWordsAndChangesNothing) {
         {Request("watch"), "task", {"none"}},
         {Request("task_list"), "brief", {"yes", 2}},
         {Request("task_list"), "colour", {1}},
+        {Request("share_check"), "path", {5}},
         {Request("task_log", "t"), "limit", {-1, 100000, "x"}},
         {add, "share_list", {"docs", numbers, unknown, many, PObject()}},
         {add, "name", {"t", "a\nb", "", std::string(60000, 'n'), 5}},

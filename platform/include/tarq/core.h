@@ -32,12 +32,14 @@ enum TARQErrorCode {
     TARQ_ERR_SHARE_EXISTS = 0x1B00,  /* the catalogue has a share of that name already */
     TARQ_ERR_SHARE_OVERLAP = 0x1C00, /* the folder holds, or lies in, another share's */
     TARQ_ERR_SHARE_FOLDER =
-        0x1D00,                   /* the share's folder is not there or no folder; errno says why */
-    TARQ_ERR_NO_KEY = 0x2000,     /* the section has no such key */
-    TARQ_ERR_NO_SECTION = 0x2200, /* the file has no such section */
-    TARQ_ERR_NO_VOLUME = 0x2300,  /* the path lies on no volume, or cannot be examined */
-    TARQ_ERR_LOOKUP = 0x3100,     /* the name service failed */
-    TARQ_ERR_SERVICE = 0xEA00,    /* the service manager refused or cannot be reached */
+        0x1D00, /* the share's folder is not there or no folder; errno says why */
+    TARQ_ERR_SHARE_IDENTITY =
+        0x1E00, /* another folder, or one on another disk, stands where the share's was */
+    TARQ_ERR_NO_KEY = 0x2000,      /* the section has no such key */
+    TARQ_ERR_NO_SECTION = 0x2200,  /* the file has no such section */
+    TARQ_ERR_NO_VOLUME = 0x2300,   /* the path lies on no volume, or cannot be examined */
+    TARQ_ERR_LOOKUP = 0x3100,      /* the name service failed */
+    TARQ_ERR_SERVICE = 0xEA00,     /* the service manager refused or cannot be reached */
     TARQ_ERR_SERVICE_BUSY = 0xEB00 /* the unit is being started already */
 };
 

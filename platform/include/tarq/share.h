@@ -50,15 +50,20 @@ typedef struct TARQVolumePath {
  * that an empty mount point is never taken for an emptied share;
  * TARQ_ERR_SHARE_FOLDER when the volume is there and the folder is not, so that a folder which was
  * moved away is never taken for one whose files were deleted;
+ * TARQ_ERR_SHARE_IDENTITY when another folder stands there than was recorded (one on another disk,
+ * or one that was made anew), so that its files are never taken for what became of the share's;
  * TARQ_ERR_BAD_PARAMETER when the section cannot be understood.
- * For an encrypted share it is the folder of the encrypted form that has to be there. */
+ * For an encrypted share it is the folder of the encrypted form that has to be there. A share that
+ * has no identity in the catalogue yet is given that of its folder now, by a caller that may write
+ * there. */
 int TARQShareGet(const char* name, TARQShare* share);
 /* Frees a record. NULL is allowed. */
 void TARQShareFree(TARQShare share);
 
 /* Adds a share. `path` is an existing readable folder, absolute; links in it are resolved. Its
- * volume (mount path, file system type and, where there is one, UUID) is recorded. An encrypted
- * share's encrypted form has to be there too, at its default place.
+ * volume (mount path, file system type and, where there is one, UUID) and what the folder itself is
+ * known by are recorded. An encrypted share's encrypted form has to be there too, at its default
+ * place.
  *
  * A name has 1 to 80 bytes of UTF-8, no control character and none of / : " \ [ ] * ?, does not
  * begin with "." or "@", has no blank at either end nor two side by side, and is neither "global"
@@ -71,6 +76,17 @@ int TARQShareAdd(const char* name, const char* path, unsigned int flags);
 /* Takes a share out of the catalogue; its files stay. 0, or negative (TARQ_ERR_NO_SHARE). Waits for
  * other writers. */
 int TARQShareRemove(const char* name);
+/* What a share is known by: adds the facts that the catalogue has of the folder whose files travel
+ * to `recorded`, and those of the folder that is there now to `now`, under the catalogue's keys
+ * (volume, volume_fs, volume_uuid, folder_fs, folder_fsid, folder_inode, folder_birth); what is not
+ * known is empty. `now` has that folder's path, too ("path"). 1 when they are the same folder's, 0
+ * when they are not, or when nothing of the folder is recorded; negative: TARQ_ERR_NO_SHARE;
+ * TARQ_ERR_BAD_PARAMETER; TARQ_ERR_SHARE_FOLDER; TARQ_ERR_NO_VOLUME. */
+int TARQShareFactsGet(const char* name, KAPICSzHash recorded, KAPICSzHash now);
+/* Records the facts of the folder that is there now in place of those before, when they are still
+ * the ones in `seen`. 0, or negative: TARQ_ERR_SHARE_IDENTITY when they have changed since; or as
+ * above, or a file's. Waits for other writers. */
+int TARQShareConfirm(const char* name, KAPICSzHash seen);
 /* Appends the names of all shares, in the catalogue's order, to `into`. 0, or negative. */
 int TARQShareEnum(KAPICSzList into);
 
