@@ -78,8 +78,9 @@ int Repair() {
         if (!MendRegistry(*damage, *config)) {
             return ComplainErrno("cannot write the registry " + RegistryFile());
         }
-        printf("Mended:  %s again with their owners; the service is switched %s\n",
+        printf("Mended:  %s with %s; the service is switched %s\n",
                programs::Count(damage->shares.size(), "share").c_str(),
+               damage->shares.size() == 1 ? "its owner" : "their owners",
                ReadSwitch() == Switch::kOn ? "on" : "off");
         printf("Kept:    %s, the damaged file\n", DamagedCopy().c_str());
         puts("Clients that were forgotten pair again by themselves.");
@@ -325,21 +326,23 @@ int RunCommandLine(int argc, char** argv) {
     SetupOptions setup;
     CLI::App* const setup_command =
         app.add_subcommand("setup", "Configure the server, and have its rsync daemon run");
-    setup_command->add_option("--storage", setup.storage, "Folder that receives the shares")
-        ->option_text("FOLDER")
-        ->required();
+    setup_command
+        ->add_option("--storage", setup.storage,
+                     "Folder that receives the shares; a new server needs it")
+        ->option_text("FOLDER");
     setup_command
         ->add_option("--volume", setup.volumes,
-                     "Another folder, for clients whose volume has that name")
+                     "Another folder, for clients whose volume has that name; NAME= takes it out")
         ->option_text("NAME=FOLDER");
-    setup_command->add_option("--port", setup.port, "Port to listen on")
-        ->default_str("873, with TARQ_ROOT 8873")
+    setup_command->add_option("--port", setup.port, "Port to listen on (873; 8873 with TARQ_ROOT)")
         ->check(programs::Between(1, 65535));
-    setup_command->add_option("--address", setup.address, "Address to listen on")
-        ->default_str("all");
-    setup_command->add_option("--user", setup.user, "System user that owns the copies, as root")
-        ->default_str("zel");
-    setup_command->add_flag("--no-encryption", setup.no_encryption, "Refuse encrypted shares");
+    setup_command->add_option("--address", setup.address, "Address to listen on, or all");
+    setup_command->add_option("--user", setup.user,
+                              "System user that owns the copies, as root (zel)");
+    setup_command->add_flag_function(
+        "--encryption,!--no-encryption", [&](int64_t count) { setup.encryption = count > 0; },
+        "Accept or refuse encrypted shares");
+    setup_command->footer("What is not given stays as it was.");
     setup_command->callback([&] { result = Setup(setup); });
 
     app.add_subcommand("enable", "Accept clients")->callback([&] { result = SetSwitch(true); });

@@ -96,10 +96,12 @@ private:
         }
         health_.registry = damage->None() ? "whole" : "damaged";
         if (damage->switch_lost || !damage->shares.empty()) {
-            Found("the registry " + RegistryFile() + " is damaged: it has lost " +
-                      (damage->shares.empty() ? "the service's switch"
-                                              : Count(damage->shares.size(), "share") + " (" +
-                                                    Listed(damage->shares) + ")") +
+            std::string lost = damage->switch_lost ? "the service's switch" : "";
+            if (!damage->shares.empty()) {
+                lost += (lost.empty() ? "" : " and ") + Count(damage->shares.size(), "share") +
+                        " (" + Listed(damage->shares) + ")";
+            }
+            Found("the registry " + RegistryFile() + " is damaged: it has lost " + lost +
                       "; clients are refused",
                   "zel_server repair");
         }
@@ -203,6 +205,11 @@ private:
         StorageHealth storage;
         storage.folder = folder;
         storage.state = CheckStorage(folder);
+        // The daemon may what the one who asks may not.
+        if (storage.state == StorageState::kNotPermitted && geteuid() != 0 &&
+            !config_.user.empty()) {
+            storage.state = StorageState::kReady;
+        }
         struct statvfs space = {};
         if (storage.state != StorageState::kAbsent && storage.state != StorageState::kOtherDisk &&
             statvfs(folder.c_str(), &space) == 0) {
@@ -251,7 +258,7 @@ private:
     void LookAtCopies() {
         if (!config_.user.empty() && getpwnam(config_.user.c_str()) == nullptr) {
             Found("there is no user '" + config_.user + "', to whom the copies belong",
-                  "zel_server setup --storage " + config_.storage + ", which makes it");
+                  "zel_server setup, which makes it");
             return;
         }
         std::vector<std::string> copies;

@@ -69,7 +69,10 @@ int WaitForFirstEnd(const std::vector<pid_t>& daemons) {
             waitpid(daemon, nullptr, 0);
         }
     }
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    // Nobody has told this process to end: that is a failure whatever the daemon says.
+    return Complain("the rsync daemon has ended" +
+                    (WIFSIGNALED(status) ? " by signal " + std::to_string(WTERMSIG(status))
+                                         : " with status " + std::to_string(WEXITSTATUS(status))));
 }
 
 }  // namespace

@@ -7,6 +7,7 @@
 
 #include <cerrno>
 #include <chrono>
+#include <cstdint>
 #include <cstdio>
 #include <filesystem>
 #include <thread>
@@ -33,6 +34,7 @@ namespace fs = std::filesystem;
 constexpr int kSystemPort = 873;  // rsync's own; only root may listen there
 constexpr int kUnprivilegedPort = 8873;
 constexpr char kStorageUser[] = "zel";
+constexpr char kEverywhere[] = "all";
 // How long a daemon may take until it listens.
 constexpr std::chrono::seconds kStartLimit(10);
 constexpr std::chrono::milliseconds kStep(50);
@@ -49,6 +51,14 @@ std::string Normal(const std::string& folder) {
     return normal;
 }
 
+// What holds when nothing is said: what was said before, or else what is usual.
+ServerConfig ConfigBefore() {
+    ServerConfig usual;
+    usual.port = IsSystem() ? kSystemPort : kUnprivilegedPort;
+    usual.user = IsSystem() ? kStorageUser : "";
+    return LoadServerConfig().value_or(usual);
+}
+
 int ConfigFrom(const SetupOptions& options, ServerConfig& config) {
     if (IsSystem() && geteuid() != 0) {
         return Complain(
@@ -62,12 +72,20 @@ int ConfigFrom(const SetupOptions& options, ServerConfig& config) {
     if (!IsPlainPath(config.program)) {
         return Complain("zel_server must be installed at a path without quotes, '%' or '\\'");
     }
-    const auto before = LoadServerConfig();
-    config.switched_off = before && before->switched_off;
-    config.port = options.port != 0 ? options.port : IsSystem() ? kSystemPort : kUnprivilegedPort;
-    config.address = options.address;
-    config.storage = Normal(options.storage);
-    config.encryption = !options.no_encryption;
+    if (!options.storage.empty()) {
+        config.storage = Normal(options.storage);
+    }
+    if (config.storage.empty()) {
+        Complain("a new server needs --storage FOLDER, the folder that receives the shares");
+        return kExitUsage;
+    }
+    if (options.port != 0) {
+        config.port = options.port;
+    }
+    if (!options.address.empty()) {
+        config.address = options.address == kEverywhere ? "" : options.address;
+    }
+    config.encryption = options.encryption.value_or(config.encryption);
     for (const std::string& volume : options.volumes) {
         const size_t equals = volume.find('=');
         const std::string name = volume.substr(0, equals);
@@ -75,11 +93,15 @@ int ConfigFrom(const SetupOptions& options, ServerConfig& config) {
             Complain("--volume takes NAME=FOLDER, not '" + programs::Printable(volume) + "'");
             return kExitUsage;
         }
-        config.volumes[name] = Normal(volume.substr(equals + 1));
+        if (equals + 1 == volume.size()) {
+            config.volumes.erase(name);
+        } else {
+            config.volumes[name] = Normal(volume.substr(equals + 1));
+        }
     }
     // A server in a folder of its own leaves the machine's users alone.
-    if (IsSystem()) {
-        config.user = options.user.empty() ? kStorageUser : options.user;
+    if (IsSystem() && !options.user.empty()) {
+        config.user = options.user;
     }
     return kExitOk;
 }
@@ -175,14 +197,14 @@ bool MakeFolders(std::string& failed) {
 }
 
 bool IsInMemory(const std::string& folder) {
-    constexpr long kMemoryTypes[] = {0x01021994, 0x858458f6};  // tmpfs, ramfs
+    constexpr uint32_t kTmpfs = 0x01021994;
+    constexpr uint32_t kRamfs = 0x858458f6;
     struct statfs info = {};
     if (statfs(folder.c_str(), &info) != 0) {
         return false;
     }
-    const auto type = static_cast<unsigned long>(info.f_type);
-    return type == static_cast<unsigned long>(kMemoryTypes[0]) ||
-           type == static_cast<unsigned long>(kMemoryTypes[1]);
+    const auto type = static_cast<uint32_t>(info.f_type);
+    return type == kTmpfs || type == kRamfs;
 }
 
 // What lies in a storage folder already and could be shares' copies.
@@ -268,9 +290,9 @@ std::string Where(const ServerConfig& config) {
     if (!config.address.empty()) {
         where += " of " + config.address;
     }
-    return ServedAddresses(config).size() == 1
-               ? where
-               : where + ", and on this machine itself for clients that come through ssh";
+    const std::vector<std::string> addresses = ServedAddresses(config);
+    return addresses.size() == 1 ? where
+                                 : where + ", and of " + addresses.back() + " for ssh clients";
 }
 
 // Without a manager that knows the unit, the admin starts the daemon.
@@ -286,10 +308,11 @@ int TellHowToStart(const Health& now, const ServerConfig& config) {
             "%ld first\n",
             static_cast<long>(*now.daemon));
     }
-    printf("To do:   no system manager that knows %s runs here; start the rsync daemon by hand:\n",
-           kUnit);
-    printf("         %szel_server serve        on %s, until it is ended\n", root.c_str(),
-           Where(config).c_str());
+    printf(
+        "To do:   no system manager that knows %s runs here; start the rsync daemon by hand:\n"
+        "             %szel_server serve\n"
+        "         It then listens on %s, until it is ended.\n",
+        kUnit, root.c_str(), Where(config).c_str());
     return kExitOk;
 }
 
@@ -308,15 +331,16 @@ int HaveDaemon(const ServerConfig& config) {
                         "' and 'zel_server status' say why");
     }
     const char* const done = as_configured ? "Running: " : runs ? "Restarted: " : "Started: ";
-    printf("%s%s, on %s%s\n", done, kUnit, Where(config).c_str(),
-           now.unit.enabled ? "" : "; it starts with the machine from now on");
+    printf("%s%s, on %s%s%s\n", done, kUnit, Where(config).c_str(),
+           now.unit.enabled ? "" : "; it starts with the machine from now on",
+           runs && !as_configured ? "; pushes that were under way are tried again" : "");
     return kExitOk;
 }
 
 }  // namespace
 
 int Setup(const SetupOptions& options) {
-    ServerConfig config;
+    ServerConfig config = ConfigBefore();
     int result = ConfigFrom(options, config);
     if (result == kExitOk) {
         result = LookAtEverything(config, AskUnit());

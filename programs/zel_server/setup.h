@@ -1,18 +1,20 @@
 // `zel_server setup`: from nothing to a server that runs.
 #pragma once
 
+#include <optional>
 #include <string>
 #include <vector>
 
 namespace zel_server {
 
+/// What is empty stays as it was, or is as usual at a new server.
 struct SetupOptions {
-    std::string storage;
-    std::vector<std::string> volumes;  // NAME=FOLDER
-    std::string address;
+    std::string storage;               ///< a new server needs it
+    std::vector<std::string> volumes;  ///< NAME=FOLDER; NAME= alone takes the volume out
+    std::string address;               ///< "all": everywhere
     std::string user;
-    int port = 0;  ///< 0: the usual one
-    bool no_encryption = false;
+    int port = 0;
+    std::optional<bool> encryption;
 };
 
 /// Looks whether everything can be had, writes the configuration, and sees to it that the rsync

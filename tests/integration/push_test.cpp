@@ -193,7 +193,7 @@ TEST_F(PushTest, StatusNamesWhatKeepsPushesOut) {
         EXPECT_NE(Push().exit_code, 0) << what;
     };
     Must(Server("disable"));
-    SetUpServer();  // leaves the switch as it is
+    Must(Server("setup"));  // leaves the switch, and all else, as it is
     expect("switched off", "zel_server enable");
     Must(Server("enable"));
     fs::rename(storage_, storage_ + ".away");
