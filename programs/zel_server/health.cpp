@@ -69,6 +69,7 @@ public:
 
     Health Run() {
         LookAtRegistry();
+        LookAtConfiguration();
         LookAtDaemon();
         LookAtAccounts();
         for (const std::string& folder : config_.Folders()) {
@@ -117,6 +118,17 @@ private:
         }
         shares_ = KnownShares().value_or(std::vector<std::string>());
         health_.shares = shares_.size();
+    }
+
+    // Without one of these the rsync daemon refuses everybody.
+    void LookAtConfiguration() {
+        for (const std::string& path : {RsyncdConfig(), ShareModules(), AdminModules()}) {
+            struct stat info = {};
+            if (stat(path.c_str(), &info) != 0 && errno == ENOENT) {
+                Found(path + ", which the rsync daemon reads, is not there",
+                      "zel_server setup, which makes it again");
+            }
+        }
     }
 
     // The unit's state, what listens, and whether that is what is configured.
@@ -262,11 +274,23 @@ private:
             return;
         }
         std::vector<std::string> copies;
+        std::vector<std::string> lost;
         for (const std::string& share : shares_) {
             ShareState state;
-            if (ReadShare(share, state) == ReadResult::kRead) {
-                copies.push_back(state.path);
+            struct stat info = {};
+            if (ReadShare(share, state) != ReadResult::kRead || state.path.empty()) {
+                continue;
             }
+            copies.push_back(state.path);
+            const std::string folder = state.path.substr(0, state.path.rfind('/'));
+            if (lstat(state.path.c_str(), &info) != 0 && errno == ENOENT &&
+                CheckStorage(folder) == StorageState::kReady) {
+                lost.push_back(share);
+            }
+        }
+        if (!lost.empty()) {
+            Found("there is no copy of " + Listed(lost) + " any more: is another disk mounted?",
+                  "nothing, if that is meant: the next push sends all of it", false);
         }
         const std::vector<std::string> foreign = ForeignFolders(config_, copies);
         if (!foreign.empty()) {

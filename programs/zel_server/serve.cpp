@@ -119,7 +119,8 @@ bool ServesAll(const ServerConfig& config, const std::vector<Listener>& listener
 int Serve() {
     const auto config = LoadServerConfig();
     if (!config) {
-        return Complain(kNotSetUp);
+        Complain(kNotSetUp);
+        return kExitUsage;  // starting it again does not help
     }
     const std::vector<std::string> addresses = ServedAddresses(*config);
     if (addresses.size() == 1) {

@@ -146,7 +146,7 @@ std::optional<std::vector<std::string>> SharesWithModule() {
             shares.push_back(name.stem());
         }
     }
-    if (error) {
+    if (error && error != std::errc::no_such_file_or_directory) {
         return std::nullopt;
     }
     std::sort(shares.begin(), shares.end());

@@ -215,6 +215,12 @@ TEST_F(PushTest, StatusNamesWhatKeepsPushesOut) {
     EXPECT_THAT(Server("account add alice --password-file -", "secret\n"),
                 Ended(0, "was there already"));
     ExpectNextPushCompletes();
+    fs::remove_all(storage_ + "/docs");
+    EXPECT_THAT(Server("status"), Ended(0, "no copy of 'docs' any more"));
+    fs::remove_all(folder_.Path("server/usr/tarq/etc/zel_server/admin.d"));
+    expect("admin.d, which the rsync daemon reads, is not there", "zel_server setup");
+    Must(Server("setup"));
+    ExpectNextPushCompletes();
 
     StopServer();
     expect("the rsync daemon is not running", "zel_server serve");
