@@ -4,6 +4,7 @@
 #include <sstream>
 
 #include "platform/internal/config.h"
+#include "platform/internal/section_check.h"
 #include "tarq/root_path.h"
 
 namespace TARQ {
@@ -27,6 +28,12 @@ std::string ReadConfig(Config* config) {
     tarq_internal::Section values;
     if (tarq_internal::ReadSection(path, kSection, &values) == tarq_internal::ReadResult::kFailed) {
         return "cannot read " + path;
+    }
+    const std::string stray =
+        tarq_internal::FindStray(tarq_internal::ReadTextFile(path).value_or(""), kSection,
+                                 {"port", "rsync", "ssh", "ssh_options"});
+    if (!stray.empty()) {
+        return path + ", " + stray;
     }
     const auto value = [&values](const char* key, const std::string& otherwise) {
         std::string text = tarq_internal::ValueOf(values, key);

@@ -1,6 +1,13 @@
 #include "programs/zel_daemon/daemon_config.h"
 
+#include <grp.h>
+
+#include <cerrno>
+#include <cstring>
+#include <set>
+
 #include "platform/internal/config.h"
+#include "platform/internal/section_check.h"
 #include "programs/common/text.h"
 #include "tarq/root_path.h"
 
@@ -9,62 +16,70 @@ namespace zel_daemon {
 namespace {
 
 constexpr char kPath[] = "/usr/tarq/etc/zel_daemon.conf";
+constexpr char kSection[] = "daemon";
 
-// Reads the numbers of the section; the first that does not pass is what `error` tells.
-class NumberReader {
+// Reads values of the section, which it knows to be no others than `keys`.
+class SectionReader {
 public:
-    NumberReader(const tarq_internal::Section& section, std::string& error)
-        : section_(section), error_(error) {}
+    SectionReader(const std::string& path, const std::set<std::string>& keys) : path_(path) {
+        if (tarq_internal::ReadSection(path, kSection, &section_) ==
+            tarq_internal::ReadResult::kFailed) {
+            throw ConfigError(path + " cannot be read: " + strerror(errno));
+        }
+        const std::string stray = tarq_internal::FindStray(
+            tarq_internal::ReadTextFile(path).value_or(""), kSection, keys);
+        if (!stray.empty()) {
+            throw ConfigError(path + ", " + stray);
+        }
+    }
 
     std::chrono::milliseconds Read(const char* key, std::chrono::milliseconds fallback,
-                                   uint64_t min, uint64_t max) {
+                                   uint64_t min, uint64_t max) const {
         return std::chrono::milliseconds(
             Read(key, static_cast<uint64_t>(fallback.count()), min, max));
     }
 
-    uint64_t Read(const char* key, uint64_t fallback, uint64_t min, uint64_t max) {
-        const std::string text = tarq_internal::ValueOf(section_, key);
+    uint64_t Read(const char* key, uint64_t fallback, uint64_t min, uint64_t max) const {
+        const std::string text = Text(key);
         if (text.empty()) {
             return fallback;
         }
         const auto number = programs::ParseNumber(text, max);
         if (!number || *number < min) {
-            if (error_.empty()) {
-                error_ = TARQ::RootPath(kPath) + ": " + key + " is '" + programs::Printable(text) +
-                         "', not a number from " + std::to_string(min) + " to " +
-                         std::to_string(max);
-            }
-            return fallback;
+            throw ConfigError(path_ + ": " + key + " is '" + programs::Printable(text) +
+                              "', not a number from " + std::to_string(min) + " to " +
+                              std::to_string(max));
         }
         return *number;
     }
 
+    std::string Text(const char* key) const { return tarq_internal::ValueOf(section_, key); }
+
 private:
-    const tarq_internal::Section& section_;
-    std::string& error_;
+    const std::string path_;
+    tarq_internal::Section section_;
 };
 
 }  // namespace
 
-DaemonConfig ReadDaemonConfig(std::string& error) {
-    error.clear();
+DaemonConfig ReadDaemonConfig() {
+    const std::string path = TARQ::RootPath(kPath);
+    const SectionReader file(path, {"workers", "gather_ms", "gather_max_ms", "retry_first_ms",
+                                    "retry_max_ms", "poll_seconds", "group"});
     DaemonConfig config;
-    tarq_internal::Section section;
-    if (tarq_internal::ReadSection(TARQ::RootPath(kPath), "daemon", &section) ==
-        tarq_internal::ReadResult::kFailed) {
-        error = TARQ::RootPath(kPath) + " cannot be read or is no section file";
-        return config;
-    }
-    NumberReader numbers(section, error);
-    config.workers = static_cast<unsigned int>(numbers.Read("workers", config.workers, 1, 32));
-    config.gather = numbers.Read("gather_ms", config.gather, 10, 600000);
-    config.gather_max = numbers.Read("gather_max_ms", config.gather_max, 10, 600000);
-    config.retry_first = numbers.Read("retry_first_ms", config.retry_first, 100, 86400000);
-    config.retry_max = numbers.Read("retry_max_ms", config.retry_max, 100, 86400000);
+    config.workers = static_cast<unsigned int>(file.Read("workers", config.workers, 1, 32));
+    config.gather = file.Read("gather_ms", config.gather, 10, 600000);
+    config.gather_max = file.Read("gather_max_ms", config.gather_max, 10, 600000);
+    config.retry_first = file.Read("retry_first_ms", config.retry_first, 100, 86400000);
+    config.retry_max = file.Read("retry_max_ms", config.retry_max, 100, 86400000);
     config.poll = std::chrono::seconds(
-        numbers.Read("poll_seconds", static_cast<uint64_t>(config.poll.count()), 1, 86400));
-    config.group = tarq_internal::ValueOf(section, "group");
-    return error.empty() ? config : DaemonConfig();
+        file.Read("poll_seconds", static_cast<uint64_t>(config.poll.count()), 1, 86400));
+    config.group = file.Text("group");
+    if (!config.group.empty() && getgrnam(config.group.c_str()) == nullptr) {
+        throw ConfigError(path + ": group is '" + programs::Printable(config.group) +
+                          "', which this machine has not");
+    }
+    return config;
 }
 
 }  // namespace zel_daemon

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <chrono>
+#include <stdexcept>
 #include <string>
 
 namespace zel_daemon {
@@ -17,8 +18,15 @@ struct DaemonConfig {
     std::string group;  ///< whose members may use the socket; empty: nobody's
 };
 
-/// Reads the file; keys that are missing have their defaults. A value that does not pass is told in
-/// `error` ("key: what is wrong with it"), which is empty otherwise, and the defaults come back.
-DaemonConfig ReadDaemonConfig(std::string& error);
+/// The file is not as it should be: what() says where, and what is wrong.
+class ConfigError : public std::runtime_error {
+public:
+    using std::runtime_error::runtime_error;
+};
+
+/// Reads the file; keys that are missing, and all of them without a file, have their defaults.
+/// Throws ConfigError for a value that does not pass, for a group that this machine does not know,
+/// and for a section or key that nobody would read.
+DaemonConfig ReadDaemonConfig();
 
 }  // namespace zel_daemon

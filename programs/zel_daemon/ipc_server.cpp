@@ -293,7 +293,7 @@ IpcServer::IpcServer(EventLoop& loop, const std::string& path, const std::string
     if (!group.empty()) {
         const struct group* entry = getgrnam(group.c_str());
         if (entry == nullptr) {
-            throw std::runtime_error("there is no group '" + group + "' (zel_daemon.conf)");
+            throw std::runtime_error("there is no group '" + group + "' any more");
         }
         group_ = entry->gr_gid;
         if (chown(path.c_str(), static_cast<uid_t>(-1), group_) != 0) {

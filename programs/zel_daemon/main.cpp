@@ -1,6 +1,7 @@
 // zel_daemon: keeps the tasks of a client, and runs each when it is due.
 #include <signal.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
@@ -10,6 +11,7 @@
 #include <optional>
 #include <thread>
 
+#include "ZEL/ipc.h"
 #include "ZEL/log.h"
 #include "base/unique_fd.h"
 #include "programs/common/help.h"
@@ -36,10 +38,12 @@ constexpr int kRotatedLogs = 5;
 constexpr std::chrono::seconds kLockPatience(2);
 constexpr std::chrono::milliseconds kLockStep(10);
 
-enum ExitCode : int { kEnded = 0, kFailed = 1, kUsage = 2 };
+/// kMendFirst: starting it again would not help, only a person can.
+enum ExitCode : int { kEnded = 0, kFailed = 1, kUsage = 2, kMendFirst = 3 };
 
 struct Options {
     bool foreground = false;
+    bool reload = false;
     std::string log = "syslog";
     int level = Logger::LEVEL_NOTE;
 };
@@ -86,13 +90,20 @@ void PrepareFolders() {
     }
 }
 
-DaemonConfig ReadConfigOrThrow() {
-    std::string error;
-    DaemonConfig config = ReadDaemonConfig(error);
-    if (!error.empty()) {
-        throw std::runtime_error(error);
+// Has the daemon that runs read its configuration again: empty, or why it does not.
+std::string AskToReload() {
+    const std::string path = TARQ::RootPath(kSocketPath);
+    ZEL::PObject request;
+    request["command"] = "reload";
+    ZEL::PObject reply;
+    ZEL::IPCSender sender;
+    if (sender.connect(path) != 0) {
+        return "no daemon answers at " + path + ": " + strerror(errno);
     }
-    return config;
+    if (sender.send(request, true, reply) != 0) {
+        return "the daemon does not answer at " + path;
+    }
+    return reply["error"].asString();
 }
 
 void Serve(const Options& options) {
@@ -103,7 +114,7 @@ void Serve(const Options& options) {
     StartLog(options);
     PrepareFolders();
     const base::UniqueFd lock = TakeLock();
-    const DaemonConfig config = ReadConfigOrThrow();
+    const DaemonConfig config = ReadDaemonConfig();
 
     EventLoop loop;
     loop.OnSignal(SIGTERM, [&] { loop.Stop(); });
@@ -119,9 +130,12 @@ void Serve(const Options& options) {
     });
     const auto reload = [&] {
         std::string error;
-        const DaemonConfig changed = ReadDaemonConfig(error);
-        if (error.empty()) {
-            service.SetConfig(changed);
+        try {
+            service.SetConfig(ReadDaemonConfig());
+            Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] zel_daemon(%d): configuration read again\n",
+                           __LINE__);
+        } catch (const ConfigError& wrong) {
+            error = std::string(wrong.what()) + "; the configuration stays as it was";
         }
         service.Refresh();
         return error;
@@ -160,6 +174,22 @@ void Serve(const Options& options) {
     server.reset();
 }
 
+// Whether standard error goes to the journal, as the system's log does.
+bool IsJournal() {
+    struct stat error = {};
+    const char* const stream = getenv("JOURNAL_STREAM");  // "device:inode"
+    return stream != nullptr && fstat(STDERR_FILENO, &error) == 0 &&
+           stream == std::to_string(error.st_dev) + ":" + std::to_string(error.st_ino);
+}
+
+// To the person who started it and to the log, but once where both are the same.
+void Say(const Options& options, const std::exception& error) {
+    if (options.log != "stderr" && !(options.log == "syslog" && IsJournal())) {
+        fprintf(stderr, "zel_daemon: %s\n", error.what());
+    }
+    Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__, error.what());
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -169,6 +199,8 @@ int main(int argc, char** argv) {
     app.set_version_flag("--version", ZEL_VERSION, "Show the version");
     Options options;
     app.add_flag("--foreground", options.foreground, "Stay in the foreground");
+    app.add_flag("--reload", options.reload,
+                 "Have the running daemon read its configuration again, and tell if it is wrong");
     app.add_option("--log", options.log, "syslog, stderr, or a file's path")
         ->option_text("WHERE")
         ->capture_default_str();
@@ -183,11 +215,20 @@ int main(int argc, char** argv) {
     if (ended >= 0) {
         return ended;
     }
+    if (options.reload) {
+        const std::string problem = AskToReload();
+        if (!problem.empty()) {
+            fprintf(stderr, "zel_daemon: %s\n", problem.c_str());
+        }
+        return problem.empty() ? kEnded : kFailed;
+    }
     try {
         Serve(options);
+    } catch (const ConfigError& error) {
+        Say(options, error);
+        return kMendFirst;
     } catch (const std::exception& error) {
-        fprintf(stderr, "zel_daemon: %s\n", error.what());
-        Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__, error.what());
+        Say(options, error);
         return kFailed;
     }
     return kEnded;

@@ -610,15 +610,35 @@ TEST_F(DaemonTest, OneDaemonAtATimeWithAConfigurationThatPasses) {
     EXPECT_THROW(second.Start(), std::runtime_error);
     EXPECT_THAT(second.Log(), HasSubstr("another zel_daemon runs already"));
     Settings("workers=\"7\"\n");
-    EXPECT_EQ(Result(Request("reload")), 0);
-    Settings("workers=\"many\"\n");
-    EXPECT_THAT(zel_.Ask("reload")["error"].asString(), HasSubstr("workers is 'many'"));
+    const std::string daemon = "TARQ_ROOT=" + folder_.Path("client") + " " ZEL_DAEMON;
+    test::Run(daemon + " --reload");
+    const std::pair<const char*, const char*> wrong[] = {
+        {"workers=\"many\"\n", "workers is 'many', not a number from 1 to 32"},
+        {"# workers\n\nworker=\"3\"\n", "line 8: key 'worker' is unknown, there are gather_max_ms"},
+        {"gather_ms=\"9\"\n", "line 6: key 'gather_ms' is there twice"},
+        {"[deamon]\nworkers=\"3\"\n", "line 6: section [deamon] is unknown"},
+        {"; workers\n", "line 6: '; workers' is neither a [section] nor a key"},
+        {"group=\"no such group\"\n", "group is 'no such group'"},
+    };
+    const auto refuse = [&](const std::string& how, int expected, const std::string& why) {
+        int status = 0;
+        const std::string said = test::Command(daemon + how).Finish(status);
+        EXPECT_THAT(said, AllOf(HasSubstr("/usr/tarq/etc/zel_daemon.conf"), HasSubstr(why)));
+        EXPECT_EQ(status, expected) << said;
+    };
+    for (const auto& [text, why] : wrong) {
+        Settings(text);
+        refuse(" --reload", 1, why);
+    }
     zel_.Signal(SIGHUP);
-    EXPECT_TRUE(Await([&] { return zel_.Log().find("workers is 'many'") != std::string::npos; }));
+    EXPECT_TRUE(Await([&] { return zel_.Log().find("'no such group'") != std::string::npos; }));
     EXPECT_EQ(zel_.Ask("daemon_status")["workers"].asInt32(), 7);
     EXPECT_EQ(zel_.End(SIGTERM), 0);
-    EXPECT_THROW(zel_.Start(), std::runtime_error);
-    EXPECT_THAT(zel_.Log(), HasSubstr("not a number from 1 to 32"));
+    refuse(" --foreground", 3, "'no such group'");  // systemd does not try this again
+    refuse("", 3, "'no such group'");
+    int status = 0;
+    EXPECT_THAT(test::Command(daemon + " --reload").Finish(status), HasSubstr("no daemon answers"));
+    EXPECT_EQ(status, 1);
 }
 
 }  // namespace
