@@ -220,9 +220,68 @@ TEST_F(StoreTest, AFileThatIsNoStoreOfThisProgramIsRefusedAndLeftAsItIs) {
                     AllOf(HasSubstr(path_ + ": cannot open"), HasSubstr(fault)));
         EXPECT_EQ(test::ReadFile(path_) == content, true) << fault;
     }
-    folder_.Write("daemon/tasks.db", "");  // where making it was cut off at the very start
+}
+
+TEST_F(StoreTest, AStoreThatWasLostIsNoFreshStart) {
+    const auto fault = [&] {
+        std::string told = "none";
+        try {
+            const Store store(path_);
+        } catch (const zel_daemon::DamagedStore& error) {
+            told = error.what();
+        }
+        return told;
+    };
+    store_->AddTask(Task("a"));
+    // As a daemon leaves it that is killed: what was added is in the log of changes alone.
+    for (const char* part : {"", "-wal"}) {
+        fs::copy_file(path_ + part, folder_.Path("copy") + part);
+    }
+    store_.reset();
+    const auto put_back = [&] {
+        for (const char* part : {"", "-wal"}) {
+            fs::copy_file(folder_.Path("copy") + part, path_ + part,
+                          fs::copy_options::overwrite_existing);
+        }
+    };
+    const std::pair<std::function<void()>, const char*> ways[] = {
+        {[&] { fs::resize_file(path_, 0); }, "it is empty"},
+        {[&] { fs::remove(path_); }, "it is gone, though it was there"},
+        {[&] {
+             fs::remove(path_);
+             fs::remove(path_ + "-wal");
+         },
+         "tasks.db.made tells"},
+        {[&] {
+             fs::remove(path_);
+             fs::remove(path_ + "-wal");
+             folder_.Write("daemon/tasks.db", "");
+             Database(path_).Execute("PRAGMA user_version = 1; PRAGMA user_version = 0");
+         },
+         "without anything in it"},
+    };
+    for (const auto& [lose, why] : ways) {
+        put_back();
+        lose();
+        EXPECT_THAT(fault(), AllOf(HasSubstr(why), HasSubstr("zel_daemon --new-store")));
+        EXPECT_THAT(fault(), HasSubstr(why)) << "the second time";
+        // What was put back is all there.
+        put_back();
+        Reopen();
+        EXPECT_EQ(store_->Tasks().size(), 1u) << why;
+        store_.reset();
+    }
+    // Unless a person wants it.
+    fs::resize_file(path_, 0);
+    const std::string aside = Store::Renew(path_);
+    EXPECT_TRUE(fs::exists(aside));
     Reopen();
     EXPECT_THAT(store_->Tasks(), IsEmpty());
+    // Where making the first one was cut off there was none.
+    store_.reset();
+    fs::remove_all(folder_.Path("daemon"));
+    folder_.Write("daemon/tasks.db.new", "half");
+    EXPECT_EQ(fault(), "none");
 }
 
 TEST_F(StoreTest, DamageFurtherInIsToldWhenItIsMet) {

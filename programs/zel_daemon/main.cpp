@@ -44,6 +44,7 @@ enum ExitCode : int { kEnded = 0, kFailed = 1, kUsage = 2, kMendFirst = 3 };
 struct Options {
     bool foreground = false;
     bool reload = false;
+    bool new_store = false;
     std::string log = "syslog";
     int level = Logger::LEVEL_NOTE;
 };
@@ -104,6 +105,15 @@ std::string AskToReload() {
         return "the daemon does not answer at " + path;
     }
     return reply["error"].asString();
+}
+
+void RenewStore() {
+    PrepareFolders();
+    const base::UniqueFd lock = TakeLock();
+    const std::string path = TARQ::RootPath(kStorePath);
+    const std::string aside = Store::Renew(path);
+    printf("%s is a new, empty store%s%s\n", path.c_str(),
+           aside.empty() ? "" : "; what was there is now ", aside.c_str());
 }
 
 void Serve(const Options& options) {
@@ -201,6 +211,10 @@ int main(int argc, char** argv) {
     app.add_flag("--foreground", options.foreground, "Stay in the foreground");
     app.add_flag("--reload", options.reload,
                  "Have the running daemon read its configuration again, and tell if it is wrong");
+    app.add_flag(
+        "--new-store", options.new_store,
+        "Begin with an empty store, when the one there was is lost, and end; what is there "
+        "is moved away");
     app.add_option("--log", options.log, "syslog, stderr, or a file's path")
         ->option_text("WHERE")
         ->capture_default_str();
@@ -223,8 +237,15 @@ int main(int argc, char** argv) {
         return problem.empty() ? kEnded : kFailed;
     }
     try {
-        Serve(options);
+        if (options.new_store) {
+            RenewStore();
+        } else {
+            Serve(options);
+        }
     } catch (const ConfigError& error) {
+        Say(options, error);
+        return kMendFirst;
+    } catch (const DamagedStore& error) {
         Say(options, error);
         return kMendFirst;
     } catch (const std::exception& error) {

@@ -54,7 +54,10 @@ void Database::Check(int code) const {
     if (handle_ == nullptr) {
         throw SqliteError(SQLITE_NOMEM, sqlite3_errstr(SQLITE_NOMEM));
     }
-    throw SqliteError(code, sqlite3_errmsg(Handle()));
+    const int primary = code & 0xff;
+    const bool is_systems = primary == SQLITE_CANTOPEN || primary == SQLITE_IOERR;
+    throw SqliteError(code, sqlite3_errmsg(Handle()),
+                      is_systems ? sqlite3_system_errno(Handle()) : 0);
 }
 
 Query::~Query() {

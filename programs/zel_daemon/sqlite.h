@@ -16,14 +16,19 @@ namespace zel_daemon {
 /// SQLite refused something; what() is its own text.
 class SqliteError : public std::runtime_error {
 public:
-    SqliteError(int code, const std::string& text) : std::runtime_error(text), code_(code) {}
+    SqliteError(int code, const std::string& text, int system_error = 0)
+        : std::runtime_error(text), code_(code), system_error_(system_error) {}
     /// The extended result code.
     int Code() const { return code_; }
     /// The kind of error that it belongs to.
     int PrimaryCode() const { return code_ & 0xff; }
 
+    /// What the system said when a file could not be opened or read, or 0.
+    int SystemError() const { return system_error_; }
+
 private:
     int code_;
+    int system_error_;
 };
 
 /// One open database file, which must be there already.

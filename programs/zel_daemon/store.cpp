@@ -1,14 +1,10 @@
 #include "programs/zel_daemon/store.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <algorithm>
 #include <cerrno>
 #include <system_error>
 
-#include "base/unique_fd.h"
+#include "programs/zel_daemon/shortage.h"
+#include "programs/zel_daemon/store_file.h"
 #include "programs/zel_daemon/store_schema.h"
 #include "programs/zel_daemon/stored_task.h"
 
@@ -16,54 +12,17 @@ namespace zel_daemon {
 
 namespace {
 
-using base::UniqueFd;
-
 constexpr char kStopped[] = "the daemon was stopped";
 
 constexpr char kRunColumns[] =
     "id, task, reason, start_time, end_time, result, status, error, files_sent, files_deleted, "
     "bytes_sent, rsync_runs";
 
-void ThrowErrno(const std::string& what) {
-    throw std::system_error(errno, std::generic_category(), what);
-}
-
-std::string FolderOf(const std::string& path) {
-    const size_t slash = path.rfind('/');
-    return slash == std::string::npos ? "." : path.substr(0, std::max<size_t>(slash, 1));
-}
-
-// An entry that was made in the folder survives a power cut from here on.
-void SyncFolder(const std::string& folder) {
-    const UniqueFd fd(open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!fd || fsync(fd.Get()) != 0) {
-        ThrowErrno(folder);
-    }
-}
-
-// The file and its folder, for the daemon alone: tasks have passwords. SQLite gives its own files
-// beside the file the file's mode.
-void MakePrivateFile(const std::string& path) {
-    const std::string folder = FolderOf(path);
-    if (mkdir(folder.c_str(), 0700) == 0) {
-        SyncFolder(FolderOf(folder));
-    } else if (errno != EEXIST) {
-        ThrowErrno(folder);
-    }
-    const UniqueFd fresh(open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
-    if (fresh) {
-        SyncFolder(folder);
-    } else if (errno != EEXIST) {
-        ThrowErrno(path);
-    }
-    struct stat info = {};
-    if (stat(path.c_str(), &info) != 0 ||
-        ((info.st_mode & 0077) != 0 && chmod(path.c_str(), 0600) != 0)) {
-        ThrowErrno(path);
-    }
-}
-
 constexpr char kMakeRoom[] = "the disk is full; make room on it";
+constexpr char kBeginAnew[] =
+    "stop the daemon and put back a copy, or begin with an empty store by 'zel_daemon "
+    "--new-store', "
+    "which moves away what is there";
 
 const char* Advice(const std::error_code& error) {
     return error == std::errc::no_space_on_device || error.value() == EDQUOT
@@ -71,7 +30,14 @@ const char* Advice(const std::error_code& error) {
                : "see that the daemon's user may write there";
 }
 
-const char* Advice(const SqliteError& error) {
+bool IsDamage(const SqliteError& error) {
+    return error.PrimaryCode() == SQLITE_CORRUPT || error.PrimaryCode() == SQLITE_NOTADB;
+}
+
+std::string Advice(const SqliteError& error) {
+    if (error.SystemError() == EMFILE || error.SystemError() == ENFILE) {
+        return ReasonOf(error.SystemError());
+    }
     switch (error.Code()) {
         case SQLITE_CONSTRAINT_UNIQUE:
             return "the name is taken; choose another one";
@@ -83,9 +49,7 @@ const char* Advice(const SqliteError& error) {
     switch (error.PrimaryCode()) {
         case SQLITE_CORRUPT:
         case SQLITE_NOTADB:
-            return "the file is damaged and is left as it is; stop the daemon, move the file and "
-                   "those beside it that begin with its name away, and put back a copy or add the "
-                   "tasks anew";
+            return std::string("the file is damaged and is left as it is; ") + kBeginAnew;
         case SQLITE_FULL:
             return kMakeRoom;
         case SQLITE_READONLY:
@@ -136,20 +100,23 @@ struct Store::Impl {
     // Does `work`, and words every failure: the file, what failed, why, and what to do.
     template <typename Work>
     auto Do(const std::string& what, Work work) const {
-        const auto fail = [&](const std::string& why) {
-            return StoreError(path + ": cannot " + what + ": " + why);
-        };
+        const std::string failed = path + ": cannot " + what + ": ";
         try {
             return work();
         } catch (const SqliteError& error) {
-            throw fail(error.what() + std::string("; ") + Advice(error));
+            const std::string why = failed + error.what() + "; " + Advice(error);
+            IsDamage(error) ? throw DamagedStore(why) : throw StoreError(why);
         } catch (const SchemaError& error) {
-            throw fail(error.what());
+            throw DamagedStore(failed + error.what());
+        } catch (const LostError& error) {
+            throw DamagedStore(failed + error.what() + "; " + kBeginAnew);
         } catch (const RowError& error) {
-            throw fail(error.what() + std::string("; mend it, or remove the row, in the sqlite3 "
-                                                  "shell while the daemon is stopped"));
+            throw DamagedStore(
+                failed + error.what() +
+                "; mend it, or remove the row, in the sqlite3 shell while the daemon "
+                "is stopped");
         } catch (const std::system_error& error) {
-            throw fail(error.what() + std::string("; ") + Advice(error.code()));
+            throw StoreError(failed + error.what() + "; " + Advice(error.code()));
         }
     }
 
@@ -183,8 +150,11 @@ struct Store::Impl {
 
 Store::Store(const std::string& path) : impl_(std::make_unique<Impl>(path)) {
     impl_->Do("open the store", [&] {
-        MakePrivateFile(path);
+        PrepareStoreFile(path);
         Database& database = impl_->database.emplace(path);
+        if (IsBlank(database)) {
+            throw LostError("it is a database without anything in it");
+        }
         if (database.IsReadOnly()) {
             throw SqliteError(SQLITE_READONLY, sqlite3_errstr(SQLITE_READONLY));
         }
@@ -193,6 +163,7 @@ Store::Store(const std::string& path) : impl_(std::make_unique<Impl>(path)) {
         database.Execute(
             "PRAGMA journal_mode = WAL; PRAGMA synchronous = FULL; PRAGMA foreign_keys = ON; "
             "PRAGMA cell_size_check = ON");
+        MarkStoreFile(path);
     });
     // When a run was cut off nobody knows: its start is what is sure. No time at all would make it
     // run for ever.
@@ -207,6 +178,12 @@ Store::Store(const std::string& path) : impl_(std::make_unique<Impl>(path)) {
 }
 
 Store::~Store() = default;
+
+std::string Store::Renew(const std::string& path) {
+    std::string aside = Impl(path).Do("begin anew", [&] { return PutStoreAside(path); });
+    const Store fresh(path);
+    return aside;
+}
 
 std::vector<TaskRecord> Store::Tasks() {
     return impl_->Do("read the tasks", [&] {

@@ -20,18 +20,28 @@ public:
     using std::runtime_error::runtime_error;
 };
 
+/// Only a person can mend it: the file is damaged, lost, or not this program's.
+class DamagedStore : public StoreError {
+public:
+    using StoreError::StoreError;
+};
+
 /// Threads: one thread. Every operation may throw StoreError; nothing has changed then.
 class Store {
 public:
     /// Runs kept of each task; the oldest are dropped when new ones begin.
     static constexpr int kRunsKept = 200;
 
-    /// Opens the file, making it (and its folder, 0700) when it is not there. One with an older
-    /// layout is brought up to date; one with a newer layout, and a database that is no store, are
-    /// refused and left as they are. Runs that had not ended when the file was last used are marked
-    /// as failed ("the daemon was stopped"), with their start as their end, and their events wait
-    /// again.
+    /// Opens the file, making it (and its folder, 0700) when there never was one. One that is empty
+    /// or gone since is refused: a fresh start is for a person to want, see Renew(). One with an
+    /// older layout is brought up to date; one with a newer layout, and a database that is no
+    /// store, are refused and left as they are. Runs that had not ended when the file was last used
+    /// are marked as failed ("the daemon was stopped"), with their start as their end, and their
+    /// events wait again.
     explicit Store(const std::string& path);
+    /// Puts what is there aside and makes a new, empty store. The name that the old one has now,
+    /// empty when there was none. REQUIRES that no daemon uses it. Throws StoreError.
+    static std::string Renew(const std::string& path);
     ~Store();
     Store(const Store&) = delete;
     Store& operator=(const Store&) = delete;

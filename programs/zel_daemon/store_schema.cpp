@@ -74,12 +74,16 @@ const SchemaSteps& StoreSchema() {
     return steps;
 }
 
+bool IsBlank(Database& database) {
+    return database.Number("PRAGMA application_id") == 0 &&
+           database.Number("PRAGMA user_version") == 0 &&
+           database.Number("SELECT count(*) FROM sqlite_schema") == 0;
+}
+
 void BringUpToDate(Database& database, const SchemaSteps& steps) {
     const int64_t application = database.Number("PRAGMA application_id");
     const int64_t version = database.Number("PRAGMA user_version");
-    const bool empty = application == 0 && version == 0 &&
-                       database.Number("SELECT count(*) FROM sqlite_schema") == 0;
-    if (!empty && application != kApplicationId) {
+    if (application != kApplicationId && !IsBlank(database)) {
         throw SchemaError("it is a database of another program; name another file");
     }
     const auto known = static_cast<int64_t>(steps.size());

@@ -21,6 +21,9 @@ using SchemaSteps = std::vector<const char*>;
 /// The steps of the store.
 const SchemaSteps& StoreSchema();
 
+/// Whether nobody has put anything into the database yet.
+bool IsBlank(Database& database);
+
 /// Takes the steps that the file lacks, each in a transaction of its own. Throws SchemaError,
 /// before anything has changed, for a database that is no store and for a store that has more steps
 /// behind it than there are.
