@@ -13,7 +13,6 @@
 #include <thread>
 
 #include "ZEL/is_syncedshare.h"
-#include "ZEL/zel.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/accounts.h"
 #include "programs/zel_server/complaint.h"
@@ -322,6 +321,10 @@ int HaveDaemon(const ServerConfig& config) {
         return TellHowToStart(now, config);
     }
     const bool runs = now.unit.active == "active";
+    if (!runs && now.daemon) {
+        return Complain("an rsync daemon of this server was started by hand: end process " +
+                        std::to_string(*now.daemon) + ", then run 'zel_server setup' again");
+    }
     const bool as_configured = runs && now.listens && !now.configuration_newer;
     if (!now.unit.enabled && !EnableUnit()) {
         return Complain(std::string("cannot enable the unit ") + kUnit);
@@ -348,7 +351,7 @@ int Setup(const SetupOptions& options) {
     if (result != kExitOk) {
         return result;
     }
-    const bool is_new = !ZEL::IsPathExist(ConfigFile());
+    const bool is_new = !LoadServerConfig();
     std::string failed;
     if (!HaveStorageUser(config.user)) {
         return Complain("cannot make the system user '" + config.user + "' that owns the copies");

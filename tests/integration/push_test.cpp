@@ -232,6 +232,17 @@ TEST_F(PushTest, StatusNamesWhatKeepsPushesOut) {
                        std::to_string(port_)),
                 Ended(1, "held by python3, process "));
     EXPECT_FALSE(fs::exists(folder_.Path("new")));
+    // A set-up that could not be finished is begun anew.
+    other.Stop();
+    StopServer();
+    const auto fresh = [&](const std::string& more) {
+        return test::RunProgram(folder_.Path("fresh"),
+                                {"sh", "-c",
+                                 "exec " ZEL_SERVER " setup --storage " + folder_.Path("new") +
+                                     " --port " + std::to_string(port_) + more});
+    };
+    EXPECT_THAT(fresh(" --volume v=/proc/none"), Ended(1, "cannot make the storage folder"));
+    EXPECT_THAT(fresh(""), Ended(0, "zel_server serve"));
 }
 
 TEST_F(PushTest, ARegistryThatWasCutIsMendedByTheCommandThatStatusNames) {
