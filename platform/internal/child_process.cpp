@@ -370,6 +370,9 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
     if (result.start_error != 0) {
         return result;
     }
+    if (setup.on_start) {
+        setup.on_start(group->Leader());
+    }
 
     std::optional<Clock::time_point> next_step;  // the next question, or the end of the grace
     if (cancelled) {

@@ -19,6 +19,7 @@ struct ChildSetup {
     std::vector<std::string> environment;  ///< NAME=value
     std::string input;            ///< all of its standard input; at most kMaxChildInput bytes
     uint64_t max_file_bytes = 0;  ///< no file that it writes may grow longer; 0: no limit
+    std::function<void(pid_t)> on_start;  ///< told once the program runs; may be empty
 };
 
 /// What a pipe takes without anybody reading.

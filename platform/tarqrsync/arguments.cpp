@@ -18,8 +18,10 @@ constexpr char kDefaultPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/b
 // Seconds that a connection may take to come up: a server that has not answered by then is not
 // there, however patient the caller is with a slow copy.
 constexpr int kConnectTimeout = 60;
-// Seconds after which ssh asks a silent server whether it is still there.
-constexpr int kSshAliveInterval = 15;
+// Seconds after which ssh asks a silent server whether it is still there, and how often before it
+// gives up. A slow line that is full may take a while to carry the answer.
+constexpr int kSshAliveInterval = 30;
+constexpr int kSshAliveCount = 4;
 
 // Where the receiver keeps what it has of a file when a run breaks off. The name is reserved: rsync
 // copies no folder of that name.
@@ -66,10 +68,6 @@ std::string DoubledPercent(const std::string& text) {
     return result;
 }
 
-int ConnectTimeout(const Settings& settings) {
-    return settings.timeout > 0 ? std::min(settings.timeout, kConnectTimeout) : kConnectTimeout;
-}
-
 // The ssh command line up to the host. The configured words come first, as the first value that ssh
 // meets is the one that holds.
 Words SshWords(const InvocationContext& context) {
@@ -90,6 +88,7 @@ Words SshWords(const InvocationContext& context) {
              std::string("NumberOfPasswordPrompts=1"),
              "ConnectTimeout=" + std::to_string(ConnectTimeout(settings)),
              "ServerAliveInterval=" + std::to_string(kSshAliveInterval),
+             "ServerAliveCountMax=" + std::to_string(kSshAliveCount),
              std::string("ForwardX11=no"),
              std::string("ForwardAgent=no"),
              std::string("ControlPath=none"),
@@ -137,6 +136,8 @@ std::string AddTransport(const InvocationContext& context, PrivateFolder* folder
     if (settings.timeout > 0) {
         arguments->push_back("--timeout=" + std::to_string(settings.timeout));
     }
+    // A server's greeting is not mixed with what rsync itself says.
+    arguments->push_back("--no-motd");
     if (transport != Transport::DAEMON) {
         AddAskpass(settings.password, folder, invocation);
     }
@@ -196,10 +197,12 @@ void AddRules(const Settings& settings, PrivateFolder* folder, Words* arguments)
 }
 
 void AddReporting(const RunOptions& options, Words* arguments) {
+    // rsync says when the log-in is over and it turns to the files, and how many there are before
+    // any is sent.
+    arguments->push_back("--info=flist2");
     if (options.on_progress) {
-        // How many files there are is told before any is sent, and then each as it is checked, the
-        // ones that are in step as well (-ii).
-        Append(arguments, {"--info=progress2,flist2", "--outbuf=N", "-ii"});
+        // Each file is told as it is checked, the ones that are in step as well (-ii).
+        Append(arguments, {"--info=progress2", "--outbuf=N", "-ii"});
     }
     if (options.on_change || options.on_progress) {
         arguments->push_back("--out-format=" + std::string(kChangeMark) + "%i %l %n");
@@ -275,6 +278,10 @@ std::string PathAtServer(const Settings& settings) {
 }
 
 }  // namespace
+
+int ConnectTimeout(const Settings& settings) {
+    return settings.timeout > 0 ? std::min(settings.timeout, kConnectTimeout) : kConnectTimeout;
+}
 
 Invocation CopyInvocation(const InvocationContext& context, PrivateFolder* folder) {
     const Settings& settings = context.settings;

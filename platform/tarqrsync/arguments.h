@@ -31,6 +31,9 @@ struct InvocationContext {
     std::string log_file;  ///< empty: none
 };
 
+/// Seconds that a connection may take to come up.
+int ConnectTimeout(const Settings& settings);
+
 /// A copy, or a listing, of files. Long lists of rules and what ssh needs to log in go to files in
 /// `folder`. Throws PrivateFileError.
 Invocation CopyInvocation(const InvocationContext& context, PrivateFolder* folder);

@@ -15,10 +15,12 @@ namespace {
 constexpr char kConfigPath[] = "/usr/tarq/etc/tarqrsync.conf";
 constexpr char kSection[] = "rsync";
 
-bool ParsePort(const std::string& text, int* port) {
+constexpr int kMaxSeconds = 86400;
+
+bool ParseUpTo(int max, const std::string& text, int* number) {
     const char* end = text.data() + text.size();
-    const auto [rest, error] = std::from_chars(text.data(), end, *port);
-    return error == std::errc() && rest == end && *port >= 1 && *port <= kMaxPort;
+    const auto [rest, error] = std::from_chars(text.data(), end, *number);
+    return error == std::errc() && rest == end && *number >= 1 && *number <= max;
 }
 
 }  // namespace
@@ -45,9 +47,19 @@ std::string ReadConfig(Config* config) {
     for (std::string word; words >> word;) {
         config->ssh_options.push_back(word);
     }
-    const std::string port = value("port", std::to_string(config->daemon_port));
-    if (!ParsePort(port, &config->daemon_port)) {
-        return path + ": port '" + port + "' is not between 1 and 65535";
+    const struct {
+        const char* key;
+        int max;
+        int* number;
+    } numbers[] = {{"port", kMaxPort, &config->daemon_port},
+                   {"answer_seconds", kMaxSeconds, &config->answer_seconds},
+                   {"dead_seconds", kMaxSeconds, &config->dead_seconds}};
+    for (const auto& [key, max, number] : numbers) {
+        const std::string text = value(key, std::to_string(*number));
+        if (!ParseUpTo(max, text, number)) {
+            return path + ": " + key + " '" + text + "' is not between 1 and " +
+                   std::to_string(max);
+        }
     }
     return "";
 }

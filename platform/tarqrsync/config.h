@@ -14,6 +14,8 @@ struct Config {
     std::string rsync = "rsync";
     std::string ssh = "ssh";
     std::vector<std::string> ssh_options;
+    int answer_seconds = 60;  ///< for the log-in of a copy, and for a command
+    int dead_seconds = 120;   ///< without any answer, after which a connection is given up
 };
 
 /// Reads the file, if there is one. Empty, or what is wrong with it, for a person.

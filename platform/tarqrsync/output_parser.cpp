@@ -106,6 +106,15 @@ constexpr std::array<Figure, 6> kFigures = {{
     {"Total bytes received: ", &RunReport::bytes_received},
 }};
 
+// What rsync says when it turns to the files: one if it looks for all of them first, and then the
+// line ends much later, the other if it does so as it goes.
+bool SaysBegun(std::string_view line) {
+    constexpr std::string_view kFindingFirst = "building file list";
+    constexpr std::string_view kFindingAsItGoes = "sending incremental file list";
+    return line.substr(0, kFindingFirst.size()) == kFindingFirst ||
+           line.substr(0, kFindingAsItGoes.size()) == kFindingAsItGoes;
+}
+
 bool IsOctal(char c) {
     return c >= '0' && c <= '7';
 }
@@ -126,6 +135,7 @@ void OutputParser::Feed(std::string_view bytes) {
         } else if (!line_dropped_) {
             line_ += piece;
         }
+        begun_ = begun_ || SaysBegun(line_);
         if (end == std::string_view::npos) {
             return;
         }

@@ -22,6 +22,8 @@ public:
     void Feed(std::string_view bytes);
     /// Hands on the progress of now, with its time without movement, when it is time to.
     void Tick(unsigned int seconds_still);
+    /// Whether rsync has said that the copy goes on: the far end has let it in.
+    bool Begun() const { return begun_; }
     /// The output has ended: a last line without a newline counts, progress that was held back is
     /// handed on.
     void Finish();
@@ -48,6 +50,7 @@ private:
     std::string line_;           // the start of a line whose end has not come
     bool line_dropped_ = false;  // that line is too long to mean anything
 
+    bool begun_ = false;
     RunProgress progress_;
     unsigned int percent_of_bytes_ = 0;  // as rsync gives it
     uint64_t bytes_before_file_ = 0;

@@ -12,7 +12,6 @@
 #include <array>
 #include <cerrno>
 #include <charconv>
-#include <chrono>
 #include <cstring>
 
 #include "base/unique_fd.h"
@@ -27,7 +26,6 @@ namespace Backup {
 
 namespace {
 
-using std::chrono::steady_clock;
 using tarq_internal::ChildResult;
 using tarq_internal::ChildSetup;
 
@@ -132,6 +130,12 @@ bool IsInTimedSleep(pid_t pid) {
     }
 #endif
     return number == SYS_clock_nanosleep || number == SYS_nanosleep;
+}
+
+std::string SecondsText(int seconds) {
+    return seconds == 60    ? "a minute"
+           : seconds == 120 ? "two minutes"
+                            : std::to_string(seconds) + " seconds";
 }
 
 // rsync receives in a child, which renames the answer into place once it has checked it. When then
@@ -285,21 +289,22 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     }
 
     MessageKeeper keeper;
-    auto last_moved = steady_clock::now();
+    RunWatch watch(PatienceOfRun());
+    RunWatch::Fault fault = RunWatch::Fault::NONE;
+    setup.on_start = [&](pid_t rsync) { watch.Started(rsync); };
     const ChildResult result = tarq_internal::RunChild(
         setup,
         [&] {
-            const auto still = steady_clock::now() - last_moved;
-            parser->Tick(static_cast<unsigned int>(
-                std::chrono::duration_cast<std::chrono::seconds>(still).count()));
-            return cancelled && cancelled();
+            fault = watch.Look(parser->Begun());
+            parser->Tick(watch.SecondsStill());
+            return fault != RunWatch::Fault::NONE || (cancelled && cancelled());
         },
         [&](const char* bytes, size_t size) {
-            last_moved = steady_clock::now();
+            watch.Spoke();
             parser->Feed({bytes, size});
         },
         [&](const char* bytes, size_t size) {
-            last_moved = steady_clock::now();
+            watch.Spoke();
             keeper.Feed({bytes, size});
         },
         limits.early_end);
@@ -307,6 +312,9 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     if (result.start_error != 0) {
         return Fail(STATUS_RSYNC_MISSING, "the program " + setup.program + " cannot be started: " +
                                               strerror(result.start_error));
+    }
+    if (fault != RunWatch::Fault::NONE) {
+        return FailByWatch(fault);
     }
     if (result.cancelled) {
         return Fail(STATUS_CANCELLED, "the run was cancelled");
@@ -336,6 +344,35 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     const Verdict verdict = Judge(Facts(exit_code));
     outcome_.cause = verdict.cause;
     return Fail(verdict.status, verdict.first_line);
+}
+
+Patience Run::PatienceOfRun() const {
+    using std::chrono::seconds;
+    // A listing says nothing before all of it is there.
+    const bool begins = settings_.is_command || !settings_.list_only;
+    return {seconds(ConnectTimeout(settings_)), seconds(begins ? config_.answer_seconds : 0),
+            seconds(config_.dead_seconds)};
+}
+
+int Run::FailByWatch(RunWatch::Fault fault) {
+    const std::string& host = settings_.host;
+    const std::string patience = SecondsText(config_.answer_seconds);
+    switch (fault) {
+        case RunWatch::Fault::SILENT:
+            return Fail(STATUS_TIMEOUT, host + " accepted the connection and said nothing for " +
+                                            patience + ": is an rsync daemon what listens there?");
+        case RunWatch::Fault::DEAD:
+            return Fail(STATUS_TIMEOUT, "the connection to " + host +
+                                            " is dead: nothing that was sent has been answered "
+                                            "for " +
+                                            SecondsText(config_.dead_seconds));
+        default:
+            return Fail(STATUS_TIMEOUT,
+                        host +
+                            (settings_.is_command ? " did not answer the command within "
+                                                  : " did not let the copy begin within ") +
+                            patience);
+    }
 }
 
 int Run::Fail(int status, const std::string& first_line) {

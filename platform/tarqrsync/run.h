@@ -10,6 +10,7 @@
 #include "platform/tarqrsync/explain.h"
 #include "platform/tarqrsync/output_parser.h"
 #include "platform/tarqrsync/private_folder.h"
+#include "platform/tarqrsync/run_watch.h"
 #include "platform/tarqrsync/settings.h"
 #include "tarq/rsync_wrapper.h"
 
@@ -36,6 +37,9 @@ private:
         uint64_t max_file_bytes = 0;
         tarq_internal::EarlyEnd early_end;
     };
+
+    Patience PatienceOfRun() const;
+    int FailByWatch(RunWatch::Fault fault);
 
     int Attempt(const std::function<bool()>& cancelled);
     int RunCommand(const std::function<bool()>& cancelled);

@@ -1,7 +1,10 @@
 #include "tarq/rsync_wrapper.h"
 
+#include <arpa/inet.h>
 #include <dirent.h>
+#include <sys/socket.h>
 
+#include "base/unique_fd.h"
 #include "tests/integration/servers.h"
 #include "tests/support/syslog_capture.h"
 #include "tests/support/testing.h"
@@ -212,6 +215,61 @@ TEST_F(RsyncWrapperTest, FailuresHaveTheirStatusAndSayInPlainWordsWhatIsWrong) {
                   Has(report_.details, "Unknown module"));
     }
     EXPECT_THAT(Tree(module_), IsEmpty());
+}
+
+TEST_F(RsyncWrapperTest, AServerThatSaysNothingIsGivenUpAndASlowCopyIsNot) {
+    const base::UniqueFd silent(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    const int port = test::FreePort();
+    sockaddr_in address = {};
+    address.sin_family = AF_INET;
+    address.sin_port = htons(static_cast<uint16_t>(port));
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    ASSERT_EQ(bind(silent.Get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    ASSERT_EQ(listen(silent.Get(), 1), 0);
+    Configure("answer_seconds=\"2\"\ndead_seconds=\"2\"\n");
+    AddToSource("file", std::string(4000000, 'x'));
+    const auto begin = std::chrono::steady_clock::now();
+    const auto to_silent = [=](RsyncWrapper& w) { w.setPort(port); };
+    EXPECT_EQ(Copy(to_silent), STATUS_TIMEOUT);
+    EXPECT_THAT(report_.explanation, HasSubstr("said nothing for 2 seconds"));
+    ServeCommands("cat > /dev/null; sleep 20");
+    EXPECT_EQ(Command({"command=\"X\""}), STATUS_TIMEOUT);
+    EXPECT_THAT(report_.explanation, HasSubstr("did not answer the command"));
+    EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(10));
+
+    RunOptions slow;
+    slow.bandwidth_limit = 800;
+    EXPECT_EQ(Copy({}, slow), 0) << report_.explanation;
+}
+
+TEST_F(RsyncWrapperTest, ProgressOfAnUpdateIsOfFilesAndOfAFirstCopyIsOfBytes) {
+    for (int i = 0; i < 50; ++i) {
+        AddToSource("in_step/" + std::to_string(i), "x");
+    }
+    chmod(module_.c_str(), 0700);
+    std::vector<RunProgress> seen;
+    RunOptions options;
+    options.bandwidth_limit = 2000;
+    options.on_progress = [&](const RunProgress& progress) { seen.push_back(progress); };
+    for (const auto basis : {RunProgress::BYTES, RunProgress::FILES}) {
+        for (const char* large : {"in_step/large", "large"}) {
+            AddToSource(large, std::string(1000000 + basis, 'x'));
+        }
+        seen.clear();
+        EXPECT_EQ(Copy({}, options), 0);
+        EXPECT_EQ(seen.back().percent, 100U);
+        EXPECT_EQ(seen.back().files_checked, 54U);
+        unsigned int largest = 0;
+        for (const RunProgress& progress : seen) {
+            largest = std::max(largest, progress.percent);
+            EXPECT_TRUE(progress.percent < 100 || progress.bytes_done >= 2000000);
+            EXPECT_TRUE(progress.bytes_done == 0 || progress.percent_of == basis);
+            EXPECT_LE(progress.file_bytes, progress.file_length);
+        }
+        EXPECT_TRUE(std::any_of(seen.begin(), seen.end(), [](const RunProgress& progress) {
+            return progress.file == "in_step/large" && progress.file_length >= 1000000;
+        }));
+    }
 }
 
 TEST_F(RsyncWrapperTest, ARunShowsItsPasswordNowhereAndEndsWithinASecondOfItsCancel) {

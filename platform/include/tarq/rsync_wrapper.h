@@ -107,7 +107,8 @@ enum WrapperStatus : int {
     STATUS_SOCKET = 10,  ///< rsync's own: the server cannot be reached
     STATUS_PROTOCOL_STREAM = 12,  ///< rsync's own: the connection broke
     STATUS_CANCELLED = 20,  ///< rsync's own: ended by a signal, which is how a cancelled run ends
-    STATUS_TIMEOUT = 30,    ///< rsync's own: nothing moved for the time-out
+    STATUS_TIMEOUT = 30,    ///< rsync's own: nothing moved for the time-out; or a server that does
+                            ///< not answer, or a connection that is dead
     STATUS_UNKNOWN_COMMAND = 43,  ///< the server does not know the command, or no commands at all
     STATUS_COMMAND_TOO_LONG =
         50,                     ///< the command has more bytes than rsync carries; nothing was sent
@@ -124,8 +125,10 @@ constexpr size_t kMaxCommandBytes = size_t{5} * 1024;
 /// One rsync run.
 ///
 /// Configuration: /usr/tarq/etc/tarqrsync.conf, section "rsync", may name `port` (the daemon's,
-/// default 873), `rsync` and `ssh` (the programs) and `ssh_options` (words, put in front of the
-/// host). Read at each execute().
+/// default 873), `rsync` and `ssh` (the programs), `ssh_options` (words, put in front of the
+/// host), `answer_seconds` (default 60: how long a server may take for the log-in of a copy, or for
+/// a command) and `dead_seconds` (default 120: how long a connection may go without any answer).
+/// Read at each execute().
 ///
 /// Passwords reach rsync on its standard input and ssh through an askpass helper: never in an
 /// argument list, in an environment or in a log. Host keys are kept in
