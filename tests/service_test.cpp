@@ -22,12 +22,25 @@ struct Copies {
     std::atomic<bool> hold{false};  // they last until this is false
     std::atomic<int> status{0};
     std::mutex mutex;
+    std::map<std::string, std::pair<int, TARQ::Backup::RunCause>> bad;  // by module or source's end
+    std::vector<std::string> sources;                                   // what was copied, in order
     std::map<std::string, int> running;  // by module, under the mutex as what follows
     std::atomic<int> at_a_time{0};
     int most_at_a_time = 0;
     bool share_shared = false;  // one share was copied twice at the same time
 
-    int Copy(const std::string& module, const std::function<bool()>& cancelled) {
+    int Copy(const std::string& module, const std::string& source, TARQ::Backup::RunReport& report,
+             const std::function<bool()>& cancelled) {
+        {
+            const std::lock_guard<std::mutex> lock(mutex);
+            sources.push_back(source);
+            for (const auto& [what, fault] : bad) {
+                if (module == what || source.find(what) != std::string::npos) {
+                    report.cause = fault.second;
+                    return fault.first;
+                }
+            }
+        }
         Count(module, 1);
         bool ended = false;
         while (hold && !ended) {
@@ -56,6 +69,7 @@ namespace Backup {
 
 struct RsyncWrapper::Impl {
     std::string module;
+    std::string source;
     std::list<std::string> command;
 };
 
@@ -90,7 +104,9 @@ void RsyncWrapper::setTarqAuth(bool, bool) {}
 void RsyncWrapper::setPort(int) {}
 void RsyncWrapper::setTimeout(int) {}
 void RsyncWrapper::setExcludeRule(const std::list<std::string>&) {}
-void RsyncWrapper::setSrcPath(const std::string&) {}
+void RsyncWrapper::setSrcPath(const std::string& path) {
+    impl_->source = path;
+}
 void RsyncWrapper::logError() {}
 void RsyncWrapper::setTarqCustCmdRule(const std::list<std::string>& lines) {
     impl_->command = lines;
@@ -101,7 +117,7 @@ void RsyncWrapper::setDestPath(const std::string&, const std::string&, const std
 }
 int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
     if (impl_->command.empty()) {
-        return report->status = copies->Copy(impl_->module, cancelled);
+        return report->status = copies->Copy(impl_->module, impl_->source, *report, cancelled);
     }
     for (const std::string& line : impl_->command) {
         if (line.rfind("outfile=", 0) == 0) {
@@ -372,6 +388,92 @@ TEST_F(ServiceTest, NoShareIsCopiedTwiceAtATimeAndNoMoreTasksRunThanWorkers) {
     }
     EXPECT_EQ(copies_.most_at_a_time, 2);
     EXPECT_FALSE(copies_.share_shared);
+}
+
+TEST_F(ServiceTest, OnlyWhatFailedWaitsForItsNextTry) {
+    using TARQ::Backup::RunCause;
+    // What was copied since the last call, without the folder that the shares are in.
+    const auto copied = [&] {
+        const std::lock_guard<std::mutex> lock(copies_.mutex);
+        std::vector<std::string> names;
+        for (const std::string& source : std::exchange(copies_.sources, {})) {
+            names.push_back(source.substr(root_.Path("shares/").size()));
+        }
+        return names;
+    };
+    const auto set_bad = [&](const std::string& what, int status, RunCause cause) {
+        const std::lock_guard<std::mutex> lock(copies_.mutex);
+        copies_.bad = {{what, {status, cause}}};
+    };
+    const auto change = [&](const std::string& name) {
+        root_.Write("shares/" + name, std::to_string(clock_.elapsed));
+        Settle();
+        Pass(1);
+    };
+    for (const std::string share : {"a", "b"}) {
+        root_.Write("shares/" + share + "/deep/x", "x");
+        root_.Write("shares/" + share + "/low/x", "x");
+    }
+    // A share that fails as a whole: all of it waits, and nothing else.
+    set_bad("b", 12, RunCause::NONE);
+    Add("t", "realtime", {"a", "b", "c"});
+    EXPECT_THAT(copied(), ElementsAre("a/", "b/", "c/"));
+    EXPECT_THAT(State("t").last->error, AllOf(HasSubstr("share 'b'"), Not(HasSubstr("share 'a'"))));
+    EXPECT_EQ(State("t").last->status, 12);
+    EXPECT_THAT(State("t").note, HasSubstr("share 'b' waits"));
+    change("a/deep/x");
+    change("b/deep/x");
+    EXPECT_THAT(copied(), ElementsAre("a/./deep/x"));
+    EXPECT_EQ(State("t").pending, 1u);
+    Pass(15);
+    EXPECT_THAT(copied(), ElementsAre("b/"));
+    copies_.bad.clear();
+    Pass(30);
+    EXPECT_THAT(copied(), ElementsAre("b/"));
+    EXPECT_EQ(State("t").pending, 0u);
+    EXPECT_EQ(State("t").note, "");
+    EXPECT_FALSE(State("t").retry_in);
+
+    // A path that cannot be read: what else changes in the share goes at once.
+    set_bad("/deep/x", 23, RunCause::UNREADABLE_SOURCE);
+    change("a/deep/x");
+    EXPECT_EQ(State("t").pending, 1u);
+    change("a/low/x");
+    change("a/deep/x");  // nothing new
+    EXPECT_THAT(copied(), ElementsAre("a/./deep/x", "a/./low/x"));
+    EXPECT_EQ(State("t").pending, 1u);
+    Pass(12);
+    EXPECT_THAT(copied(), ElementsAre("a/./deep/x"));
+    copies_.bad.clear();
+    Pass(25);
+    EXPECT_THAT(copied(), ElementsAre("a/./deep/x"));
+    EXPECT_EQ(State("t").pending, 0u);
+
+    // A share that is busy is copied again in the same run, and then at least once a minute.
+    set_bad("c", 23, RunCause::BUSY_SOURCE);
+    RequestRun();
+    EXPECT_THAT(copied(), ElementsAre("a/", "b/", "c/", "c/", "c/"));
+    Pass(600);
+    EXPECT_THAT(copied().size(), AllOf(Ge(3u * 9), Le(3u * 15)));
+    copies_.bad.clear();
+    Pass(73);
+    EXPECT_THAT(copied(), ElementsAre("c/"));
+    EXPECT_EQ(State("t").last->result, ZEL::TASK_RESULT_SUCCESS);
+}
+
+TEST_F(ServiceTest, AScheduledTaskTriesAgainOnlyTheSharesThatFailed) {
+    copies_.bad = {{"b", {12, TARQ::Backup::RunCause::NONE}}};
+    Add("t", "manual", {"a", "b", "c"});
+    RequestRun();
+    EXPECT_EQ(copies_.sources.size(), 3u);
+    copies_.bad.clear();
+    Pass(15);
+    ASSERT_EQ(copies_.sources.size(), 4u);
+    EXPECT_THAT(copies_.sources.back(), EndsWith("/b/"));
+    EXPECT_EQ(State("t").last->result, ZEL::TASK_RESULT_SUCCESS);
+    EXPECT_FALSE(State("t").retry_in);
+    Pass(kDay);
+    EXPECT_EQ(copies_.sources.size(), 4u);
 }
 
 TEST_F(ServiceTest, WithoutAThreadARunFailsAndIsMadeLater) {

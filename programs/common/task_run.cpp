@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <chrono>
 #include <condition_variable>
+#include <iterator>
 #include <mutex>
 #include <system_error>
 #include <thread>
@@ -25,6 +26,7 @@ namespace programs {
 namespace {
 
 using std::chrono::steady_clock;
+using TARQ::Backup::RunCause;
 using TARQ::Backup::RunChange;
 using TARQ::Backup::RunOptions;
 using TARQ::Backup::RunProgress;
@@ -35,8 +37,19 @@ constexpr std::chrono::seconds kBeaconEvery(60);  // the server takes a task for
 constexpr std::chrono::seconds kLastWord(1);
 constexpr int kVanishedFiles = 24;  // rsync: some files were gone before it came to them
 constexpr int kLookupFailed = 42;
+constexpr int kUnsupportedCommand = 51;
+constexpr int kAccepted = 207;
+constexpr int kPassedThrough = 208;
 constexpr int kNothingSent = 213;
+constexpr int kKeyFileFailed = 300;
 constexpr int kFirstServerStatus = 200;
+
+// A share that changes while it is copied is copied so often in one run.
+constexpr int kBusyTries = 3;
+// The names of the shares in one pairing command: a command carries 5 KiB.
+constexpr size_t kMaxPairedBytes = size_t{3} * 1024;
+// The failures of a run are told up to here: messages and rows of the history have a limit.
+constexpr size_t kMaxToldBytes = size_t{6} * 1024;
 
 std::list<std::string> ToList(const std::vector<std::string>& items) {
     return {items.begin(), items.end()};
@@ -167,42 +180,137 @@ bool IsPresent(int folder, const std::string& path) {
     return entry && fstat(entry.Get(), &info) == 0 && !S_ISLNK(info.st_mode);
 }
 
+/// A path as it is sent, and those of the order that are taken with it.
+struct Part {
+    std::string path;
+    std::vector<std::string> ordered;
+};
+
 // The paths as they are now: one that has gone stands for the nearest folder above that is there,
 // where the deletion is seen. No path is below another one.
-std::vector<std::string> PresentPaths(const std::string& folder,
-                                      const std::vector<std::string>& paths) {
+std::vector<Part> PresentParts(const std::string& folder, const std::vector<std::string>& paths) {
     const base::UniqueFd root(open(folder.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    std::vector<std::string> present;
-    for (std::string path : paths) {
+    std::vector<Part> present;
+    for (const std::string& ordered : paths) {
+        std::string path = ordered;
         while (path.find_first_not_of('/') != std::string::npos && !IsPresent(root.Get(), path)) {
             path.resize(std::max<size_t>(path.rfind('/'), 1));
         }
-        present.push_back(path);
+        present.push_back({path, {ordered}});
     }
-    std::sort(present.begin(), present.end());
-    std::vector<std::string> fewest;
-    for (std::string& path : present) {
-        const bool covered = std::any_of(
-            fewest.begin(), fewest.end(),
-            [&](const std::string& above) { return path == above || IsBelow(path, above); });
-        if (!covered) {
-            fewest.push_back(std::move(path));
+    std::sort(present.begin(), present.end(),
+              [](const Part& one, const Part& other) { return one.path < other.path; });
+    std::vector<Part> fewest;
+    for (Part& part : present) {
+        const auto above = std::find_if(fewest.begin(), fewest.end(), [&](const Part& kept) {
+            return part.path == kept.path || IsBelow(part.path, kept.path);
+        });
+        if (above == fewest.end()) {
+            fewest.push_back(std::move(part));
+        } else {
+            above->ordered.push_back(std::move(part.ordered.front()));
         }
     }
     return fewest;
+}
+
+bool IsAtTheTop(const std::string& path) {
+    return path.size() > 1 && path.rfind('/') == 0;
 }
 
 std::string Quoted(const std::string& share) {
     return "share '" + Printable(share) + "'";
 }
 
+// What the failure of a command for one share says of the others.
+Reach ReachOfCommand(int status) {
+    switch (status) {
+        case kDone:  // something here, of the share's
+        case kBadArgument:
+        case kOtherAccount:
+        case kConflicts:
+        case kNoEncryption:
+        case kStorage:
+        case kNameTaken:
+        case kNotRunning:
+            return Reach::kShare;
+        default:
+            return Reach::kRun;
+    }
+}
+
+using Orders = std::vector<const ShareOrder*>;
+
+// What a run that has ended did not come to.
+void LeaveUndone(Orders::const_iterator begin, Orders::const_iterator end, const Verdict& verdict,
+                 std::vector<Undone>& undone) {
+    for (; begin != end; ++begin) {
+        undone.push_back({(*begin)->share, (*begin)->paths, verdict, false});
+    }
+}
+
+void LeaveAllUndone(const Orders& shares, const Verdict& verdict, std::vector<Undone>& undone) {
+    const size_t first = undone.size();
+    LeaveUndone(shares.begin(), shares.end(), verdict, undone);
+    if (first < undone.size()) {
+        undone[first].tried = true;  // it is the one that the verdict is told with
+    }
+}
+
+// The one verdict of a run: the failure that ended it, or the first, with the others named.
+Verdict Summed(const std::vector<Undone>& undone) {
+    std::vector<const Undone*> failed;
+    size_t not_tried = 0;
+    for (const Undone& item : undone) {
+        if (item.tried) {
+            failed.push_back(&item);
+        } else {
+            ++not_tried;
+        }
+    }
+    if (failed.empty()) {
+        return {};
+    }
+    const auto ended = std::find_if(failed.begin(), failed.end(), [](const Undone* item) {
+        return item->verdict.reach == Reach::kRun;
+    });
+    if (ended != failed.end()) {
+        std::rotate(failed.begin(), ended, std::next(ended));
+    }
+    Verdict sum = failed.front()->verdict;
+    size_t told = 1;
+    for (; told < failed.size() && sum.error.size() < kMaxToldBytes; ++told) {
+        sum.error += "; " + failed[told]->verdict.error;
+    }
+    if (told < failed.size()) {
+        sum.error += "; and " + std::to_string(failed.size() - told) + " more like these";
+    }
+    if (not_tried > 0 && sum.trouble != Trouble::kCancelled && failed.size() > 1) {
+        sum.error += "; " + Count(not_tried, "share") + " not tried";
+    }
+    return sum;
+}
+
 }  // namespace
 
 Trouble TroubleOf(int status) {
-    if (status == kNothingSent) {
+    if (status == kNothingSent || status == kKeyFileFailed) {
         return Trouble::kLocal;
     }
-    return status < kFirstServerStatus ? Trouble::kFailed : Trouble::kRefused;
+    return status < kFirstServerStatus && status != TARQ::Backup::STATUS_AUTHENTICATION
+               ? Trouble::kFailed
+               : Trouble::kRefused;
+}
+
+RunResult NothingDone(const RunOrder& order, const Verdict& verdict) {
+    Orders shares;
+    for (const ShareOrder& share : order.shares) {
+        shares.push_back(&share);
+    }
+    RunResult result;
+    LeaveAllUndone(shares, verdict, result.undone);
+    result.verdict = verdict;
+    return result;
 }
 
 struct TaskRun::Impl {
@@ -218,28 +326,72 @@ struct TaskRun::Impl {
         return wishes;
     }
 
-    Verdict Failed(const std::string& what, int status) const {
+    Verdict Failed(const std::string& what, int status, Reach reach = Reach::kRun) const {
         if (cancel) {
             return {Trouble::kCancelled, 0, "ended by the user; the next run completes the copy"};
         }
         const std::string why = status == 0 ? "see the system log" : Explain(status, report);
-        return {status == 0 ? Trouble::kLocal : TroubleOf(status), status, what + ": " + why};
+        return {status == 0 ? Trouble::kLocal : TroubleOf(status), status, what + ": " + why,
+                reach};
     }
 
     static Verdict CheckShare(const std::string& share) {
         std::string problem = ShareProblem(share);
-        return problem.empty() ? Verdict() : Verdict{Trouble::kLocal, 0, std::move(problem)};
+        return problem.empty() ? Verdict()
+                               : Verdict{Trouble::kLocal, 0, std::move(problem), Reach::kShare};
     }
 
+    // Finds the server. One that answers the probe, and then not the question for its version, is
+    // not a server without versions: what comes next would be put to it in the wrong form.
+    Verdict Find() {
+        const ScopedRunOptions watched(Reporting());
+        int status = rsyncer.Initialize(info);
+        const bool version_failed = report.status > kDone && report.status != kUnknownCommand &&
+                                    report.status != kUnsupportedCommand;
+        if (status == 0 && (version_failed || cancel)) {
+            status = report.status;
+        }
+        connected = status == 0;
+        const std::string& name = info.GetServerName();
+        return connected ? Verdict()
+                         : Failed("cannot use server " + (name.empty() ? info.GetServerIP() : name),
+                                  status);
+    }
+
+    // One command pairs as many shares as it carries.
     Verdict Pair(bool dry_run, const std::vector<std::string>& shares) {
+        for (size_t begin = 0; begin < shares.size();) {
+            size_t end = begin;
+            for (size_t bytes = 0; end < shares.size(); ++end) {
+                bytes += shares[end].size() + 1;
+                if (end > begin && bytes > kMaxPairedBytes) {
+                    break;
+                }
+            }
+            Verdict paired =
+                PairTogether(dry_run, {&shares[begin], &shares[begin] + (end - begin)});
+            if (!paired.Ok()) {
+                return paired;
+            }
+            begin = end;
+        }
+        return {};
+    }
+
+    Verdict PairTogether(bool dry_run, const std::list<std::string>& shares) {
         std::list<std::string> conflicts;
         int status = 0;
         const ScopedRunOptions watched(Reporting());
-        if (rsyncer.DoPairing(dry_run, ToList(shares), conflicts, status) != 0) {
-            return Failed("the server does not take these shares", status);
-        }
-        if (status == kDone) {
+        const int asked = rsyncer.DoPairing(dry_run, shares, conflicts, status);
+        // A server that pairs no shares by name may say that it has merely taken the command.
+        if (asked == 0 && (status == kDone || status == kAccepted || status == kPassedThrough)) {
             return {};
+        }
+        const Reach reach = ReachOfCommand(status);
+        if (cancel || asked != 0 || status != kConflicts || conflicts.empty()) {
+            return Failed(shares.size() == 1 ? "the server does not take " + Quoted(shares.front())
+                                             : std::string("the server does not take these shares"),
+                          status, reach);
         }
         std::string taken;
         for (const std::string& share : conflicts) {
@@ -247,21 +399,23 @@ struct TaskRun::Impl {
         }
         return {Trouble::kRefused, status,
                 taken + (conflicts.size() == 1 ? " belongs" : " belong") +
-                    " to another client or account at the server"};
+                    " to another client or account at the server",
+                reach};
     }
 
-    // Announces a share, and pairs first when the server does not know this client.
-    Verdict Start(const std::string& share, const std::vector<std::string>& all_shares) {
+    // Announces a share, and pairs first when the server does not know this client. For this share
+    // alone: one that the server refuses must not stand in the way of the others.
+    Verdict Start(const std::string& share) {
         for (const bool may_pair : {true, false}) {
             int status = 0;
             {
                 const ScopedRunOptions watched(Reporting());
                 if (rsyncer.StartSyncShare(share, status) != 0) {
-                    return Failed(Quoted(share) + " cannot be announced", 0);
+                    return Failed(Quoted(share) + " cannot be announced", 0, Reach::kShare);
                 }
             }
             if (status == kNotPaired && may_pair) {
-                Verdict paired = Pair(false, all_shares);
+                Verdict paired = Pair(false, {share});
                 if (!paired.Ok()) {
                     return paired;
                 }
@@ -271,7 +425,8 @@ struct TaskRun::Impl {
                 continue;
             }
             return status == kDone ? Verdict()
-                                   : Failed("the server does not take " + Quoted(share), status);
+                                   : Failed("the server does not take " + Quoted(share), status,
+                                            ReachOfCommand(status));
         }
         return {};
     }
@@ -279,63 +434,125 @@ struct TaskRun::Impl {
     Verdict SendKey(const std::string& share) {
         const ScopedRunOptions watched(Reporting());
         const int status = rsyncer.SyncEncryptKey(share);
-        return status == 0
-                   ? Verdict()
-                   : Failed("the key of encrypted " + Quoted(share) + " cannot be sent", status);
+        return status == 0 ? Verdict()
+                           : Failed("the key of encrypted " + Quoted(share) + " cannot be sent",
+                                    status, Reach::kShare);
     }
 
-    Verdict PushShare(const RunOrder& order, const ShareOrder& share,
-                      const std::vector<std::string>& all_shares, RunTotals& totals) {
-        Verdict result = Start(share.share, all_shares);
-        if (result.Ok()) {
-            result = SendKey(share.share);
+    void PushShares(const RunOrder& order, const Orders& shares, RunTotals& totals,
+                    std::vector<Undone>& undone) {
+        if (shares.empty()) {
+            return;
         }
+        int ignored = 0;
+        bool announced = order.announce;
+        {
+            Beacon beacon(rsyncer.GetSyncInfo(), order.task);
+            if (announced) {
+                rsyncer.SendBeacon(order.task, ignored);
+            }
+            for (auto share = shares.begin(); share != shares.end();) {
+                const size_t before = undone.size();
+                PushShare(order, **share, totals, undone);
+                ++share;
+                if (undone.size() > before && undone.back().verdict.reach == Reach::kRun) {
+                    const Verdict end = undone.back().verdict;
+                    LeaveUndone(share, shares.end(), end, undone);
+                    break;
+                }
+            }
+            announced = beacon.Stop() || announced;
+        }
+        totals.rsync_runs += rsync_runs;
+        if (announced && heard) {
+            const LastWord last_word;
+            rsyncer.FinishSync("task", order.task, ignored);
+        }
+    }
+
+    // Adds to `undone` what the server has not taken.
+    void PushShare(const RunOrder& order, const ShareOrder& share, RunTotals& totals,
+                   std::vector<Undone>& undone) {
+        Verdict result = Start(share.share);
         if (!result.Ok()) {
-            return result;
+            undone.push_back({share.share, share.paths, std::move(result)});
+            return;
         }
         const auto begin = steady_clock::now();
+        const size_t undone_before = undone.size();
         RunReport sent;
-        // Once more, right before files are compared: an unmounted volume must not look like an
-        // emptied share.
-        result = CheckShare(share.share);
+        result = SendKey(share.share);
         if (result.Ok()) {
-            result = SendPaths(order, share, sent);
+            // Once more, right before files are compared: an unmounted volume must not look like
+            // an emptied share.
+            result = CheckShare(share.share);
+        }
+        if (result.Ok()) {
+            SendPaths(order, share, sent, undone);
+        } else {
+            undone.push_back({share.share, share.paths, std::move(result)});
         }
         totals.files_sent += sent.files_sent;
         totals.files_deleted += sent.files_deleted;
         totals.bytes_sent += sent.bytes_sent + sent.bytes_received;
         const std::chrono::duration<double> elapsed = steady_clock::now() - begin;
-        Verdict closed = Finish(share.share, result.Ok());
-        if (result.Ok() && closed.Ok() && listener.on_share_done) {
+        const bool completed = undone.size() == undone_before;
+        Verdict closed = Finish(share.share, completed, share.rest_waits);
+        if (completed && !closed.Ok()) {
+            undone.push_back({share.share, share.paths, std::move(closed)});
+        } else if (completed && listener.on_share_done) {
             listener.on_share_done(share.share, sent, elapsed.count());
         }
-        return result.Ok() ? closed : result;
     }
 
-    Verdict SendPaths(const RunOrder& order, const ShareOrder& share, RunReport& sent) {
+    void SendPaths(const RunOrder& order, const ShareOrder& share, RunReport& sent,
+                   std::vector<Undone>& undone) {
         ZEL::ShareInfo facts;
         if (rsyncer.GetShareInfo(share.share, facts) != 0) {
-            return Failed(Quoted(share.share) + " cannot be looked up", 0);
+            undone.push_back(
+                {share.share, share.paths,
+                 Failed(Quoted(share.share) + " cannot be looked up", 0, Reach::kShare)});
+            return;
         }
         const bool whole = share.paths == std::vector<std::string>{"/"};
-        const std::vector<std::string> paths =
-            whole ? share.paths : PresentPaths(facts.GetModulePath(), share.paths);
-        for (const std::string& path : paths) {
-            Verdict result = SendFiles(order, share.share, path);
-            sent.files_sent += report.files_sent;
-            sent.files_deleted += report.files_deleted;
-            sent.files_total += report.files_total;
-            sent.bytes_total += report.bytes_total;
-            sent.bytes_sent += report.bytes_sent;
-            sent.bytes_received += report.bytes_received;
-            if (!result.Ok()) {
-                return result;
+        std::vector<Part> parts = whole ? std::vector<Part>{{"/", {"/"}}}
+                                        : PresentParts(facts.GetModulePath(), share.paths);
+        bool touched_folder = false;
+        for (size_t i = 0; i < parts.size(); ++i) {
+            Verdict result = SendFiles(order, share.share, parts[i].path, sent);
+            touched_folder = touched_folder || IsAtTheTop(parts[i].path);
+            if (result.Ok()) {
+                continue;
+            }
+            const bool goes_on = result.reach == Reach::kPaths;
+            undone.push_back({share.share, std::move(parts[i].ordered), std::move(result)});
+            if (!goes_on) {
+                Undone& failed = undone.back();
+                while (++i < parts.size()) {
+                    failed.paths.insert(failed.paths.end(), parts[i].ordered.begin(),
+                                        parts[i].ordered.end());
+                }
+                return;
             }
         }
-        return {};
+        if (touched_folder) {
+            SendFolderItself(order, share.share, sent);
+        }
     }
 
-    Verdict SendFiles(const RunOrder& order, const std::string& share, const std::string& path) {
+    // A path is sent with the folders above it, but not with the share's own, whose time the
+    // server's changes with what is sent straight into it. That is no part of any path: what is
+    // excluded is neither sent nor deleted.
+    void SendFolderItself(const RunOrder& order, const std::string& share, RunReport& sent) {
+        int status = 0;
+        const ScopedRunOptions watched(Reporting());
+        rsyncer.RunSync(order.task_id, share, "/", {"/*"}, status);
+        sent.bytes_sent += report.bytes_sent;
+        sent.bytes_received += report.bytes_received;
+    }
+
+    Verdict SendFiles(const RunOrder& order, const std::string& share, const std::string& path,
+                      RunReport& sent) {
         RunOptions wishes = Reporting();
         wishes.bandwidth_limit = info.GetMaxBandwidth();
         if (listener.on_progress) {
@@ -344,22 +561,45 @@ struct TaskRun::Impl {
             };
         }
         int status = 0;
-        const ScopedRunOptions watched(std::move(wishes));
-        const int ran = rsyncer.RunSync(order.task_id, share, path, ToList(order.excludes), status);
-        if (ran == 0 && status == 0 && report.status < 0) {
-            // Nothing was there to run for. A path that has gone meanwhile is a change that will be
-            // told, of the folder above it; a share that has gone is a fault.
-            return path == "/" ? Verdict{Trouble::kLocal, 0, Quoted(share) + ": its folder is gone"}
-                               : Verdict();
+        int ran = 0;
+        for (int i = 0; i < kBusyTries; ++i) {
+            report = RunReport();
+            const ScopedRunOptions watched(wishes);
+            ran = rsyncer.RunSync(order.task_id, share, path, ToList(order.excludes), status);
+            if (ran == 0 && status == 0 && report.status < 0) {
+                // Nothing was there to run for. A path that has gone meanwhile is a change that
+                // will be told, of the folder above it; a share that has gone is a fault.
+                return path == "/" ? Verdict{Trouble::kLocal, 0,
+                                             Quoted(share) + ": its folder is gone", Reach::kShare}
+                                   : Verdict();
+            }
+            ++rsync_runs;
+            sent.files_sent += report.files_sent;
+            sent.files_deleted += report.files_deleted;
+            sent.files_total += report.files_total;
+            sent.bytes_total += report.bytes_total;
+            sent.bytes_sent += report.bytes_sent;
+            sent.bytes_received += report.bytes_received;
+            if (report.cause != RunCause::BUSY_SOURCE || cancel) {
+                break;
+            }
         }
-        ++rsync_runs;
         // Files that vanished under rsync's hands are changes that will be told, too.
-        return ran == 0 && (status == 0 || status == kVanishedFiles)
-                   ? Verdict()
-                   : Failed(Quoted(share) + " is not complete", status);
+        if (ran == 0 && (status == 0 || status == kVanishedFiles)) {
+            return {};
+        }
+        const bool busy = report.cause == RunCause::BUSY_SOURCE;
+        const bool part = busy || report.cause == RunCause::UNREADABLE_SOURCE;
+        const std::string what =
+            path == "/" ? " is not complete" : ": " + Printable(path) + " is not complete";
+        Verdict failed = Failed(Quoted(share) + what, status, part ? Reach::kPaths : Reach::kShare);
+        if (busy && failed.trouble == Trouble::kFailed) {
+            failed.trouble = Trouble::kBusy;
+        }
+        return failed;
     }
 
-    Verdict Finish(const std::string& share, bool completed) {
+    Verdict Finish(const std::string& share, bool completed, bool rest_waits) {
         const LastWord last_word;
         const RunReport of_the_run = report;
         int status = 0;
@@ -367,11 +607,12 @@ struct TaskRun::Impl {
         Verdict result;
         {
             const ScopedRunOptions watched(Reporting());
-            sent = rsyncer.FinishSync(completed ? "share" : "abort", share, status);
+            sent = rsyncer.FinishSync(completed && !rest_waits ? "share" : "abort", share, status);
         }
         heard = !cancel || (sent == 0 && status == kDone);
         if (completed && (sent != 0 || status != kDone)) {
-            result = Failed("the server does not confirm " + Quoted(share), status);
+            result = Failed("the server does not confirm " + Quoted(share), status,
+                            ReachOfCommand(status));
         }
         report = of_the_run;
         return result;
@@ -403,6 +644,7 @@ struct TaskRun::Impl {
     const std::atomic<bool>& cancel;
     RunListener listener;
     RunReport report;         // of the last thing that was run
+    bool connected = false;   // an address of the server has answered
     uint64_t rsync_runs = 0;  // copies made
     bool heard = true;        // the server still listens when a person has had enough
     ZEL::Rsyncer rsyncer;
@@ -415,13 +657,7 @@ TaskRun::~TaskRun() = default;
 
 Verdict TaskRun::Connect() {
     const CancelScope scope(impl_->cancel);
-    const ScopedRunOptions watched(impl_->Reporting());
-    const int status = impl_->rsyncer.Initialize(impl_->info);
-    const std::string& name = impl_->info.GetServerName();
-    return status == 0 ? Verdict()
-                       : impl_->Failed("cannot use server " +
-                                           (name.empty() ? impl_->info.GetServerIP() : name),
-                                       status);
+    return impl_->Find();
 }
 
 Verdict TaskRun::CheckPairing(const std::vector<std::string>& shares) {
@@ -429,35 +665,28 @@ Verdict TaskRun::CheckPairing(const std::vector<std::string>& shares) {
     return impl_->Pair(true, shares);
 }
 
-Verdict TaskRun::Push(const RunOrder& order, RunTotals& totals) {
+RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
     const CancelScope scope(impl_->cancel);
-    std::vector<std::string> names;
-    for (const ShareOrder& share : order.shares) {
-        names.push_back(share.share);
-    }
     impl_->rsync_runs = 0;
     impl_->heard = true;
-    int ignored = 0;
-    bool announced = order.announce;
-    Verdict result;
-    {
-        Beacon beacon(impl_->rsyncer.GetSyncInfo(), order.task);
-        if (announced) {
-            impl_->rsyncer.SendBeacon(order.task, ignored);
+    RunResult result;
+    Orders ready;
+    for (const ShareOrder& share : order.shares) {
+        Verdict fit = Impl::CheckShare(share.share);
+        if (fit.Ok()) {
+            ready.push_back(&share);
+        } else {
+            result.undone.push_back({share.share, share.paths, std::move(fit)});
         }
-        for (const ShareOrder& share : order.shares) {
-            result = impl_->PushShare(order, share, names, totals);
-            if (!result.Ok()) {
-                break;
-            }
-        }
-        announced = beacon.Stop() || announced;
     }
-    totals.rsync_runs += impl_->rsync_runs;
-    if (announced && impl_->heard) {
-        const LastWord last_word;
-        impl_->rsyncer.FinishSync("task", order.task, ignored);
+    // A share that is away is no reason to speak to the server.
+    const Verdict found = ready.empty() || impl_->connected ? Verdict() : impl_->Find();
+    if (found.Ok()) {
+        impl_->PushShares(order, ready, totals, result.undone);
+    } else {
+        LeaveAllUndone(ready, found, result.undone);
     }
+    result.verdict = Summed(result.undone);
     return result;
 }
 

@@ -18,18 +18,27 @@ enum class Trouble {
     kNone,
     kFailed,    ///< the connection, rsync or the server failed: worth another try
     kLocal,     ///< something on this machine: a share, its volume, a file
-    kRefused,   ///< the server refuses: conflict, account, switch
+    kRefused,   ///< the server refuses: conflict, account, password, switch
+    kBusy,      ///< what was copied changed at the same time: worth another try soon
     kCancelled  ///< ended by a person
 };
 
 /// What a status that is not 0 comes to, see tarq/rsync_wrapper.h.
 Trouble TroubleOf(int status);
 
+/// What a failure stands in the way of.
+enum class Reach {
+    kRun,  ///< everything: the server is not reached, refuses this client, or a person has ended it
+    kShare,  ///< one share
+    kPaths   ///< one path of a share: what is beside it is taken
+};
+
 /// How an operation ended, for a program and for a person.
 struct Verdict {
     Trouble trouble = Trouble::kNone;
     int status = 0;     ///< the server's or rsync's (tarq/rsync_wrapper.h); 0 for local troubles
     std::string error;  ///< what failed, where and what to do; empty when nothing did
+    Reach reach = Reach::kRun;
 
     bool Ok() const { return trouble == Trouble::kNone; }
 };
@@ -47,6 +56,9 @@ struct RunTotals {
 struct ShareOrder {
     std::string share;
     std::vector<std::string> paths = {"/"};
+    /// Something of the share is known to be behind and is not in this run, so that the server is
+    /// not told that its copy is complete.
+    bool rest_waits = false;
 };
 
 /// What a run is to do.
@@ -59,6 +71,25 @@ struct RunOrder {
     /// commands; it does so only when it lasts.
     bool announce = true;
 };
+
+/// What a run left undone of one share, and why.
+struct Undone {
+    std::string share;
+    std::vector<std::string> paths;  ///< of its order
+    Verdict verdict;
+    bool tried = true;  ///< false: the run had ended before it came to them
+};
+
+/// How a run ended: what is not in `undone` was taken by the server.
+struct RunResult {
+    /// Of the failure that ended the run, else of the first. Its text names each failure, with its
+    /// reason; after many it tells their number.
+    Verdict verdict;
+    std::vector<Undone> undone;  ///< in the order of the run
+};
+
+/// That of a run that has failed as a whole, before anything of `order` was taken.
+RunResult NothingDone(const RunOrder& order, const Verdict& verdict);
 
 /// Told on the running thread; each may be empty.
 struct RunListener {
@@ -87,9 +118,11 @@ public:
     Verdict Connect();
     /// Asks whether the server takes these shares from this client. Changes nothing there.
     Verdict CheckPairing(const std::vector<std::string>& shares);
-    /// Pushes share after share, pairing when the server does not know this client; stops at the
-    /// first that fails. After Connect().
-    Verdict Push(const RunOrder& order, RunTotals& totals);
+    /// Pushes share after share, after Connect() unless that was done, pairing when the server does
+    /// not know this client. Shares and paths that fail do not keep the others from being pushed,
+    /// unless the failure is one of the whole run. A share that changes while it is copied is
+    /// copied once more, a few times at most.
+    RunResult Push(const RunOrder& order, RunTotals& totals);
     /// Tells what Push() would send and delete. A share of which the server holds no copy is told
     /// to `on_missing`. Changes nothing.
     Verdict List(const RunOrder& order, const ChangeHandler& on_change,

@@ -10,8 +10,8 @@ namespace zel_daemon {
 
 namespace {
 
+using programs::RunResult;
 using programs::RunTotals;
-using programs::Verdict;
 using TARQ::Backup::RunProgress;
 
 // A server may have moved to another address by then.
@@ -24,44 +24,26 @@ std::string FolderOf(const std::string& share) {
 
 }  // namespace
 
-Connection::Connection(const ZEL::SyncInfo& info)
-    : run(info, cancel,
-          {[this](const std::string& share, const RunProgress& progress) {
-               if (on_progress) {
-                   on_progress(share, progress);
-               }
-           },
-           nullptr, nullptr}) {}
-
-bool Connection::Reusable(const std::list<std::string>& shares) const {
-    if (!ready_ || cancel || std::chrono::steady_clock::now() - since_ > kOld) {
-        return false;
+programs::TaskRun& Connection::For(const programs::RunOrder& order) {
+    const auto now = std::chrono::steady_clock::now();
+    bool usable = run_ && now - since_ <= kOld;
+    for (const programs::ShareOrder& share : order.shares) {
+        std::string folder = FolderOf(share.share);
+        const auto known = folders_.emplace(share.share, folder).first;
+        usable = usable && known->second == folder;
+        known->second = std::move(folder);
     }
-    for (const std::string& share : shares) {
-        const auto known = folders_.find(share);
-        if (known == folders_.end() || known->second != FolderOf(share)) {
-            return false;
-        }
+    if (!usable) {
+        since_ = now;
+        const auto told = [this](const std::string& share, const RunProgress& progress) {
+            if (on_progress) {
+                on_progress(share, progress);
+            }
+        };
+        run_ = std::make_unique<programs::TaskRun>(info_, cancel,
+                                                   programs::RunListener{told, nullptr, nullptr});
     }
-    return true;
-}
-
-Verdict Connection::Ensure(const std::list<std::string>& shares) {
-    if (ready_) {
-        return {};
-    }
-    Verdict verdict = run.Connect();
-    if (verdict.Ok()) {
-        verdict = run.CheckPairing({shares.begin(), shares.end()});
-    }
-    if (verdict.Ok()) {
-        for (const std::string& share : shares) {
-            folders_[share] = FolderOf(share);
-        }
-        ready_ = true;
-        since_ = std::chrono::steady_clock::now();
-    }
-    return verdict;
+    return *run_;
 }
 
 ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, RunPlan plan,
@@ -71,7 +53,7 @@ ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, Ru
         thread_ =
             std::thread([this, &loop, on_progress, on_end] { Work(loop, on_progress, on_end); });
     } catch (const std::system_error& error) {
-        End(loop, on_end, {programs::Trouble::kLocal, 0, ReasonOf(error.code().value())}, {});
+        End(loop, on_end, NothingDone(ReasonOf(error.code().value())), {});
     }
 }
 
@@ -93,38 +75,29 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
             }
         });
     };
-    Verdict verdict;
+    RunResult result;
     RunTotals totals;
     try {
-        verdict = Run(totals);
+        result = connection_->For(plan_.order).Push(plan_.order, totals);
     } catch (const std::exception& error) {
-        verdict = {programs::Trouble::kLocal, 0, error.what()};
+        result = NothingDone(error.what());
     }
     connection_->on_progress = nullptr;
-    End(loop, on_end, verdict, totals);
+    End(loop, on_end, result, totals);
 }
 
-void ActiveRun::End(EventLoop& loop, const OnEnd& on_end, const Verdict& verdict,
+RunResult ActiveRun::NothingDone(const std::string& why) const {
+    return programs::NothingDone(plan_.order, {programs::Trouble::kLocal, 0, why});
+}
+
+void ActiveRun::End(EventLoop& loop, const OnEnd& on_end, const RunResult& result,
                     const RunTotals& totals) {
-    loop.Post([this, alive = alive_, on_end, verdict, totals] {
+    loop.Post([this, alive = alive_, on_end, result, totals] {
         if (*alive) {
             ended_ = true;
-            on_end(verdict, totals);
+            on_end(result, totals);
         }
     });
-}
-
-Verdict ActiveRun::Run(RunTotals& totals) {
-    std::list<std::string> shares;
-    for (const programs::ShareOrder& share : plan_.order.shares) {
-        shares.push_back(share.share);
-        std::string problem = programs::ShareProblem(share.share);
-        if (!problem.empty()) {
-            return {programs::Trouble::kLocal, 0, std::move(problem)};
-        }
-    }
-    Verdict verdict = connection_->Ensure(shares);
-    return verdict.Ok() ? connection_->run.Push(plan_.order, totals) : verdict;
 }
 
 }  // namespace zel_daemon

@@ -20,21 +20,18 @@ namespace zel_daemon {
 /// look for it again.
 class Connection {
 public:
-    explicit Connection(const ZEL::SyncInfo& info);
+    explicit Connection(const ZEL::SyncInfo& info) : info_(info) {}
 
-    /// Whether the next run may go on with it: it worked, is not old, and these shares still lie
-    /// where they did.
-    bool Reusable(const std::list<std::string>& shares) const;
+    /// What to push with. It starts anew when it is old, or when one of these shares lies elsewhere
+    /// than it did.
+    programs::TaskRun& For(const programs::RunOrder& order);
 
-    /// Finds the server and asks for the shares, unless that has been done.
-    programs::Verdict Ensure(const std::list<std::string>& shares);
-
-    std::atomic<bool> cancel{false};
+    std::atomic<bool> cancel{false};  ///< for good: the next run needs another connection
     std::function<void(const std::string& share, const TARQ::Backup::RunProgress&)> on_progress;
-    programs::TaskRun run;
 
 private:
-    bool ready_ = false;
+    const ZEL::SyncInfo info_;
+    std::unique_ptr<programs::TaskRun> run_;
     std::chrono::steady_clock::time_point since_;
     std::map<std::string, std::string> folders_;  // of the shares, when they were first looked up
 };
@@ -43,8 +40,7 @@ private:
 struct RunPlan {
     programs::RunOrder order;
     RunRecord record;
-    std::vector<uint64_t> events;  ///< the stored changes that it sends
-    bool whole = true;             ///< all of each share, not only the changes
+    std::vector<ZEL::Event> events;  ///< the stored changes that it sends
 };
 
 /// A run under way.
@@ -54,7 +50,7 @@ class ActiveRun {
 public:
     using OnProgress =
         std::function<void(const std::string& share, const TARQ::Backup::RunProgress&)>;
-    using OnEnd = std::function<void(const programs::Verdict&, const programs::RunTotals&)>;
+    using OnEnd = std::function<void(const programs::RunResult&, const programs::RunTotals&)>;
 
     /// Starts it; without a thread to be had it ends as failed. Both functions are called on the
     /// loop's thread, after this; nothing is, once this object is gone.
@@ -73,8 +69,8 @@ public:
 
 private:
     void Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd& on_end);
-    programs::Verdict Run(programs::RunTotals& totals);
-    void End(EventLoop& loop, const OnEnd& on_end, const programs::Verdict& verdict,
+    programs::RunResult NothingDone(const std::string& why) const;
+    void End(EventLoop& loop, const OnEnd& on_end, const programs::RunResult& result,
              const programs::RunTotals& totals);
 
     std::shared_ptr<Connection> connection_;

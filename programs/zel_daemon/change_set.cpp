@@ -110,6 +110,10 @@ std::vector<std::string> Join(const std::vector<std::string>& keys, size_t wante
 
 }  // namespace
 
+bool ChangeSet::Covers(const std::string& above, const std::string& path) {
+    return IsWithin(KeyOf(path), KeyOf(above));
+}
+
 void ChangeSet::Add(const std::string& path) {
     Hold(KeyOf(path));
     if (held_.size() > kMaxHeld) {

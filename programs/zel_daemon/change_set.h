@@ -24,6 +24,9 @@ public:
     /// What Take() gives at most: each path costs a run of rsync.
     static constexpr size_t kMaxTaken = 16;
 
+    /// Whether `path` is `above` or below it.
+    static bool Covers(const std::string& above, const std::string& path);
+
     void Add(const std::string& path);
     bool Empty() const { return held_.empty(); }
     /// The folded paths, in byte order; the set is empty afterwards. Folding to kMaxTaken joins

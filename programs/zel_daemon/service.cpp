@@ -38,7 +38,10 @@ Service::~Service() {
         try {
             StoreGathered(*task);
             if (task->active) {
-                task->ended = EndedRun{task->active->Plan().record, task->active->Plan().events};
+                task->ended = EndedRun{task->active->Plan().record, {}, {}};
+                for (const ZEL::Event& event : task->active->Plan().events) {
+                    task->ended->unsent.push_back(event.GetID());
+                }
                 task->active.reset();
                 RunRecord& record = task->ended->record;
                 record.end = clock_.Now();
@@ -58,6 +61,11 @@ void Service::Start() {
     for (TaskRecord& record : store_.Tasks()) {
         Task& task = Insert(std::move(record));
         task.pending = store_.CountEvents(task.record.ID());
+        if (task.pending > 0 && task.record.IsRealtime()) {
+            for (const std::string& share : task.record.Info().GetShareList()) {
+                task.debts.OweChanges(share);
+            }
+        }
     }
     for (RunRecord& run : store_.LastRuns()) {
         const auto found = tasks_.find(run.task_id);
@@ -67,6 +75,7 @@ void Service::Start() {
         // A run that failed, or that the daemon's own end cut off, is made up for.
         if (run.result == ZEL::TASK_RESULT_FAILED) {
             found->second->plan->Failed(Delays());
+            found->second->debts.OweAllWhole();
         }
         found->second->last = std::move(run);
     }
@@ -118,7 +127,9 @@ void Service::CheckNameFree(const std::string& name, uint64_t id) const {
 Service::Task& Service::Insert(TaskRecord record) {
     auto task = std::make_unique<Task>(std::move(record), clock_);
     Task& inserted = *task;
-    inserted.whole_due = inserted.record.IsRealtime();
+    if (inserted.record.IsRealtime()) {
+        inserted.debts.OweAllWhole();
+    }
     by_name_[inserted.record.Name()] = &inserted;
     tasks_[inserted.record.ID()] = std::move(task);
     return inserted;
@@ -128,16 +139,17 @@ Service::Task& Service::Insert(TaskRecord record) {
 void Service::Reset(Task& task) {
     task.MakePlan(clock_);
     task.connection.reset();
-    task.whole_due = task.record.IsRealtime();
+    task.debts.SetShares(task.record.Info().GetShareList());
     task.poll_at.reset();
     task.notes.clear();
     task.held = false;
-    if (!task.record.IsRealtime()) {
-        task.gathered.clear();
-        task.gather_first.reset();
-        store_.ClearEvents(task.record.ID());
-        task.pending = 0;
+    task.gathered.clear();
+    task.gather_first.reset();
+    if (task.record.IsRealtime()) {
+        task.debts.OweAllWhole();  // which has the changes in it that waited
     }
+    store_.ClearEvents(task.record.ID());
+    task.pending = 0;
 }
 
 const TaskRecord& Service::Add(TaskRecord record) {
@@ -193,14 +205,19 @@ uint64_t Service::RequestRun(const std::string& name) {
 
 void Service::Cancel(const std::string& name) {
     Task& task = Get(name);
-    if (!task.active && task.due_since == 0 && !task.plan->RetryWaiting()) {
+    if (!task.active && task.due_since == 0 && !task.plan->RetryWaiting() &&
+        !task.debts.NextRetry()) {
         throw RequestError(ZEL::RESULT_EVENT_CONFLICT, "task '" + programs::Printable(name) +
                                                            "' neither runs nor waits to run");
     }
     task.requested = false;
     task.held = true;
-    task.whole_due = task.whole_due || (task.record.IsRealtime() && task.plan->RetryWaiting());
     task.plan->Settled();
+    if (task.record.IsRealtime()) {
+        task.debts.Release();
+    } else {
+        task.debts.Forgive();
+    }
     if (task.plan->ScheduleDue()) {
         task.plan->ScheduleTaken();
         task.record.checked_until = task.plan->CheckedUntil();
@@ -225,7 +242,12 @@ void Service::SetPaused(const std::string& name, bool paused) {
     store_.UpdateTask(changed);
     task.record = std::move(changed);
     task.MakePlan(clock_);
-    task.whole_due = task.record.IsRealtime();
+    if (task.record.IsRealtime()) {
+        task.debts.Release();
+        task.debts.OweAllWhole();
+    } else {
+        task.debts.Forgive();
+    }
     task.held = false;
     task.notes.clear();
     task.poll_at.reset();
@@ -256,13 +278,17 @@ TaskState Service::StateOf(const TaskRecord& record) const {
     if (!record.paused) {
         state.next_run = task.plan->NextRun();
     }
-    if (const auto wait = task.plan->UntilRetry()) {
+    if (const auto wait = UntilRetry(task)) {
         state.retry_in = (*wait + 999) / 1000;
     }
     state.pending = task.pending;
     state.note = task.store_note;
     for (const auto& [share, note] : task.notes) {
         state.note += (state.note.empty() ? "" : "; ") + note;
+    }
+    const std::string waits_for = WaitsFor(task);
+    if (!waits_for.empty()) {
+        state.note += (state.note.empty() ? "" : "; ") + waits_for;
     }
     state.active = task.active.get();
     state.last = task.last ? &*task.last : nullptr;

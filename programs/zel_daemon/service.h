@@ -12,6 +12,7 @@
 #include "programs/zel_daemon/change_set.h"
 #include "programs/zel_daemon/daemon_config.h"
 #include "programs/zel_daemon/event_loop.h"
+#include "programs/zel_daemon/share_debts.h"
 #include "programs/zel_daemon/store.h"
 #include "programs/zel_daemon/task_plan.h"
 #include "programs/zel_daemon/task_record.h"
@@ -81,7 +82,7 @@ private:
     struct Task;
     struct Due {
         RunReason reason;
-        bool whole;
+        bool all;  // whatever is owed
     };
 
     Task& Get(const std::string& name) const;
@@ -98,7 +99,6 @@ private:
     void WatchAgain(const Task& task);
     void PostWatcher();
     void RunWatcher();
-    bool IsSearching(const Task& task) const;
     bool PollDue(const Task& task) const;
     void SearchAgain(Task& task);
     void ForgetSettledNotes(Task& task);
@@ -108,15 +108,19 @@ private:
     // Runs.
     void Advance();
     std::optional<Due> WhatIsDue(Task& task);
-    bool MayStart(const Task& task) const;
+    bool MayStart(const Task& task, const Due& due) const;
     void StartRun(Task& task, const Due& due);
-    void FillOrder(Task& task, const Due& due, RunPlan& plan);
-    void EndRun(Task& task, const programs::Verdict& verdict, const programs::RunTotals& totals);
+    bool FillOrder(Task& task, RunPlan& plan);
+    void EndRun(Task& task, const programs::RunResult& result, const programs::RunTotals& totals);
+    void Settle(Task& task, const RunPlan& plan, const programs::RunResult& result);
+    void PutBack(Task& task);
     void StoreEnd(Task& task);
     void StoreFailed(Task& task, const StoreError& error);
     RetryDelays Delays() const;
     void SetAlarm();
     std::optional<int64_t> UntilNextStep(const Task& task) const;
+    std::optional<int64_t> UntilRetry(const Task& task) const;
+    static std::string WaitsFor(const Task& task);
 
     EventLoop& loop_;
     const Clock& clock_;

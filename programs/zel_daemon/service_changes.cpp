@@ -84,9 +84,11 @@ void Service::WatchShares() {
         if (before == watched_.end() || before->second != folder) {
             watcher_.Add(share, folder);
             for (const auto& [id, task] : tasks_) {
-                if (task->HasShare(share)) {
-                    task->whole_due = task->Watches();
+                if (task->debts.Has(share)) {
                     task->notes.erase(share);
+                    if (task->Watches()) {
+                        task->debts.OweWhole(share);
+                    }
                 }
             }
         }
@@ -122,17 +124,10 @@ void Service::RunWatcher() {
     Advance();
 }
 
-bool Service::IsSearching(const Task& task) const {
-    const std::list<std::string>& shares = task.record.Info().GetShareList();
-    return std::any_of(shares.begin(), shares.end(), [this](const std::string& share) {
-        return watcher_.Stats(share).searching;
-    });
-}
-
 void Service::OnChange(const std::string& share, const std::string& path) {
     const int64_t now = clock_.Elapsed();
     for (const auto& [id, task] : tasks_) {
-        if (!task->Watches() || !task->HasShare(share)) {
+        if (!task->Watches() || !task->debts.Has(share)) {
             continue;
         }
         task->gathered[share].Add(path);
@@ -146,7 +141,7 @@ void Service::OnChange(const std::string& share, const std::string& path) {
 void Service::Note(const std::string& share, const std::string& note) {
     bool is_news = false;
     for (const auto& [id, task] : tasks_) {
-        if (task->Watches() && task->HasShare(share) && task->notes[share] != note) {
+        if (task->Watches() && task->debts.Has(share) && task->notes[share] != note) {
             task->notes[share] = note;
             is_news = true;
         }
@@ -179,10 +174,10 @@ void Service::OnLoss(const std::string& share, const WatchLoss& loss) {
             break;
     }
     for (const auto& [id, task] : tasks_) {
-        if (!task->Watches() || !task->HasShare(share)) {
+        if (!task->Watches() || !task->debts.Has(share)) {
             continue;
         }
-        task->whole_due = true;
+        task->debts.OweWhole(share);
         task->held = false;
         if (loss.kind != WatchLoss::kOverflow) {
             task->poll_at = clock_.Elapsed() + config_.poll.count() * 1000;
@@ -197,10 +192,10 @@ bool Service::PollDue(const Task& task) const {
 
 // What is not watched is compared whole now and then, after another try to watch it.
 void Service::SearchAgain(Task& task) {
-    task.whole_due = true;
     task.poll_at = clock_.Elapsed() + config_.poll.count() * 1000;
     ListenToWatcher();
     for (const auto& [share, note] : task.notes) {
+        task.debts.OweWhole(share);
         watcher_.SearchAgain(share);
     }
     PostWatcher();
@@ -229,6 +224,7 @@ void Service::StoreGathered(Task& task) {
         const std::vector<std::string> paths = changes.Take();
         try {
             store_.AddEvents(task.record.ID(), share, paths);
+            task.debts.OweChanges(share);
         } catch (const StoreError&) {
             for (const std::string& path : paths) {
                 changes.Add(path);

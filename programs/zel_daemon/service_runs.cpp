@@ -1,14 +1,18 @@
 // The service's runs: when a task is due, how its run begins, and how it ends.
 #include <algorithm>
+#include <set>
 #include <utility>
 
 #include "ZEL/log.h"
+#include "programs/common/text.h"
 #include "programs/zel_daemon/service_task.h"
 
 namespace zel_daemon {
 
 namespace {
 
+using programs::Reach;
+using programs::RunResult;
 using programs::RunTotals;
 using programs::Verdict;
 using ZEL::Logger;
@@ -17,6 +21,17 @@ using ZEL::Logger;
 constexpr int64_t kStoreRetryMs = 10000;
 // A timer for something that is far off is set again now and then.
 constexpr int64_t kLongestWaitMs = int64_t{24} * 3600 * 1000;
+// What failed and changes again is tried so often at most.
+constexpr int64_t kChangedAgainMs = 60000;
+
+std::vector<uint64_t> IdsOf(const std::vector<ZEL::Event>& events) {
+    std::vector<uint64_t> ids;
+    ids.reserve(events.size());
+    for (const ZEL::Event& event : events) {
+        ids.push_back(event.GetID());
+    }
+    return ids;
+}
 
 }  // namespace
 
@@ -53,7 +68,7 @@ void Service::Advance() {
     });
     for (const auto& [task, what] : due) {
         WatchAgain(*task);
-        if (MayStart(*task)) {
+        if (MayStart(*task, what)) {
             StartRun(*task, what);
         }
     }
@@ -74,58 +89,70 @@ std::optional<Service::Due> Service::WhatIsDue(Task& task) {
     if (task.plan->ScheduleDue()) {
         return Due{RunReason::kSchedule, true};
     }
-    if (task.plan->RetryWaiting()) {
-        if (!task.plan->RetryDue()) {
-            return std::nullopt;
-        }
-        return Due{RunReason::kRetry, !task.record.IsRealtime() || task.whole_due};
-    }
-    if (!task.record.IsRealtime() || task.held) {
+    const bool again = task.plan->RetryWaiting();
+    if ((again && !task.plan->RetryDue()) || (task.held && task.record.IsRealtime())) {
         return std::nullopt;
     }
-    if (task.whole_due || task.pending > 0) {
-        return Due{RunReason::kChange, task.whole_due};
+    const std::optional<int64_t> next = task.debts.Next();
+    if (next && *next <= clock_.Elapsed()) {
+        return Due{again ? RunReason::kRetry : RunReason::kChange, false};
     }
     return std::nullopt;
 }
 
 // Whether a due task can start now: a worker is free, no other run has one of its shares, and its
 // folders have been found, so that no change falls between the comparison and the watch.
-bool Service::MayStart(const Task& task) const {
+bool Service::MayStart(const Task& task, const Due& due) const {
+    std::set<std::string> in_use;
     unsigned int running = 0;
     for (const auto& entry : tasks_) {
-        const Task& other = *entry.second;
-        if (!other.active) {
-            continue;
-        }
-        ++running;
-        const std::list<std::string>& shares = task.record.Info().GetShareList();
-        if (std::any_of(shares.begin(), shares.end(),
-                        [&](const std::string& share) { return other.HasShare(share); })) {
-            return false;
+        if (entry.second->active) {
+            ++running;
+            for (const programs::ShareOrder& share : entry.second->active->Plan().order.shares) {
+                in_use.insert(share.share);
+            }
         }
     }
-    return running < config_.workers && !(task.Watches() && IsSearching(task));
+    if (running >= config_.workers) {
+        return false;
+    }
+    const auto hindered = [&](const std::string& share) {
+        return in_use.count(share) != 0 || (task.Watches() && watcher_.Stats(share).searching);
+    };
+    const std::list<std::string>& shares = task.record.Info().GetShareList();
+    return due.all ? std::none_of(shares.begin(), shares.end(), hindered)
+                   : !task.debts.AnyDue(clock_.Elapsed(), hindered);
 }
 
-void Service::FillOrder(Task& task, const Due& due, RunPlan& plan) {
+// Takes what may be tried now. Whether some of it has failed before.
+bool Service::FillOrder(Task& task, RunPlan& plan) {
+    bool again = false;
     plan.order.task = task.record.Name();
     plan.order.task_id = task.record.ID();
     plan.order.excludes = task.record.excludes;
-    plan.order.announce = due.whole;
-    plan.whole = due.whole;
-    std::map<std::string, ChangeSet> changes;
-    for (const ZEL::Event& event : store_.PendingEvents(task.record.ID())) {
-        plan.events.push_back(event.GetID());
-        changes[event.GetShareName()].Add(event.GetRelativePath());
-    }
-    for (const std::string& share : task.record.Info().GetShareList()) {
-        if (due.whole) {
-            plan.order.shares.push_back({share, {"/"}});
-        } else if (!changes[share].Empty()) {
-            plan.order.shares.push_back({share, changes[share].Take()});
+    plan.order.announce = false;
+    for (const ShareDebts::Due& due : task.debts.Take(clock_.Elapsed())) {
+        ChangeSet changes;
+        if (due.stored) {
+            for (ZEL::Event& event : store_.PendingEvents(task.record.ID(), due.share, due.after)) {
+                changes.Add(event.GetRelativePath());
+                plan.events.push_back(std::move(event));
+            }
         }
+        if (due.whole) {
+            plan.order.shares.push_back({due.share, {"/"}, false});
+            plan.order.announce = true;
+        } else if (!changes.Empty()) {
+            plan.order.shares.push_back({due.share, changes.Take(), due.rest_waits});
+        } else if (due.rest_waits) {
+            // What changed is what has failed before: that may have mended it.
+            task.debts.Hasten(
+                clock_.Elapsed(), kChangedAgainMs,
+                [&](const std::string& share, programs::Trouble) { return share == due.share; });
+        }
+        again = again || due.again;
     }
+    return again;
 }
 
 void Service::StartRun(Task& task, const Due& due) {
@@ -134,11 +161,13 @@ void Service::StartRun(Task& task, const Due& due) {
         if (task.HasGathered()) {
             StoreGathered(task);
         }
-        FillOrder(task, due, plan);
+        if (due.all) {
+            task.debts.Release();
+            task.debts.OweAllWhole();
+        }
+        const bool again = FillOrder(task, plan);
         if (plan.order.shares.empty()) {
-            // Changes of shares that are no longer the task's.
-            store_.RemoveEvents(plan.events);
-            task.pending = store_.CountEvents(task.record.ID());
+            task.debts.Settle(clock_.Elapsed(), {}, Delays(), 0);
             task.plan->Settled();
             task.due_since = 0;
             return;
@@ -148,27 +177,27 @@ void Service::StartRun(Task& task, const Due& due) {
             task.record.checked_until = task.plan->CheckedUntil();
             store_.UpdateTask(task.record);
         }
-        store_.MarkSending(plan.events);
+        store_.MarkSending(IdsOf(plan.events));
         plan.record.task_id = task.record.ID();
-        plan.record.reason = due.reason;
+        plan.record.reason =
+            again && due.reason == RunReason::kChange ? RunReason::kRetry : due.reason;
         plan.record.start = clock_.Now();
-        plan.record.id = store_.BeginRun(task.record.ID(), due.reason, plan.record.start);
+        plan.record.id = store_.BeginRun(task.record.ID(), plan.record.reason, plan.record.start);
     } catch (const StoreError& error) {
+        PutBack(task);
         StoreFailed(task, error);
         return;
     }
     task.requested = false;
     task.by_person = false;
     task.due_since = 0;
-    if (due.whole) {
-        // What changes from here on is told by events of its own.
-        task.whole_due = false;
+    if (plan.order.announce) {  // whole shares: what changes from here on is told by events
         ForgetSettledNotes(task);
         if (task.poll_at) {
             task.poll_at = clock_.Elapsed() + config_.poll.count() * 1000;
         }
     }
-    if (!task.connection || !task.connection->Reusable(task.record.Info().GetShareList())) {
+    if (!task.connection || task.connection->cancel) {
         task.connection = std::make_shared<Connection>(task.record.Info().GetSyncInfo());
     }
     Logger::LogMsg(Logger::LEVEL_INFO, "[INFO] zel_daemon(%d): task '%s': run %llu starts\n",
@@ -181,14 +210,15 @@ void Service::StartRun(Task& task, const Due& due) {
             task.active->progress = progress;
             on_change_();
         },
-        [this, &task](const Verdict& verdict, const RunTotals& totals) {
-            EndRun(task, verdict, totals);
+        [this, &task](const RunResult& result, const RunTotals& totals) {
+            EndRun(task, result, totals);
         });
 }
 
-void Service::EndRun(Task& task, const Verdict& verdict, const RunTotals& totals) {
+void Service::EndRun(Task& task, const RunResult& result, const RunTotals& totals) {
     const RunPlan plan = task.active->Plan();
     task.active.reset();
+    const Verdict& verdict = result.verdict;
     RunRecord record = plan.record;
     record.end = clock_.Now();
     record.status = verdict.status;
@@ -200,19 +230,19 @@ void Service::EndRun(Task& task, const Verdict& verdict, const RunTotals& totals
     record.result = verdict.Ok()     ? ZEL::TASK_RESULT_SUCCESS
                     : task.by_person ? ZEL::TASK_RESULT_CANCELLED
                                      : ZEL::TASK_RESULT_FAILED;
-    if (!verdict.Ok() && plan.whole && task.record.IsRealtime()) {
-        task.whole_due = true;
-    }
     if (record.result == ZEL::TASK_RESULT_FAILED) {
-        task.plan->Failed(Delays());
-        task.connection.reset();
         Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s': %s\n", __LINE__,
                        task.record.Name().c_str(), record.error.c_str());
+    }
+    if (record.result == ZEL::TASK_RESULT_FAILED && verdict.reach == Reach::kRun) {
+        task.plan->Failed(Delays());
+        task.connection.reset();
     } else {
         task.plan->Settled();
     }
     task.last = record;
-    task.ended = EndedRun{std::move(record), plan.events};
+    task.ended = EndedRun{std::move(record), {}, {}};
+    Settle(task, plan, result);
     try {
         StoreEnd(task);
     } catch (const StoreError& error) {
@@ -221,16 +251,58 @@ void Service::EndRun(Task& task, const Verdict& verdict, const RunTotals& totals
     Advance();
 }
 
+// What the run has sent is forgotten, what it has not is owed.
+void Service::Settle(Task& task, const RunPlan& plan, const RunResult& result) {
+    std::map<std::string, std::vector<const std::string*>> unsent_paths;
+    std::map<std::string, ShareDebts::Outcome> outcomes;
+    for (const programs::Undone& undone : result.undone) {
+        ShareDebts::Outcome& outcome = outcomes[undone.share];
+        const bool other = undone.verdict.reach == Reach::kRun;
+        if (!outcome.failed || undone.verdict.reach == Reach::kShare) {
+            outcome.reach = undone.verdict.reach;
+            outcome.trouble = undone.verdict.trouble;
+        }
+        outcome.failed = true;
+        outcome.tried = outcome.tried && !other;
+        for (const std::string& path : undone.paths) {
+            unsent_paths[undone.share].push_back(&path);
+        }
+    }
+    for (const ZEL::Event& event : plan.events) {
+        const auto unsent = unsent_paths.find(event.GetShareName());
+        const bool sent =
+            unsent == unsent_paths.end() ||
+            std::none_of(unsent->second.begin(), unsent->second.end(), [&](const auto* path) {
+                return ChangeSet::Covers(*path, event.GetRelativePath());
+            });
+        (sent ? task.ended->sent : task.ended->unsent).push_back(event.GetID());
+        if (!sent) {
+            uint64_t& last = outcomes[event.GetShareName()].last_change;
+            last = std::max(last, event.GetID());
+        }
+    }
+    task.debts.Settle(clock_.Elapsed(), outcomes, Delays(), task.plan->Chance());
+    if (task.by_person && !task.record.IsRealtime()) {
+        task.debts.Forgive();
+    }
+}
+
+// A run that could not begin: all that was taken for it is owed as it was.
+void Service::PutBack(Task& task) {
+    std::map<std::string, ShareDebts::Outcome> outcomes;
+    for (const std::string& share : task.record.Info().GetShareList()) {
+        outcomes[share].tried = false;
+    }
+    task.debts.Settle(clock_.Elapsed(), outcomes, Delays(), 0);
+}
+
 // Nothing of the task is run before this has been done: what was being sent would be left out.
 void Service::StoreEnd(Task& task) {
     if (!task.ended) {
         return;
     }
-    if (task.ended->record.result == ZEL::TASK_RESULT_SUCCESS) {
-        store_.RemoveEvents(task.ended->events);
-    } else {
-        store_.ReturnEvents(task.ended->events);
-    }
+    store_.RemoveEvents(task.ended->sent);
+    store_.ReturnEvents(task.ended->unsent);
     store_.EndRun(task.ended->record);
     task.ended.reset();
     task.store_note.clear();
@@ -270,17 +342,60 @@ std::optional<int64_t> Service::UntilNextStep(const Task& task) const {
     if (task.record.paused) {
         return wait;
     }
-    const std::optional<int64_t> retry = task.plan->UntilRetry();
-    if (retry) {
-        at(now + *retry);
-    }
     if (const auto next = task.plan->NextRun()) {
         at(now + std::min((*next - clock_.Now()) * 1000, kLongestWaitMs));
     }
-    if (task.poll_at && !task.held && !retry) {
+    if (const auto retry = task.plan->UntilRetry()) {
+        at(now + *retry);
+        return wait;
+    }
+    if (task.held && task.record.IsRealtime()) {
+        return wait;
+    }
+    if (task.poll_at) {
         at(*task.poll_at);
     }
+    if (const auto next = task.debts.Next()) {
+        at(*next);
+    }
     return wait;
+}
+
+// Milliseconds until something that failed is tried again.
+std::optional<int64_t> Service::UntilRetry(const Task& task) const {
+    std::optional<int64_t> wait = task.plan->UntilRetry();
+    const std::optional<int64_t> share = task.debts.NextRetry();
+    if (!wait && share) {
+        wait = std::max<int64_t>(*share - clock_.Elapsed(), 0);
+    }
+    return wait;
+}
+
+// What a person is told that the next try waits for.
+std::string Service::WaitsFor(const Task& task) {
+    if (task.plan->RetryWaiting()) {
+        return "waits for its server";
+    }
+    const ShareDebts::Waiting waiting = task.debts.WhatWaits();
+    if (waiting.shares == 0) {
+        return "";
+    }
+    std::string words = "share '" + programs::Printable(waiting.first) + "'";
+    if (waiting.shares > 1) {
+        words += " and " + programs::Count(waiting.shares - 1, "other share") + " wait";
+    } else {
+        words += " waits";
+    }
+    switch (waiting.trouble) {
+        case programs::Trouble::kLocal:
+            return words + " for the volume or folder to be there";
+        case programs::Trouble::kRefused:
+            return words + " for the server to take it";
+        case programs::Trouble::kBusy:
+            return words + " until fewer files change while they are read";
+        default:
+            return words + " for the next try";
+    }
 }
 
 void Service::SetAlarm() {

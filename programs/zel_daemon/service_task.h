@@ -1,8 +1,6 @@
 // What the three sources of the service share: a task with all that goes on with it.
 #pragma once
 
-#include <algorithm>
-#include <list>
 #include <map>
 #include <memory>
 #include <optional>
@@ -17,26 +15,27 @@ namespace zel_daemon {
 /// A run whose end is still to be stored.
 struct EndedRun {
     RunRecord record;
-    std::vector<uint64_t> events;  ///< that it was to send
+    std::vector<uint64_t> sent;    ///< changes that the server has taken
+    std::vector<uint64_t> unsent;  ///< and those that it has not
 };
 
 /// A task and all that goes on with it.
 struct Service::Task {
-    Task(TaskRecord kept, const Clock& clock) : record(std::move(kept)) { MakePlan(clock); }
+    Task(TaskRecord kept, const Clock& clock) : record(std::move(kept)) {
+        MakePlan(clock);
+        debts.SetShares(record.Info().GetShareList());
+    }
 
     void MakePlan(const Clock& clock) {
         plan.emplace(clock, record.Info().GetSchedule(), record.checked_until);
     }
 
     bool HasGathered() const { return gather_first.has_value(); }
-    bool HasShare(const std::string& share) const {
-        const std::list<std::string>& shares = record.Info().GetShareList();
-        return std::find(shares.begin(), shares.end(), share) != shares.end();
-    }
     bool Watches() const { return record.IsRealtime() && !record.paused; }
 
     TaskRecord record;
     std::optional<TaskPlan> plan;  // always there
+    ShareDebts debts;
     std::shared_ptr<Connection> connection;
     std::unique_ptr<ActiveRun> active;
     std::optional<EndedRun> ended;  // the store does not know of its end yet
@@ -48,7 +47,6 @@ struct Service::Task {
     std::optional<RunRecord> last;  // the last run that ended
 
     // Realtime tasks.
-    bool whole_due = false;
     std::map<std::string, ChangeSet> gathered;  // by share
     std::optional<int64_t> gather_first;        // when the first of them came
     int64_t gather_last = 0;

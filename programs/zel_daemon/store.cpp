@@ -83,6 +83,14 @@ RunRecord ReadRun(Query& query) {
     return run;
 }
 
+ZEL::Event ReadEvent(Query& query) {
+    ZEL::Event event;
+    event.SetID(static_cast<uint64_t>(query.Number()));
+    event.SetShareName(query.Text());
+    event.SetRelativePath(query.Text());
+    return event;
+}
+
 template <typename Record>
 std::vector<Record> ReadAll(Query&& query, Record (*read)(Query&)) {
     std::vector<Record> records;
@@ -236,17 +244,22 @@ void Store::AddEvents(uint64_t task_id, const std::string& share,
 
 std::vector<ZEL::Event> Store::PendingEvents(uint64_t task_id) {
     return impl_->Do("read the changes", [&] {
-        return ReadAll<ZEL::Event>(
+        return ReadAll(
             Query(*impl_->database,
                   "SELECT id, share, path FROM events WHERE task = ? AND status = 0 ORDER BY id",
                   task_id),
-            [](Query& query) {
-                ZEL::Event event;
-                event.SetID(static_cast<uint64_t>(query.Number()));
-                event.SetShareName(query.Text());
-                event.SetRelativePath(query.Text());
-                return event;
-            });
+            ReadEvent);
+    });
+}
+
+std::vector<ZEL::Event> Store::PendingEvents(uint64_t task_id, const std::string& share,
+                                             uint64_t after) {
+    return impl_->Do("read the changes", [&] {
+        return ReadAll(Query(*impl_->database,
+                             "SELECT id, share, path FROM events WHERE task = ? AND status = 0 "
+                             "AND share = ? AND id > ? ORDER BY id",
+                             task_id, share, after),
+                       ReadEvent);
     });
 }
 

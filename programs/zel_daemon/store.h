@@ -61,6 +61,9 @@ public:
                    const std::vector<std::string>& paths);
     /// The changes of a task that wait, oldest first.
     std::vector<ZEL::Event> PendingEvents(uint64_t task_id);
+    /// Those of one share whose id is larger than `after`.
+    std::vector<ZEL::Event> PendingEvents(uint64_t task_id, const std::string& share,
+                                          uint64_t after);
     /// Marks these as being sent: a change of the same path that comes now waits on its own.
     void MarkSending(const std::vector<uint64_t>& ids);
     /// The server took these.

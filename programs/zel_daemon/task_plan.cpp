@@ -3,7 +3,6 @@
 #include <time.h>
 
 #include <algorithm>
-#include <cmath>
 #include <limits>
 #include <random>
 
@@ -14,8 +13,6 @@ namespace {
 // A clock that is set right by a little shows moments again whose runs have been made: they are not
 // made twice, and none after them is lost.
 constexpr int64_t kSetRightSeconds = 60;
-
-constexpr double kJitter = 0.2;
 
 // A small generator: there is one for each task.
 std::function<double()> SystemRandom() {
@@ -83,30 +80,14 @@ bool TaskPlan::WasSetBack(int64_t now) const {
 }
 
 void TaskPlan::Failed(const RetryDelays& delays) {
-    int64_t delay = delays.first;
-    for (unsigned int i = 0; i < failures_ && delay < delays.longest; ++i) {
-        delay *= 2;
-    }
-    delay = std::min(delay, delays.longest);
-    ++failures_;
-    const double factor = 1 + kJitter * (2 * random_() - 1);
-    retry_at_ = clock_.Elapsed() + std::llround(static_cast<double>(delay) * factor);
-}
-
-void TaskPlan::Settled() {
-    failures_ = 0;
-    retry_at_.reset();
-}
-
-bool TaskPlan::RetryDue() const {
-    return UntilRetry() == 0;
+    retry_.Failed(clock_.Elapsed(), delays, random_());
 }
 
 std::optional<int64_t> TaskPlan::UntilRetry() const {
-    if (!retry_at_) {
+    if (!retry_.Waiting()) {
         return std::nullopt;
     }
-    return std::max<int64_t>(*retry_at_ - clock_.Elapsed(), 0);
+    return std::max<int64_t>(*retry_.At() - clock_.Elapsed(), 0);
 }
 
 }  // namespace zel_daemon

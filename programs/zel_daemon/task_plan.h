@@ -6,6 +6,7 @@
 #include <optional>
 
 #include "ZEL/sync_obj.h"
+#include "programs/zel_daemon/backoff.h"
 
 namespace zel_daemon {
 
@@ -19,12 +20,6 @@ public:
     virtual int64_t Elapsed() const = 0;
 };
 
-/// How long a failed run waits for its next try, in milliseconds: the first time, and at most.
-struct RetryDelays {
-    int64_t first = 10000;
-    int64_t longest = 3600000;
-};
-
 class SystemClock : public Clock {
 public:
     int64_t Now() const override;
@@ -36,9 +31,7 @@ public:
 ///
 /// Schedule: a run that was missed (the machine was off, the clock jumped ahead) is made up for
 /// once, however many were missed. After a jump back the schedule goes on from the time that the
-/// clock shows. A failed run is tried again after 10 s, 20 s, 40 s ... up to 1 h unless other
-/// delays are given, each up to a fifth shorter or longer so that many clients do not come back
-/// together.
+/// clock shows. A run that failed as a whole is tried again after a while, see Backoff.
 ///
 /// Threads: one thread.
 class TaskPlan {
@@ -61,14 +54,18 @@ public:
     /// What must be stored: runs up to here are done with.
     int64_t CheckedUntil() const { return checked_until_; }
 
-    /// A run failed: sets the moment of the next try.
+    /// A run failed as a whole: sets the moment of the next try.
     void Failed(const RetryDelays& delays = {});
-    /// A run was made well, or cancelled by a person: no try is waiting any more.
-    void Settled();
+    /// What it failed for may be over, see Backoff.
+    void Hasten(int64_t gap) { retry_.Hasten(clock_.Elapsed(), gap); }
+    /// The server was reached, or a person has cancelled: no try is waiting any more.
+    void Settled() { retry_.Settled(); }
     /// Whether a failed run waits to be tried again, and whether its moment has come.
-    bool RetryWaiting() const { return retry_at_.has_value(); }
-    bool RetryDue() const;
-    unsigned int Failures() const { return failures_; }
+    bool RetryWaiting() const { return retry_.Waiting(); }
+    bool RetryDue() const { return retry_.Due(clock_.Elapsed()); }
+    unsigned int Failures() const { return retry_.Failures(); }
+    /// A number from 0 to below 1.
+    double Chance() { return random_(); }
     /// Milliseconds until the next try; 0 when it is due; nothing when none waits.
     std::optional<int64_t> UntilRetry() const;
 
@@ -83,8 +80,7 @@ private:
     mutable std::optional<int64_t> next_;
     mutable std::optional<int64_t> next_after_;  // the checked_until_ that next_ belongs to
     std::function<double()> random_;
-    unsigned int failures_ = 0;
-    std::optional<int64_t> retry_at_;  // on the clock that never jumps
+    Backoff retry_;
 };
 
 }  // namespace zel_daemon

@@ -16,6 +16,7 @@ ExitCode CodeOf(programs::Trouble trouble) {
         case programs::Trouble::kCancelled:
             return kCancelled;
         case programs::Trouble::kFailed:
+        case programs::Trouble::kBusy:
             break;
     }
     return kFailed;

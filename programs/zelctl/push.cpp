@@ -38,10 +38,12 @@ ExitCode CheckPath(const PushOptions& options) {
 // What every command does before it speaks to the server.
 ExitCode Prepare(const PushOptions& options, ZEL::SyncInfo& info) {
     ExitCode result = PrepareHost();
-    if (result == kOk) {
+    // Of several shares to push those that are fit are pushed; a push of one asks for no password
+    // in vain.
+    if (result == kOk && (options.dry_run || options.shares.size() == 1)) {
         result = CheckShares(options.shares);
     }
-    if (result == kOk) {
+    if (result == kOk && options.path != "/") {
         result = CheckPath(options);
     }
     if (result == kOk && options.info) {
@@ -137,10 +139,6 @@ ExitCode Push(const PushOptions& options) {
         }
     };
     TaskRun run(info, Interrupted(), std::move(listener));
-    Verdict verdict = Connect(run, options.shares);
-    if (!verdict.Ok()) {
-        return Tell(verdict);
-    }
     RunOrder order;
     order.task = "push-" + ZEL::GetHostName(35);
     order.excludes = options.excludes;
@@ -148,18 +146,20 @@ ExitCode Push(const PushOptions& options) {
         order.shares.push_back({share, {options.path}});
     }
     if (options.dry_run) {
-        return ListChanges(run, order);
+        const Verdict verdict = Connect(run, options.shares);
+        return verdict.Ok() ? ListChanges(run, order) : Tell(verdict);
     }
     RunTotals totals;
-    verdict = run.Push(order, totals);
+    const programs::RunResult result = run.Push(order, totals);
     display.Clear();
-    return Tell(verdict);
+    return Tell(result.verdict);
 }
 
 ExitCode CheckPairing(const ConnectionOptions& connection, const std::vector<std::string>& shares) {
     PushOptions options;
     options.connection = connection;
     options.shares = shares;
+    options.dry_run = true;
     ZEL::SyncInfo info;
     const ExitCode prepared = Prepare(options, info);
     if (prepared != kOk) {

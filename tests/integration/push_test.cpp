@@ -1,8 +1,10 @@
 // A whole client and a whole server: the programs as people run them, on a real rsync daemon and a
 // real sshd.
 #include <sys/mount.h>
+#include <sys/stat.h>
 
 #include <regex>
+#include <tuple>
 
 #include "tests/integration/client_and_server.h"
 #include "tests/support/testing.h"
@@ -60,10 +62,47 @@ TEST_F(PushTest, OnlyTheChangeTravelsAndADeletionIsOne) {
     EXPECT_THAT(Push("--path /sub").output, HasSubstr("1 file sent, 0 deleted"));
     EXPECT_FALSE(fs::exists(storage_ + "/docs/top"));
     EXPECT_EQ(Push("--path '/no such'").exit_code, 3);
+
+    // The share's own folder keeps its time and its mode, too.
+    const auto facts = [](const std::string& folder) {
+        struct stat info = {};
+        stat(folder.c_str(), &info);
+        return std::tuple(info.st_mtim.tv_sec, info.st_mtim.tv_nsec, info.st_mode);
+    };
+    chmod(source_.c_str(), 0750);
+    EXPECT_THAT(Push("--path /top"), Ended(0));
+    EXPECT_EQ(facts(storage_ + "/docs"), facts(source_));
+    EXPECT_TRUE(fs::exists(storage_ + "/docs/-n\n odd \xc3\xa4"));
+    Write("top2", "t");
+    EXPECT_THAT(Push(), Ended(0));
+    EXPECT_EQ(facts(storage_ + "/docs"), facts(source_));
+}
+
+TEST_F(PushTest, OneBadShareDoesNotStopTheOthers) {
+    Must(Server("account add mallory --password-file -", "secret\n"));
+    for (const std::string share : {"away", "taken", "last"}) {
+        folder_.Write(share + "/file", share);
+        Must(Client("share add " + share + " " + folder_.Path(share)));
+    }
+    const auto push = [&](const std::string& shares, const std::string& user) {
+        return Client("push " + shares + " -s 127.0.0.1 --password-file - -u " + user, "secret\n");
+    };
+    EXPECT_THAT(push("taken", "mallory"), Ended(0));
+    fs::rename(folder_.Path("away"), folder_.Path("gone"));
+    EXPECT_THAT(push("taken away docs last", "alice"), Ended(3, "share 'away': "));
+    ExpectCopyIsComplete();
+    EXPECT_TRUE(fs::exists(storage_ + "/last/file"));
+    EXPECT_THAT(push("taken last", "alice"), Ended(4, "'taken': the share belongs to another"));
+    EXPECT_THAT(push("away", "alice"), Ended(3, "away"));
+    // Nobody there: no share is tried after the first.
+    StopServer();
+    const test::Outcome unreachable = push("docs last", "alice");
+    EXPECT_THAT(unreachable, Ended(1, "refuses connections"));
+    EXPECT_THAT(unreachable.output, Not(HasSubstr("last")));
 }
 
 TEST_F(PushTest, EachFailureHasItsOwnErrorAndTheNextPushCompletesTheCopy) {
-    EXPECT_THAT(Push("", "wrong"), Ended(1, "password"));
+    EXPECT_THAT(Push("", "wrong"), Ended(4, "password"));
     EXPECT_THAT(Client("push docs -s no.such.invalid -u alice --password-file -", "secret\n"),
                 Ended(1, "cannot be looked up"));
     StopServer();
@@ -141,7 +180,8 @@ TEST_F(PushTest, AFullDiskAtTheServerIsSaidAndThenHealed) {
 TEST_F(PushTest, AnotherAccountOrClientIsKeptOut) {
     Must(Server("account add mallory --password-file -", "secret\n"));
     ExpectNextPushCompletes();
-    EXPECT_THAT(Push("", "secret", "mallory"), Ended(4, "belongs to another client or account"));
+    EXPECT_THAT(Push("", "secret", "mallory"),
+                Ended(4, "'docs': the share belongs to another account"));
     for (const std::string user : {"mallory", "alice"}) {  // alice: nothing has been started
         EXPECT_NE(Rsync(source_ + "/a.txt " + user + "@127.0.0.1::docs/forged"), 0);
         EXPECT_FALSE(fs::exists(storage_ + "/docs/forged"));

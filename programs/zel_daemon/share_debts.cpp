@@ -1,0 +1,202 @@
+#include "programs/zel_daemon/share_debts.h"
+
+#include <algorithm>
+#include <limits>
+
+namespace zel_daemon {
+
+namespace {
+
+using programs::Reach;
+using programs::Trouble;
+
+constexpr int64_t kAtOnce = std::numeric_limits<int64_t>::min();
+// A share that is always busy is tried this often, at least.
+constexpr int64_t kLongestBusyMs = 60000;
+
+void TakeEarlier(std::optional<int64_t>& soonest, std::optional<int64_t> moment) {
+    if (moment && (!soonest || *moment < *soonest)) {
+        soonest = moment;
+    }
+}
+
+}  // namespace
+
+std::optional<int64_t> ShareDebts::Share::Next() const {
+    if (!Owes()) {
+        return std::nullopt;
+    }
+    const bool unfailed = whole == Whole::kDue || fresh;
+    return retry.Waiting() && (shut || !unfailed) ? retry.At() : kAtOnce;
+}
+
+bool ShareDebts::Share::MayTry(int64_t now) const {
+    const std::optional<int64_t> next = Next();
+    return next && *next <= now;
+}
+
+void ShareDebts::SetShares(const std::list<std::string>& shares) {
+    shares_.clear();
+    taken_.clear();
+    sums_.reset();
+    for (const std::string& share : shares) {
+        shares_[share];
+    }
+}
+
+ShareDebts::Share* ShareDebts::Changed(const std::string& share) {
+    const auto found = shares_.find(share);
+    if (found == shares_.end()) {
+        return nullptr;
+    }
+    sums_.reset();
+    return &found->second;
+}
+
+void ShareDebts::OweWhole(const std::string& share) {
+    Share* const owed = Changed(share);
+    if (owed != nullptr && owed->whole == Whole::kNo) {
+        owed->whole = Whole::kDue;
+    }
+}
+
+void ShareDebts::OweAllWhole() {
+    for (const auto& [name, share] : shares_) {
+        OweWhole(name);
+    }
+}
+
+void ShareDebts::OweChanges(const std::string& share) {
+    if (Share* const owed = Changed(share)) {
+        owed->fresh = true;
+    }
+}
+
+void ShareDebts::Forgive() {
+    for (auto& [name, share] : shares_) {
+        share = {};
+    }
+    sums_.reset();
+}
+
+void ShareDebts::Release() {
+    for (auto& [name, share] : shares_) {
+        share.retry.Release();
+    }
+    sums_.reset();
+}
+
+void ShareDebts::Hasten(int64_t now, int64_t gap,
+                        const std::function<bool(const std::string& share, Trouble)>& fits) {
+    for (auto& [name, share] : shares_) {
+        if (share.retry.Waiting() && fits(name, share.trouble)) {
+            share.retry.Hasten(now, gap);
+            sums_.reset();
+        }
+    }
+}
+
+const ShareDebts::Sums& ShareDebts::Summed() const {
+    if (!sums_) {
+        sums_.emplace();
+        for (const auto& [name, share] : shares_) {
+            TakeEarlier(sums_->next, share.Next());
+            if (share.retry.Waiting()) {
+                TakeEarlier(sums_->next_retry, share.retry.At());
+                if (sums_->waiting.shares++ == 0) {
+                    sums_->waiting.first = name;
+                    sums_->waiting.trouble = share.trouble;
+                }
+            }
+        }
+    }
+    return *sums_;
+}
+
+std::optional<int64_t> ShareDebts::Next() const {
+    return Summed().next;
+}
+
+std::optional<int64_t> ShareDebts::NextRetry() const {
+    return Summed().next_retry;
+}
+
+ShareDebts::Waiting ShareDebts::WhatWaits() const {
+    return Summed().waiting;
+}
+
+bool ShareDebts::AnyDue(int64_t now,
+                        const std::function<bool(const std::string& share)>& test) const {
+    return std::any_of(shares_.begin(), shares_.end(), [&](const auto& entry) {
+        return entry.second.MayTry(now) && test(entry.first);
+    });
+}
+
+std::vector<ShareDebts::Due> ShareDebts::Take(int64_t now) {
+    std::vector<Due> taken;
+    for (auto& [name, share] : shares_) {
+        if (!share.MayTry(now)) {
+            continue;
+        }
+        const bool ripe = !share.retry.Waiting() || share.retry.Due(now);
+        Due due;
+        due.share = name;
+        due.whole = share.whole == Whole::kDue || (share.whole == Whole::kFailed && ripe);
+        due.stored = share.fresh || share.failed_upto != 0;
+        due.after = due.whole || ripe ? 0 : share.failed_upto;
+        due.again = share.retry.Failures() > 0 && (ripe || due.whole);
+        due.rest_waits = !due.whole && !ripe;
+        share.fresh = false;
+        if (due.whole) {
+            share.whole = Whole::kNo;
+        }
+        if (due.again) {
+            share.failed_upto = 0;
+            share.shut = false;
+            share.retry.Release();
+        }
+        taken_[name] = due;
+        taken.push_back(std::move(due));
+    }
+    sums_.reset();
+    return taken;
+}
+
+void ShareDebts::Settle(int64_t now, const std::map<std::string, Outcome>& outcomes,
+                        const RetryDelays& delays, double chance) {
+    for (const auto& [name, due] : taken_) {
+        Share* const share = Changed(name);
+        const auto found = outcomes.find(name);
+        const Outcome outcome = found == outcomes.end() ? Outcome() : found->second;
+        if (share == nullptr) {
+            continue;
+        }
+        if (!outcome.tried) {
+            share->fresh = share->fresh || due.stored;
+            if (due.whole && share->whole == Whole::kNo) {
+                share->whole = Whole::kDue;
+            }
+        } else if (outcome.failed) {
+            if (due.whole) {
+                share->whole = Whole::kFailed;
+            }
+            share->failed_upto = std::max(share->failed_upto, outcome.last_change);
+            share->shut = outcome.reach != Reach::kPaths;
+            share->trouble = outcome.trouble;
+            // What waited already does not wait longer for what has come to it.
+            if (!share->retry.Waiting()) {
+                RetryDelays waits = delays;
+                if (outcome.trouble == Trouble::kBusy) {
+                    waits.longest = std::min(waits.longest, kLongestBusyMs);
+                }
+                share->retry.Failed(now, waits, chance);
+            }
+        } else if (!share->retry.Waiting()) {
+            share->retry.Settled();
+            share->trouble = Trouble::kNone;
+        }
+    }
+    taken_.clear();
+}
+
+}  // namespace zel_daemon

@@ -1,0 +1,115 @@
+// What one task owes its server, share by share, and when each share may be tried.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <list>
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "programs/common/task_run.h"
+#include "programs/zel_daemon/backoff.h"
+
+namespace zel_daemon {
+
+/// A share is owed as a whole, or only in stored changes, or not at all. What is owed may be tried
+/// at once, until a try fails. Then
+///
+/// - what failed waits for its next try, and a change that is stored later does not wait with it;
+/// - unless the failure was one of the whole share (its volume is away, the server refuses it):
+///   then all of it waits.
+///
+/// A failure of the whole run puts everything back as it was; when the run is tried again is not
+/// said here (see TaskPlan). Changes are told apart by their number in the store: those up to
+/// `after` have failed before.
+///
+/// Costs: Next() and Wait() look at each share only after something has changed, and at none
+/// otherwise.
+///
+/// Threads: one thread. Moments are in milliseconds on a clock that never jumps.
+class ShareDebts {
+public:
+    /// What may be tried of one share.
+    struct Due {
+        std::string share;
+        bool whole = false;
+        bool stored = false;      ///< there are changes in the store, or may be
+        uint64_t after = 0;       ///< those up to here are left out
+        bool again = false;       ///< some of it has failed before
+        bool rest_waits = false;  ///< something else of the share waits for its next try
+    };
+    /// What became of one share that was taken.
+    struct Outcome {
+        bool tried = true;  ///< false: it is owed as it was
+        bool failed = false;
+        programs::Reach reach = programs::Reach::kPaths;
+        programs::Trouble trouble = programs::Trouble::kNone;
+        uint64_t last_change = 0;  ///< the highest number of its changes that failed
+    };
+    /// What waits for its next try, for a person.
+    struct Waiting {
+        size_t shares = 0;
+        std::string first;                                     ///< one of them
+        programs::Trouble trouble = programs::Trouble::kNone;  ///< that one's
+    };
+
+    /// Forgets what is owed, and begins with these.
+    void SetShares(const std::list<std::string>& shares);
+    bool Has(const std::string& share) const { return shares_.count(share) != 0; }
+
+    void OweWhole(const std::string& share);
+    void OweAllWhole();
+    /// Changes of the share have been stored.
+    void OweChanges(const std::string& share);
+    /// Nothing is owed any more.
+    void Forgive();
+    /// Nothing waits any more: what is owed may be tried at once.
+    void Release();
+    /// What these shares failed for may be over, see Backoff. `fits` is asked for each that waits.
+    void Hasten(int64_t now, int64_t gap,
+                const std::function<bool(const std::string& share, programs::Trouble)>& fits);
+
+    /// When something may be tried; now or earlier: at once. Nothing: never, as things are.
+    std::optional<int64_t> Next() const;
+    /// When the first of what failed is tried again.
+    std::optional<int64_t> NextRetry() const;
+    Waiting WhatWaits() const;
+    /// Whether `test` holds for one of the shares that may be tried now.
+    bool AnyDue(int64_t now, const std::function<bool(const std::string& share)>& test) const;
+
+    /// A run begins with all that may be tried now, until Settle() is told how it ended.
+    std::vector<Due> Take(int64_t now);
+    /// How it ended, for each share taken; those that `outcomes` leaves out went well.
+    void Settle(int64_t now, const std::map<std::string, Outcome>& outcomes,
+                const RetryDelays& delays, double chance);
+
+private:
+    enum class Whole { kNo, kDue, kFailed };
+    struct Share {
+        Whole whole = Whole::kNo;
+        bool fresh = false;        // changes are stored that have not failed
+        uint64_t failed_upto = 0;  // those up to this number have; 0: none
+        bool shut = false;         // and keep all else from being tried
+        Backoff retry;
+        programs::Trouble trouble = programs::Trouble::kNone;
+
+        bool Owes() const { return whole != Whole::kNo || fresh || failed_upto != 0; }
+        bool MayTry(int64_t now) const;
+        std::optional<int64_t> Next() const;
+    };
+    struct Sums {
+        std::optional<int64_t> next;
+        std::optional<int64_t> next_retry;
+        Waiting waiting;
+    };
+    const Sums& Summed() const;
+    Share* Changed(const std::string& share);
+
+    std::map<std::string, Share> shares_;
+    std::map<std::string, Due> taken_;
+    mutable std::optional<Sums> sums_;  // nothing: to be made anew
+};
+
+}  // namespace zel_daemon
