@@ -35,7 +35,7 @@ struct Copies {
             const std::lock_guard<std::mutex> lock(mutex);
             sources.push_back(source);
             for (const auto& [what, fault] : bad) {
-                if (module == what || source.find(what) != std::string::npos) {
+                if (module == what || (what[0] == '/' && source.find(what) != std::string::npos)) {
                     report.cause = fault.second;
                     return fault.first;
                 }
