@@ -31,9 +31,9 @@ std::string ReadConfig(Config* config) {
     if (tarq_internal::ReadSection(path, kSection, &values) == tarq_internal::ReadResult::kFailed) {
         return "cannot read " + path;
     }
-    const std::string stray =
-        tarq_internal::FindStray(tarq_internal::ReadTextFile(path).value_or(""), kSection,
-                                 {"port", "rsync", "ssh", "ssh_options"});
+    const std::string stray = tarq_internal::FindStray(
+        tarq_internal::ReadTextFile(path).value_or(""), kSection,
+        {"port", "rsync", "ssh", "ssh_options", "answer_seconds", "dead_seconds"});
     if (!stray.empty()) {
         return path + ", " + stray;
     }

@@ -7,6 +7,7 @@
 #include <string_view>
 #include <utility>
 
+#include "platform/tarqrsync/message_keeper.h"
 #include "tarq/rsync_wrapper.h"
 
 namespace TARQ {
@@ -93,6 +94,10 @@ constexpr Clue kClues[] = {
      "the rsync daemon at {host} is configured to refuse an option of this run"},
     {"module is read only", ANYWHERE, kKeepStatus, "the module {module} at {host} is read-only"},
     {"@ERROR:", ANYWHERE, kKeepStatus, "{host} refused the run: {line}"},
+    {"connection unexpectedly closed", ANYWHERE, kKeepStatus,
+     "{host} closed the connection in the middle of the run: its rsync, or all of it, was stopped"},
+    {"Connection reset by peer", ANYWHERE, kKeepStatus,
+     "{host} broke the connection off: its rsync, or all of it, was stopped"},
     {"No space left on device", COPY, kKeepStatus, "the disk of {host} is full"},
     {"Disk quota exceeded", COPY, kKeepStatus,
      "the disk quota of the account at {host} is used up"},
@@ -118,7 +123,7 @@ constexpr ExitMeaning kExitMeanings[] = {
     {kExitFileIo, "a file could not be written or read"},
     {STATUS_PROTOCOL_STREAM, "the connection to {host} broke"},
     {kExitIpc, "rsync could not start its other half"},
-    {STATUS_CANCELLED, "rsync was ended by a signal"},
+    {STATUS_CANCELLED, "rsync was ended by a signal on this machine"},
     {kExitPartial, "not everything could be copied"},
     {kExitVanished,
      "some files vanished from the source during the run; all others were copied, and "
@@ -127,10 +132,43 @@ constexpr ExitMeaning kExitMeanings[] = {
     {kExitConnectTimeout, "{host} did not answer in time"},
 };
 
-std::string_view LineAt(std::string_view text, size_t position) {
+// What a line of the far end's may take of a sentence.
+constexpr size_t kMaxQuoted = 400;
+
+std::string LineAt(std::string_view text, size_t position) {
     const size_t before = text.rfind('\n', position);
     const size_t start = before == std::string_view::npos ? 0 : before + 1;
-    return text.substr(start, text.find('\n', position) - start);
+    const std::string_view line = text.substr(start, text.find('\n', position) - start);
+    return line.size() <= kMaxQuoted ? std::string(line)
+                                     : std::string(line.substr(0, kMaxQuoted)) + "...";
+}
+
+// What rsync says of one file begins so, behind it stands which of its halves speaks.
+constexpr std::string_view kComplaint = "rsync: [";
+
+// ": WORDS OF THE FIRST, and 12 more" for the lines of `messages` that begin with `head`; empty
+// when there is none.
+std::string Complaints(std::string_view messages, std::string_view head) {
+    std::string first;
+    size_t more = 0;
+    for (size_t at = messages.find(head); at != std::string_view::npos;
+         at = messages.find(head, at + 1)) {
+        if (at != 0 && messages[at - 1] != '\n') {
+            continue;
+        }
+        if (first.empty()) {
+            const std::string line = LineAt(messages, at);
+            const size_t words = line.find("] ");
+            first = line.substr(words == std::string::npos ? 0 : words + 2);
+        } else {
+            ++more;
+        }
+    }
+    const bool cut = messages.find(kLeftOut) != std::string_view::npos;
+    return first.empty() ? ""
+           : cut         ? ": " + first + ", and many more"
+           : more > 0    ? ": " + first + ", and " + std::to_string(more) + " more"
+                         : ": " + first;
 }
 
 bool Contains(std::string_view text, std::string_view words) {
@@ -270,11 +308,11 @@ bool IsBusySource(const RunFacts& facts) {
 
 Verdict IncompleteSource(const RunFacts& facts, RunCause cause) {
     const std::string_view messages = facts.messages;
-    const std::string_view found =
-        Contains(messages, kSourceComplaint) ? kSourceComplaint : kChangedWhileSent;
-    std::string line = (cause == RunCause::BUSY_SOURCE ? "the source changed while it was read: "
-                                                       : "the source cannot be read in full: ") +
-                       std::string(LineAt(messages, messages.find(found)));
+    const std::string which = Complaints(messages, "rsync: [sender] ");
+    std::string line =
+        (cause == RunCause::BUSY_SOURCE ? "the source changed while it was read"
+                                        : "the source cannot be read in full") +
+        (!which.empty() ? which : ": " + LineAt(messages, messages.find(kChangedWhileSent)));
     if (facts.settings.delete_missing) {
         line += "; nothing was deleted at the destination";
     }
@@ -309,10 +347,25 @@ Verdict FromWords(const RunFacts& facts, int status) {
     }
     for (const ExitMeaning& meaning : kExitMeanings) {
         if (meaning.code == status) {
-            return {status, RunCause::NONE, Fill(meaning.meaning, facts, "")};
+            const std::string which = CameToFiles(status) && status != kExitVanished
+                                          ? Complaints(messages, kComplaint)
+                                          : "";
+            return {status, RunCause::NONE, Fill(meaning.meaning, facts, "") + which};
         }
     }
     return {status, RunCause::NONE, "rsync failed with exit code " + std::to_string(status)};
+}
+
+// Whether the rsync here got a signal: it says so itself, and which half it is. The far end's says
+// the same of its own.
+bool WasEndedHere(const RunFacts& facts) {
+    const std::string_view messages = facts.messages;
+    const size_t said = messages.find("(code 20)");
+    const std::string line = said == std::string_view::npos ? "" : LineAt(messages, said);
+    const bool sender = Contains(line, "[sender") || Contains(line, "[Sender");
+    const bool started_up = Contains(line, "[client") || Contains(line, "[server");
+    return line.empty() ||
+           (started_up ? Contains(line, "[client") : sender != facts.settings.is_command);
 }
 
 }  // namespace
@@ -323,6 +376,10 @@ Verdict Judge(const RunFacts& facts) {
     }
     if (IsUnreadableSource(facts)) {
         return IncompleteSource(facts, RunCause::UNREADABLE_SOURCE);
+    }
+    if (facts.exit_code == STATUS_CANCELLED && !WasEndedHere(facts)) {
+        return {STATUS_PROTOCOL_STREAM, RunCause::NONE,
+                facts.settings.host + " ended the run: its rsync was stopped"};
     }
     // These two say all by their number: what else was written has no part in it.
     const bool plain = facts.exit_code == kExitVanished || facts.exit_code == STATUS_TIMEOUT;

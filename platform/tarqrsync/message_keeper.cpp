@@ -5,28 +5,37 @@ namespace Backup {
 
 namespace {
 
-constexpr size_t kKept = size_t{64} * 1024;
+constexpr size_t kFirst = size_t{4} * 1024;
+constexpr size_t kLast = size_t{12} * 1024;
 
 }  // namespace
 
 void MessageKeeper::Feed(std::string_view bytes) {
-    kept_ += bytes;
+    const std::string_view head = bytes.substr(0, kFirst - first_.size());
+    first_ += head;
+    last_ += bytes.substr(head.size());
     // Cut only now and then, so that much text does not cost a move of the whole for each piece.
-    if (kept_.size() > 2 * kKept) {
-        kept_.erase(0, kept_.size() - kKept);
+    if (last_.size() > 2 * kLast) {
+        last_.erase(0, last_.size() - kLast);
         cut_ = true;
     }
 }
 
 std::string MessageKeeper::Text() const {
-    size_t start = kept_.size() > kKept ? kept_.size() - kKept : 0;
+    std::string kept = first_;
+    size_t start = last_.size() > kLast ? last_.size() - kLast : 0;
     if (cut_ || start > 0) {
-        const size_t line_end = kept_.find('\n', start);
+        const size_t line_end = last_.find('\n', start);
         start = line_end == std::string::npos ? start : line_end + 1;
+        // Half a line at the end of the first part goes, unless it is all that there is.
+        const size_t whole = kept.rfind('\n');
+        kept = (whole == std::string::npos ? kept + "\n" : kept.substr(0, whole + 1)) + kLeftOut +
+               "\n";
     }
+    kept += last_.substr(start);
     std::string result;
-    for (size_t i = start; i < kept_.size(); ++i) {
-        const auto c = static_cast<unsigned char>(kept_[i]);
+    for (const char byte : kept) {
+        const auto c = static_cast<unsigned char>(byte);
         if (c == '\r') {
             continue;  // ssh ends its lines with one
         }
