@@ -1,5 +1,6 @@
 #include "programs/zel_daemon/ipc_server.h"
 
+#include <fcntl.h>
 #include <grp.h>
 #include <poll.h>
 #include <sys/socket.h>
@@ -20,6 +21,7 @@
 #include "ZEL/channel.h"
 #include "ZEL/log.h"
 #include "ZEL/stream.h"
+#include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {
 
@@ -37,6 +39,16 @@ constexpr size_t kMaxRequestBytes = 1 << 20;       // a task with thousands of p
 constexpr milliseconds kWatchEvery(200);           // a watcher hears no more often than this ...
 constexpr std::chrono::seconds kWatchAtLeast(30);  // ... and no less
 constexpr std::chrono::seconds kPeerCheck(1);      // how soon a watcher that has gone is noticed
+
+constexpr std::chrono::minutes kTellEvery(1);  // of a shortage
+
+bool IsShortage(int error) {
+    return error == EMFILE || error == ENFILE || error == ENOMEM || error == ENOBUFS;
+}
+
+base::UniqueFd SpareDescriptor() {
+    return base::UniqueFd(open("/dev/null", O_RDONLY | O_CLOEXEC));
+}
 
 // The socket file is never open to others, not even before its mode is set.
 class Umask {
@@ -283,7 +295,7 @@ private:
 
 IpcServer::IpcServer(EventLoop& loop, const std::string& path, const std::string& group,
                      Handler handler)
-    : loop_(loop), handler_(std::move(handler)), own_user_(geteuid()) {
+    : loop_(loop), handler_(std::move(handler)), own_user_(geteuid()), spare_(SpareDescriptor()) {
     {
         const Umask closed(0117);
         if (listener_.prepare(path) != 0) {
@@ -329,9 +341,36 @@ bool IpcServer::MayAsk(int fd, Peer& peer) const {
     return peer.trusted || (group_ != static_cast<gid_t>(-1) && HasGroup(fd, who, group_));
 }
 
+void IpcServer::TellShortage(int error) {
+    const auto now = steady_clock::now();
+    if (!shortage_told_ || now - *shortage_told_ > kTellEvery) {
+        shortage_told_ = now;
+        Logger::LogMsg(Logger::LEVEL_WARNING,
+                       "[WARNING] zel_daemon(%d): a connection cannot be served: %s\n", __LINE__,
+                       ReasonOf(error).c_str());
+    }
+}
+
+int IpcServer::AcceptOne() {
+    int fd = listener_.accept();
+    if (fd >= 0 || !IsShortage(errno)) {
+        return fd;
+    }
+    TellShortage(errno);
+    EndLongestWaiting();
+    fd = listener_.accept();
+    if (fd < 0 && IsShortage(errno)) {
+        // One that waited on would have the loop called again at once, for ever.
+        spare_.Reset();
+        base::UniqueFd(listener_.accept()).Reset();
+        spare_ = SpareDescriptor();
+    }
+    return fd;
+}
+
 void IpcServer::Accept() {
     SweepEnded();
-    const int fd = listener_.accept();
+    const int fd = AcceptOne();
     if (fd < 0) {
         return;
     }
@@ -350,8 +389,7 @@ void IpcServer::Accept() {
     try {
         sessions_.push_back(std::make_unique<Session>(*this, fd, allowed, peer));
     } catch (const std::system_error& error) {
-        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] zel_daemon(%d): no thread: %s\n", __LINE__,
-                       error.what());
+        TellShortage(error.code().value());
         close(fd);
     }
 }

@@ -554,6 +554,30 @@ TEST_F(DaemonTest, HostilePeersHoldUpNobody) {
     EXPECT_EQ(zel_.End(SIGTERM), 0);
 }
 
+TEST_F(DaemonTest, WithFewDescriptorsItStaysAndSaysWhichLimitToRaise) {
+    Settings("poll_seconds=\"1\"\n");
+    for (const char* few : {"24", "40"}) {  // too few for a run; for all connections
+        zel_.Start({"prlimit", std::string("--nofile=") + few + ":1000"});
+        if (few == std::string("24")) {
+            AddTask();
+        }
+        std::vector<std::unique_ptr<RawPeer>> silent;
+        for (int i = 0; i < 60; ++i) {
+            silent.push_back(std::make_unique<RawPeer>(zel_.Socket()));
+        }
+        EXPECT_EQ(zel_.Ask("task_list")["tasks"].asArray().size(), 1u);
+        EXPECT_THAT(zel_.Log(), HasSubstr("LimitNOFILE="));
+        EXPECT_LE(zel_.Log().size(), 20000u);
+        // Raised, as a unit's would be by the next start.
+        test::Run("prlimit --nofile=1000 --pid " + std::to_string(zel_.Pid()));
+        silent.clear();
+        AwaitEqual(few);
+        EXPECT_TRUE(Await([&] { return !Task().hasMember("note"); })) << Task().toString();
+        EXPECT_EQ(zel_.End(SIGTERM), 0);
+        Write("more", few);
+    }
+}
+
 TEST_F(DaemonTest, AnotherUserIsToldThatHeMayNot) {
     if (geteuid() != 0) {
         GTEST_SKIP() << "needs root to become another user";
