@@ -16,6 +16,8 @@ using TARQ::Backup::RunProgress;
 
 // A server may have moved to another address by then.
 constexpr std::chrono::minutes kOld(10);
+// What a run needs: the ends of pipes to two rsyncs, and files that are read on the way.
+constexpr unsigned int kDescriptors = 16;
 
 std::string FolderOf(const std::string& share) {
     ZEL::ShareInfo facts;
@@ -78,7 +80,10 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
     RunResult result;
     RunTotals totals;
     try {
-        result = connection_->For(plan_.order).Push(plan_.order, totals);
+        // In the middle of a run their lack would look like a volume that is not mounted, or worse.
+        const int lack = LackOfDescriptors(kDescriptors);
+        result = lack != 0 ? NothingDone(ReasonOf(lack))
+                           : connection_->For(plan_.order).Push(plan_.order, totals);
     } catch (const std::exception& error) {
         result = NothingDone(error.what());
     }

@@ -136,6 +136,13 @@ EventLoop::EventLoop() : impl_(std::make_unique<Impl>()) {
     impl_->posted_fd = UniqueFd(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
     RequireCall(impl_->posted_fd.Get(), "eventfd");
     OnReadable(impl_->posted_fd.Get(), [impl = impl_.get()] { impl->RunPosted(); });
+    // It needs a descriptor, of which there may be none when it is first set.
+    sd_event_source* timer = nullptr;
+    Require(sd_event_add_time(event, &timer, CLOCK_BOOTTIME, 0, kTimerSlackUs, Impl::OnTime,
+                              impl_.get()),
+            "sd_event_add_time");
+    impl_->timer.reset(timer);
+    Require(sd_event_source_set_enabled(timer, SD_EVENT_OFF), "sd_event_source_set_enabled");
 }
 
 EventLoop::~EventLoop() = default;
@@ -179,14 +186,6 @@ void EventLoop::OnClockSet(Task task) {
 void EventLoop::SetTimer(std::chrono::milliseconds delay, Task task) {
     impl_->timer_task = std::move(task);
     const auto microseconds = static_cast<uint64_t>(std::max<int64_t>(delay.count(), 0)) * 1000;
-    if (!impl_->timer) {
-        sd_event_source* source = nullptr;
-        Require(sd_event_add_time_relative(impl_->event.get(), &source, CLOCK_BOOTTIME,
-                                           microseconds, kTimerSlackUs, Impl::OnTime, impl_.get()),
-                "sd_event_add_time_relative");
-        impl_->timer.reset(source);
-        return;
-    }
     Require(sd_event_source_set_time_relative(impl_->timer.get(), microseconds),
             "sd_event_source_set_time_relative");
     Require(sd_event_source_set_enabled(impl_->timer.get(), SD_EVENT_ONESHOT),
@@ -195,9 +194,7 @@ void EventLoop::SetTimer(std::chrono::milliseconds delay, Task task) {
 
 void EventLoop::ClearTimer() {
     impl_->timer_task = nullptr;
-    if (impl_->timer) {
-        sd_event_source_set_enabled(impl_->timer.get(), SD_EVENT_OFF);
-    }
+    sd_event_source_set_enabled(impl_->timer.get(), SD_EVENT_OFF);
 }
 
 void EventLoop::Post(Task task) {

@@ -1,11 +1,12 @@
 #include "programs/zel_daemon/inotify.h"
 
-#include <fcntl.h>
 #include <sys/inotify.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+
+#include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {
 
@@ -32,8 +33,7 @@ int Inotify::Open() {
         return 0;
     }
     const int error = errno;
-    const bool has_descriptors = !!base::UniqueFd(open("/", O_PATH | O_CLOEXEC));
-    return error == EMFILE && has_descriptors ? EUSERS : error;
+    return error == EMFILE && LackOfDescriptors(1) == 0 ? EUSERS : error;
 }
 
 int Inotify::Watch(int folder) {

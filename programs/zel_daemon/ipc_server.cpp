@@ -299,7 +299,7 @@ IpcServer::IpcServer(EventLoop& loop, const std::string& path, const std::string
     {
         const Umask closed(0117);
         if (listener_.prepare(path) != 0) {
-            throw std::runtime_error("cannot listen at " + path + ": " + strerror(errno));
+            throw std::runtime_error("cannot listen at " + path + ": " + ReasonOf(errno));
         }
     }
     if (!group.empty()) {

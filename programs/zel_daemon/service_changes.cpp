@@ -19,9 +19,21 @@ using ZEL::Logger;
 
 // The watcher's share of the loop's time before others have their turn.
 constexpr std::chrono::milliseconds kWatcherSlice(20);
+// That a look-up of a share needs.
+constexpr unsigned int kLookUpDescriptors = 4;
 
 std::string ShownShare(const std::string& share) {
     return "share '" + programs::Printable(share) + "': ";
+}
+
+// Why a share could not be looked up.
+std::string WhyUnknown(const std::string& share) {
+    const std::string failed = ShownShare(share) + "it cannot be looked up";
+    if (const int error = LackOfDescriptors(kLookUpDescriptors)) {
+        return failed + ": " + ReasonOf(error);
+    }
+    const std::string problem = programs::ShareProblem(share);
+    return problem.empty() ? failed : problem;
 }
 
 // A path may be longer than what a person reads.
@@ -69,8 +81,7 @@ void Service::WatchShares() {
             } else if (watched_.count(share) != 0) {
                 needed[share] = watched_[share];  // a look-up that fails is no news of its folder
             } else if (task->notes.count(share) == 0) {
-                const std::string problem = programs::ShareProblem(share);
-                Note(share, problem.empty() ? ShownShare(share) + "cannot be looked up" : problem);
+                Note(share, WhyUnknown(share));
             }
         }
     }

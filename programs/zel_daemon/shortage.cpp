@@ -1,7 +1,12 @@
 #include "programs/zel_daemon/shortage.h"
 
+#include <fcntl.h>
+
 #include <cerrno>
 #include <cstring>
+#include <vector>
+
+#include "base/unique_fd.h"
 
 namespace zel_daemon {
 
@@ -19,6 +24,17 @@ std::string ReasonOf(int error) {
         default:
             return strerror(error);
     }
+}
+
+int LackOfDescriptors(unsigned int count) {
+    std::vector<base::UniqueFd> held(count);
+    for (base::UniqueFd& fd : held) {
+        fd = base::UniqueFd(open("/", O_PATH | O_CLOEXEC));
+        if (!fd) {
+            return errno;
+        }
+    }
+    return 0;
 }
 
 }  // namespace zel_daemon

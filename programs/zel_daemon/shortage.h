@@ -9,4 +9,7 @@ namespace zel_daemon {
 /// reached. EAGAIN is that of a thread or process that could not be started.
 std::string ReasonOf(int error);
 
+/// 0 when so many descriptors can be had now, else why not.
+int LackOfDescriptors(unsigned int count);
+
 }  // namespace zel_daemon
