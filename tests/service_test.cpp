@@ -476,6 +476,42 @@ TEST_F(ServiceTest, AScheduledTaskTriesAgainOnlyTheSharesThatFailed) {
     EXPECT_EQ(copies_.sources.size(), 4u);
 }
 
+TEST_F(ServiceTest, WhatHasComeBackIsTriedAtOnceButNotAllTheTime) {
+    using zel_daemon::Recovery;
+    const std::string folder = root_.Path("shares/a");
+    Add("t", "manual");
+    fs::rename(folder, folder + ".away");
+    RequestRun();
+    Pass(700);
+    const size_t tries = NewRuns().size();
+    EXPECT_GE(State("t").retry_in.value_or(0), 60);
+    EXPECT_THAT(State("t").note, HasSubstr("share 'a' waits for the volume"));
+    service_->MayHaveRecovered(Recovery::kVolume);  // of another share's
+    service_->MayHaveRecovered(Recovery::kNetwork);
+    Pass(5);
+    EXPECT_THAT(NewRuns(), IsEmpty());
+    fs::rename(folder + ".away", folder);
+    service_->MayHaveRecovered(Recovery::kVolume);
+    Pass(2);
+    EXPECT_EQ(NewRuns().size(), 1u);
+    EXPECT_EQ(State("t").last->result, ZEL::TASK_RESULT_SUCCESS);
+    EXPECT_GE(tries, 5u);
+
+    // A network that comes and goes, and a server that is not there.
+    {
+        const std::lock_guard<std::mutex> lock(copies_.mutex);
+        copies_.bad = {{"a", {12, TARQ::Backup::RunCause::NONE}}};
+    }
+    RequestRun();
+    Pass(700);
+    NewRuns();
+    for (int i = 0; i < 120; ++i) {
+        service_->MayHaveRecovered(Recovery::kNetwork);
+        Pass(1);
+    }
+    EXPECT_THAT(NewRuns().size(), AllOf(Ge(9u), Le(13u)));
+}
+
 TEST_F(ServiceTest, WithoutAThreadARunFailsAndIsMadeLater) {
     Add("t", "manual");
     {

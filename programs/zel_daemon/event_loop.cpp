@@ -102,6 +102,14 @@ struct EventLoop::Impl {
         return handlers.back();
     }
 
+    void AddIo(int fd, uint32_t events, Task task) {
+        Handler& handler = AddHandler(std::move(task));
+        sd_event_source* added = nullptr;
+        Require(sd_event_add_io(event.get(), &added, fd, events, OnIo, &handler),
+                "sd_event_add_io");
+        handler.source.reset(added);
+    }
+
     void RunPosted() {
         uint64_t count = 0;
         while (read(posted_fd.Get(), &count, sizeof count) < 0 && errno == EINTR) {
@@ -148,11 +156,11 @@ EventLoop::EventLoop() : impl_(std::make_unique<Impl>()) {
 EventLoop::~EventLoop() = default;
 
 void EventLoop::OnReadable(int fd, Task task) {
-    Impl::Handler& handler = impl_->AddHandler(std::move(task));
-    sd_event_source* source = nullptr;
-    Require(sd_event_add_io(impl_->event.get(), &source, fd, EPOLLIN, Impl::OnIo, &handler),
-            "sd_event_add_io");
-    handler.source.reset(source);
+    impl_->AddIo(fd, EPOLLIN, std::move(task));
+}
+
+void EventLoop::OnUrgent(int fd, Task task) {
+    impl_->AddIo(fd, EPOLLPRI, std::move(task));
 }
 
 void EventLoop::OnSignal(int number, Task task) {

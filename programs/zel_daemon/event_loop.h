@@ -22,6 +22,8 @@ public:
 
     /// Calls `task` whenever `fd` can be read, for the life of the loop.
     void OnReadable(int fd, Task task);
+    /// The same, whenever it has urgent data (POLLPRI).
+    void OnUrgent(int fd, Task task);
     /// Calls `task` for each of these signals, which the process no longer takes otherwise. Before
     /// any thread is started.
     void OnSignal(int number, Task task);

@@ -20,6 +20,7 @@
 #include "programs/zel_daemon/daemon_config.h"
 #include "programs/zel_daemon/event_loop.h"
 #include "programs/zel_daemon/ipc_server.h"
+#include "programs/zel_daemon/recovery_watch.h"
 #include "programs/zel_daemon/requests.h"
 #include "programs/zel_daemon/service.h"
 #include "programs/zel_daemon/store.h"
@@ -148,6 +149,7 @@ void Serve(const Options& options) {
             error = std::string(wrong.what()) + "; the configuration stays as it was";
         }
         service.Refresh();
+        service.MayHaveRecovered(Recovery::kSettings);
         return error;
     };
     Requests requests(service, reload, store_path);
@@ -164,6 +166,24 @@ void Serve(const Options& options) {
         loop.OnReadable(zone.Fd(), [&] {
             if (zone.Changed()) {
                 service.Refresh();
+            }
+        });
+    }
+    RecoveryWatch recovery;
+    if (recovery.MountsFd() >= 0) {
+        loop.OnUrgent(recovery.MountsFd(), [&] { service.MayHaveRecovered(Recovery::kVolume); });
+    }
+    if (recovery.NetworkFd() >= 0) {
+        loop.OnReadable(recovery.NetworkFd(), [&] {
+            if (recovery.NetworkChanged()) {
+                service.MayHaveRecovered(Recovery::kNetwork);
+            }
+        });
+    }
+    if (recovery.SettingsFd() >= 0) {
+        loop.OnReadable(recovery.SettingsFd(), [&] {
+            if (recovery.SettingsChanged()) {
+                service.MayHaveRecovered(Recovery::kSettings);
             }
         });
     }

@@ -6,12 +6,14 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 
 #include "programs/zel_daemon/active_run.h"
 #include "programs/zel_daemon/change_set.h"
 #include "programs/zel_daemon/daemon_config.h"
 #include "programs/zel_daemon/event_loop.h"
+#include "programs/zel_daemon/recovery_watch.h"
 #include "programs/zel_daemon/share_debts.h"
 #include "programs/zel_daemon/store.h"
 #include "programs/zel_daemon/task_plan.h"
@@ -60,6 +62,10 @@ public:
     void SetConfig(const DaemonConfig& config);
     /// Shares may lie elsewhere now, the clock or the time zone may have been changed.
     void Refresh();
+
+    /// What waits for its next try because of something of this kind is tried soon: once in a
+    /// while, however often this is called.
+    void MayHaveRecovered(Recovery what);
 
     /// Stores a new task and gives it its id.
     const TaskRecord& Add(TaskRecord record);
@@ -114,6 +120,7 @@ private:
     void EndRun(Task& task, const programs::RunResult& result, const programs::RunTotals& totals);
     void Settle(Task& task, const RunPlan& plan, const programs::RunResult& result);
     void PutBack(Task& task);
+    void HastenRetries();
     void StoreEnd(Task& task);
     void StoreFailed(Task& task, const StoreError& error);
     RetryDelays Delays() const;
@@ -131,6 +138,8 @@ private:
     std::map<std::string, std::string> watched_;  // shares and their folders
     bool watcher_heard_ = false;                  // the loop calls when it can be read
     bool watcher_posted_ = false;                 // folders are left to search
+    std::set<Recovery> recovered_;
+    int64_t look_at_ = 0;  // when to look what has recovered; while there is something in it
     std::map<uint64_t, std::unique_ptr<Task>> tasks_;
     std::map<std::string, Task*> by_name_;
 };

@@ -23,6 +23,8 @@ constexpr int64_t kStoreRetryMs = 10000;
 constexpr int64_t kLongestWaitMs = int64_t{24} * 3600 * 1000;
 // What failed and changes again is tried so often at most.
 constexpr int64_t kChangedAgainMs = 60000;
+// After a sign that something has come back.
+constexpr int64_t kSettleMs = 1000;
 
 std::vector<uint64_t> IdsOf(const std::vector<ZEL::Event>& events) {
     std::vector<uint64_t> ids;
@@ -38,6 +40,9 @@ std::vector<uint64_t> IdsOf(const std::vector<ZEL::Event>& events) {
 // Takes every step that is due, and sleeps until the next one is. Called after whatever happened.
 void Service::Advance() {
     const int64_t now = clock_.Elapsed();
+    if (!recovered_.empty() && now >= look_at_) {
+        HastenRetries();
+    }
     std::vector<std::pair<Task*, Due>> due;
     for (const auto& [id, task] : tasks_) {
         try {
@@ -287,6 +292,41 @@ void Service::Settle(Task& task, const RunPlan& plan, const RunResult& result) {
     }
 }
 
+void Service::MayHaveRecovered(Recovery what) {
+    // One change seldom comes alone: an address is there before the way to the server is.
+    if (recovered_.empty()) {
+        look_at_ = clock_.Elapsed() + kSettleMs;
+    }
+    recovered_.insert(what);
+    Advance();
+}
+
+// What failed for want of what may be there now does not wait any longer. A server that many ask
+// because the network comes and goes is spared: between two tries lies the first wait.
+void Service::HastenRetries() {
+    const bool volume = recovered_.count(Recovery::kVolume) != 0;
+    const bool network = recovered_.count(Recovery::kNetwork) != 0;
+    const bool settings = recovered_.count(Recovery::kSettings) != 0;
+    recovered_.clear();
+    const int64_t now = clock_.Elapsed();
+    const int64_t gap = config_.retry_first.count();
+    if (settings || volume) {
+        WatchShares();
+    }
+    for (const auto& [id, task] : tasks_) {
+        if ((network || settings) && !task->active && task->plan->RetryWaiting()) {
+            task->connection.reset();
+            task->plan->Hasten(gap);
+        }
+        task->debts.Hasten(now, gap, [&](const std::string& share, programs::Trouble trouble) {
+            if (trouble == programs::Trouble::kLocal) {
+                return (volume || settings) && programs::ShareProblem(share).empty();
+            }
+            return settings || (network && trouble == programs::Trouble::kFailed);
+        });
+    }
+}
+
 // A run that could not begin: all that was taken for it is owed as it was.
 void Service::PutBack(Task& task) {
     std::map<std::string, ShareDebts::Outcome> outcomes;
@@ -374,7 +414,7 @@ std::optional<int64_t> Service::UntilRetry(const Task& task) const {
 // What a person is told that the next try waits for.
 std::string Service::WaitsFor(const Task& task) {
     if (task.plan->RetryWaiting()) {
-        return "waits for its server";
+        return "waits for its server; tried at once when the network changes";
     }
     const ShareDebts::Waiting waiting = task.debts.WhatWaits();
     if (waiting.shares == 0) {
@@ -388,7 +428,7 @@ std::string Service::WaitsFor(const Task& task) {
     }
     switch (waiting.trouble) {
         case programs::Trouble::kLocal:
-            return words + " for the volume or folder to be there";
+            return words + " for the volume or folder; tried at once when it is there";
         case programs::Trouble::kRefused:
             return words + " for the server to take it";
         case programs::Trouble::kBusy:
@@ -400,6 +440,9 @@ std::string Service::WaitsFor(const Task& task) {
 
 void Service::SetAlarm() {
     std::optional<int64_t> wait;
+    if (!recovered_.empty()) {
+        wait = std::max<int64_t>(look_at_ - clock_.Elapsed(), 0);
+    }
     for (const auto& [id, task] : tasks_) {
         if (const auto left = UntilNextStep(*task)) {
             wait = std::min(wait.value_or(*left), *left);
