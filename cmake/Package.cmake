@@ -25,11 +25,15 @@ set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS_PRIVATE_DIRS ${CMAKE_LIBRARY_OUTPUT_DIRECTORY})
 set(CPACK_DEBIAN_PACKAGE_CONTROL_STRICT_PERMISSION ON)
-# The packages of one build belong together.
-set(CPACK_DEBIAN_ENABLE_COMPONENT_DEPENDS ON)
-set(CPACK_COMPONENT_LIBZEL-DEV_DEPENDS libzel)
-set(CPACK_COMPONENT_ZEL-CLIENT_DEPENDS libzel)
-set(CPACK_COMPONENT_ZEL-SERVER_DEPENDS libzel)
+# The packages of one build belong together. No other library is there when programs are unpacked, and none comes while
+# other programs are there: whoever upgrades one package alone is refused before anything has changed.
+set(CPACK_DEBIAN_LIBZEL_PACKAGE_BREAKS)
+foreach(name libzel-dev zel-client zel-server)
+    list(APPEND CPACK_DEBIAN_LIBZEL_PACKAGE_BREAKS "${name} (<< ${PROJECT_VERSION})" "${name} (>> ${PROJECT_VERSION})")
+    string(TOUPPER ${name} key)
+    set(CPACK_DEBIAN_${key}_PACKAGE_PREDEPENDS "libzel (= ${PROJECT_VERSION})")
+endforeach()
+list(JOIN CPACK_DEBIAN_LIBZEL_PACKAGE_BREAKS ", " CPACK_DEBIAN_LIBZEL_PACKAGE_BREAKS)
 
 # debian_package(name section summary text): what dpkg tells of it, and the papers that each package carries.
 set(papers ${CMAKE_BINARY_DIR}/packaging)
@@ -48,6 +52,12 @@ function(debian_package name section summary text)
             RENAME ${name} COMPONENT ${name} EXCLUDE_FROM_ALL)
     endif()
 endfunction()
+
+# The documentation, with its links from one text to another.
+file(GLOB texts CONFIGURE_DEPENDS ${PROJECT_SOURCE_DIR}/docs/*.md)
+foreach(name zel-client zel-server libzel-dev)
+    install(FILES ${texts} DESTINATION ${CMAKE_INSTALL_DATADIR}/doc/${name} COMPONENT ${name} EXCLUDE_FROM_ALL)
+endforeach()
 
 # package_unit(name unit): the maintainer scripts of a package with this unit. What its purge removes beside is in
 # packaging/debian/<name>.purge.
