@@ -130,6 +130,29 @@ TEST(TaskRow, TravelsWholeAndNoTextBreaksOut) {
     }
 }
 
+TEST(TaskRow, AListFitsItsTerminal) {
+    programs::TaskRow row;
+    row.name = "a task with \xc3\xa4 long name";
+    row.shares = "one,two,three,four";
+    row.server = "nas.example.org";
+    row.schedule = "weekly mon,thu 02:30, 3 more every 1h30m";
+    row.status = 2;
+    row.result = 2;
+    row.last_end = 1000;
+    row.next_run = 4000000000;
+    row.error = "cannot use server nas.example.org: " + std::string(100, 'x');
+    for (const size_t width : {200U, 120U, 80U, 60U}) {
+        const auto lines = programs::TaskLines({row}, width);
+        ASSERT_EQ(lines.size(), 3U);
+        for (const std::string& line : lines) {
+            EXPECT_EQ(zelctl::CutToColumns(line, width), line);
+        }
+        EXPECT_THAT(lines[1], HasSubstr("failed 1970-01-01  2096-10-02"));
+        EXPECT_THAT(lines[2], testing::StartsWith("  ! cannot use server nas.example.org: xx"));
+    }
+    EXPECT_THAT(programs::TaskLines({row}, 0)[2], testing::EndsWith(row.error));
+}
+
 TEST(Text, WhatATerminalObeysIsShownInstead) {
     EXPECT_EQ(programs::Printable("a\033[2J\xc2\x9b\x7f"), "a\\033[2J\\302\x9b\\177");
     const std::string plain = "\xc3\xa4 \xe2\x82\xac \xc2\xa0";
@@ -183,7 +206,7 @@ constexpr char kSamba[] =
     "# Global parameters\r\n[global]\n\tworkgroup = X\n\tpath = /no\n\n"
     "[homes]\n\tbrowseable = No\n[printers]\n\tprintable = Yes\n[print$]\n\tpath = /drivers\n"
     "[HP]\n\tpath = /spool\n\tprint ok = yes\n"
-    "no section\n[Photos of us]\n\tcomment = a = b; [x]\n\tpath = /srv/photos  \n"
+    "no section\n[Photos of us]\n\tcomment = a = b; [x]\n\tpath = \"/srv/my photos\"  \n"
     "[user]\n\tpath = /home/%U\n[off]\n\tavailable = No\n\tPath = /srv\n[nothing]\n[rel]\npath=x\n"
     "[]\npath = /y\n[open\npath = /z";
 
@@ -192,7 +215,7 @@ TEST(Samba, SharesAreFoundAmongAllElse) {
     for (const zelctl::SambaShare& share : zelctl::ParseSambaShares(kSamba)) {
         found.push_back(share.name + "|" + share.path + "|" + share.refusal.substr(0, 12));
     }
-    EXPECT_THAT(found, ElementsAre("Photos of us|/srv/photos|", "user|/home/%U|its folder /",
+    EXPECT_THAT(found, ElementsAre("Photos of us|/srv/my photos|", "user|/home/%U|its folder /",
                                    "off|/srv|Samba has it", "nothing||it names no ",
                                    HasSubstr("rel|x|its")));
 }
@@ -311,8 +334,9 @@ protected:
         return test::Zelctl(root_.Path(), arguments, input);
     }
     Outcome Add(const std::string& more) const {
-        return Run("task add nightly --share docs --server nas2 --user alice --password-file " +
-                   root_.Path("password") + " " + more);
+        return Run(
+            "task add nightly --no-check --share docs --server nas2 --user alice --password-file " +
+            root_.Path("password") + " " + more);
     }
 
     const test::TempRoot root_;
@@ -357,7 +381,7 @@ TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
                     "--exclude '*.tmp' --exclude 'a b'")
                     .output,
                 AllOf(HasSubstr("'nightly' is added: daily 08:00, 3 more every 2h"),
-                      testing::ContainsRegex("(20[0-9-]* [01][0-9]:00:00 .*\n){3}"),
+                      testing::ContainsRegex("(20[0-9-]* [01][0-9]:00:00\n){3}"),
                       Not(HasSubstr("secret"))));
     EXPECT_THAT(
         daemon.Requests(),
@@ -398,10 +422,20 @@ TEST_F(Zelctl, EditSendsOnlyWhatChanges) {
                             HasSubstr("task_show"), HasSubstr("task_show")));
 }
 
+TEST_F(Zelctl, AShareThatTasksSendIsNotRemovedUnasked) {
+    FakeDaemon daemon(root_.Path(), [](const PObject&) {
+        return TasksReply({SomeTask("nightly", "docs"), SomeTask("other")});
+    });
+    EXPECT_THAT(Run("share rm docs"), Ended(3, "sent by task nightly:"));
+    EXPECT_THAT(Run("share list").output, HasSubstr("docs"));
+    EXPECT_THAT(Run("share rm docs --force"), Ended(0));
+}
+
 TEST_F(Zelctl, ErrorRepliesBecomeWordsAndExitCodes) {
     PObject reply;
     FakeDaemon daemon(root_.Path(), [&](const PObject&) { return reply; });
-    for (const auto& [code, exit_code] : {std::pair{-4, 2}, {-8, 3}, {-11, 3}, {-19, 3}, {-3, 3}}) {
+    for (const auto& [code, exit_code] :
+         {std::pair{-4, 2}, {-8, 3}, {-11, 3}, {-17, 3}, {-19, 3}, {-3, 3}}) {
         reply = PObject::Map{{"result", code}, {"error", "no task \033[31m'x'"}};
         EXPECT_THAT(Run("task rm x"), Ended(exit_code, "zelctl: no task \\033[31m'x'\n")) << code;
     }
@@ -414,6 +448,7 @@ TEST_F(Zelctl, ListsAreReadAsRowsOrAsMapsAndNothingInThemReachesTheTerminal) {
     FakeDaemon daemon(root_.Path(), [&](const PObject& request) {
         PObject task = Brief("bad\033]0;x\007", 0, 2, 4);
         task["note"] = "disk\033 full";
+        task["last_error"] = "no disk";
         if (!request.hasMember("rows")) {
             return TasksReply({task});
         }
@@ -428,9 +463,10 @@ TEST_F(Zelctl, ListsAreReadAsRowsOrAsMapsAndNothingInThemReachesTheTerminal) {
     EXPECT_THAT(Run("task list").output,
                 AllOf(HasSubstr("NAME"), HasSubstr("in rows  "), Not(HasSubstr("\302\233"))));
     knows_rows = false;
-    EXPECT_THAT(Run("task list").output,
-                AllOf(HasSubstr("bad\\033]0;x\\007  "), HasSubstr("daily 02:30"),
-                      HasSubstr("failed"), HasSubstr("disk\\033 full"), Not(HasSubstr("\033"))));
+    EXPECT_THAT(
+        Run("task list").output,
+        AllOf(HasSubstr("bad\\033]0;x\\007  "), HasSubstr("daily 02:30"), HasSubstr("failed"),
+              HasSubstr("\n  ! no disk\n  ! disk\\033 full\n"), Not(HasSubstr("\033"))));
     EXPECT_THAT(daemon.Requests(),
                 ElementsAre(HasSubstr("rows"), HasSubstr("rows"), HasSubstr("brief")));
     EXPECT_EQ(nlohmann::json::parse(Run("task list --json").output)[0]["name"], "bad\033]0;x\007");
@@ -608,9 +644,37 @@ TEST(QuickList, TakesAWholeReplyAndNothingLess) {
 
 // ---- With a real server ----
 
-class TaskDryRun : public testing::Test, public test::ClientAndServer {};
+class RealServer : public testing::Test, public test::ClientAndServer {};
 
-TEST_F(TaskDryRun, ListsWhatTheTaskWouldSend) {
+TEST_F(RealServer, TheServerIsAskedBeforeATaskIsAddedAndByTheDoctor) {
+    PObject added;
+    FakeDaemon daemon(folder_.Path("client"), [&](const PObject& request) {
+        if (request["command"].asString() == "task_list") {
+            PObject wrong = added;
+            wrong["name"] = "wrong";
+            wrong["pswd"] = "other";
+            return TasksReply({added, wrong});
+        }
+        if (request["command"].asString() == "task_add") {
+            added = request;
+        }
+        return Success({{"task", request}, {"protocol", 1}});
+    });
+    const std::string add =
+        "task add t --share docs -u alice --manual --password-file - -s 127.0.0.1";
+    EXPECT_THAT(Client(add, "wrong\n"), Ended(4, "refused the login"));
+    EXPECT_THAT(daemon.Requests(), testing::IsEmpty());
+    EXPECT_THAT(Client(add, "secret\n"), Ended(0, "takes the account and the shares"));
+    const Outcome doctor = Client("doctor");
+    EXPECT_THAT(doctor.output,
+                AllOf(testing::ContainsRegex("ok +task t: .*the server takes it"),
+                      testing::ContainsRegex("failed +task wrong: .*refused the login")));
+    EXPECT_THAT(Client("push docs -s 127.0.0.1 -u alice --password-file -", "wrong\n"), Ended(4));
+    StopServer();
+    EXPECT_THAT(Client(add, "secret\n"), Ended(0, "the task is added all the same"));
+}
+
+TEST_F(RealServer, ListsWhatTheTaskWouldSend) {
     test::Must(Client("push docs -s 127.0.0.1 -u alice --password-file - -q", "secret\n"));
     Write("new", "n");
     Write("left.tmp", "n");
@@ -671,11 +735,15 @@ TEST_F(Zelctl, SambaSharesAreTakenOverOnce) {
     root_.Write("photos/file", "x");
     const std::string config = root_.Write(
         "smb.conf", "[global]\nworkgroup = X\n[Photos]\npath = " + root_.Path("photos") +
-                        "\n[docs]\npath = " + root_.Path("source") + "\n[gone]\npath = /no/such\n");
+                        "\n[docs]\npath = " + root_.Path("source") +
+                        "\n[gone]\npath = /no/such\n[again]\npath = " + root_.Path("photos") +
+                        "\n");
     const std::string import = "share import --samba --config ";
-    EXPECT_THAT(Run(import + config + " -n").output,
-                AllOf(HasSubstr("'Photos' would be"), HasSubstr("'docs' is in"),
-                      HasSubstr("'gone' is left out")));
+    EXPECT_THAT(
+        Run(import + config + " -n").output,
+        AllOf(HasSubstr("'Photos' would be /"), HasSubstr("'docs' is in"),
+              HasSubstr("'gone' would be left out"), HasSubstr("'again' would be left out: ")));
+    EXPECT_THAT(Run("share list").output, Not(HasSubstr("Photos"))) << "nothing was done";
     EXPECT_EQ(Run(import + config + " photos").exit_code, 0);
     EXPECT_THAT(test::ReadFile(root_.Path("usr/tarq/etc/tarqshare.conf")), HasSubstr("[Photos]"));
     EXPECT_THAT(Run("share list").output, Not(HasSubstr("gone")));
@@ -686,6 +754,11 @@ TEST_F(Zelctl, TheDoctorFindsWhatIsWrongAndHowToMendIt) {
     const int port = test::FreePort();
     FakeDaemon daemon(root_.Path(), [&](const PObject&) {
         PObject task = SomeTask("nightly");
+        task["sync_result"] = 2;
+        task["last_error"] = "no disk";
+        task["watched_folders"] = 0;
+        task["watch_complete"] = 0;
+        task["watch_problem"] = "not permitted";
         task["share_list"].asArray().emplace_back("docs");
         task["server_name"] = "";
         task["server_ip"] = "127.0.0.1";
@@ -696,12 +769,14 @@ TEST_F(Zelctl, TheDoctorFindsWhatIsWrongAndHowToMendIt) {
         reply["store"] = root_.Write("store/tasks.db", "");
         return reply;
     });
+    root_.Write("usr/tarq/etc/zel_daemon.conf", "[daemon]\nworkers=\"99\"\n");
+    root_.Write("usr/tarq/etc/tarqrsync.conf", "[rsync]\nport=\"no\"\n");
     chmod(root_.Path("usr/tarq/etc/tarqshare.conf").c_str(), 0666);
     const Outcome outcome = Run("doctor --json");
     EXPECT_EQ(outcome.exit_code, 3);
     std::map<std::string, std::string> found;
     for (const auto& check : nlohmann::json::parse(outcome.output)) {
-        found[check["name"]] =
+        found[check["name"]] +=
             check["verdict"].get<std::string>() + ": " + check["finding"].get<std::string>();
         EXPECT_EQ(check["verdict"] == "ok", check["remedy"] == "") << check;
     }
@@ -710,6 +785,12 @@ TEST_F(Zelctl, TheDoctorFindsWhatIsWrongAndHowToMendIt) {
     EXPECT_THAT(found["share b"], HasSubstr("failed: "));
     EXPECT_THAT(found["file " + root_.Path("usr/tarq/etc/tarqshare.conf")], HasSubstr("0666"));
     EXPECT_THAT(found["file " + root_.Path("store/tasks.db")], HasSubstr("holds secrets"));
+    EXPECT_THAT(found["task nightly"],
+                AllOf(HasSubstr("failed: nothing of it is watched: not permitted"),
+                      HasSubstr("failed: its last run failed at "), HasSubstr("no disk")));
+    EXPECT_THAT(found["configuration"],
+                AllOf(HasSubstr("workers is '99'"), HasSubstr("port is 'no'")));
+    EXPECT_THAT(found["store"], HasSubstr("is empty"));
     EXPECT_THAT(found["watches"], HasSubstr("7 folders watched"));
     EXPECT_THAT(found["unit zel_daemon"], HasSubstr("failed: it is not installed"));
     EXPECT_THAT(found["server 127.0.0.1, port " + std::to_string(port)], HasSubstr("refused"));

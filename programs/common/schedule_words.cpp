@@ -292,6 +292,29 @@ std::string DescribeSchedule(const ZEL::Schedule& schedule) {
     return text;
 }
 
+std::string DescribeMissingDay(const ZEL::Schedule& schedule) {
+    const long day = schedule.GetBeginDay();
+    if (schedule.GetMode() == ZEL::SCHD_MODE_YEARLY && schedule.GetBeginMonth() == 2 && day == 29) {
+        // Each run is reckoned from the one before, which was in March.
+        return "It runs on March 1; on February 29 only in a leap year in which it was set before "
+               "that day.";
+    }
+    if (schedule.GetMode() != ZEL::SCHD_MODE_MONTHLY) {
+        return "";
+    }
+    switch (day) {
+        case 29:
+            return "For a February without day 29 it runs on March 1.";
+        case 30:
+            return "For February it runs on March 2, in a leap year on March 1.";
+        case 31:
+            return "For a month of 30 days it runs on the 1st of the next one; for February on "
+                   "March 3, in a leap year on March 2.";
+        default:
+            return "";
+    }
+}
+
 std::optional<CalendarDate> ParseDate(const std::string& text) {
     const std::vector<int> date = Numbers(text, '-', {4, 2, 2});
     if (date.empty() || !IsDate(date[0], date[1], date[2])) {

@@ -30,6 +30,9 @@ std::string ApplyWords(const ScheduleWords& words, ZEL::Schedule& schedule);
 /// The reverse, for a person.
 std::string DescribeSchedule(const ZEL::Schedule& schedule);
 
+/// When it runs in a month or year without its day; empty when each has it.
+std::string DescribeMissingDay(const ZEL::Schedule& schedule);
+
 struct CalendarDate {
     int year;
     int month;  ///< 1 to 12

@@ -1,8 +1,11 @@
 #include "programs/common/task_row.h"
 
 #include <charconv>
+#include <ctime>
+#include <iterator>
 #include <utility>
 
+#include "programs/common/table.h"
 #include "programs/common/text.h"
 
 namespace programs {
@@ -12,7 +15,7 @@ namespace {
 constexpr char kSeparator = '\x1f';
 // Texts are cut so that the whole stays below what a string may have on the wire; the numbers take
 // less than 200 bytes.
-constexpr size_t kMaxText = 12000;
+constexpr size_t kMaxText = 9000;
 
 // ZEL::TASK_STATUS and ZEL::TASK_RESULT, by number.
 constexpr const char* kStatusWords[] = {"idle", "waiting", "running", "paused"};
@@ -38,6 +41,7 @@ void EachField(Row& row, Visit& visit) {
     visit(row.progress);
     visit(row.pending);
     visit(row.note);
+    visit(row.error);
 }
 
 /// Puts a row together, field after field.
@@ -151,25 +155,44 @@ std::string TaskLastRunWords(const TaskRow& row) {
     return words;
 }
 
-Table NewTaskTable() {
-    return Table(
-        {"NAME", "SHARES", "SERVER", "SCHEDULE", "STATE", "LAST RUN", "NEXT RUN", "PENDING"});
-}
-
-void AddTaskRow(TaskRow row, Table& table) {
-    std::vector<std::string> cells;
-    cells.reserve(8);
-    std::string state = TaskStateWords(row);
-    std::string last_run = TaskLastRunWords(row);
-    cells.push_back(std::move(row.name));
-    cells.push_back(std::move(row.shares));
-    cells.push_back(std::move(row.server));
-    cells.push_back(std::move(row.schedule));
-    cells.push_back(std::move(state));
-    cells.push_back(std::move(last_run));
-    cells.push_back(row.next_run ? HumanTime(*row.next_run) : "-");
-    cells.push_back(std::to_string(row.pending));
-    table.Add(std::move(cells));
+std::vector<std::string> TaskLines(std::vector<TaskRow> rows, size_t width) {
+    const int64_t now = time(nullptr);
+    Table table({{"NAME", 8},
+                 {"SHARES", 8, 3},
+                 {"SERVER", 8, 2},
+                 {"SCHEDULE", 12, 1},
+                 {"STATE", 12},
+                 "LAST RUN",
+                 "NEXT RUN",
+                 "PENDING"});
+    table.Reserve(rows.size());
+    std::vector<std::vector<std::string>> remarks;
+    remarks.reserve(rows.size());
+    for (TaskRow& row : rows) {
+        std::vector<std::string>& told = remarks.emplace_back();
+        for (const std::string& remark : {row.error, row.note}) {
+            if (!remark.empty()) {
+                const std::string line = "  ! " + Printable(remark);
+                told.push_back(width == 0 ? line : CutTo(line, width));
+            }
+        }
+        std::string state = TaskStateWords(row);
+        std::string last_run = TaskResultWord(row.result);
+        if (row.last_end) {
+            last_run += " " + BriefTime(*row.last_end, now);
+        }
+        table.Add({std::move(row.name), std::move(row.shares), std::move(row.server),
+                   std::move(row.schedule), std::move(state), std::move(last_run),
+                   row.next_run ? BriefTime(*row.next_run, now) : "-",
+                   std::to_string(row.pending)});
+    }
+    std::vector<std::string> table_lines = table.Lines(width);
+    std::vector<std::string> lines = {std::move(table_lines.front())};
+    for (size_t i = 0; i < remarks.size(); ++i) {
+        lines.push_back(std::move(table_lines[i + 1]));
+        std::move(remarks[i].begin(), remarks[i].end(), std::back_inserter(lines));
+    }
+    return lines;
 }
 
 }  // namespace programs

@@ -5,8 +5,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
-
-#include "programs/common/table.h"
+#include <vector>
 
 namespace programs {
 
@@ -23,6 +22,7 @@ struct TaskRow {
     std::string progress;              ///< of the run that is under way, in words
     uint64_t pending = 0;              ///< changes
     std::string note;                  ///< empty when all is well
+    std::string error;                 ///< why the last run failed; empty when it did not
 };
 
 /// The row as one string of less than 65536 bytes, as docs/daemon-protocol.md has it: its control
@@ -42,8 +42,8 @@ std::string TaskStateWords(const TaskRow& row);
 /// "done 2026-11-21 08:30:00"
 std::string TaskLastRunWords(const TaskRow& row);
 
-/// The table of tasks, without rows.
-Table NewTaskTable();
-void AddTaskRow(TaskRow row, Table& table);
+/// The list of tasks, without line ends: a table whose lines have at most `width` columns (0: no
+/// limit), and below the row of a task what a person should know of it.
+std::vector<std::string> TaskLines(std::vector<TaskRow> rows, size_t width);
 
 }  // namespace programs

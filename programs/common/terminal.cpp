@@ -92,13 +92,21 @@ std::optional<std::string> ReadPassword(const std::string& file, const std::stri
 
 std::optional<std::string> ReadNewPassword(const std::string& file, const std::string& prompt,
                                            std::string& error) {
-    const auto password = ReadPassword(file, prompt, error);
-    std::string again;
-    if (password && file.empty() && (!TypeAtTerminal("Once more: ", again) || again != *password)) {
-        error = "the two passwords are not the same";
-        return std::nullopt;
+    for (;;) {
+        auto password = ReadPassword(file, prompt, error);
+        if (!password || !file.empty()) {
+            return password;
+        }
+        std::string again;
+        if (!TypeAtTerminal("Once more: ", again)) {
+            error = "the password was not typed a second time";
+            return std::nullopt;
+        }
+        if (again == *password) {
+            return password;
+        }
+        std::fputs("The two are not the same; again.\n", stderr);
     }
-    return password;
 }
 
 bool Confirm(const std::string& question) {

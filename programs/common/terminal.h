@@ -11,7 +11,8 @@ namespace programs {
 std::optional<std::string> ReadPassword(const std::string& file, const std::string& prompt,
                                         std::string& error);
 
-/// The same for a password that is set here: one that is typed is asked for twice.
+/// The same for a password that is set here: one that is typed is asked for twice, until both are
+/// the same.
 std::optional<std::string> ReadNewPassword(const std::string& file, const std::string& prompt,
                                            std::string& error);
 

@@ -83,6 +83,21 @@ std::string HumanTime(int64_t seconds_since_epoch) {
     return text;
 }
 
+std::string BriefTime(int64_t seconds_since_epoch, int64_t now) {
+    constexpr int64_t kHalfYear = int64_t{182} * 86400;
+    const std::string whole = HumanTime(seconds_since_epoch);
+    const size_t day = whole.find(' ');
+    if (day == std::string::npos || day < 6) {
+        return whole;
+    }
+    if (HumanTime(now).compare(0, day, whole, 0, day) == 0) {
+        return whole.substr(day + 1, 5);
+    }
+    return seconds_since_epoch > now - kHalfYear && seconds_since_epoch < now + kHalfYear
+               ? whole.substr(day - 5, 11)
+               : whole.substr(0, day);
+}
+
 bool IsPrintable(const std::string& text) {
     for (size_t i = 0; i < text.size(); ++i) {
         if (IsControl(text, i)) {

@@ -24,6 +24,10 @@ std::string Count(uint64_t count, const std::string& noun);
 /// A local date and time, "2026-11-21 08:30:00".
 std::string HumanTime(int64_t seconds_since_epoch);
 
+/// The same in few columns: "08:30" on the day of `now`, "11-21 08:30" within half a year of it,
+/// and "2027-11-21" otherwise.
+std::string BriefTime(int64_t seconds_since_epoch, int64_t now);
+
 /// `text` with control characters, the eight-bit ones included, written as \ooo: safe on a
 /// terminal.
 std::string Printable(const std::string& text);

@@ -16,6 +16,7 @@
 #include "base/unique_fd.h"
 #include "programs/common/help.h"
 #include "programs/common/task_run.h"
+#include "programs/common/text.h"
 #include "programs/zel_daemon/background.h"
 #include "programs/zel_daemon/daemon_config.h"
 #include "programs/zel_daemon/event_loop.h"
@@ -196,8 +197,8 @@ void Serve(const Options& options) {
         background->Ready();
     }
     sd_notify(0, "READY=1");
-    Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] zel_daemon(%d): ready, %zu tasks\n", __LINE__,
-                   service.Stats().tasks);
+    Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] zel_daemon(%d): ready, %s\n", __LINE__,
+                   programs::Count(service.Stats().tasks, "task").c_str());
     loop.Run();
     sd_notify(0, "STOPPING=1");
     Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] zel_daemon(%d): stopping\n", __LINE__);

@@ -29,9 +29,24 @@ constexpr unsigned int kLogLimit = 20;
 // Keys of a task that are the daemon's own: an exported task has them, and they are passed over.
 const std::set<std::string>& StateKeys() {
     static const std::set<std::string> keys = [] {
-        std::set<std::string> all = {
-            "id",   "schedule", "status",   "sync_result", "next_run", "retry_in",    "pending",
-            "note", "run",      "last_run", "last_start",  "last_end", "last_status", "last_error"};
+        std::set<std::string> all = {"id",
+                                     "schedule",
+                                     "status",
+                                     "sync_result",
+                                     "next_run",
+                                     "retry_in",
+                                     "pending",
+                                     "note",
+                                     "run",
+                                     "last_run",
+                                     "last_start",
+                                     "last_end",
+                                     "last_status",
+                                     "last_error",
+                                     "watched_folders",
+                                     "watch_searching",
+                                     "watch_complete",
+                                     "watch_problem"};
         all.insert(programs::ProgressKeys().begin(), programs::ProgressKeys().end());
         return all;
     }();
@@ -326,6 +341,10 @@ programs::TaskRow Requests::RowOf(const TaskRecord& record) const {
     if (state.last != nullptr) {
         row.result = state.last->result;
         row.last_end = state.last->end;
+        if (row.result == ZEL::TASK_RESULT_FAILED) {
+            row.error = state.last->error;
+            std::replace(row.error.begin(), row.error.end(), '\n', ' ');
+        }
     }
     row.next_run = state.next_run;
     if (state.retry_in) {
@@ -345,6 +364,14 @@ void Requests::AddState(const TaskRecord& record, PObject& map) const {
     map["sync_result"] =
         static_cast<int>(state.last != nullptr ? state.last->result : ZEL::TASK_RESULT_NONE);
     map["pending"] = Number(state.pending);
+    if (state.watch) {
+        map["watched_folders"] = Number(state.watch->folders);
+        map["watch_searching"] = state.watch->searching;
+        map["watch_complete"] = state.watch->complete;
+        if (!state.watch->problem.empty()) {
+            map["watch_problem"] = state.watch->problem;
+        }
+    }
     if (state.next_run) {
         map["next_run"] = Number(static_cast<uint64_t>(*state.next_run));
     }

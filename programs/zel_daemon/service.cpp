@@ -290,6 +290,7 @@ TaskState Service::StateOf(const TaskRecord& record) const {
     if (!waits_for.empty()) {
         state.note += (state.note.empty() ? "" : "; ") + waits_for;
     }
+    state.watch = WatchOf(task);
     state.active = task.active.get();
     state.last = task.last ? &*task.last : nullptr;
     return state;

@@ -22,6 +22,14 @@
 
 namespace zel_daemon {
 
+/// How far the folders of a realtime task's shares are watched.
+struct TaskWatch {
+    size_t folders = 0;
+    bool searching = false;  ///< folders are still being found
+    bool complete = true;    ///< no folder that was found is left out
+    std::string problem;     ///< why it is not complete
+};
+
 /// What a person sees of a task beside its settings.
 struct TaskState {
     ZEL::TASK_STATUS status = ZEL::TASK_STATUS_IDLE;
@@ -29,6 +37,7 @@ struct TaskState {
     std::optional<int64_t> retry_in;  ///< seconds
     uint64_t pending = 0;             ///< changes that wait
     std::string note;                 ///< what a person should know
+    std::optional<TaskWatch> watch;   ///< of a realtime task that is not paused
     const ActiveRun* active = nullptr;
     const RunRecord* last = nullptr;  ///< the last run that ended
 };
@@ -107,6 +116,7 @@ private:
     void RunWatcher();
     bool PollDue(const Task& task) const;
     void SearchAgain(Task& task);
+    std::optional<TaskWatch> WatchOf(const Task& task) const;
     void ForgetSettledNotes(Task& task);
     void StoreGathered(Task& task);
     bool GatherDue(const Task& task, int64_t now) const;

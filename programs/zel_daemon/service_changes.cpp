@@ -135,6 +135,29 @@ void Service::RunWatcher() {
     Advance();
 }
 
+std::optional<TaskWatch> Service::WatchOf(const Task& task) const {
+    if (!task.Watches()) {
+        return std::nullopt;
+    }
+    TaskWatch watch;
+    for (const std::string& share : task.record.Info().GetShareList()) {
+        const WatchStats stats = watcher_.Stats(share);
+        const bool known = watched_.count(share) != 0;
+        watch.folders += stats.folders;
+        watch.searching = watch.searching || stats.searching;
+        if (known && stats.complete && (stats.folders > 0 || stats.searching)) {
+            continue;
+        }
+        watch.complete = false;
+        const auto note = task.notes.find(share);
+        watch.problem += (watch.problem.empty() ? "" : "; ") +
+                         (note != task.notes.end() ? note->second
+                                                   : "share '" + programs::Printable(share) +
+                                                         "': its folder is not watched");
+    }
+    return watch;
+}
+
 void Service::OnChange(const std::string& share, const std::string& path) {
     const int64_t now = clock_.Elapsed();
     for (const auto& [id, task] : tasks_) {

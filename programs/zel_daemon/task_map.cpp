@@ -88,7 +88,7 @@ void CheckShares(const std::list<std::string>& shares) {
     for (const std::string& share : shares) {
         const std::string problem = programs::ShareProblem(share);
         if (!problem.empty()) {
-            Refuse(problem);
+            throw RequestError(ZEL::RESULT_FOLDER_MISSING, problem);
         }
     }
 }

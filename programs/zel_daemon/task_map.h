@@ -23,7 +23,7 @@ private:
 /// Sets the fields of `record` whose keys `request` has. Keys that are none of a task's are left to
 /// the caller. Throws RequestError (-4) for a value of the wrong kind or size, and for a task that
 /// would not pass; `record` is then as it was. Shares are looked up on this host when the request
-/// names them.
+/// names them (-17 for one that cannot be pushed from here).
 void ApplyTaskKeys(const ZEL::PObject& request, TaskRecord& record);
 
 /// Whether `key` is one that ApplyTaskKeys() takes.

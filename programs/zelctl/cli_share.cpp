@@ -13,8 +13,10 @@ void DeclareShareImport(CLI::App& share, ExitCode& result) {
     static bool dry_run = false;
     CLI::App* const import = share.add_subcommand("import", "Add the shares of another service");
     import->add_flag("--samba", samba, "Of Samba, as 'testparm' tells them")->required();
-    import->add_option("--config", config, "Its configuration file (the system's)");
-    import->add_flag("-n,--dry-run", dry_run, "Only say which would be added");
+    import->add_option("--config", config, "Its configuration file")
+        ->option_text("FILE")
+        ->default_str("the system's");
+    import->add_flag("-n,--dry-run", dry_run, "Only say what would be done");
     import->add_option("names", names, "Only these");
     import->footer("Shares that are in the catalogue already stay as they are.");
     import->callback([&result] { result = ImportSambaShares(config, names, dry_run);
@@ -30,6 +32,7 @@ void DeclareShare(CLI::App& share, ExitCode& result) {
     static bool acl = false;
     static bool windows = false;
     static bool as_json = false;
+    static bool force = false;
 
     CLI::App* const add = share.add_subcommand("add", "Add a folder as a share");
     add->add_option("name", name, "The share's name")->required();
@@ -52,7 +55,8 @@ void DeclareShare(CLI::App& share, ExitCode& result) {
     CLI::App* const remove =
         share.add_subcommand("rm", "Take a share out of the catalogue; its files stay");
     remove->add_option("name", name, "The share's name")->required();
-    remove->callback([&result] { result = RemoveShare(name); });
+    remove->add_flag("--force", force, "Even when tasks send it");
+    remove->callback([&result] { result = RemoveShare(name, force); });
 
     DeclareShareImport(share, result);
 }

@@ -19,6 +19,7 @@ struct TaskArguments {
     std::string password_file;
     bool new_password = false;
     bool no_excludes = false;
+    bool no_check = false;
     std::vector<std::string> excludes;
     TaskOptions options;
 
@@ -49,10 +50,11 @@ void AddScheduleOptions(CLI::App& command, programs::ScheduleWords& words, bool 
         ->group(group);
     command
         .add_option("--monthly", words.monthly,
-                    "On this day of each month (in a month without it, on a day of the next)")
+                    "On this day of each month; where a month has no such day, as many days into "
+                    "the next one as are missing: 31 is May 1 for April")
         ->option_text("DAY")
         ->group(group);
-    command.add_option("--yearly", words.yearly, "On this date of each year")
+    command.add_option("--yearly", words.yearly, "On this date of each year; 02-29 is March 1")
         ->option_text("MM-DD")
         ->group(group);
     command.add_option("--once", words.once, "On this date alone")
@@ -85,6 +87,8 @@ void AddTaskOptions(CLI::App& command, TaskArguments& arguments, bool required) 
     command.add_option("-u,--user", options.user, "Account on the server")->required(required);
     command.add_option("--password-file", arguments.password_file,
                        "File with the account's password ('-': standard input)");
+    command.add_flag("--no-check", arguments.no_check,
+                     "Do not ask the server whether it takes the account and the shares");
     AddSwitch(command, "ssh", options.ssh, "Carry everything through ssh");
     command.add_option("--ssh-port", options.ssh_port, "Port of the ssh server")
         ->default_str(required ? "22" : "")
@@ -123,7 +127,8 @@ void DeclareChanging(CLI::App& task, ExitCode& result, TaskArguments& arguments)
     CLI::App* const add = task.add_subcommand("add", "Add a task");
     AddTaskOptions(*add, arguments, true);
     add->callback([&result, &arguments] {
-        result = AddTask(arguments.name, arguments.Options(), arguments.password_file);
+        result = AddTask(arguments.name, arguments.Options(), arguments.password_file,
+                         !arguments.no_check);
     });
     CLI::App* const edit =
         task.add_subcommand("edit", "Change a task; what is not given stays as it is");
@@ -133,7 +138,7 @@ void DeclareChanging(CLI::App& task, ExitCode& result, TaskArguments& arguments)
     edit->add_flag("--no-exclude", arguments.no_excludes, "No file stays behind any more");
     edit->callback([&result, &arguments] {
         result = EditTask(arguments.name, arguments.Options(), arguments.new_name,
-                          arguments.new_password, arguments.password_file);
+                          arguments.new_password, arguments.password_file, !arguments.no_check);
     });
 }
 

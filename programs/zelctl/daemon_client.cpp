@@ -67,16 +67,20 @@ ExitCode DaemonConnection::Failed(ExitCode code, const std::string& error) {
 }
 
 ExitCode DaemonConnection::CannotConnect(const std::string& path, int error) {
+    fault_ = DaemonFault::kOther;
     switch (error) {
         case ENOENT:
         case ECONNREFUSED:
+            fault_ = DaemonFault::kNotRunning;
             return Failed(kLocal, "the daemon is not running: systemctl start zel_daemon");
         case EACCES:
         case EPERM:
+            fault_ = DaemonFault::kNotPermitted;
             return Failed(kLocal, "not permitted to use the daemon's socket " + path +
                                       ": be root, or a member of its group (key 'group' of "
                                       "zel_daemon.conf)");
         case EAGAIN:
+            fault_ = DaemonFault::kSilent;
             return Failed(kLocal, "the daemon does not answer: systemctl restart zel_daemon");
         default:
             return Failed(kLocal, "cannot reach the daemon at " + path + ": " + strerror(error));
@@ -105,6 +109,7 @@ ExitCode DaemonConnection::Connect() {
 }
 
 ExitCode DaemonConnection::Lost() {
+    fault_ = DaemonFault::kSilent;
     return Failed(Interrupted() ? kCancelled : kLocal,
                   Interrupted()
                       ? ""
@@ -135,6 +140,9 @@ ExitCode DaemonConnection::Receive(ZEL::PObject& reply) {
     const int result = received["result"].asInt32();
     if (result == ZEL::RESULT_SUCCESS) {
         return kOk;
+    }
+    if (result == ZEL::RESULT_NO_PERMISSION) {
+        fault_ = DaemonFault::kNotPermitted;
     }
     const std::string error = received["error"].asString();
     return Failed(

@@ -9,6 +9,15 @@
 
 namespace zelctl {
 
+/// Why the daemon cannot be asked.
+enum class DaemonFault {
+    kNone,          ///< it can, or it has refused a request
+    kNotRunning,    ///< nobody listens
+    kNotPermitted,  ///< this user may not ask
+    kSilent,        ///< it listens, and does not answer or breaks off
+    kOther
+};
+
 /// A connection to the daemon. After another code than kOk it is only good for Error() and Tell().
 ///
 /// Threads: one thread.
@@ -24,6 +33,7 @@ public:
     /// What failed and what to do, printable; empty when an interrupt, noted by
     /// WatchForInterrupt(), ended a wait (kCancelled).
     const std::string& Error() const { return error_; }
+    DaemonFault Fault() const { return fault_; }
     /// Tells the person, if there is something to tell. Gives `code` back.
     ExitCode Tell(ExitCode code) const;
 
@@ -33,6 +43,7 @@ private:
     ExitCode Lost();
 
     std::string error_;
+    DaemonFault fault_ = DaemonFault::kNone;
     ZEL::Channel channel_;
 };
 

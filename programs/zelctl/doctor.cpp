@@ -19,8 +19,8 @@ constexpr size_t kNamesShown = 3;
 
 // In the order of what depends on what.
 constexpr void (*kChecks[])(const Patient&, Findings&) = {
-    CheckRsync, CheckSSH,     CheckClock, CheckCatalogue, CheckFiles,
-    CheckSpace, CheckWatches, CheckUnit,  CheckDaemon,    CheckServers};
+    CheckRsync, CheckSSH,     CheckClock, CheckConfiguration, CheckCatalogue, CheckFiles,
+    CheckSpace, CheckWatches, CheckStore, CheckUnit,          CheckDaemon};
 
 const char* Word(Verdict verdict) {
     switch (verdict) {
@@ -33,22 +33,40 @@ const char* Word(Verdict verdict) {
     }
 }
 
-Patient Examine() {
-    Patient patient;
+// The tasks, with their passwords when this user may see them.
+ExitCode GetTasks(Patient& patient, ZEL::PObject& reply) {
+    ZEL::PObject request;
+    request["command"] = "task_list";
+    request["secrets"] = 1;
+    patient.has_passwords = AskDaemon(request, reply, &patient.no_passwords) == kOk;
+    if (patient.has_passwords) {
+        return kOk;
+    }
+    request["secrets"] = 0;
+    return AskDaemon(request, reply, &patient.daemon_error);
+}
+
+void AskDaemonItself(Patient& patient) {
+    DaemonConnection connection;
     ZEL::PObject request;
     request["command"] = "daemon_status";
-    patient.daemon_answers = AskDaemon(request, patient.daemon, &patient.daemon_error) == kOk;
-    if (patient.daemon_answers) {
-        request["command"] = "task_list";
-        ZEL::PObject reply;
-        if (AskDaemon(request, reply, &patient.daemon_error) == kOk) {
-            for (const ZEL::PObject& task : reply["tasks"].asArray()) {
-                ZEL::SyncTask record;
-                ZEL::PObj2SyncTask(task, record);
-                for (const std::string& share : record.GetInfo().GetShareList()) {
-                    patient.shares[share].insert(record.GetInfo().GetName());
-                }
-                patient.tasks.push_back(std::move(record));
+    patient.daemon_answers = connection.Connect() == kOk && connection.Send(request) == kOk &&
+                             connection.Receive(patient.daemon) == kOk;
+    patient.daemon_error = connection.Error();
+    patient.daemon_fault = connection.Fault();
+}
+
+Patient Examine() {
+    Patient patient;
+    AskDaemonItself(patient);
+    ZEL::PObject reply;
+    if (patient.daemon_answers && GetTasks(patient, reply) == kOk) {
+        for (ZEL::PObject& state : reply["tasks"].asArray()) {
+            PatientTask& task = patient.tasks.emplace_back();
+            ZEL::PObj2SyncTask(state, task.record);
+            task.state.swap(state);
+            for (const std::string& share : task.record.GetInfo().GetShareList()) {
+                patient.shares[share].insert(task.record.GetInfo().GetName());
             }
         }
     }
@@ -75,8 +93,8 @@ void PrintForPeople(const Findings& findings) {
 }  // namespace
 
 bool Patient::UsesSSH() const {
-    return std::any_of(tasks.begin(), tasks.end(), [](const ZEL::SyncTask& task) {
-        return task.GetInfo().GetSyncInfo().UseSSH();
+    return std::any_of(tasks.begin(), tasks.end(), [](const PatientTask& task) {
+        return task.record.GetInfo().GetSyncInfo().UseSSH();
     });
 }
 
@@ -92,11 +110,13 @@ std::string TasksInWords(const std::set<std::string>& names) {
 }
 
 ExitCode Doctor(bool as_json) {
-    const Patient patient = Examine();
+    Patient patient = Examine();
     Findings findings;
     for (const auto check : kChecks) {
         check(patient, findings);
     }
+    patient.cut_off = CheckServers(patient, findings);
+    CheckTasks(patient, findings);
     if (as_json) {
         programs::Table table({"NAME", "VERDICT", "FINDING", "REMEDY"});
         for (const Finding& finding : findings) {

@@ -9,6 +9,7 @@
 
 #include "ZEL/pobject.h"
 #include "ZEL/sync_obj.h"
+#include "programs/zelctl/daemon_client.h"
 
 namespace zelctl {
 
@@ -23,12 +24,22 @@ struct Finding {
 
 using Findings = std::vector<Finding>;
 
+/// A task as the daemon tells it.
+struct PatientTask {
+    ZEL::SyncTask record;
+    ZEL::PObject state;  ///< the daemon's map
+};
+
 /// What the checks look at, gathered once.
 struct Patient {
     bool daemon_answers = false;
-    std::string daemon_error;          ///< why it does not
-    ZEL::PObject daemon;               ///< the reply to daemon_status
-    std::vector<ZEL::SyncTask> tasks;  ///< the daemon's; none when it does not answer
+    std::string daemon_error;  ///< why it does not
+    DaemonFault daemon_fault = DaemonFault::kNone;
+    ZEL::PObject daemon;             ///< the reply to daemon_status
+    std::vector<PatientTask> tasks;  ///< the daemon's; none when it does not answer
+    bool has_passwords = false;      ///< the tasks have them
+    std::string no_passwords;        ///< why they do not
+    std::set<std::string> cut_off;   ///< tasks whose server CheckServers() has not reached
     /// Shares of the catalogue, and those that tasks name, with the tasks' names.
     std::map<std::string, std::set<std::string>> shares;
     std::string catalogue_error;  ///< why the catalogue cannot be read; empty when it can
@@ -44,7 +55,12 @@ void CheckClock(const Patient& patient, Findings& findings);
 void CheckWatches(const Patient& patient, Findings& findings);
 void CheckSpace(const Patient& patient, Findings& findings);
 void CheckCatalogue(const Patient& patient, Findings& findings);
-void CheckServers(const Patient& patient, Findings& findings);
+/// Gives the tasks whose server is not reached.
+std::set<std::string> CheckServers(const Patient& patient, Findings& findings);
+/// After CheckServers(): servers that are not reached are not asked.
+void CheckTasks(const Patient& patient, Findings& findings);
+void CheckConfiguration(const Patient& patient, Findings& findings);
+void CheckStore(const Patient& patient, Findings& findings);
 void CheckFiles(const Patient& patient, Findings& findings);
 void CheckUnit(const Patient& patient, Findings& findings);
 void CheckDaemon(const Patient& patient, Findings& findings);

@@ -134,8 +134,8 @@ void Wait(Endpoint* begin, Endpoint* end) {
 std::vector<Endpoint> Gather(const Patient& patient) {
     const std::string daemon_port = RsyncSetting("port", kDaemonPort);
     std::map<std::tuple<std::string, std::string, std::string>, Endpoint> endpoints;
-    for (const ZEL::SyncTask& task : patient.tasks) {
-        const ZEL::SyncInfo& info = task.GetInfo().GetSyncInfo();
+    for (const PatientTask& task : patient.tasks) {
+        const ZEL::SyncInfo& info = task.record.GetInfo().GetSyncInfo();
         const uint32_t ssh_port = info.GetSSHPort() == 0 ? kSSHPort : info.GetSSHPort();
         const std::string port = info.UseSSH() ? std::to_string(ssh_port) : daemon_port;
         Endpoint& endpoint =
@@ -144,7 +144,7 @@ std::vector<Endpoint> Gather(const Patient& patient) {
         endpoint.address = info.GetServerIP();
         endpoint.port = port;
         endpoint.ssh = info.UseSSH();
-        endpoint.tasks.insert(task.GetInfo().GetName());
+        endpoint.tasks.insert(task.record.GetInfo().GetName());
     }
     std::vector<Endpoint> list;
     list.reserve(endpoints.size());
@@ -156,7 +156,8 @@ std::vector<Endpoint> Gather(const Patient& patient) {
 
 }  // namespace
 
-void CheckServers(const Patient& patient, Findings& findings) {
+std::set<std::string> CheckServers(const Patient& patient, Findings& findings) {
+    std::set<std::string> cut_off;
     std::vector<Endpoint> endpoints = Gather(patient);
     for (size_t begin = 0; begin < endpoints.size(); begin += kAtOnce) {
         const size_t end = std::min(begin + kAtOnce, endpoints.size());
@@ -171,12 +172,14 @@ void CheckServers(const Patient& patient, Findings& findings) {
         if (endpoint.reached) {
             findings.push_back({name, Verdict::kOk, "answers" + users, ""});
         } else {
+            cut_off.insert(endpoint.tasks.begin(), endpoint.tasks.end());
             findings.push_back(
                 {name, Verdict::kFailed, endpoint.fault + users,
                  std::string("check the name, the network and the firewall; at the server: ") +
                      (endpoint.ssh ? "is sshd running?" : "zel_server status")});
         }
     }
+    return cut_off;
 }
 
 }  // namespace zelctl

@@ -1,5 +1,4 @@
-// The doctor's checks of shares, of the files that hold configuration and secrets, and of the
-// daemon.
+// The doctor's checks of shares, and of the files that hold configuration and secrets.
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -13,7 +12,6 @@
 #include "tarq/core.h"
 #include "tarq/owners.h"
 #include "tarq/root_path.h"
-#include "tarq/systemd.h"
 
 namespace zelctl {
 
@@ -21,10 +19,7 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr char kUnit[] = "zel_daemon";
-constexpr char kStore[] = "/usr/tarq/etc/zel_daemon/tasks.db";
 constexpr char kCatalogue[] = "/usr/tarq/etc/tarqshare.conf";
-constexpr int kProtocol = 1;
 
 // What to do about a share that has a problem.
 std::string RemedyOfShare(const std::string& name) {
@@ -40,12 +35,12 @@ std::string RemedyOfShare(const std::string& name) {
             return "zelctl share add '" + name + "' FOLDER, or take it out of the tasks";
         case TARQ_ERR_SHARE_VOLUME:
             return "mount its disk; if the share has moved: zelctl share confirm '" + name +
-                   "', or share rm and share add";
+                   "', or share rm --force and share add";
         case TARQ_ERR_SHARE_IDENTITY:
             return "mount its disk; if the folder is the right one: zelctl share confirm '" + name +
                    "'";
         default:
-            return "if the share has moved: zelctl share rm and zelctl share add";
+            return "if the share has moved: zelctl share rm --force and share add";
     }
 }
 
@@ -100,25 +95,7 @@ std::vector<std::string> KeyFiles(const std::string& name) {
     return files;
 }
 
-bool IsUnitInstalled() {
-    const std::string file = std::string(kUnit) + ".service";
-    for (const char* folder : {"/etc/systemd/system/", "/usr/local/lib/systemd/system/",
-                               "/usr/lib/systemd/system/", "/lib/systemd/system/"}) {
-        if (access(TARQ::RootPath(folder + file).c_str(), F_OK) == 0) {
-            return true;
-        }
-    }
-    const TARQ::HashOwner section(KAPICSzHashAlloc(4));
-    return section && KAPICFileGetSection(TARQ::RootPath("/usr/tarq/etc/tarqsystemd.conf").c_str(),
-                                          kUnit, section.get()) > 0;
-}
-
 }  // namespace
-
-std::string StorePath(const Patient& patient) {
-    const std::string told = patient.daemon["store"].asString();
-    return told.empty() ? TARQ::RootPath(kStore) : told;
-}
 
 void CheckCatalogue(const Patient& patient, Findings& findings) {
     const std::string path = TARQ::RootPath(kCatalogue);
@@ -168,44 +145,8 @@ void CheckFiles(const Patient& patient, Findings& findings) {
     if (findings.size() == before) {
         findings.push_back(
             {"files", Verdict::kOk,
-             "owners and modes of " + std::to_string(looked_at) + " files are as they should be",
+             "owner and mode of " + programs::Count(looked_at, "file") + " looked at, none to mend",
              ""});
-    }
-}
-
-void CheckUnit(const Patient&, Findings& findings) {
-    const std::string name = std::string("unit ") + kUnit;
-    const int active = TARQSystemdActiveStatusGet(kUnit);
-    if (active == 1) {
-        findings.push_back({name, Verdict::kOk, "active", ""});
-    } else if (!IsUnitInstalled()) {
-        findings.push_back({name, Verdict::kFailed, "it is not installed",
-                            "install the package, or its unit file, and 'systemctl "
-                            "daemon-reload'"});
-    } else {
-        findings.push_back(
-            {name, Verdict::kFailed,
-             active == 0 ? "it is not active"
-                         : "the service manager does not say whether it is "
-                           "active",
-             "systemctl enable --now zel_daemon; its log: journalctl -u zel_daemon"});
-    }
-}
-
-void CheckDaemon(const Patient& patient, Findings& findings) {
-    const int64_t protocol = patient.daemon["protocol"].asInt64();
-    if (!patient.daemon_answers) {
-        findings.push_back({"daemon", Verdict::kFailed, patient.daemon_error,
-                            "systemctl restart zel_daemon; its log: journalctl -u zel_daemon"});
-    } else if (protocol != kProtocol) {
-        findings.push_back({"daemon", Verdict::kFailed,
-                            "it speaks version " + std::to_string(protocol) + " of the protocol",
-                            "install zelctl and zel_daemon of one version, and restart it"});
-    } else {
-        findings.push_back({"daemon", Verdict::kOk,
-                            "version " + patient.daemon["version"].asString() + ", " +
-                                programs::Count(patient.tasks.size(), "task"),
-                            ""});
     }
 }
 

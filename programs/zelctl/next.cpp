@@ -84,7 +84,8 @@ ExitCode ShowNextRuns(const NextOptions& options) {
 }
 
 ExitCode ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count, bool as_json) {
-    programs::Table table({"NEXT RUN", "SECONDS"});
+    programs::Table table(as_json ? std::vector<programs::Column>{"NEXT RUN", "SECONDS"}
+                                  : std::vector<programs::Column>{"NEXT RUN"});
     long moment = after;
     for (unsigned int i = 0; i < count; ++i) {
         moment = schedule.GetNextScheduledSeconds(moment);
@@ -94,7 +95,11 @@ ExitCode ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int co
         if (moment == 0) {
             break;  // no further run
         }
-        table.Add({programs::HumanTime(moment), std::to_string(moment)});
+        std::vector<std::string> row = {programs::HumanTime(moment)};
+        if (as_json) {
+            row.push_back(std::to_string(moment));
+        }
+        table.Add(std::move(row));
     }
     table.Print(as_json);
     return kOk;

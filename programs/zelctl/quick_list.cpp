@@ -11,8 +11,8 @@
 #include <vector>
 
 #include "base/unique_fd.h"
+#include "programs/common/table.h"
 #include "programs/common/task_row.h"
-#include "programs/common/text.h"
 #include "tarq/root_path.h"
 
 namespace zelctl {
@@ -109,13 +109,7 @@ private:
     size_t at_ = 0;
 };
 
-/// The list, and what is told below it.
-struct TaskList {
-    programs::Table table = programs::NewTaskTable();
-    std::string notes;
-};
-
-void ReadRows(WireReader& reader, TaskList& list) {
+void ReadRows(WireReader& reader, std::vector<programs::TaskRow>& rows) {
     if (reader.Byte() != kArray) {
         reader.Refuse();
     }
@@ -125,16 +119,12 @@ void ReadRows(WireReader& reader, TaskList& list) {
             reader.Refuse();
             return;
         }
-        if (!row.note.empty()) {
-            list.notes +=
-                programs::Printable(row.name) + ": " + programs::Printable(row.note) + "\n";
-        }
-        programs::AddTaskRow(std::move(row), list.table);
+        rows.push_back(std::move(row));
     }
 }
 
 // {"result": 0, "rows": [...]}, and nothing else.
-bool ReadReply(WireReader& reader, TaskList& list) {
+bool ReadReply(WireReader& reader, std::vector<programs::TaskRow>& rows) {
     bool has_rows = false;
     if (reader.Byte() != kMap) {
         return false;
@@ -142,7 +132,7 @@ bool ReadReply(WireReader& reader, TaskList& list) {
     for (unsigned char tag = reader.Byte(); reader.Good() && tag != kEnd; tag = reader.Byte()) {
         const std::string key(tag == kString ? reader.String() : "");
         if (key == "rows") {
-            ReadRows(reader, list);
+            ReadRows(reader, rows);
             has_rows = true;
         } else if (key != "result" || reader.Byte() != kInteger || reader.Integer() != 0) {
             return false;
@@ -160,12 +150,15 @@ bool PrintTaskListQuickly() {
         return false;
     }
     WireReader reader(fd.Get());
-    TaskList list;
-    if (!ReadReply(reader, list)) {
+    std::vector<programs::TaskRow> rows;
+    if (!ReadReply(reader, rows)) {
         return false;
     }
-    list.table.Print(false);
-    fputs(list.notes.c_str(), stdout);
+    std::string text;
+    for (const std::string& line : programs::TaskLines(std::move(rows), programs::OutputWidth())) {
+        (text += line) += '\n';
+    }
+    fwrite(text.data(), 1, text.size(), stdout);
     return true;
 }
 

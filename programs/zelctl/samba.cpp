@@ -5,13 +5,18 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
+#include <filesystem>
+#include <optional>
 #include <set>
 #include <sstream>
 
 #include "programs/common/text.h"
 #include "programs/zelctl/child_output.h"
 #include "programs/zelctl/shares.h"
+#include "tarq/root_path.h"
+#include "tarq/share.h"
 
 namespace zelctl {
 
@@ -19,6 +24,10 @@ namespace {
 
 using programs::Printable;
 
+namespace fs = std::filesystem;
+
+constexpr char kCatalogue[] = "/usr/tarq/etc/tarqshare.conf";
+constexpr char kRoot[] = "TARQ_ROOT";
 constexpr const char* kOwnSections[] = {"global", "homes", "printers", "print$", "ipc$"};
 
 std::string Trimmed(const std::string& text) {
@@ -27,6 +36,13 @@ std::string Trimmed(const std::string& text) {
     return begin == std::string::npos
                ? ""
                : text.substr(begin, text.find_last_not_of(blanks) - begin + 1);
+}
+
+// Samba takes a value in double quotes for what is in them.
+std::string Unquoted(const std::string& value) {
+    return value.size() >= 2 && value.front() == '"' && value.back() == '"'
+               ? value.substr(1, value.size() - 2)
+               : value;
 }
 
 // Samba folds names like this; those of the catalogue differ in more than capitals as well.
@@ -51,7 +67,7 @@ struct Section {
 
     void Take(const std::string& key, const std::string& value) {
         if (key == "path" || key == "directory") {
-            path = value;
+            path = Unquoted(value);
         } else if (key == "printable" || key == "print ok") {
             printable = IsYes(value);
         } else if (key == "available") {
@@ -106,6 +122,63 @@ ExitCode Choose(const std::vector<std::string>& names, std::vector<SambaShare>& 
     }
     shares = std::move(chosen);
     return result;
+}
+
+/// A copy of the catalogue, which takes the place of the catalogue for as long as this lives: what
+/// an import would do is seen by doing it there.
+class ScratchCatalogue {
+public:
+    ScratchCatalogue() {
+        const fs::path before = TARQ::RootPath(kCatalogue);
+        std::string folder = fs::temp_directory_path(error_) / "zelctl-XXXXXX";
+        if (mkdtemp(folder.data()) == nullptr) {
+            error_ = std::error_code(errno, std::generic_category());
+            return;
+        }
+        folder_ = folder;
+        const fs::path copy = folder + kCatalogue;
+        fs::create_directories(copy.parent_path(), error_);
+        if (!error_ && fs::exists(before, error_)) {
+            fs::copy_file(before, copy, error_);
+        }
+        const char* const root = getenv(kRoot);
+        root_ = root != nullptr ? std::optional<std::string>(root) : std::nullopt;
+        setenv(kRoot, folder.c_str(), 1);
+    }
+    ~ScratchCatalogue() {
+        if (folder_.empty()) {
+            return;
+        }
+        if (root_) {
+            setenv(kRoot, root_->c_str(), 1);
+        } else {
+            unsetenv(kRoot);
+        }
+        std::error_code ignored;
+        fs::remove_all(folder_, ignored);
+    }
+    ScratchCatalogue(const ScratchCatalogue&) = delete;
+    ScratchCatalogue& operator=(const ScratchCatalogue&) = delete;
+
+    /// Why it could not be made; none when it was.
+    const std::error_code& Error() const { return error_; }
+
+private:
+    std::error_code error_;
+    fs::path folder_;
+    std::optional<std::string> root_;
+};
+
+ExitCode Preview(const SambaShare& share) {
+    const std::string name = Printable(share.name);
+    if (TARQShareAdd(share.name.c_str(), share.path.c_str(), TARQ_SHARE_WINDOWS) < 0) {
+        return Fail(kLocal, "share '%s' would be left out: %s", name.c_str(),
+                    KAPICErrGet() == TARQ_ERR_BAD_PARAMETER
+                        ? "its name or its folder cannot be a share's"
+                        : KAPICErrText(KAPICErrGet()));
+    }
+    printf("Share '%s' would be %s\n", name.c_str(), Printable(share.path).c_str());
+    return kOk;
 }
 
 }  // namespace
@@ -163,6 +236,14 @@ ExitCode ImportSambaShares(const std::string& config, const std::vector<std::str
         return kLocal;
     }
     std::transform(known->begin(), known->end(), std::inserter(there, there.end()), Folded);
+    std::optional<ScratchCatalogue> scratch;
+    if (dry_run) {
+        scratch.emplace();
+        if (scratch->Error()) {
+            return Fail(kLocal, "cannot copy the catalogue, to try the import on it: %s",
+                        scratch->Error().message().c_str());
+        }
+    }
     if (shares.empty() && result == kOk) {
         puts("Samba has no shares to take over.");
     }
@@ -173,12 +254,11 @@ ExitCode ImportSambaShares(const std::string& config, const std::vector<std::str
         if (there.count(Folded(share.name)) != 0) {
             printf("Share '%s' is in the catalogue already; it stays as it is\n", name.c_str());
         } else if (!refusal.empty()) {
-            result = Fail(kLocal, "share '%s' is left out: %s", name.c_str(),
-                          Printable(refusal).c_str());
-        } else if (dry_run) {
-            printf("Share '%s' would be %s\n", name.c_str(), Printable(share.path).c_str());
+            result = Fail(kLocal, "share '%s' %s left out: %s", name.c_str(),
+                          dry_run ? "would be" : "is", Printable(refusal).c_str());
         } else {
-            const ExitCode added = AddShare(share.name, share.path, false, true);
+            const ExitCode added =
+                dry_run ? Preview(share) : AddShare(share.name, share.path, false, true);
             result = added == kOk ? result : added;
         }
     }

@@ -1,10 +1,14 @@
 #include "programs/zelctl/shares.h"
 
+#include <algorithm>
 #include <filesystem>
+#include <set>
 
 #include "programs/common/table.h"
 #include "programs/common/task_run.h"
 #include "programs/common/text.h"
+#include "programs/zelctl/daemon_client.h"
+#include "programs/zelctl/doctor_checks.h"
 #include "programs/zelctl/prepare.h"
 #include "programs/zelctl/share_confirm.h"
 #include "tarq/owners.h"
@@ -24,6 +28,26 @@ ShareOwner GetShare(const std::string& name) {
 
 std::string LastError() {
     return KAPICErrText(KAPICErrGet());
+}
+
+// The tasks that send a share, as far as the daemon can be asked.
+std::set<std::string> TasksWith(const std::string& share) {
+    ZEL::PObject request;
+    request["command"] = "task_list";
+    request["brief"] = 1;
+    ZEL::PObject reply;
+    std::string ignored;
+    std::set<std::string> names;
+    if (AskDaemon(request, reply, &ignored) == kOk) {
+        for (const ZEL::PObject& task : reply["tasks"].asArray()) {
+            const ZEL::PObject::Array& shares = task["share_list"].asArray();
+            if (std::any_of(shares.begin(), shares.end(),
+                            [&](const ZEL::PObject& used) { return used.asString() == share; })) {
+                names.insert(task["name"].asString());
+            }
+        }
+    }
+    return names;
 }
 
 }  // namespace
@@ -63,7 +87,15 @@ ExitCode AddShare(const std::string& name, const std::string& path, bool acl, bo
     return kOk;
 }
 
-ExitCode RemoveShare(const std::string& name) {
+ExitCode RemoveShare(const std::string& name, bool force) {
+    const std::set<std::string> users = force ? std::set<std::string>() : TasksWith(name);
+    if (!users.empty()) {
+        return Fail(kLocal,
+                    "share '%s' is sent by %s: take it out of there first ('zelctl task edit' or "
+                    "'rm'), or give --force",
+                    programs::Printable(name).c_str(),
+                    programs::Printable(TasksInWords(users)).c_str());
+    }
     if (TARQShareRemove(name.c_str()) < 0) {
         return Fail(kLocal, "cannot remove '%s': %s", programs::Printable(name).c_str(),
                     LastError().c_str());

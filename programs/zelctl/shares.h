@@ -13,7 +13,7 @@ ExitCode AddShare(const std::string& name, const std::string& path, bool acl, bo
 /// Shows what the share was known by and what its folder is now, and records that when a person (or
 /// `yes`) says that it is the right one.
 ExitCode ConfirmShare(const std::string& name, bool yes);
-ExitCode RemoveShare(const std::string& name);
+ExitCode RemoveShare(const std::string& name, bool force);
 ExitCode ListShares(bool as_json);
 
 /// All shares of the catalogue, in its order; nothing, and the reason told, when it cannot be read.

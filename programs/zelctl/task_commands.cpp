@@ -1,11 +1,14 @@
 #include "programs/zelctl/task_commands.h"
 
+#include <chrono>
 #include <cstdio>
 #include <ctime>
 
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
+#include "programs/zelctl/ask_server.h"
 #include "programs/zelctl/daemon_client.h"
+#include "programs/zelctl/interrupt.h"
 #include "programs/zelctl/next.h"
 #include "programs/zelctl/task_view.h"
 
@@ -16,6 +19,7 @@ namespace {
 using programs::Printable;
 using ZEL::PObject;
 
+constexpr std::chrono::seconds kPatience(30);
 constexpr unsigned int kRunsShown = 3;  // after a task has been added or edited
 
 ExitCode AskPassword(const std::string& file, ZEL::TaskInfo& info) {
@@ -23,13 +27,41 @@ ExitCode AskPassword(const std::string& file, ZEL::TaskInfo& info) {
     const std::string server =
         sync.GetServerName().empty() ? sync.GetServerIP() : sync.GetServerName();
     std::string error;
-    const auto password = programs::ReadPassword(
+    const auto password = programs::ReadNewPassword(
         file, "Password of " + sync.GetUser() + " on " + server + ": ", error);
     if (!password) {
         return Fail(kUsage, "%s", error.c_str());
     }
     sync.SetPassword(*password);
     info.SetSyncInfo(sync);
+    return kOk;
+}
+
+// Asks the server, with a password that has just been given, what the first run would ask. A server
+// that cannot be asked now keeps nobody from adding a task; one that will never take it does.
+ExitCode TryServer(const ZEL::TaskInfo& info, const char* done) {
+    const std::string problem = programs::PrepareHost();
+    if (!problem.empty()) {
+        fprintf(stderr, "zelctl: the server was not asked: %s\n", Printable(problem).c_str());
+        return kOk;
+    }
+    WatchForInterrupt();
+    const std::list<std::string>& shares = info.GetShareList();
+    const programs::Verdict verdict =
+        AskServer(info.GetSyncInfo(), {shares.begin(), shares.end()}, kPatience);
+    if (verdict.Ok()) {
+        puts("The server takes the account and the shares.");
+        return kOk;
+    }
+    const std::string error = Printable(OneLine(verdict.error));
+    if (verdict.trouble == programs::Trouble::kCancelled) {
+        return Fail(kCancelled, "%s; nothing was %s", "ended by the user", done);
+    }
+    if (IsRefusedForGood(verdict)) {
+        return Fail(kRefused, "%s; nothing was %s (--no-check does not ask the server)",
+                    error.c_str(), done);
+    }
+    fprintf(stderr, "zelctl: warning: %s; the task is %s all the same\n", error.c_str(), done);
     return kOk;
 }
 
@@ -63,6 +95,10 @@ ExitCode ShowStored(const PObject& reply, const char* done) {
     const std::string name = Printable(record.GetInfo().GetName());
     printf("Task '%s' is %s: %s.\n", name.c_str(), done,
            programs::DescribeSchedule(schedule).c_str());
+    const std::string missing_day = programs::DescribeMissingDay(schedule);
+    if (!missing_day.empty()) {
+        puts(missing_day.c_str());
+    }
     const std::string words = WithoutRuns(schedule, name);
     if (!words.empty()) {
         puts(words.c_str());
@@ -84,7 +120,7 @@ ExitCode GetTask(const std::string& name, PObject& task) {
 }  // namespace
 
 ExitCode AddTask(const std::string& name, const TaskOptions& options,
-                 const std::string& password_file) {
+                 const std::string& password_file, bool check) {
     ExitCode code = CheckTaskName(name);
     ZEL::TaskInfo info;
     info.SetName(name);
@@ -105,6 +141,9 @@ ExitCode AddTask(const std::string& name, const TaskOptions& options,
     if (code == kOk) {
         code = CheckTask(info);
     }
+    if (code == kOk && check) {
+        code = TryServer(info, "added");
+    }
     if (code != kOk) {
         return code;
     }
@@ -120,7 +159,7 @@ ExitCode AddTask(const std::string& name, const TaskOptions& options,
 }
 
 ExitCode EditTask(const std::string& name, const TaskOptions& options, const std::string& new_name,
-                  bool new_password, const std::string& password_file) {
+                  bool new_password, const std::string& password_file, bool check) {
     PObject shown;
     ExitCode code = new_name.empty() ? kOk : CheckTaskName(new_name);
     if (code == kOk) {
@@ -143,13 +182,17 @@ ExitCode EditTask(const std::string& name, const TaskOptions& options, const std
     if (code == kOk) {
         code = CheckFuture(options, info.GetSchedule());
     }
-    if (code == kOk && (new_password || !password_file.empty())) {
+    const bool has_password = new_password || !password_file.empty();
+    if (code == kOk && has_password) {
         code = AskPassword(password_file, info);
     }
     // Shares that the task has had before are not looked at: a disk that is away for now must not
     // keep anybody from changing a time.
     if (code == kOk && !(info.GetSyncInfo().Validate() && info.GetSchedule().Validate())) {
         code = CheckTask(info);
+    }
+    if (code == kOk && check && has_password) {
+        code = TryServer(info, "changed");
     }
     if (code != kOk) {
         return code;

@@ -9,13 +9,14 @@
 
 namespace zelctl {
 
-/// `password_file`: as programs::ReadPassword takes it.
+/// `password_file`: as programs::ReadPassword takes it. `check`: the server is asked first; a task
+/// that it refuses for good is not added.
 ExitCode AddTask(const std::string& name, const TaskOptions& options,
-                 const std::string& password_file);
+                 const std::string& password_file, bool check);
 /// `new_name` is empty unless the task is to be renamed. The password stays unless `new_password`
-/// or a file is given.
+/// or a file is given; `check`: the server is asked with it first.
 ExitCode EditTask(const std::string& name, const TaskOptions& options, const std::string& new_name,
-                  bool new_password, const std::string& password_file);
+                  bool new_password, const std::string& password_file, bool check);
 ExitCode ListTasks(bool as_json);
 ExitCode ShowTask(const std::string& name, bool as_json);
 /// `command` is one that says no more than the task's name: "task_remove", "task_cancel",

@@ -159,9 +159,11 @@ class ChangeLines {
 public:
     void See(const PObject::Array& tasks) {
         for (const PObject& task : tasks) {
+            const programs::TaskRow row = RowOf(task);
             std::string line = Printable(task["name"].asString()) + ": " +
-                               programs::TaskStateWords(RowOf(task)) + ", last run " +
-                               programs::TaskResultWord(task["sync_result"].asInt32());
+                               programs::TaskStateWords(row) + ", last run " +
+                               programs::TaskResultWord(row.result) +
+                               (row.error.empty() ? "" : ": " + Printable(row.error));
             std::string& before = lines_[task["name"].asString()];
             if (line != before) {
                 printf("%s  %s\n", programs::HumanTime(time(nullptr)).c_str(), line.c_str());
@@ -250,7 +252,7 @@ ExitCode WatchTasks(const std::string& name) {
         }
         if (LiveBlock::Possible()) {
             stream.PutBusyFirst();  // a window may not hold all
-            block.Draw(TaskTable(stream.Tasks()).Lines());
+            block.Draw(TaskLines(stream.Tasks()));
         } else {
             lines.See(stream.Tasks());
         }

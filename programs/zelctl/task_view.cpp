@@ -1,11 +1,14 @@
 #include "programs/zelctl/task_view.h"
 
+#include <algorithm>
 #include <cstdio>
+#include <iterator>
 #include <nlohmann/json.hpp>
 
 #include "ZEL/sync_obj.h"
 #include "programs/common/run_progress.h"
 #include "programs/common/schedule_words.h"
+#include "programs/common/table.h"
 #include "programs/common/text.h"
 
 namespace zelctl {
@@ -104,6 +107,9 @@ programs::TaskRow RowOf(const PObject& task) {
     }
     row.pending = task["pending"].asUInt64();
     row.note = task["note"].asString();
+    if (row.result == ZEL::TASK_RESULT_FAILED) {
+        row.error = OneLine(task["last_error"].asString());
+    }
     return row;
 }
 
@@ -136,12 +142,11 @@ std::string OneLine(const std::string& text) {
     return line;
 }
 
-Table TaskTable(const PObject::Array& tasks) {
-    Table table = programs::NewTaskTable();
-    for (const PObject& task : tasks) {
-        programs::AddTaskRow(RowOf(task), table);
-    }
-    return table;
+std::vector<std::string> TaskLines(const PObject::Array& tasks) {
+    std::vector<programs::TaskRow> rows;
+    rows.reserve(tasks.size());
+    std::transform(tasks.begin(), tasks.end(), std::back_inserter(rows), RowOf);
+    return programs::TaskLines(std::move(rows), programs::OutputWidth());
 }
 
 void PrintTasks(const PObject::Array& tasks, bool as_json) {
@@ -149,12 +154,8 @@ void PrintTasks(const PObject::Array& tasks, bool as_json) {
         PrintJson(ListJson(tasks, TaskJson));
         return;
     }
-    TaskTable(tasks).Print(false);
-    for (const PObject& task : tasks) {
-        if (task["note"].isString()) {
-            printf("%s: %s\n", programs::Printable(task["name"].asString()).c_str(),
-                   programs::Printable(task["note"].asString()).c_str());
-        }
+    for (const std::string& line : TaskLines(tasks)) {
+        puts(line.c_str());
     }
 }
 

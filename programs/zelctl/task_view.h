@@ -3,9 +3,9 @@
 
 #include <nlohmann/json_fwd.hpp>
 #include <string>
+#include <vector>
 
 #include "ZEL/pobject.h"
-#include "programs/common/table.h"
 #include "programs/common/task_row.h"
 
 namespace zelctl {
@@ -20,7 +20,8 @@ std::string ServerOf(const ZEL::PObject& task);
 /// An error, which may have several lines, as one.
 std::string OneLine(const std::string& text);
 
-programs::Table TaskTable(const ZEL::PObject::Array& tasks);
+/// The list of tasks as this terminal shows it.
+std::vector<std::string> TaskLines(const ZEL::PObject::Array& tasks);
 
 void PrintTasks(const ZEL::PObject::Array& tasks, bool as_json);
 void PrintTask(const ZEL::PObject& task, bool as_json);

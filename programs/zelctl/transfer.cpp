@@ -162,11 +162,12 @@ private:
         }
         if (password_file_.empty() || !password_) {
             std::string error;
-            password_ = programs::ReadPassword(password_file_,
-                                               "Password of " + Printable(read["user"].asString()) +
-                                                   " on " + Printable(ServerOf(read)) + " (task '" +
-                                                   Printable(read["name"].asString()) + "'): ",
-                                               error);
+            password_ =
+                programs::ReadNewPassword(password_file_,
+                                          "Password of " + Printable(read["user"].asString()) +
+                                              " on " + Printable(ServerOf(read)) + " (task '" +
+                                              Printable(read["name"].asString()) + "'): ",
+                                          error);
             if (!password_) {
                 return Fail(kUsage, "%s; nothing was imported", error.c_str());
             }

@@ -1,0 +1,24 @@
+// Asking a server what a push would ask it first.
+#pragma once
+
+#include <chrono>
+#include <string>
+#include <vector>
+
+#include "programs/common/task_run.h"
+
+namespace zelctl {
+
+/// Whether the server takes the shares from this client and account. Changes nothing there. One
+/// that does not answer within `patience` has failed. Any thread.
+programs::Verdict AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& shares,
+                            std::chrono::seconds patience);
+
+/// Whether that was the end of the patience.
+bool IsSilence(const programs::Verdict& verdict);
+
+/// Whether no later push would fare better: the account, or the shares' owner, has to be another
+/// one, or it is no server of ours.
+bool IsRefusedForGood(const programs::Verdict& verdict);
+
+}  // namespace zelctl
