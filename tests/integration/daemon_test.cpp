@@ -245,6 +245,9 @@ TEST_F(DaemonTest, AShareWhoseFolderIsAwayCostsNothingAndComesBack) {
     fs::rename(source_, source_ + ".away");
     ASSERT_TRUE(Await([&] { return Task()["sync_result"].asInt32() == ZEL::TASK_RESULT_FAILED; }));
     EXPECT_THAT(Task()["note"].asString(), HasSubstr("its folder has gone"));
+    EXPECT_EQ(Task()["watched_folders"].asUInt64(), 0U);
+    EXPECT_EQ(Task()["watch_complete"].asInt32(), 0);
+    EXPECT_THAT(Task()["watch_problem"].asString(), HasSubstr("its folder has gone"));
     std::this_thread::sleep_for(std::chrono::seconds(3));
     EXPECT_LE(Runs().size(), 10u);
     EXPECT_LE(zel_.Log().size(), 10000u) << "it goes round and round";
