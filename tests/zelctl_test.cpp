@@ -150,6 +150,9 @@ TEST(TaskRow, AListFitsItsTerminal) {
         EXPECT_THAT(lines[1], HasSubstr("failed 1970-01-01  2096-10-02"));
         EXPECT_THAT(lines[2], testing::StartsWith("  ! cannot use server nas.example.org: xx"));
     }
+    // Where columns are left out, the others have their room.
+    EXPECT_THAT(programs::TaskLines({row}, 80)[1],
+                testing::StartsWith("a task with ..  weekly mon,th..  running"));
     EXPECT_THAT(programs::TaskLines({row}, 0)[2], testing::EndsWith(row.error));
 }
 

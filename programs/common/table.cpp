@@ -68,6 +68,7 @@ void Table::Add(std::vector<std::string> cells) {
 
 // Makes the widest of the columns that may be cut narrower, and then leaves columns out (0).
 void Table::Fit(size_t width, std::vector<size_t>& widths) const {
+    std::vector<size_t> whole = widths;
     const auto total = [&] {
         size_t sum = 0;
         for (const size_t column : widths) {
@@ -99,7 +100,9 @@ void Table::Fit(size_t width, std::vector<size_t>& widths) const {
         if (over == 0 || spare == columns_.size()) {
             return;
         }
-        widths[spare] = 0;
+        // What it leaves free is the others' again.
+        whole[spare] = 0;
+        widths = whole;
     }
 }
 

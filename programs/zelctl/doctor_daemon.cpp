@@ -26,7 +26,8 @@ constexpr char kStore[] = "/usr/tarq/etc/zel_daemon/tasks.db";
 constexpr int kProtocol = 1;
 
 // The keys of section "rsync" of tarqrsync.conf.
-constexpr const char* kRsyncKeys[] = {"port", "rsync", "ssh", "ssh_options"};
+constexpr const char* kRsyncKeys[] = {"answer_seconds", "dead_seconds", "port",
+                                      "rsync",          "ssh",          "ssh_options"};
 constexpr uint64_t kMaxPort = 65535;
 
 // What is wrong with tarqrsync.conf; empty when nothing is.
