@@ -146,12 +146,15 @@ TEST_F(StoreTest, KeepsTheLastRunsOfEachTask) {
     store_->AddTask(Task("has not run"));
     const std::string error = "share 'x\xff': cannot be read";
     const uint64_t id = store_->BeginRun(task, RunReason::kRetry, 100);
-    const RunRecord run = {id, task,  RunReason::kRetry, 100, 160, ZEL::TASK_RESULT_FAILED,
-                           23, error, UINT64_MAX,        2,   3,   4};
+    const RunRecord run = {id,         task,  RunReason::kRetry,
+                           100,        160,   ZEL::TASK_RESULT_FAILED,
+                           23,         error, "a\nb",
+                           UINT64_MAX, 2,     3,
+                           4};
     store_->EndRun(run);
-    EXPECT_THAT(store_->Runs(task, 5),
-                ElementsAre(FieldsAre(id, task, RunReason::kRetry, 100, 160,
-                                      ZEL::TASK_RESULT_FAILED, 23, error, UINT64_MAX, 2, 3, 4)));
+    EXPECT_THAT(store_->Runs(task, 5), ElementsAre(FieldsAre(id, task, RunReason::kRetry, 100, 160,
+                                                             ZEL::TASK_RESULT_FAILED, 23, error,
+                                                             "a\nb", UINT64_MAX, 2, 3, 4)));
 
     const uint64_t others = store_->BeginRun(other, RunReason::kRequest, 50);
     uint64_t last = 0;

@@ -50,6 +50,7 @@ constexpr int kBusyTries = 3;
 constexpr size_t kMaxPairedBytes = size_t{3} * 1024;
 // The failures of a run are told up to here: messages and rows of the history have a limit.
 constexpr size_t kMaxToldBytes = size_t{6} * 1024;
+constexpr size_t kMaxDetailBytes = size_t{16} * 1024;
 
 std::list<std::string> ToList(const std::vector<std::string>& items) {
     return {items.begin(), items.end()};
@@ -282,6 +283,12 @@ Verdict Summed(const std::vector<Undone>& undone) {
     for (; told < failed.size() && sum.error.size() < kMaxToldBytes; ++told) {
         sum.error += "; " + failed[told]->verdict.error;
     }
+    for (size_t i = 1; i < failed.size() && !failed[i]->verdict.details.empty(); ++i) {
+        if (sum.details.size() + failed[i]->verdict.details.size() >= kMaxDetailBytes) {
+            break;
+        }
+        sum.details += (sum.details.empty() ? "" : "\n") + failed[i]->verdict.details;
+    }
     if (told < failed.size()) {
         sum.error += "; and " + std::to_string(failed.size() - told) + " more like these";
     }
@@ -331,8 +338,8 @@ struct TaskRun::Impl {
             return {Trouble::kCancelled, 0, "ended by the user; the next run completes the copy"};
         }
         const std::string why = status == 0 ? "see the system log" : Explain(status, report);
-        return {status == 0 ? Trouble::kLocal : TroubleOf(status), status, what + ": " + why,
-                reach};
+        return {status == 0 ? Trouble::kLocal : TroubleOf(status), status, what + ": " + why, reach,
+                report.details};
     }
 
     static Verdict CheckShare(const std::string& share) {

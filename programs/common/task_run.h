@@ -39,6 +39,7 @@ struct Verdict {
     int status = 0;     ///< the server's or rsync's (tarq/rsync_wrapper.h); 0 for local troubles
     std::string error;  ///< what failed, where and what to do; empty when nothing did
     Reach reach = Reach::kRun;
+    std::string details = {};  ///< what rsync and ssh wrote about it, line by line; may be empty
 
     bool Ok() const { return trouble == Trouble::kNone; }
 };

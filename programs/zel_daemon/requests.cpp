@@ -157,7 +157,7 @@ PObject Requests::Dispatch(const Peer& peer, const PObject& request) {
         {"task_cancel", {"task"}, false, &Requests::TaskCancel},
         {"task_pause", {"task"}, false, &Requests::TaskPause},
         {"task_resume", {"task"}, false, &Requests::TaskResume},
-        {"task_log", {"task", "limit"}, false, &Requests::TaskLog},
+        {"task_log", {"task", "limit", "details"}, false, &Requests::TaskLog},
         {"share_check", {"path", "device", "inode", "volume"}, false, &Requests::ShareCheck},
         {"watch", {"task"}, false, &Requests::Watch},
         {"daemon_status", {}, false, &Requests::DaemonStatus},
@@ -253,8 +253,9 @@ PObject Requests::TaskLog(const Peer&, const PObject& request) {
     const unsigned int limit = NumberOf(request, "limit", kLogLimit, Store::kRunsKept);
     PObject reply = Success();
     PObject::Array& runs = reply["runs"].asArray();
+    const bool details = FlagOf(request, "details");
     for (const RunRecord& run : service_.Runs(TextOf(request, "task"), limit)) {
-        runs.push_back(RunToMap(run));
+        runs.push_back(RunToMap(run, details));
     }
     return reply;
 }

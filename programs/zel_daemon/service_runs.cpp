@@ -228,6 +228,7 @@ void Service::EndRun(Task& task, const RunResult& result, const RunTotals& total
     record.end = clock_.Now();
     record.status = verdict.status;
     record.error = verdict.error;
+    record.details = verdict.details;
     record.files_sent = totals.files_sent;
     record.files_deleted = totals.files_deleted;
     record.bytes_sent = totals.bytes_sent;

@@ -15,8 +15,8 @@ namespace {
 constexpr char kStopped[] = "the daemon was stopped";
 
 constexpr char kRunColumns[] =
-    "id, task, reason, start_time, end_time, result, status, error, files_sent, files_deleted, "
-    "bytes_sent, rsync_runs";
+    "id, task, reason, start_time, end_time, result, status, error, details, files_sent, "
+    "files_deleted, bytes_sent, rsync_runs";
 
 constexpr char kMakeRoom[] = "the disk is full; make room on it";
 constexpr char kBeginAnew[] =
@@ -76,6 +76,7 @@ RunRecord ReadRun(Query& query) {
     run.result = static_cast<ZEL::TASK_RESULT>(query.Number());
     run.status = static_cast<int>(query.Number());
     run.error = query.Text();
+    run.details = query.Text();
     run.files_sent = static_cast<uint64_t>(query.Number());
     run.files_deleted = static_cast<uint64_t>(query.Number());
     run.bytes_sent = static_cast<uint64_t>(query.Number());
@@ -310,10 +311,10 @@ uint64_t Store::BeginRun(uint64_t task_id, RunReason reason, int64_t start) {
 void Store::EndRun(const RunRecord& run) {
     impl_->Change("note the end of a run", [&] {
         Query(*impl_->database,
-              "UPDATE runs SET end_time = ?, result = ?, status = ?, error = ?, files_sent = ?, "
-              "files_deleted = ?, bytes_sent = ?, rsync_runs = ? WHERE id = ?",
-              run.end, static_cast<int>(run.result), run.status, run.error, run.files_sent,
-              run.files_deleted, run.bytes_sent, run.rsync_runs, run.id)
+              "UPDATE runs SET end_time = ?, result = ?, status = ?, error = ?, details = ?, "
+              "files_sent = ?, files_deleted = ?, bytes_sent = ?, rsync_runs = ? WHERE id = ?",
+              run.end, static_cast<int>(run.result), run.status, run.error, run.details,
+              run.files_sent, run.files_deleted, run.bytes_sent, run.rsync_runs, run.id)
             .Run();
     });
 }

@@ -67,10 +67,14 @@ CREATE INDEX runs_of_task ON runs (task, id);
 CREATE INDEX runs_not_ended ON runs (id) WHERE end_time = 0;
 )";
 
+constexpr char kDetails[] = R"(
+ALTER TABLE runs ADD COLUMN details TEXT NOT NULL DEFAULT '';  -- what rsync and ssh wrote
+)";
+
 }  // namespace
 
 const SchemaSteps& StoreSchema() {
-    static const SchemaSteps steps = {kFirst};
+    static const SchemaSteps steps = {kFirst, kDetails};
     return steps;
 }
 

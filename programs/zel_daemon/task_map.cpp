@@ -168,7 +168,7 @@ PObject TaskToBriefMap(const TaskRecord& record) {
     return map;
 }
 
-PObject RunToMap(const RunRecord& run) {
+PObject RunToMap(const RunRecord& run, bool with_details) {
     static const char* const reasons[] = {"schedule", "change", "request", "retry"};
     PObject map;
     map["run"] = static_cast<unsigned long long>(run.id);
@@ -179,6 +179,9 @@ PObject RunToMap(const RunRecord& run) {
     map["sync_result"] = static_cast<int>(run.result);
     map["sync_status"] = run.status;
     map["error"] = run.error;
+    if (with_details && !run.details.empty()) {
+        map["details"] = run.details;
+    }
     map["reason"] = reasons[static_cast<int>(run.reason)];
     map["files_sent"] = static_cast<unsigned long long>(run.files_sent);
     map["files_deleted"] = static_cast<unsigned long long>(run.files_deleted);

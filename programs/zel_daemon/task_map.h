@@ -35,6 +35,6 @@ ZEL::PObject TaskToMap(const TaskRecord& record, bool secrets);
 ZEL::PObject TaskToBriefMap(const TaskRecord& record);
 
 /// One run of the history.
-ZEL::PObject RunToMap(const RunRecord& run);
+ZEL::PObject RunToMap(const RunRecord& run, bool with_details);
 
 }  // namespace zel_daemon

@@ -43,7 +43,8 @@ struct RunRecord {
     ZEL::TASK_RESULT result = ZEL::TASK_RESULT_NONE;
     int status =
         0;  ///< the server's or rsync's, see tarq/rsync_wrapper.h; 0 also for local failures
-    std::string error;  ///< what failed and where, for a person; empty after a success
+    std::string error;    ///< what failed and where, for a person; empty after a success
+    std::string details;  ///< what rsync and ssh wrote about it, line by line; may be empty
     uint64_t files_sent = 0;
     uint64_t files_deleted = 0;
     uint64_t bytes_sent = 0;

@@ -190,7 +190,9 @@ void DeclareTask(CLI::App& task, ExitCode& result) {
         ->check(programs::Between(1, 200))
         ->capture_default_str();
     log->add_flag("--json", as_json, "Write JSON, for programs");
-    log->callback([&result] { result = ShowTaskLog(name, limit, as_json); });
+    static bool details = false;
+    log->add_flag("--verbose", details, "Show what rsync and ssh wrote about each failure, too");
+    log->callback([&result] { result = ShowTaskLog(name, limit, details, as_json); });
 
     CLI::App* const next = AddNamed(task, "next", "Show when a task runs next", name);
     next->add_option("--count", count, "How many runs to show")

@@ -251,9 +251,10 @@ ExitCode TellTask(const char* command, const std::string& name, const char* done
     return code;
 }
 
-ExitCode ShowTaskLog(const std::string& name, unsigned int limit, bool as_json) {
+ExitCode ShowTaskLog(const std::string& name, unsigned int limit, bool details, bool as_json) {
     PObject request = TaskRequest("task_log", name);
     request["limit"] = limit;
+    request["details"] = details;
     PObject reply;
     const ExitCode code = AskDaemon(request, reply);
     if (code == kOk) {

@@ -22,7 +22,7 @@ ExitCode ShowTask(const std::string& name, bool as_json);
 /// `command` is one that says no more than the task's name: "task_remove", "task_cancel",
 /// "task_pause" or "task_resume"; `done` what has happened then.
 ExitCode TellTask(const char* command, const std::string& name, const char* done);
-ExitCode ShowTaskLog(const std::string& name, unsigned int limit, bool as_json);
+ExitCode ShowTaskLog(const std::string& name, unsigned int limit, bool details, bool as_json);
 ExitCode ShowTaskRuns(const std::string& name, unsigned int count, bool as_json);
 ExitCode ShowDaemonStatus(bool as_json);
 ExitCode ReloadDaemon();

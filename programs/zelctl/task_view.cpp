@@ -82,6 +82,15 @@ ordered_json ListJson(const PObject::Array& list, ordered_json (*to_json)(const 
     return array;
 }
 
+// Each line by itself: what came from outside may hold anything else.
+void PrintIndented(const std::string& text) {
+    for (size_t begin = 0; begin < text.size();) {
+        const size_t end = std::min(text.find('\n', begin), text.size());
+        printf("    %s\n", programs::Printable(text.substr(begin, end - begin)).c_str());
+        begin = end + 1;
+    }
+}
+
 ordered_json RunJson(const PObject& run) {
     ordered_json json = ToJson(run);
     json["result"] =
@@ -211,6 +220,12 @@ void PrintRuns(const PObject::Array& runs, bool as_json) {
              programs::HumanBytes(run["bytes_sent"].asUInt64()), OneLine(run["error"].asString())});
     }
     table.Print(false);
+    for (const PObject& run : runs) {
+        if (run["details"].isString()) {
+            printf("\nRun %llu:\n", run["run"].asUInt64());
+            PrintIndented(run["details"].asString());
+        }
+    }
 }
 
 void PrintDaemonStatus(const PObject& status, bool as_json) {
