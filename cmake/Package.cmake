@@ -62,6 +62,7 @@ endforeach()
 # package_unit(name unit): the maintainer scripts of a package with this unit. What its purge removes beside is in
 # packaging/debian/<name>.purge.
 function(package_unit name unit)
+    set(package ${name})
     string(TOUPPER ${name} key)
     file(READ packaging/debian/${name}.purge purge)
     set(scripts)
@@ -100,11 +101,15 @@ set(CPACK_DEBIAN_LIBZEL_PACKAGE_CONTROL_EXTRA
 # Options of the rsync protocol that older ones lack carry the commands.
 set(CPACK_DEBIAN_ZEL-CLIENT_PACKAGE_DEPENDS "rsync (>= 3.2.1)")
 set(CPACK_DEBIAN_ZEL-CLIENT_PACKAGE_RECOMMENDS "openssh-client")
+# Asks a server for its NetBIOS name; lists the shares of Samba.
+set(CPACK_DEBIAN_ZEL-CLIENT_PACKAGE_SUGGESTS "samba-common-bin")
 set(CPACK_DEBIAN_ZEL-SERVER_PACKAGE_DEPENDS "rsync (>= 3.2.1), passwd")
 if(TARGET zel_daemon)
     package_unit(zel-client zel_daemon.service)
 endif()
 package_unit(zel-server zel_rsyncd.service)
+install(FILES packaging/zel-client.tmpfiles DESTINATION lib/tmpfiles.d RENAME zel-client.conf
+    COMPONENT zel-client EXCLUDE_FROM_ALL)
 install(FILES packaging/debian/zel-server.logrotate DESTINATION /etc/logrotate.d RENAME zel-server
     COMPONENT zel-server EXCLUDE_FROM_ALL)
 file(WRITE ${papers}/zel-server/conffiles "/etc/logrotate.d/zel-server\n")

@@ -164,6 +164,31 @@ TEST_F(Host, NameLookupGivesIpv4FirstAndEachAddressOnceAndTellsAnUnknownNameFrom
     EXPECT_EQ(KAPICErrGet(), TARQ_ERR_LOOKUP);
 }
 
+TEST_F(Host, AToolOfTheMakersIsFoundWhereThisHostHasItAndItsAbsenceIsAnErrorOnce) {
+    const auto run = [&](const std::string& program) -> std::string {
+        FILE* const stream = KAPICPopen(program.c_str(), "r", "x", nullptr);
+        if (stream == nullptr) {
+            return "none";
+        }
+        char line[80] = "";
+        const bool any = fgets(line, sizeof line, stream) != nullptr;
+        return (any ? line : "nothing") + std::to_string(WEXITSTATUS(KAPICPclose(stream)));
+    };
+    const auto install = [&](const std::string& place, const std::string& text) {
+        chmod(root_.Write(place, "#!/bin/sh\nprintf '" + text + "'\n").c_str(), 0755);
+    };
+    const std::string tool = root_.Path("usr/local/bin/tool");
+    EXPECT_EQ(run(tool), "none");
+    EXPECT_EQ(run(tool), "nothing1");
+    install("usr/bin/tool", "the host");
+    EXPECT_EQ(run(tool), "the host0");
+    install("usr/local/bin/tool", "the maker");
+    EXPECT_EQ(run(tool), "the maker0");
+    for (int i = 0; i < 2; ++i) {
+        EXPECT_EQ(run(root_.Path("usr/bin/other")), "none");
+    }
+}
+
 TEST_F(Host, HighAvailabilityMacIsOneOfADeviceOrNone) {
     char mac[18] = "#";
     Configure(

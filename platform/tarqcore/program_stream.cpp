@@ -5,11 +5,14 @@
 #include <stdarg.h>
 #include <string.h>
 #include <sys/wait.h>
+#include <tarq/root_path.h>
 #include <unistd.h>
 
 #include <map>
 #include <memory>
 #include <mutex>
+#include <set>
+#include <string>
 #include <vector>
 
 #include "base/unique_fd.h"
@@ -74,6 +77,32 @@ FILE* FailStart(int error) {
     return nullptr;
 }
 
+// The maker's own programs, and where others have them; what answers for a missing one.
+constexpr char kMakersFolder[] = "/usr/local/bin/";
+constexpr char kHostFolder[] = "/usr/bin/";
+constexpr char kNoProgram[] = "/bin/false";
+
+/// Whether the calling process has asked for this program in vain before.
+bool IsKnownToBeMissing(const std::string& program) {
+    static std::mutex mutex;
+    static std::set<std::string>& missing = *new std::set<std::string>;  // outlives every thread
+    const std::lock_guard<std::mutex> lock(mutex);
+    return !missing.insert(program).second;
+}
+
+/// The program to run for `program`: itself, but for one of the maker's that is not there.
+std::string ProgramFor(const std::string& program) {
+    const std::string folder = TARQ::RootPath(kMakersFolder);
+    if (program.compare(0, folder.size(), folder) != 0 || access(program.c_str(), F_OK) == 0) {
+        return program;
+    }
+    std::string other = TARQ::RootPath(kHostFolder) + program.substr(folder.size());
+    if (access(other.c_str(), F_OK) == 0) {
+        return other;
+    }
+    return IsKnownToBeMissing(program) ? kNoProgram : program;
+}
+
 struct CloseStream {
     void operator()(FILE* stream) const { fclose(stream); }
 };
@@ -126,7 +155,7 @@ FILE* KAPICPopen(const char* program, const char* mode, ...) {
         do {
             arguments.push_back(va_arg(given, char*));
         } while (arguments.back() != nullptr);
-        return Start(program, reads, arguments);
+        return Start(ProgramFor(program).c_str(), reads, arguments);
     });
     va_end(given);
     return stream;

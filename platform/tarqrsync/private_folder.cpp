@@ -17,6 +17,15 @@
 namespace TARQ {
 namespace Backup {
 
+namespace {
+
+std::string TemporaryFolder() {
+    const char* const chosen = RootFolder().empty() ? secure_getenv("TMPDIR") : nullptr;
+    return chosen != nullptr && chosen[0] == '/' ? chosen : RootPath("/tmp");
+}
+
+}  // namespace
+
 PrivateFileError::PrivateFileError(const std::string& what)
     : std::runtime_error(what + ": " + strerror(errno)) {}
 
@@ -29,7 +38,7 @@ PrivateFolder::~PrivateFolder() {
 
 std::string PrivateFolder::Path(const std::string& name) {
     if (folder_.empty()) {
-        const std::string parent = RootPath("/tmp");
+        const std::string parent = TemporaryFolder();
         mkdir(parent.c_str(), 0700);  // a root folder of somebody's own may lack it
         std::string pattern = parent + "/tarqrsync.XXXXXX";
         if (mkdtemp(pattern.data()) == nullptr) {

@@ -13,7 +13,8 @@ public:
     explicit PrivateFileError(const std::string& what);
 };
 
-/// A folder below /tmp that only this user can enter, made when it is first needed and removed with
+/// A folder in the folder for temporary files (TMPDIR, else /tmp; below the root folder when there
+/// is one, its tmp) that only this user can enter, made when it is first needed and removed with
 /// all that is in it at the end. It holds what one run must not show to anybody else.
 class PrivateFolder {
 public:

@@ -1,3 +1,6 @@
+#include <fcntl.h>
+#include <stdio.h>
+#include <stdlib.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -5,6 +8,7 @@
 #include <cstring>
 #include <filesystem>
 
+#include "ZEL/log.h"
 #include "ZEL/zel.h"
 #include "programs/common/task_run.h"
 #include "programs/common/text.h"
@@ -14,6 +18,8 @@
 namespace programs {
 
 namespace {
+
+constexpr int kAttempts = 3;
 
 // Whether nobody but us and root can put another file in the place of one of ours.
 bool IsOurs(const std::string& folder) {
@@ -25,6 +31,26 @@ bool IsOurs(const std::string& folder) {
     const bool others_may_write = (info.st_mode & (S_IWGRP | S_IWOTH)) != 0;
     return (info.st_uid == geteuid() || info.st_uid == 0) &&
            (!others_may_write || (info.st_mode & S_ISVTX) != 0);
+}
+
+// Puts a folder of ours in the place of what somebody else has put there, in one step, so that he
+// cannot be first once more. What was there lies beside it then, under a name that is told. Only
+// who may rename what lies in the folder above can do that: root, in /tmp. False with errno.
+bool PutAside(const std::string& path) {
+    std::string aside = path + ".XXXXXX";
+    if (mkdtemp(aside.data()) == nullptr) {
+        return false;
+    }
+    if (renameat2(AT_FDCWD, aside.c_str(), AT_FDCWD, path.c_str(), RENAME_EXCHANGE) != 0) {
+        const int reason = errno;
+        rmdir(aside.c_str());
+        errno = reason;
+        return false;
+    }
+    ZEL::Logger::LogMsg(ZEL::Logger::LEVEL_WARNING,
+                        "[WARNING] host(%d): %s belonged to somebody else; it is %s now\n",
+                        __LINE__, path.c_str(), aside.c_str());
+    return true;
 }
 
 }  // namespace
@@ -40,13 +66,20 @@ std::string PrepareHost() {
                    "; run it as root, or set TARQ_ROOT to a folder of yours";
         }
     }
-    if (mkdir(scratch.c_str(), 0700) != 0 && errno != EEXIST) {
-        return "cannot make " + scratch + ": " + strerror(errno);
+    // What is in the way may go at any moment.
+    for (int attempt = 0; attempt < kAttempts; ++attempt) {
+        if (mkdir(scratch.c_str(), 0700) == 0) {
+            return "";
+        }
+        if (errno != EEXIST) {
+            return "cannot make " + scratch + ": " + strerror(errno) +
+                   (errno == EROFS ? " (systemctl restart zel_daemon makes it anew)" : "");
+        }
+        if (IsOurs(scratch) || PutAside(scratch)) {
+            return "";
+        }
     }
-    return IsOurs(scratch) ? ""
-                           : scratch +
-                                 " belongs to somebody else: remove it, or set TARQ_ROOT to a "
-                                 "folder of yours";
+    return scratch + " belongs to somebody else: remove it, or set TARQ_ROOT to a folder of yours";
 }
 
 std::string ShareProblem(const std::string& name) {

@@ -139,8 +139,8 @@ private:
 std::string ShareProblem(const std::string& share);
 
 /// Makes the folders that the library expects of its host and no package may have made: for the
-/// configuration, and for scratch files, which must be nobody else's to change. What is wrong;
-/// empty when all is well.
+/// configuration, and for scratch files, which must be nobody else's to change: what somebody else
+/// has put in their place is moved aside by who may. What is wrong; empty when all is well.
 std::string PrepareHost();
 
 }  // namespace programs

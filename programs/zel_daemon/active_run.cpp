@@ -82,8 +82,10 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
     try {
         // In the middle of a run their lack would look like a volume that is not mounted, or worse.
         const int lack = LackOfDescriptors(kDescriptors);
-        result = lack != 0 ? NothingDone(ReasonOf(lack))
-                           : connection_->For(plan_.order).Push(plan_.order, totals);
+        // What lies in /tmp may have been cleaned away since the start.
+        const std::string unprepared = lack != 0 ? ReasonOf(lack) : programs::PrepareHost();
+        result = unprepared.empty() ? connection_->For(plan_.order).Push(plan_.order, totals)
+                                    : NothingDone(unprepared);
     } catch (const std::exception& error) {
         result = NothingDone(error.what());
     }

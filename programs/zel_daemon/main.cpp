@@ -47,6 +47,7 @@ struct Options {
     bool foreground = false;
     bool reload = false;
     bool new_store = false;
+    bool prepare = false;
     std::string log = "syslog";
     int level = Logger::LEVEL_NOTE;
 };
@@ -236,6 +237,10 @@ int main(int argc, char** argv) {
         "--new-store", options.new_store,
         "Begin with an empty store, when the one there was is lost, and end; what is there "
         "is moved away");
+    app.add_flag(
+        "--prepare", options.prepare,
+        "Only make the folders that it needs; the system's unit does so first, with rights "
+        "that the daemon has not");
     app.add_option("--log", options.log, "syslog, stderr, or a file's path")
         ->option_text("WHERE")
         ->capture_default_str();
@@ -260,6 +265,9 @@ int main(int argc, char** argv) {
     try {
         if (options.new_store) {
             RenewStore();
+        } else if (options.prepare) {
+            StartLog(options);
+            PrepareFolders();
         } else {
             Serve(options);
         }

@@ -163,7 +163,13 @@ int KAPICSemClose(int id);
 
 /* Runs `program` with the given arguments (strings, then NULL; without the program's own name),
  * with a pipe from its standard output (mode "r") or to its standard input ("w"), without a shell.
- * The stream, or NULL when the program cannot be started. Close with KAPICPclose. */
+ * The stream, or NULL when the program cannot be started. Close with KAPICPclose.
+ *
+ * A program below /usr/local/bin, where the maker's systems have their tools, is looked for in
+ * /usr/bin when it is not there (both below the root folder, see root_path.h). When that lacks it
+ * too the call fails, the first time; a process that asks again is given a stream without a byte
+ * and, at its close, wait status 1 of a program: what is not installed is an error once, and not at
+ * every run. */
 FILE* KAPICPopen(const char* program, const char* mode, ... /* arguments, NULL */);
 /* Closes the stream and waits for the program. Its wait status as waitpid() gives it, or -1. */
 int KAPICPclose(FILE* stream);
