@@ -584,9 +584,10 @@ TEST_F(Zelctl, EachVerbAsksForWhatItSaysAndShowsTheAnswer) {
          "progress         docs: 50%  1.0 MiB, 102 KiB/s, 0:09 left"},
         {"task show t --json", R"("task_show", "task": "t")", "\"state\": \"running\""},
         {"task next t --count 5 --json", R"("task_show", "task": "t")", "13:00:00"},
-        {"task log t --limit 7", R"("task_log", "limit": 7, "task": "t")",
+        {"task log t --limit 7", R"("task_log", "details": 0, "limit": 7, "task": "t")",
          "1:40  failed  retry   3      0        2.0 KiB  first; second\\033"},
-        {"task log t --json", R"("task_log", "limit": 20, "task": "t")", "\"result\": \"failed\""},
+        {"task log t --json", R"("task_log", "details": 0, "limit": 20, "task": "t")",
+         "\"result\": \"failed\""},
         {"status", R"("daemon_status")", "0, 0 running (2 workers)"},
         {"reload", R"("reload")", "has read"},
     };
