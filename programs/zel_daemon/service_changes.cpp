@@ -19,8 +19,6 @@ using ZEL::Logger;
 
 // The watcher's share of the loop's time before others have their turn.
 constexpr std::chrono::milliseconds kWatcherSlice(20);
-// That a look-up of a share needs.
-constexpr unsigned int kLookUpDescriptors = 4;
 
 std::string ShownShare(const std::string& share) {
     return "share '" + programs::Printable(share) + "': ";
@@ -28,12 +26,8 @@ std::string ShownShare(const std::string& share) {
 
 // Why a share could not be looked up.
 std::string WhyUnknown(const std::string& share) {
-    const std::string failed = ShownShare(share) + "it cannot be looked up";
-    if (const int error = LackOfDescriptors(kLookUpDescriptors)) {
-        return failed + ": " + ReasonOf(error);
-    }
-    const std::string problem = programs::ShareProblem(share);
-    return problem.empty() ? failed : problem;
+    const std::string problem = ShareProblem(share);
+    return problem.empty() ? ShownShare(share) + "it cannot be looked up" : problem;
 }
 
 // A path may be longer than what a person reads.

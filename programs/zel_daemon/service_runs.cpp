@@ -6,6 +6,7 @@
 #include "ZEL/log.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/service_task.h"
+#include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {
 
@@ -321,7 +322,7 @@ void Service::HastenRetries() {
         }
         task->debts.Hasten(now, gap, [&](const std::string& share, programs::Trouble trouble) {
             if (trouble == programs::Trouble::kLocal) {
-                return (volume || settings) && programs::ShareProblem(share).empty();
+                return (volume || settings) && ShareProblem(share).empty();
             }
             return settings || (network && trouble == programs::Trouble::kFailed);
         });

@@ -7,8 +7,17 @@
 #include <vector>
 
 #include "base/unique_fd.h"
+#include "programs/common/task_run.h"
+#include "programs/common/text.h"
 
 namespace zel_daemon {
+
+namespace {
+
+// That a look-up of a share needs.
+constexpr unsigned int kLookUpDescriptors = 4;
+
+}  // namespace
 
 std::string ReasonOf(int error) {
     switch (error) {
@@ -35,6 +44,13 @@ int LackOfDescriptors(unsigned int count) {
         }
     }
     return 0;
+}
+
+std::string ShareProblem(const std::string& share) {
+    if (const int error = LackOfDescriptors(kLookUpDescriptors)) {
+        return "share '" + programs::Printable(share) + "' cannot be looked up: " + ReasonOf(error);
+    }
+    return programs::ShareProblem(share);
 }
 
 }  // namespace zel_daemon

@@ -12,4 +12,8 @@ std::string ReasonOf(int error);
 /// 0 when so many descriptors can be had now, else why not.
 int LackOfDescriptors(unsigned int count);
 
+/// What programs::ShareProblem() says, unless the look-up itself lacks descriptors: that says
+/// nothing of the share, and must not be taken for a volume that is away.
+std::string ShareProblem(const std::string& share);
+
 }  // namespace zel_daemon

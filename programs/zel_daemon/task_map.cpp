@@ -5,8 +5,8 @@
 #include <set>
 
 #include "ZEL/channel.h"
-#include "programs/common/task_run.h"
 #include "programs/common/text.h"
+#include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {
 
@@ -86,7 +86,7 @@ void CheckShares(const std::list<std::string>& shares) {
         Refuse("share_list names a share twice");
     }
     for (const std::string& share : shares) {
-        const std::string problem = programs::ShareProblem(share);
+        const std::string problem = ShareProblem(share);
         if (!problem.empty()) {
             throw RequestError(ZEL::RESULT_FOLDER_MISSING, problem);
         }

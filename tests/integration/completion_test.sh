@@ -42,7 +42,7 @@ expect '<Übungen>' zelctl task add x --share ''
 expect '<Übungen>' zelctl task edit x --share = Ü
 expect '<my\ photos>' zelctl task edit --server nas my
 expect '<Übungen>' zelctl push --server nas other ''
-expect '<--limit><--json><--help>' zelctl task log x --
+expect '<--limit><--verbose><--json><--help>' zelctl task log x --
 expect '<rm><run><resume>' zelctl help task r
 expect '<>' zel_server account rm ''
 expect '<syslog>' zel_daemon --foreground --log sy

@@ -559,9 +559,9 @@ TEST_F(DaemonTest, HostilePeersHoldUpNobody) {
 
 TEST_F(DaemonTest, WithFewDescriptorsItStaysAndSaysWhichLimitToRaise) {
     Settings("poll_seconds=\"1\"\n");
-    for (const char* few : {"24", "40"}) {  // too few for a run; for all connections
+    for (const char* few : {"32", "44"}) {  // too few for a run; for all connections
         zel_.Start({"prlimit", std::string("--nofile=") + few + ":1000"});
-        if (few == std::string("24")) {
+        if (few == std::string("32")) {
             AddTask();
         }
         std::vector<std::unique_ptr<RawPeer>> silent;
