@@ -125,11 +125,12 @@ ExitCode ListShares(bool as_json) {
     if (!names) {
         return kLocal;
     }
-    programs::Table table({"SHARE", "STATE", "FOLDER"});
+    programs::Table table({"SHARE", "STATE", "FOLDER", "PROBLEM"});
     for (const std::string& name : *names) {
         const ShareOwner share = GetShare(name);
-        table.Add({name, share ? "ready" : LastError(),
-                   share && share->path != nullptr ? share->path : ""});
+        const bool known = share && share->path != nullptr;
+        table.Add({name, share ? "ready" : "not ready", known ? share->path : "",
+                   share ? "" : LastError()});
     }
     table.Print(as_json);
     return kOk;
