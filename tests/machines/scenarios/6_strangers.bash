@@ -21,3 +21,21 @@ nothing_to_see() {  # scenario
     done
     until_true 30 in_step
 }
+
+# He has made the scratch folder and the semaphore of the programs before they come up.
+nothing_to_hold() {  # scenario
+    stranger
+    local name
+    for name in client server; do
+        at "$name" bash -c 'ipcrm --semaphore-key 0x2980298 2>/dev/null || true'
+        at_as "$name" mallory perl -e 'semget(0x2980298, 1, 01666) // die $!'
+    done
+    at client rm -rf /tmp/ZEL
+    at_as client mallory mkdir -m 700 /tmp/ZEL
+    at client systemd-tmpfiles --create  # as each boot does, and the package's installation
+    at client systemctl restart zel_daemon
+    at client bash -c 'date >/srv/photos/date'
+    until_true 20 in_step
+    typed client "zelctl push photos --server nas2 --user alice"
+    at server zel_server status
+}
