@@ -57,8 +57,9 @@ std::string ReadConfig(Config* config) {
     for (const auto& [key, max, number] : numbers) {
         const std::string text = value(key, std::to_string(*number));
         if (!ParseUpTo(max, text, number)) {
-            return path + ": " + key + " '" + text + "' is not between 1 and " +
-                   std::to_string(max);
+            std::string wrong = path + ": " + key;
+            wrong += " '" + text + "' is not between 1 and " + std::to_string(max);
+            return wrong;
         }
     }
     return "";

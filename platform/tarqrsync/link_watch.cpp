@@ -139,7 +139,8 @@ std::vector<pid_t> Descendants(pid_t program) {
     std::vector<pid_t> processes = {program};
     for (size_t i = 0; i < processes.size() && processes.size() < kMaxProcesses; ++i) {
         const std::string pid = std::to_string(processes[i]);
-        std::ifstream children("/proc/" + pid + "/task/" + pid + "/children");
+        const std::string process = "/proc/" + pid;
+        std::ifstream children(process + "/task/" + pid + "/children");
         for (pid_t child = 0; children >> child;) {
             processes.push_back(child);
         }

@@ -85,7 +85,7 @@ std::string HumanTime(int64_t seconds_since_epoch) {
 
 std::string BriefTime(int64_t seconds_since_epoch, int64_t now) {
     constexpr int64_t kHalfYear = int64_t{182} * 86400;
-    const std::string whole = HumanTime(seconds_since_epoch);
+    std::string whole = HumanTime(seconds_since_epoch);
     const size_t day = whole.find(' ');
     if (day == std::string::npos || day < 6) {
         return whole;

@@ -49,7 +49,7 @@ programs::TaskRun& Connection::For(const programs::RunOrder& order) {
 }
 
 ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, RunPlan plan,
-                     OnProgress on_progress, OnEnd on_end)
+                     const OnProgress& on_progress, const OnEnd& on_end)
     : connection_(std::move(connection)), plan_(std::move(plan)) {
     try {
         thread_ =

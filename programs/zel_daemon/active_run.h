@@ -55,7 +55,7 @@ public:
     /// Starts it; without a thread to be had it ends as failed. Both functions are called on the
     /// loop's thread, after this; nothing is, once this object is gone.
     ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, RunPlan plan,
-              OnProgress on_progress, OnEnd on_end);
+              const OnProgress& on_progress, const OnEnd& on_end);
     /// Cancels and waits for the end.
     ~ActiveRun();
     ActiveRun(const ActiveRun&) = delete;

@@ -98,7 +98,7 @@ void ShareDebts::Hasten(int64_t now, int64_t gap,
 
 const ShareDebts::Sums& ShareDebts::Summed() const {
     if (!sums_) {
-        sums_.emplace();
+        sums_ = Sums();
         for (const auto& [name, share] : shares_) {
             TakeEarlier(sums_->next, share.Next());
             if (share.retry.Waiting()) {

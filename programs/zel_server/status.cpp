@@ -13,7 +13,6 @@ namespace zel_server {
 namespace {
 
 using Json = nlohmann::ordered_json;
-using programs::Count;
 using programs::Printable;
 
 constexpr char kMultiSourceMarker[] = "ZELMULTI-SRC-SUPPORT";

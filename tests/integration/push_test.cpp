@@ -312,6 +312,10 @@ TEST_F(PushTest, SshReachesTheSameServer) {
     StopServer();
     SetUpServer("127.0.0.2");
     StartServer();
+    // The one daemon may answer before the other.
+    for (int i = 0; i < 100 && Server("status").exit_code != 0; ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    }
     EXPECT_THAT(Server("status"), Ended(0, "of 127.0.0.2"));
     ExpectNextPushCompletes("--ssh --ssh-port " + std::to_string(ssh.Port()), user);
     EXPECT_THAT(ssh.Log(), HasSubstr("Accepted publickey"));
