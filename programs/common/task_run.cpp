@@ -342,6 +342,8 @@ struct TaskRun::Impl {
                 report.details};
     }
 
+    bool Silent() const { return report.status == TARQ::Backup::STATUS_TIMEOUT; }
+
     static Verdict CheckShare(const std::string& share) {
         std::string problem = ShareProblem(share);
         return problem.empty() ? Verdict()
@@ -446,6 +448,15 @@ struct TaskRun::Impl {
                                     status, Reach::kShare);
     }
 
+    // The server's answer is no reason to end the run; that there is none is: each of the commands
+    // and copies that follow would wait as long for its own.
+    Verdict Announce(const std::string& task) {
+        const ScopedRunOptions watched(Reporting());
+        int status = 0;
+        rsyncer.SendBeacon(task, status);
+        return Silent() ? Failed("the server does not answer", report.status) : Verdict();
+    }
+
     void PushShares(const RunOrder& order, const Orders& shares, RunTotals& totals,
                     std::vector<Undone>& undone) {
         if (shares.empty()) {
@@ -454,16 +465,24 @@ struct TaskRun::Impl {
         int ignored = 0;
         bool announced = order.announce;
         {
-            Beacon beacon(rsyncer.GetSyncInfo(), order.task);
             if (announced) {
-                rsyncer.SendBeacon(order.task, ignored);
+                const Verdict told = Announce(order.task);
+                if (!told.Ok()) {
+                    LeaveAllUndone(shares, told, undone);
+                    return;
+                }
             }
+            Beacon beacon(rsyncer.GetSyncInfo(), order.task);
             for (auto share = shares.begin(); share != shares.end();) {
                 const size_t before = undone.size();
                 PushShare(order, **share, totals, undone);
                 ++share;
-                if (undone.size() > before && undone.back().verdict.reach == Reach::kRun) {
-                    const Verdict end = undone.back().verdict;
+                if (undone.size() == before) {
+                    continue;
+                }
+                Verdict end = undone.back().verdict;
+                if (end.reach == Reach::kRun || !heard) {
+                    end.reach = Reach::kRun;
                     LeaveUndone(share, shares.end(), end, undone);
                     break;
                 }
@@ -482,6 +501,7 @@ struct TaskRun::Impl {
                    std::vector<Undone>& undone) {
         Verdict result = Start(share.share);
         if (!result.Ok()) {
+            heard = !Silent();
             undone.push_back({share.share, share.paths, std::move(result)});
             return;
         }
@@ -504,6 +524,10 @@ struct TaskRun::Impl {
         totals.bytes_sent += sent.bytes_sent + sent.bytes_received;
         const std::chrono::duration<double> elapsed = steady_clock::now() - begin;
         const bool completed = undone.size() == undone_before;
+        heard = completed || !Silent();
+        if (!heard) {
+            return;
+        }
         Verdict closed = Finish(share.share, completed, share.rest_waits);
         if (completed && !closed.Ok()) {
             undone.push_back({share.share, share.paths, std::move(closed)});
@@ -616,7 +640,7 @@ struct TaskRun::Impl {
             const ScopedRunOptions watched(Reporting());
             sent = rsyncer.FinishSync(completed && !rest_waits ? "share" : "abort", share, status);
         }
-        heard = !cancel || (sent == 0 && status == kDone);
+        heard = (!cancel || (sent == 0 && status == kDone)) && !Silent();
         if (completed && (sent != 0 || status != kDone)) {
             result = Failed("the server does not confirm " + Quoted(share), status,
                             ReachOfCommand(status));
@@ -653,7 +677,7 @@ struct TaskRun::Impl {
     RunReport report;         // of the last thing that was run
     bool connected = false;   // an address of the server has answered
     uint64_t rsync_runs = 0;  // copies made
-    bool heard = true;        // the server still listens when a person has had enough
+    bool heard = true;        // false: an answer to a last word would be waited for in vain
     ZEL::Rsyncer rsyncer;
 };
 

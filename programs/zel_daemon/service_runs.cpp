@@ -36,6 +36,14 @@ std::vector<uint64_t> IdsOf(const std::vector<ZEL::Event>& events) {
     return ids;
 }
 
+// A receiver that died in a copy has left what it had of a file beside it, under another name.
+bool BrokeOff(const Verdict& verdict) {
+    return verdict.reach == Reach::kShare &&
+           (verdict.status == TARQ::Backup::STATUS_SOCKET ||
+            verdict.status == TARQ::Backup::STATUS_PROTOCOL_STREAM ||
+            verdict.status == TARQ::Backup::STATUS_TIMEOUT);
+}
+
 }  // namespace
 
 // Takes every step that is due, and sleeps until the next one is. Called after whatever happened.
@@ -271,6 +279,7 @@ void Service::Settle(Task& task, const RunPlan& plan, const RunResult& result) {
         }
         outcome.failed = true;
         outcome.tried = outcome.tried && !other;
+        outcome.broke_off = outcome.broke_off || BrokeOff(undone.verdict);
         for (const std::string& path : undone.paths) {
             unsent_paths[undone.share].push_back(&path);
         }

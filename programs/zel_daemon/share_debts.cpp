@@ -177,7 +177,7 @@ void ShareDebts::Settle(int64_t now, const std::map<std::string, Outcome>& outco
                 share->whole = Whole::kDue;
             }
         } else if (outcome.failed) {
-            if (due.whole) {
+            if (due.whole || outcome.broke_off) {
                 share->whole = Whole::kFailed;
             }
             share->failed_upto = std::max(share->failed_upto, outcome.last_change);

@@ -44,6 +44,7 @@ public:
     struct Outcome {
         bool tried = true;  ///< false: it is owed as it was
         bool failed = false;
+        bool broke_off = false;  ///< the server may have kept something of it: all is owed
         programs::Reach reach = programs::Reach::kPaths;
         programs::Trouble trouble = programs::Trouble::kNone;
         uint64_t last_change = 0;  ///< the highest number of its changes that failed
