@@ -48,3 +48,18 @@ client_disk_swapped() {  # scenario
     machine disk other 16M
     unharmed_by --disk other=/srv/photos
 }
+
+# A person may say that another disk is the share from now on.
+client_disk_replaced() {  # scenario
+    local disk
+    machine disk new 16M
+    for disk in new photos; do
+        machine down client
+        machine up client --disk "$disk=/srv/photos"
+        ends_with 3 at client zelctl task run photos --wait
+        fails in_step
+        at client zelctl share confirm photos --yes
+        at client zelctl task run photos --wait
+        in_step
+    done
+}
