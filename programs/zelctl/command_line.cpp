@@ -3,8 +3,8 @@
 #include "ZEL/log.h"
 #include "programs/common/help.h"
 #include "programs/common/text.h"
-#include "programs/zelctl/cli.h"
-#include "programs/zelctl/server.h"
+#include "programs/zelctl/declare.h"
+#include "programs/zelctl/server/become.h"
 
 namespace {
 

@@ -1,8 +1,8 @@
 #include <cstring>
 
 #include "programs/common/command_line.h"
-#include "programs/zelctl/exit_codes.h"
-#include "programs/zelctl/quick_list.h"
+#include "programs/zelctl/base/exit_codes.h"
+#include "programs/zelctl/task/quick_list.h"
 
 int main(int argc, char** argv) {
     const bool is_list = argc == 3 && strcmp(argv[1], "task") == 0 && strcmp(argv[2], "list") == 0;

@@ -1,0 +1,210 @@
+// The doctor's checks of this machine: programs, clock, watches, space.
+#include <sys/stat.h>
+#include <sys/statvfs.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <ctime>
+#include <filesystem>
+
+#include "programs/common/text.h"
+#include "programs/zelctl/base/child_output.h"
+#include "programs/zelctl/doctor/checks.h"
+#include "tarq/core.h"
+#include "tarq/owners.h"
+#include "tarq/root_path.h"
+
+namespace zelctl {
+
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr char kNeededRsync[] = "3.2.1";        // carries commands to the server's handler
+constexpr int64_t kFirstSaneTime = 1704067200;  // 2024: a clock before it has lost its battery
+constexpr uint64_t kLittleSpace = uint64_t{256} << 20;
+constexpr uint64_t kNoSpace = uint64_t{16} << 20;
+constexpr uint64_t kFewInodes = 1000;
+constexpr uint64_t kFewInstances = 16;
+
+void AddFact(Findings& findings, const std::string& name, const std::string& finding) {
+    findings.push_back({name, Verdict::kOk, finding, ""});
+}
+
+/// A number of /proc/sys; 0 when it cannot be read.
+uint64_t KernelNumber(const std::string& path) {
+    const auto text = programs::ReadWholeFile(path, 64);
+    return text ? programs::ParseNumber(text->substr(0, text->find('\n')), UINT64_MAX).value_or(0)
+                : 0;
+}
+
+// Folders below `folder`, itself included, up to `limit`.
+uint64_t CountFolders(const std::string& folder, uint64_t limit) {
+    uint64_t count = 1;
+    std::error_code error;
+    const auto options = fs::directory_options::skip_permission_denied;
+    for (auto entry = fs::recursive_directory_iterator(folder, options, error);
+         !error && entry != fs::recursive_directory_iterator() && count < limit;
+         entry.increment(error)) {
+        std::error_code ignored;
+        count += entry->is_directory(ignored) && !entry->is_symlink(ignored) ? 1 : 0;
+    }
+    return count;
+}
+
+uint64_t CountAllFolders(const Patient& patient, uint64_t limit) {
+    uint64_t count = 0;
+    for (const auto& [name, tasks] : patient.shares) {
+        TARQShare share = nullptr;
+        const int found = TARQShareGet(name.c_str(), &share);
+        const TARQ::ShareOwner owner(share);
+        if (found == 0 && owner && owner->path != nullptr && count < limit) {
+            count += CountFolders(owner->path, limit - count);
+        }
+    }
+    return count;
+}
+
+}  // namespace
+
+std::string RsyncSetting(const char* key, const std::string& otherwise) {
+    char value[4096] = "";
+    const std::string path = TARQ::RootPath("/usr/tarq/etc/tarqrsync.conf");
+    const bool found =
+        KAPICFileGetSectionValue(path.c_str(), "rsync", key, value, sizeof value) == 0;
+    return found && value[0] != '\0' ? value : otherwise;
+}
+
+bool IsUsableRsync(const std::string& text, std::string& version) {
+    static constexpr char kHead[] = "version ";
+    unsigned int major = 0;
+    unsigned int minor = 0;
+    unsigned int patch = 0;
+    const size_t head = text.find(kHead);
+    // Some builds put a "v" in front of the number.
+    const size_t begin =
+        head == std::string::npos
+            ? head
+            : std::min(text.find_first_not_of('v', head + sizeof kHead - 1), text.size());
+    if (begin == std::string::npos ||
+        sscanf(text.c_str() + begin, "%3u.%3u.%3u", &major, &minor, &patch) < 2) {
+        version.clear();
+        return false;
+    }
+    version = text.substr(begin, text.find_first_of(" \n", begin) - begin);
+    return std::make_pair(major, std::make_pair(minor, patch)) >=
+           std::make_pair(3U, std::make_pair(2U, 1U));
+}
+
+void CheckRsync(const Patient&, Findings& findings) {
+    const std::string program = RsyncSetting("rsync", "rsync");
+    const ChildOutput answer = RunAndRead({program, "--version"});
+    std::string version;
+    if (!answer.failure.empty()) {
+        findings.push_back({"rsync", Verdict::kFailed, answer.failure,
+                            std::string("install rsync ") + kNeededRsync +
+                                " or later, or name it with 'rsync' in tarqrsync.conf"});
+    } else if (!IsUsableRsync(answer.output, version)) {
+        findings.push_back({"rsync", Verdict::kFailed,
+                            version.empty() ? program + " does not say what version it is"
+                                            : program + " is version " + version,
+                            std::string("install rsync ") + kNeededRsync + " or later"});
+    } else {
+        AddFact(findings, "rsync", "version " + version);
+    }
+}
+
+void CheckSSH(const Patient& patient, Findings& findings) {
+    const std::string program = RsyncSetting("ssh", "ssh");
+    const std::string path = FindInPath(program);
+    if (!path.empty()) {
+        AddFact(findings, "ssh", path);
+    } else if (patient.UsesSSH()) {
+        findings.push_back({"ssh", Verdict::kFailed, program + " is not there, and tasks use it",
+                            "install openssh-client, or name it with 'ssh' in tarqrsync.conf"});
+    } else {
+        AddFact(findings, "ssh", "not there; no task uses it");
+    }
+}
+
+void CheckClock(const Patient&, Findings& findings) {
+    const int64_t now = time(nullptr);
+    const std::string shown = programs::HumanTime(now);
+    const std::string state = TARQ::RootPath("/run/systemd/timesync");
+    if (now < kFirstSaneTime) {
+        findings.push_back({"clock", Verdict::kFailed, "it shows " + shown,
+                            "set the clock (timedatectl set-time), or let it be set: timedatectl "
+                            "set-ntp true"});
+    } else if (access(state.c_str(), F_OK) == 0 &&
+               access((state + "/synchronized").c_str(), F_OK) != 0) {
+        findings.push_back({"clock", Verdict::kWarning, shown + ", not yet set over the network",
+                            "timedatectl set-ntp true, and check that a time server is reachable"});
+    } else {
+        AddFact(findings, "clock", shown);
+    }
+}
+
+void CheckWatches(const Patient& patient, Findings& findings) {
+    const uint64_t limit = KernelNumber("/proc/sys/fs/inotify/max_user_watches");
+    const uint64_t instances = KernelNumber("/proc/sys/fs/inotify/max_user_instances");
+    if (limit == 0) {
+        findings.push_back({"watches", Verdict::kWarning, "the kernel tells no limit of watches",
+                            "on-change tasks need a kernel with inotify"});
+        return;
+    }
+    const uint64_t folders = patient.daemon_answers ? patient.daemon["folders"].asUInt64()
+                                                    : CountAllFolders(patient, limit + 1);
+    const std::string counted = programs::Count(folders, "folder") +
+                                (patient.daemon_answers ? " watched" : " in all shares") +
+                                ", at most " + std::to_string(limit);
+    // The kernel keeps some for others, and folders come faster than people look.
+    if (folders >= limit - limit / 10) {
+        findings.push_back(
+            {"watches", folders >= limit ? Verdict::kFailed : Verdict::kWarning, counted,
+             "sysctl fs.inotify.max_user_watches=" + std::to_string(folders * 2) +
+                 " (and a line of that in /etc/sysctl.d/ to keep it): folders that are not "
+                 "watched are compared every so often instead"});
+    } else {
+        AddFact(findings, "watches", counted);
+    }
+    if (instances < kFewInstances) {
+        findings.push_back({"watch instances", Verdict::kWarning,
+                            "at most " + std::to_string(instances) + " of each user",
+                            "sysctl fs.inotify.max_user_instances=128"});
+    }
+}
+
+void CheckSpace(const Patient& patient, Findings& findings) {
+    const std::string store = fs::path(StorePath(patient)).parent_path();
+    for (const std::string& folder : {store, TARQ::RootPath("/tmp")}) {
+        const std::string name = "space in " + folder;
+        struct statvfs info = {};
+        if (statvfs(folder.c_str(), &info) != 0) {
+            // The daemon makes the store's folder when it starts first.
+            const bool missing = errno == ENOENT;
+            findings.push_back({name, missing ? Verdict::kWarning : Verdict::kFailed,
+                                strerror(errno),
+                                missing ? "start the daemon once: systemctl start zel_daemon"
+                                        : "check the folder and its disk"});
+            continue;
+        }
+        const uint64_t free = uint64_t{info.f_bavail} * info.f_frsize;
+        // A file system without a fixed number of inodes says 0.
+        const bool few_inodes = info.f_files != 0 && info.f_favail < kFewInodes;
+        const std::string finding =
+            programs::HumanBytes(free) + " free" +
+            (few_inodes ? ", only " + programs::Count(info.f_favail, "inode") + " left" : "");
+        if (free >= kLittleSpace && !few_inodes) {
+            AddFact(findings, name, finding);
+        } else {
+            const bool none = free < kNoSpace || (few_inodes && info.f_favail == 0);
+            findings.push_back({name, none ? Verdict::kFailed : Verdict::kWarning, finding,
+                                "remove files that nobody needs from this file system"});
+        }
+    }
+}
+
+}  // namespace zelctl

@@ -1,0 +1,97 @@
+#include "programs/zelctl/server/ask.h"
+
+#include <atomic>
+#include <condition_variable>
+#include <mutex>
+#include <thread>
+
+#include "programs/common/server_status.h"
+#include "programs/common/text.h"
+#include "programs/zelctl/base/interrupt.h"
+
+namespace zelctl {
+
+namespace {
+
+using programs::Trouble;
+using programs::Verdict;
+using std::chrono::steady_clock;
+
+constexpr std::chrono::milliseconds kLookForInterrupt(100);
+
+/// Sets a flag when the time is up, or the user has had enough.
+class Patience {
+public:
+    explicit Patience(std::chrono::seconds patience)
+        : until_(steady_clock::now() + patience), thread_([this] { Run(); }) {}
+    ~Patience() {
+        {
+            const std::lock_guard<std::mutex> lock(mutex_);
+            over_ = true;
+        }
+        wake_.notify_one();
+        thread_.join();
+    }
+    Patience(const Patience&) = delete;
+    Patience& operator=(const Patience&) = delete;
+
+    const std::atomic<bool>& Ended() const { return ended_; }
+
+private:
+    void Run() {
+        std::unique_lock<std::mutex> lock(mutex_);
+        while (!wake_.wait_for(lock, kLookForInterrupt, [this] { return over_; })) {
+            if (Interrupted() || steady_clock::now() >= until_) {
+                ended_ = true;
+                return;
+            }
+        }
+    }
+
+    std::mutex mutex_;
+    std::condition_variable wake_;
+    bool over_ = false;
+    std::atomic<bool> ended_{false};
+    steady_clock::time_point until_;
+    std::thread thread_;  // the last: it uses all the others
+};
+
+}  // namespace
+
+Verdict AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& shares,
+                  std::chrono::seconds patience) {
+    const Patience waiting(patience);
+    programs::TaskRun run(info, waiting.Ended());
+    Verdict verdict = run.Connect();
+    if (verdict.Ok()) {
+        verdict = run.CheckPairing(shares);
+    }
+    if (!verdict.Ok() && waiting.Ended() && !Interrupted()) {
+        const std::string& name = info.GetServerName();
+        return {Trouble::kFailed, 0,
+                "server " + (name.empty() ? info.GetServerIP() : name) + " gave no answer within " +
+                    programs::Count(static_cast<uint64_t>(patience.count()), "second")};
+    }
+    return verdict;
+}
+
+bool IsSilence(const Verdict& verdict) {
+    return verdict.trouble == Trouble::kFailed && verdict.status == 0;
+}
+
+bool IsRefusedForGood(const Verdict& verdict) {
+    switch (verdict.status) {
+        case TARQ::Backup::STATUS_AUTHENTICATION:
+        case programs::kUnknownCommand:
+        case programs::kBadArgument:
+        case programs::kOtherAccount:
+        case programs::kConflicts:
+        case programs::kNoEncryption:
+        case programs::kNameTaken:
+            return true;
+        default:
+            return false;
+    }
+}
+
+}  // namespace zelctl

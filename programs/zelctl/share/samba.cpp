@@ -1,0 +1,268 @@
+#include "programs/zelctl/share/samba.h"
+
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <optional>
+#include <set>
+#include <sstream>
+
+#include "programs/common/text.h"
+#include "programs/zelctl/base/child_output.h"
+#include "programs/zelctl/share/commands.h"
+#include "tarq/root_path.h"
+#include "tarq/share.h"
+
+namespace zelctl {
+
+namespace {
+
+using programs::Printable;
+
+namespace fs = std::filesystem;
+
+constexpr char kCatalogue[] = "/usr/tarq/etc/tarqshare.conf";
+constexpr char kRoot[] = "TARQ_ROOT";
+constexpr const char* kOwnSections[] = {"global", "homes", "printers", "print$", "ipc$"};
+
+std::string Trimmed(const std::string& text) {
+    const char* const blanks = " \t\r\n";
+    const size_t begin = text.find_first_not_of(blanks);
+    return begin == std::string::npos
+               ? ""
+               : text.substr(begin, text.find_last_not_of(blanks) - begin + 1);
+}
+
+// Samba takes a value in double quotes for what is in them.
+std::string Unquoted(const std::string& value) {
+    return value.size() >= 2 && value.front() == '"' && value.back() == '"'
+               ? value.substr(1, value.size() - 2)
+               : value;
+}
+
+// Samba folds names like this; those of the catalogue differ in more than capitals as well.
+std::string Folded(std::string text) {
+    std::transform(text.begin(), text.end(), text.begin(), [](char c) {
+        return static_cast<char>(c >= 'A' && c <= 'Z' ? c - 'A' + 'a' : c);
+    });
+    return text;
+}
+
+bool IsYes(const std::string& value) {
+    const std::string folded = Folded(value);
+    return folded == "yes" || folded == "true" || folded == "1";
+}
+
+/// One section, as its lines come.
+struct Section {
+    std::string name;
+    std::string path;
+    bool printable = false;
+    bool available = true;
+
+    void Take(const std::string& key, const std::string& value) {
+        if (key == "path" || key == "directory") {
+            path = Unquoted(value);
+        } else if (key == "printable" || key == "print ok") {
+            printable = IsYes(value);
+        } else if (key == "available") {
+            available = IsYes(value);
+        }
+    }
+
+    bool IsShare() const {
+        const auto* const own =
+            std::find(std::begin(kOwnSections), std::end(kOwnSections), Folded(name));
+        return !name.empty() && !printable && own == std::end(kOwnSections);
+    }
+
+    std::string Refusal() const {
+        if (path.empty()) {
+            return "it names no folder";
+        }
+        if (path.find('%') != std::string::npos) {
+            return "its folder " + path + " is another one for each user or client";
+        }
+        if (path.front() != '/') {
+            return "its folder " + path + " is no absolute path";
+        }
+        return available ? "" : "Samba has it switched off (available = no)";
+    }
+};
+
+std::string FaultOfFolder(const std::string& path) {
+    struct stat info = {};
+    if (stat(path.c_str(), &info) != 0) {
+        return "its folder " + path + " is not available: " + strerror(errno);
+    }
+    return S_ISDIR(info.st_mode) ? "" : path + " is no folder";
+}
+
+// The shares that are wanted, or all; names that Samba does not know are told.
+ExitCode Choose(const std::vector<std::string>& names, std::vector<SambaShare>& shares) {
+    if (names.empty()) {
+        return kOk;
+    }
+    std::vector<SambaShare> chosen;
+    ExitCode result = kOk;
+    for (const std::string& name : names) {
+        const auto found = std::find_if(shares.begin(), shares.end(), [&](const SambaShare& share) {
+            return Folded(share.name) == Folded(name);
+        });
+        if (found == shares.end()) {
+            result = Fail(kLocal, "Samba has no share '%s'", Printable(name).c_str());
+        } else {
+            chosen.push_back(*found);
+        }
+    }
+    shares = std::move(chosen);
+    return result;
+}
+
+/// A copy of the catalogue, which takes the place of the catalogue for as long as this lives: what
+/// an import would do is seen by doing it there.
+class ScratchCatalogue {
+public:
+    ScratchCatalogue() {
+        const fs::path before = TARQ::RootPath(kCatalogue);
+        std::string folder = fs::temp_directory_path(error_) / "zelctl-XXXXXX";
+        if (mkdtemp(folder.data()) == nullptr) {
+            error_ = std::error_code(errno, std::generic_category());
+            return;
+        }
+        folder_ = folder;
+        const fs::path copy = folder + kCatalogue;
+        fs::create_directories(copy.parent_path(), error_);
+        if (!error_ && fs::exists(before, error_)) {
+            fs::copy_file(before, copy, error_);
+        }
+        const char* const root = getenv(kRoot);
+        root_ = root != nullptr ? std::optional<std::string>(root) : std::nullopt;
+        setenv(kRoot, folder.c_str(), 1);
+    }
+    ~ScratchCatalogue() {
+        if (folder_.empty()) {
+            return;
+        }
+        if (root_) {
+            setenv(kRoot, root_->c_str(), 1);
+        } else {
+            unsetenv(kRoot);
+        }
+        std::error_code ignored;
+        fs::remove_all(folder_, ignored);
+    }
+    ScratchCatalogue(const ScratchCatalogue&) = delete;
+    ScratchCatalogue& operator=(const ScratchCatalogue&) = delete;
+
+    /// Why it could not be made; none when it was.
+    const std::error_code& Error() const { return error_; }
+
+private:
+    std::error_code error_;
+    fs::path folder_;
+    std::optional<std::string> root_;
+};
+
+ExitCode Preview(const SambaShare& share) {
+    const std::string name = Printable(share.name);
+    if (TARQShareAdd(share.name.c_str(), share.path.c_str(), TARQ_SHARE_WINDOWS) < 0) {
+        return Fail(kLocal, "share '%s' would be left out: %s", name.c_str(),
+                    KAPICErrGet() == TARQ_ERR_BAD_PARAMETER
+                        ? "its name or its folder cannot be a share's"
+                        : KAPICErrText(KAPICErrGet()));
+    }
+    printf("Share '%s' would be %s\n", name.c_str(), Printable(share.path).c_str());
+    return kOk;
+}
+
+}  // namespace
+
+std::vector<SambaShare> ParseSambaShares(const std::string& text) {
+    std::vector<Section> sections;
+    std::istringstream lines(text);
+    for (std::string line; std::getline(lines, line);) {
+        line = Trimmed(line);
+        if (line.empty() || line.front() == '#' || line.front() == ';') {
+            continue;
+        }
+        if (line.front() == '[' && line.back() == ']') {
+            sections.emplace_back();
+            sections.back().name = Trimmed(line.substr(1, line.size() - 2));
+            continue;
+        }
+        const size_t equals = line.find('=');
+        if (equals != std::string::npos && !sections.empty()) {
+            sections.back().Take(Folded(Trimmed(line.substr(0, equals))),
+                                 Trimmed(line.substr(equals + 1)));
+        }
+    }
+    std::vector<SambaShare> shares;
+    for (const Section& section : sections) {
+        if (section.IsShare()) {
+            shares.push_back({section.name, section.path, section.Refusal()});
+        }
+    }
+    return shares;
+}
+
+ExitCode ImportSambaShares(const std::string& config, const std::vector<std::string>& names,
+                           bool dry_run) {
+    std::vector<std::string> command = {"testparm", "-s"};
+    if (!config.empty()) {
+        command.push_back(config);
+    }
+    const ChildOutput answer = RunAndRead(command);
+    if (!answer.failure.empty()) {
+        return Fail(kLocal, "%s; it belongs to the package samba-common-bin",
+                    Printable(answer.failure).c_str());
+    }
+    if (answer.exit_code != 0) {
+        std::string errors = Trimmed(answer.errors);
+        std::replace(errors.begin(), errors.end(), '\n', ' ');
+        return Fail(kLocal, "testparm cannot read the configuration: %s",
+                    Printable(errors).c_str());
+    }
+    std::vector<SambaShare> shares = ParseSambaShares(answer.output);
+    ExitCode result = Choose(names, shares);
+    std::set<std::string> there;
+    const auto known = ShareNames();
+    if (!known) {
+        return kLocal;
+    }
+    std::transform(known->begin(), known->end(), std::inserter(there, there.end()), Folded);
+    std::optional<ScratchCatalogue> scratch;
+    if (dry_run) {
+        scratch.emplace();
+        if (scratch->Error()) {
+            return Fail(kLocal, "cannot copy the catalogue, to try the import on it: %s",
+                        scratch->Error().message().c_str());
+        }
+    }
+    if (shares.empty() && result == kOk) {
+        puts("Samba has no shares to take over.");
+    }
+    for (const SambaShare& share : shares) {
+        const std::string name = Printable(share.name);
+        const std::string refusal =
+            share.refusal.empty() ? FaultOfFolder(share.path) : share.refusal;
+        if (there.count(Folded(share.name)) != 0) {
+            printf("Share '%s' is in the catalogue already; it stays as it is\n", name.c_str());
+        } else if (!refusal.empty()) {
+            result = Fail(kLocal, "share '%s' %s left out: %s", name.c_str(),
+                          dry_run ? "would be" : "is", Printable(refusal).c_str());
+        } else {
+            const ExitCode added =
+                dry_run ? Preview(share) : AddShare(share.name, share.path, false, true);
+            result = added == kOk ? result : added;
+        }
+    }
+    return result;
+}
+
+}  // namespace zelctl

@@ -1,0 +1,264 @@
+#include "programs/zelctl/task/run.h"
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <map>
+
+#include "ZEL/sync_obj.h"
+#include "programs/common/run_progress.h"
+#include "programs/common/text.h"
+#include "programs/zelctl/base/daemon_client.h"
+#include "programs/zelctl/base/interrupt.h"
+#include "programs/zelctl/base/live_block.h"
+#include "programs/zelctl/push/push.h"
+#include "programs/zelctl/task/view.h"
+
+namespace zelctl {
+
+namespace {
+
+using programs::Printable;
+using std::chrono::steady_clock;
+using ZEL::PObject;
+
+constexpr std::chrono::seconds kLineEvery(10);  // where there is no terminal
+
+/// The daemon's stream of what tasks are doing.
+class TaskStream {
+public:
+    /// `name` is empty for all tasks.
+    ExitCode Open(const std::string& name) {
+        PObject request;
+        request["command"] = "watch";
+        if (!name.empty()) {
+            request["task"] = name;
+        }
+        const ExitCode code = connection_.Connect();
+        return connection_.Tell(code == kOk ? connection_.Send(request) : code);
+    }
+    /// Waits for the next news.
+    ExitCode Next() { return connection_.Tell(connection_.Receive(reply_)); }
+    /// Puts the tasks that do something before those that do not.
+    void PutBusyFirst() {
+        PObject::Array& tasks = reply_["tasks"].asArray();
+        std::stable_partition(tasks.begin(), tasks.end(), [](const PObject& task) {
+            const int status = task["status"].asInt32();
+            return status == ZEL::TASK_STATUS_WAITING || status == ZEL::TASK_STATUS_RUNNING;
+        });
+    }
+    const PObject::Array& Tasks() const {
+        return static_cast<const PObject&>(reply_)["tasks"].asArray();
+    }
+
+private:
+    DaemonConnection connection_;
+    PObject reply_;
+};
+
+const PObject* FindTask(const PObject::Array& tasks, const std::string& name) {
+    const auto found = std::find_if(tasks.begin(), tasks.end(), [&](const PObject& task) {
+        return task["name"].asString() == name;
+    });
+    return found == tasks.end() ? nullptr : &*found;
+}
+
+std::string WaitingLine(const PObject& task) {
+    const std::string name = task["name"].asString();
+    const std::string share = task["progress_share"].asString();
+    if (task["status"].asInt32() != ZEL::TASK_STATUS_RUNNING || share.empty()) {
+        return Printable(name) + ": " + programs::TaskStateWords(RowOf(task));
+    }
+    const TARQ::Backup::RunProgress progress = programs::ProgressOf(task);
+    const std::string what = name == share ? name : name + " " + share;
+    return LiveBlock::Possible() ? programs::ProgressLine(what, progress, LiveBlock::Columns())
+                                 : Printable(what) + ": " + programs::ProgressWords(progress);
+}
+
+/// The runs that a person waits for.
+class Waiting {
+public:
+    /// `after`: the run that had ended when this one was asked for.
+    void Add(const std::string& name, uint64_t after) { left_[name] = after; }
+    bool Over() const { return left_.empty(); }
+    ExitCode Result() const { return result_; }
+
+    /// Takes in what the tasks are doing.
+    void See(const PObject::Array& tasks) {
+        std::vector<std::string> lines;
+        for (auto run = left_.begin(); run != left_.end();) {
+            const PObject* const task = FindTask(tasks, run->first);
+            if (task == nullptr || (*task)["last_run"].asUInt64() != run->second) {
+                block_.Clear();
+                Note(task == nullptr ? Gone(run->first) : Ended(*task));
+                run = left_.erase(run);
+            } else {
+                lines.push_back(WaitingLine(*task));
+                ++run;
+            }
+        }
+        if (LiveBlock::Possible()) {
+            block_.Draw(lines);
+        } else if (steady_clock::now() - last_lines_ >= kLineEvery) {
+            last_lines_ = steady_clock::now();
+            for (const std::string& line : lines) {
+                puts(line.c_str());
+            }
+            fflush(stdout);
+        }
+    }
+
+    /// The user has had enough.
+    ExitCode Leave() {
+        block_.Clear();
+        for (const auto& [name, after] : left_) {
+            Fail(kCancelled,
+                 "no longer waiting; the run of '%s' goes on: 'zelctl task watch' looks on, "
+                 "'zelctl task cancel' ends it",
+                 Printable(name).c_str());
+        }
+        return kCancelled;
+    }
+
+private:
+    void Note(ExitCode code) { result_ = std::max(result_, code); }
+
+    static ExitCode Gone(const std::string& name) {
+        return Fail(kFailed, "task '%s' has been removed or renamed", Printable(name).c_str());
+    }
+
+    static ExitCode Ended(const PObject& task) {
+        const std::string name = Printable(task["name"].asString());
+        const int64_t took = task["last_end"].asInt64() - task["last_start"].asInt64();
+        const std::string took_words =
+            programs::HumanDuration(static_cast<uint64_t>(std::max<int64_t>(took, 0)));
+        switch (task["sync_result"].asInt32()) {
+            case ZEL::TASK_RESULT_SUCCESS:
+                printf("%s: done in %s\n", name.c_str(), took_words.c_str());
+                fflush(stdout);
+                return kOk;
+            case ZEL::TASK_RESULT_CANCELLED:
+                return Fail(kCancelled, "task '%s': the run was cancelled", name.c_str());
+            default: {
+                const int status = task["last_status"].asInt32();
+                return Fail(status == 0 ? kLocal : CodeOf(programs::TroubleOf(status)),
+                            "task '%s' failed after %s: %s", name.c_str(), took_words.c_str(),
+                            Printable(OneLine(task["last_error"].asString())).c_str());
+            }
+        }
+    }
+
+    std::map<std::string, uint64_t> left_;  // by task, the last run before
+    ExitCode result_ = kOk;
+    LiveBlock block_;
+    steady_clock::time_point last_lines_ = steady_clock::now();
+};
+
+/// Where there is no terminal: a line for each task whose state is another than before.
+class ChangeLines {
+public:
+    void See(const PObject::Array& tasks) {
+        for (const PObject& task : tasks) {
+            const programs::TaskRow row = RowOf(task);
+            std::string line = Printable(task["name"].asString()) + ": " +
+                               programs::TaskStateWords(row) + ", last run " +
+                               programs::TaskResultWord(row.result) +
+                               (row.error.empty() ? "" : ": " + Printable(row.error));
+            std::string& before = lines_[task["name"].asString()];
+            if (line != before) {
+                printf("%s  %s\n", programs::HumanTime(time(nullptr)).c_str(), line.c_str());
+                before = std::move(line);
+            }
+        }
+        fflush(stdout);
+    }
+
+private:
+    std::map<std::string, std::string> lines_;
+};
+
+}  // namespace
+
+ExitCode RunTasks(const std::vector<std::string>& names, bool wait) {
+    Waiting waiting;
+    for (const std::string& name : names) {
+        PObject reply;
+        const ExitCode code = AskDaemon(TaskRequest("task_run", name), reply);
+        if (code != kOk) {
+            return code;
+        }
+        waiting.Add(name, reply["after"].asUInt64());
+        if (!wait) {
+            printf("Task '%s' runs as soon as a worker is free.\n", Printable(name).c_str());
+        }
+    }
+    if (!wait) {
+        return kOk;
+    }
+    WatchForInterrupt();
+    TaskStream stream;
+    ExitCode code = stream.Open(names.size() == 1 ? names[0] : "");
+    while (code == kOk && !waiting.Over()) {
+        code = stream.Next();
+        if (code == kOk) {
+            waiting.See(stream.Tasks());
+        }
+    }
+    if (code == kCancelled) {
+        return waiting.Leave();
+    }
+    return code == kOk ? waiting.Result() : code;
+}
+
+ExitCode ListTaskChanges(const std::vector<std::string>& names) {
+    for (const std::string& name : names) {
+        PObject request = TaskRequest("task_show", name);
+        request["secrets"] = 1;
+        PObject reply;
+        ExitCode code = AskDaemon(request, reply);
+        if (code != kOk) {
+            return code;
+        }
+        const PObject& task = reply["task"];
+        ZEL::SyncTask record;
+        ZEL::PObj2SyncTask(task, record);
+        PushOptions options;
+        const auto& shares = record.GetInfo().GetShareList();
+        options.shares.assign(shares.begin(), shares.end());
+        for (const PObject& pattern : task["exclude"].asArray()) {
+            options.excludes.push_back(pattern.asString());
+        }
+        options.connection.server = ServerOf(task);
+        options.info = record.GetInfo().GetSyncInfo();
+        options.dry_run = true;
+        code = Push(options);
+        if (code != kOk) {
+            return code;
+        }
+    }
+    return kOk;
+}
+
+ExitCode WatchTasks(const std::string& name) {
+    WatchForInterrupt();
+    TaskStream stream;
+    LiveBlock block;
+    ChangeLines lines;
+    ExitCode code = stream.Open(name);
+    while (code == kOk) {
+        code = stream.Next();
+        if (code != kOk) {
+            break;
+        }
+        if (LiveBlock::Possible()) {
+            stream.PutBusyFirst();  // a window may not hold all
+            block.Draw(TaskLines(stream.Tasks()));
+        } else {
+            lines.See(stream.Tasks());
+        }
+    }
+    // The user's own end is the only good one.
+    return code == kCancelled ? kOk : code;
+}
+
+}  // namespace zelctl

@@ -1,0 +1,272 @@
+#include "programs/zelctl/task/view.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <iterator>
+#include <nlohmann/json.hpp>
+
+#include "ZEL/sync_obj.h"
+#include "programs/common/run_progress.h"
+#include "programs/common/schedule_words.h"
+#include "programs/common/table.h"
+#include "programs/common/text.h"
+
+namespace zelctl {
+
+namespace {
+
+using nlohmann::ordered_json;
+using programs::HumanTime;
+using programs::Table;
+using ZEL::PObject;
+
+std::string Joined(const PObject::Array& texts) {
+    std::string joined;
+    for (const PObject& text : texts) {
+        joined += (joined.empty() ? "" : ",") + text.asString();
+    }
+    return joined;
+}
+
+template <typename T>
+std::optional<T> NumberOf(const PObject& value) {
+    return value.isInteger() ? std::optional<T>(static_cast<T>(value.asUInt64())) : std::nullopt;
+}
+
+std::string TimeOf(const PObject& moment, const char* otherwise) {
+    return moment.isInteger() ? HumanTime(moment.asInt64()) : otherwise;
+}
+
+std::string OnOff(const PObject& flag) {
+    return flag.asBool() ? "yes" : "no";
+}
+
+/// What there is to say of one thing: a line for each fact, or JSON.
+class Facts {
+public:
+    void Add(const char* what, const std::string& value) {
+        if (!value.empty()) {
+            lines_.emplace_back(what, value);
+        }
+    }
+    void Print() const {
+        size_t width = 0;
+        for (const auto& line : lines_) {
+            width = std::max(width, line.first.size());
+        }
+        for (const auto& [what, value] : lines_) {
+            printf("%-*s  %s\n", static_cast<int>(width), what.c_str(),
+                   programs::Printable(value).c_str());
+        }
+    }
+
+private:
+    std::vector<std::pair<std::string, std::string>> lines_;
+};
+
+// The daemon's keys as they are, with words beside its numbers.
+ordered_json TaskJson(const PObject& task) {
+    ordered_json json = ToJson(task);
+    json.erase("pswd");  // never shown, whoever sends it
+    json["schedule"] = ScheduleOf(task);
+    json["state"] = programs::TaskStatusWord(task["status"].asInt32());
+    json["result"] = programs::TaskResultWord(task["sync_result"].asInt32());
+    return json;
+}
+
+ordered_json ListJson(const PObject::Array& list, ordered_json (*to_json)(const PObject&)) {
+    ordered_json array = ordered_json::array();
+    for (const PObject& element : list) {
+        array.push_back(to_json(element));
+    }
+    return array;
+}
+
+// Each line by itself: what came from outside may hold anything else.
+void PrintIndented(const std::string& text) {
+    for (size_t begin = 0; begin < text.size();) {
+        const size_t end = std::min(text.find('\n', begin), text.size());
+        printf("    %s\n", programs::Printable(text.substr(begin, end - begin)).c_str());
+        begin = end + 1;
+    }
+}
+
+ordered_json RunJson(const PObject& run) {
+    ordered_json json = ToJson(run);
+    json["result"] =
+        run["end"].isInteger() ? programs::TaskResultWord(run["sync_result"].asInt32()) : "running";
+    return json;
+}
+
+}  // namespace
+
+programs::TaskRow RowOf(const PObject& task) {
+    programs::TaskRow row;
+    row.name = task["name"].asString();
+    row.shares = Joined(task["share_list"].asArray());
+    row.server = ServerOf(task);
+    row.schedule = ScheduleOf(task);
+    row.status = task["status"].asInt32();
+    row.result = task["sync_result"].asInt32();
+    row.last_end = NumberOf<int64_t>(task["last_end"]);
+    row.next_run = NumberOf<int64_t>(task["next_run"]);
+    row.retry_in = NumberOf<uint64_t>(task["retry_in"]);
+    if (task["progress_share"].isString()) {
+        row.progress = programs::ProgressState(programs::ProgressOf(task));
+    }
+    row.pending = task["pending"].asUInt64();
+    row.note = task["note"].asString();
+    if (row.result == ZEL::TASK_RESULT_FAILED) {
+        row.error = OneLine(task["last_error"].asString());
+    }
+    return row;
+}
+
+std::string ScheduleOf(const PObject& task) {
+    if (task["schedule"].isString()) {
+        return task["schedule"].asString();
+    }
+    ZEL::SyncTask record;
+    ZEL::PObj2SyncTask(task, record);
+    // A list may leave all but the mode out.
+    return task.hasMember("schedule_begin_hour")
+               ? programs::DescribeSchedule(record.GetInfo().GetSchedule())
+               : record.GetInfo().GetSchedule().GetModeStr();
+}
+
+std::string ServerOf(const PObject& task) {
+    std::string name = task["server_name"].asString();
+    return name.empty() ? task["server_ip"].asString() : name;
+}
+
+std::string OneLine(const std::string& text) {
+    std::string line;
+    for (const char c : text) {
+        if (c == '\n') {
+            line += "; ";
+        } else {
+            line += c;
+        }
+    }
+    return line;
+}
+
+std::vector<std::string> TaskLines(const PObject::Array& tasks) {
+    std::vector<programs::TaskRow> rows;
+    rows.reserve(tasks.size());
+    std::transform(tasks.begin(), tasks.end(), std::back_inserter(rows), RowOf);
+    return programs::TaskLines(std::move(rows), programs::OutputWidth());
+}
+
+void PrintTasks(const PObject::Array& tasks, bool as_json) {
+    if (as_json) {
+        PrintJson(ListJson(tasks, TaskJson));
+        return;
+    }
+    for (const std::string& line : TaskLines(tasks)) {
+        puts(line.c_str());
+    }
+}
+
+void PrintTask(const PObject& task, bool as_json) {
+    if (as_json) {
+        PrintJson(TaskJson(task));
+        return;
+    }
+    Facts facts;
+    facts.Add("name", task["name"].asString());
+    facts.Add("id", std::to_string(task["id"].asUInt64()));
+    facts.Add("shares", Joined(task["share_list"].asArray()));
+    facts.Add("server", ServerOf(task));
+    facts.Add("user", task["user"].asString());
+    facts.Add("ssh", task["ssh"].asBool() && task["ssh_port"].asUInt32() != 0
+                         ? "yes, port " + std::to_string(task["ssh_port"].asUInt32())
+                         : OnOff(task["ssh"]));
+    facts.Add("compress", OnOff(task["compress"]));
+    facts.Add("delta", OnOff(task["block"]));
+    facts.Add("time-out", programs::Count(task["rsync_timeout"].asUInt32(), "second"));
+    const uint32_t limit = task["max_bandwidth"].asUInt32();
+    facts.Add("bandwidth limit", limit == 0 ? "none" : std::to_string(limit) + " KiB/s");
+    facts.Add("exclude", Joined(task["exclude"].asArray()));
+    facts.Add("schedule", ScheduleOf(task));
+    facts.Add("next run", TimeOf(task["next_run"], "-"));
+    facts.Add("state", programs::TaskStateWords(RowOf(task)));
+    if (task["progress_share"].isString()) {
+        facts.Add("progress", task["progress_share"].asString() + ": " +
+                                  programs::ProgressWords(programs::ProgressOf(task)));
+    }
+    facts.Add("last run", programs::TaskLastRunWords(RowOf(task)));
+    facts.Add("error", OneLine(task["last_error"].asString()));
+    facts.Add("pending changes", std::to_string(task["pending"].asUInt64()));
+    facts.Add("note", task["note"].asString());
+    facts.Print();
+}
+
+void PrintRuns(const PObject::Array& runs, bool as_json) {
+    if (as_json) {
+        PrintJson(ListJson(runs, RunJson));
+        return;
+    }
+    Table table({"RUN", "START", "TOOK", "RESULT", "REASON", "FILES", "DELETED", "SENT", "ERROR"});
+    for (const PObject& run : runs) {
+        const bool ended = run["end"].isInteger();
+        const int64_t took = run["end"].asInt64() - run["start"].asInt64();
+        table.Add(
+            {std::to_string(run["run"].asUInt64()), HumanTime(run["start"].asInt64()),
+             ended ? programs::HumanDuration(took < 0 ? 0 : static_cast<uint64_t>(took)) : "-",
+             ended ? programs::TaskResultWord(run["sync_result"].asInt32()) : "running",
+             run["reason"].asString(), std::to_string(run["files_sent"].asUInt64()),
+             std::to_string(run["files_deleted"].asUInt64()),
+             programs::HumanBytes(run["bytes_sent"].asUInt64()), OneLine(run["error"].asString())});
+    }
+    table.Print(false);
+    for (const PObject& run : runs) {
+        if (run["details"].isString()) {
+            printf("\nRun %llu:\n", run["run"].asUInt64());
+            PrintIndented(run["details"].asString());
+        }
+    }
+}
+
+void PrintDaemonStatus(const PObject& status, bool as_json) {
+    if (as_json) {
+        ordered_json json = ToJson(status);
+        json.erase("result");
+        PrintJson(json);
+        return;
+    }
+    Facts facts;
+    facts.Add("version", status["version"].asString());
+    facts.Add("process", std::to_string(status["pid"].asUInt64()));
+    facts.Add("started", TimeOf(status["started"], "-"));
+    facts.Add("tasks", std::to_string(status["tasks"].asUInt64()) + ", " +
+                           std::to_string(status["running"].asUInt64()) + " running (" +
+                           programs::Count(status["workers"].asUInt64(), "worker") + ")");
+    facts.Add("watching", programs::Count(status["folders"].asUInt64(), "folder") +
+                              (status["searching"].asBool() ? ", still searching" : ""));
+    facts.Add("store", status["store"].asString());
+    facts.Print();
+}
+
+ordered_json ToJson(const PObject& value) {
+    if (value.isMap()) {
+        ordered_json object = ordered_json::object();
+        for (const auto& [key, element] : value.asMap()) {
+            object[key] = ToJson(element);
+        }
+        return object;
+    }
+    if (value.isArray()) {
+        return ListJson(value.asArray(), ToJson);
+    }
+    if (value.isString()) {
+        return value.asString();
+    }
+    return value.isInteger() ? ordered_json(value.asInt64()) : ordered_json();
+}
+
+void PrintJson(const ordered_json& json) {
+    puts(json.dump(2, ' ', false, ordered_json::error_handler_t::replace).c_str());
+}
+
+}  // namespace zelctl
