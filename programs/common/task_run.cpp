@@ -243,14 +243,14 @@ Reach ReachOfCommand(int status) {
 using Orders = std::vector<const ShareOrder*>;
 
 // What a run that has ended did not come to.
-void LeaveUndone(Orders::const_iterator begin, Orders::const_iterator end, const Verdict& verdict,
-                 std::vector<Undone>& undone) {
+void LeaveUndone(Orders::const_iterator begin, Orders::const_iterator end,
+                 const RunFailure& verdict, std::vector<Undone>& undone) {
     for (; begin != end; ++begin) {
         undone.push_back({(*begin)->share, (*begin)->paths, verdict, false});
     }
 }
 
-void LeaveAllUndone(const Orders& shares, const Verdict& verdict, std::vector<Undone>& undone) {
+void LeaveAllUndone(const Orders& shares, const RunFailure& verdict, std::vector<Undone>& undone) {
     const size_t first = undone.size();
     LeaveUndone(shares.begin(), shares.end(), verdict, undone);
     if (first < undone.size()) {
@@ -259,7 +259,7 @@ void LeaveAllUndone(const Orders& shares, const Verdict& verdict, std::vector<Un
 }
 
 // The one verdict of a run: the failure that ended it, or the first, with the others named.
-Verdict Summed(const std::vector<Undone>& undone) {
+RunFailure Summed(const std::vector<Undone>& undone) {
     std::vector<const Undone*> failed;
     size_t not_tried = 0;
     for (const Undone& item : undone) {
@@ -278,7 +278,7 @@ Verdict Summed(const std::vector<Undone>& undone) {
     if (ended != failed.end()) {
         std::rotate(failed.begin(), ended, std::next(ended));
     }
-    Verdict sum = failed.front()->verdict;
+    RunFailure sum = failed.front()->verdict;
     size_t told = 1;
     for (; told < failed.size() && sum.error.size() < kMaxToldBytes; ++told) {
         sum.error += "; " + failed[told]->verdict.error;
@@ -309,7 +309,7 @@ Trouble TroubleOf(int status) {
                : Trouble::kRefused;
 }
 
-RunResult NothingDone(const RunOrder& order, const Verdict& verdict) {
+RunResult NothingDone(const RunOrder& order, const RunFailure& verdict) {
     Orders shares;
     for (const ShareOrder& share : order.shares) {
         shares.push_back(&share);
@@ -333,7 +333,7 @@ struct TaskRun::Impl {
         return wishes;
     }
 
-    Verdict Failed(const std::string& what, int status, Reach reach = Reach::kRun) const {
+    RunFailure Failed(const std::string& what, int status, Reach reach = Reach::kRun) const {
         if (cancel) {
             return {Trouble::kCancelled, 0, "ended by the user; the next run completes the copy"};
         }
@@ -344,15 +344,15 @@ struct TaskRun::Impl {
 
     bool Silent() const { return report.status == TARQ::Backup::STATUS_TIMEOUT; }
 
-    static Verdict CheckShare(const std::string& share) {
+    static RunFailure CheckShare(const std::string& share) {
         std::string problem = ShareProblem(share);
-        return problem.empty() ? Verdict()
-                               : Verdict{Trouble::kLocal, 0, std::move(problem), Reach::kShare};
+        return problem.empty() ? RunFailure()
+                               : RunFailure{Trouble::kLocal, 0, std::move(problem), Reach::kShare};
     }
 
     // Finds the server. One that answers the probe, and then not the question for its version, is
     // not a server without versions: what comes next would be put to it in the wrong form.
-    Verdict Find() {
+    RunFailure Find() {
         const ScopedRunOptions watched(Reporting());
         int status = rsyncer.Initialize(info);
         const bool version_failed = report.status > kDone && report.status != kUnknownCommand &&
@@ -362,13 +362,13 @@ struct TaskRun::Impl {
         }
         connected = status == 0;
         const std::string& name = info.GetServerName();
-        return connected ? Verdict()
+        return connected ? RunFailure()
                          : Failed("cannot use server " + (name.empty() ? info.GetServerIP() : name),
                                   status);
     }
 
     // One command pairs as many shares as it carries.
-    Verdict Pair(bool dry_run, const std::vector<std::string>& shares) {
+    RunFailure Pair(bool dry_run, const std::vector<std::string>& shares) {
         for (size_t begin = 0; begin < shares.size();) {
             size_t end = begin;
             for (size_t bytes = 0; end < shares.size(); ++end) {
@@ -377,7 +377,7 @@ struct TaskRun::Impl {
                     break;
                 }
             }
-            Verdict paired =
+            RunFailure paired =
                 PairTogether(dry_run, {&shares[begin], &shares[begin] + (end - begin)});
             if (!paired.Ok()) {
                 return paired;
@@ -387,7 +387,7 @@ struct TaskRun::Impl {
         return {};
     }
 
-    Verdict PairTogether(bool dry_run, const std::list<std::string>& shares) {
+    RunFailure PairTogether(bool dry_run, const std::list<std::string>& shares) {
         std::list<std::string> conflicts;
         int status = 0;
         const ScopedRunOptions watched(Reporting());
@@ -414,7 +414,7 @@ struct TaskRun::Impl {
 
     // Announces a share, and pairs first when the server does not know this client. For this share
     // alone: one that the server refuses must not stand in the way of the others.
-    Verdict Start(const std::string& share) {
+    RunFailure Start(const std::string& share) {
         for (const bool may_pair : {true, false}) {
             int status = 0;
             {
@@ -424,7 +424,7 @@ struct TaskRun::Impl {
                 }
             }
             if (status == kNotPaired && may_pair) {
-                Verdict paired = Pair(false, {share});
+                RunFailure paired = Pair(false, {share});
                 if (!paired.Ok()) {
                     return paired;
                 }
@@ -433,28 +433,28 @@ struct TaskRun::Impl {
                 }
                 continue;
             }
-            return status == kDone ? Verdict()
+            return status == kDone ? RunFailure()
                                    : Failed("the server does not take " + Quoted(share), status,
                                             ReachOfCommand(status));
         }
         return {};
     }
 
-    Verdict SendKey(const std::string& share) {
+    RunFailure SendKey(const std::string& share) {
         const ScopedRunOptions watched(Reporting());
         const int status = rsyncer.SyncEncryptKey(share);
-        return status == 0 ? Verdict()
+        return status == 0 ? RunFailure()
                            : Failed("the key of encrypted " + Quoted(share) + " cannot be sent",
                                     status, Reach::kShare);
     }
 
     // The server's answer is no reason to end the run; that there is none is: each of the commands
     // and copies that follow would wait as long for its own.
-    Verdict Announce(const std::string& task) {
+    RunFailure Announce(const std::string& task) {
         const ScopedRunOptions watched(Reporting());
         int status = 0;
         rsyncer.SendBeacon(task, status);
-        return Silent() ? Failed("the server does not answer", report.status) : Verdict();
+        return Silent() ? Failed("the server does not answer", report.status) : RunFailure();
     }
 
     void PushShares(const RunOrder& order, const Orders& shares, RunTotals& totals,
@@ -466,7 +466,7 @@ struct TaskRun::Impl {
         bool announced = order.announce;
         {
             if (announced) {
-                const Verdict told = Announce(order.task);
+                const RunFailure told = Announce(order.task);
                 if (!told.Ok()) {
                     LeaveAllUndone(shares, told, undone);
                     return;
@@ -480,7 +480,7 @@ struct TaskRun::Impl {
                 if (undone.size() == before) {
                     continue;
                 }
-                Verdict end = undone.back().verdict;
+                RunFailure end = undone.back().verdict;
                 if (end.reach == Reach::kRun || !heard) {
                     end.reach = Reach::kRun;
                     LeaveUndone(share, shares.end(), end, undone);
@@ -499,7 +499,7 @@ struct TaskRun::Impl {
     // Adds to `undone` what the server has not taken.
     void PushShare(const RunOrder& order, const ShareOrder& share, RunTotals& totals,
                    std::vector<Undone>& undone) {
-        Verdict result = Start(share.share);
+        RunFailure result = Start(share.share);
         if (!result.Ok()) {
             heard = !Silent();
             undone.push_back({share.share, share.paths, std::move(result)});
@@ -528,7 +528,7 @@ struct TaskRun::Impl {
         if (!heard) {
             return;
         }
-        Verdict closed = Finish(share.share, completed, share.rest_waits);
+        RunFailure closed = Finish(share.share, completed, share.rest_waits);
         if (completed && !closed.Ok()) {
             undone.push_back({share.share, share.paths, std::move(closed)});
         } else if (completed && listener.on_share_done) {
@@ -550,7 +550,7 @@ struct TaskRun::Impl {
                                         : PresentParts(facts.GetModulePath(), share.paths);
         bool touched_folder = false;
         for (size_t i = 0; i < parts.size(); ++i) {
-            Verdict result = SendFiles(order, share.share, parts[i].path, sent);
+            RunFailure result = SendFiles(order, share.share, parts[i].path, sent);
             touched_folder = touched_folder || IsAtTheTop(parts[i].path);
             if (result.Ok()) {
                 continue;
@@ -582,8 +582,8 @@ struct TaskRun::Impl {
         sent.bytes_received += report.bytes_received;
     }
 
-    Verdict SendFiles(const RunOrder& order, const std::string& share, const std::string& path,
-                      RunReport& sent) {
+    RunFailure SendFiles(const RunOrder& order, const std::string& share, const std::string& path,
+                         RunReport& sent) {
         RunOptions wishes = Reporting();
         wishes.bandwidth_limit = info.GetMaxBandwidth();
         if (listener.on_progress) {
@@ -600,9 +600,10 @@ struct TaskRun::Impl {
             if (ran == 0 && status == 0 && report.status < 0) {
                 // Nothing was there to run for. A path that has gone meanwhile is a change that
                 // will be told, of the folder above it; a share that has gone is a fault.
-                return path == "/" ? Verdict{Trouble::kLocal, 0,
-                                             Quoted(share) + ": its folder is gone", Reach::kShare}
-                                   : Verdict();
+                return path == "/"
+                           ? RunFailure{Trouble::kLocal, 0, Quoted(share) + ": its folder is gone",
+                                        Reach::kShare}
+                           : RunFailure();
             }
             ++rsync_runs;
             sent.files_sent += report.files_sent;
@@ -623,19 +624,20 @@ struct TaskRun::Impl {
         const bool part = busy || report.cause == RunCause::UNREADABLE_SOURCE;
         const std::string what =
             path == "/" ? " is not complete" : ": " + Printable(path) + " is not complete";
-        Verdict failed = Failed(Quoted(share) + what, status, part ? Reach::kPaths : Reach::kShare);
+        RunFailure failed =
+            Failed(Quoted(share) + what, status, part ? Reach::kPaths : Reach::kShare);
         if (busy && failed.trouble == Trouble::kFailed) {
             failed.trouble = Trouble::kBusy;
         }
         return failed;
     }
 
-    Verdict Finish(const std::string& share, bool completed, bool rest_waits) {
+    RunFailure Finish(const std::string& share, bool completed, bool rest_waits) {
         const LastWord last_word;
         const RunReport of_the_run = report;
         int status = 0;
         int sent = 0;
-        Verdict result;
+        RunFailure result;
         {
             const ScopedRunOptions watched(Reporting());
             sent = rsyncer.FinishSync(completed && !rest_waits ? "share" : "abort", share, status);
@@ -649,9 +651,9 @@ struct TaskRun::Impl {
         return result;
     }
 
-    Verdict ListShare(const RunOrder& order, const ShareOrder& share,
-                      const ChangeHandler& on_change,
-                      const std::function<void(const std::string&)>& on_missing) {
+    RunFailure ListShare(const RunOrder& order, const ShareOrder& share,
+                         const ChangeHandler& on_change,
+                         const std::function<void(const std::string&)>& on_missing) {
         for (const std::string& path : share.paths) {
             RunOptions wishes = Reporting();
             wishes.dry_run = true;
@@ -686,12 +688,12 @@ TaskRun::TaskRun(const ZEL::SyncInfo& info, const std::atomic<bool>& cancel, Run
 
 TaskRun::~TaskRun() = default;
 
-Verdict TaskRun::Connect() {
+RunFailure TaskRun::Connect() {
     const CancelScope scope(impl_->cancel);
     return impl_->Find();
 }
 
-Verdict TaskRun::CheckPairing(const std::vector<std::string>& shares) {
+RunFailure TaskRun::CheckPairing(const std::vector<std::string>& shares) {
     const CancelScope scope(impl_->cancel);
     return impl_->Pair(true, shares);
 }
@@ -703,7 +705,7 @@ RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
     RunResult result;
     Orders ready;
     for (const ShareOrder& share : order.shares) {
-        Verdict fit = Impl::CheckShare(share.share);
+        RunFailure fit = Impl::CheckShare(share.share);
         if (fit.Ok()) {
             ready.push_back(&share);
         } else {
@@ -711,7 +713,7 @@ RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
         }
     }
     // A share that is away is no reason to speak to the server.
-    const Verdict found = ready.empty() || impl_->connected ? Verdict() : impl_->Find();
+    const RunFailure found = ready.empty() || impl_->connected ? RunFailure() : impl_->Find();
     if (found.Ok()) {
         impl_->PushShares(order, ready, totals, result.undone);
     } else {
@@ -721,11 +723,11 @@ RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
     return result;
 }
 
-Verdict TaskRun::List(const RunOrder& order, const ChangeHandler& on_change,
-                      const std::function<void(const std::string& share)>& on_missing) {
+RunFailure TaskRun::List(const RunOrder& order, const ChangeHandler& on_change,
+                         const std::function<void(const std::string& share)>& on_missing) {
     const CancelScope scope(impl_->cancel);
     for (const ShareOrder& share : order.shares) {
-        Verdict result = impl_->ListShare(order, share, on_change, on_missing);
+        RunFailure result = impl_->ListShare(order, share, on_change, on_missing);
         if (!result.Ok()) {
             return result;
         }

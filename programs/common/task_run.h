@@ -33,8 +33,8 @@ enum class Reach {
     kPaths   ///< one path of a share: what is beside it is taken
 };
 
-/// How an operation ended, for a program and for a person.
-struct Verdict {
+/// How an operation of a run ended, for a program and for a person.
+struct RunFailure {
     Trouble trouble = Trouble::kNone;
     int status = 0;     ///< the server's or rsync's (tarq/rsync_wrapper.h); 0 for local troubles
     std::string error;  ///< what failed, where and what to do; empty when nothing did
@@ -77,7 +77,7 @@ struct RunOrder {
 struct Undone {
     std::string share;
     std::vector<std::string> paths;  ///< of its order
-    Verdict verdict;
+    RunFailure verdict;
     bool tried = true;  ///< false: the run had ended before it came to them
 };
 
@@ -85,12 +85,12 @@ struct Undone {
 struct RunResult {
     /// Of the failure that ended the run, else of the first. Its text names each failure, with its
     /// reason; after many it tells their number.
-    Verdict verdict;
+    RunFailure verdict;
     std::vector<Undone> undone;  ///< in the order of the run
 };
 
 /// That of a run that has failed as a whole, before anything of `order` was taken.
-RunResult NothingDone(const RunOrder& order, const Verdict& verdict);
+RunResult NothingDone(const RunOrder& order, const RunFailure& verdict);
 
 /// Told on the running thread; each may be empty.
 struct RunListener {
@@ -116,9 +116,9 @@ public:
     TaskRun& operator=(const TaskRun&) = delete;
 
     /// Finds an address of the server that answers. Changes nothing there.
-    Verdict Connect();
+    RunFailure Connect();
     /// Asks whether the server takes these shares from this client. Changes nothing there.
-    Verdict CheckPairing(const std::vector<std::string>& shares);
+    RunFailure CheckPairing(const std::vector<std::string>& shares);
     /// Pushes share after share, after Connect() unless that was done, pairing when the server does
     /// not know this client. Shares and paths that fail do not keep the others from being pushed,
     /// unless the failure is one of the whole run. A share that changes while it is copied is
@@ -126,8 +126,8 @@ public:
     RunResult Push(const RunOrder& order, RunTotals& totals);
     /// Tells what Push() would send and delete. A share of which the server holds no copy is told
     /// to `on_missing`. Changes nothing.
-    Verdict List(const RunOrder& order, const ChangeHandler& on_change,
-                 const std::function<void(const std::string& share)>& on_missing);
+    RunFailure List(const RunOrder& order, const ChangeHandler& on_change,
+                    const std::function<void(const std::string& share)>& on_missing);
 
 private:
     struct Impl;

@@ -13,9 +13,9 @@ namespace zel_daemon {
 namespace {
 
 using programs::Reach;
+using programs::RunFailure;
 using programs::RunResult;
 using programs::RunTotals;
-using programs::Verdict;
 using ZEL::Logger;
 
 // A store that could not be written is tried again after so long.
@@ -37,7 +37,7 @@ std::vector<uint64_t> IdsOf(const std::vector<ZEL::Event>& events) {
 }
 
 // A receiver that died in a copy has left what it had of a file beside it, under another name.
-bool BrokeOff(const Verdict& verdict) {
+bool BrokeOff(const RunFailure& verdict) {
     return verdict.reach == Reach::kShare &&
            (verdict.status == TARQ::Backup::STATUS_SOCKET ||
             verdict.status == TARQ::Backup::STATUS_PROTOCOL_STREAM ||
@@ -232,7 +232,7 @@ void Service::StartRun(Task& task, const Due& due) {
 void Service::EndRun(Task& task, const RunResult& result, const RunTotals& totals) {
     const RunPlan plan = task.active->Plan();
     task.active.reset();
-    const Verdict& verdict = result.verdict;
+    const RunFailure& verdict = result.verdict;
     RunRecord record = plan.record;
     record.end = clock_.Now();
     record.status = verdict.status;

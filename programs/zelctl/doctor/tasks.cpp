@@ -54,7 +54,7 @@ public:
     }
 
     /// In the order of the tasks.
-    const programs::Verdict& Answer(size_t task) const { return answers_[task]; }
+    const programs::RunFailure& Answer(size_t task) const { return answers_[task]; }
     /// Its server was silent for another task.
     bool Skipped(size_t task) const { return skipped_[task]; }
 
@@ -77,7 +77,7 @@ private:
 
     const std::vector<const PatientTask*>& tasks_;
     std::atomic<size_t> next_{0};
-    std::vector<programs::Verdict> answers_;
+    std::vector<programs::RunFailure> answers_;
     std::vector<char> skipped_;  // one byte each: threads write side by side
     std::map<std::string, std::atomic<bool>> silent_;
 };
@@ -87,7 +87,7 @@ std::string Quoted(const std::string& name) {
 }
 
 // What to do about a server's refusal, where its own words do not say.
-std::string RemedyOfRefusal(const programs::Verdict& verdict, const PatientTask& task) {
+std::string RemedyOfRefusal(const programs::RunFailure& verdict, const PatientTask& task) {
     const ZEL::TaskInfo& info = task.record.GetInfo();
     switch (verdict.status) {
         case TARQ::Backup::STATUS_AUTHENTICATION:
@@ -101,7 +101,7 @@ std::string RemedyOfRefusal(const programs::Verdict& verdict, const PatientTask&
     }
 }
 
-void CheckAnswer(const programs::Verdict& verdict, bool skipped, const PatientTask& task,
+void CheckAnswer(const programs::RunFailure& verdict, bool skipped, const PatientTask& task,
                  Findings& found) {
     if (skipped) {
         found.push_back({"", Verdict::kFailed,

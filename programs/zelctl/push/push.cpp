@@ -12,13 +12,13 @@ namespace zelctl {
 
 namespace {
 
+using programs::RunFailure;
 using programs::RunOrder;
 using programs::RunTotals;
 using programs::TaskRun;
-using programs::Verdict;
 using TARQ::Backup::RunChange;
 
-ExitCode Tell(const Verdict& verdict) {
+ExitCode Tell(const RunFailure& verdict) {
     return verdict.Ok() ? kOk : Fail(CodeOf(verdict.trouble), "%s", verdict.error.c_str());
 }
 
@@ -58,8 +58,8 @@ ExitCode Prepare(const PushOptions& options, ZEL::SyncInfo& info) {
     return result;
 }
 
-Verdict Connect(TaskRun& run, const std::vector<std::string>& shares) {
-    Verdict verdict = run.Connect();
+RunFailure Connect(TaskRun& run, const std::vector<std::string>& shares) {
+    RunFailure verdict = run.Connect();
     return verdict.Ok() ? run.CheckPairing(shares) : verdict;
 }
 
@@ -102,7 +102,7 @@ ExitCode ListChanges(TaskRun& run, const RunOrder& order) {
         ChangeList list;
         RunOrder alone = order;
         alone.shares = {share};
-        const Verdict verdict = run.List(
+        const RunFailure verdict = run.List(
             alone, [&](const std::string&, const RunChange& change) { list.Add(change); },
             [&](const std::string& name) { list.AddMissing(name); });
         if (!verdict.Ok()) {
@@ -146,7 +146,7 @@ ExitCode Push(const PushOptions& options) {
         order.shares.push_back({share, {options.path}});
     }
     if (options.dry_run) {
-        const Verdict verdict = Connect(run, options.shares);
+        const RunFailure verdict = Connect(run, options.shares);
         return verdict.Ok() ? ListChanges(run, order) : Tell(verdict);
     }
     RunTotals totals;
@@ -166,7 +166,7 @@ ExitCode CheckPairing(const ConnectionOptions& connection, const std::vector<std
         return prepared;
     }
     TaskRun run(info, Interrupted());
-    const Verdict verdict = Connect(run, shares);
+    const RunFailure verdict = Connect(run, shares);
     if (verdict.Ok()) {
         puts("The server would take these shares from this client.");
     }

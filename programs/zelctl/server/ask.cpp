@@ -13,8 +13,8 @@ namespace zelctl {
 
 namespace {
 
+using programs::RunFailure;
 using programs::Trouble;
-using programs::Verdict;
 using std::chrono::steady_clock;
 
 constexpr std::chrono::milliseconds kLookForInterrupt(100);
@@ -58,11 +58,11 @@ private:
 
 }  // namespace
 
-Verdict AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& shares,
-                  std::chrono::seconds patience) {
+RunFailure AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& shares,
+                     std::chrono::seconds patience) {
     const Patience waiting(patience);
     programs::TaskRun run(info, waiting.Ended());
-    Verdict verdict = run.Connect();
+    RunFailure verdict = run.Connect();
     if (verdict.Ok()) {
         verdict = run.CheckPairing(shares);
     }
@@ -75,11 +75,11 @@ Verdict AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& sha
     return verdict;
 }
 
-bool IsSilence(const Verdict& verdict) {
+bool IsSilence(const RunFailure& verdict) {
     return verdict.trouble == Trouble::kFailed && verdict.status == 0;
 }
 
-bool IsRefusedForGood(const Verdict& verdict) {
+bool IsRefusedForGood(const RunFailure& verdict) {
     switch (verdict.status) {
         case TARQ::Backup::STATUS_AUTHENTICATION:
         case programs::kUnknownCommand:

@@ -11,14 +11,14 @@ namespace zelctl {
 
 /// Whether the server takes the shares from this client and account. Changes nothing there. One
 /// that does not answer within `patience` has failed. Any thread.
-programs::Verdict AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& shares,
-                            std::chrono::seconds patience);
+programs::RunFailure AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& shares,
+                               std::chrono::seconds patience);
 
 /// Whether that was the end of the patience.
-bool IsSilence(const programs::Verdict& verdict);
+bool IsSilence(const programs::RunFailure& verdict);
 
 /// Whether no later push would fare better: the account, or the shares' owner, has to be another
 /// one, or it is no server of ours.
-bool IsRefusedForGood(const programs::Verdict& verdict);
+bool IsRefusedForGood(const programs::RunFailure& verdict);
 
 }  // namespace zelctl

@@ -47,7 +47,7 @@ ExitCode TryServer(const ZEL::TaskInfo& info, const char* done) {
     }
     WatchForInterrupt();
     const std::list<std::string>& shares = info.GetShareList();
-    const programs::Verdict verdict =
+    const programs::RunFailure verdict =
         AskServer(info.GetSyncInfo(), {shares.begin(), shares.end()}, kPatience);
     if (verdict.Ok()) {
         puts("The server takes the account and the shares.");
