@@ -1,7 +1,7 @@
 #include "ZEL/rsyncer.h"
 
 #include <fstream>
-#include <functional>
+#include <utility>
 #include <vector>
 
 #include "ZEL/log.h"
@@ -164,12 +164,18 @@ void Rsyncer::RsyncTask::SetServerIP(const std::string& server_address) {
 void Rsyncer::RsyncTask::SetPassword(const std::string& secret) {
     password = secret;
 }
+void Rsyncer::RsyncTask::SetCanceller(std::function<bool()> cancelled) {
+    canceller = std::move(cancelled);
+}
 
-// A null pointer makes an empty callable: the run is never asked to stop.
+int Rsyncer::RsyncTask::Run(CancelChecker cancel) {
+    return execute(cancel != nullptr ? cancel : canceller);
+}
+
 int Rsyncer::RsyncTask::ExecuteCmd(const Lines& lines, CancelChecker cancel) {
     setTarqCustCmdRule(lines);
     setDestPath(user, serverIP, password, "", "");
-    const int status = execute(std::function<bool()>(cancel));
+    const int status = Run(cancel);
     return Finish(status, status == kDone || status == kAccepted || status == kPassedThrough);
 }
 
@@ -179,7 +185,7 @@ int Rsyncer::RsyncTask::Execute(const std::string& src_path, const std::string& 
     setExcludeRule(exclude_rules);
     setSrcPath(src_path);
     setDestPath(user, serverIP, password, module_name, dest_sub_path);
-    const int status = execute(std::function<bool()>(cancel));
+    const int status = Run(cancel);
     return Finish(status, status == kDone);
 }
 
@@ -208,6 +214,10 @@ void Rsyncer::SetCancelChecker(CancelChecker checker) {
     cancelChecker = checker;
 }
 
+void Rsyncer::SetTaskSetup(std::function<void(RsyncTask&)> setup) {
+    taskSetup = std::move(setup);
+}
+
 bool Rsyncer::SupportMultiSource() const {
     return serverVersion > 0;
 }
@@ -230,6 +240,9 @@ void Rsyncer::InitRsyncTask(RsyncTask& task, bool is_test) const {
         task.SetServerPort(syncInfo.GetSSHPort());
     }
     task.SetRsyncTimeout(syncInfo.GetRsyncTimeout());
+    if (taskSetup) {
+        taskSetup(task);
+    }
 }
 
 // Runs a command whose lines a builder has made with the result `built`. `sender` is who says that

@@ -17,6 +17,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <list>
 #include <map>
 #include <string>
@@ -63,6 +64,8 @@ public:
         void SetUser(const std::string& user_name);
         void SetServerIP(const std::string& address);
         void SetPassword(const std::string& secret);
+        /// Asked during the run when that has no CancelChecker. Empty: nothing is asked.
+        void SetCanceller(std::function<bool()> cancelled);
 
         /// Sends a server command. Returns the status; any but 0, 207 and 208 is explained in the
         /// system log.
@@ -76,11 +79,13 @@ public:
                     const std::list<std::string>& exclude_rules);
 
     private:
+        int Run(CancelChecker cancel);
         int Finish(int status, bool is_success);
 
         std::string user;      // account on the server
         std::string serverIP;  // address used for this run
         std::string password;  // the account's
+        std::function<bool()> canceller;
     };
 
     Rsyncer();
@@ -92,15 +97,18 @@ public:
     int Initialize(const SyncInfo& info);
     /// Does nothing; an Rsyncer keeps what it learned.
     void Clear();
-    /// Asked during every run from now on; null: runs cannot be cancelled.
+    /// Asked during every run from now on; null: the task's canceller is, if it has one.
     void SetCancelChecker(CancelChecker checker);
+    /// Called with every task from now on, once that has the settings: gives it what no setting
+    /// says, such as a canceller, or what the host's wrapper can do besides. Empty: nothing.
+    void SetTaskSetup(std::function<void(RsyncTask&)> setup);
     /// True when the server pairs several sources share by share. Known after Initialize.
     bool SupportMultiSource() const;
     SyncInfo GetSyncInfo() const;
     /// The address that the last Initialize settled on.
     std::string GetLatestIP() const;
-    /// Configures a task for the settings held here. `is_test` keeps the run out of rsync's debug
-    /// log.
+    /// Configures a task for the settings held here, then by the task set-up. `is_test` keeps the
+    /// run out of rsync's debug log.
     void InitRsyncTask(RsyncTask& task, bool is_test) const;
 
     // ---- Finding the server ----
@@ -170,10 +178,11 @@ private:
                     bool is_test, int& status) const;
 
     int serverVersion;  // -1: not known yet; 0: the server does not know the version command
-    CancelChecker cancelChecker;  // null: runs cannot be cancelled
+    CancelChecker cancelChecker;
     SyncInfo syncInfo;  // its server IP is the candidate being tried, then the one that answered
     std::map<std::string, ShareInfo> shareInfoCache;
     std::string address;
+    std::function<void(RsyncTask&)> taskSetup;
 };
 
 /// Cuts `text` at each character of `delimiters` and appends the pieces, empty ones included, to

@@ -25,6 +25,7 @@ struct World {
 
     std::vector<std::vector<std::string>> commands;  // lines of each command sent
     std::vector<std::string> runs;                   // setter calls of each run, in order
+    bool last_was_ended = false;                     // its canceller said so
     int errors_logged = 0;
 
     World::Answer Next(const std::string& command) {
@@ -92,6 +93,7 @@ void RsyncWrapper::setTarqCustCmdRule(const std::list<std::string>& lines) {
 int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
     impl_->Note(cancelled ? "cancellable" : "plain");
     world->runs.push_back(impl_->calls);
+    world->last_was_ended = cancelled && cancelled();
     if (impl_->command.empty()) {
         return world->copy_status;
     }
@@ -314,6 +316,25 @@ TEST_F(RsyncerTest, ADataRunGoesIntoTheSharesModule) {
     EXPECT_EQ(rsyncer_.RunSync(1, "docs", "/gone", {}, status_), 0);
     EXPECT_EQ(status_, 0);
     EXPECT_EQ(world_.runs.size(), 4U);
+}
+
+TEST_F(RsyncerTest, EveryTaskIsSetUpAndACancellerIsAskedWhereThereIsNoChecker) {
+    bool enough = false;
+    rsyncer_.SetTaskSetup([&](ZEL::Rsyncer::RsyncTask& task) {
+        task.setDelete(false);
+        task.SetCanceller([&] { return enough; });
+    });
+    Connect();
+    EXPECT_FALSE(world_.last_was_ended);
+    enough = true;
+    EXPECT_EQ(rsyncer_.SendBeacon("task", status_), 0);
+    EXPECT_TRUE(world_.last_was_ended);
+    EXPECT_EQ(rsyncer_.RunSync(1, "docs", "/", {}, status_), 0);
+    EXPECT_TRUE(world_.last_was_ended);
+    EXPECT_THAT(world_.runs, Each(HasSubstr("timeout=600 setDelete=0 ")));
+    rsyncer_.SetCancelChecker([] { return false; });
+    EXPECT_EQ(rsyncer_.RunSync(1, "docs", "/", {}, status_), 0);
+    EXPECT_FALSE(world_.last_was_ended);
 }
 
 TEST_F(RsyncerTest, CommandsThatAreAcceptedAreNotExplained) {

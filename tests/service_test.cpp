@@ -71,20 +71,8 @@ struct RsyncWrapper::Impl {
     std::string module;
     std::string source;
     std::list<std::string> command;
+    RunReport* report = nullptr;
 };
-
-namespace {
-thread_local RunReport* report = nullptr;
-}
-
-struct ScopedRunOptions::Impl {
-    RunReport* before;
-};
-ScopedRunOptions::ScopedRunOptions(RunOptions options)
-    : impl_(new Impl{std::exchange(report, options.report)}) {}
-ScopedRunOptions::~ScopedRunOptions() {
-    report = impl_->before;
-}
 
 RsyncWrapper::RsyncWrapper() : impl_(new Impl) {}
 RsyncWrapper::~RsyncWrapper() = default;
@@ -115,9 +103,13 @@ void RsyncWrapper::setDestPath(const std::string&, const std::string&, const std
                                const std::string& module, const std::string&) {
     impl_->module = module;
 }
+void RsyncWrapper::setRunOptions(const RunOptions& options) {
+    impl_->report = options.report;
+}
 int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
     if (impl_->command.empty()) {
-        return report->status = copies->Copy(impl_->module, impl_->source, *report, cancelled);
+        RunReport& report = *impl_->report;
+        return report.status = copies->Copy(impl_->module, impl_->source, report, cancelled);
     }
     for (const std::string& line : impl_->command) {
         if (line.rfind("outfile=", 0) == 0) {

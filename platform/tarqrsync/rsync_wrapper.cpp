@@ -3,7 +3,6 @@
 #include <syslog.h>
 
 #include <sstream>
-#include <utility>
 
 #include "platform/tarqrsync/run.h"
 #include "platform/tarqrsync/settings.h"
@@ -16,26 +15,11 @@ namespace {
 // The cause stands in the explanation; the system log is not the place for a line a file.
 constexpr int kMaxLoggedLines = 20;
 
-thread_local const RunOptions* current_options = nullptr;
-
 }  // namespace
-
-struct ScopedRunOptions::Impl {
-    RunOptions options;
-    const RunOptions* before;
-};
-
-ScopedRunOptions::ScopedRunOptions(RunOptions options)
-    : impl_(new Impl{std::move(options), current_options}) {
-    current_options = &impl_->options;
-}
-
-ScopedRunOptions::~ScopedRunOptions() {
-    current_options = impl_->before;
-}
 
 struct RsyncWrapper::Impl {
     Settings settings;
+    RunOptions options;
     std::string explanation;
     std::string details;
 };
@@ -120,15 +104,17 @@ void RsyncWrapper::setDestPath(const std::string& user, const std::string& host,
     impl_->settings.sub_path = sub_path;
 }
 
+void RsyncWrapper::setRunOptions(const RunOptions& options) {
+    impl_->options = options;
+}
+
 int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
-    static const RunOptions no_options;
-    const RunOptions& options = current_options != nullptr ? *current_options : no_options;
-    Run run(impl_->settings, options);
+    Run run(impl_->settings, impl_->options);
     const int status = run.Execute(cancelled);
     impl_->explanation = run.Outcome().explanation;
     impl_->details = run.Outcome().details;
-    if (options.report != nullptr) {
-        *options.report = run.Outcome();
+    if (impl_->options.report != nullptr) {
+        *impl_->options.report = run.Outcome();
     }
     return status;
 }

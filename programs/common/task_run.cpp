@@ -31,7 +31,6 @@ using TARQ::Backup::RunChange;
 using TARQ::Backup::RunOptions;
 using TARQ::Backup::RunProgress;
 using TARQ::Backup::RunReport;
-using TARQ::Backup::ScopedRunOptions;
 
 constexpr std::chrono::seconds kBeaconEvery(60);  // the server takes a task for dead after 120
 constexpr std::chrono::seconds kLastWord(1);
@@ -55,39 +54,6 @@ constexpr size_t kMaxDetailBytes = size_t{16} * 1024;
 std::list<std::string> ToList(const std::vector<std::string>& items) {
     return {items.begin(), items.end()};
 }
-
-// The library asks a function without an argument whether to give up: what it looks at is the
-// thread's own.
-thread_local const std::atomic<bool>* wanted = nullptr;
-thread_local steady_clock::time_point patient_until;  // whatever is wanted
-
-bool CancelWanted() {
-    return wanted != nullptr && wanted->load(std::memory_order_relaxed) &&
-           steady_clock::now() >= patient_until;
-}
-
-/// The operations of this thread look at `cancel` until the scope ends.
-class CancelScope {
-public:
-    explicit CancelScope(const std::atomic<bool>& cancel)
-        : before_(std::exchange(wanted, &cancel)) {}
-    ~CancelScope() { wanted = before_; }
-    CancelScope(const CancelScope&) = delete;
-    CancelScope& operator=(const CancelScope&) = delete;
-
-private:
-    const std::atomic<bool>* before_;
-};
-
-/// What is said in this scope is said even when a person has had enough, unless the server takes
-/// too long to listen.
-class LastWord {
-public:
-    LastWord() { patient_until = steady_clock::now() + kLastWord; }
-    ~LastWord() { patient_until = {}; }
-    LastWord(const LastWord&) = delete;
-    LastWord& operator=(const LastWord&) = delete;
-};
 
 /// Tells the server that the run is alive, from a thread and a connection of its own.
 class Beacon {
@@ -122,9 +88,10 @@ public:
 
 private:
     void Run() {
-        const CancelScope scope(stop_);
         ZEL::Rsyncer rsyncer;
-        rsyncer.SetCancelChecker(CancelWanted);
+        rsyncer.SetTaskSetup([this](ZEL::Rsyncer::RsyncTask& task) {
+            task.SetCanceller([this] { return stop_.load(); });
+        });
         bool ready = false;
         std::unique_lock<std::mutex> lock(mutex_);
         while (!wake_.wait_for(lock, kBeaconEvery, [this] { return stop_.load(); })) {
@@ -323,14 +290,26 @@ RunResult NothingDone(const RunOrder& order, const RunFailure& verdict) {
 struct TaskRun::Impl {
     Impl(const ZEL::SyncInfo& sync_info, const std::atomic<bool>& cancel_flag, RunListener told)
         : info(sync_info), cancel(cancel_flag), listener(std::move(told)) {
-        rsyncer.SetCancelChecker(CancelWanted);
+        rsyncer.SetTaskSetup([this](ZEL::Rsyncer::RsyncTask& task) {
+            task.SetCanceller([this] { return cancel && steady_clock::now() >= patient_until; });
+            task.setRunOptions(options);
+        });
     }
 
-    RunOptions Reporting() {
-        RunOptions wishes;
+    // The driver for one operation: what that runs has these options, and leaves its report.
+    ZEL::Rsyncer& With(RunOptions wanted = {}) {
+        options = std::move(wanted);
         report = RunReport();
-        wishes.report = &report;
-        return wishes;
+        options.report = &report;
+        return rsyncer;
+    }
+
+    // This is said even when a person has had enough, unless the server takes too long to listen.
+    int LastWord(const std::string& type, const std::string& name, int& status) {
+        patient_until = steady_clock::now() + kLastWord;
+        const int sent = With().FinishSync(type, name, status);
+        patient_until = {};
+        return sent;
     }
 
     RunFailure Failed(const std::string& what, int status, Reach reach = Reach::kRun) const {
@@ -353,8 +332,7 @@ struct TaskRun::Impl {
     // Finds the server. One that answers the probe, and then not the question for its version, is
     // not a server without versions: what comes next would be put to it in the wrong form.
     RunFailure Find() {
-        const ScopedRunOptions watched(Reporting());
-        int status = rsyncer.Initialize(info);
+        int status = With().Initialize(info);
         const bool version_failed = report.status > kDone && report.status != kUnknownCommand &&
                                     report.status != kUnsupportedCommand;
         if (status == 0 && (version_failed || cancel)) {
@@ -390,8 +368,7 @@ struct TaskRun::Impl {
     RunFailure PairTogether(bool dry_run, const std::list<std::string>& shares) {
         std::list<std::string> conflicts;
         int status = 0;
-        const ScopedRunOptions watched(Reporting());
-        const int asked = rsyncer.DoPairing(dry_run, shares, conflicts, status);
+        const int asked = With().DoPairing(dry_run, shares, conflicts, status);
         // A server that pairs no shares by name may say that it has merely taken the command.
         if (asked == 0 && (status == kDone || status == kAccepted || status == kPassedThrough)) {
             return {};
@@ -417,11 +394,8 @@ struct TaskRun::Impl {
     RunFailure Start(const std::string& share) {
         for (const bool may_pair : {true, false}) {
             int status = 0;
-            {
-                const ScopedRunOptions watched(Reporting());
-                if (rsyncer.StartSyncShare(share, status) != 0) {
-                    return Failed(Quoted(share) + " cannot be announced", 0, Reach::kShare);
-                }
+            if (With().StartSyncShare(share, status) != 0) {
+                return Failed(Quoted(share) + " cannot be announced", 0, Reach::kShare);
             }
             if (status == kNotPaired && may_pair) {
                 RunFailure paired = Pair(false, {share});
@@ -441,8 +415,7 @@ struct TaskRun::Impl {
     }
 
     RunFailure SendKey(const std::string& share) {
-        const ScopedRunOptions watched(Reporting());
-        const int status = rsyncer.SyncEncryptKey(share);
+        const int status = With().SyncEncryptKey(share);
         return status == 0 ? RunFailure()
                            : Failed("the key of encrypted " + Quoted(share) + " cannot be sent",
                                     status, Reach::kShare);
@@ -451,9 +424,8 @@ struct TaskRun::Impl {
     // The server's answer is no reason to end the run; that there is none is: each of the commands
     // and copies that follow would wait as long for its own.
     RunFailure Announce(const std::string& task) {
-        const ScopedRunOptions watched(Reporting());
         int status = 0;
-        rsyncer.SendBeacon(task, status);
+        With().SendBeacon(task, status);
         return Silent() ? Failed("the server does not answer", report.status) : RunFailure();
     }
 
@@ -491,8 +463,7 @@ struct TaskRun::Impl {
         }
         totals.rsync_runs += rsync_runs;
         if (announced && heard) {
-            const LastWord last_word;
-            rsyncer.FinishSync("task", order.task, ignored);
+            LastWord("task", order.task, ignored);
         }
     }
 
@@ -576,15 +547,14 @@ struct TaskRun::Impl {
     // excluded is neither sent nor deleted.
     void SendFolderItself(const RunOrder& order, const std::string& share, RunReport& sent) {
         int status = 0;
-        const ScopedRunOptions watched(Reporting());
-        rsyncer.RunSync(order.task_id, share, "/", {"/*"}, status);
+        With().RunSync(order.task_id, share, "/", {"/*"}, status);
         sent.bytes_sent += report.bytes_sent;
         sent.bytes_received += report.bytes_received;
     }
 
     RunFailure SendFiles(const RunOrder& order, const std::string& share, const std::string& path,
                          RunReport& sent) {
-        RunOptions wishes = Reporting();
+        RunOptions wishes;
         wishes.bandwidth_limit = info.GetMaxBandwidth();
         if (listener.on_progress) {
             wishes.on_progress = [&](const RunProgress& progress) {
@@ -594,9 +564,7 @@ struct TaskRun::Impl {
         int status = 0;
         int ran = 0;
         for (int i = 0; i < kBusyTries; ++i) {
-            report = RunReport();
-            const ScopedRunOptions watched(wishes);
-            ran = rsyncer.RunSync(order.task_id, share, path, ToList(order.excludes), status);
+            ran = With(wishes).RunSync(order.task_id, share, path, ToList(order.excludes), status);
             if (ran == 0 && status == 0 && report.status < 0) {
                 // Nothing was there to run for. A path that has gone meanwhile is a change that
                 // will be told, of the folder above it; a share that has gone is a fault.
@@ -633,35 +601,26 @@ struct TaskRun::Impl {
     }
 
     RunFailure Finish(const std::string& share, bool completed, bool rest_waits) {
-        const LastWord last_word;
-        const RunReport of_the_run = report;
         int status = 0;
-        int sent = 0;
-        RunFailure result;
-        {
-            const ScopedRunOptions watched(Reporting());
-            sent = rsyncer.FinishSync(completed && !rest_waits ? "share" : "abort", share, status);
-        }
+        const int sent = LastWord(completed && !rest_waits ? "share" : "abort", share, status);
         heard = (!cancel || (sent == 0 && status == kDone)) && !Silent();
         if (completed && (sent != 0 || status != kDone)) {
-            result = Failed("the server does not confirm " + Quoted(share), status,
-                            ReachOfCommand(status));
+            return Failed("the server does not confirm " + Quoted(share), status,
+                          ReachOfCommand(status));
         }
-        report = of_the_run;
-        return result;
+        return {};
     }
 
     RunFailure ListShare(const RunOrder& order, const ShareOrder& share,
                          const ChangeHandler& on_change,
                          const std::function<void(const std::string&)>& on_missing) {
         for (const std::string& path : share.paths) {
-            RunOptions wishes = Reporting();
+            RunOptions wishes;
             wishes.dry_run = true;
             wishes.on_change = [&](const RunChange& change) { on_change(share.share, change); };
             int status = 0;
-            const ScopedRunOptions watched(std::move(wishes));
-            const int ran =
-                rsyncer.RunSync(order.task_id, share.share, path, ToList(order.excludes), status);
+            const int ran = With(wishes).RunSync(order.task_id, share.share, path,
+                                                 ToList(order.excludes), status);
             if (ran == 0 && status != 0 && report.cause == TARQ::Backup::RunCause::UNKNOWN_MODULE) {
                 on_missing(share.share);
                 return {};
@@ -676,10 +635,12 @@ struct TaskRun::Impl {
     ZEL::SyncInfo info;
     const std::atomic<bool>& cancel;
     RunListener listener;
-    RunReport report;         // of the last thing that was run
-    bool connected = false;   // an address of the server has answered
-    uint64_t rsync_runs = 0;  // copies made
-    bool heard = true;        // false: an answer to a last word would be waited for in vain
+    RunOptions options;                      // of the operation under way
+    RunReport report;                        // of the last thing that was run
+    steady_clock::time_point patient_until;  // whatever is wanted
+    bool connected = false;                  // an address of the server has answered
+    uint64_t rsync_runs = 0;                 // copies made
+    bool heard = true;  // false: an answer to a last word would be waited for in vain
     ZEL::Rsyncer rsyncer;
 };
 
@@ -689,17 +650,14 @@ TaskRun::TaskRun(const ZEL::SyncInfo& info, const std::atomic<bool>& cancel, Run
 TaskRun::~TaskRun() = default;
 
 RunFailure TaskRun::Connect() {
-    const CancelScope scope(impl_->cancel);
     return impl_->Find();
 }
 
 RunFailure TaskRun::CheckPairing(const std::vector<std::string>& shares) {
-    const CancelScope scope(impl_->cancel);
     return impl_->Pair(true, shares);
 }
 
 RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
-    const CancelScope scope(impl_->cancel);
     impl_->rsync_runs = 0;
     impl_->heard = true;
     RunResult result;
@@ -725,7 +683,6 @@ RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
 
 RunFailure TaskRun::List(const RunOrder& order, const ChangeHandler& on_change,
                          const std::function<void(const std::string& share)>& on_missing) {
-    const CancelScope scope(impl_->cancel);
     for (const ShareOrder& share : order.shares) {
         RunFailure result = impl_->ListShare(order, share, on_change, on_missing);
         if (!result.Ok()) {

@@ -69,7 +69,7 @@ protected:
         }
         report_ = RunReport();
         options.report = &report_;
-        const ScopedRunOptions scope(options);
+        wrapper.setRunOptions(options);
         const int status = wrapper.execute(cancelled);
         wrapper.logError();
         return status;

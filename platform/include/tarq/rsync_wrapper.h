@@ -2,7 +2,7 @@
 //
 // An RsyncWrapper is configured with its setters, run once with execute(), and thrown away. What a
 // caller wants to know or to limit beyond that (progress, bandwidth, a list of what would change)
-// it asks for with RunOptions around the run, on the same thread.
+// it asks for with RunOptions. Those are this platform's own: another host's wrapper may lack them.
 #pragma once
 
 #include <cstdint>
@@ -70,7 +70,7 @@ struct RunReport {
     uint64_t bytes_received = 0;  ///< bytes that this side read from it
 };
 
-/// Wishes for the runs that this thread makes. Every member may stay as it is.
+/// What a run does beside its settings. Every member may stay as it is.
 struct RunOptions {
     unsigned int bandwidth_limit = 0;  ///< KiB a second; 0: no limit
     bool dry_run = false;              ///< copies only: change nothing at the destination
@@ -80,20 +80,6 @@ struct RunOptions {
     std::function<void(const RunChange&)>
         on_change;                ///< called on the running thread, in rsync's order
     RunReport* report = nullptr;  ///< filled when the run ends; the caller's
-};
-
-/// Makes `options` hold for every execute() on this thread until it is destroyed; then those of
-/// before hold again.
-class ScopedRunOptions {
-public:
-    explicit ScopedRunOptions(RunOptions options);
-    ~ScopedRunOptions();
-    ScopedRunOptions(const ScopedRunOptions&) = delete;
-    ScopedRunOptions& operator=(const ScopedRunOptions&) = delete;
-
-private:
-    struct Impl;
-    std::unique_ptr<Impl> impl_;
 };
 
 /// Statuses that execute() returns by itself; all others are rsync's exit codes or the server's
@@ -186,6 +172,9 @@ public:
     /// directory reached over ssh. `sub_path` is below it. A command run needs no module.
     void setDestPath(const std::string& user, const std::string& host, const std::string& password,
                      const std::string& module, const std::string& sub_path);
+
+    /// What this run does besides.
+    void setRunOptions(const RunOptions& options);
 
     /// Runs, and returns 0, rsync's exit code, a WrapperStatus or, after a command run, the
     /// server's status.
