@@ -1,29 +1,17 @@
 #include "ZEL/internal/cert_name.h"
 
 #include <algorithm>
-#include <array>
 #include <string_view>
+
+#include "base/text.h"
 
 namespace ZEL {
 
 namespace {
 
-// A table rather than tolower(): a host's locale must not decide which certificate is accepted.
-constexpr std::array<unsigned char, 256> MakeFolding() {
-    std::array<unsigned char, 256> folding = {};
-    for (size_t i = 0; i < folding.size(); ++i) {
-        const bool upper = i >= 'A' && i <= 'Z';
-        folding[i] = static_cast<unsigned char>(upper ? i - 'A' + 'a' : i);
-    }
-    return folding;
-}
-
-constexpr std::array<unsigned char, 256> kFolding = MakeFolding();
-
 bool SameFolded(std::string_view a, std::string_view b) {
-    return std::equal(a.begin(), a.end(), b.begin(), b.end(), [](char x, char y) {
-        return kFolding[static_cast<unsigned char>(x)] == kFolding[static_cast<unsigned char>(y)];
-    });
+    return std::equal(a.begin(), a.end(), b.begin(), b.end(),
+                      [](char x, char y) { return base::Lower(x) == base::Lower(y); });
 }
 
 }  // namespace

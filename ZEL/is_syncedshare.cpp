@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include "ZEL/internal/registry.h"
+#include "base/text.h"
 #include "tarq/root_path.h"
 
 using namespace ZEL::registry;
@@ -261,6 +262,6 @@ int TARQZELIsSyncedShare(const char* share) {
 
 void getLowerString(const char* source, char* target) {
     for (int i = 0; i < kNameCharacters && source[i] != '\0'; ++i) {
-        target[i] = Lower(source[i]);
+        target[i] = base::Lower(source[i]);
     }
 }

@@ -4,6 +4,7 @@
 
 #include "ZEL/internal/registry.h"
 #include "ZEL/is_syncedshare.h"
+#include "base/text.h"
 
 using namespace ZEL::registry;
 
@@ -20,7 +21,7 @@ enum class Verdict { kFree, kHeld, kFailed };
 /// Whether `name` in lower case is `lowered`, as far as names count.
 bool IsSpelling(const char* name, const char (&lowered)[kNameCharacters + 1]) {
     for (int i = 0; i < kNameCharacters; ++i) {
-        if (Lower(name[i]) != lowered[i]) {
+        if (base::Lower(name[i]) != lowered[i]) {
             return false;
         }
         if (name[i] == '\0') {

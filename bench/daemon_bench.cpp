@@ -25,9 +25,9 @@
 
 #include "ZEL/ipc.h"
 #include "ZEL/sync_obj.h"
+#include "base/child_process.h"
 #include "base/unique_fd.h"
 #include "bench/large_tree.h"
-#include "platform/internal/child_process.h"
 #include "tests/integration/daemon_process.h"
 #include "tests/integration/servers.h"
 
@@ -96,11 +96,11 @@ void Compare(const char* what, const std::function<double()>& ours, const char* 
 }
 
 void Run(const std::string& root, Words command) {
-    tarq_internal::ChildSetup setup;
-    setup.program = tarq_internal::FindProgram(command[0], kSearchPath);
+    base::ChildSetup setup;
+    setup.program = base::FindProgram(command[0], kSearchPath);
     setup.arguments = command;
     setup.environment = {"LC_ALL=C", "TARQ_ROOT=" + root};
-    const auto result = tarq_internal::RunChild(setup, nullptr, nullptr, nullptr);
+    const auto result = base::RunChild(setup, nullptr, nullptr, nullptr);
     Must(result.start_error == 0 && result.wait_status == 0, command[0] + " failed");
 }
 

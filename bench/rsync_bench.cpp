@@ -23,7 +23,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/internal/child_process.h"
+#include "base/child_process.h"
 #include "tarq/rsync_wrapper.h"
 #include "tests/integration/servers.h"
 
@@ -200,11 +200,11 @@ private:
 
     void ZelServer(Words arguments) const {
         arguments.insert(arguments.begin(), ZEL_SERVER);
-        tarq_internal::ChildSetup setup;
+        base::ChildSetup setup;
         setup.program = ZEL_SERVER;
         setup.arguments = std::move(arguments);
         setup.environment = {"LC_ALL=C", "TARQ_ROOT=" + root_.Path("server")};
-        const auto result = tarq_internal::RunChild(setup, nullptr, nullptr, nullptr);
+        const auto result = base::RunChild(setup, nullptr, nullptr, nullptr);
         Must(result.start_error == 0 && result.wait_status == 0);
     }
 
@@ -253,14 +253,14 @@ private:
     }
 
     bool Bare(const Words& options, const Words& paths) const {
-        tarq_internal::ChildSetup setup;
-        setup.program = tarq_internal::FindProgram("rsync", "/usr/local/bin:/usr/bin:/bin");
+        base::ChildSetup setup;
+        setup.program = base::FindProgram("rsync", "/usr/local/bin:/usr/bin:/bin");
         setup.arguments = {"rsync", "--port=" + std::to_string(port_),
                            "--password-file=" + password_file_};
         setup.arguments.insert(setup.arguments.end(), options.begin(), options.end());
         setup.arguments.insert(setup.arguments.end(), paths.begin(), paths.end());
         setup.environment = {"LC_ALL=C"};
-        const auto result = tarq_internal::RunChild(setup, nullptr, nullptr, nullptr);
+        const auto result = base::RunChild(setup, nullptr, nullptr, nullptr);
         return result.start_error == 0 && result.wait_status == 0;
     }
 

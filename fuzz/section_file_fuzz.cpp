@@ -37,8 +37,8 @@ std::unique_ptr<SectionImage> MakeImage(std::string_view text) {
 Values ReadValues(const SectionImage& image, const Section& section) {
     Values values;
     std::string_view body = image.Body(section);
-    for (std::string_view line; tarqcore::TakeLine(body, line);) {
-        if (const auto entry = tarqcore::ParseKeyLine(line)) {
+    for (std::string_view line; base::TakeLine(body, line);) {
+        if (const auto entry = base::ParseKeyLine(line)) {
             values.emplace(entry->key, entry->value);  // of two lines of one key the first counts
         }
     }

@@ -1,5 +1,5 @@
 add_library(test_servers STATIC integration/servers.cpp)
-target_link_libraries(test_servers PUBLIC test_support tarq_internal)
+target_link_libraries(test_servers PUBLIC test_support base)
 
 zel_test(tarqrsync_test tarqrsync_test.cpp LIBRARIES tarqrsync_parts)
 zel_test(rsync_wrapper_test integration/rsync_wrapper_test.cpp

@@ -1,5 +1,5 @@
+#include "base/child_process.h"
 #include "base/unique_fd.h"
-#include "platform/internal/child_process.h"
 #include "platform/tarqrsync/answer_file.h"
 #include "platform/tarqrsync/arguments.h"
 #include "platform/tarqrsync/explain.h"
@@ -10,8 +10,8 @@
 namespace TARQ::Backup {
 namespace {
 
-using tarq_internal::ChildResult;
-using tarq_internal::ChildSetup;
+using base::ChildResult;
+using base::ChildSetup;
 using namespace testing;
 
 TEST(Answer, OnlyAPlainDecimalStatusInTheFirstLineIsTaken) {
@@ -152,7 +152,7 @@ TEST(Explanation, ComesFromTheWordsAndTheKindOfRun) {
 TEST(Arguments, OddNamesAndAddressesComeThrough) {
     const test::TempRoot root;
     PrivateFolder folder;
-    Config config;
+    base::RsyncConfig config;
     config.ssh_options = {"-J", "it's"};
     Settings settings;
     settings.account = true;
@@ -189,7 +189,7 @@ std::string Shell(const std::string& script, ChildResult* result, ChildSetup set
     const auto append = [&output](const char* bytes, size_t size) { output.append(bytes, size); };
     setup.program = "/bin/sh";
     setup.arguments = {"sh", "-c", script};
-    *result = tarq_internal::RunChild(setup, cancelled, append, append);
+    *result = base::RunChild(setup, cancelled, append, append);
     return output;
 }
 
@@ -243,7 +243,7 @@ TEST(ChildProcess, EndsWithItsWholeGroupHoweverTheRunEnds) {
         pid.assign(bytes, size);
         throw std::logic_error("stop");
     };
-    EXPECT_THROW(tarq_internal::RunChild(setup, nullptr, thrower, nullptr), std::logic_error);
+    EXPECT_THROW(base::RunChild(setup, nullptr, thrower, nullptr), std::logic_error);
     EXPECT_TRUE(gone(pid));
 
     int asked = 0;
@@ -258,9 +258,9 @@ TEST(ChildProcess, TellsWhyAProgramDidNotStartAndHowItEnded) {
     ChildSetup setup;
     setup.program = "/no/such";
     setup.arguments = {"x"};
-    EXPECT_EQ(tarq_internal::RunChild(setup, nullptr, nullptr, nullptr).start_error, ENOENT);
-    setup.input.assign(tarq_internal::kMaxChildInput + 1, 'x');
-    EXPECT_EQ(tarq_internal::RunChild(setup, nullptr, nullptr, nullptr).start_error, E2BIG);
+    EXPECT_EQ(base::RunChild(setup, nullptr, nullptr, nullptr).start_error, ENOENT);
+    setup.input.assign(base::kMaxChildInput + 1, 'x');
+    EXPECT_EQ(base::RunChild(setup, nullptr, nullptr, nullptr).start_error, E2BIG);
 
     ChildResult result;
     const std::vector<std::string> words = {

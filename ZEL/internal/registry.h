@@ -44,11 +44,6 @@ inline bool IsEmpty(const char* text) {
 /// How much of a share's name counts when letter case does not.
 inline constexpr int kNameCharacters = 32;
 
-/// ASCII alone: names are compared the same whatever the program's locale.
-inline char Lower(char c) {
-    return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
-}
-
 /// Holds the semaphore that all writers of the registry take.
 class WriteLock {
 public:

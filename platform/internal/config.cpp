@@ -1,20 +1,12 @@
 #include "platform/internal/config.h"
 
-#include <fcntl.h>
 #include <tarq/core.h>
 #include <tarq/owners.h>
-#include <unistd.h>
 
-#include <array>
-#include <cerrno>
 #include <cstring>
-
-#include "base/unique_fd.h"
 
 namespace tarq_internal {
 namespace {
-
-using base::UniqueFd;
 
 constexpr int kHashCapacity = 16;
 
@@ -58,35 +50,6 @@ ReadResult ReadValue(const std::string& path, const std::string& section, const 
 std::string ValueOf(const Section& section, const std::string& key) {
     const auto found = section.find(key);
     return found == section.end() ? std::string() : found->second;
-}
-
-std::optional<std::string> ReadTextFile(const std::string& path) {
-    const UniqueFd file(open(path.c_str(), O_RDONLY | O_CLOEXEC));
-    if (!file) {
-        return std::nullopt;
-    }
-    std::string text;
-    std::array<char, 4096> buffer;
-    for (;;) {
-        const ssize_t got = read(file.Get(), buffer.data(), buffer.size());
-        if (got == 0) {
-            return text;
-        }
-        if (got > 0) {
-            text.append(buffer.data(), static_cast<size_t>(got));
-        } else if (errno != EINTR) {
-            return std::nullopt;
-        }
-    }
-}
-
-std::string Trimmed(const std::string& text) {
-    const std::string blanks(" \t\r\n\0", 5);
-    const size_t first = text.find_first_not_of(blanks);
-    if (first == std::string::npos) {
-        return {};
-    }
-    return text.substr(first, text.find_last_not_of(blanks) - first + 1);
 }
 
 bool CopyOut(const std::string& text, char* buffer, int size) {

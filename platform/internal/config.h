@@ -4,7 +4,6 @@
 #pragma once
 
 #include <map>
-#include <optional>
 #include <string>
 
 namespace tarq_internal {
@@ -23,12 +22,6 @@ ReadResult ReadValue(const std::string& path, const std::string& section, const 
 
 /// The value of `key`; empty when the section has none.
 std::string ValueOf(const Section& section, const std::string& key);
-
-/// The whole file, or nothing, with errno set, when it cannot be read.
-std::optional<std::string> ReadTextFile(const std::string& path);
-
-/// The text without blanks, line ends and NULs at either end.
-std::string Trimmed(const std::string& text);
 
 /// Writes `text` and its terminator into `buffer`. False, with an empty string in the buffer when
 /// there is one, when it does not fit: nothing is ever cut off.

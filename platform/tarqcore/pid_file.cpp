@@ -3,11 +3,12 @@
 #include <signal.h>
 #include <unistd.h>
 
-#include <charconv>
+#include <climits>
 #include <optional>
 #include <string>
 #include <string_view>
 
+#include "base/text.h"
 #include "base/unique_fd.h"
 #include "platform/internal/error.h"
 
@@ -37,16 +38,8 @@ pid_t ParsePid(std::string_view text) {
     if (line_break == std::string_view::npos && text.size() == kPidFileBytes) {
         return 0;
     }
-    const std::string_view line = text.substr(0, line_break);
-    const size_t begin = line.find_first_not_of(" \t");
-    const size_t end = line.find_last_not_of(" \t\r");
-    pid_t pid = 0;
-    if (begin == std::string_view::npos || end == std::string_view::npos) {
-        return 0;
-    }
-    const char* last = line.data() + end + 1;
-    const auto [stop, error] = std::from_chars(line.data() + begin, last, pid);
-    return error == std::errc() && stop == last && pid > 0 ? pid : 0;
+    const std::string_view line = base::Trimmed(text.substr(0, line_break), " \t\r");
+    return static_cast<pid_t>(base::ParseNumber(line, INT_MAX).value_or(0));
 }
 
 /// Whether the process has ended and only waits for its parent to notice. No when that cannot be

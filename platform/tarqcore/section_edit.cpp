@@ -7,6 +7,10 @@
 namespace tarqcore {
 namespace {
 
+using base::KeyLine;
+using base::ParseKeyLine;
+using base::TakeLine;
+
 constexpr std::string_view kLineBreaks = "\n\r";
 
 bool HasAny(std::string_view text, std::string_view characters) {

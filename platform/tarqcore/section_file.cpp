@@ -7,16 +7,16 @@
 #include <string_view>
 #include <vector>
 
+#include "base/replace_file.h"
 #include "platform/internal/error.h"
-#include "platform/tarqcore/atomic_file.h"
 #include "platform/tarqcore/section_edit.h"
 #include "platform/tarqcore/section_image.h"
 #include "platform/tarqcore/section_source.h"
 
+using base::KeyLine;
 using tarq_internal::Fail;
 using tarq_internal::Guarded;
 using tarqcore::FileToUpdate;
-using tarqcore::KeyLine;
 using tarqcore::NewLine;
 using tarqcore::NewText;
 using tarqcore::Section;
@@ -39,7 +39,7 @@ int Write(const FileToUpdate& file, const NewText& text) {
         return Fail(TARQ_ERR_WRITE_FILE);
     }
     const struct stat* old = file.status ? &*file.status : nullptr;
-    return tarqcore::ReplaceFile(file.path, old, pieces) ? 1 : -1;
+    return base::ReplaceFile(file.path, pieces, old) ? 1 : Fail(TARQ_ERR_WRITE_FILE);
 }
 
 /// The shape of every write: check what is to be written, read the file, edit, write. `edit` is
@@ -83,8 +83,8 @@ int KAPICFileGetSection(const char* path, const char* section, KAPICSzHash into)
         }
         std::vector<KeyLine> entries;
         std::string_view body = image->Body(*found);
-        for (std::string_view line; tarqcore::TakeLine(body, line);) {
-            if (const std::optional<KeyLine> entry = tarqcore::ParseKeyLine(line)) {
+        for (std::string_view line; base::TakeLine(body, line);) {
+            if (const std::optional<KeyLine> entry = base::ParseKeyLine(line)) {
                 entries.push_back(*entry);
             }
         }
@@ -117,8 +117,8 @@ int KAPICFileGetSectionValue(const char* path, const char* section, const char* 
             return Fail(TARQ_ERR_NO_SECTION);
         }
         std::string_view body = image->Body(*found);
-        for (std::string_view line; tarqcore::TakeLine(body, line);) {
-            const std::optional<KeyLine> entry = tarqcore::ParseKeyLine(line);
+        for (std::string_view line; base::TakeLine(body, line);) {
+            const std::optional<KeyLine> entry = base::ParseKeyLine(line);
             if (entry && entry->key == key) {
                 const size_t n = entry->value.copy(buffer, static_cast<size_t>(size) - 1);
                 buffer[n] = '\0';

@@ -6,7 +6,8 @@
 namespace tarqcore {
 namespace {
 
-constexpr std::string_view kByteOrderMark = "\xEF\xBB\xBF";
+using base::kByteOrderMark;
+
 constexpr size_t kNone = std::string_view::npos;
 
 // Look-ups that scan before an index is made: it costs about as much as these together, and a
@@ -15,16 +16,6 @@ constexpr unsigned kScansBeforeIndex = 8;
 
 bool IsBlank(char c) {
     return c == ' ' || c == '\t' || c == '\r';
-}
-
-std::string_view Trimmed(std::string_view text) {
-    while (!text.empty() && IsBlank(text.front())) {
-        text.remove_prefix(1);
-    }
-    while (!text.empty() && IsBlank(text.back())) {
-        text.remove_suffix(1);
-    }
-    return text;
 }
 
 // On x86 with GCC the search below is compiled for wide vectors as well, and the loader picks. Not
@@ -64,38 +55,6 @@ TARQ_WIDE_VECTORS size_t FindBracketed(std::string_view text, std::string_view n
 
 }  // namespace
 
-std::optional<KeyLine> ParseKeyLine(std::string_view line) {
-    const std::string_view trimmed = Trimmed(line);
-    const size_t equals = trimmed.find('=');
-    if (equals == kNone || trimmed.front() == '#' || trimmed.front() == '[' ||
-        trimmed.find('\0') != kNone) {
-        return std::nullopt;
-    }
-    const std::string_view key = Trimmed(trimmed.substr(0, equals));
-    if (key.empty() || key.find('"') != kNone) {
-        return std::nullopt;
-    }
-    std::string_view value = Trimmed(trimmed.substr(equals + 1));
-    if (value.size() >= 2 && value.front() == '"') {
-        const size_t last_quote = value.rfind('"');
-        if (last_quote > 0) {
-            value = value.substr(1, last_quote - 1);
-        }
-    }
-    const auto indent = static_cast<size_t>(trimmed.data() - line.data());
-    return KeyLine{line.substr(0, indent), key, value};
-}
-
-bool TakeLine(std::string_view& text, std::string_view& line) {
-    if (text.empty()) {
-        return false;
-    }
-    const size_t line_break = text.find('\n');
-    line = text.substr(0, line_break);
-    text.remove_prefix(line_break == kNone ? text.size() : line_break + 1);
-    return true;
-}
-
 SectionImage::SectionImage(std::unique_ptr<char[]> text, size_t size)
     : text_(std::move(text)), size_(size) {
     const bool marked = Text().substr(0, kByteOrderMark.size()) == kByteOrderMark;
@@ -105,7 +64,7 @@ SectionImage::SectionImage(std::unique_ptr<char[]> text, size_t size)
 std::string_view SectionImage::Body(const Section& section) const {
     std::string_view body = Text().substr(section.begin, section.end - section.begin);
     std::string_view header;
-    TakeLine(body, header);
+    base::TakeLine(body, header);
     return body;
 }
 

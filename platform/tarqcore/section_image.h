@@ -10,26 +10,9 @@
 #include <string_view>
 #include <vector>
 
+#include "base/section_view.h"
+
 namespace tarqcore {
-
-/// One key="value" line. The views lie in the line.
-struct KeyLine {
-    std::string_view indent;  ///< the blanks in front of the key
-    std::string_view key;
-    std::string_view value;
-};
-
-/// What a line says, its line break taken off. Nothing for a comment, a header and whatever has no
-/// key:
-///  - blanks (space, tab, carriage return) around the line, the key and the value do not count;
-///  - the value runs from its first quote to the last quote of the line, so that quotes inside it
-///  need no escape;
-///    a value that does not begin with a quote, or has only that one, counts as it stands;
-///  - a line with a NUL in it, or whose key holds a quote or begins with "[", is none of ours.
-std::optional<KeyLine> ParseKeyLine(std::string_view line);
-
-/// Takes the first line, without its line break, off `text`. False when there is no text left.
-bool TakeLine(std::string_view& text, std::string_view& line);
 
 /// A section's place in the text, in bytes from the start.
 struct Section {

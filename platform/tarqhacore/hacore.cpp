@@ -5,6 +5,7 @@
 #include <cctype>
 #include <string>
 
+#include "base/text.h"
 #include "platform/internal/config.h"
 #include "platform/internal/error.h"
 
@@ -44,7 +45,7 @@ std::string NormalMac(const std::string& text) {
             mac += ':';
             continue;
         }
-        const char digit = static_cast<char>(tolower(static_cast<unsigned char>(text[i])));
+        const char digit = base::Lower(text[i]);
         const size_t value = digits.find(digit);
         if (value == std::string::npos || (i == 1 && value % 2 == 1)) {
             return {};

@@ -12,14 +12,13 @@
 #include <regex>
 #include <tuple>
 
-#include "platform/internal/config.h"
+#include "base/text.h"
+#include "base/whole_file.h"
 
 namespace tarq_net {
 namespace {
 
 namespace fs = std::filesystem;
-using tarq_internal::ReadTextFile;
-using tarq_internal::Trimmed;
 
 constexpr long kEthernet = 1;  // ARPHRD_ETHER: wired and wireless alike
 constexpr unsigned char kLocalBit =
@@ -39,7 +38,7 @@ struct Candidate {
 };
 
 std::string Attribute(const fs::path& folder, const char* name) {
-    return Trimmed(ReadTextFile(folder / name).value_or(""));
+    return std::string(base::Trimmed(base::ReadFile(folder / name).value_or("")));
 }
 
 long Number(const std::string& text) {

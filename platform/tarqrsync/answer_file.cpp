@@ -7,9 +7,11 @@
 #include <algorithm>
 #include <cerrno>
 #include <charconv>
+#include <optional>
+#include <utility>
 
 #include "base/unique_fd.h"
-#include "platform/internal/write_all.h"
+#include "base/whole_file.h"
 
 namespace TARQ {
 namespace Backup {
@@ -56,33 +58,21 @@ bool ReadAnswerFile(const std::string& path, std::string* text) {
     if (!fd || fstat(fd.Get(), &info) != 0) {
         return false;
     }
-    if (!S_ISREG(info.st_mode) || info.st_size > static_cast<off_t>(kMaxAnswerBytes)) {
-        errno = S_ISREG(info.st_mode) ? EFBIG : EINVAL;
+    if (!S_ISREG(info.st_mode)) {
+        errno = EINVAL;
         return false;
     }
-    text->resize(static_cast<size_t>(info.st_size));
-    size_t done = 0;
-    while (done < text->size()) {
-        const ssize_t count = read(fd.Get(), text->data() + done, text->size() - done);
-        if (count < 0 && errno == EINTR) {
-            continue;
-        }
-        if (count < 0) {
-            return false;
-        }
-        if (count == 0) {
-            break;
-        }
-        done += static_cast<size_t>(count);
+    std::optional<std::string> content = base::ReadAll(fd.Get(), kMaxAnswerBytes);
+    if (content) {
+        *text = std::move(*content);
     }
-    text->resize(done);
-    return true;
+    return content.has_value();
 }
 
 bool WriteOutfile(const std::string& path, const std::string& content) {
     const base::UniqueFd fd(open(
         path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0600));
-    return fd && tarq_internal::WriteAll(fd.Get(), content);
+    return fd && base::WriteAll(fd.Get(), content);
 }
 
 }  // namespace Backup

@@ -3,7 +3,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/tarqrsync/config.h"
+#include "base/rsync_config.h"
 #include "platform/tarqrsync/private_folder.h"
 #include "platform/tarqrsync/settings.h"
 #include "tarq/rsync_wrapper.h"
@@ -24,7 +24,7 @@ constexpr char kChangeMark[] = "@@ ";
 /// Beside the settings, what decides how rsync is called.
 struct InvocationContext {
     const Settings& settings;
-    const Config& config;
+    const base::RsyncConfig& config;
     const RunOptions& options;
     bool acls = false;     ///< ask for access control lists
     bool xattrs = false;   ///< ask for extended attributes

@@ -1,12 +1,12 @@
 #include "platform/tarqrsync/explain.h"
 
 #include <algorithm>
-#include <cctype>
 #include <initializer_list>
 #include <iterator>
 #include <string_view>
 #include <utility>
 
+#include "base/text.h"
 #include "platform/tarqrsync/message_keeper.h"
 #include "tarq/rsync_wrapper.h"
 
@@ -214,7 +214,7 @@ bool IsRefusedSshLogin(std::string_view text) {
     for (size_t at = text.find(kWords); at != std::string_view::npos;
          at = text.find(kWords, at + 1)) {
         const size_t reason = at + kWords.size();
-        if (reason < text.size() && std::isalpha(static_cast<unsigned char>(text[reason])) != 0) {
+        if (reason < text.size() && base::IsLetter(text[reason])) {
             return true;
         }
     }

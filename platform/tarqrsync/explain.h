@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "platform/tarqrsync/config.h"
+#include "base/rsync_config.h"
 #include "platform/tarqrsync/settings.h"
 #include "tarq/rsync_wrapper.h"
 
@@ -12,7 +12,7 @@ namespace Backup {
 /// What is known of an rsync that failed.
 struct RunFacts {
     const Settings& settings;
-    const Config& config;
+    const base::RsyncConfig& config;
     int exit_code;         ///< rsync's own
     std::string messages;  ///< what rsync and ssh wrote, see MessageKeeper
 };

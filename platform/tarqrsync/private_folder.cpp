@@ -11,7 +11,7 @@
 #include <system_error>
 
 #include "base/unique_fd.h"
-#include "platform/internal/write_all.h"
+#include "base/whole_file.h"
 #include "tarq/root_path.h"
 
 namespace TARQ {
@@ -54,7 +54,7 @@ std::string PrivateFolder::Write(const std::string& name, const std::string& con
     std::string path = Path(name);
     const base::UniqueFd fd(
         open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, executable ? 0700 : 0600));
-    if (!fd || !tarq_internal::WriteAll(fd.Get(), content)) {
+    if (!fd || !base::WriteAll(fd.Get(), content)) {
         throw PrivateFileError("cannot write " + path);
     }
     return path;

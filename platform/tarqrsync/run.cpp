@@ -14,9 +14,10 @@
 #include <charconv>
 #include <cstring>
 
+#include "base/child_process.h"
+#include "base/config_file.h"
 #include "base/unique_fd.h"
-#include "platform/internal/child_process.h"
-#include "platform/internal/config.h"
+#include "base/whole_file.h"
 #include "platform/tarqrsync/answer_file.h"
 #include "platform/tarqrsync/message_keeper.h"
 #include "tarq/root_path.h"
@@ -26,8 +27,8 @@ namespace Backup {
 
 namespace {
 
-using tarq_internal::ChildResult;
-using tarq_internal::ChildSetup;
+using base::ChildResult;
+using base::ChildSetup;
 
 constexpr char kLogPath[] = "/var/log/tarqrsync.log";
 constexpr off_t kMaxLogBytes = off_t{1024} * 1024;
@@ -87,7 +88,7 @@ std::string AskVersion(const ChildSetup& used) {
     setup.arguments = {used.program, "--version"};
     setup.environment = used.environment;
     std::string text;
-    tarq_internal::RunChild(
+    base::RunChild(
         setup, nullptr, [&text](const char* bytes, size_t size) { text.append(bytes, size); },
         nullptr);
     const std::string head = "rsync  version ";
@@ -118,7 +119,7 @@ bool IsMissing(const std::string& path) {
 
 // True when the process `pid` is known to lie in a sleep of a fixed time.
 bool IsInTimedSleep(pid_t pid) {
-    const auto text = tarq_internal::ReadTextFile("/proc/" + std::to_string(pid) + "/syscall");
+    const auto text = base::ReadFile("/proc/" + std::to_string(pid) + "/syscall");
     long number = -1;  // of the system call; no number when the process runs
     if (!text) {
         return false;
@@ -152,7 +153,7 @@ public:
         }
     }
 
-    tarq_internal::EarlyEnd End() const {
+    base::EarlyEnd End() const {
         return {notify_.Get(),
                 [this](pid_t rsync) { return !IsMissing(answer_file_) && IsInTimedSleep(rsync); }};
     }
@@ -169,6 +170,8 @@ int Run::Execute(const std::function<bool()>& cancelled) {
         outcome_.status = Attempt(cancelled);
     } catch (const PrivateFileError& error) {
         outcome_.status = Fail(kStatusFileIo, error.what());
+    } catch (const base::ConfigError& error) {
+        outcome_.status = Fail(STATUS_SYNTAX, error.what());
     }
     return outcome_.status;
 }
@@ -179,10 +182,7 @@ int Run::Attempt(const std::function<bool()>& cancelled) {
         const bool lacks_account = settings_.user.empty() && settings_.account_required;
         return Fail(lacks_account ? STATUS_AUTHENTICATION : STATUS_SYNTAX, refusal);
     }
-    const std::string fault = ReadConfig(&config_);
-    if (!fault.empty()) {
-        return Fail(STATUS_SYNTAX, fault);
-    }
+    config_ = base::ReadRsyncConfig(RootPath(base::kRsyncConfigPath));
     if (settings_.debug_log) {
         log_file_ = PrepareLog();
     }
@@ -278,7 +278,7 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     outcome_.details.clear();
     messages_.clear();
     ChildSetup setup;
-    setup.program = tarq_internal::FindProgram(config_.rsync, PathVariable(invocation.environment));
+    setup.program = base::FindProgram(config_.rsync, PathVariable(invocation.environment));
     setup.arguments = invocation.arguments;
     setup.arguments.insert(setup.arguments.begin(), config_.rsync);
     setup.environment = invocation.environment;
@@ -292,7 +292,7 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     RunWatch watch(PatienceOfRun());
     RunWatch::Fault fault = RunWatch::Fault::NONE;
     setup.on_start = [&](pid_t rsync) { watch.Started(rsync); };
-    const ChildResult result = tarq_internal::RunChild(
+    const ChildResult result = base::RunChild(
         setup,
         [&] {
             fault = watch.Look(parser->Begun());

@@ -4,9 +4,9 @@
 #include <functional>
 #include <string>
 
-#include "platform/internal/child_process.h"
+#include "base/child_process.h"
+#include "base/rsync_config.h"
 #include "platform/tarqrsync/arguments.h"
-#include "platform/tarqrsync/config.h"
 #include "platform/tarqrsync/explain.h"
 #include "platform/tarqrsync/output_parser.h"
 #include "platform/tarqrsync/private_folder.h"
@@ -35,7 +35,7 @@ private:
     /// What a command's rsync may do, beyond what a copy's may.
     struct ChildLimits {
         uint64_t max_file_bytes = 0;
-        tarq_internal::EarlyEnd early_end;
+        base::EarlyEnd early_end;
     };
 
     Patience PatienceOfRun() const;
@@ -52,7 +52,7 @@ private:
 
     const Settings& settings_;
     const RunOptions& options_;
-    Config config_;
+    base::RsyncConfig config_;
     PrivateFolder folder_;
     std::string log_file_;
     std::string messages_;  // what rsync and ssh wrote

@@ -1,10 +1,10 @@
 #include "platform/tarqrsync/settings.h"
 
 #include <algorithm>
-#include <cctype>
 #include <string_view>
 
-#include "platform/tarqrsync/config.h"
+#include "base/rsync_config.h"
+#include "base/text.h"
 
 namespace TARQ {
 namespace Backup {
@@ -29,10 +29,9 @@ bool HasParentStep(const std::string& path) {
 }
 
 bool IsHost(const std::string& host) {
-    return !host.empty() && host[0] != '-' &&
-           std::all_of(host.begin(), host.end(), [](unsigned char c) {
-               return std::isalnum(c) || c == '.' || c == '-' || c == '_' || c == ':' || c == '%';
-           });
+    return !host.empty() && host[0] != '-' && std::all_of(host.begin(), host.end(), [](char c) {
+        return base::IsLetterOrDigit(c) || c == '.' || c == '-' || c == '_' || c == ':' || c == '%';
+    });
 }
 
 std::string RefusalOfAccount(const Settings& settings) {
@@ -101,7 +100,7 @@ std::string RefusalOf(const Settings& settings) {
     if (!IsHost(settings.host)) {
         return "'" + settings.host + "' is neither a host name nor an address";
     }
-    if (settings.port < 0 || settings.port > kMaxPort) {
+    if (settings.port < 0 || settings.port > base::kMaxPort) {
         return "the port " + std::to_string(settings.port) + " is not between 1 and 65535";
     }
     if (settings.timeout < 0) {

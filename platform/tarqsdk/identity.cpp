@@ -6,18 +6,15 @@
 
 #include <algorithm>
 #include <array>
-#include <cctype>
 #include <cerrno>
 #include <cstdint>
 #include <optional>
 
-#include "platform/internal/config.h"
+#include "base/text.h"
+#include "base/whole_file.h"
 
 namespace tarq_sdk {
 namespace {
-
-using tarq_internal::ReadTextFile;
-using tarq_internal::Trimmed;
 
 // The board's number comes second: a mainboard that is replaced takes it along, the case's label
 // stays.
@@ -103,8 +100,8 @@ bool IsCleanSerial(const std::string& text) {
 bool IsPlaceholder(const std::string& text) {
     std::string letters;
     for (const char c : text) {
-        if (isalnum(static_cast<unsigned char>(c)) != 0) {
-            letters += static_cast<char>(tolower(static_cast<unsigned char>(c)));
+        if (base::IsLetterOrDigit(c)) {
+            letters += base::Lower(c);
         }
     }
     if (letters.find_first_not_of(letters.substr(0, 1)) == std::string::npos) {
@@ -126,14 +123,14 @@ std::string CompactSerial(const std::string& serial) {
 bool HardwareSerial(const std::string& sys, std::string* serial) {
     serial->clear();
     for (const char* source : kSources) {
-        const std::optional<std::string> text = ReadTextFile(sys + source);
+        const std::optional<std::string> text = base::ReadFile(sys + source);
         if (!text) {
             if (errno == ENOENT || errno == ENOTDIR || errno == ENODEV) {
                 continue;
             }
             return false;
         }
-        const std::string candidate = Trimmed(*text);
+        const std::string candidate(base::Trimmed(*text));
         if (IsCleanSerial(candidate) && !IsPlaceholder(candidate)) {
             *serial = candidate;
             return true;

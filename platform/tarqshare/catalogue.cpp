@@ -14,9 +14,9 @@
 #include <charconv>
 #include <cstdio>
 
+#include "base/utf8.h"
 #include "platform/internal/config.h"
 #include "platform/internal/error.h"
-#include "platform/internal/utf8.h"
 
 namespace tarq_share {
 namespace {
@@ -121,8 +121,8 @@ bool AddFacts(const Share& share, KAPICSzHash into) {
 }
 
 bool IsShareName(const std::string& name) {
-    if (name.empty() || name.size() > kMaxNameBytes || !tarq_internal::IsUtf8(name) ||
-        name.front() == '.' || name.front() == '@' || name.front() == ' ' || name.back() == ' ' ||
+    if (name.empty() || name.size() > kMaxNameBytes || !base::IsUtf8(name) || name.front() == '.' ||
+        name.front() == '@' || name.front() == ' ' || name.back() == ' ' ||
         name.find("  ") != std::string::npos) {
         return false;
     }

@@ -13,15 +13,14 @@
 #include <regex>
 #include <sstream>
 
-#include "platform/internal/config.h"
+#include "base/text.h"
+#include "base/whole_file.h"
 #include "platform/tarqshare/mount_table.h"
 
 namespace tarq_share {
 namespace {
 
 namespace fs = std::filesystem;
-using tarq_internal::ReadTextFile;
-using tarq_internal::Trimmed;
 
 // Deeper stacks of device mappings or of file systems on file systems are not built by people.
 constexpr int kMaxDepth = 16;
@@ -90,7 +89,7 @@ bool IsStackable(const Mount& mount) {
 class Finder {
 public:
     explicit Finder(const HostFolders& host)
-        : host_(host), table_(ParseMountTable(ReadTextFile(host.mount_table).value_or(""))) {}
+        : host_(host), table_(ParseMountTable(base::ReadFile(host.mount_table).value_or(""))) {}
 
     /// The mount that holds the data of `path`: where a file system shows another folder's files
     /// (decrypted, say), that folder's.
@@ -168,7 +167,7 @@ private:
         if (fs::exists(disk / "partition", error)) {
             disk = disk.parent_path();
         }
-        if (Trimmed(ReadTextFile(disk / "removable").value_or("")) == "1") {
+        if (base::Trimmed(base::ReadFile(disk / "removable").value_or("")) == "1") {
             return true;
         }
         // Below the folder of `sys` alone: that folder's own name says nothing about the disk.
@@ -179,7 +178,7 @@ private:
         }
         // Memory of this kind that is soldered to the board calls itself "MMC", a card "SD".
         if (position.find("mmc_host/") != std::string::npos &&
-            Trimmed(ReadTextFile(disk / "device/type").value_or("")) != "MMC") {
+            base::Trimmed(base::ReadFile(disk / "device/type").value_or("")) != "MMC") {
             return true;
         }
         if (depth == kMaxDepth) {
@@ -201,8 +200,8 @@ private:
         if (disk.empty()) {
             return {};
         }
-        const std::string number = Trimmed(ReadTextFile(disk / "dev").value_or(""));
-        std::istringstream properties(ReadTextFile(host_.udev_data + "/b" + number).value_or(""));
+        const std::string number(base::Trimmed(base::ReadFile(disk / "dev").value_or("")));
+        std::istringstream properties(base::ReadFile(host_.udev_data + "/b" + number).value_or(""));
         static const std::string key = "E:ID_FS_UUID=";
         for (std::string line; std::getline(properties, line);) {
             if (line.compare(0, key.size(), key) == 0) {

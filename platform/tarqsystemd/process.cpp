@@ -18,7 +18,8 @@ extern "C" {  // the header has no such thing of its own
 #include <sstream>
 #include <utility>
 
-#include "platform/internal/config.h"
+#include "base/child_process.h"
+#include "base/whole_file.h"
 
 namespace tarq_systemd {
 namespace {
@@ -66,12 +67,7 @@ bool Send(int fd, const Value& value) {
     closefrom(kLinkFd + 1);
 
     // The caller's ignored and blocked signals are no business of the command's.
-    for (int number = 1; number < NSIG; ++number) {
-        signal(number, SIG_DFL);
-    }
-    sigset_t none;
-    sigemptyset(&none);
-    sigprocmask(SIG_SETMASK, &none, nullptr);
+    base::ResetSignals();
 
     const pid_t self = getpid();
     char go = 0;
@@ -97,7 +93,7 @@ bool WaitForChild(pid_t child) {
 }  // namespace
 
 std::optional<ProcessId> LookUpProcess(pid_t pid) {
-    const auto text = tarq_internal::ReadTextFile("/proc/" + std::to_string(pid) + "/stat");
+    const auto text = base::ReadFile("/proc/" + std::to_string(pid) + "/stat");
     // The second field, the program's name in brackets, may hold blanks and brackets itself.
     const size_t name_end = text ? text->rfind(')') : std::string::npos;
     if (name_end == std::string::npos) {
@@ -204,12 +200,7 @@ std::optional<BackgroundLaunch> BackgroundLaunch::Prepare(const std::vector<std:
     }
     UniqueFd mine(ends[0]);
     UniqueFd other(ends[1]);
-    std::vector<char*> arguments;
-    arguments.reserve(words.size() + 1);
-    for (const std::string& word : words) {
-        arguments.push_back(const_cast<char*>(word.c_str()));
-    }
-    arguments.push_back(nullptr);
+    const std::vector<char*> arguments = base::ArgumentVector(words);
 
     // The process in between ends at once, so that the command is nobody's child here.
     const pid_t between = fork();

@@ -8,14 +8,15 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <charconv>
 #include <chrono>
-#include <cstdio>
 #include <optional>
 #include <sstream>
 #include <vector>
 
+#include "base/replace_file.h"
+#include "base/text.h"
 #include "base/unique_fd.h"
+#include "base/whole_file.h"
 #include "platform/internal/config.h"
 #include "platform/tarqsystemd/process.h"
 
@@ -29,7 +30,7 @@ using tarq_internal::ReadResult;
 constexpr char kConfiguration[] = "/usr/tarq/etc/tarqsystemd.conf";
 constexpr char kRunFolder[] = "/var/run/";
 constexpr seconds kStopLimit(30);
-constexpr int kLongestStopLimit = 24 * 60 * 60;
+constexpr uint64_t kLongestStopLimit = 24 * 60 * 60;
 constexpr seconds kKillLimit(10);  // for the kernel to take down what no longer has a say in it
 
 std::string PidFile(const std::string& unit) {
@@ -58,7 +59,7 @@ private:
 
 /// The unit's process when it runs. False, with errno set, when that cannot be found out.
 bool FindProcess(const std::string& unit, std::optional<Process>* process) {
-    const auto text = tarq_internal::ReadTextFile(PidFile(unit));
+    const auto text = base::ReadFile(PidFile(unit));
     if (!text) {
         return errno == ENOENT;
     }
@@ -69,22 +70,9 @@ bool FindProcess(const std::string& unit, std::optional<Process>* process) {
     return true;
 }
 
-/// In one step, so that a reader never sees half a number.
 bool WritePidFile(const std::string& unit, const ProcessId& id) {
-    const std::string path = PidFile(unit);
-    const std::string draft = path + ".new";
-    const std::string text = std::to_string(id.pid) + "\n" + std::to_string(id.start_time) + "\n";
-    const UniqueFd file(
-        open(draft.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0644));
-    if (!file) {
-        return false;
-    }
-    const ssize_t written = write(file.Get(), text.data(), text.size());
-    if (written != static_cast<ssize_t>(text.size())) {
-        errno = written < 0 ? errno : ENOSPC;
-        return false;
-    }
-    return rename(draft.c_str(), path.c_str()) == 0;
+    return base::ReplaceFile(
+        PidFile(unit), std::to_string(id.pid) + "\n" + std::to_string(id.start_time) + "\n", 0644);
 }
 
 /// The words of the unit's command; none, with the error code set, when it has no command that
@@ -122,14 +110,12 @@ bool ReadStopLimit(const std::string& unit, seconds* limit) {
         case ReadResult::kFound:
             break;
     }
-    int number = -1;
-    const char* end = text.data() + text.size();
-    const auto [stop, error] = std::from_chars(text.data(), end, number);
-    if (error != std::errc() || stop != end || number < 0 || number > kLongestStopLimit) {
+    const std::optional<uint64_t> number = base::ParseNumber(text, kLongestStopLimit);
+    if (!number) {
         Failed(TARQ_ERR_BAD_PARAMETER);
         return false;
     }
-    *limit = seconds(number);
+    *limit = seconds(*number);
     return true;
 }
 

@@ -9,6 +9,7 @@
 #include <memory>
 #include <string>
 
+#include "base/text.h"
 #include "platform/tarqsystemd/bus_units.h"
 #include "platform/tarqsystemd/supervisor.h"
 #include "platform/tarqsystemd/unit_manager.h"
@@ -32,8 +33,7 @@ std::unique_ptr<UnitManager> Manager() {
 /// Sets the error code when it is none. A unit's name becomes part of a path and a section's name.
 bool IsUnitName(const char* unit) {
     const auto allowed = [](char c) {
-        return isalnum(static_cast<unsigned char>(c)) != 0 ||
-               (c != '\0' && strchr("_-.:@", c) != nullptr);
+        return base::IsLetterOrDigit(c) || (c != '\0' && strchr("_-.:@", c) != nullptr);
     };
     const std::string name = unit == nullptr ? "" : unit;
     if (name.empty() || name.size() > kMaxUnitName || name.front() == '.' ||

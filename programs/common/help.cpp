@@ -7,6 +7,7 @@
 #include <sstream>
 #include <utility>
 
+#include "base/text.h"
 #include "programs/common/text.h"
 
 namespace programs {
@@ -229,7 +230,7 @@ CLI::Validator Between(uint64_t min, uint64_t max) {
     const std::string bounds = std::to_string(min) + " to " + std::to_string(max);
     return CLI::Validator(
         [min, max, bounds](const std::string& text) {
-            const auto number = ParseNumber(text, max);
+            const auto number = base::ParseNumber(text, max);
             return number && *number >= min
                        ? std::string()
                        : "must be a whole number from " + bounds + ", not '" + text + "'";

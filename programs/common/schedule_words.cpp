@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "ZEL/rsyncer.h"
+#include "base/text.h"
 #include "programs/common/text.h"
 
 namespace programs {
@@ -31,13 +32,6 @@ constexpr int kJanuary = 1;
 constexpr int kLastMinuteOfDay = 24 * 60 - 1;
 constexpr long kMaxTimes = 95;  // the library's bound: a run each quarter of an hour
 
-std::string Lower(std::string text) {
-    std::transform(text.begin(), text.end(), text.begin(), [](char c) {
-        return static_cast<char>(c >= 'A' && c <= 'Z' ? c - 'A' + 'a' : c);
-    });
-    return text;
-}
-
 std::string Quoted(const std::string& text) {
     return "'" + Printable(text) + "'";
 }
@@ -50,7 +44,7 @@ std::vector<int> Numbers(const std::string& text, char separator,
     ZEL::SplitStringByChars(text, std::string(1, separator), pieces);
     std::vector<int> numbers;
     for (size_t i = 0; i < pieces.size() && pieces.size() == digits.size(); ++i) {
-        const auto number = ParseNumber(pieces[i], 9999);
+        const auto number = base::ParseNumber(pieces[i], 9999);
         if (!number || pieces[i].size() > digits[i]) {
             return {};
         }
@@ -80,8 +74,8 @@ std::optional<int> ParsePeriod(const std::string& text) {
         return std::nullopt;
     }
     minutes.pop_back();
-    const auto whole = ParseNumber(hours, 23);
-    const auto rest = ParseNumber(minutes, kLastMinuteOfDay);
+    const auto whole = base::ParseNumber(hours, 23);
+    const auto rest = base::ParseNumber(minutes, kLastMinuteOfDay);
     if (!whole || !rest) {
         return std::nullopt;
     }
@@ -101,7 +95,7 @@ std::string DescribePeriod(long seconds) {
 
 std::string ApplyWeek(const std::string& words, ZEL::Schedule& schedule) {
     std::vector<std::string> pieces;
-    ZEL::SplitStringByChars(Lower(words), ",", pieces);
+    ZEL::SplitStringByChars(base::Lower(words), ",", pieces);
     std::string week = "0000000";
     for (const std::string& piece : pieces) {
         const auto* const named =
@@ -150,7 +144,7 @@ std::string ApplyDays(const ScheduleWords& words, ZEL::Schedule& schedule) {
     } else if (words.weekly) {
         return ApplyWeek(*words.weekly, schedule);
     } else if (words.monthly) {
-        const auto day = ParseNumber(*words.monthly, 31);
+        const auto day = base::ParseNumber(*words.monthly, 31);
         if (!day || *day == 0) {
             return "--monthly: " + Quoted(*words.monthly) + " is no day of a month: give 1 to 31";
         }

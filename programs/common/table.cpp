@@ -8,6 +8,7 @@
 #include <nlohmann/json.hpp>
 #include <string_view>
 
+#include "base/text.h"
 #include "programs/common/text.h"
 
 namespace programs {
@@ -19,7 +20,7 @@ constexpr std::string_view kCut = "..";
 
 std::string JsonKey(std::string heading) {
     for (char& c : heading) {
-        c = c == ' ' ? '_' : static_cast<char>(c >= 'A' && c <= 'Z' ? c - 'A' + 'a' : c);
+        c = c == ' ' ? '_' : base::Lower(c);
     }
     return heading;
 }

@@ -1,10 +1,8 @@
 #include "programs/common/text.h"
 
 #include <algorithm>
-#include <charconv>
 #include <cstdio>
 #include <ctime>
-#include <fstream>
 
 namespace programs {
 
@@ -21,16 +19,6 @@ bool IsControl(const std::string& text, size_t i) {
 }
 
 }  // namespace
-
-std::optional<uint64_t> ParseNumber(const std::string& value, uint64_t max) {
-    uint64_t number = 0;
-    const char* const end = value.data() + value.size();
-    const auto [stopped, error] = std::from_chars(value.data(), end, number);
-    if (error != std::errc() || stopped != end || number > max) {
-        return std::nullopt;
-    }
-    return number;
-}
 
 std::string HumanBytes(uint64_t bytes) {
     static const char* const units[] = {"B", "KiB", "MiB", "GiB", "TiB", "PiB", "EiB"};
@@ -123,20 +111,6 @@ std::string Printable(const std::string& text) {
         }
     }
     return printable;
-}
-
-std::optional<std::string> ReadWholeFile(const std::string& path, size_t max) {
-    std::ifstream file(path, std::ios::binary);
-    if (!file) {
-        return std::nullopt;
-    }
-    std::string content(max + 1, '\0');
-    file.read(content.data(), static_cast<std::streamsize>(content.size()));
-    content.resize(static_cast<size_t>(file.gcount()));
-    if (file.bad() || content.size() > max) {
-        return std::nullopt;
-    }
-    return content;
 }
 
 bool IsTaskName(const std::string& name) {

@@ -1,13 +1,9 @@
 #pragma once
 
 #include <cstdint>
-#include <optional>
 #include <string>
 
 namespace programs {
-
-/// `value` as a whole number in decimal digits, at most `max`; nothing for any other text.
-std::optional<uint64_t> ParseNumber(const std::string& value, uint64_t max);
 
 /// "0 B", "1.5 KiB", "23 MiB" ...
 std::string HumanBytes(uint64_t bytes);
@@ -37,8 +33,5 @@ bool IsPrintable(const std::string& text);
 /// Whether a task may be called so: 1 to 128 bytes without control characters, quotes and brackets,
 /// which the server's registry has no place for.
 bool IsTaskName(const std::string& name);
-
-/// The whole file; nothing when it cannot be read or is larger than `max` bytes.
-std::optional<std::string> ReadWholeFile(const std::string& path, size_t max);
 
 }  // namespace programs

@@ -3,8 +3,9 @@
 #pragma once
 
 #include <chrono>
-#include <stdexcept>
 #include <string>
+
+#include "base/config_file.h"
 
 namespace zel_daemon {
 
@@ -18,15 +19,9 @@ struct DaemonConfig {
     std::string group;  ///< whose members may use the socket; empty: nobody's
 };
 
-/// The file is not as it should be: what() says where, and what is wrong.
-class ConfigError : public std::runtime_error {
-public:
-    using std::runtime_error::runtime_error;
-};
-
 /// Reads the file; keys that are missing, and all of them without a file, have their defaults.
-/// Throws ConfigError for a value that does not pass, for a group that this machine does not know,
-/// and for a section or key that nobody would read.
+/// Throws base::ConfigError for a value that does not pass, for a group that this machine does not
+/// know, and for a section or key that nobody would read.
 DaemonConfig ReadDaemonConfig();
 
 }  // namespace zel_daemon

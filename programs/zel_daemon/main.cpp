@@ -147,7 +147,7 @@ void Serve(const Options& options) {
             service.SetConfig(ReadDaemonConfig());
             Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] zel_daemon(%d): configuration read again\n",
                            __LINE__);
-        } catch (const ConfigError& wrong) {
+        } catch (const base::ConfigError& wrong) {
             error = std::string(wrong.what()) + "; the configuration stays as it was";
         }
         service.Refresh();
@@ -271,7 +271,7 @@ int main(int argc, char** argv) {
         } else {
             Serve(options);
         }
-    } catch (const ConfigError& error) {
+    } catch (const base::ConfigError& error) {
         Say(options, error);
         return kMendFirst;
     } catch (const DamagedStore& error) {

@@ -1,6 +1,6 @@
 #include "programs/zel_daemon/sqlite.h"
 
-#include "platform/internal/utf8.h"
+#include "base/utf8.h"
 
 namespace zel_daemon {
 
@@ -10,7 +10,7 @@ namespace {
 constexpr int kBusyMilliseconds = 5000;
 
 bool IsText(const std::string& value) {
-    return value.find('\0') == std::string::npos && tarq_internal::IsUtf8(value);
+    return value.find('\0') == std::string::npos && base::IsUtf8(value);
 }
 
 }  // namespace

@@ -3,7 +3,7 @@
 #include <nlohmann/json.hpp>
 #include <utility>
 
-#include "platform/internal/utf8.h"
+#include "base/utf8.h"
 
 namespace zel_daemon {
 
@@ -56,8 +56,8 @@ template <typename Strings>
 std::string ToJson(const Strings& strings) {
     json list = json::array();
     for (const std::string& string : strings) {
-        list.push_back(tarq_internal::IsUtf8(string) ? json(string)
-                                                     : json(Bytes(string.begin(), string.end())));
+        list.push_back(base::IsUtf8(string) ? json(string)
+                                            : json(Bytes(string.begin(), string.end())));
     }
     return list.dump();
 }

@@ -5,7 +5,8 @@
 #include <sstream>
 
 #include "ZEL/zel.h"
-#include "programs/common/atomic_file.h"
+#include "base/replace_file.h"
+#include "base/whole_file.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/server_config.h"
 
@@ -21,7 +22,7 @@ std::optional<std::vector<std::string>> ReadLines() {
     if (!ZEL::IsPathExist(SecretsFile())) {
         return lines;
     }
-    const auto content = programs::ReadWholeFile(SecretsFile(), kMaxSecrets);
+    const auto content = base::ReadFile(SecretsFile(), kMaxSecrets);
     if (!content) {
         return std::nullopt;
     }
@@ -37,7 +38,7 @@ bool WriteLines(const std::vector<std::string>& lines) {
     for (const std::string& line : lines) {
         content += line + "\n";
     }
-    return programs::WriteFileAtomically(SecretsFile(), content, 0600);
+    return base::ReplaceFile(SecretsFile(), content, 0600);
 }
 
 bool IsLineOf(const std::string& line, const std::string& name) {

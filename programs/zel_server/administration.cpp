@@ -8,6 +8,7 @@
 #include <nlohmann/json.hpp>
 
 #include "ZEL/is_syncedshare.h"
+#include "base/text.h"
 #include "programs/common/command_line.h"
 #include "programs/common/help.h"
 #include "programs/common/table.h"
@@ -188,9 +189,8 @@ int ListShares(bool as_json) {
         ShareState state;
         const bool damaged = ReadShare(name, state) != ReadResult::kRead;
         const Outcome outcome = OutcomeOf(state, damaged);
-        const auto status = programs::ParseNumber(state.last_result, 255);
-        const auto time =
-            programs::ParseNumber(state.last_time, std::numeric_limits<time_t>::max());
+        const auto status = base::ParseNumber(state.last_result, 255);
+        const auto time = base::ParseNumber(state.last_time, std::numeric_limits<time_t>::max());
         if (as_json) {
             rows.push_back({{"share", name},
                             {"client", state.Owner()},

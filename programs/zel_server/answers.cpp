@@ -10,6 +10,7 @@
 #include <memory>
 
 #include "base/unique_fd.h"
+#include "base/whole_file.h"
 #include "programs/zel_server/server_config.h"
 
 namespace zel_server {
@@ -67,9 +68,7 @@ bool WriteAnswer(const std::string& account, const std::string& session,
     // A session is used once: a file that is there already is somebody's mischief.
     const UniqueFd file(
         open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0600));
-    return file &&
-           write(file.Get(), content.data(), content.size()) ==
-               static_cast<ssize_t>(content.size()) &&
+    return file && base::WriteAll(file.Get(), content) &&
            symlink(session.c_str(), LinkOf(account, connection).c_str()) == 0;
 }
 

@@ -1,7 +1,9 @@
 #include "programs/zel_server/command.h"
 
+#include <algorithm>
 #include <string_view>
 
+#include "base/text.h"
 #include "programs/zel_server/names.h"
 #include "tarq/rsync_wrapper.h"
 
@@ -17,12 +19,7 @@ struct KeyValue {
 };
 
 bool IsKey(std::string_view key) {
-    for (const char c : key) {
-        if (!((c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'))) {
-            return false;
-        }
-    }
-    return !key.empty();
+    return !key.empty() && std::all_of(key.begin(), key.end(), base::IsLetter);
 }
 
 bool IsValue(std::string_view value) {

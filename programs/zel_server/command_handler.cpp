@@ -15,6 +15,7 @@
 
 #include "ZEL/is_syncedshare.h"
 #include "ZEL/rsyncer.h"
+#include "base/text.h"
 #include "programs/common/server_status.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/names.h"
@@ -184,7 +185,7 @@ std::optional<StartRequest> ParseStart(const Command& command) {
         }
     }
     const std::string* const key_length = command.Find("lenEncKey");
-    if (key_length != nullptr && !ParseNumber(*key_length, 65536)) {
+    if (key_length != nullptr && !base::ParseNumber(*key_length, 65536)) {
         return std::nullopt;
     }
     const std::string* const encrypted = command.Find("isEncrypt");
@@ -398,7 +399,7 @@ int HandleCommand() {
     const std::string account = Environment("RSYNC_USER_NAME");
     const std::string connection = Environment("RSYNC_PID");
     const std::optional<std::string> session = ParseSession(text);
-    if (!session || !IsAccountName(account) || !ParseNumber(connection, UINT32_MAX)) {
+    if (!session || !IsAccountName(account) || !base::ParseNumber(connection, UINT32_MAX)) {
         // Shown to the client by the daemon.
         puts("This module takes commands of the synchronisation service only.");
         return 1;

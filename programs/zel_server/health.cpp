@@ -9,6 +9,8 @@
 #include <cerrno>
 #include <filesystem>
 
+#include "base/text.h"
+#include "base/whole_file.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/accounts.h"
 #include "programs/zel_server/registry_repair.h"
@@ -58,8 +60,8 @@ std::optional<pid_t> PidInFile() {
     if (KAPICProcAliveByPidFile(PidFile().c_str()) == 0) {
         return std::nullopt;
     }
-    const std::string text = programs::ReadWholeFile(PidFile(), kMaxPidFile).value_or("");
-    const auto pid = programs::ParseNumber(text.substr(0, text.find('\n')), INT32_MAX);
+    const std::string text = base::ReadFile(PidFile(), kMaxPidFile).value_or("");
+    const auto pid = base::ParseNumber(text.substr(0, text.find('\n')), INT32_MAX);
     return pid && IsOurDaemon(static_cast<pid_t>(*pid)) ? std::optional<pid_t>(*pid) : std::nullopt;
 }
 

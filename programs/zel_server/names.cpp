@@ -1,5 +1,6 @@
 #include "programs/zel_server/names.h"
 
+#include "base/text.h"
 #include "tarq/rsync_wrapper.h"
 
 namespace zel_server {
@@ -15,10 +16,6 @@ constexpr size_t kMaxVolumeName = 128;
 bool IsControl(char c) {
     const unsigned char byte = static_cast<unsigned char>(c);
     return byte < 0x20 || byte == 0x7f;
-}
-
-bool IsAsciiAlnum(char c) {
-    return (c >= '0' && c <= '9') || (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z');
 }
 
 // 1 to `max` bytes, none of them a control character or one of `refused`.
@@ -47,11 +44,11 @@ bool IsShareName(const std::string& name) {
 }
 
 bool IsAccountName(const std::string& name) {
-    if (name.empty() || name.size() > kMaxAccountName || !IsAsciiAlnum(name.front())) {
+    if (name.empty() || name.size() > kMaxAccountName || !base::IsLetterOrDigit(name.front())) {
         return false;
     }
     for (const char c : name) {
-        if (!IsAsciiAlnum(c) && std::string("._-@+").find(c) == std::string::npos) {
+        if (!base::IsLetterOrDigit(c) && std::string("._-@+").find(c) == std::string::npos) {
             return false;
         }
     }
@@ -87,7 +84,7 @@ std::string ModuleKey(const std::string& name) {
     std::string key;
     for (const char c : name) {
         if (c != ' ') {
-            key += static_cast<char>(c >= 'A' && c <= 'Z' ? c - 'A' + 'a' : c);
+            key += base::Lower(c);
         }
     }
     return key;

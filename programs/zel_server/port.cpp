@@ -16,6 +16,7 @@
 #include <map>
 #include <memory>
 
+#include "base/text.h"
 #include "base/unique_fd.h"
 #include "programs/common/text.h"
 
@@ -88,7 +89,7 @@ void ForEachHolder(const Take& take) {
     std::error_code error;
     for (fs::directory_iterator process("/proc", error), end; !error && process != end;
          process.increment(error)) {
-        const auto pid = programs::ParseNumber(process->path().filename(), INT32_MAX);
+        const auto pid = base::ParseNumber(process->path().filename().native(), INT32_MAX);
         if (!pid) {
             continue;
         }

@@ -3,7 +3,8 @@
 #include <set>
 
 #include "ZEL/is_syncedshare.h"
-#include "programs/common/atomic_file.h"
+#include "base/replace_file.h"
+#include "base/whole_file.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/registry.h"
 #include "programs/zel_server/share_module.h"
@@ -15,8 +16,8 @@ namespace {
 constexpr size_t kMaxRegistry = size_t{8} * 1024 * 1024;  // as section files have it
 
 bool KeepDamagedCopy() {
-    const auto text = programs::ReadWholeFile(RegistryFile(), kMaxRegistry);
-    return text && programs::WriteFileAtomically(DamagedCopy(), *text, 0600);
+    const auto text = base::ReadFile(RegistryFile(), kMaxRegistry);
+    return text && base::ReplaceFile(DamagedCopy(), *text, 0600);
 }
 
 bool PutBack(const std::string& share) {

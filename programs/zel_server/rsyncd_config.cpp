@@ -4,7 +4,8 @@
 
 #include <sstream>
 
-#include "programs/common/atomic_file.h"
+#include "base/replace_file.h"
+#include "base/whole_file.h"
 #include "programs/common/text.h"
 #include "tarq/root_path.h"
 #include "tarq/rsync_wrapper.h"
@@ -52,8 +53,8 @@ bool WriteRsyncdConfig(const ServerConfig& config) {
     }
     text << "\n&include " << ShareModules() << "\n&include " << AdminModules() << "\n";
     // Its time tells whether the daemon that runs knows it.
-    return programs::ReadWholeFile(RsyncdConfig(), kMaxFile) == text.str() ||
-           programs::WriteFileAtomically(RsyncdConfig(), text.str(), 0644);
+    return base::ReadFile(RsyncdConfig(), kMaxFile) == text.str() ||
+           base::ReplaceFile(RsyncdConfig(), text.str(), 0644);
 }
 
 bool IsPlainPath(const std::string& path) {

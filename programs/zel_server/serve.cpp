@@ -10,6 +10,8 @@
 #include <cstdio>
 #include <cstring>
 
+#include "base/child_process.h"
+#include "base/whole_file.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/complaint.h"
 #include "programs/zel_server/rsyncd_config.h"
@@ -34,12 +36,7 @@ std::vector<std::string> DaemonCommand(const std::string& address, bool first) {
 
 // Becomes the daemon; comes back, with errno set, only when it cannot.
 void Become(const std::vector<std::string>& command) {
-    std::vector<char*> arguments;
-    arguments.reserve(command.size() + 1);
-    for (const std::string& word : command) {
-        arguments.push_back(const_cast<char*>(word.c_str()));
-    }
-    arguments.push_back(nullptr);
+    const std::vector<char*> arguments = base::ArgumentVector(command);
     execvp(arguments[0], arguments.data());
 }
 
@@ -90,8 +87,7 @@ std::vector<std::string> ServedAddresses(const ServerConfig& config) {
 }
 
 bool IsOurDaemon(pid_t pid) {
-    const auto words =
-        programs::ReadWholeFile("/proc/" + std::to_string(pid) + "/cmdline", kMaxCommandLine);
+    const auto words = base::ReadFile("/proc/" + std::to_string(pid) + "/cmdline", kMaxCommandLine);
     if (!words) {
         return false;
     }

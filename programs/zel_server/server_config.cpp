@@ -6,6 +6,8 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "base/rsync_config.h"
+#include "base/text.h"
 #include "programs/common/text.h"
 #include "tarq/owners.h"
 #include "tarq/root_path.h"
@@ -96,7 +98,7 @@ std::optional<ServerConfig> LoadServerConfig() {
         return std::nullopt;
     }
     ServerConfig config;
-    const auto port = programs::ParseNumber(Value(values, "port"), 65535);
+    const auto port = base::ParseNumber(Value(values, "port"), base::kMaxPort);
     config.address = Value(values, "address");
     config.storage = Value(values, "storage");
     config.encryption = Value(values, "encryption") != "no";

@@ -13,6 +13,7 @@
 #include <thread>
 
 #include "ZEL/is_syncedshare.h"
+#include "base/rsync_config.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/accounts.h"
 #include "programs/zel_server/complaint.h"
@@ -30,7 +31,6 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr int kSystemPort = 873;  // rsync's own; only root may listen there
 constexpr int kUnprivilegedPort = 8873;
 constexpr char kStorageUser[] = "zel";
 constexpr char kEverywhere[] = "all";
@@ -53,7 +53,7 @@ std::string Normal(const std::string& folder) {
 // What holds when nothing is said: what was said before, or else what is usual.
 ServerConfig ConfigBefore() {
     ServerConfig usual;
-    usual.port = IsSystem() ? kSystemPort : kUnprivilegedPort;
+    usual.port = IsSystem() ? base::kRsyncPort : kUnprivilegedPort;
     usual.user = IsSystem() ? kStorageUser : "";
     return LoadServerConfig().value_or(usual);
 }

@@ -10,7 +10,8 @@
 #include <filesystem>
 #include <sstream>
 
-#include "programs/common/atomic_file.h"
+#include "base/replace_file.h"
+#include "base/whole_file.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/names.h"
 #include "programs/zel_server/rsyncd_config.h"
@@ -93,8 +94,8 @@ bool WriteShareModule(const ServerConfig& config, const std::string& share,
     } else {
         text << "    use chroot = no\n";
     }
-    return programs::ReadWholeFile(FileOf(share), kMaxModuleFile) == text.str() ||
-           programs::WriteFileAtomically(FileOf(share), text.str(), 0644);
+    return base::ReadFile(FileOf(share), kMaxModuleFile) == text.str() ||
+           base::ReplaceFile(FileOf(share), text.str(), 0644);
 }
 
 bool HasShareModule(const std::string& share) {
@@ -104,7 +105,7 @@ bool HasShareModule(const std::string& share) {
 }
 
 std::optional<ShareModule> ReadShareModule(const std::string& share) {
-    const auto text = programs::ReadWholeFile(FileOf(share), kMaxModuleFile);
+    const auto text = base::ReadFile(FileOf(share), kMaxModuleFile);
     if (!text) {
         return std::nullopt;
     }

@@ -5,6 +5,7 @@
 #include <ctime>
 #include <string>
 
+#include "base/text.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/answers.h"
 #include "programs/zel_server/names.h"
@@ -93,7 +94,7 @@ int EndTransfer() {
         return 0;
     }
     if (connection.module == TARQ::Backup::kCommandModule) {
-        if (programs::ParseNumber(connection.number, UINT32_MAX)) {
+        if (base::ParseNumber(connection.number, UINT32_MAX)) {
             RemoveAnswer(connection.account, connection.number);
         }
         return 0;
@@ -104,7 +105,7 @@ int EndTransfer() {
     ShareState state;
     // After a push is closed, later connections only read or ask: they say nothing about the copy.
     // The client may have said that its push failed before the daemon, which knows why, comes here.
-    if (!lock.Held() || status == nullptr || !programs::ParseNumber(status, 255) ||
+    if (!lock.Held() || status == nullptr || !base::ParseNumber(status, 255) ||
         !IsShareName(share) || ReadShare(share, state) != ReadResult::kRead ||
         state.account != connection.account || state.running_id.empty()) {
         return 0;

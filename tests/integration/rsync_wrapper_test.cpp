@@ -446,7 +446,7 @@ TEST_F(RsyncWrapperTest, AnRsyncThatIsMissingOrTooOldIsNamed) {
     EXPECT_THAT(report_.explanation, StartsWith(old + " is rsync 3.1.3, which is too old"));
     root_.Write("usr/tarq/etc/tarqrsync.conf", "[rsync]\nport=\"many\"\n");
     EXPECT_EQ(Copy(), 1);
-    EXPECT_THAT(report_.explanation, HasSubstr("port 'many'"));
+    EXPECT_THAT(report_.explanation, HasSubstr("port is 'many', not a number from 1 to 65535"));
 }
 
 TEST_F(RsyncWrapperTest, TheDebugLogIsRotatedAndAFolderWithoutRightsIsNoFailure) {

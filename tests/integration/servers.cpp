@@ -14,8 +14,8 @@
 #include <stdexcept>
 #include <thread>
 
+#include "base/child_process.h"
 #include "base/unique_fd.h"
-#include "platform/internal/child_process.h"
 
 namespace test {
 
@@ -42,9 +42,9 @@ bool Answers(int port) {
     return connect(socket.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
 }
 
-tarq_internal::ChildSetup SetupOf(const std::vector<std::string>& command) {
-    tarq_internal::ChildSetup setup;
-    setup.program = tarq_internal::FindProgram(command[0], kSearchPath);
+base::ChildSetup SetupOf(const std::vector<std::string>& command) {
+    base::ChildSetup setup;
+    setup.program = base::FindProgram(command[0], kSearchPath);
     setup.arguments = command;
     setup.environment = {"LC_ALL=C", std::string("PATH=") + kSearchPath};
     return setup;
@@ -61,13 +61,12 @@ void MakeKey(const std::string& path, const std::string& passphrase) {
 Outcome RunProgram(const std::string& root, std::vector<std::string> command,
                    const std::string& input, const std::function<bool()>& cancelled,
                    const std::string& path) {
-    tarq_internal::ChildSetup setup = SetupOf(command);
+    base::ChildSetup setup = SetupOf(command);
     setup.environment = {"LC_ALL=C", "TARQ_ROOT=" + root, "PATH=" + path};
     setup.input = input;
     Outcome outcome;
     const auto append = [&](const char* bytes, size_t size) { outcome.output.append(bytes, size); };
-    const tarq_internal::ChildResult result =
-        tarq_internal::RunChild(setup, cancelled, append, append);
+    const base::ChildResult result = base::RunChild(setup, cancelled, append, append);
     outcome.exit_code = WIFEXITED(result.wait_status) ? WEXITSTATUS(result.wait_status) : -1;
     return outcome;
 }
@@ -86,7 +85,7 @@ void ServerProcess::Start(const std::vector<std::string>& command, const std::st
         const auto append = [&file](const char* bytes, size_t size) {
             file.write(bytes, static_cast<std::streamsize>(size)).flush();
         };
-        tarq_internal::RunChild(
+        base::RunChild(
             SetupOf(command), [this] { return stop_.load(); }, append, append);
         ended_ = true;
     });
@@ -153,7 +152,7 @@ void RsyncDaemon::AddCommandModule(const std::string& handler) {
 }
 
 bool SshServer::Available() {
-    return access(tarq_internal::FindProgram("sshd", kSearchPath).c_str(), X_OK) == 0 &&
+    return access(base::FindProgram("sshd", kSearchPath).c_str(), X_OK) == 0 &&
            (access("/run/sshd", X_OK) == 0 || mkdir("/run/sshd", 0755) == 0);
 }
 
@@ -175,9 +174,9 @@ SshServer::SshServer() : port_(FreePort()) {
 
 void SshServer::Start() {
     // sshd starts itself anew for each connection and wants its full path for that.
-    process_.Start({tarq_internal::FindProgram("sshd", kSearchPath), "-D", "-e", "-f",
-                    folder_.Path("sshd_config")},
-                   folder_.Path("log"), port_);
+    process_.Start(
+        {base::FindProgram("sshd", kSearchPath), "-D", "-e", "-f", folder_.Path("sshd_config")},
+        folder_.Path("log"), port_);
 }
 
 void SshServer::ChangeHostKey() {

@@ -6,7 +6,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "platform/internal/child_process.h"
+#include "base/child_process.h"
 
 namespace zelctl {
 
@@ -24,12 +24,12 @@ std::string SearchPath() {
 }  // namespace
 
 std::string FindInPath(const std::string& name) {
-    return tarq_internal::FindProgram(name, SearchPath());
+    return base::FindProgram(name, SearchPath());
 }
 
 ChildOutput RunAndRead(const std::vector<std::string>& command) {
     ChildOutput answer;
-    tarq_internal::ChildSetup setup;
+    base::ChildSetup setup;
     setup.program = FindInPath(command[0]);
     if (setup.program.empty()) {
         answer.failure = command[0] + " is not installed";
@@ -42,7 +42,7 @@ ChildOutput RunAndRead(const std::vector<std::string>& command) {
         return std::chrono::steady_clock::now() > end ||
                answer.output.size() + answer.errors.size() > kMaxOutput;
     };
-    const tarq_internal::ChildResult result = tarq_internal::RunChild(
+    const base::ChildResult result = base::RunChild(
         setup, enough, [&](const char* bytes, size_t size) { answer.output.append(bytes, size); },
         [&](const char* bytes, size_t size) { answer.errors.append(bytes, size); });
     if (result.start_error != 0) {

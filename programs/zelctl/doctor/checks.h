@@ -9,6 +9,7 @@
 
 #include "ZEL/pobject.h"
 #include "ZEL/sync_obj.h"
+#include "base/rsync_config.h"
 #include "programs/zelctl/base/daemon_client.h"
 
 namespace zelctl {
@@ -68,8 +69,8 @@ void CheckDaemon(const Patient& patient, Findings& findings);
 /// "task a", "tasks a, b", or how many they are
 std::string TasksInWords(const std::set<std::string>& names);
 
-/// A value of section "rsync" of /usr/tarq/etc/tarqrsync.conf, or `otherwise`.
-std::string RsyncSetting(const char* key, const std::string& otherwise);
+/// How rsync and ssh are run here; as by default when the file that says so is faulty.
+base::RsyncConfig RsyncSettings();
 
 /// Where the daemon keeps its tasks.
 std::string StorePath(const Patient& patient);

@@ -8,6 +8,9 @@
 #include <fstream>
 #include <iterator>
 
+#include "base/config_file.h"
+#include "base/rsync_config.h"
+#include "base/text.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/daemon_config.h"
 #include "programs/zelctl/base/child_output.h"
@@ -24,37 +27,6 @@ namespace {
 constexpr char kUnit[] = "zel_daemon";
 constexpr char kStore[] = "/usr/tarq/etc/zel_daemon/tasks.db";
 constexpr int kProtocol = 1;
-
-// The keys of section "rsync" of tarqrsync.conf.
-constexpr const char* kRsyncKeys[] = {"answer_seconds", "dead_seconds", "port",
-                                      "rsync",          "ssh",          "ssh_options"};
-constexpr uint64_t kMaxPort = 65535;
-
-// What is wrong with tarqrsync.conf; empty when nothing is.
-std::string FaultOfRsyncConfig() {
-    const std::string path = TARQ::RootPath("/usr/tarq/etc/tarqrsync.conf");
-    const TARQ::HashOwner section(KAPICSzHashAlloc(8));
-    struct stat info = {};
-    if (!section || stat(path.c_str(), &info) != 0) {
-        return "";
-    }
-    if (KAPICFileGetSection(path.c_str(), "rsync", section.get()) < 0) {
-        return path + ": " + KAPICErrText(KAPICErrGet());
-    }
-    const char* const port = KAPICSzHashGetValue(section.get(), "port");
-    if (port != nullptr && programs::ParseNumber(port, kMaxPort).value_or(0) == 0) {
-        return path + ": port is '" + port + "', not a number from 1 to 65535";
-    }
-    const char* key = nullptr;
-    const char* value = nullptr;
-    for (int at = 0; KAPICSzHashNext(section.get(), &at, &key, &value) == 1;) {
-        if (std::find(std::begin(kRsyncKeys), std::end(kRsyncKeys), std::string(key)) ==
-            std::end(kRsyncKeys)) {
-            return path + ": there is no key '" + std::string(key) + "'";
-        }
-    }
-    return "";
-}
 
 // What is wrong with the database file, by its head and its size; empty when nothing is, or it is
 // not there. What is still beside it is not in it: then only the head counts.
@@ -181,18 +153,18 @@ void CheckDaemon(const Patient& patient, Findings& findings) {
 }
 
 void CheckConfiguration(const Patient&, Findings& findings) {
-    std::vector<std::string> faults = {FaultOfRsyncConfig()};
-    try {
-        zel_daemon::ReadDaemonConfig();
-    } catch (const zel_daemon::ConfigError& error) {
-        faults.emplace_back(error.what());
-    }
-    faults.erase(std::remove(faults.begin(), faults.end(), ""), faults.end());
-    for (const std::string& found : faults) {
-        findings.push_back(
-            {"configuration", Verdict::kFailed, found, "correct the line, then: zelctl reload"});
-    }
-    if (faults.empty()) {
+    const size_t before = findings.size();
+    const auto check = [&findings](const auto& read) {
+        try {
+            read();
+        } catch (const base::ConfigError& error) {
+            findings.push_back({"configuration", Verdict::kFailed, error.what(),
+                                "correct the line, then: zelctl reload"});
+        }
+    };
+    check([] { base::ReadRsyncConfig(TARQ::RootPath(base::kRsyncConfigPath)); });
+    check(zel_daemon::ReadDaemonConfig);
+    if (findings.size() == before) {
         findings.push_back({"configuration", Verdict::kOk, "nothing wrong in it", ""});
     }
 }

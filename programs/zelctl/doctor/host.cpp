@@ -10,6 +10,9 @@
 #include <ctime>
 #include <filesystem>
 
+#include "base/config_file.h"
+#include "base/text.h"
+#include "base/whole_file.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/child_output.h"
 #include "programs/zelctl/doctor/checks.h"
@@ -36,9 +39,8 @@ void AddFact(Findings& findings, const std::string& name, const std::string& fin
 
 /// A number of /proc/sys; 0 when it cannot be read.
 uint64_t KernelNumber(const std::string& path) {
-    const auto text = programs::ReadWholeFile(path, 64);
-    return text ? programs::ParseNumber(text->substr(0, text->find('\n')), UINT64_MAX).value_or(0)
-                : 0;
+    const auto text = base::ReadFile(path, 64);
+    return text ? base::ParseNumber(text->substr(0, text->find('\n')), UINT64_MAX).value_or(0) : 0;
 }
 
 // Folders below `folder`, itself included, up to `limit`.
@@ -70,12 +72,12 @@ uint64_t CountAllFolders(const Patient& patient, uint64_t limit) {
 
 }  // namespace
 
-std::string RsyncSetting(const char* key, const std::string& otherwise) {
-    char value[4096] = "";
-    const std::string path = TARQ::RootPath("/usr/tarq/etc/tarqrsync.conf");
-    const bool found =
-        KAPICFileGetSectionValue(path.c_str(), "rsync", key, value, sizeof value) == 0;
-    return found && value[0] != '\0' ? value : otherwise;
+base::RsyncConfig RsyncSettings() {
+    try {
+        return base::ReadRsyncConfig(TARQ::RootPath(base::kRsyncConfigPath));
+    } catch (const base::ConfigError&) {
+        return {};
+    }
 }
 
 bool IsUsableRsync(const std::string& text, std::string& version) {
@@ -100,7 +102,7 @@ bool IsUsableRsync(const std::string& text, std::string& version) {
 }
 
 void CheckRsync(const Patient&, Findings& findings) {
-    const std::string program = RsyncSetting("rsync", "rsync");
+    const std::string program = RsyncSettings().rsync;
     const ChildOutput answer = RunAndRead({program, "--version"});
     std::string version;
     if (!answer.failure.empty()) {
@@ -118,7 +120,7 @@ void CheckRsync(const Patient&, Findings& findings) {
 }
 
 void CheckSSH(const Patient& patient, Findings& findings) {
-    const std::string program = RsyncSetting("ssh", "ssh");
+    const std::string program = RsyncSettings().ssh;
     const std::string path = FindInPath(program);
     if (!path.empty()) {
         AddFact(findings, "ssh", path);

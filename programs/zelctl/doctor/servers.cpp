@@ -24,7 +24,6 @@ using std::chrono::steady_clock;
 constexpr milliseconds kPatience(3000);
 constexpr size_t kAtOnce = 64;  // servers; each takes a descriptor for each of its addresses
 constexpr uint32_t kSSHPort = 22;
-constexpr char kDaemonPort[] = "873";
 
 struct AddressFree {
     void operator()(addrinfo* list) const { freeaddrinfo(list); }
@@ -132,7 +131,7 @@ void Wait(Endpoint* begin, Endpoint* end) {
 }
 
 std::vector<Endpoint> Gather(const Patient& patient) {
-    const std::string daemon_port = RsyncSetting("port", kDaemonPort);
+    const std::string daemon_port = std::to_string(RsyncSettings().daemon_port);
     std::map<std::tuple<std::string, std::string, std::string>, Endpoint> endpoints;
     for (const PatientTask& task : patient.tasks) {
         const ZEL::SyncInfo& info = task.record.GetInfo().GetSyncInfo();

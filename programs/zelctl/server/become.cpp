@@ -6,20 +6,19 @@
 #include <cstring>
 #include <filesystem>
 
+#include "base/child_process.h"
+
 namespace zelctl {
 
 ExitCode BecomeServer(const std::vector<std::string>& arguments) {
-    std::string program = "zel_server";
-    std::vector<char*> words = {program.data()};
-    for (const std::string& argument : arguments) {
-        words.push_back(const_cast<char*>(argument.c_str()));
-    }
-    words.push_back(nullptr);
+    std::vector<std::string> command = {"zel_server"};
+    command.insert(command.end(), arguments.begin(), arguments.end());
+    const std::vector<char*> words = base::ArgumentVector(command);
     // The one that was installed with this program, or else any.
     std::error_code error;
     const std::filesystem::path own = std::filesystem::read_symlink("/proc/self/exe", error);
-    execv((own.parent_path() / program).c_str(), words.data());
-    execvp(program.c_str(), words.data());
+    execv((own.parent_path() / command[0]).c_str(), words.data());
+    execvp(command[0].c_str(), words.data());
     return Fail(kLocal, "zel_server cannot be started: %s; is the package zel-server installed?",
                 strerror(errno));
 }

@@ -10,8 +10,9 @@
 #include <filesystem>
 #include <optional>
 #include <set>
-#include <sstream>
 
+#include "base/section_view.h"
+#include "base/text.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/child_output.h"
 #include "programs/zelctl/share/commands.h"
@@ -30,14 +31,6 @@ constexpr char kCatalogue[] = "/usr/tarq/etc/tarqshare.conf";
 constexpr char kRoot[] = "TARQ_ROOT";
 constexpr const char* kOwnSections[] = {"global", "homes", "printers", "print$", "ipc$"};
 
-std::string Trimmed(const std::string& text) {
-    const char* const blanks = " \t\r\n";
-    const size_t begin = text.find_first_not_of(blanks);
-    return begin == std::string::npos
-               ? ""
-               : text.substr(begin, text.find_last_not_of(blanks) - begin + 1);
-}
-
 // Samba takes a value in double quotes for what is in them.
 std::string Unquoted(const std::string& value) {
     return value.size() >= 2 && value.front() == '"' && value.back() == '"'
@@ -45,16 +38,8 @@ std::string Unquoted(const std::string& value) {
                : value;
 }
 
-// Samba folds names like this; those of the catalogue differ in more than capitals as well.
-std::string Folded(std::string text) {
-    std::transform(text.begin(), text.end(), text.begin(), [](char c) {
-        return static_cast<char>(c >= 'A' && c <= 'Z' ? c - 'A' + 'a' : c);
-    });
-    return text;
-}
-
 bool IsYes(const std::string& value) {
-    const std::string folded = Folded(value);
+    const std::string folded = base::Lower(value);
     return folded == "yes" || folded == "true" || folded == "1";
 }
 
@@ -77,7 +62,7 @@ struct Section {
 
     bool IsShare() const {
         const auto* const own =
-            std::find(std::begin(kOwnSections), std::end(kOwnSections), Folded(name));
+            std::find(std::begin(kOwnSections), std::end(kOwnSections), base::Lower(name));
         return !name.empty() && !printable && own == std::end(kOwnSections);
     }
 
@@ -112,7 +97,7 @@ ExitCode Choose(const std::vector<std::string>& names, std::vector<SambaShare>& 
     ExitCode result = kOk;
     for (const std::string& name : names) {
         const auto found = std::find_if(shares.begin(), shares.end(), [&](const SambaShare& share) {
-            return Folded(share.name) == Folded(name);
+            return base::Lower(share.name) == base::Lower(name);
         });
         if (found == shares.end()) {
             result = Fail(kLocal, "Samba has no share '%s'", Printable(name).c_str());
@@ -185,21 +170,21 @@ ExitCode Preview(const SambaShare& share) {
 
 std::vector<SambaShare> ParseSambaShares(const std::string& text) {
     std::vector<Section> sections;
-    std::istringstream lines(text);
-    for (std::string line; std::getline(lines, line);) {
-        line = Trimmed(line);
+    std::string_view rest = text;
+    for (std::string_view line; base::TakeLine(rest, line);) {
+        line = base::Trimmed(line);
         if (line.empty() || line.front() == '#' || line.front() == ';') {
             continue;
         }
         if (line.front() == '[' && line.back() == ']') {
             sections.emplace_back();
-            sections.back().name = Trimmed(line.substr(1, line.size() - 2));
+            sections.back().name = base::Trimmed(line.substr(1, line.size() - 2));
             continue;
         }
         const size_t equals = line.find('=');
         if (equals != std::string::npos && !sections.empty()) {
-            sections.back().Take(Folded(Trimmed(line.substr(0, equals))),
-                                 Trimmed(line.substr(equals + 1)));
+            sections.back().Take(base::Lower(std::string(base::Trimmed(line.substr(0, equals)))),
+                                 std::string(base::Trimmed(line.substr(equals + 1))));
         }
     }
     std::vector<SambaShare> shares;
@@ -223,7 +208,7 @@ ExitCode ImportSambaShares(const std::string& config, const std::vector<std::str
                     Printable(answer.failure).c_str());
     }
     if (answer.exit_code != 0) {
-        std::string errors = Trimmed(answer.errors);
+        std::string errors(base::Trimmed(answer.errors));
         std::replace(errors.begin(), errors.end(), '\n', ' ');
         return Fail(kLocal, "testparm cannot read the configuration: %s",
                     Printable(errors).c_str());
@@ -235,7 +220,8 @@ ExitCode ImportSambaShares(const std::string& config, const std::vector<std::str
     if (!known) {
         return kLocal;
     }
-    std::transform(known->begin(), known->end(), std::inserter(there, there.end()), Folded);
+    std::transform(known->begin(), known->end(), std::inserter(there, there.end()),
+                   [](const std::string& name) { return base::Lower(name); });
     std::optional<ScratchCatalogue> scratch;
     if (dry_run) {
         scratch.emplace();
@@ -251,7 +237,7 @@ ExitCode ImportSambaShares(const std::string& config, const std::vector<std::str
         const std::string name = Printable(share.name);
         const std::string refusal =
             share.refusal.empty() ? FaultOfFolder(share.path) : share.refusal;
-        if (there.count(Folded(share.name)) != 0) {
+        if (there.count(base::Lower(share.name)) != 0) {
             printf("Share '%s' is in the catalogue already; it stays as it is\n", name.c_str());
         } else if (!refusal.empty()) {
             result = Fail(kLocal, "share '%s' %s left out: %s", name.c_str(),

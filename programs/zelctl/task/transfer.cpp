@@ -7,7 +7,8 @@
 #include <optional>
 
 #include "ZEL/sync_obj.h"
-#include "programs/common/atomic_file.h"
+#include "base/replace_file.h"
+#include "base/whole_file.h"
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
@@ -38,7 +39,7 @@ ExitCode GetTasks(bool secrets, PObject& reply) {
 }
 
 ExitCode ReadTasks(const std::string& path, std::vector<PObject>& tasks) {
-    const auto text = programs::ReadWholeFile(path == "-" ? "/dev/stdin" : path, kMaxFileBytes);
+    const auto text = base::ReadFile(path == "-" ? "/dev/stdin" : path, kMaxFileBytes);
     const std::string shown = Printable(path);
     if (!text) {
         return Fail(kLocal, "cannot read %s: %s", shown.c_str(), strerror(errno));
@@ -212,7 +213,7 @@ ExitCode ExportTasks(const std::string& path, bool with_passwords) {
         fputs(text.c_str(), stdout);
         return kOk;
     }
-    if (!programs::WriteFileAtomically(path, text, with_passwords ? kSecretMode : kPlainMode)) {
+    if (!base::ReplaceFile(path, text, with_passwords ? kSecretMode : kPlainMode)) {
         return Fail(kLocal, "cannot write %s: %s", Printable(path).c_str(), strerror(errno));
     }
     printf("%s in %s%s\n", programs::Count(tasks.size(), "task").c_str(), Printable(path).c_str(),

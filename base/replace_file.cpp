@@ -1,4 +1,4 @@
-#include "platform/tarqcore/atomic_file.h"
+#include "base/replace_file.h"
 
 #include <errno.h>
 #include <fcntl.h>
@@ -6,18 +6,18 @@
 #include <sys/file.h>
 #include <unistd.h>
 
+#include <algorithm>
+
 #include "base/unique_fd.h"
-#include "platform/internal/error.h"
+#include "base/whole_file.h"
 
-namespace tarqcore {
+namespace base {
 namespace {
-
-using base::UniqueFd;
-using tarq_internal::Fail;
 
 // Names that writers of one file may hold at the same time.
 constexpr int kTemporaryNames = 16;
 constexpr mode_t kNewFileMode = 0644;
+constexpr mode_t kPrivateMode = 0600;
 constexpr mode_t kModeBits = 07777;
 
 /// A new file in a folder, beside the one that it is to replace. Removed when destroyed, unless it
@@ -39,6 +39,12 @@ public:
     }
 
     bool Create(mode_t mode) {
+        struct stat there {};
+        if (fstatat(folder_, target_.c_str(), &there, AT_SYMLINK_NOFOLLOW) == 0 &&
+            !S_ISREG(there.st_mode) && !S_ISLNK(there.st_mode)) {
+            errno = S_ISDIR(there.st_mode) ? EISDIR : ENOTSUP;  // a device is nobody's to replace
+            return false;
+        }
         for (int attempt = 0; attempt < kTemporaryNames; ++attempt) {
             name_ = "." + target_ + ".tmp" + std::to_string(attempt);
             RemoveAbandoned();
@@ -47,8 +53,9 @@ public:
             if (!fd && errno != EEXIST) {
                 return false;
             }
-            // Between the two calls somebody may have taken the file for abandoned.
-            if (fd && Holds(fd.Get())) {
+            // Between the two calls somebody may have taken the file for abandoned. A file system
+            // that has no locks has nobody who does.
+            if (fd && (Lock(fd.Get()) || errno != EWOULDBLOCK) && IsCalledSo(fd.Get())) {
                 fd_ = std::move(fd);
                 return true;
             }
@@ -65,24 +72,12 @@ public:
         const bool same_owner = own.st_uid == of.st_uid && own.st_gid == of.st_gid;
         // The owner first: a change of owner clears the mode's upper bits.
         return (same_owner || fchown(fd_.Get(), of.st_uid, of.st_gid) == 0) &&
-               fchmod(fd_.Get(), of.st_mode & kModeBits) == 0;
+               SetMode(of.st_mode & kModeBits);
     }
 
-    bool Write(std::string_view bytes) {
-        while (!bytes.empty()) {
-            const ssize_t n = write(fd_.Get(), bytes.data(), bytes.size());
-            if (n > 0) {
-                bytes.remove_prefix(static_cast<size_t>(n));
-            } else if (n == 0) {
-                errno = ENOSPC;  // a write that takes nothing and gives no reason would be tried
-                                 // for ever
-                return false;
-            } else if (errno != EINTR) {
-                return false;
-            }
-        }
-        return true;
-    }
+    bool SetMode(mode_t mode) { return fchmod(fd_.Get(), mode) == 0; }
+
+    bool Write(std::string_view bytes) { return WriteAll(fd_.Get(), bytes); }
 
     bool Flush() { return fsync(fd_.Get()) == 0; }
 
@@ -95,11 +90,13 @@ public:
     }
 
 private:
-    /// Takes the lock on `fd`; true when the name still stands for that file.
-    bool Holds(int fd) const {
+    static bool Lock(int fd) { return flock(fd, LOCK_EX | LOCK_NB) == 0; }
+
+    /// Whether the name stands for the file of `fd`.
+    bool IsCalledSo(int fd) const {
         struct stat own {};
         struct stat named {};
-        return flock(fd, LOCK_EX | LOCK_NB) == 0 && fstat(fd, &own) == 0 &&
+        return fstat(fd, &own) == 0 &&
                fstatat(folder_, name_.c_str(), &named, AT_SYMLINK_NOFOLLOW) == 0 &&
                own.st_dev == named.st_dev && own.st_ino == named.st_ino;
     }
@@ -107,7 +104,7 @@ private:
     void RemoveAbandoned() const {
         const UniqueFd left(openat(folder_, name_.c_str(),
                                    O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY));
-        if (left && Holds(left.Get())) {
+        if (left && Lock(left.Get()) && IsCalledSo(left.Get())) {
             unlinkat(folder_, name_.c_str(), 0);
         }
     }
@@ -123,38 +120,38 @@ bool FlushFolder(int folder) {
     return fsync(folder) == 0 || errno == EINVAL || errno == ENOSYS;
 }
 
-}  // namespace
-
-bool ReplaceFile(const std::string& path, const struct stat* old,
-                 const std::vector<std::string_view>& content) {
+/// `prepare` gives the new file its owner and mode.
+template <typename Prepare>
+bool Replace(const std::string& path, const std::vector<std::string_view>& content, mode_t mode,
+             Prepare&& prepare) {
     const size_t slash = path.rfind('/');
     const bool bare = slash == std::string::npos;
-    const std::string folder_path = bare ? "." : path.substr(0, slash + 1);
     const std::string name = bare ? path : path.substr(slash + 1);
-    const auto fail = [] {
-        Fail(TARQ_ERR_WRITE_FILE);
-        return false;
-    };
-
-    const UniqueFd folder(open(folder_path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    const UniqueFd folder(
+        open(bare ? "." : path.substr(0, slash + 1).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (!folder) {
-        return fail();
+        return false;
     }
     TemporaryFile file(folder.Get(), name);
-    // Nobody else may look into the new file before it has the old one's mode.
-    if (!file.Create(old != nullptr ? 0600 : kNewFileMode)) {
-        return fail();
-    }
-    for (const std::string_view piece : content) {
-        if (!file.Write(piece)) {
-            return fail();
-        }
-    }
-    if ((old != nullptr && !file.TakeOwnerAndMode(*old)) || !file.Flush() ||
-        !file.RenameToTarget() || !FlushFolder(folder.Get())) {
-        return fail();
-    }
-    return true;
+    return file.Create(mode) &&
+           std::all_of(content.begin(), content.end(),
+                       [&](std::string_view piece) { return file.Write(piece); }) &&
+           prepare(file) && file.Flush() && file.RenameToTarget() && FlushFolder(folder.Get());
 }
 
-}  // namespace tarqcore
+}  // namespace
+
+bool ReplaceFile(const std::string& path, const std::vector<std::string_view>& content,
+                 const struct stat* old) {
+    // Nobody else may look into the new file before it has the old one's mode.
+    return Replace(
+        path, content, old != nullptr ? kPrivateMode : kNewFileMode,
+        [&](TemporaryFile& file) { return old == nullptr || file.TakeOwnerAndMode(*old); });
+}
+
+bool ReplaceFile(const std::string& path, std::string_view content, mode_t mode) {
+    return Replace(path, {content}, kPrivateMode,
+                   [&](TemporaryFile& file) { return file.SetMode(mode); });
+}
+
+}  // namespace base

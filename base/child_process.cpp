@@ -1,4 +1,4 @@
-#include "platform/internal/child_process.h"
+#include "base/child_process.h"
 
 #include <fcntl.h>
 #include <poll.h>
@@ -17,13 +17,11 @@
 #include <string_view>
 
 #include "base/unique_fd.h"
-#include "platform/internal/write_all.h"
+#include "base/whole_file.h"
 
-namespace tarq_internal {
+namespace base {
 
 namespace {
-
-using base::UniqueFd;
 
 using Clock = std::chrono::steady_clock;
 using std::chrono::microseconds;
@@ -83,16 +81,6 @@ UniqueFd MakeInput(const std::string& input) {
     return std::move(pipe.read_end);
 }
 
-std::vector<char*> CStrings(const std::vector<std::string>& strings) {
-    std::vector<char*> pointers;
-    pointers.reserve(strings.size() + 1);
-    for (const std::string& text : strings) {
-        pointers.push_back(const_cast<char*>(text.c_str()));  // execve() only reads them
-    }
-    pointers.push_back(nullptr);
-    return pointers;
-}
-
 // Blocks every signal on this thread while it lives: a child must not run the host's handlers
 // between fork() and the moment that its dispositions are the default ones.
 class SignalsBlocked {
@@ -121,15 +109,7 @@ struct ChildPlan {
 
 // Between fork() and execve() only what is safe in the child of a process with threads.
 [[noreturn]] void BecomeProgram(const ChildPlan& plan) {
-    struct sigaction default_action = {};
-    default_action.sa_handler = SIG_DFL;
-    for (int number = 1; number < NSIG; ++number) {
-        sigaction(number, &default_action, nullptr);
-    }
-    sigset_t none;
-    sigemptyset(&none);
-    sigprocmask(SIG_SETMASK, &none, nullptr);
-
+    ResetSignals();
     setsid();
     // The second line is for a parent that died before the first one took effect.
     prctl(PR_SET_PDEATHSIG, SIGTERM);
@@ -248,8 +228,8 @@ struct Stream {
 // Starts the child. 0, or errno.
 int Start(const ChildSetup& setup, std::optional<ProcessGroup>* group, Stream* output,
           Stream* error) {
-    const std::vector<char*> arguments = CStrings(setup.arguments);
-    const std::vector<char*> environment = CStrings(setup.environment);
+    const std::vector<char*> arguments = ArgumentVector(setup.arguments);
+    const std::vector<char*> environment = ArgumentVector(setup.environment);
     Pipe out, err, report;
     const UniqueFd input = MakeInput(setup.input);
     if (!input || !MakePipe(&out) || !MakePipe(&err) || !MakePipe(&report)) {
@@ -354,6 +334,27 @@ void Wait(const ProcessGroup& group, const Stream& output, const Stream& error,
 
 }  // namespace
 
+std::vector<char*> ArgumentVector(const std::vector<std::string>& words) {
+    std::vector<char*> pointers;
+    pointers.reserve(words.size() + 1);
+    for (const std::string& word : words) {
+        pointers.push_back(const_cast<char*>(word.c_str()));
+    }
+    pointers.push_back(nullptr);
+    return pointers;
+}
+
+void ResetSignals() {
+    struct sigaction default_action = {};
+    default_action.sa_handler = SIG_DFL;
+    for (int number = 1; number < NSIG; ++number) {
+        sigaction(number, &default_action, nullptr);
+    }
+    sigset_t none;
+    sigemptyset(&none);
+    sigprocmask(SIG_SETMASK, &none, nullptr);
+}
+
 ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cancelled,
                      const OutputHandler& on_output, const OutputHandler& on_error,
                      const EarlyEnd& early_end) {
@@ -433,4 +434,4 @@ std::string FindProgram(const std::string& name, const std::string& search_path)
     return "";
 }
 
-}  // namespace tarq_internal
+}  // namespace base

@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-namespace tarq_internal {
+namespace base {
 
 /// A program to run. The child gets these arguments and this environment and nothing else of the
 /// host: default signal dispositions, no descriptor above 2, a session and process group of its
@@ -59,4 +59,11 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
 /// along `search_path` (folders joined by ":"). Empty when there is none.
 std::string FindProgram(const std::string& name, const std::string& search_path);
 
-}  // namespace tarq_internal
+/// The words as execv() takes them, which changes none: valid as long as they are.
+std::vector<char*> ArgumentVector(const std::vector<std::string>& words);
+
+/// Every signal does what it does by default, and none is blocked. For a child between fork() and
+/// execv().
+void ResetSignals();
+
+}  // namespace base

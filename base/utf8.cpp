@@ -1,9 +1,9 @@
-#include "platform/internal/utf8.h"
+#include "base/utf8.h"
 
 #include <cstddef>
 #include <cstdint>
 
-namespace tarq_internal {
+namespace base {
 
 bool IsUtf8(const std::string& text) {
     // The smallest code point that a sequence of this many bytes may stand for.
@@ -34,4 +34,4 @@ bool IsUtf8(const std::string& text) {
     return true;
 }
 
-}  // namespace tarq_internal
+}  // namespace base
