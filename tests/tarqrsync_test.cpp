@@ -131,7 +131,7 @@ TEST(Explanation, ComesFromTheWordsAndTheKindOfRun) {
               "nas closed the connection"},
              {copy, 77, "", 77, "rsync failed with exit code 77"},
          }) {
-        const Verdict verdict = Judge({settings, Config(), exit_code, messages});
+        const Verdict verdict = Judge({settings, base::RsyncConfig(), exit_code, messages});
         EXPECT_EQ(verdict.status, status) << messages;
         EXPECT_THAT(verdict.first_line, StartsWith(first_line));
     }
@@ -142,10 +142,11 @@ TEST(Explanation, ComesFromTheWordsAndTheKindOfRun) {
                              "Too many levels of symbolic links (40)\n" +
                              "ERROR: z failed verification -- update discarded.\n\n" +
                              "rsync error: some files/attrs were not transferred (see above)\n";
-    EXPECT_EQ(Judge({copy, Config(), 23, busy}).cause, RunCause::BUSY_SOURCE);
-    EXPECT_EQ(Judge({copy, Config(), 23, busy + open + "Permission denied (13)\n"}).cause,
-              RunCause::UNREADABLE_SOURCE);
-    EXPECT_EQ(Judge({copy, Config(), 23, denied}).cause, RunCause::NONE);
+    EXPECT_EQ(Judge({copy, base::RsyncConfig(), 23, busy}).cause, RunCause::BUSY_SOURCE);
+    EXPECT_EQ(
+        Judge({copy, base::RsyncConfig(), 23, busy + open + "Permission denied (13)\n"}).cause,
+        RunCause::UNREADABLE_SOURCE);
+    EXPECT_EQ(Judge({copy, base::RsyncConfig(), 23, denied}).cause, RunCause::NONE);
 }
 
 /// What only odd names and addresses show: plain ones are seen to work against real servers.
