@@ -182,7 +182,7 @@ protected:
         copies = &copies_;
         SetZone("UTC");
         config_.workers = 2;
-        config_.gather = milliseconds(100);
+        config_.debounce = milliseconds(100);
         for (const std::string share : {"a", "b", "c", "d"}) {
             root_.Write("shares/" + share + "/file", "x");
             Must(Zelctl(root_.Path(), "share add " + share + " " + root_.Path("shares/" + share)));

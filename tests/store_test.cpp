@@ -134,7 +134,10 @@ TEST_F(StoreTest, AChangeWaitsOnceAndOnceMoreWhileItIsBeingSent) {
     EXPECT_EQ(store_->CountEvents(task), 3U);
 
     store_->MarkSending({ids[0]});
-    store_->ClearEvents(task);
+    TaskRecord reset = Task("reset");
+    reset.task.SetID(task);
+    store_->ResetTask(reset);
+    EXPECT_EQ(store_->Tasks()[0].Name(), "reset");
     EXPECT_EQ(store_->CountEvents(task), 0U);
     EXPECT_THAT(Pending(other), ElementsAre("s /z"));
     EXPECT_THAT(Fault([&] { store_->AddEvents(99, "s", {"/"}); }), HasSubstr("no such task"));
@@ -306,7 +309,7 @@ TEST_F(StoreTest, DamageFurtherInIsToldWhenItIsMet) {
         const std::string fault = Fault([&] {
             Store store(path_);
             store.PendingEvents(task);
-            store.ClearEvents(task);
+            store.RemoveTask(task);
         });
         faults += fault != "none";
         EXPECT_THAT(fault, testing::AnyOf("none", HasSubstr("the file is damaged")));

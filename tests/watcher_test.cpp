@@ -86,7 +86,7 @@ protected:
         }
         EXPECT_EQ(ToldAfterWork(), probes) << what;
         EXPECT_EQ(watcher_.Stats("s").folders, probes.size()) << what;
-        EXPECT_FALSE(watcher_.Stats("s").searching) << what;
+        EXPECT_FALSE(watcher_.Stats("s").scanning) << what;
         EXPECT_EQ(KernelWatches(), probes.size()) << what;
     }
     size_t KernelWatches() const {
@@ -234,12 +234,12 @@ TEST_F(WatcherTest, WhatCannotBeWatchedIsSaidOnceInASearch) {
         };
         Start();
         EXPECT_EQ(TakeLosses(), Unwatched(error));
-        EXPECT_FALSE(watcher_.Stats("s").complete || watcher_.Stats("s").searching);
+        EXPECT_FALSE(watcher_.Stats("s").complete || watcher_.Stats("s").scanning);
         Write("/f");
         fs::create_directories(Path("/new/below"));
         EXPECT_THAT(ToldAfterWork(), ElementsAre("/f", "/new"));
         EXPECT_EQ(TakeLosses(), Unwatched(error));
-        watcher_.SearchAgain("s");
+        watcher_.Rescan("s");
         Work();
         EXPECT_EQ(TakeLosses(), Unwatched(error));
         // A folder that shows a sign of life is tried again; then nothing is missing.
@@ -268,7 +268,7 @@ TEST_F(WatcherTest, WithoutDescriptorsNothingIsMissedUnsaid) {
     ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);
     EXPECT_EQ(TakeLosses(), Unwatched(EMFILE));
     EXPECT_FALSE(watcher_.Stats("s").complete);
-    watcher_.SearchAgain("s");
+    watcher_.Rescan("s");
     EXPECT_THAT(ToldAfterWork(), IsSupersetOf({"/a/new", "/a/new/below"}));
     ExpectAllWatched();
     EXPECT_TRUE(watcher_.Stats("s").complete);

@@ -48,9 +48,10 @@ programs::TaskRun& Connection::For(const programs::RunOrder& order) {
     return *run_;
 }
 
-ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, RunPlan plan,
+ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection,
+                     programs::RunOrder order,
                      const OnProgress& on_progress, const OnEnd& on_end)
-    : connection_(std::move(connection)), plan_(std::move(plan)) {
+    : connection_(std::move(connection)), order_(std::move(order)) {
     try {
         thread_ =
             std::thread([this, &loop, on_progress, on_end] { Work(loop, on_progress, on_end); });
@@ -84,7 +85,7 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
         const int lack = LackOfDescriptors(kDescriptors);
         // What lies in /tmp may have been cleaned away since the start.
         const std::string unprepared = lack != 0 ? ReasonOf(lack) : programs::PrepareHost();
-        result = unprepared.empty() ? connection_->For(plan_.order).Push(plan_.order, totals)
+        result = unprepared.empty() ? connection_->For(order_).Push(order_, totals)
                                     : NothingDone(unprepared);
     } catch (const std::exception& error) {
         result = NothingDone(error.what());
@@ -94,7 +95,7 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
 }
 
 RunResult ActiveRun::NothingDone(const std::string& why) const {
-    return programs::NothingDone(plan_.order, {programs::Trouble::kLocal, 0, why});
+    return programs::NothingDone(order_, {programs::Trouble::kLocal, 0, why});
 }
 
 void ActiveRun::End(EventLoop& loop, const OnEnd& on_end, const RunResult& result,

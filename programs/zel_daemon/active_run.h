@@ -8,11 +8,9 @@
 #include <memory>
 #include <string>
 #include <thread>
-#include <vector>
 
 #include "programs/common/task_run.h"
 #include "programs/zel_daemon/event_loop.h"
-#include "programs/zel_daemon/task_record.h"
 
 namespace zel_daemon {
 
@@ -36,13 +34,6 @@ private:
     std::map<std::string, std::string> folders_;  // of the shares, when they were first looked up
 };
 
-/// What a run is to do, and what becomes of it.
-struct RunPlan {
-    programs::RunOrder order;
-    RunRecord record;
-    std::vector<ZEL::Event> events;  ///< the stored changes that it sends
-};
-
 /// A run under way.
 ///
 /// Threads: the loop's.
@@ -54,7 +45,7 @@ public:
 
     /// Starts it; without a thread to be had it ends as failed. Both functions are called on the
     /// loop's thread, after this; nothing is, once this object is gone.
-    ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, RunPlan plan,
+    ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, programs::RunOrder order,
               const OnProgress& on_progress, const OnEnd& on_end);
     /// Cancels and waits for the end.
     ~ActiveRun();
@@ -62,7 +53,6 @@ public:
     ActiveRun& operator=(const ActiveRun&) = delete;
 
     void Cancel() { connection_->cancel = true; }
-    const RunPlan& Plan() const { return plan_; }
 
     std::string progress_share;  ///< empty until there is progress
     TARQ::Backup::RunProgress progress;
@@ -74,7 +64,7 @@ private:
              const programs::RunTotals& totals);
 
     std::shared_ptr<Connection> connection_;
-    RunPlan plan_;
+    const programs::RunOrder order_;
     std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);  // the loop's thread alone
     bool ended_ = false;                                          // the loop's thread alone
     std::thread thread_;

@@ -24,8 +24,8 @@ DaemonConfig ReadDaemonConfig() {
     };
     DaemonConfig config;
     config.workers = static_cast<unsigned int>(file.Number("workers", config.workers, 1, 32));
-    time("gather_ms", config.gather, 10, 600000);
-    time("gather_max_ms", config.gather_max, 10, 600000);
+    time("gather_ms", config.debounce, 10, 600000);
+    time("gather_max_ms", config.debounce_max, 10, 600000);
     time("retry_first_ms", config.retry_first, 100, 86400000);
     time("retry_max_ms", config.retry_max, 100, 86400000);
     time("poll_seconds", config.poll, 1, 86400);

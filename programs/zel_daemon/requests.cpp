@@ -301,7 +301,7 @@ PObject Requests::DaemonStatus(const Peer&, const PObject&) {
     reply["running"] = Number(stats.running);
     reply["workers"] = stats.workers;
     reply["folders"] = Number(stats.watched.folders);
-    reply["searching"] = stats.watched.searching;
+    reply["searching"] = stats.watched.scanning;
     reply["store"] = store_path_;
     return reply;
 }
@@ -367,7 +367,7 @@ void Requests::AddState(const TaskRecord& record, PObject& map) const {
     map["pending"] = Number(state.pending);
     if (state.watch) {
         map["watched_folders"] = Number(state.watch->folders);
-        map["watch_searching"] = state.watch->searching;
+        map["watch_searching"] = state.watch->scanning;
         map["watch_complete"] = state.watch->complete;
         if (!state.watch->problem.empty()) {
             map["watch_problem"] = state.watch->problem;
@@ -392,7 +392,7 @@ void Requests::AddState(const TaskRecord& record, PObject& map) const {
     if (state.active == nullptr) {
         return;
     }
-    map["run"] = Number(state.active->Plan().record.id);
+    map["run"] = Number(state.run);
     if (!state.active->progress_share.empty()) {
         programs::AddProgress(state.active->progress_share, state.active->progress, map);
     }

@@ -1,23 +1,19 @@
-// What the daemon does: keeps the tasks, knows when each is due, starts its runs and takes down how
-// they ended.
+// What the daemon does: keeps the tasks, and does for each what its machine says, above all runs.
 #pragma once
 
-#include <list>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
 #include <set>
 #include <string>
+#include <vector>
 
 #include "programs/zel_daemon/active_run.h"
-#include "programs/zel_daemon/change_set.h"
 #include "programs/zel_daemon/daemon_config.h"
 #include "programs/zel_daemon/event_loop.h"
-#include "programs/zel_daemon/recovery_watch.h"
-#include "programs/zel_daemon/share_debts.h"
 #include "programs/zel_daemon/store.h"
-#include "programs/zel_daemon/task_plan.h"
-#include "programs/zel_daemon/task_record.h"
+#include "programs/zel_daemon/task_machine.h"
 #include "programs/zel_daemon/watcher.h"
 
 namespace zel_daemon {
@@ -25,7 +21,7 @@ namespace zel_daemon {
 /// How far the folders of a realtime task's shares are watched.
 struct TaskWatch {
     size_t folders = 0;
-    bool searching = false;  ///< folders are still being found
+    bool scanning = false;  ///< folders are still being found
     bool complete = true;    ///< no folder that was found is left out
     std::string problem;     ///< why it is not complete
 };
@@ -38,6 +34,7 @@ struct TaskState {
     uint64_t pending = 0;             ///< changes that wait
     std::string note;                 ///< what a person should know
     std::optional<TaskWatch> watch;   ///< of a realtime task that is not paused
+    uint64_t run = 0;                 ///< the run under way; 0: none is
     const ActiveRun* active = nullptr;
     const RunRecord* last = nullptr;  ///< the last run that ended
 };
@@ -49,10 +46,9 @@ struct ServiceStats {
     WatchStats watched;
 };
 
-/// A realtime task lives so: its shares' folders are searched and watched; once that is done all is
-/// compared whole, for what has changed unwatched; from then on changes are gathered for a short
-/// while, folded, stored, sent, and forgotten only when the server has taken them. Whatever makes
-/// the watch incomplete leads back to a whole comparison.
+/// When a task does what, its TaskMachine knows. The service tells it what happens on disk, on this
+/// host and among people, does what it wants done, and picks the tasks that run: no more at a time
+/// than there are workers, no share in two runs at a time, who is due longest goes first.
 ///
 /// Threads: the loop's. Operations that a person asks for throw RequestError (task_map.h) or
 /// StoreError, and have changed nothing then.
@@ -94,50 +90,53 @@ public:
     ServiceStats Stats() const;
 
 private:
-    struct Task;
-    struct Due {
-        RunReason reason;
-        bool all;  // whatever is owed
+    struct Task {
+        TaskMachine machine;
+        std::shared_ptr<Connection> connection = {};
+        std::unique_ptr<ActiveRun> active = {};
+        uint64_t pending = 0;  // stored changes, those being sent included
+    };
+    /// A share that tasks want watched.
+    struct WatchedShare {
+        std::string folder;        // that is watched; empty: none is
+        std::string problem;       // why it is not watched in full, for people
+        std::vector<Task*> tasks;  // that want it
+    };
+    /// What the runs under way leave for others.
+    struct Room {
+        unsigned int running = 0;
+        std::set<std::string> in_use;  // shares
     };
 
     Task& Get(const std::string& name) const;
     void CheckNameFree(const std::string& name, uint64_t id) const;
     Task& Insert(TaskRecord record);
-    void Reset(Task& task);
 
-    // Changes on disk.
+    // The watch.
     void OnChange(const std::string& share, const std::string& path);
     void OnLoss(const std::string& share, const WatchLoss& loss);
-    void Note(const std::string& share, const std::string& note);
+    void LoseForLong(const std::string& share, const std::string& problem);
     void ListenToWatcher();
     void WatchShares();
     void WatchAgain(const Task& task);
+    void ForgetSettledProblems(const Task& task);
     void PostWatcher();
     void RunWatcher();
-    bool PollDue(const Task& task) const;
-    void SearchAgain(Task& task);
+    bool IsCovered(const std::string& share) const;
     std::optional<TaskWatch> WatchOf(const Task& task) const;
-    void ForgetSettledNotes(Task& task);
-    void StoreGathered(Task& task);
-    bool GatherDue(const Task& task, int64_t now) const;
 
-    // Runs.
+    // Steps and runs.
     void Advance();
-    std::optional<Due> WhatIsDue(Task& task);
-    bool MayStart(const Task& task, const Due& due) const;
-    void StartRun(Task& task, const Due& due);
-    bool FillOrder(Task& task, RunPlan& plan);
-    void EndRun(Task& task, const programs::RunResult& result, const programs::RunTotals& totals);
-    void Settle(Task& task, const RunPlan& plan, const programs::RunResult& result);
-    void PutBack(Task& task);
-    void HastenRetries();
+    Step DoChores(Task& task);
     void StoreEnd(Task& task);
+    void StoreChanges(Task& task);
     void StoreFailed(Task& task, const StoreError& error);
-    RetryDelays Delays() const;
-    void SetAlarm();
-    std::optional<int64_t> UntilNextStep(const Task& task) const;
-    std::optional<int64_t> UntilRetry(const Task& task) const;
-    static std::string WaitsFor(const Task& task);
+    void Rescan(Task& task);
+    void TakeRoom(const Task& task, Room& room) const;
+    bool MayStart(const Task& task, const Step& step, const Room& room) const;
+    void StartRun(Task& task, const Step& step);
+    void EndRun(Task& task, const programs::RunResult& result, const programs::RunTotals& totals);
+    void HastenRetries();
 
     EventLoop& loop_;
     const Clock& clock_;
@@ -145,12 +144,12 @@ private:
     DaemonConfig config_;
     std::function<void()> on_change_;
     Watcher watcher_;
-    std::map<std::string, std::string> watched_;  // shares and their folders
-    bool watcher_heard_ = false;                  // the loop calls when it can be read
-    bool watcher_posted_ = false;                 // folders are left to search
+    std::map<std::string, WatchedShare> shares_;
+    bool watcher_heard_ = false;   // the loop calls when it can be read
+    bool watcher_posted_ = false;  // folders are left to scan
     std::set<Recovery> recovered_;
     int64_t look_at_ = 0;  // when to look what has recovered; while there is something in it
-    std::map<uint64_t, std::unique_ptr<Task>> tasks_;
+    std::map<uint64_t, Task> tasks_;
     std::map<std::string, Task*> by_name_;
 };
 

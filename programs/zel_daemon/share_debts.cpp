@@ -26,7 +26,7 @@ std::optional<int64_t> ShareDebts::Share::Next() const {
     if (!Owes()) {
         return std::nullopt;
     }
-    const bool unfailed = whole == Whole::kDue || fresh;
+    const bool unfailed = (state == ShareState::kUnknown && !resync_failed) || fresh;
     return retry.Waiting() && (shut || !unfailed) ? retry.At() : kAtOnce;
 }
 
@@ -53,16 +53,17 @@ ShareDebts::Share* ShareDebts::Changed(const std::string& share) {
     return &found->second;
 }
 
-void ShareDebts::OweWhole(const std::string& share) {
+void ShareDebts::OweResync(const std::string& share) {
     Share* const owed = Changed(share);
-    if (owed != nullptr && owed->whole == Whole::kNo) {
-        owed->whole = Whole::kDue;
+    if (owed != nullptr && owed->state == ShareState::kTracked) {
+        owed->state = ShareState::kUnknown;
+        owed->resync_failed = false;
     }
 }
 
-void ShareDebts::OweAllWhole() {
+void ShareDebts::OweResyncs() {
     for (const auto& [name, share] : shares_) {
-        OweWhole(name);
+        OweResync(name);
     }
 }
 
@@ -141,14 +142,14 @@ std::vector<ShareDebts::Due> ShareDebts::Take(int64_t now) {
         const bool ripe = !share.retry.Waiting() || share.retry.Due(now);
         Due due;
         due.share = name;
-        due.whole = share.whole == Whole::kDue || (share.whole == Whole::kFailed && ripe);
+        due.resync = share.state == ShareState::kUnknown && (!share.resync_failed || ripe);
         due.stored = share.fresh || share.failed_upto != 0;
-        due.after = due.whole || ripe ? 0 : share.failed_upto;
-        due.again = share.retry.Failures() > 0 && (ripe || due.whole);
-        due.rest_waits = !due.whole && !ripe;
+        due.after = due.resync || ripe ? 0 : share.failed_upto;
+        due.again = share.retry.Failures() > 0 && (ripe || due.resync);
+        due.rest_waits = !due.resync && !ripe;
         share.fresh = false;
-        if (due.whole) {
-            share.whole = Whole::kNo;
+        if (due.resync) {
+            share.state = ShareState::kTracked;
         }
         if (due.again) {
             share.failed_upto = 0;
@@ -173,12 +174,13 @@ void ShareDebts::Settle(int64_t now, const std::map<std::string, Outcome>& outco
         }
         if (!outcome.tried) {
             share->fresh = share->fresh || due.stored;
-            if (due.whole && share->whole == Whole::kNo) {
-                share->whole = Whole::kDue;
+            if (due.resync) {
+                OweResync(name);
             }
         } else if (outcome.failed) {
-            if (due.whole || outcome.broke_off) {
-                share->whole = Whole::kFailed;
+            if (due.resync || outcome.broke_off) {
+                share->state = ShareState::kUnknown;
+                share->resync_failed = true;
             }
             share->failed_upto = std::max(share->failed_upto, outcome.last_change);
             share->shut = outcome.reach != Reach::kPaths;

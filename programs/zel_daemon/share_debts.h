@@ -14,8 +14,13 @@
 
 namespace zel_daemon {
 
-/// A share is owed as a whole, or only in stored changes, or not at all. What is owed may be tried
-/// at once, until a try fails. Then
+/// What is known of what changed in a share since its last full resync.
+enum class ShareState {
+    kTracked,  ///< all of it, as stored changes: they are all that is owed
+    kUnknown   ///< not all: the next run is a full resync of the share
+};
+
+/// What is owed may be tried at once, until a try fails. Then
 ///
 /// - what failed waits for its next try, and a change that is stored later does not wait with it;
 /// - unless the failure was one of the whole share (its volume is away, the server refuses it):
@@ -34,7 +39,7 @@ public:
     /// What may be tried of one share.
     struct Due {
         std::string share;
-        bool whole = false;
+        bool resync = false;      ///< in full
         bool stored = false;      ///< there are changes in the store, or may be
         uint64_t after = 0;       ///< those up to here are left out
         bool again = false;       ///< some of it has failed before
@@ -44,7 +49,7 @@ public:
     struct Outcome {
         bool tried = true;  ///< false: it is owed as it was
         bool failed = false;
-        bool broke_off = false;  ///< the server may have kept something of it: all is owed
+        bool broke_off = false;  ///< the server may have kept something of it: a resync is owed
         programs::Reach reach = programs::Reach::kPaths;
         programs::Trouble trouble = programs::Trouble::kNone;
         uint64_t last_change = 0;  ///< the highest number of its changes that failed
@@ -59,9 +64,12 @@ public:
     /// Forgets what is owed, and begins with these.
     void SetShares(const std::list<std::string>& shares);
     bool Has(const std::string& share) const { return shares_.count(share) != 0; }
+    /// REQUIRES Has(). While a run sends the share it counts as sent.
+    ShareState StateOf(const std::string& share) const { return shares_.at(share).state; }
 
-    void OweWhole(const std::string& share);
-    void OweAllWhole();
+    /// The share's state, or that of all shares, is kUnknown from now on.
+    void OweResync(const std::string& share);
+    void OweResyncs();
     /// Changes of the share have been stored.
     void OweChanges(const std::string& share);
     /// Nothing is owed any more.
@@ -87,16 +95,16 @@ public:
                 const RetryDelays& delays, double chance);
 
 private:
-    enum class Whole { kNo, kDue, kFailed };
     struct Share {
-        Whole whole = Whole::kNo;
+        ShareState state = ShareState::kTracked;
+        bool resync_failed = false;  // it waits for its next try with what else failed
         bool fresh = false;        // changes are stored that have not failed
         uint64_t failed_upto = 0;  // those up to this number have; 0: none
         bool shut = false;         // and keep all else from being tried
         Backoff retry;
         programs::Trouble trouble = programs::Trouble::kNone;
 
-        bool Owes() const { return whole != Whole::kNo || fresh || failed_upto != 0; }
+        bool Owes() const { return state == ShareState::kUnknown || fresh || failed_upto != 0; }
         bool MayTry(int64_t now) const;
         std::optional<int64_t> Next() const;
     };

@@ -145,6 +145,17 @@ struct Store::Impl {
         });
     }
 
+    void Update(const TaskRecord& record) {
+        Query query(*database, "UPDATE tasks SET (" + TaskColumns() + ") = (" + TaskParameters() +
+                                   ") WHERE id = ?");
+        BindTask(query, record);
+        query.Bind(record.ID());
+        query.Run();
+        if (database->Changes() == 0) {
+            throw SqliteError(SQLITE_CONSTRAINT_FOREIGNKEY, "id " + std::to_string(record.ID()));
+        }
+    }
+
     void ForEach(const std::string& what, const std::vector<uint64_t>& ids, const char* statement) {
         Change(what, [&] {
             for (const uint64_t id : ids) {
@@ -213,15 +224,13 @@ uint64_t Store::AddTask(const TaskRecord& record) {
 }
 
 void Store::UpdateTask(const TaskRecord& record) {
+    impl_->Change("store task '" + record.Name() + "'", [&] { impl_->Update(record); });
+}
+
+void Store::ResetTask(const TaskRecord& record) {
     impl_->Change("store task '" + record.Name() + "'", [&] {
-        Query query(*impl_->database, "UPDATE tasks SET (" + TaskColumns() + ") = (" +
-                                          TaskParameters() + ") WHERE id = ?");
-        BindTask(query, record);
-        query.Bind(record.ID());
-        query.Run();
-        if (impl_->database->Changes() == 0) {
-            throw SqliteError(SQLITE_CONSTRAINT_FOREIGNKEY, "id " + std::to_string(record.ID()));
-        }
+        impl_->Update(record);
+        Query(*impl_->database, "DELETE FROM events WHERE task = ?", record.ID()).Run();
     });
 }
 
@@ -284,12 +293,6 @@ uint64_t Store::CountEvents(uint64_t task_id) {
         Query query(*impl_->database, "SELECT count(*) FROM events WHERE task = ?", task_id);
         query.Next();
         return static_cast<uint64_t>(query.Number());
-    });
-}
-
-void Store::ClearEvents(uint64_t task_id) {
-    impl_->Change("forget changes", [&] {
-        Query(*impl_->database, "DELETE FROM events WHERE task = ?", task_id).Run();
     });
 }
 

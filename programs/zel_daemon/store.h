@@ -53,6 +53,8 @@ public:
     uint64_t AddTask(const TaskRecord& record);
     /// Replaces the task with the record's id. Throws when there is none, or the name is taken.
     void UpdateTask(const TaskRecord& record);
+    /// The same, and forgets all changes of the task, whatever their state.
+    void ResetTask(const TaskRecord& record);
     /// Removes a task with its events and its history.
     void RemoveTask(uint64_t id);
 
@@ -72,8 +74,6 @@ public:
     void ReturnEvents(const std::vector<uint64_t>& ids);
     /// The changes of a task that the server has not taken yet: that wait or are being sent.
     uint64_t CountEvents(uint64_t task_id);
-    /// Forgets all changes of a task, whatever their state.
-    void ClearEvents(uint64_t task_id);
 
     /// Notes the beginning of a run and returns its id.
     uint64_t BeginRun(uint64_t task_id, RunReason reason, int64_t start);

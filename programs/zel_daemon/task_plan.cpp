@@ -83,11 +83,4 @@ void TaskPlan::Failed(const RetryDelays& delays) {
     retry_.Failed(clock_.Elapsed(), delays, random_());
 }
 
-std::optional<int64_t> TaskPlan::UntilRetry() const {
-    if (!retry_.Waiting()) {
-        return std::nullopt;
-    }
-    return std::max<int64_t>(*retry_.At() - clock_.Elapsed(), 0);
-}
-
 }  // namespace zel_daemon

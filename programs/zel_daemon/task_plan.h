@@ -55,19 +55,15 @@ public:
     int64_t CheckedUntil() const { return checked_until_; }
 
     /// A run failed as a whole: sets the moment of the next try.
-    void Failed(const RetryDelays& delays = {});
+    void Failed(const RetryDelays& delays);
     /// What it failed for may be over, see Backoff.
     void Hasten(int64_t gap) { retry_.Hasten(clock_.Elapsed(), gap); }
     /// The server was reached, or a person has cancelled: no try is waiting any more.
     void Settled() { retry_.Settled(); }
-    /// Whether a failed run waits to be tried again, and whether its moment has come.
-    bool RetryWaiting() const { return retry_.Waiting(); }
-    bool RetryDue() const { return retry_.Due(clock_.Elapsed()); }
-    unsigned int Failures() const { return retry_.Failures(); }
+    /// When a failed run is tried again, on the clock that never jumps; nothing when none waits.
+    std::optional<int64_t> RetryAt() const { return retry_.At(); }
     /// A number from 0 to below 1.
     double Chance() { return random_(); }
-    /// Milliseconds until the next try; 0 when it is due; nothing when none waits.
-    std::optional<int64_t> UntilRetry() const;
 
 private:
     bool WasSetBack(int64_t now) const;

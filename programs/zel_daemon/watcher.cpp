@@ -1,4 +1,4 @@
-// The table of folders follows the events in their order, while searches see the folders as they
+// The table of folders follows the events in their order, while scans see the folders as they
 // are now, ahead of the events that still wait. So a name may lead to another folder than the one
 // in the table. What keeps the table right all the same:
 //
@@ -7,8 +7,8 @@
 //   dropped and found anew.
 // - A folder is watched before it is read: what appears in between is told by an event.
 // - A path that leads nowhere now is dropped: what took it away is told by an event that waits. If
-//   that is the move of a folder above, all below that one is searched again once it is in place.
-// - A folder that gets its watch later than its share's first search is told then: whatever was
+//   that is the move of a folder above, all below that one is scanned again once it is in place.
+// - A folder that gets its watch later than its share's first scan is told then: whatever was
 //   sent before may lack what changed in it unwatched.
 #include "programs/zel_daemon/watcher.h"
 
@@ -38,7 +38,7 @@ namespace {
 
 using base::UniqueFd;
 
-/// Work goes in turns of some events and some steps of search: enough events that the kernel's
+/// Work goes in turns of some events and some steps of scan: enough events that the kernel's
 /// queue does not overflow meanwhile (16,384 unless set otherwise), and enough steps that a flood
 /// of events does not keep new folders from being watched.
 constexpr int kEventsPerTurn = 256;
@@ -52,8 +52,8 @@ constexpr size_t kListBufferSize = size_t{32} * 1024;
 
 // What is known of a folder beside its place.
 constexpr uint8_t kQueued = 1;    // waits in jobs_
-constexpr uint8_t kDeep = 2;      // its next search goes through all below, known or not
-constexpr uint8_t kTold = 4;      // told by an event, or below such a one
+constexpr uint8_t kDeep = 2;      // its next scan goes through all below, known or not
+constexpr uint8_t kNotified = 4;      // told by an event, or below such a one
 constexpr uint8_t kUnseen = 8;    // its parent is being read and has not shown it yet
 constexpr uint8_t kMissing = 16;  // cannot be watched, or not all below it
 
@@ -84,12 +84,12 @@ struct Watcher::Impl {
         std::string name;
         std::string folder;
         FolderId root = kNoFolder;  // kNoFolder: the share's folder is gone
-        UniqueFd fd;                // of the root, while searching: it keeps the volume mounted
+        UniqueFd fd;                // of the root, while scanning: it keeps the volume mounted
         size_t watched = 0;
         size_t missing = 0;
-        size_t jobs = 0;  // searches that wait or are under way
-        bool first_search = true;
-        std::set<int> told;  // errors of this search
+        size_t jobs = 0;  // scans that wait or are under way
+        bool first_scan = true;
+        std::set<int> told;  // errors of this scan
     };
 
     /// A folder whose entries are being read.
@@ -123,8 +123,8 @@ struct Watcher::Impl {
     // was found before is not used after one.
 
     /// Tells `path`.
-    void Tell(const Share& share) { on_change(std::string(share.name), path.empty() ? "/" : path); }
-    void Lose(const Share& share, const WatchLoss& loss) { on_loss(std::string(share.name), loss); }
+    void Notify(const Share& share) { on_change(std::string(share.name), path.empty() ? "/" : path); }
+    void NotifyLoss(const Share& share, const WatchLoss& loss) { on_loss(std::string(share.name), loss); }
 
     // Folders
 
@@ -187,13 +187,13 @@ struct Watcher::Impl {
         table.Remove(id);
     }
 
-    void LoseRoot(Share& share) {
+    void RootGone(Share& share) {
         Drop(std::exchange(share.root, kNoFolder));
         share.fd = UniqueFd();
-        Lose(share, {WatchLoss::kFolderGone});
+        NotifyLoss(share, {WatchLoss::kFolderGone});
     }
 
-    // Searching
+    // Scanning
 
     void Enqueue(FolderId id, bool deep) {
         uint8_t& marks = table[id].marks;
@@ -213,7 +213,7 @@ struct Watcher::Impl {
         Share* share = FindShare(number);
         if (share != nullptr && --share->jobs == 0) {
             share->fd = UniqueFd();
-            share->first_search = false;
+            share->first_scan = false;
         }
     }
 
@@ -223,11 +223,11 @@ struct Watcher::Impl {
         EndJob(share);
     }
 
-    /// The folder that Locate() was asked for last is not watched. Told once in a search for each
+    /// The folder that Locate() was asked for last is not watched. Told once in a scan for each
     /// reason.
-    void TellUnwatched(Share& share, int error) {
+    void NotifyUnwatched(Share& share, int error) {
         if (share.told.insert(error).second) {
-            Lose(share, {WatchLoss::kUnwatched, error, path.empty() ? "/" : path});
+            NotifyLoss(share, {WatchLoss::kUnwatched, error, path.empty() ? "/" : path});
         }
     }
 
@@ -239,7 +239,7 @@ struct Watcher::Impl {
         }
         DropChildren(id);
         SetMissing(id, true);
-        TellUnwatched(share, error);
+        NotifyUnwatched(share, error);
     }
 
     /// The folder could not be opened or watched, as errno says.
@@ -247,13 +247,13 @@ struct Watcher::Impl {
         if (!IsGone(errno)) {
             Miss(share, id, errno);
         } else if (id == share.root) {
-            LoseRoot(share);
+            RootGone(share);
         } else {
             Drop(id);
         }
     }
 
-    /// Opens the share's folder for a search. It is not held open in between: that would keep its
+    /// Opens the share's folder for a scan. It is not held open in between: that would keep its
     /// volume from being unmounted.
     bool OpenRoot(Share& share) {
         if (share.fd) {
@@ -303,7 +303,7 @@ struct Watcher::Impl {
         return fd;
     }
 
-    void Search(FolderId id) {
+    void Scan(FolderId id) {
         const uint32_t number = table[id].owner;
         const bool deep = (table[id].marks & kDeep) != 0;
         table[id].marks = static_cast<uint8_t>(table[id].marks & ~(kQueued | kDeep));
@@ -317,7 +317,7 @@ struct Watcher::Impl {
         if (const int error = inotify.Open()) {
             Miss(*share, id, error);
         } else if (!OpenRoot(*share)) {
-            IsGone(errno) ? LoseRoot(*share) : Miss(*share, id, errno);
+            IsGone(errno) ? RootGone(*share) : Miss(*share, id, errno);
         } else if (!(fd = WatchFolder(*share, id, &is_new))) {
             Failed(*share, id);
         }
@@ -334,8 +334,8 @@ struct Watcher::Impl {
         } else {
             EndJob(number);
         }
-        if (is_new && ((table[id].marks & kTold) != 0 || !share->first_search)) {
-            Tell(*share);
+        if (is_new && ((table[id].marks & kNotified) != 0 || !share->first_scan)) {
+            Notify(*share);
         }
     }
 
@@ -352,14 +352,14 @@ struct Watcher::Impl {
             const int error = errno;
             SetMissing(id, true);
             EndListing();
-            TellUnwatched(*share, error);
+            NotifyUnwatched(*share, error);
             return;
         }
         if (got <= 0) {
             EndDeepListing();
             return;
         }
-        const uint8_t told = share->first_search ? table[id].marks & kTold : kTold;
+        const uint8_t told = share->first_scan ? table[id].marks & kNotified : kNotified;
         for (ssize_t at = 0; at < got;) {
             const auto* entry = reinterpret_cast<const dirent64*>(list_buffer.get() + at);
             at += entry->d_reclen;
@@ -428,7 +428,7 @@ struct Watcher::Impl {
             if (share != nullptr && share->root != kNoFolder) {
                 Enqueue(share->root, true);
                 share->told.clear();
-                Lose(*share, {WatchLoss::kOverflow});
+                NotifyLoss(*share, {WatchLoss::kOverflow});
             }
         }
     }
@@ -439,9 +439,9 @@ struct Watcher::Impl {
         Share* share = Locate(id);
         Unwatch(id);
         if (share != nullptr && id == share->root) {
-            LoseRoot(*share);
+            RootGone(*share);
         } else if (share != nullptr) {
-            table[id].marks |= kTold;
+            table[id].marks |= kNotified;
             Enqueue(id, false);
         }
     }
@@ -455,10 +455,10 @@ struct Watcher::Impl {
             if (id == share->root && (table[id].marks & kMissing) != 0) {
                 Enqueue(id, true);
             }
-            Tell(*share);
+            Notify(*share);
         } else if (id == share->root &&
                    (mask & (IN_DELETE_SELF | IN_MOVE_SELF | IN_UNMOUNT)) != 0) {
-            LoseRoot(*share);
+            RootGone(*share);
         }  // else the folder's parent tells
     }
 
@@ -472,7 +472,7 @@ struct Watcher::Impl {
         }
         path += '/';
         path += event.name;
-        Tell(*share);
+        Notify(*share);
     }
 
     void FolderEntry(FolderId parent, const Inotify::Event& event) {
@@ -484,7 +484,7 @@ struct Watcher::Impl {
                 }
                 table.Attach(*moved, parent, event.name);
                 table[*moved].marks =
-                    static_cast<uint8_t>((table[*moved].marks & ~kUnseen) | kTold);
+                    static_cast<uint8_t>((table[*moved].marks & ~kUnseen) | kNotified);
                 Enqueue(*moved, true);
                 return;
             }
@@ -493,7 +493,7 @@ struct Watcher::Impl {
             if (id == kNoFolder) {
                 id = AddChild(parent, event.name);
             }
-            table[id].marks |= kTold;
+            table[id].marks |= kNotified;
             // A change of its mode may have made it readable.
             if ((event.mask & IN_ATTRIB) == 0 || table[id].watch < 0) {
                 Enqueue(id, false);
@@ -545,7 +545,7 @@ struct Watcher::Impl {
             const FolderId id = jobs.back();
             jobs.pop_back();
             if (table[id].marks & kQueued) {  // else it was removed since
-                Search(id);
+                Scan(id);
             }
         }
     }
@@ -570,7 +570,7 @@ struct Watcher::Impl {
     std::map<std::string, uint32_t> numbers;  // of shares, by name; never used again
     std::map<uint32_t, Share> shares;
     uint32_t last_number = 0;
-    std::vector<FolderId> jobs;  // to be searched, the last first
+    std::vector<FolderId> jobs;  // to be scanned, the last first
     std::vector<FolderId>
         dropped;  // without parent; to be forgotten with all below, the last first
     std::optional<Listing> listing;
@@ -616,7 +616,7 @@ void Watcher::Remove(const std::string& share) {
     impl_->numbers.erase(number);
 }
 
-void Watcher::SearchAgain(const std::string& share) {
+void Watcher::Rescan(const std::string& share) {
     const auto number = impl_->numbers.find(share);
     if (number == impl_->numbers.end()) {
         return;
@@ -654,7 +654,7 @@ WatchStats Watcher::Stats(const std::string& share) const {
     stats.complete = found.root != kNoFolder && found.missing == 0;
     if (found.root != kNoFolder) {
         stats.folders = found.watched;
-        stats.searching = found.jobs != 0;
+        stats.scanning = found.jobs != 0;
     }
     return stats;
 }
@@ -665,7 +665,7 @@ WatchStats Watcher::Stats() const {
     for (const auto& [share, number] : impl_->numbers) {
         const WatchStats one = Stats(share);
         all.folders += one.folders;
-        all.searching = all.searching || one.searching;
+        all.scanning = all.scanning || one.scanning;
         all.complete = all.complete && one.complete;
     }
     return all;

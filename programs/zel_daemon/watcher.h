@@ -12,10 +12,10 @@ namespace zel_daemon {
 /// Why a watcher can no longer tell all that changes in a share.
 struct WatchLoss {
     enum Kind {
-        kOverflow,  ///< the kernel dropped events; the folders are searched anew, watching goes on
+        kOverflow,  ///< the kernel dropped events; the folders are scanned anew, watching goes on
         kFolderGone,  ///< the share's folder was removed, moved away, or its volume was unmounted
         kUnwatched    ///< a folder, with all below it, is not watched. It is taken in when it shows
-                      ///< a sign of life, or is searched again
+                      ///< a sign of life, or is scanned again
     };
 
     Kind kind;
@@ -29,7 +29,7 @@ struct WatchLoss {
 
 struct WatchStats {
     size_t folders = 0;      ///< folders that are watched
-    bool searching = false;  ///< folders are still being found
+    bool scanning = false;  ///< folders are still being found
     bool complete = false;   ///< all folders found are watched
 };
 
@@ -37,7 +37,7 @@ struct WatchStats {
 /// as changed with them. Symbolic links are not followed, other file systems mounted below a share
 /// are watched as its own.
 ///
-/// From the moment that a folder was told or searched, no later change in it is missed without a
+/// From the moment that a folder was told or scanned, no later change in it is missed without a
 /// loss that says so. What the kernel does not tell is missed: changes made through a name outside
 /// the share that a file also has (a hard link), changes that another host makes on a network file
 /// system, and a file system that is mounted over a folder already watched.
@@ -60,7 +60,7 @@ public:
     Watcher& operator=(const Watcher&) = delete;
 
     /// Gets what the kernel gives notices by, unless it has been got. False when that is not to be
-    /// had now: shares that are searched without it are told as not watched.
+    /// had now: shares that are scanned without it are told as not watched.
     bool Open();
     /// Readable when there is something for Work(). REQUIRES Open().
     int Fd() const;
@@ -68,15 +68,15 @@ public:
     /// Watches `folder` for `share`, in place of what was watched for it before. The folders below
     /// it are found by Work(), which must be called after this and after Remove(): Fd() does not
     /// tell of them. What changes in a folder before it is found is not told, so a run that is to
-    /// leave nothing out begins when the share is no longer searched.
+    /// leave nothing out begins when the share is no longer scanned.
     void Add(const std::string& share, const std::string& folder);
     void Remove(const std::string& share);
     /// Searches all folders of a share again, as after an overflow: what could not be watched may
     /// be by now, and is told again when it cannot. As Add(), this is done by Work().
-    void SearchAgain(const std::string& share);
+    void Rescan(const std::string& share);
 
-    /// Reads events and searches folders for about so long. True when work is left that Fd() does
-    /// not tell of, folders to search above all: call again soon. False: wait for Fd().
+    /// Reads events and scans folders for about so long. True when work is left that Fd() does
+    /// not tell of, folders to scan above all: call again soon. False: wait for Fd().
     bool Work(std::chrono::milliseconds budget);
 
     /// Of one share; none and not complete for one that is not watched.
