@@ -1,6 +1,6 @@
 # The daemon's parts, and the daemon as a whole.
 if(ZEL_BUILD_PROGRAMS)
-    foreach(part IN ITEMS change_set store task_plan watcher)
+    foreach(part IN ITEMS change_set store task_machine watcher)
         zel_test(${part}_test ${part}_test.cpp LIBRARIES daemon_parts)
     endforeach()
 

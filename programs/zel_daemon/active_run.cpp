@@ -49,8 +49,7 @@ programs::TaskRun& Connection::For(const programs::RunOrder& order) {
 }
 
 ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection,
-                     programs::RunOrder order,
-                     const OnProgress& on_progress, const OnEnd& on_end)
+                     programs::RunOrder order, const OnProgress& on_progress, const OnEnd& on_end)
     : connection_(std::move(connection)), order_(std::move(order)) {
     try {
         thread_ =

@@ -10,8 +10,8 @@
 namespace zel_daemon {
 
 struct DaemonConfig {
-    unsigned int workers = 2;                     ///< runs at the same time
-    std::chrono::milliseconds debounce{1000};      ///< quiet time before changes are sent ...
+    unsigned int workers = 2;                       ///< runs at the same time
+    std::chrono::milliseconds debounce{1000};       ///< quiet time before changes are sent ...
     std::chrono::milliseconds debounce_max{10000};  ///< ... but they wait no longer than this
     std::chrono::seconds poll{900};  ///< how often what cannot be watched is compared whole
     std::chrono::milliseconds retry_first{10000};  ///< a run that failed is tried again after ...

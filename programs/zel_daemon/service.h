@@ -22,8 +22,8 @@ namespace zel_daemon {
 struct TaskWatch {
     size_t folders = 0;
     bool scanning = false;  ///< folders are still being found
-    bool complete = true;    ///< no folder that was found is left out
-    std::string problem;     ///< why it is not complete
+    bool complete = true;   ///< no folder that was found is left out
+    std::string problem;    ///< why it is not complete
 };
 
 /// What a person sees of a task beside its settings.

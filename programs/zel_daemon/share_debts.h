@@ -98,9 +98,9 @@ private:
     struct Share {
         ShareState state = ShareState::kTracked;
         bool resync_failed = false;  // it waits for its next try with what else failed
-        bool fresh = false;        // changes are stored that have not failed
-        uint64_t failed_upto = 0;  // those up to this number have; 0: none
-        bool shut = false;         // and keep all else from being tried
+        bool fresh = false;          // changes are stored that have not failed
+        uint64_t failed_upto = 0;    // those up to this number have; 0: none
+        bool shut = false;           // and keep all else from being tried
         Backoff retry;
         programs::Trouble trouble = programs::Trouble::kNone;
 

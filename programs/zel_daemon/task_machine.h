@@ -35,8 +35,8 @@ struct Step {
     std::optional<int64_t> wait;
 };
 
-/// One task, with all rules of when it does what. It does nothing itself: it has neither threads nor
-/// files, and reads the time from the clock that it was given.
+/// One task, with all rules of when it does what. It does nothing itself: it has neither threads
+/// nor files, and reads the time from the clock that it was given.
 ///
 /// A realtime task lives so: its shares' folders are scanned and watched, and each share begins as
 /// kUnknown (see ShareState). A full resync makes it kTracked; from then on changes are debounced,
@@ -130,7 +130,8 @@ public:
     const std::set<std::string>& Unwatched() const { return unwatched_; }
     ShareState StateOf(const std::string& share) const { return debts_.StateOf(share); }
     /// Whether `test` holds for one of the shares of a run that is due.
-    bool AnyShare(const Step& step, const std::function<bool(const std::string& share)>& test) const;
+    bool AnyShare(const Step& step,
+                  const std::function<bool(const std::string& share)>& test) const;
     /// Since when a run has been due, on the clock that never jumps; 0: none is.
     int64_t DueSince() const { return due_since_; }
     const std::optional<RunPlan>& Running() const { return running_; }

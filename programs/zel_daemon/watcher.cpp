@@ -53,7 +53,7 @@ constexpr size_t kListBufferSize = size_t{32} * 1024;
 // What is known of a folder beside its place.
 constexpr uint8_t kQueued = 1;    // waits in jobs_
 constexpr uint8_t kDeep = 2;      // its next scan goes through all below, known or not
-constexpr uint8_t kNotified = 4;      // told by an event, or below such a one
+constexpr uint8_t kNotified = 4;  // told by an event, or below such a one
 constexpr uint8_t kUnseen = 8;    // its parent is being read and has not shown it yet
 constexpr uint8_t kMissing = 16;  // cannot be watched, or not all below it
 
@@ -123,8 +123,12 @@ struct Watcher::Impl {
     // was found before is not used after one.
 
     /// Tells `path`.
-    void Notify(const Share& share) { on_change(std::string(share.name), path.empty() ? "/" : path); }
-    void NotifyLoss(const Share& share, const WatchLoss& loss) { on_loss(std::string(share.name), loss); }
+    void Notify(const Share& share) {
+        on_change(std::string(share.name), path.empty() ? "/" : path);
+    }
+    void NotifyLoss(const Share& share, const WatchLoss& loss) {
+        on_loss(std::string(share.name), loss);
+    }
 
     // Folders
 

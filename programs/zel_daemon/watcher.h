@@ -12,7 +12,7 @@ namespace zel_daemon {
 /// Why a watcher can no longer tell all that changes in a share.
 struct WatchLoss {
     enum Kind {
-        kOverflow,  ///< the kernel dropped events; the folders are scanned anew, watching goes on
+        kOverflow,    ///< the kernel dropped events; the folders are scanned anew, watching goes on
         kFolderGone,  ///< the share's folder was removed, moved away, or its volume was unmounted
         kUnwatched    ///< a folder, with all below it, is not watched. It is taken in when it shows
                       ///< a sign of life, or is scanned again
@@ -28,9 +28,9 @@ struct WatchLoss {
 };
 
 struct WatchStats {
-    size_t folders = 0;      ///< folders that are watched
+    size_t folders = 0;     ///< folders that are watched
     bool scanning = false;  ///< folders are still being found
-    bool complete = false;   ///< all folders found are watched
+    bool complete = false;  ///< all folders found are watched
 };
 
 /// Watches whole trees: new folders are taken in as they appear, and what they hold by then is told
