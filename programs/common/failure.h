@@ -2,19 +2,21 @@
 // program's edge, which makes an exit status or a reply of it.
 #pragma once
 
+#include <functional>
 #include <stdexcept>
 #include <string>
 
 namespace programs {
 
-/// What went wrong, as far as callers act on it.
-enum class FailureKind {
-    kFailed,    ///< the connection, rsync or the server failed: worth another try
-    kUsage,     ///< what was asked for is wrong or not there
-    kLocal,     ///< something on this machine: a share, its volume, a file, a daemon that is not
-                ///< running
-    kRefused,   ///< the server refuses: conflict, account, password, switch
-    kCancelled  ///< ended by a person
+/// What went wrong, as far as callers act on it. The numbers are what a program that fails so exits
+/// with; the manual pages list them.
+enum class FailureKind : int {
+    kFailed = 1,    ///< the connection, rsync or the server failed: worth another try
+    kUsage = 2,     ///< what was asked for is wrong or not there
+    kLocal = 3,     ///< something on this machine: a share, its volume, a file, a daemon that is
+                    ///< not running
+    kRefused = 4,   ///< the server refuses: conflict, account, password, switch
+    kCancelled = 5  ///< ended by a person
 };
 
 class Failure : public std::runtime_error {
@@ -24,6 +26,7 @@ public:
     /// none.
     Failure(FailureKind kind, const std::string& text, int status = 0)
         : std::runtime_error(text), kind_(kind), status_(status) {}
+    explicit Failure(const std::string& text) : Failure(FailureKind::kFailed, text) {}
 
     FailureKind Kind() const { return kind_; }
     int Status() const { return status_; }
@@ -33,20 +36,16 @@ private:
     int status_;
 };
 
-/// What a program that fails so exits with; the manual pages list them.
-constexpr int ExitStatusOf(FailureKind kind) {
-    switch (kind) {
-        case FailureKind::kUsage:
-            return 2;
-        case FailureKind::kLocal:
-            return 3;
-        case FailureKind::kRefused:
-            return 4;
-        case FailureKind::kCancelled:
-            return 5;
-        default:
-            return 1;
-    }
-}
+/// A call of the system has failed: `what`, with the reason of errno behind it.
+Failure SystemFailure(const std::string& what, FailureKind kind = FailureKind::kFailed);
+
+/// A failure that the person has read about already: only its exit status is left. Has no text.
+Failure ReportedFailure(FailureKind kind);
+
+/// Writes "program: text" to standard error; nothing when there is no text.
+void Report(const char* program, const std::string& text);
+
+/// The edge of a program: runs `command`, reports what it fails with, and gives the exit status.
+int RunReporting(const char* program, const std::function<void()>& command);
 
 }  // namespace programs

@@ -8,6 +8,7 @@
 #include <utility>
 
 #include "base/text.h"
+#include "programs/common/failure.h"
 #include "programs/common/text.h"
 
 namespace programs {
@@ -204,13 +205,13 @@ void SpeakPlainly(CLI::App& app, bool has_commands) {
     }
 }
 
-int Parse(CLI::App& app, const std::vector<std::string>& words, int usage) {
+void Parse(CLI::App& app, const std::vector<std::string>& words) {
     try {
         app.parse(std::vector<std::string>(words.rbegin(), words.rend()));
-        return -1;
     } catch (const CLI::ParseError& error) {
         if (error.get_exit_code() == 0) {
-            return app.exit(error);
+            app.exit(error);
+            return;
         }
         const CLI::App* last = nullptr;
         const std::string path = CommandPath(&app, last);
@@ -218,11 +219,10 @@ int Parse(CLI::App& app, const std::vector<std::string>& words, int usage) {
         if (last->get_require_subcommand_min() > 0 &&
             error.get_exit_code() == static_cast<int>(CLI::ExitCodes::RequiredError)) {
             std::cerr << app.help();
-        } else {
-            std::cerr << app.get_name() << ": " << Printable(Complaint(error, app)) << "\n'" << path
-                      << " --help' tells what it takes.\n";
+            throw ReportedFailure(FailureKind::kUsage);
         }
-        return usage;
+        throw Failure(FailureKind::kUsage, Printable(Complaint(error, app)) + "\n'" + path +
+                                               " --help' tells what it takes.");
     }
 }
 

@@ -18,10 +18,9 @@ std::vector<std::string> CommandWords(int argc, char** argv);
 /// "help" when commands are below.
 void SpeakPlainly(CLI::App& app, bool has_commands);
 
-/// Parses `words`, and runs the callbacks of what was found. -1: it is for the caller to go on;
-/// else the program is to exit with it: 0 after a help, `usage` after a complaint on standard
-/// error.
-int Parse(CLI::App& app, const std::vector<std::string>& words, int usage);
+/// Parses `words`, and runs the callbacks of what was found; a help or a version that is asked for
+/// instead goes to standard output. Throws Failure (kUsage), and whatever the callbacks throw.
+void Parse(CLI::App& app, const std::vector<std::string>& words);
 
 /// A whole number in decimal digits, from `min` to `max`. The help tells of the bounds.
 CLI::Validator Between(uint64_t min, uint64_t max);

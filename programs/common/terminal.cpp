@@ -3,11 +3,11 @@
 #include <termios.h>
 #include <unistd.h>
 
-#include <cerrno>
 #include <cstdio>
-#include <cstring>
 #include <fstream>
 #include <iostream>
+
+#include "programs/common/failure.h"
 
 namespace programs {
 
@@ -57,52 +57,49 @@ bool TypeAtTerminal(const std::string& prompt, std::string& line) {
     return read;
 }
 
+Failure NoPassword(const char* reason) {
+    return {FailureKind::kUsage, reason};
+}
+
 }  // namespace
 
-std::optional<std::string> ReadPassword(const std::string& file, const std::string& prompt,
-                                        std::string& error) {
+std::string ReadPassword(const std::string& file, const std::string& prompt) {
     std::string line;
     if (file.empty()) {
         if (isatty(STDIN_FILENO) == 0) {
-            error = "no password: give --password-file FILE, or '-' to read it from standard input";
-            return std::nullopt;
+            throw NoPassword(
+                "no password: give --password-file FILE, or '-' to read it from standard input");
         }
         if (!TypeAtTerminal(prompt, line)) {
-            error = "no password was typed";
-            return std::nullopt;
+            throw NoPassword("no password was typed");
         }
     } else if (file == "-") {
         if (!ReadLine(std::cin, line)) {
-            error = "no password on standard input";
-            return std::nullopt;
+            throw NoPassword("no password on standard input");
         }
     } else {
         std::ifstream stream(file);
         if (!stream || !ReadLine(stream, line)) {
-            error = "cannot read a password from '" + file + "': " + std::strerror(errno);
-            return std::nullopt;
+            throw SystemFailure("cannot read a password from '" + file + "'", FailureKind::kUsage);
         }
     }
     if (line.empty() || line.size() > kMaxPassword) {
-        error = "a password has 1 to 255 characters";
-        return std::nullopt;
+        throw NoPassword("a password has 1 to 255 characters");
     }
     return line;
 }
 
-std::optional<std::string> ReadNewPassword(const std::string& file, const std::string& prompt,
-                                           std::string& error) {
+std::string ReadNewPassword(const std::string& file, const std::string& prompt) {
     for (;;) {
-        auto password = ReadPassword(file, prompt, error);
-        if (!password || !file.empty()) {
+        std::string password = ReadPassword(file, prompt);
+        if (!file.empty()) {
             return password;
         }
         std::string again;
         if (!TypeAtTerminal("Once more: ", again)) {
-            error = "the password was not typed a second time";
-            return std::nullopt;
+            throw NoPassword("the password was not typed a second time");
         }
-        if (again == *password) {
+        if (again == password) {
             return password;
         }
         std::fputs("The two are not the same; again.\n", stderr);

@@ -14,6 +14,7 @@
 #include "ZEL/ipc.h"
 #include "ZEL/log.h"
 #include "base/unique_fd.h"
+#include "programs/common/failure.h"
 #include "programs/common/help.h"
 #include "programs/common/task_run.h"
 #include "programs/common/text.h"
@@ -31,6 +32,8 @@
 namespace {
 
 using namespace zel_daemon;
+using programs::Failure;
+using programs::FailureKind;
 using ZEL::Logger;
 
 constexpr char kStorePath[] = "/usr/tarq/etc/zel_daemon/tasks.db";
@@ -39,9 +42,6 @@ constexpr char kLockPath[] = "/var/run/zel_daemon.lock";
 constexpr int kRotatedLogs = 5;
 constexpr std::chrono::seconds kLockPatience(2);
 constexpr std::chrono::milliseconds kLockStep(10);
-
-/// kMendFirst: starting it again would not help, only a person can.
-enum ExitCode : int { kEnded = 0, kFailed = 1, kUsage = 2, kMendFirst = 3 };
 
 struct Options {
     bool foreground = false;
@@ -57,7 +57,7 @@ void StartLog(const Options& options) {
                       : options.log == "stderr" ? Logger::STDERR
                                                 : Logger::LOGFILE;
     if (Logger::Initialize(type, options.level, options.log, kRotatedLogs) != 0) {
-        throw std::runtime_error("cannot write the log " + options.log + ": " + strerror(errno));
+        throw programs::SystemFailure("cannot write the log " + options.log);
     }
 }
 
@@ -66,7 +66,7 @@ base::UniqueFd TakeLock() {
     const std::string path = TARQ::RootPath(kLockPath);
     base::UniqueFd lock(open(path.c_str(), O_CREAT | O_RDWR | O_CLOEXEC, 0600));
     if (!lock) {
-        throw std::runtime_error("cannot open " + path + ": " + strerror(errno));
+        throw programs::SystemFailure("cannot open " + path);
     }
     // The lock of a daemon that was killed goes with the last of its children that had just been
     // made and were no program of their own yet.
@@ -76,7 +76,7 @@ base::UniqueFd TakeLock() {
             std::this_thread::sleep_for(kLockStep);
             continue;
         }
-        throw std::runtime_error("another zel_daemon runs already (it holds " + path + ")");
+        throw Failure("another zel_daemon runs already (it holds " + path + ")");
     }
     return lock;
 }
@@ -84,30 +84,32 @@ base::UniqueFd TakeLock() {
 void PrepareFolders() {
     const std::string problem = programs::PrepareHost();
     if (!problem.empty()) {
-        throw std::runtime_error(problem);
+        throw Failure(problem);
     }
     std::error_code error;
     const std::string run = TARQ::RootPath("/var/run");
     std::filesystem::create_directories(run, error);
     if (error) {
-        throw std::runtime_error("cannot make " + run + ": " + error.message());
+        throw Failure("cannot make " + run + ": " + error.message());
     }
 }
 
-// Has the daemon that runs read its configuration again: empty, or why it does not.
-std::string AskToReload() {
+// Has the daemon that runs read its configuration again.
+void AskToReload() {
     const std::string path = TARQ::RootPath(kSocketPath);
     ZEL::PObject request;
     request["command"] = "reload";
     ZEL::PObject reply;
     ZEL::IPCSender sender;
     if (sender.connect(path) != 0) {
-        return "no daemon answers at " + path + ": " + strerror(errno);
+        throw programs::SystemFailure("no daemon answers at " + path);
     }
     if (sender.send(request, true, reply) != 0) {
-        return "the daemon does not answer at " + path;
+        throw Failure("the daemon does not answer at " + path);
     }
-    return reply["error"].asString();
+    if (!reply["error"].asString().empty()) {
+        throw Failure(reply["error"].asString());
+    }
 }
 
 void RenewStore() {
@@ -222,6 +224,31 @@ void Say(const Options& options, const std::exception& error) {
     Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__, error.what());
 }
 
+// kLocal: starting it again would not help, only a person can.
+void Act(const Options& options) {
+    FailureKind kind = FailureKind::kFailed;
+    try {
+        if (options.new_store) {
+            RenewStore();
+        } else if (options.prepare) {
+            StartLog(options);
+            PrepareFolders();
+        } else {
+            Serve(options);
+        }
+        return;
+    } catch (const base::ConfigError& error) {
+        kind = FailureKind::kLocal;
+        Say(options, error);
+    } catch (const DamagedStore& error) {
+        kind = FailureKind::kLocal;
+        Say(options, error);
+    } catch (const std::exception& error) {
+        Say(options, error);
+    }
+    throw programs::ReportedFailure(kind);
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -251,35 +278,7 @@ int main(int argc, char** argv) {
                                      {"info", Logger::LEVEL_INFO},
                                      {"debug", Logger::LEVEL_DEBUG}}))
         ->default_str("note");
-    const int ended = programs::Parse(app, programs::CommandWords(argc, argv), kUsage);
-    if (ended >= 0) {
-        return ended;
-    }
-    if (options.reload) {
-        const std::string problem = AskToReload();
-        if (!problem.empty()) {
-            fprintf(stderr, "zel_daemon: %s\n", problem.c_str());
-        }
-        return problem.empty() ? kEnded : kFailed;
-    }
-    try {
-        if (options.new_store) {
-            RenewStore();
-        } else if (options.prepare) {
-            StartLog(options);
-            PrepareFolders();
-        } else {
-            Serve(options);
-        }
-    } catch (const base::ConfigError& error) {
-        Say(options, error);
-        return kMendFirst;
-    } catch (const DamagedStore& error) {
-        Say(options, error);
-        return kMendFirst;
-    } catch (const std::exception& error) {
-        Say(options, error);
-        return kFailed;
-    }
-    return kEnded;
+    app.callback([&] { options.reload ? AskToReload() : Act(options); });
+    return programs::RunReporting(
+        "zel_daemon", [&] { programs::Parse(app, programs::CommandWords(argc, argv)); });
 }

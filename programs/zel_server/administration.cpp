@@ -10,12 +10,12 @@
 #include "ZEL/is_syncedshare.h"
 #include "base/text.h"
 #include "programs/common/command_line.h"
+#include "programs/common/failure.h"
 #include "programs/common/help.h"
 #include "programs/common/table.h"
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/accounts.h"
-#include "programs/zel_server/complaint.h"
 #include "programs/zel_server/names.h"
 #include "programs/zel_server/registry.h"
 #include "programs/zel_server/registry_repair.h"
@@ -29,55 +29,51 @@
 namespace {
 
 using Json = nlohmann::ordered_json;
+using programs::Failure;
+using programs::FailureKind;
+using programs::SystemFailure;
 using programs::Table;
 using namespace zel_server;
 
 constexpr char kMultiSourceMarker[] = "ZELMULTI-SRC-SUPPORT";
 
-int FailedOnRegistry(const char* what) {
-    return Complain(std::string("cannot ") + what + " the registry " + RegistryFile() + ": " +
-                    KAPICErrText(KAPICErrGet()));
+Failure RegistryFailure(const char* what) {
+    return Failure(std::string("cannot ") + what + " the registry " + RegistryFile() + ": " +
+                   KAPICErrText(KAPICErrGet()));
 }
 
 // ---- Switch ----
 
 // In the registry, where it counts, and in the configuration, should the registry be lost.
-int SetSwitch(bool on) {
-    auto config = LoadServerConfig();
-    if (!config) {
-        return Complain(kNotSetUp);
-    }
+void SetSwitch(bool on) {
+    ServerConfig config = RequireServerConfig();
     const RegistryLock lock;
     if (!lock.Held() || TARQUISetZEL(on ? 1 : 0, nullptr, nullptr) != 0) {
-        return FailedOnRegistry("write");
+        throw RegistryFailure("write");
     }
-    config->switched_off = !on;
-    if (!SaveServerConfig(*config)) {
-        return ComplainErrno("cannot write " + ConfigFile());
+    config.switched_off = !on;
+    if (!SaveServerConfig(config)) {
+        throw SystemFailure("cannot write " + ConfigFile());
     }
     puts(on ? "The server accepts clients." : "The server refuses all clients.");
-    return kExitOk;
 }
 
 // ---- A damaged registry ----
 
-int Repair() {
-    const auto config = LoadServerConfig();
-    if (!config) {
-        return Complain(kNotSetUp);
-    }
+void Repair() {
+    const ServerConfig config = RequireServerConfig();
     const RegistryLock lock;
     const auto damage = lock.Held() ? FindDamage() : std::nullopt;
     if (!damage) {
-        return FailedOnRegistry("read");
+        throw RegistryFailure("read");
     }
     if (damage->None()) {
         puts("The registry is whole: nothing to do.");
-        return kExitOk;
+        return;
     }
     if (damage->switch_lost || !damage->shares.empty()) {
-        if (!MendRegistry(*damage, *config)) {
-            return ComplainErrno("cannot write the registry " + RegistryFile());
+        if (!MendRegistry(*damage, config)) {
+            throw SystemFailure("cannot write the registry " + RegistryFile());
         }
         printf("Mended:  %s with %s; the service is switched %s\n",
                programs::Count(damage->shares.size(), "share").c_str(),
@@ -93,34 +89,35 @@ int Repair() {
             "gives it to\n         the next client and account that push it\n",
             programs::Printable(share).c_str());
     }
-    return damage->ownerless.empty() ? kExitOk : kExitFailed;
+    if (!damage->ownerless.empty()) {
+        throw programs::ReportedFailure(FailureKind::kFailed);
+    }
 }
 
 // ---- Pairing ----
 
-int ResetPair() {
+void ResetPair() {
     const RegistryLock lock;
     Section pairing;
     if (!lock.Held() || ReadSection("PairedClientInfo", pairing) == ReadResult::kFailed) {
-        return FailedOnRegistry("read");
+        throw RegistryFailure("read");
     }
     if (pairing["clientID"] == kMultiSourceMarker) {
         puts("The server serves several clients already: nothing to do.");
-        return kExitOk;
+        return;
     }
     if (zel_svr_reset_pair() != 0) {
-        return FailedOnRegistry("write");
+        throw RegistryFailure("write");
     }
     puts("The server now serves several clients; the one that was paired stays paired.");
-    return kExitOk;
 }
 
 // ---- What there is ----
 
-int ListClients(bool as_json) {
+void ListClients(bool as_json) {
     const auto sections = SectionNames();
     if (!sections) {
-        return FailedOnRegistry("read");
+        throw RegistryFailure("read");
     }
     Table table({"CLIENT", "KNOWS THIS SERVER AS"});
     const std::string prefix = "CLIENTID_";
@@ -137,7 +134,6 @@ int ListClients(bool as_json) {
         table.Add({pairing["clientID"], pairing["serverName"]});
     }
     table.Print(as_json);
-    return kExitOk;
 }
 
 // How a share is: in a word for programs, and for people.
@@ -178,10 +174,10 @@ Json OrNull(const std::optional<uint64_t>& number) {
     return number ? Json(*number) : Json(nullptr);
 }
 
-int ListShares(bool as_json) {
+void ListShares(bool as_json) {
     const auto names = KnownShares();
     if (!names) {
-        return FailedOnRegistry("read");
+        throw RegistryFailure("read");
     }
     Table table({"SHARE", "CLIENT", "ACCOUNT", "STATE", "FOLDER"});
     Json rows = Json::array();
@@ -209,23 +205,19 @@ int ListShares(bool as_json) {
     } else {
         table.Print(false);
     }
-    return kExitOk;
 }
 
-int ReleaseShare(const std::string& share) {
-    const auto config = LoadServerConfig();
-    if (!config) {
-        return Complain(kNotSetUp);
-    }
+void ReleaseShare(const std::string& share) {
+    const ServerConfig config = RequireServerConfig();
     const RegistryLock lock;
     ShareState state;
     const ReadResult read = lock.Held() ? ReadShare(share, state) : ReadResult::kFailed;
     if (read == ReadResult::kFailed) {
-        return FailedOnRegistry("read");
+        throw RegistryFailure("read");
     }
     if (read == ReadResult::kMissing) {
-        return Complain("there is no share '" + programs::Printable(share) +
-                        "': see 'zel_server shares'");
+        throw Failure("there is no share '" + programs::Printable(share) +
+                      "': see 'zel_server shares'");
     }
     const auto module = ReadShareModule(share);
     if (read == ReadResult::kDamaged && module) {
@@ -237,31 +229,37 @@ int ReleaseShare(const std::string& share) {
     state.complete_id.clear();
     state.account.clear();
     if (!WriteShare(share, state)) {
-        return FailedOnRegistry("write");
+        throw RegistryFailure("write");
     }
-    if (!state.path.empty() && !WriteShareModule(*config, share, state)) {
-        return ComplainErrno("cannot write the module of the share in " + ShareModules());
+    if (!state.path.empty() && !WriteShareModule(config, share, state)) {
+        throw SystemFailure("cannot write the module of the share in " + ShareModules());
     }
     printf(
         "Share '%s' belongs to nobody now; the next client and account that push it get it, copy "
         "included.\n",
         programs::Printable(share).c_str());
-    return kExitOk;
 }
 
 // ---- Accounts ----
 
-int AddAccount(const std::string& name, const std::string& password_file, bool reset) {
+std::string AskPassword(const std::string& name, const std::string& password_file) {
+    try {
+        return programs::ReadNewPassword(password_file, "Password for " + name + ": ");
+    } catch (const Failure& failure) {
+        throw Failure(failure.what());  // no wrong usage of this program
+    }
+}
+
+void AddAccount(const std::string& name, const std::string& password_file, bool reset) {
     if (!IsAccountName(name)) {
-        fprintf(stderr,
-                "zel_server: '%s' cannot be an account: use letters, digits and . _ - @ +, a "
-                "letter or digit first\n",
-                programs::Printable(name).c_str());
-        return kExitUsage;
+        throw Failure(FailureKind::kUsage,
+                      "'" + programs::Printable(name) +
+                          "' cannot be an account: use letters, digits and . _ - @ +, a letter or "
+                          "digit first");
     }
     const auto names = Accounts();
     if (!names) {
-        return ComplainErrno("cannot read " + SecretsFile());
+        throw SystemFailure("cannot read " + SecretsFile());
     }
     const bool is_new = std::find(names->begin(), names->end(), name) == names->end();
     const bool is_typed = password_file.empty() && isatty(STDIN_FILENO) != 0;
@@ -269,44 +267,35 @@ int AddAccount(const std::string& name, const std::string& password_file, bool r
         !programs::Confirm("There is an account '" + name +
                            "': give it another password, so that clients with the old one are "
                            "refused?")) {
-        return Complain("nothing was changed");
+        throw Failure("nothing was changed");
     }
-    std::string error;
-    const auto password =
-        programs::ReadNewPassword(password_file, "Password for " + name + ": ", error);
-    if (!password) {
-        return Complain(error);
-    }
-    if (!SetAccount(name, *password)) {
-        return ComplainErrno("cannot write " + SecretsFile() + " (is the server set up?)");
+    if (!SetAccount(name, AskPassword(name, password_file))) {
+        throw SystemFailure("cannot write " + SecretsFile() + " (is the server set up?)");
     }
     printf(is_new ? "Account '%s' may log in.\n"
                   : "Account '%s' was there already: it has the new password now, and the old one "
                     "no longer holds.\n",
            name.c_str());
-    return kExitOk;
 }
 
-int DropAccount(const std::string& name) {
+void DropAccount(const std::string& name) {
     if (!RemoveAccount(name)) {
-        return errno == ENOENT ? Complain("there is no account '" + name + "'")
-                               : ComplainErrno("cannot write " + SecretsFile());
+        throw errno == ENOENT ? Failure("there is no account '" + name + "'")
+                              : SystemFailure("cannot write " + SecretsFile());
     }
     printf("Account '%s' may no longer log in; its shares' copies stay.\n", name.c_str());
-    return kExitOk;
 }
 
-int ListAccounts(bool as_json) {
+void ListAccounts(bool as_json) {
     const auto names = Accounts();
     if (!names) {
-        return ComplainErrno("cannot read " + SecretsFile());
+        throw SystemFailure("cannot read " + SecretsFile());
     }
     Table table({"ACCOUNT"});
     for (const std::string& name : *names) {
         table.Add({name});
     }
     table.Print(as_json);
-    return kExitOk;
 }
 
 }  // namespace
@@ -317,7 +306,6 @@ int RunCommandLine(int argc, char** argv) {
     programs::SpeakPlainly(app, true);
     app.require_subcommand(1);
     app.set_version_flag("--version", ZEL_VERSION, "Show the version");
-    int result = kExitOk;
     bool as_json = false;
     const auto json_flag = [&](CLI::App* command) {
         command->add_flag("--json", as_json, "Write JSON, for programs");
@@ -343,36 +331,33 @@ int RunCommandLine(int argc, char** argv) {
         "--encryption,!--no-encryption", [&](int64_t count) { setup.encryption = count > 0; },
         "Accept or refuse encrypted shares");
     setup_command->footer("What is not given stays as it was.");
-    setup_command->callback([&] { result = Setup(setup); });
+    setup_command->callback([&] { Setup(setup); });
 
-    app.add_subcommand("enable", "Accept clients")->callback([&] { result = SetSwitch(true); });
-    app.add_subcommand("disable", "Refuse all clients")->callback([&] {
-        result = SetSwitch(false);
-    });
+    app.add_subcommand("enable", "Accept clients")->callback([&] { SetSwitch(true); });
+    app.add_subcommand("disable", "Refuse all clients")->callback([&] { SetSwitch(false); });
     app.add_subcommand("reset-pair", "Turn a single pairing into one of several")->callback([&] {
-        result = ResetPair();
+        ResetPair();
     });
 
     app.add_subcommand("repair", "Put back what a damaged registry has lost")->callback([&] {
-        result = Repair();
+        Repair();
     });
     app.add_subcommand("serve", "Run the rsync daemon in the foreground, as the unit does")
-        ->callback([&] { result = Serve(); });
+        ->callback([&] { Serve(); });
 
     CLI::App* const status = app.add_subcommand("status", "Show whether the server serves");
     json_flag(status);
-    status->callback([&] { result = ShowStatus(as_json); });
+    status->callback([&] { ShowStatus(as_json); });
     CLI::App* const clients = app.add_subcommand("clients", "List the paired clients");
     json_flag(clients);
-    clients->callback([&] { result = ListClients(as_json); });
+    clients->callback([&] { ListClients(as_json); });
 
     std::string released;
     CLI::App* const shares = app.add_subcommand("shares", "List the shares, or release one");
     json_flag(shares);
     shares->add_option("--release", released, "Let another client or account take this share over")
         ->option_text("SHARE");
-    shares->callback(
-        [&] { result = released.empty() ? ListShares(as_json) : ReleaseShare(released); });
+    shares->callback([&] { released.empty() ? ListShares(as_json) : ReleaseShare(released); });
 
     std::string name;
     std::string password_file;
@@ -384,19 +369,19 @@ int RunCommandLine(int argc, char** argv) {
                     "File with the password ('-': standard input)");
     bool reset = false;
     add->add_flag("--reset", reset, "Do not ask before an account gets another password");
-    add->callback([&] { result = AddAccount(name, password_file, reset); });
+    add->callback([&] { AddAccount(name, password_file, reset); });
     CLI::App* const remove = account->add_subcommand("rm", "Remove an account");
     remove->add_option("name", name, "The account")->required();
-    remove->callback([&] { result = DropAccount(name); });
+    remove->callback([&] { DropAccount(name); });
     CLI::App* const list = account->add_subcommand("list", "List the accounts");
     json_flag(list);
-    list->callback([&] { result = ListAccounts(as_json); });
+    list->callback([&] { ListAccounts(as_json); });
 
     // The rsync daemon calls these three; main() takes them before it comes here.
     app.footer(
         "The rsync daemon itself calls 'handle-command', 'admit-transfer' and\n"
         "'end-transfer'.\n"
         "Exit codes: 0 done, 1 failed, 2 wrong usage.");
-    const int ended = programs::Parse(app, programs::CommandWords(argc, argv), kExitUsage);
-    return ended >= 0 ? ended : result;
+    return programs::RunReporting(
+        "zel_server", [&] { programs::Parse(app, programs::CommandWords(argc, argv)); });
 }

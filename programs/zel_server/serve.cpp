@@ -12,8 +12,8 @@
 
 #include "base/child_process.h"
 #include "base/whole_file.h"
+#include "programs/common/failure.h"
 #include "programs/common/text.h"
-#include "programs/zel_server/complaint.h"
 #include "programs/zel_server/rsyncd_config.h"
 
 namespace zel_server {
@@ -54,7 +54,7 @@ pid_t StartDaemon(const std::vector<std::string>& command) {
     _exit(127);
 }
 
-int WaitForFirstEnd(const std::vector<pid_t>& daemons) {
+[[noreturn]] void WaitForFirstEnd(const std::vector<pid_t>& daemons) {
     int status = 0;
     pid_t ended = 0;
     do {
@@ -67,9 +67,10 @@ int WaitForFirstEnd(const std::vector<pid_t>& daemons) {
         }
     }
     // Nobody has told this process to end: that is a failure whatever the daemon says.
-    return Complain("the rsync daemon has ended" +
-                    (WIFSIGNALED(status) ? " by signal " + std::to_string(WTERMSIG(status))
-                                         : " with status " + std::to_string(WEXITSTATUS(status))));
+    throw programs::Failure("the rsync daemon has ended" +
+                            (WIFSIGNALED(status)
+                                 ? " by signal " + std::to_string(WTERMSIG(status))
+                                 : " with status " + std::to_string(WEXITSTATUS(status))));
 }
 
 }  // namespace
@@ -112,26 +113,23 @@ bool ServesAll(const ServerConfig& config, const std::vector<Listener>& listener
     return true;
 }
 
-int Serve() {
-    const auto config = LoadServerConfig();
-    if (!config) {
-        Complain(kNotSetUp);
-        return kExitUsage;  // starting it again does not help
-    }
-    const std::vector<std::string> addresses = ServedAddresses(*config);
+void Serve() {
+    // Of another kind: starting it again does not help.
+    const ServerConfig config = RequireServerConfig(programs::FailureKind::kUsage);
+    const std::vector<std::string> addresses = ServedAddresses(config);
     if (addresses.size() == 1) {
         Become(DaemonCommand(addresses[0], true));
-        return ComplainErrno("rsync cannot be run");
+        throw programs::SystemFailure("rsync cannot be run");
     }
     std::vector<pid_t> daemons;
     for (const std::string& address : addresses) {
         const pid_t daemon = StartDaemon(DaemonCommand(address, daemons.empty()));
         if (daemon < 0) {
-            return ComplainErrno("cannot start the rsync daemon");
+            throw programs::SystemFailure("cannot start the rsync daemon");
         }
         daemons.push_back(daemon);
     }
-    return WaitForFirstEnd(daemons);
+    WaitForFirstEnd(daemons);
 }
 
 }  // namespace zel_server

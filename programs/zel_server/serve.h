@@ -21,7 +21,7 @@ bool IsOurDaemon(pid_t pid);
 bool ServesAll(const ServerConfig& config, const std::vector<Listener>& listeners);
 
 /// `zel_server serve`: runs the rsync daemon in the foreground, two where two addresses are served
-/// (stock rsync listens on one); ends all when one ends. Gives its exit code.
-int Serve();
+/// (stock rsync listens on one), until one has ended, which is a failure: it ends the other then.
+void Serve();
 
 }  // namespace zel_server

@@ -8,6 +8,7 @@
 
 #include "base/rsync_config.h"
 #include "base/text.h"
+#include "programs/common/failure.h"
 #include "programs/common/text.h"
 #include "tarq/owners.h"
 #include "tarq/root_path.h"
@@ -118,6 +119,14 @@ std::optional<ServerConfig> LoadServerConfig() {
         }
     }
     return config;
+}
+
+ServerConfig RequireServerConfig(programs::FailureKind otherwise) {
+    std::optional<ServerConfig> config = LoadServerConfig();
+    if (!config) {
+        throw programs::Failure(otherwise, "not set up: run 'zel_server setup --storage FOLDER'");
+    }
+    return *std::move(config);
 }
 
 bool SaveServerConfig(const ServerConfig& config) {

@@ -7,6 +7,8 @@
 #include <string>
 #include <vector>
 
+#include "programs/common/failure.h"
+
 namespace zel_server {
 
 struct ServerConfig {
@@ -39,6 +41,8 @@ std::string LockFile();      ///< held by every command and outcome that changes
 
 /// Reads server.conf; nothing when the server is not set up or the file is damaged.
 std::optional<ServerConfig> LoadServerConfig();
+/// The same; throws Failure of that kind when there is none.
+ServerConfig RequireServerConfig(programs::FailureKind otherwise = programs::FailureKind::kFailed);
 /// Writes it. False, with errno set, on failure.
 bool SaveServerConfig(const ServerConfig& config);
 

@@ -9,14 +9,15 @@
 #include <chrono>
 #include <cstdint>
 #include <cstdio>
+#include <cstring>
 #include <filesystem>
 #include <thread>
 
 #include "ZEL/is_syncedshare.h"
 #include "base/rsync_config.h"
+#include "programs/common/failure.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/accounts.h"
-#include "programs/zel_server/complaint.h"
 #include "programs/zel_server/health.h"
 #include "programs/zel_server/names.h"
 #include "programs/zel_server/registry_repair.h"
@@ -30,6 +31,8 @@ namespace zel_server {
 namespace {
 
 namespace fs = std::filesystem;
+using programs::Failure;
+using programs::FailureKind;
 
 constexpr int kUnprivilegedPort = 8873;
 constexpr char kStorageUser[] = "zel";
@@ -58,25 +61,25 @@ ServerConfig ConfigBefore() {
     return LoadServerConfig().value_or(usual);
 }
 
-int ConfigFrom(const SetupOptions& options, ServerConfig& config) {
+void ConfigFrom(const SetupOptions& options, ServerConfig& config) {
     if (IsSystem() && geteuid() != 0) {
-        return Complain(
+        throw Failure(
             "run it as root, or set TARQ_ROOT to a folder of yours to run a server in it");
     }
     if (!IsSystem() && !IsPlainPath(TARQ::RootFolder())) {
-        return Complain("TARQ_ROOT must be an absolute path without quotes, '%' or '\\'");
+        throw Failure("TARQ_ROOT must be an absolute path without quotes, '%' or '\\'");
     }
     std::error_code error;
     config.program = fs::read_symlink("/proc/self/exe", error);
     if (!IsPlainPath(config.program)) {
-        return Complain("zel_server must be installed at a path without quotes, '%' or '\\'");
+        throw Failure("zel_server must be installed at a path without quotes, '%' or '\\'");
     }
     if (!options.storage.empty()) {
         config.storage = Normal(options.storage);
     }
     if (config.storage.empty()) {
-        Complain("a new server needs --storage FOLDER, the folder that receives the shares");
-        return kExitUsage;
+        throw Failure(FailureKind::kUsage,
+                      "a new server needs --storage FOLDER, the folder that receives the shares");
     }
     if (options.port != 0) {
         config.port = options.port;
@@ -89,8 +92,8 @@ int ConfigFrom(const SetupOptions& options, ServerConfig& config) {
         const size_t equals = volume.find('=');
         const std::string name = volume.substr(0, equals);
         if (equals == std::string::npos || !IsShareName(name)) {
-            Complain("--volume takes NAME=FOLDER, not '" + programs::Printable(volume) + "'");
-            return kExitUsage;
+            throw Failure(FailureKind::kUsage,
+                          "--volume takes NAME=FOLDER, not '" + programs::Printable(volume) + "'");
         }
         if (equals + 1 == volume.size()) {
             config.volumes.erase(name);
@@ -102,14 +105,13 @@ int ConfigFrom(const SetupOptions& options, ServerConfig& config) {
     if (IsSystem() && !options.user.empty()) {
         config.user = options.user;
     }
-    return kExitOk;
 }
 
 // ---- Whether everything can be had; nothing is changed yet ----
 
-int LookAtFolder(const std::string& folder, const UnitState& unit) {
+void LookAtFolder(const std::string& folder, const UnitState& unit) {
     if (!IsPlainPath(folder)) {
-        return Complain(
+        throw Failure(
             "'" + folder +
             "' cannot be a storage folder: give an absolute path without quotes, '%' or '\\'");
     }
@@ -118,81 +120,75 @@ int LookAtFolder(const std::string& folder, const UnitState& unit) {
     const std::string real = fs::weakly_canonical(folder, error);
     const std::string why = unit.confinement.Forbids(error ? folder : real);
     if (!why.empty()) {
-        return Complain("the storage folder cannot be " + folder + ": the unit " + kUnit +
-                        " cannot write there (" + why + "); choose another, such as /srv/copies");
+        throw Failure("the storage folder cannot be " + folder + ": the unit " + kUnit +
+                      " cannot write there (" + why + "); choose another, such as /srv/copies");
     }
-    return kExitOk;
 }
 
-int LookAtPort(const ServerConfig& config) {
+void LookAtPort(const ServerConfig& config) {
     const std::vector<Listener> listeners = ListenersOn(config.port);
     if (const auto holder = OtherHolder(config, listeners)) {
-        return Complain(
-            "port " + std::to_string(config.port) + " is held by " + NameOf(*holder) +
-            ": end that, or choose another --port" +
-            (holder->program == "rsync"
-                 ? "; modules of an rsync daemon of yours can move into " + AdminModules()
-                 : ""));
+        throw Failure("port " + std::to_string(config.port) + " is held by " + NameOf(*holder) +
+                      ": end that, or choose another --port" +
+                      (holder->program == "rsync"
+                           ? "; modules of an rsync daemon of yours can move into " + AdminModules()
+                           : ""));
     }
     if (ServesAll(config, listeners)) {
-        return kExitOk;
+        return;
     }
     for (const std::string& address : ServedAddresses(config)) {
         const int error = TryToListen(address, config.port);
         if (error == EADDRNOTAVAIL) {
-            return Complain("this machine has no address '" + programs::Printable(address) + "'");
+            throw Failure("this machine has no address '" + programs::Printable(address) + "'");
         }
         // Our own daemon may hold an address of several; it is started again.
         if (error != 0 && error != EADDRINUSE) {
-            return Complain("cannot listen on port " + std::to_string(config.port) + ": " +
-                            strerror(error));
+            throw Failure("cannot listen on port " + std::to_string(config.port) + ": " +
+                          strerror(error));
         }
         if (error == EADDRINUSE && listeners.empty()) {
-            return Complain("port " + std::to_string(config.port) +
-                            " is held by somebody who does not listen there yet: choose another "
-                            "--port, or try again");
+            throw Failure("port " + std::to_string(config.port) +
+                          " is held by somebody who does not listen there yet: choose another "
+                          "--port, or try again");
         }
     }
-    return kExitOk;
 }
 
-int LookAtEverything(const ServerConfig& config, const UnitState& unit) {
+void LookAtEverything(const ServerConfig& config, const UnitState& unit) {
     for (const std::string& folder : config.Folders()) {
-        const int result = LookAtFolder(folder, unit);
-        if (result != kExitOk) {
-            return result;
-        }
+        LookAtFolder(folder, unit);
     }
     if (unit.masked) {
-        return Complain(std::string("the unit ") + kUnit + " is masked: systemctl unmask " + kUnit);
+        throw Failure(std::string("the unit ") + kUnit + " is masked: systemctl unmask " + kUnit);
     }
-    return LookAtPort(config);
+    LookAtPort(config);
 }
 
 // ---- Taking it ----
 
 // The system user that owns the copies when the daemon runs as root, made when it is missing.
-bool HaveStorageUser(const std::string& user) {
+void HaveStorageUser(const std::string& user) {
     if (user.empty() || getpwnam(user.c_str()) != nullptr) {
-        return true;
+        return;
     }
     FILE* const useradd =
         KAPICPopen("/usr/sbin/useradd", "r", "--system", "--no-create-home", "--shell",
                    "/usr/sbin/nologin", user.c_str(), static_cast<const char*>(nullptr));
-    return useradd != nullptr && KAPICPclose(useradd) == 0 && getpwnam(user.c_str()) != nullptr;
+    if (useradd == nullptr || KAPICPclose(useradd) != 0 || getpwnam(user.c_str()) == nullptr) {
+        throw Failure("cannot make the system user '" + user + "' that owns the copies");
+    }
 }
 
-bool MakeFolders(std::string& failed) {
+void MakeFolders() {
     for (const std::string& folder : {ConfigFolder(), ShareModules(), AdminModules(),
                                       AnswerFolder(), TARQ::RootPath("/var/log")}) {
         std::error_code error;
         fs::create_directories(folder, error);
         if (error) {
-            failed = folder + ": " + error.message();
-            return false;
+            throw Failure("cannot make " + folder + ": " + error.message());
         }
     }
-    return true;
 }
 
 bool IsInMemory(const std::string& folder) {
@@ -223,24 +219,24 @@ std::vector<std::string> CopiesIn(const std::string& storage) {
 }
 
 // Makes a storage folder and says which disk it is on, and what is odd about it.
-int TakeFolder(const ServerConfig& config, const std::string& folder) {
+void TakeFolder(const ServerConfig& config, const std::string& folder) {
     std::error_code error;
     fs::create_directories(folder, error);
     if (error) {
-        return Complain("cannot make the storage folder '" + folder + "': " + error.message());
+        throw Failure("cannot make the storage folder '" + folder + "': " + error.message());
     }
     const std::string disk = RecordDiskOf(folder);
     if (disk.empty()) {
-        return Complain("cannot tell which disk '" + folder +
-                        "' is on: " + KAPICErrText(KAPICErrGet()));
+        throw Failure("cannot tell which disk '" + folder +
+                      "' is on: " + KAPICErrText(KAPICErrGet()));
     }
     const StorageState state = CheckStorage(folder);
     if (state == StorageState::kReadOnly) {
-        return Complain("the storage folder " + folder + " is on a disk that is mounted read-only");
+        throw Failure("the storage folder " + folder + " is on a disk that is mounted read-only");
     }
     if (state != StorageState::kReady) {
-        return Complain("the storage folder " + folder +
-                        " cannot be used: it is no folder, or may not be written");
+        throw Failure("the storage folder " + folder +
+                      " cannot be used: it is no folder, or may not be written");
     }
     printf("Storage: %s, on the disk mounted at %s\n", folder.c_str(), disk.c_str());
     if (IsSystem() && IsInMemory(folder)) {
@@ -251,24 +247,23 @@ int TakeFolder(const ServerConfig& config, const std::string& folder) {
         const Problem problem = ForeignCopies(config, foreign);
         printf("         NOTE: %s\n         %s\n", problem.what.c_str(), problem.mend.c_str());
     }
-    return kExitOk;
 }
 
 // The switch of a new server is on; the admin's word for one that was set up before stays.
-int TakeRegistry(bool is_new) {
+void TakeRegistry(bool is_new) {
     const RegistryLock lock;
     if (is_new && ReadSwitch() == Switch::kUnknown) {
-        return lock.Held() && TARQUISetZEL(1, nullptr, nullptr) == 0
-                   ? kExitOk
-                   : Complain("cannot write the registry " + RegistryFile() + ": " +
-                              KAPICErrText(KAPICErrGet()));
+        if (!lock.Held() || TARQUISetZEL(1, nullptr, nullptr) != 0) {
+            throw Failure("cannot write the registry " + RegistryFile() + ": " +
+                          KAPICErrText(KAPICErrGet()));
+        }
+        return;
     }
     const auto damage = FindDamage();
     if (!damage || !damage->None()) {
-        return Complain("the registry " + RegistryFile() +
-                        " is damaged or cannot be read: 'zel_server status' says what to do");
+        throw Failure("the registry " + RegistryFile() +
+                      " is damaged or cannot be read: 'zel_server status' says what to do");
     }
-    return kExitOk;
 }
 
 // ---- The daemon ----
@@ -295,10 +290,10 @@ std::string Where(const ServerConfig& config) {
 }
 
 // Without a manager that knows the unit, the admin starts the daemon.
-int TellHowToStart(const Health& now, const ServerConfig& config) {
+void TellHowToStart(const Health& now, const ServerConfig& config) {
     if (now.listens && !now.configuration_newer) {
         printf("Running: the rsync daemon, on %s\n", Where(config).c_str());
-        return kExitOk;
+        return;
     }
     const std::string root = IsSystem() ? "" : "TARQ_ROOT='" + TARQ::RootFolder() + "' ";
     if (now.daemon) {
@@ -312,75 +307,60 @@ int TellHowToStart(const Health& now, const ServerConfig& config) {
         "             %szel_server serve\n"
         "         It then listens on %s, until it is ended.\n",
         kUnit, root.c_str(), Where(config).c_str());
-    return kExitOk;
 }
 
-int HaveDaemon(const ServerConfig& config) {
+void HaveDaemon(const ServerConfig& config) {
     const Health now = Examine(config);
     if (!now.unit.managed) {
-        return TellHowToStart(now, config);
+        TellHowToStart(now, config);
+        return;
     }
     const bool runs = now.unit.active == "active";
     if (!runs && now.daemon) {
-        return Complain("an rsync daemon of this server was started by hand: end process " +
-                        std::to_string(*now.daemon) + ", then run 'zel_server setup' again");
+        throw Failure("an rsync daemon of this server was started by hand: end process " +
+                      std::to_string(*now.daemon) + ", then run 'zel_server setup' again");
     }
     const bool as_configured = runs && now.listens && !now.configuration_newer;
     if (!now.unit.enabled && !EnableUnit()) {
-        return Complain(std::string("cannot enable the unit ") + kUnit);
+        throw Failure(std::string("cannot enable the unit ") + kUnit);
     }
     if (!as_configured && (!(runs ? RestartUnit() : StartUnit()) || !WaitUntilServed(config))) {
-        return Complain(std::string("the rsync daemon does not start: 'journalctl -u ") + kUnit +
-                        "' and 'zel_server status' say why");
+        throw Failure(std::string("the rsync daemon does not start: 'journalctl -u ") + kUnit +
+                      "' and 'zel_server status' say why");
     }
     const char* const done = as_configured ? "Running: " : runs ? "Restarted: " : "Started: ";
     printf("%s%s, on %s%s%s\n", done, kUnit, Where(config).c_str(),
            now.unit.enabled ? "" : "; it starts with the machine from now on",
            runs && !as_configured ? "; pushes that were under way are tried again" : "");
-    return kExitOk;
 }
 
 }  // namespace
 
-int Setup(const SetupOptions& options) {
+void Setup(const SetupOptions& options) {
     ServerConfig config = ConfigBefore();
-    int result = ConfigFrom(options, config);
-    if (result == kExitOk) {
-        result = LookAtEverything(config, AskUnit());
-    }
-    if (result != kExitOk) {
-        return result;
-    }
+    ConfigFrom(options, config);
+    LookAtEverything(config, AskUnit());
     const bool is_new = !LoadServerConfig();
-    std::string failed;
-    if (!HaveStorageUser(config.user)) {
-        return Complain("cannot make the system user '" + config.user + "' that owns the copies");
-    }
-    if (!MakeFolders(failed)) {
-        return Complain("cannot make " + failed);
-    }
+    HaveStorageUser(config.user);
+    MakeFolders();
     for (const std::string& folder : config.Folders()) {
-        result = result == kExitOk ? TakeFolder(config, folder) : result;
+        TakeFolder(config, folder);
     }
     // The registry before the configuration: a new server is one without configuration.
-    result = result == kExitOk ? TakeRegistry(is_new) : result;
-    if (result != kExitOk) {
-        return result;
-    }
+    TakeRegistry(is_new);
     if (!SaveServerConfig(config) || !WriteRsyncdConfig(config)) {
-        return ComplainErrno("cannot write the configuration in " + ConfigFolder());
+        throw programs::SystemFailure("cannot write the configuration in " + ConfigFolder());
     }
     printf("Written: %s\n         (your own modules go into %s)\n", RsyncdConfig().c_str(),
            AdminModules().c_str());
-    result = HaveDaemon(config);
-    if (result == kExitOk && ReadSwitch() == Switch::kOff) {
+    HaveDaemon(config);
+    if (ReadSwitch() == Switch::kOff) {
         puts("Off:     clients are refused, as before: 'zel_server enable' lets them in");
     }
     const auto accounts = Accounts();
-    if (result == kExitOk && accounts && accounts->empty()) {
+    if (accounts && accounts->empty()) {
         puts("Next:    zel_server account add NAME, for each client");
     }
-    return result;
 }
 
 }  // namespace zel_server

@@ -18,7 +18,7 @@ struct SetupOptions {
 };
 
 /// Looks whether everything can be had, writes the configuration, and sees to it that the rsync
-/// daemon runs with it, or says how to. Says what it did; gives an exit code.
-int Setup(const SetupOptions& options);
+/// daemon runs with it, or says how to. Says what it did.
+void Setup(const SetupOptions& options);
 
 }  // namespace zel_server

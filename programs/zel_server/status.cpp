@@ -4,8 +4,8 @@
 #include <nlohmann/json.hpp>
 
 #include "ZEL/is_syncedshare.h"
+#include "programs/common/failure.h"
 #include "programs/common/text.h"
-#include "programs/zel_server/complaint.h"
 #include "programs/zel_server/health.h"
 
 namespace zel_server {
@@ -159,15 +159,14 @@ void PrintText(const ServerConfig& config, const Report& report, const Health& h
 
 }  // namespace
 
-int ShowStatus(bool as_json) {
-    const auto config = LoadServerConfig();
-    if (!config) {
-        return Complain(kNotSetUp);
-    }
-    const Health health = Examine(*config);
+void ShowStatus(bool as_json) {
+    const ServerConfig config = RequireServerConfig();
+    const Health health = Examine(config);
     const Report report;
-    (as_json ? PrintJson : PrintText)(*config, report, health);
-    return health.PushesCanSucceed() ? kExitOk : kExitFailed;
+    (as_json ? PrintJson : PrintText)(config, report, health);
+    if (!health.PushesCanSucceed()) {
+        throw programs::ReportedFailure(programs::FailureKind::kFailed);
+    }
 }
 
 }  // namespace zel_server

@@ -3,7 +3,7 @@
 
 namespace zel_server {
 
-/// Writes how the server is; exit code 1 when pushes cannot succeed, all or some.
-int ShowStatus(bool as_json);
+/// Writes how the server is; fails when pushes cannot succeed, all or some.
+void ShowStatus(bool as_json);
 
 }  // namespace zel_server

@@ -1,6 +1,7 @@
 #include "programs/common/command_line.h"
 
 #include "ZEL/log.h"
+#include "programs/common/failure.h"
 #include "programs/common/help.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/declare.h"
@@ -13,7 +14,7 @@ using namespace zelctl;
 struct Command {
     const char* name;
     const char* about;
-    void (*declare)(CLI::App& app, ExitCode& result);
+    void (*declare)(CLI::App& app);
 };
 
 constexpr Command kCommands[] = {
@@ -43,15 +44,14 @@ std::string NextWord(const std::vector<std::string>& words, size_t& index) {
 }
 
 // `below`: the word after a command that others are below; empty: `word` itself is none.
-ExitCode NoSuchCommand(const std::string& word, const std::string& below) {
+programs::Failure NoSuchCommand(const std::string& word, const std::string& below) {
     const std::string group = below.empty() ? "" : word + " ";
-    return Fail(kUsage, "there is no command '%s': 'zelctl %s-h' lists them",
-                programs::Printable(below.empty() ? word : group + below).c_str(), group.c_str());
+    return {programs::FailureKind::kUsage,
+            "there is no command '" + programs::Printable(below.empty() ? word : group + below) +
+                "': 'zelctl " + group + "-h' lists them"};
 }
 
-}  // namespace
-
-int RunCommandLine(int argc, char** argv) {
+void Run(const std::vector<std::string>& words) {
     CLI::App app{"Keeps shared folders in step with a paired server"};
     app.name("zelctl");
     programs::SpeakPlainly(app, true);
@@ -61,19 +61,17 @@ int RunCommandLine(int argc, char** argv) {
         "-v,--verbose",
         [] { ZEL::Logger::Initialize(ZEL::Logger::STDERR, ZEL::Logger::LEVEL_INFO, "", 0); },
         "Write the library's log to standard error instead of the system log");
-    ExitCode result = kOk;
-    const std::vector<std::string> words = programs::CommandWords(argc, argv);
     size_t index = 0;
     const std::string wanted = NextWord(words, index);
     if (wanted == "server") {
-        return BecomeServer({words.begin() + static_cast<std::ptrdiff_t>(index), words.end()});
+        BecomeServer({words.begin() + static_cast<std::ptrdiff_t>(index), words.end()});
     }
     bool known = wanted.empty();
     for (const Command& command : kCommands) {
         CLI::App* const declared = app.add_subcommand(command.name, command.about);
         // What another command takes need not be known to run this one.
         if (wanted == command.name) {
-            command.declare(*declared, result);
+            command.declare(*declared);
             known = true;
             const std::string below = NextWord(words, index);
             if (declared->get_require_subcommand_min() > 0 && !below.empty() &&
@@ -81,17 +79,22 @@ int RunCommandLine(int argc, char** argv) {
                     ->get_subcommands(
                         [&](const CLI::App* lower) { return lower->check_name(below); })
                     .empty()) {
-                return NoSuchCommand(wanted, below);
+                throw NoSuchCommand(wanted, below);
             }
         }
     }
     if (!known) {
-        return NoSuchCommand(wanted, "");
+        throw NoSuchCommand(wanted, "");
     }
     app.footer(
         "'zelctl help COMMAND' tells more.\n"
         "Exit codes: 0 done, 1 failed on the way, 2 wrong usage, 3 a problem on this\n"
         "machine, 4 the server refuses, 5 ended by the user.");
-    const int ended = programs::Parse(app, words, kUsage);
-    return ended >= 0 ? ended : result;
+    programs::Parse(app, words);
+}
+
+}  // namespace
+
+int RunCommandLine(int argc, char** argv) {
+    return programs::RunReporting("zelctl", [&] { Run(programs::CommandWords(argc, argv)); });
 }

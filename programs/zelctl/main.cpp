@@ -1,13 +1,14 @@
 #include <cstring>
 
 #include "programs/common/command_line.h"
-#include "programs/zelctl/base/exit_codes.h"
+#include "programs/common/failure.h"
 #include "programs/zelctl/task/quick_list.h"
 
 int main(int argc, char** argv) {
     const bool is_list = argc == 3 && strcmp(argv[1], "task") == 0 && strcmp(argv[2], "list") == 0;
     if (is_list && zelctl::PrintTaskListQuickly()) {
-        return zelctl::kOk;
+        return 0;
     }
-    return programs::RunFromLibrary("zelctl", "libzelctl_commands.so", zelctl::kLocal, argc, argv);
+    return programs::RunFromLibrary("zelctl", "libzelctl_commands.so",
+                                    static_cast<int>(programs::FailureKind::kLocal), argc, argv);
 }

@@ -5,35 +5,35 @@
 
 namespace zelctl {
 
-void DeclareStatus(CLI::App& status, ExitCode& result) {
+void DeclareStatus(CLI::App& status) {
     static bool as_json = false;
     status.add_flag("--json", as_json, "Write JSON, for programs");
-    status.callback([&result] { result = ShowDaemonStatus(as_json); });
+    status.callback([] { ShowDaemonStatus(as_json); });
 }
 
-void DeclareReload(CLI::App& reload, ExitCode& result) {
-    reload.callback([&result] { result = ReloadDaemon(); });
+void DeclareReload(CLI::App& reload) {
+    reload.callback([] { ReloadDaemon(); });
 }
 
-void DeclareDoctor(CLI::App& doctor, ExitCode& result) {
+void DeclareDoctor(CLI::App& doctor) {
     static bool as_json = false;
     doctor.add_flag("--json", as_json, "Write JSON, for programs");
     doctor.footer(
         "It changes nothing. Exit code 0: nothing has failed; 3: something has.\n"
         "As root it sees what the daemon sees.");
-    doctor.callback([&result] { result = Doctor(as_json); });
+    doctor.callback([] { Doctor(as_json); });
 }
 
-void DeclareExport(CLI::App& exporting, ExitCode& result) {
+void DeclareExport(CLI::App& exporting) {
     static std::string path;
     static bool with_passwords = false;
     exporting.add_option("file", path, "Where to (standard output)");
     exporting.add_flag("--with-passwords", with_passwords,
                        "With the accounts' passwords; the file then is yours alone to read");
-    exporting.callback([&result] { result = ExportTasks(path, with_passwords); });
+    exporting.callback([] { ExportTasks(path, with_passwords); });
 }
 
-void DeclareImport(CLI::App& importing, ExitCode& result) {
+void DeclareImport(CLI::App& importing) {
     static std::string path;
     static std::string password_file;
     static bool replace = false;
@@ -45,7 +45,7 @@ void DeclareImport(CLI::App& importing, ExitCode& result) {
                          "File with the password of all accounts whose password the file does not "
                          "have; else each is asked for");
     importing.footer("Nothing is imported unless every task of the file is possible here.");
-    importing.callback([&result] { result = ImportTasks(path, replace, password_file); });
+    importing.callback([] { ImportTasks(path, replace, password_file); });
 }
 
 }  // namespace zelctl

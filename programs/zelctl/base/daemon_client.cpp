@@ -9,6 +9,7 @@
 
 #include "ZEL/stream.h"
 #include "base/unique_fd.h"
+#include "programs/common/failure.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "tarq/root_path.h"
@@ -16,6 +17,9 @@
 namespace zelctl {
 
 namespace {
+
+using programs::Failure;
+using programs::FailureKind;
 
 constexpr char kSocket[] = "/var/run/zel_daemon.sock";
 constexpr unsigned int kRingBytes = 81920;
@@ -43,10 +47,6 @@ std::string TooLong(const ZEL::PObject& value, const std::string& key) {
     return "";
 }
 
-ExitCode CodeOfResult(int result) {
-    return result == ZEL::RESULT_INVALID_ARGUMENT ? kUsage : kLocal;
-}
-
 }  // namespace
 
 std::string DaemonSocket() {
@@ -57,113 +57,109 @@ DaemonConnection::DaemonConnection() : channel_(kRingBytes) {
     channel_.SetFlag(InterruptFlag());
 }
 
-ExitCode DaemonConnection::Tell(ExitCode code) const {
-    return error_.empty() ? code : Fail(code, "%s", error_.c_str());
-}
-
-ExitCode DaemonConnection::Failed(ExitCode code, const std::string& error) {
-    error_ = programs::Printable(error);
-    return code;
-}
-
-ExitCode DaemonConnection::CannotConnect(const std::string& path, int error) {
-    fault_ = DaemonFault::kOther;
+Failure DaemonConnection::CannotConnect(const std::string& path, int error) {
+    const auto failed = [this](DaemonFault fault, const std::string& text) {
+        fault_ = fault;
+        return Failure(FailureKind::kLocal, programs::Printable(text));
+    };
     switch (error) {
         case ENOENT:
         case ECONNREFUSED:
-            fault_ = DaemonFault::kNotRunning;
-            return Failed(kLocal, "the daemon is not running: systemctl start zel_daemon");
+            return failed(DaemonFault::kNotRunning,
+                          "the daemon is not running: systemctl start zel_daemon");
         case EACCES:
         case EPERM:
-            fault_ = DaemonFault::kNotPermitted;
-            return Failed(kLocal, "not permitted to use the daemon's socket " + path +
-                                      ": be root, or a member of its group (key 'group' of "
-                                      "zel_daemon.conf)");
+            return failed(DaemonFault::kNotPermitted,
+                          "not permitted to use the daemon's socket " + path +
+                              ": be root, or a member of its group (key 'group' of "
+                              "zel_daemon.conf)");
         case EAGAIN:
-            fault_ = DaemonFault::kSilent;
-            return Failed(kLocal, "the daemon does not answer: systemctl restart zel_daemon");
+            return failed(DaemonFault::kSilent,
+                          "the daemon does not answer: systemctl restart zel_daemon");
         default:
-            return Failed(kLocal, "cannot reach the daemon at " + path + ": " + strerror(error));
+            return failed(DaemonFault::kOther,
+                          "cannot reach the daemon at " + path + ": " + strerror(error));
     }
 }
 
-ExitCode DaemonConnection::Connect() {
+void DaemonConnection::Connect() {
     const std::string path = DaemonSocket();
     sockaddr_un address = {};
     address.sun_family = AF_UNIX;
     if (path.size() >= sizeof address.sun_path) {
-        return CannotConnect(path, ENAMETOOLONG);
+        throw CannotConnect(path, ENAMETOOLONG);
     }
     memcpy(address.sun_path, path.data(), path.size());
     base::UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     if (!fd ||
         setsockopt(fd.Get(), SOL_SOCKET, SO_SNDTIMEO, &kConnectLimit, sizeof kConnectLimit) != 0 ||
-        connect(fd.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
-        return CannotConnect(path, errno);
-    }
-    if (channel_.Open(fd.Get(), true) != ZEL::RESULT_SUCCESS) {
-        return CannotConnect(path, errno);
+        connect(fd.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
+        channel_.Open(fd.Get(), true) != ZEL::RESULT_SUCCESS) {
+        throw CannotConnect(path, errno);
     }
     fd.Release();  // the channel's now
-    return kOk;
 }
 
-ExitCode DaemonConnection::Lost() {
+Failure DaemonConnection::Lost() {
     fault_ = DaemonFault::kSilent;
-    return Failed(Interrupted() ? kCancelled : kLocal,
-                  Interrupted()
-                      ? ""
-                      : "the daemon has broken off: see 'systemctl status zel_daemon' and its log");
+    return Interrupted()
+               ? programs::ReportedFailure(FailureKind::kCancelled)
+               : Failure(FailureKind::kLocal,
+                         "the daemon has broken off: see 'systemctl status zel_daemon' and its "
+                         "log");
 }
 
-ExitCode DaemonConnection::Send(const ZEL::PObject& request) {
+void DaemonConnection::Send(const ZEL::PObject& request) {
     const std::string key = TooLong(request, "request");
     if (!key.empty()) {
-        return Failed(kUsage,
-                      "the value for '" + key + "' is too long: a text has at most 65535 bytes");
+        throw Failure(FailureKind::kUsage,
+                      programs::Printable("the value for '" + key +
+                                          "' is too long: a text has at most 65535 bytes"));
     }
     ZEL::PStream stream;
-    return stream.Send(channel_, request) == ZEL::RESULT_SUCCESS ? kOk : Lost();
+    if (stream.Send(channel_, request) != ZEL::RESULT_SUCCESS) {
+        throw Lost();
+    }
 }
 
-ExitCode DaemonConnection::Receive(ZEL::PObject& reply) {
-    reply.clear();
+ZEL::PObject DaemonConnection::Receive() {
+    ZEL::PObject reply;
     ZEL::PStream stream;
     if (stream.Recv(channel_, reply) != ZEL::RESULT_SUCCESS) {
-        return Lost();
+        throw Lost();
     }
     const ZEL::PObject& received = reply;
     if (!received["result"].isInteger()) {
-        return Failed(kLocal,
+        throw Failure(FailureKind::kLocal,
                       "the daemon's answer is no reply: are zelctl and zel_daemon of one version?");
     }
     const int result = received["result"].asInt32();
     if (result == ZEL::RESULT_SUCCESS) {
-        return kOk;
+        return reply;
     }
     if (result == ZEL::RESULT_NO_PERMISSION) {
         fault_ = DaemonFault::kNotPermitted;
     }
-    const std::string error = received["error"].asString();
-    return Failed(
-        CodeOfResult(result),
-        error.empty() ? "the daemon refuses (result " + std::to_string(result) + ")" : error);
+    const std::string error = programs::Printable(received["error"].asString());
+    throw Failure(
+        result == ZEL::RESULT_INVALID_ARGUMENT ? FailureKind::kUsage : FailureKind::kLocal,
+        error.empty() ? "the daemon refuses (result " + std::to_string(result) + ")" : error,
+        result);
 }
 
-ExitCode AskDaemon(const ZEL::PObject& request, ZEL::PObject& reply, std::string* error) {
+ZEL::PObject AskDaemon(const ZEL::PObject& request) {
     DaemonConnection connection;
-    ExitCode code = connection.Connect();
-    if (code == kOk) {
-        code = connection.Send(request);
+    connection.Connect();
+    connection.Send(request);
+    return connection.Receive();
+}
+
+std::optional<ZEL::PObject> TryToAskDaemon(const ZEL::PObject& request) {
+    try {
+        return AskDaemon(request);
+    } catch (const Failure&) {
+        return std::nullopt;
     }
-    if (code == kOk) {
-        code = connection.Receive(reply);
-    }
-    if (error != nullptr) {
-        *error = connection.Error();
-        return code;
-    }
-    return connection.Tell(code);
 }
 
 ZEL::PObject TaskRequest(const char* command, const std::string& task) {

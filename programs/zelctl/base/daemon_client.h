@@ -1,11 +1,12 @@
 // Talking to the daemon: requests and replies of docs/daemon-protocol.md.
 #pragma once
 
+#include <optional>
 #include <string>
 
 #include "ZEL/channel.h"
 #include "ZEL/pobject.h"
-#include "programs/zelctl/base/exit_codes.h"
+#include "programs/common/failure.h"
 
 namespace zelctl {
 
@@ -18,38 +19,34 @@ enum class DaemonFault {
     kOther
 };
 
-/// A connection to the daemon. After another code than kOk it is only good for Error() and Tell().
+/// A connection to the daemon. Once an operation has thrown Failure, it is only good for Fault().
+/// The text is printable, and empty when an interrupt, noted by WatchForInterrupt(), ended a wait
+/// (kCancelled).
 ///
 /// Threads: one thread.
 class DaemonConnection {
 public:
     DaemonConnection();
 
-    ExitCode Connect();
-    ExitCode Send(const ZEL::PObject& request);
-    /// The next reply into `reply`, which is emptied first. An error reply is a failure.
-    ExitCode Receive(ZEL::PObject& reply);
+    void Connect();
+    void Send(const ZEL::PObject& request);
+    /// The next reply. An error reply is a failure.
+    ZEL::PObject Receive();
 
-    /// What failed and what to do, printable; empty when an interrupt, noted by
-    /// WatchForInterrupt(), ended a wait (kCancelled).
-    const std::string& Error() const { return error_; }
     DaemonFault Fault() const { return fault_; }
-    /// Tells the person, if there is something to tell. Gives `code` back.
-    ExitCode Tell(ExitCode code) const;
 
 private:
-    ExitCode Failed(ExitCode code, const std::string& error);
-    ExitCode CannotConnect(const std::string& path, int error);
-    ExitCode Lost();
+    programs::Failure CannotConnect(const std::string& path, int error);
+    programs::Failure Lost();
 
-    std::string error_;
     DaemonFault fault_ = DaemonFault::kNone;
     ZEL::Channel channel_;
 };
 
-/// One request and its reply, on a connection of its own. A failure is told to the person, or goes
-/// to `error` when that is given.
-ExitCode AskDaemon(const ZEL::PObject& request, ZEL::PObject& reply, std::string* error = nullptr);
+/// One request and its reply, on a connection of its own. Throws Failure as that does.
+ZEL::PObject AskDaemon(const ZEL::PObject& request);
+/// The same of a daemon that need not be there: nothing when it cannot be asked, or refuses.
+std::optional<ZEL::PObject> TryToAskDaemon(const ZEL::PObject& request);
 
 /// A request about one task.
 ZEL::PObject TaskRequest(const char* command, const std::string& task);

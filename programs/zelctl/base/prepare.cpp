@@ -1,12 +1,15 @@
 #include "programs/zelctl/base/prepare.h"
 
+#include "programs/common/failure.h"
 #include "programs/common/task_run.h"
 
 namespace zelctl {
 
-ExitCode PrepareHost() {
+void PrepareHost() {
     const std::string problem = programs::PrepareHost();
-    return problem.empty() ? kOk : Fail(kLocal, "%s", problem.c_str());
+    if (!problem.empty()) {
+        throw programs::Failure(programs::FailureKind::kLocal, problem);
+    }
 }
 
 }  // namespace zelctl

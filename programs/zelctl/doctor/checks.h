@@ -14,11 +14,11 @@
 
 namespace zelctl {
 
-enum class Verdict { kOk, kWarning, kFailed };
+enum class Severity { kOk, kWarning, kFailed };
 
 struct Finding {
     std::string name;  ///< of what was looked at
-    Verdict verdict;
+    Severity severity;
     std::string finding;
     std::string remedy;  ///< empty when all is well
 };

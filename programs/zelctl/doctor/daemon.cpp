@@ -113,14 +113,14 @@ void CheckUnit(const Patient&, Findings& findings) {
     const std::string name = std::string("unit ") + kUnit;
     const int active = TARQSystemdActiveStatusGet(kUnit);
     if (active == 1) {
-        findings.push_back({name, Verdict::kOk, "active", ""});
+        findings.push_back({name, Severity::kOk, "active", ""});
     } else if (!IsUnitInstalled()) {
-        findings.push_back({name, Verdict::kFailed, "it is not installed",
+        findings.push_back({name, Severity::kFailed, "it is not installed",
                             "install the package, or its unit file, and 'systemctl "
                             "daemon-reload'"});
     } else {
         findings.push_back(
-            {name, Verdict::kFailed,
+            {name, Severity::kFailed,
              active == 0 ? "it is not active"
                          : "the service manager does not say whether it is "
                            "active",
@@ -132,20 +132,20 @@ void CheckDaemon(const Patient& patient, Findings& findings) {
     const int64_t protocol = patient.daemon["protocol"].asInt64();
     if (!patient.daemon_answers) {
         const std::string last_words = LastWordsOfDaemon(patient);
-        findings.push_back({"daemon", Verdict::kFailed,
+        findings.push_back({"daemon", Severity::kFailed,
                             patient.daemon_error +
                                 (last_words.empty() ? "" : "; it last complained: " + last_words),
                             RemedyOfDaemon(patient.daemon_fault)});
     } else if (protocol != kProtocol) {
-        findings.push_back({"daemon", Verdict::kFailed,
+        findings.push_back({"daemon", Severity::kFailed,
                             "it speaks version " + std::to_string(protocol) + " of the protocol",
                             "install zelctl and zel_daemon of one version, and restart it"});
     } else if (!patient.daemon_error.empty()) {
-        findings.push_back({"daemon", Verdict::kFailed,
+        findings.push_back({"daemon", Severity::kFailed,
                             "it does not tell its tasks: " + patient.daemon_error,
                             "its log: journalctl -u zel_daemon"});
     } else {
-        findings.push_back({"daemon", Verdict::kOk,
+        findings.push_back({"daemon", Severity::kOk,
                             "version " + patient.daemon["version"].asString() + ", " +
                                 programs::Count(patient.tasks.size(), "task"),
                             ""});
@@ -158,14 +158,14 @@ void CheckConfiguration(const Patient&, Findings& findings) {
         try {
             read();
         } catch (const base::ConfigError& error) {
-            findings.push_back({"configuration", Verdict::kFailed, error.what(),
+            findings.push_back({"configuration", Severity::kFailed, error.what(),
                                 "correct the line, then: zelctl reload"});
         }
     };
     check([] { base::ReadRsyncConfig(TARQ::RootPath(base::kRsyncConfigPath)); });
     check(zel_daemon::ReadDaemonConfig);
     if (findings.size() == before) {
-        findings.push_back({"configuration", Verdict::kOk, "nothing wrong in it", ""});
+        findings.push_back({"configuration", Severity::kOk, "nothing wrong in it", ""});
     }
 }
 
@@ -173,7 +173,7 @@ void CheckStore(const Patient& patient, Findings& findings) {
     const std::string path = StorePath(patient);
     const std::string fault = FaultOfStore(path);
     if (!fault.empty()) {
-        findings.push_back({"store", Verdict::kFailed, path + " " + fault,
+        findings.push_back({"store", Severity::kFailed, path + " " + fault,
                             "stop the daemon, keep what is there (" + path +
                                 "*), and put a backup in its place, see operations.md"});
     }

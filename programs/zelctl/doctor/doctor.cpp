@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cstdio>
 
+#include "programs/common/failure.h"
 #include "programs/common/table.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
@@ -22,11 +23,11 @@ constexpr void (*kChecks[])(const Patient&, Findings&) = {
     CheckRsync, CheckSSH,     CheckClock, CheckConfiguration, CheckCatalogue, CheckFiles,
     CheckSpace, CheckWatches, CheckStore, CheckUnit,          CheckDaemon};
 
-const char* Word(Verdict verdict) {
-    switch (verdict) {
-        case Verdict::kOk:
+const char* Word(Severity severity) {
+    switch (severity) {
+        case Severity::kOk:
             return "ok";
-        case Verdict::kWarning:
+        case Severity::kWarning:
             return "warning";
         default:
             return "failed";
@@ -34,41 +35,59 @@ const char* Word(Verdict verdict) {
 }
 
 // The tasks, with their passwords when this user may see them.
-ExitCode GetTasks(Patient& patient, ZEL::PObject& reply) {
+ZEL::PObject GetTasks(Patient& patient) {
     ZEL::PObject request;
     request["command"] = "task_list";
     request["secrets"] = 1;
-    patient.has_passwords = AskDaemon(request, reply, &patient.no_passwords) == kOk;
-    if (patient.has_passwords) {
-        return kOk;
+    try {
+        ZEL::PObject reply = AskDaemon(request);
+        patient.has_passwords = true;
+        return reply;
+    } catch (const programs::Failure& failure) {
+        patient.no_passwords = failure.what();
     }
     request["secrets"] = 0;
-    return AskDaemon(request, reply, &patient.daemon_error);
+    return AskDaemon(request);
 }
 
 void AskDaemonItself(Patient& patient) {
     DaemonConnection connection;
     ZEL::PObject request;
     request["command"] = "daemon_status";
-    patient.daemon_answers = connection.Connect() == kOk && connection.Send(request) == kOk &&
-                             connection.Receive(patient.daemon) == kOk;
-    patient.daemon_error = connection.Error();
-    patient.daemon_fault = connection.Fault();
+    try {
+        connection.Connect();
+        connection.Send(request);
+        patient.daemon = connection.Receive();
+        patient.daemon_answers = true;
+    } catch (const programs::Failure& failure) {
+        patient.daemon_error = failure.what();
+        patient.daemon_fault = connection.Fault();
+    }
+}
+
+void AskForTasks(Patient& patient) {
+    ZEL::PObject reply;
+    try {
+        reply = GetTasks(patient);
+    } catch (const programs::Failure& failure) {
+        patient.daemon_error = failure.what();
+        return;
+    }
+    for (ZEL::PObject& state : reply["tasks"].asArray()) {
+        PatientTask& task = patient.tasks.emplace_back();
+        ZEL::PObj2SyncTask(state, task.record);
+        task.state.swap(state);
+        for (const std::string& share : task.record.GetInfo().GetShareList()) {
+            patient.shares[share].insert(task.record.GetInfo().GetName());
+        }
+    }
 }
 
 Patient Examine() {
     Patient patient;
     AskDaemonItself(patient);
-    ZEL::PObject reply;
-    if (patient.daemon_answers && GetTasks(patient, reply) == kOk) {
-        for (ZEL::PObject& state : reply["tasks"].asArray()) {
-            PatientTask& task = patient.tasks.emplace_back();
-            ZEL::PObj2SyncTask(state, task.record);
-            task.state.swap(state);
-            for (const std::string& share : task.record.GetInfo().GetShareList()) {
-                patient.shares[share].insert(task.record.GetInfo().GetName());
-            }
-        }
+    if (patient.daemon_answers) {
+        AskForTasks(patient);
     }
     const TARQ::ListOwner names(KAPICSzListAlloc(64));
     if (!names || TARQShareEnum(names.get()) < 0) {
@@ -82,7 +101,7 @@ Patient Examine() {
 
 void PrintForPeople(const Findings& findings) {
     for (const Finding& finding : findings) {
-        printf("%-8s %s: %s\n", Word(finding.verdict), Printable(finding.name).c_str(),
+        printf("%-8s %s: %s\n", Word(finding.severity), Printable(finding.name).c_str(),
                Printable(finding.finding).c_str());
         if (!finding.remedy.empty()) {
             printf("         -> %s\n", Printable(finding.remedy).c_str());
@@ -109,7 +128,7 @@ std::string TasksInWords(const std::set<std::string>& names) {
     return (names.size() == 1 ? "task " : "tasks ") + joined;
 }
 
-ExitCode Doctor(bool as_json) {
+void Doctor(bool as_json) {
     Patient patient = Examine();
     Findings findings;
     for (const auto check : kChecks) {
@@ -120,16 +139,18 @@ ExitCode Doctor(bool as_json) {
     if (as_json) {
         programs::Table table({"NAME", "VERDICT", "FINDING", "REMEDY"});
         for (const Finding& finding : findings) {
-            table.Add({finding.name, Word(finding.verdict), finding.finding, finding.remedy});
+            table.Add({finding.name, Word(finding.severity), finding.finding, finding.remedy});
         }
         table.Print(true);
     } else {
         PrintForPeople(findings);
     }
     const bool failed = std::any_of(findings.begin(), findings.end(), [](const Finding& finding) {
-        return finding.verdict == Verdict::kFailed;
+        return finding.severity == Severity::kFailed;
     });
-    return failed ? kLocal : kOk;
+    if (failed) {
+        throw programs::ReportedFailure(programs::FailureKind::kLocal);
+    }
 }
 
 }  // namespace zelctl

@@ -1,11 +1,9 @@
 // Looks at all that a push needs, and says how to mend what is wrong.
 #pragma once
 
-#include "programs/zelctl/base/exit_codes.h"
-
 namespace zelctl {
 
-/// Prints what it finds; kLocal when anything fails.
-ExitCode Doctor(bool as_json);
+/// Prints what it finds; fails (kLocal) when anything of it has failed.
+void Doctor(bool as_json);
 
 }  // namespace zelctl

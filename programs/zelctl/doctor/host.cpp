@@ -34,7 +34,7 @@ constexpr uint64_t kFewInodes = 1000;
 constexpr uint64_t kFewInstances = 16;
 
 void AddFact(Findings& findings, const std::string& name, const std::string& finding) {
-    findings.push_back({name, Verdict::kOk, finding, ""});
+    findings.push_back({name, Severity::kOk, finding, ""});
 }
 
 /// A number of /proc/sys; 0 when it cannot be read.
@@ -106,11 +106,11 @@ void CheckRsync(const Patient&, Findings& findings) {
     const ChildOutput answer = RunAndRead({program, "--version"});
     std::string version;
     if (!answer.failure.empty()) {
-        findings.push_back({"rsync", Verdict::kFailed, answer.failure,
+        findings.push_back({"rsync", Severity::kFailed, answer.failure,
                             std::string("install rsync ") + kNeededRsync +
                                 " or later, or name it with 'rsync' in tarqrsync.conf"});
     } else if (!IsUsableRsync(answer.output, version)) {
-        findings.push_back({"rsync", Verdict::kFailed,
+        findings.push_back({"rsync", Severity::kFailed,
                             version.empty() ? program + " does not say what version it is"
                                             : program + " is version " + version,
                             std::string("install rsync ") + kNeededRsync + " or later"});
@@ -125,7 +125,7 @@ void CheckSSH(const Patient& patient, Findings& findings) {
     if (!path.empty()) {
         AddFact(findings, "ssh", path);
     } else if (patient.UsesSSH()) {
-        findings.push_back({"ssh", Verdict::kFailed, program + " is not there, and tasks use it",
+        findings.push_back({"ssh", Severity::kFailed, program + " is not there, and tasks use it",
                             "install openssh-client, or name it with 'ssh' in tarqrsync.conf"});
     } else {
         AddFact(findings, "ssh", "not there; no task uses it");
@@ -137,12 +137,12 @@ void CheckClock(const Patient&, Findings& findings) {
     const std::string shown = programs::HumanTime(now);
     const std::string state = TARQ::RootPath("/run/systemd/timesync");
     if (now < kFirstSaneTime) {
-        findings.push_back({"clock", Verdict::kFailed, "it shows " + shown,
+        findings.push_back({"clock", Severity::kFailed, "it shows " + shown,
                             "set the clock (timedatectl set-time), or let it be set: timedatectl "
                             "set-ntp true"});
     } else if (access(state.c_str(), F_OK) == 0 &&
                access((state + "/synchronized").c_str(), F_OK) != 0) {
-        findings.push_back({"clock", Verdict::kWarning, shown + ", not yet set over the network",
+        findings.push_back({"clock", Severity::kWarning, shown + ", not yet set over the network",
                             "timedatectl set-ntp true, and check that a time server is reachable"});
     } else {
         AddFact(findings, "clock", shown);
@@ -153,7 +153,7 @@ void CheckWatches(const Patient& patient, Findings& findings) {
     const uint64_t limit = KernelNumber("/proc/sys/fs/inotify/max_user_watches");
     const uint64_t instances = KernelNumber("/proc/sys/fs/inotify/max_user_instances");
     if (limit == 0) {
-        findings.push_back({"watches", Verdict::kWarning, "the kernel tells no limit of watches",
+        findings.push_back({"watches", Severity::kWarning, "the kernel tells no limit of watches",
                             "on-change tasks need a kernel with inotify"});
         return;
     }
@@ -165,7 +165,7 @@ void CheckWatches(const Patient& patient, Findings& findings) {
     // The kernel keeps some for others, and folders come faster than people look.
     if (folders >= limit - limit / 10) {
         findings.push_back(
-            {"watches", folders >= limit ? Verdict::kFailed : Verdict::kWarning, counted,
+            {"watches", folders >= limit ? Severity::kFailed : Severity::kWarning, counted,
              "sysctl fs.inotify.max_user_watches=" + std::to_string(folders * 2) +
                  " (and a line of that in /etc/sysctl.d/ to keep it): folders that are not "
                  "watched are compared every so often instead"});
@@ -173,7 +173,7 @@ void CheckWatches(const Patient& patient, Findings& findings) {
         AddFact(findings, "watches", counted);
     }
     if (instances < kFewInstances) {
-        findings.push_back({"watch instances", Verdict::kWarning,
+        findings.push_back({"watch instances", Severity::kWarning,
                             "at most " + std::to_string(instances) + " of each user",
                             "sysctl fs.inotify.max_user_instances=128"});
     }
@@ -187,7 +187,7 @@ void CheckSpace(const Patient& patient, Findings& findings) {
         if (statvfs(folder.c_str(), &info) != 0) {
             // The daemon makes the store's folder when it starts first.
             const bool missing = errno == ENOENT;
-            findings.push_back({name, missing ? Verdict::kWarning : Verdict::kFailed,
+            findings.push_back({name, missing ? Severity::kWarning : Severity::kFailed,
                                 strerror(errno),
                                 missing ? "start the daemon once: systemctl start zel_daemon"
                                         : "check the folder and its disk"});
@@ -203,7 +203,7 @@ void CheckSpace(const Patient& patient, Findings& findings) {
             AddFact(findings, name, finding);
         } else {
             const bool none = free < kNoSpace || (few_inodes && info.f_favail == 0);
-            findings.push_back({name, none ? Verdict::kFailed : Verdict::kWarning, finding,
+            findings.push_back({name, none ? Severity::kFailed : Severity::kWarning, finding,
                                 "remove files that nobody needs from this file system"});
         }
     }

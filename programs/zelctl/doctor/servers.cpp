@@ -169,11 +169,11 @@ std::set<std::string> CheckServers(const Patient& patient, Findings& findings) {
         const std::string name = "server " + endpoint.Shown();
         const std::string users = " (" + TasksInWords(endpoint.tasks) + ")";
         if (endpoint.reached) {
-            findings.push_back({name, Verdict::kOk, "answers" + users, ""});
+            findings.push_back({name, Severity::kOk, "answers" + users, ""});
         } else {
             cut_off.insert(endpoint.tasks.begin(), endpoint.tasks.end());
             findings.push_back(
-                {name, Verdict::kFailed, endpoint.fault + users,
+                {name, Severity::kFailed, endpoint.fault + users,
                  std::string("check the name, the network and the firewall; at the server: ") +
                      (endpoint.ssh ? "is sshd running?" : "zel_server status")});
         }

@@ -63,7 +63,7 @@ void CheckFile(const std::string& path, bool secret, size_t& looked_at, Findings
     if (stat(path.c_str(), &info) != 0) {
         if (errno != ENOENT) {
             findings.push_back(
-                {"file " + path, Verdict::kWarning, strerror(errno), "run the doctor as root"});
+                {"file " + path, Severity::kWarning, strerror(errno), "run the doctor as root"});
         }
         return;
     }
@@ -72,7 +72,7 @@ void CheckFile(const std::string& path, bool secret, size_t& looked_at, Findings
     if (!fault.empty()) {
         const std::string mode =
             S_ISDIR(info.st_mode) ? (secret ? "0700" : "0755") : (secret ? "0600" : "0644");
-        findings.push_back({"file " + path, Verdict::kFailed,
+        findings.push_back({"file " + path, Severity::kFailed,
                             fault + (secret ? "; it holds secrets" : "; others may change it"),
                             "chown root '" + path + "' && chmod " + mode + " '" + path + "'"});
     }
@@ -100,23 +100,23 @@ std::vector<std::string> KeyFiles(const std::string& name) {
 void CheckCatalogue(const Patient& patient, Findings& findings) {
     const std::string path = TARQ::RootPath(kCatalogue);
     if (!patient.catalogue_error.empty()) {
-        findings.push_back({"share catalogue", Verdict::kFailed,
+        findings.push_back({"share catalogue", Severity::kFailed,
                             path + ": " + patient.catalogue_error,
                             "make it readable; its form is in share-catalogue.md"});
     } else if (patient.shares.empty()) {
-        findings.push_back({"share catalogue", Verdict::kWarning, "it has no shares",
+        findings.push_back({"share catalogue", Severity::kWarning, "it has no shares",
                             "zelctl share add NAME FOLDER, or zelctl share import --samba"});
     }
     for (const auto& [name, tasks] : patient.shares) {
         const std::string fault = programs::ShareProblem(name);
         const std::string users = tasks.empty() ? "" : " (" + TasksInWords(tasks) + ")";
         if (fault.empty()) {
-            findings.push_back({"share " + name, Verdict::kOk, "ready" + users, ""});
+            findings.push_back({"share " + name, Severity::kOk, "ready" + users, ""});
         } else {
             // One that no task sends hurts nobody yet.
             findings.push_back({"share " + name,
-                                tasks.empty() ? Verdict::kWarning : Verdict::kFailed, fault + users,
-                                RemedyOfShare(name)});
+                                tasks.empty() ? Severity::kWarning : Severity::kFailed,
+                                fault + users, RemedyOfShare(name)});
         }
     }
 }
@@ -144,7 +144,7 @@ void CheckFiles(const Patient& patient, Findings& findings) {
     }
     if (findings.size() == before) {
         findings.push_back(
-            {"files", Verdict::kOk,
+            {"files", Severity::kOk,
              "owner and mode of " + programs::Count(looked_at, "file") + " looked at, none to mend",
              ""});
     }

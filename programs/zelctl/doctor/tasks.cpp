@@ -104,12 +104,12 @@ std::string RemedyOfRefusal(const programs::RunFailure& verdict, const PatientTa
 void CheckAnswer(const programs::RunFailure& verdict, bool skipped, const PatientTask& task,
                  Findings& found) {
     if (skipped) {
-        found.push_back({"", Verdict::kFailed,
+        found.push_back({"", Severity::kFailed,
                          "its server was not asked: it gave no answer for another task",
                          "see that task"});
     } else if (!verdict.Ok()) {
         found.push_back(
-            {"", Verdict::kFailed, OneLine(verdict.error), RemedyOfRefusal(verdict, task)});
+            {"", Severity::kFailed, OneLine(verdict.error), RemedyOfRefusal(verdict, task)});
     }
 }
 
@@ -120,12 +120,12 @@ void CheckWatch(const PatientTask& task, Findings& found) {
     }
     const std::string problem = state["watch_problem"].asString();
     if (state["watched_folders"].asUInt64() == 0) {
-        found.push_back({"", Verdict::kFailed,
+        found.push_back({"", Severity::kFailed,
                          "nothing of it is watched" + (problem.empty() ? "" : ": " + problem),
                          "until its folders can be watched, a change is sent only with the next "
                          "whole comparison; see also the findings about its shares"});
     } else if (!state["watch_complete"].asBool()) {
-        found.push_back({"", Verdict::kFailed, "not all of it is watched: " + problem,
+        found.push_back({"", Severity::kFailed, "not all of it is watched: " + problem,
                          "changes in the other folders are sent only with the next whole "
                          "comparison"});
     }
@@ -141,7 +141,7 @@ void CheckLastRun(const PatientTask& task, Findings& found) {
             ? "it is tried again in " + programs::HumanDuration(state["retry_in"].asUInt64())
             : "it is not tried again by itself: zelctl task run " +
                   Quoted(task.record.GetInfo().GetName());
-    found.push_back({"", Verdict::kFailed,
+    found.push_back({"", Severity::kFailed,
                      "its last run failed at " + programs::HumanTime(state["last_end"].asInt64()) +
                          ": " + OneLine(state["last_error"].asString()),
                      retry});
@@ -151,7 +151,7 @@ void CheckLastRun(const PatientTask& task, Findings& found) {
 void CheckNote(const PatientTask& task, Findings& found) {
     const std::string note = task.state["note"].asString();
     if (!note.empty() && note != task.state["watch_problem"].asString()) {
-        found.push_back({"", Verdict::kWarning, note, "see the daemon's log"});
+        found.push_back({"", Severity::kWarning, note, "see the daemon's log"});
     }
 }
 
@@ -180,7 +180,7 @@ void CheckTasks(const Patient& patient, Findings& findings) {
         }
     }
     if (!patient.tasks.empty() && !patient.has_passwords) {
-        findings.push_back({"accounts", Verdict::kWarning,
+        findings.push_back({"accounts", Severity::kWarning,
                             "whether the servers take the accounts and shares was not checked: " +
                                 patient.no_passwords,
                             "run the doctor as root"});
@@ -198,7 +198,7 @@ void CheckTasks(const Patient& patient, Findings& findings) {
         CheckLastRun(task, found);
         CheckNote(task, found);
         if (found.empty()) {
-            found.push_back({"", Verdict::kOk, WellWords(task, was_asked), ""});
+            found.push_back({"", Severity::kOk, WellWords(task, was_asked), ""});
         }
         for (Finding& finding : found) {
             finding.name = "task " + task.record.GetInfo().GetName();

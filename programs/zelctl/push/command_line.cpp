@@ -4,7 +4,7 @@
 
 namespace zelctl {
 
-void DeclarePair(CLI::App& pair, ExitCode& result) {
+void DeclarePair(CLI::App& pair) {
     static ConnectionOptions connection;
     static std::vector<std::string> shares;
     pair.require_subcommand(1);
@@ -12,10 +12,10 @@ void DeclarePair(CLI::App& pair, ExitCode& result) {
         pair.add_subcommand("check", "Ask whether the server would take shares from this client");
     check->add_option("shares", shares, "The shares")->required();
     connection.AddTo(check);
-    check->callback([&result] { result = CheckPairing(connection, shares); });
+    check->callback([] { CheckPairing(connection, shares); });
 }
 
-void DeclarePush(CLI::App& push, ExitCode& result) {
+void DeclarePush(CLI::App& push) {
     static PushOptions options;
     push.add_option("shares", options.shares, "The shares")->required();
     options.connection.AddTo(&push);
@@ -33,10 +33,10 @@ void DeclarePush(CLI::App& push, ExitCode& result) {
         ->check(programs::WholeNumber());
     push.add_flag("-n,--dry-run", options.dry_run, "Only list what would be sent and deleted");
     push.add_flag("-q,--quiet", options.quiet, "Say nothing but errors");
-    push.callback([&result] { result = Push(options); });
+    push.callback([] { Push(options); });
 }
 
-void DeclareNext(CLI::App& next, ExitCode& result) {
+void DeclareNext(CLI::App& next) {
     static NextOptions options;
     next.add_option("--mode", options.mode, "manual, realtime, weekly, monthly, yearly or once")
         ->capture_default_str();
@@ -64,7 +64,7 @@ void DeclareNext(CLI::App& next, ExitCode& result) {
                     "Moment to count from, 'YYYY-MM-DD HH:MM' (now unless given)")
         ->option_text("MOMENT");
     next.add_flag("--json", options.as_json, "Write JSON, for programs");
-    next.callback([&result] { result = ShowNextRuns(options); });
+    next.callback([] { ShowNextRuns(options); });
 }
 
 }  // namespace zelctl

@@ -1,10 +1,12 @@
 #include "programs/zelctl/push/push.h"
 
 #include "ZEL/zel.h"
+#include "programs/common/failure.h"
 #include "programs/common/task_run.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "programs/zelctl/base/prepare.h"
+#include "programs/zelctl/base/run_failure.h"
 #include "programs/zelctl/push/progress.h"
 #include "programs/zelctl/share/commands.h"
 
@@ -12,55 +14,53 @@ namespace zelctl {
 
 namespace {
 
-using programs::RunFailure;
+using programs::Failure;
+using programs::FailureKind;
 using programs::RunOrder;
 using programs::RunTotals;
 using programs::TaskRun;
 using TARQ::Backup::RunChange;
 
-ExitCode Tell(const RunFailure& verdict) {
-    return verdict.Ok() ? kOk : Fail(CodeOf(verdict.trouble), "%s", verdict.error.c_str());
+void Require(const programs::RunFailure& ended) {
+    if (!ended.Ok()) {
+        throw Failure(KindOf(ended.trouble), ended.error, ended.status);
+    }
 }
 
 // A path that a person names has to be there: it is a slip of the pen, not a deletion.
-ExitCode CheckPath(const PushOptions& options) {
+void CheckPath(const PushOptions& options) {
     for (const std::string& share : options.shares) {
         ZEL::ShareInfo facts;
         if (ZEL::GetShareInfo(share, facts) != 0 ||
             !ZEL::IsPathExist(facts.GetModulePath() + options.path)) {
-            return Fail(kLocal, "share '%s' has no %s", programs::Printable(share).c_str(),
-                        programs::Printable(options.path).c_str());
+            throw Failure(FailureKind::kLocal, "share '" + programs::Printable(share) +
+                                                   "' has no " + programs::Printable(options.path));
         }
     }
-    return kOk;
 }
 
 // What every command does before it speaks to the server.
-ExitCode Prepare(const PushOptions& options, ZEL::SyncInfo& info) {
-    ExitCode result = PrepareHost();
+ZEL::SyncInfo Prepare(const PushOptions& options) {
+    PrepareHost();
     // Of several shares to push those that are fit are pushed; a push of one asks for no password
     // in vain.
-    if (result == kOk && (options.dry_run || options.shares.size() == 1)) {
-        result = CheckShares(options.shares);
+    if (options.dry_run || options.shares.size() == 1) {
+        CheckShares(options.shares);
     }
-    if (result == kOk && options.path != "/") {
-        result = CheckPath(options);
+    if (options.path != "/") {
+        CheckPath(options);
     }
-    if (result == kOk && options.info) {
-        info = *options.info;
-    } else if (result == kOk) {
-        result = options.connection.ToSyncInfo(info);
+    ZEL::SyncInfo info = options.info ? *options.info : options.connection.ToSyncInfo();
+    if (!options.info) {
         info.SetMaxBandwidth(options.bandwidth_limit);
     }
-    if (result == kOk) {
-        WatchForInterrupt();
-    }
-    return result;
+    WatchForInterrupt();
+    return info;
 }
 
-RunFailure Connect(TaskRun& run, const std::vector<std::string>& shares) {
-    RunFailure verdict = run.Connect();
-    return verdict.Ok() ? run.CheckPairing(shares) : verdict;
+void Connect(TaskRun& run, const std::vector<std::string>& shares) {
+    Require(run.Connect());
+    Require(run.CheckPairing(shares));
 }
 
 /// Prints what a push would do, and a sum a share.
@@ -97,30 +97,22 @@ private:
     bool missing_ = false;
 };
 
-ExitCode ListChanges(TaskRun& run, const RunOrder& order) {
+void ListChanges(TaskRun& run, const RunOrder& order) {
     for (const programs::ShareOrder& share : order.shares) {
         ChangeList list;
         RunOrder alone = order;
         alone.shares = {share};
-        const RunFailure verdict = run.List(
+        Require(run.List(
             alone, [&](const std::string&, const RunChange& change) { list.Add(change); },
-            [&](const std::string& name) { list.AddMissing(name); });
-        if (!verdict.Ok()) {
-            return Tell(verdict);
-        }
+            [&](const std::string& name) { list.AddMissing(name); }));
         list.Sum(share.share);
     }
-    return kOk;
 }
 
 }  // namespace
 
-ExitCode Push(const PushOptions& options) {
-    ZEL::SyncInfo info;
-    const ExitCode prepared = Prepare(options, info);
-    if (prepared != kOk) {
-        return prepared;
-    }
+void Push(const PushOptions& options) {
+    const ZEL::SyncInfo info = Prepare(options);
     ProgressDisplay display(options.quiet);
     programs::RunListener listener;
     listener.on_progress = [&](const std::string& share, const auto& progress) {
@@ -146,31 +138,24 @@ ExitCode Push(const PushOptions& options) {
         order.shares.push_back({share, {options.path}});
     }
     if (options.dry_run) {
-        const RunFailure verdict = Connect(run, options.shares);
-        return verdict.Ok() ? ListChanges(run, order) : Tell(verdict);
+        Connect(run, options.shares);
+        ListChanges(run, order);
+        return;
     }
     RunTotals totals;
     const programs::RunResult result = run.Push(order, totals);
     display.Clear();
-    return Tell(result.verdict);
+    Require(result.verdict);
 }
 
-ExitCode CheckPairing(const ConnectionOptions& connection, const std::vector<std::string>& shares) {
+void CheckPairing(const ConnectionOptions& connection, const std::vector<std::string>& shares) {
     PushOptions options;
     options.connection = connection;
     options.shares = shares;
     options.dry_run = true;
-    ZEL::SyncInfo info;
-    const ExitCode prepared = Prepare(options, info);
-    if (prepared != kOk) {
-        return prepared;
-    }
-    TaskRun run(info, Interrupted());
-    const RunFailure verdict = Connect(run, shares);
-    if (verdict.Ok()) {
-        puts("The server would take these shares from this client.");
-    }
-    return Tell(verdict);
+    TaskRun run(Prepare(options), Interrupted());
+    Connect(run, shares);
+    puts("The server would take these shares from this client.");
 }
 
 }  // namespace zelctl

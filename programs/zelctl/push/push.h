@@ -22,9 +22,9 @@ struct PushOptions {
 
 /// Finds the server, pairs when needed, and pushes share after share. Stops at the first that
 /// fails.
-ExitCode Push(const PushOptions& options);
+void Push(const PushOptions& options);
 
 /// Asks whether the server would take these shares from this client. Changes nothing.
-ExitCode CheckPairing(const ConnectionOptions& connection, const std::vector<std::string>& shares);
+void CheckPairing(const ConnectionOptions& connection, const std::vector<std::string>& shares);
 
 }  // namespace zelctl

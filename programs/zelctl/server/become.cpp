@@ -7,10 +7,11 @@
 #include <filesystem>
 
 #include "base/child_process.h"
+#include "programs/common/failure.h"
 
 namespace zelctl {
 
-ExitCode BecomeServer(const std::vector<std::string>& arguments) {
+void BecomeServer(const std::vector<std::string>& arguments) {
     std::vector<std::string> command = {"zel_server"};
     command.insert(command.end(), arguments.begin(), arguments.end());
     const std::vector<char*> words = base::ArgumentVector(command);
@@ -19,8 +20,9 @@ ExitCode BecomeServer(const std::vector<std::string>& arguments) {
     const std::filesystem::path own = std::filesystem::read_symlink("/proc/self/exe", error);
     execv((own.parent_path() / command[0]).c_str(), words.data());
     execvp(command[0].c_str(), words.data());
-    return Fail(kLocal, "zel_server cannot be started: %s; is the package zel-server installed?",
-                strerror(errno));
+    throw programs::Failure(programs::FailureKind::kLocal,
+                            std::string("zel_server cannot be started: ") + strerror(errno) +
+                                "; is the package zel-server installed?");
 }
 
 }  // namespace zelctl

@@ -2,6 +2,7 @@
 
 #include <arpa/inet.h>
 
+#include "programs/common/failure.h"
 #include "programs/common/help.h"
 #include "programs/common/terminal.h"
 
@@ -35,22 +36,22 @@ void ConnectionOptions::AddTo(CLI::App* command) {
     command->add_flag("--delta", delta, "Send only the changed blocks of files");
 }
 
-ExitCode ConnectionOptions::ToSyncInfo(ZEL::SyncInfo& info) const {
-    std::string error;
-    const auto password = programs::ReadPassword(
-        password_file, "Password of " + user + " on " + server + ": ", error);
-    if (!password) {
-        return Fail(kUsage, "%s", error.c_str());
-    }
+ZEL::SyncInfo ConnectionOptions::ToSyncInfo() const {
+    ZEL::SyncInfo info;
     SetServer(server, info);
     info.SetUser(user);
-    info.SetPassword(*password);
+    info.SetPassword(
+        programs::ReadPassword(password_file, "Password of " + user + " on " + server + ": "));
     info.SetSSH(ssh);
     info.SetSSHPort(ssh_port);
     info.SetRsyncTimeout(timeout);
     info.SetCompression(compress);
     info.SetBlockLevelSync(delta);
-    return info.Validate() ? kOk : Fail(kUsage, "the server or the account is not given");
+    if (!info.Validate()) {
+        throw programs::Failure(programs::FailureKind::kUsage,
+                                "the server or the account is not given");
+    }
+    return info;
 }
 
 void SetServer(const std::string& server, ZEL::SyncInfo& info) {

@@ -4,7 +4,6 @@
 #include <string>
 
 #include "ZEL/sync_obj.h"
-#include "programs/zelctl/base/exit_codes.h"
 
 namespace CLI {
 class App;
@@ -24,8 +23,8 @@ struct ConnectionOptions {
 
     void AddTo(CLI::App* command);
 
-    /// Fills `info`, asking for the password where needed.
-    ExitCode ToSyncInfo(ZEL::SyncInfo& info) const;
+    /// Asks for the password where needed.
+    ZEL::SyncInfo ToSyncInfo() const;
 };
 
 /// Enters `server` as the address or the name that it is, and forgets the other.

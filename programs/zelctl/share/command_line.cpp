@@ -6,7 +6,7 @@ namespace zelctl {
 
 namespace {
 
-void DeclareShareImport(CLI::App& share, ExitCode& result) {
+void DeclareShareImport(CLI::App& share) {
     static std::string config;
     static std::vector<std::string> names;
     static bool samba = false;
@@ -19,13 +19,13 @@ void DeclareShareImport(CLI::App& share, ExitCode& result) {
     import->add_flag("-n,--dry-run", dry_run, "Only say what would be done");
     import->add_option("names", names, "Only these");
     import->footer("Shares that are in the catalogue already stay as they are.");
-    import->callback([&result] { result = ImportSambaShares(config, names, dry_run);
+    import->callback([] { ImportSambaShares(config, names, dry_run);
 });
 }  // namespace
 
 }  // namespace zelctl
 
-void DeclareShare(CLI::App& share, ExitCode& result) {
+void DeclareShare(CLI::App& share) {
     share.require_subcommand(1);
     static std::string name;
     static std::string path;
@@ -39,26 +39,26 @@ void DeclareShare(CLI::App& share, ExitCode& result) {
     add->add_option("folder", path, "The folder")->required();
     add->add_flag("--acl", acl, "Its files carry access control lists");
     add->add_flag("--windows", windows, "It is shared with Windows clients");
-    add->callback([&result] { result = AddShare(name, path, acl, windows); });
+    add->callback([] { AddShare(name, path, acl, windows); });
 
     static bool yes = false;
     CLI::App* const confirm = share.add_subcommand(
         "confirm", "Say that the folder that is there now is the share's, after it was replaced");
     confirm->add_option("name", name, "The share's name")->required();
     confirm->add_flag("-y,--yes", yes, "Do not ask");
-    confirm->callback([&result] { result = ConfirmShare(name, yes); });
+    confirm->callback([] { ConfirmShare(name, yes); });
 
     CLI::App* const list = share.add_subcommand("list", "List the shares");
     list->add_flag("--json", as_json, "Write JSON, for programs");
-    list->callback([&result] { result = ListShares(as_json); });
+    list->callback([] { ListShares(as_json); });
 
     CLI::App* const remove =
         share.add_subcommand("rm", "Take a share out of the catalogue; its files stay");
     remove->add_option("name", name, "The share's name")->required();
     remove->add_flag("--force", force, "Even when tasks send it");
-    remove->callback([&result] { result = RemoveShare(name, force); });
+    remove->callback([] { RemoveShare(name, force); });
 
-    DeclareShareImport(share, result);
+    DeclareShareImport(share);
 }
 
 }  // namespace zelctl

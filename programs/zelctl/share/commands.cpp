@@ -4,6 +4,7 @@
 #include <filesystem>
 #include <set>
 
+#include "programs/common/failure.h"
 #include "programs/common/table.h"
 #include "programs/common/task_run.h"
 #include "programs/common/text.h"
@@ -17,6 +18,9 @@ namespace zelctl {
 
 namespace {
 
+using programs::Failure;
+using programs::FailureKind;
+using programs::Printable;
 using TARQ::ShareOwner;
 
 ShareOwner GetShare(const std::string& name) {
@@ -35,11 +39,9 @@ std::set<std::string> TasksWith(const std::string& share) {
     ZEL::PObject request;
     request["command"] = "task_list";
     request["brief"] = 1;
-    ZEL::PObject reply;
-    std::string ignored;
     std::set<std::string> names;
-    if (AskDaemon(request, reply, &ignored) == kOk) {
-        for (const ZEL::PObject& task : reply["tasks"].asArray()) {
+    if (std::optional<ZEL::PObject> reply = TryToAskDaemon(request)) {
+        for (const ZEL::PObject& task : (*reply)["tasks"].asArray()) {
             const ZEL::PObject::Array& shares = task["share_list"].asArray();
             if (std::any_of(shares.begin(), shares.end(),
                             [&](const ZEL::PObject& used) { return used.asString() == share; })) {
@@ -52,11 +54,8 @@ std::set<std::string> TasksWith(const std::string& share) {
 
 }  // namespace
 
-ExitCode AddShare(const std::string& name, const std::string& path, bool acl, bool windows) {
-    const ExitCode prepared = PrepareHost();
-    if (prepared != kOk) {
-        return prepared;
-    }
+void AddShare(const std::string& name, const std::string& path, bool acl, bool windows) {
+    PrepareHost();
     std::error_code error;
     const std::string absolute = std::filesystem::absolute(path, error).lexically_normal();
     unsigned int flags = 0;
@@ -67,49 +66,43 @@ ExitCode AddShare(const std::string& name, const std::string& path, bool acl, bo
         flags |= TARQ_SHARE_WINDOWS;
     }
     const std::string unseen = DaemonsViewOf(absolute);
+    const std::string shown = "'" + Printable(name) + "' at " + Printable(absolute);
     if (!unseen.empty()) {
-        return Fail(kLocal, "cannot add '%s' at %s: %s", programs::Printable(name).c_str(),
-                    programs::Printable(absolute).c_str(), unseen.c_str());
+        throw Failure(FailureKind::kLocal, "cannot add " + shown + ": " + unseen);
     }
     if (TARQShareAdd(name.c_str(), absolute.c_str(), flags) < 0) {
-        if (KAPICErrGet() == TARQ_ERR_BAD_PARAMETER) {
-            return Fail(
-                kLocal,
-                "'%s' at %s cannot be a share: a name has 1 to 80 bytes, none of / : \" or a "
-                "control "
-                "character, and begins with neither a dot, an @ nor a blank; the folder is not /",
-                programs::Printable(name).c_str(), programs::Printable(absolute).c_str());
-        }
-        return Fail(kLocal, "cannot add '%s' at %s: %s", programs::Printable(name).c_str(),
-                    programs::Printable(absolute).c_str(), LastError().c_str());
+        throw Failure(FailureKind::kLocal,
+                      KAPICErrGet() == TARQ_ERR_BAD_PARAMETER
+                          ? shown +
+                                " cannot be a share: a name has 1 to 80 bytes, none of / : \" or a "
+                                "control character, and begins with neither a dot, an @ nor a "
+                                "blank; the folder is not /"
+                          : "cannot add " + shown + ": " + LastError());
     }
     printf("Share '%s' is %s\n", name.c_str(), absolute.c_str());
-    return kOk;
 }
 
-ExitCode RemoveShare(const std::string& name, bool force) {
+void RemoveShare(const std::string& name, bool force) {
     const std::set<std::string> users = force ? std::set<std::string>() : TasksWith(name);
     if (!users.empty()) {
-        return Fail(kLocal,
-                    "share '%s' is sent by %s: take it out of there first ('zelctl task edit' or "
-                    "'rm'), or give --force",
-                    programs::Printable(name).c_str(),
-                    programs::Printable(TasksInWords(users)).c_str());
+        throw Failure(FailureKind::kLocal,
+                      "share '" + Printable(name) + "' is sent by " +
+                          Printable(TasksInWords(users)) +
+                          ": take it out of there first ('zelctl task edit' or 'rm'), or give "
+                          "--force");
     }
     if (TARQShareRemove(name.c_str()) < 0) {
-        return Fail(kLocal, "cannot remove '%s': %s", programs::Printable(name).c_str(),
-                    LastError().c_str());
+        throw Failure(FailureKind::kLocal,
+                      "cannot remove '" + Printable(name) + "': " + LastError());
     }
     printf("Share '%s' is no longer in the catalogue; its files and its copy stay.\n",
            name.c_str());
-    return kOk;
 }
 
-std::optional<std::vector<std::string>> ShareNames() {
+std::vector<std::string> ShareNames() {
     const TARQ::ListOwner list(KAPICSzListAlloc(64));
     if (!list || TARQShareEnum(list.get()) < 0) {
-        Fail(kLocal, "cannot read the share catalogue: %s", LastError().c_str());
-        return std::nullopt;
+        throw Failure(FailureKind::kLocal, "cannot read the share catalogue: " + LastError());
     }
     std::vector<std::string> names;
     const int count = KAPICSzListCount(list.get());
@@ -120,30 +113,25 @@ std::optional<std::vector<std::string>> ShareNames() {
     return names;
 }
 
-ExitCode ListShares(bool as_json) {
-    const auto names = ShareNames();
-    if (!names) {
-        return kLocal;
-    }
+void ListShares(bool as_json) {
+    const std::vector<std::string> names = ShareNames();
     programs::Table table({"SHARE", "STATE", "FOLDER", "PROBLEM"});
-    for (const std::string& name : *names) {
+    for (const std::string& name : names) {
         const ShareOwner share = GetShare(name);
         const bool known = share && share->path != nullptr;
         table.Add({name, share ? "ready" : "not ready", known ? share->path : "",
                    share ? "" : LastError()});
     }
     table.Print(as_json);
-    return kOk;
 }
 
-ExitCode CheckShares(const std::vector<std::string>& names) {
+void CheckShares(const std::vector<std::string>& names) {
     for (const std::string& name : names) {
         const std::string problem = programs::ShareProblem(name);
         if (!problem.empty()) {
-            return Fail(kLocal, "%s", problem.c_str());
+            throw Failure(FailureKind::kLocal, problem);
         }
     }
-    return kOk;
 }
 
 }  // namespace zelctl

@@ -9,6 +9,7 @@
 #include <iostream>
 #include <string_view>
 
+#include "programs/common/failure.h"
 #include "programs/common/seen_folder.h"
 #include "programs/common/table.h"
 #include "programs/common/text.h"
@@ -22,6 +23,8 @@ namespace zelctl {
 
 namespace {
 
+using programs::Failure;
+using programs::FailureKind;
 using programs::Printable;
 
 /// A fact of the catalogue, and how people call it.
@@ -76,22 +79,19 @@ bool AskPerson() {
     return answer == "y" || answer == "Y" || answer == "yes";
 }
 
-ExitCode NotConfirmed(const std::string& name) {
-    return Fail(kLocal, "cannot confirm share '%s': %s", Printable(name).c_str(),
-                KAPICErrText(KAPICErrGet()));
+Failure NotConfirmed(const std::string& name) {
+    return {FailureKind::kLocal,
+            "cannot confirm share '" + Printable(name) + "': " + KAPICErrText(KAPICErrGet())};
 }
 
-ExitCode TellDaemon(const std::string& path) {
+void TellDaemon(const std::string& path) {
     const std::string unseen = DaemonsViewOf(path);
     if (!unseen.empty()) {
-        return Fail(kLocal, "%s: %s", Printable(path).c_str(), unseen.c_str());
+        throw Failure(FailureKind::kLocal, Printable(path) + ": " + unseen);
     }
     ZEL::PObject request;
-    ZEL::PObject reply;
-    std::string ignored;  // a daemon that does not run finds it when it starts
     request["command"] = "reload";
-    AskDaemon(request, reply, &ignored);
-    return kOk;
+    TryToAskDaemon(request);  // one that does not run finds it when it starts
 }
 
 }  // namespace
@@ -102,15 +102,14 @@ std::string DaemonsViewOf(const std::string& path) {
         return "";  // whoever uses the folder finds that, and says why
     }
     ZEL::PObject request;
-    ZEL::PObject reply;
     request["command"] = "share_check";
     request["path"] = path;
     request["device"] = static_cast<unsigned long long>(seen->device);
     request["inode"] = static_cast<unsigned long long>(seen->inode);
     request["volume"] = seen->volume;
-    std::string ignored;  // one that does not run, or may not be asked, is no witness
-    AskDaemon(request, reply, &ignored);
-    const std::string problem = reply["problem"].asString();
+    // One that does not run, or may not be asked, is no witness.
+    const std::optional<ZEL::PObject> reply = TryToAskDaemon(request);
+    const std::string problem = reply ? (*reply)["problem"].asString() : "";
     return problem.empty()
                ? ""
                : "the daemon would not push this folder: " + Printable(problem) +
@@ -119,19 +118,20 @@ std::string DaemonsViewOf(const std::string& path) {
                      "read the folder";
 }
 
-ExitCode ConfirmShare(const std::string& name, bool yes) {
+void ConfirmShare(const std::string& name, bool yes) {
     const TARQ::HashOwner recorded(KAPICSzHashAlloc(8));
     const TARQ::HashOwner now(KAPICSzHashAlloc(8));
     const int same =
         recorded && now ? TARQShareFactsGet(name.c_str(), recorded.get(), now.get()) : -1;
     if (same < 0) {
-        return NotConfirmed(name);
+        throw NotConfirmed(name);
     }
     const std::string path = ValueOf(now, "path");
     if (same == 1) {
         printf("Share '%s' is the folder that was recorded, %s: there is nothing to confirm.\n",
                Printable(name).c_str(), Printable(path).c_str());
-        return TellDaemon(path);
+        TellDaemon(path);
+        return;
     }
     printf("Share '%s' is %s:\n\n", Printable(name).c_str(), Printable(path).c_str());
     ShowFacts(recorded, now);
@@ -139,17 +139,18 @@ ExitCode ConfirmShare(const std::string& name, bool yes) {
            IsEmptyFolder(path) ? ", which is NOTHING: it deletes the whole copy" : "",
            ValueOf(recorded, "volume") == ValueOf(now, "volume") ? "" : " Is its disk mounted?");
     if (!yes && isatty(STDIN_FILENO) == 0) {
-        return Fail(kUsage, "nobody to ask: say --yes when it is the right folder");
+        throw Failure(FailureKind::kUsage, "nobody to ask: say --yes when it is the right folder");
     }
     if (!yes && !AskPerson()) {
-        return Fail(kCancelled, "share '%s' stays as it was recorded; nothing of it is pushed",
-                    Printable(name).c_str());
+        throw Failure(
+            FailureKind::kCancelled,
+            "share '" + Printable(name) + "' stays as it was recorded; nothing of it is pushed");
     }
     if (TARQShareConfirm(name.c_str(), now.get()) < 0) {
-        return NotConfirmed(name);
+        throw NotConfirmed(name);
     }
     printf("Share '%s' is this folder from now on.\n", Printable(name).c_str());
-    return TellDaemon(path);
+    TellDaemon(path);
 }
 
 }  // namespace zelctl

@@ -13,6 +13,7 @@
 
 #include "base/section_view.h"
 #include "base/text.h"
+#include "programs/common/failure.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/child_output.h"
 #include "programs/zelctl/share/commands.h"
@@ -23,6 +24,8 @@ namespace zelctl {
 
 namespace {
 
+using programs::Failure;
+using programs::FailureKind;
 using programs::Printable;
 
 namespace fs = std::filesystem;
@@ -88,25 +91,30 @@ std::string FaultOfFolder(const std::string& path) {
     return S_ISDIR(info.st_mode) ? "" : path + " is no folder";
 }
 
-// The shares that are wanted, or all; names that Samba does not know are told.
-ExitCode Choose(const std::vector<std::string>& names, std::vector<SambaShare>& shares) {
+void ReportFailure(const std::string& text) {
+    programs::Report("zelctl", text);
+}
+
+// The shares that are wanted, or all; names that Samba does not know are reported: false.
+bool Choose(const std::vector<std::string>& names, std::vector<SambaShare>& shares) {
     if (names.empty()) {
-        return kOk;
+        return true;
     }
     std::vector<SambaShare> chosen;
-    ExitCode result = kOk;
+    bool all = true;
     for (const std::string& name : names) {
         const auto found = std::find_if(shares.begin(), shares.end(), [&](const SambaShare& share) {
             return base::Lower(share.name) == base::Lower(name);
         });
         if (found == shares.end()) {
-            result = Fail(kLocal, "Samba has no share '%s'", Printable(name).c_str());
+            ReportFailure("Samba has no share '" + Printable(name) + "'");
+            all = false;
         } else {
             chosen.push_back(*found);
         }
     }
     shares = std::move(chosen);
-    return result;
+    return all;
 }
 
 /// A copy of the catalogue, which takes the place of the catalogue for as long as this lives: what
@@ -154,16 +162,15 @@ private:
     std::optional<std::string> root_;
 };
 
-ExitCode Preview(const SambaShare& share) {
+void Preview(const SambaShare& share) {
     const std::string name = Printable(share.name);
     if (TARQShareAdd(share.name.c_str(), share.path.c_str(), TARQ_SHARE_WINDOWS) < 0) {
-        return Fail(kLocal, "share '%s' would be left out: %s", name.c_str(),
-                    KAPICErrGet() == TARQ_ERR_BAD_PARAMETER
-                        ? "its name or its folder cannot be a share's"
-                        : KAPICErrText(KAPICErrGet()));
+        throw Failure(FailureKind::kLocal, "share '" + name + "' would be left out: " +
+                                               (KAPICErrGet() == TARQ_ERR_BAD_PARAMETER
+                                                    ? "its name or its folder cannot be a share's"
+                                                    : KAPICErrText(KAPICErrGet())));
     }
     printf("Share '%s' would be %s\n", name.c_str(), Printable(share.path).c_str());
-    return kOk;
 }
 
 }  // namespace
@@ -196,41 +203,39 @@ std::vector<SambaShare> ParseSambaShares(const std::string& text) {
     return shares;
 }
 
-ExitCode ImportSambaShares(const std::string& config, const std::vector<std::string>& names,
-                           bool dry_run) {
+void ImportSambaShares(const std::string& config, const std::vector<std::string>& names,
+                       bool dry_run) {
     std::vector<std::string> command = {"testparm", "-s"};
     if (!config.empty()) {
         command.push_back(config);
     }
     const ChildOutput answer = RunAndRead(command);
     if (!answer.failure.empty()) {
-        return Fail(kLocal, "%s; it belongs to the package samba-common-bin",
-                    Printable(answer.failure).c_str());
+        throw Failure(FailureKind::kLocal,
+                      Printable(answer.failure) + "; it belongs to the package samba-common-bin");
     }
     if (answer.exit_code != 0) {
         std::string errors(base::Trimmed(answer.errors));
         std::replace(errors.begin(), errors.end(), '\n', ' ');
-        return Fail(kLocal, "testparm cannot read the configuration: %s",
-                    Printable(errors).c_str());
+        throw Failure(FailureKind::kLocal,
+                      "testparm cannot read the configuration: " + Printable(errors));
     }
     std::vector<SambaShare> shares = ParseSambaShares(answer.output);
-    ExitCode result = Choose(names, shares);
+    bool all = Choose(names, shares);
     std::set<std::string> there;
-    const auto known = ShareNames();
-    if (!known) {
-        return kLocal;
+    for (const std::string& name : ShareNames()) {
+        there.insert(base::Lower(name));
     }
-    std::transform(known->begin(), known->end(), std::inserter(there, there.end()),
-                   [](const std::string& name) { return base::Lower(name); });
     std::optional<ScratchCatalogue> scratch;
     if (dry_run) {
         scratch.emplace();
         if (scratch->Error()) {
-            return Fail(kLocal, "cannot copy the catalogue, to try the import on it: %s",
-                        scratch->Error().message().c_str());
+            throw Failure(FailureKind::kLocal,
+                          "cannot copy the catalogue, to try the import on it: " +
+                              scratch->Error().message());
         }
     }
-    if (shares.empty() && result == kOk) {
+    if (shares.empty() && all) {
         puts("Samba has no shares to take over.");
     }
     for (const SambaShare& share : shares) {
@@ -239,16 +244,23 @@ ExitCode ImportSambaShares(const std::string& config, const std::vector<std::str
             share.refusal.empty() ? FaultOfFolder(share.path) : share.refusal;
         if (there.count(base::Lower(share.name)) != 0) {
             printf("Share '%s' is in the catalogue already; it stays as it is\n", name.c_str());
-        } else if (!refusal.empty()) {
-            result = Fail(kLocal, "share '%s' %s left out: %s", name.c_str(),
-                          dry_run ? "would be" : "is", Printable(refusal).c_str());
-        } else {
-            const ExitCode added =
-                dry_run ? Preview(share) : AddShare(share.name, share.path, false, true);
-            result = added == kOk ? result : added;
+            continue;
+        }
+        try {
+            if (!refusal.empty()) {
+                throw Failure(FailureKind::kLocal, "share '" + name + "' " +
+                                                       (dry_run ? "would be" : "is") +
+                                                       " left out: " + Printable(refusal));
+            }
+            dry_run ? Preview(share) : AddShare(share.name, share.path, false, true);
+        } catch (const Failure& failure) {
+            ReportFailure(failure.what());
+            all = false;
         }
     }
-    return result;
+    if (!all) {
+        throw programs::ReportedFailure(FailureKind::kLocal);
+    }
 }
 
 }  // namespace zelctl

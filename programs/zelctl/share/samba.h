@@ -4,8 +4,6 @@
 #include <string>
 #include <vector>
 
-#include "programs/zelctl/base/exit_codes.h"
-
 namespace zelctl {
 
 struct SambaShare {
@@ -20,7 +18,7 @@ std::vector<SambaShare> ParseSambaShares(const std::string& text);
 
 /// Adds the shares of the Samba configuration `config` (empty: the system's) to the catalogue, or
 /// only those of `names`. `dry_run`: only says which.
-ExitCode ImportSambaShares(const std::string& config, const std::vector<std::string>& names,
-                           bool dry_run);
+void ImportSambaShares(const std::string& config, const std::vector<std::string>& names,
+                       bool dry_run);
 
 }  // namespace zelctl

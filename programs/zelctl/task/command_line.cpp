@@ -116,19 +116,18 @@ CLI::App* AddNamed(CLI::App& task, const char* command, const char* about, std::
 }
 
 // A command that says no more than the task's name.
-void DeclareTelling(CLI::App& task, ExitCode& result, std::string& name, const char* command,
-                    const char* about, const char* request, const char* done) {
-    AddNamed(task, command, about, name)->callback([&result, &name, request, done] {
-        result = TellTask(request, name, done);
+void DeclareTelling(CLI::App& task, std::string& name, const char* command, const char* about,
+                    const char* request, const char* done) {
+    AddNamed(task, command, about, name)->callback([&name, request, done] {
+        TellTask(request, name, done);
     });
 }
 
-void DeclareChanging(CLI::App& task, ExitCode& result, TaskArguments& arguments) {
+void DeclareChanging(CLI::App& task, TaskArguments& arguments) {
     CLI::App* const add = task.add_subcommand("add", "Add a task");
     AddTaskOptions(*add, arguments, true);
-    add->callback([&result, &arguments] {
-        result = AddTask(arguments.name, arguments.Options(), arguments.password_file,
-                         !arguments.no_check);
+    add->callback([&arguments] {
+        AddTask(arguments.name, arguments.Options(), arguments.password_file, !arguments.no_check);
     });
     CLI::App* const edit =
         task.add_subcommand("edit", "Change a task; what is not given stays as it is");
@@ -136,13 +135,13 @@ void DeclareChanging(CLI::App& task, ExitCode& result, TaskArguments& arguments)
     edit->add_option("--rename", arguments.new_name, "Another name for it")->option_text("NAME");
     edit->add_flag("--password", arguments.new_password, "Ask for another password");
     edit->add_flag("--no-exclude", arguments.no_excludes, "No file stays behind any more");
-    edit->callback([&result, &arguments] {
-        result = EditTask(arguments.name, arguments.Options(), arguments.new_name,
-                          arguments.new_password, arguments.password_file, !arguments.no_check);
+    edit->callback([&arguments] {
+        EditTask(arguments.name, arguments.Options(), arguments.new_name, arguments.new_password,
+                 arguments.password_file, !arguments.no_check);
     });
 }
 
-void DeclareRun(CLI::App& task, ExitCode& result) {
+void DeclareRun(CLI::App& task) {
     static std::vector<std::string> names;
     static bool wait = false;
     static bool dry_run = false;
@@ -152,12 +151,12 @@ void DeclareRun(CLI::App& task, ExitCode& result) {
                   "Show how far they are, and exit by their results; Ctrl-C leaves them running");
     run->add_flag("-n,--dry-run", dry_run, "Only list what would be sent and deleted")
         ->excludes("--wait");
-    run->callback([&result] { result = dry_run ? ListTaskChanges(names) : RunTasks(names, wait); });
+    run->callback([] { dry_run ? ListTaskChanges(names) : RunTasks(names, wait); });
 }
 
 }  // namespace
 
-void DeclareTask(CLI::App& task, ExitCode& result) {
+void DeclareTask(CLI::App& task) {
     static TaskArguments arguments;
     static bool as_json = false;
     static unsigned int limit = 20;
@@ -165,23 +164,23 @@ void DeclareTask(CLI::App& task, ExitCode& result) {
     std::string& name = arguments.name;
     task.require_subcommand(1);
 
-    DeclareChanging(task, result, arguments);
+    DeclareChanging(task, arguments);
     CLI::App* const list = task.add_subcommand("list", "List the tasks");
     list->add_flag("--json", as_json, "Write JSON, for programs");
-    list->callback([&result] { result = ListTasks(as_json); });
+    list->callback([] { ListTasks(as_json); });
 
     CLI::App* const show = AddNamed(task, "show", "Show all of a task", name);
     show->add_flag("--json", as_json, "Write JSON, for programs");
-    show->callback([&result] { result = ShowTask(name, as_json); });
+    show->callback([] { ShowTask(name, as_json); });
 
-    DeclareRun(task, result);
-    DeclareTelling(task, result, name, "rm", "Remove a task; shares and copies stay", "task_remove",
+    DeclareRun(task);
+    DeclareTelling(task, name, "rm", "Remove a task; shares and copies stay", "task_remove",
                    "is removed; its shares and their copies stay");
-    DeclareTelling(task, result, name, "cancel", "End a task's run, or take it back", "task_cancel",
+    DeclareTelling(task, name, "cancel", "End a task's run, or take it back", "task_cancel",
                    "does not run any more");
-    DeclareTelling(task, result, name, "pause", "Run a task only when asked to, until resumed",
+    DeclareTelling(task, name, "pause", "Run a task only when asked to, until resumed",
                    "task_pause", "is paused: it runs when you ask for it alone");
-    DeclareTelling(task, result, name, "resume", "Let a paused task run by its schedule again",
+    DeclareTelling(task, name, "resume", "Let a paused task run by its schedule again",
                    "task_resume", "runs by its schedule again");
 
     CLI::App* const log = AddNamed(task, "log", "Show a task's runs, newest first", name);
@@ -192,7 +191,7 @@ void DeclareTask(CLI::App& task, ExitCode& result) {
     log->add_flag("--json", as_json, "Write JSON, for programs");
     static bool details = false;
     log->add_flag("--verbose", details, "Show what rsync and ssh wrote about each failure, too");
-    log->callback([&result] { result = ShowTaskLog(name, limit, details, as_json); });
+    log->callback([] { ShowTaskLog(name, limit, details, as_json); });
 
     CLI::App* const next = AddNamed(task, "next", "Show when a task runs next", name);
     next->add_option("--count", count, "How many runs to show")
@@ -200,11 +199,11 @@ void DeclareTask(CLI::App& task, ExitCode& result) {
         ->check(programs::Between(1, 1000))
         ->capture_default_str();
     next->add_flag("--json", as_json, "Write JSON, for programs");
-    next->callback([&result] { result = ShowTaskRuns(name, count, as_json); });
+    next->callback([] { ShowTaskRuns(name, count, as_json); });
 
     CLI::App* const watch = task.add_subcommand("watch", "Show what tasks are doing, until Ctrl-C");
     watch->add_option("name", name, "The task (all)");
-    watch->callback([&result] { result = WatchTasks(name); });
+    watch->callback([] { WatchTasks(name); });
 }
 
 }  // namespace zelctl

@@ -4,27 +4,26 @@
 #include <optional>
 #include <string>
 
-#include "programs/zelctl/base/exit_codes.h"
 #include "programs/zelctl/task/options.h"
 
 namespace zelctl {
 
 /// `password_file`: as programs::ReadPassword takes it. `check`: the server is asked first; a task
 /// that it refuses for good is not added.
-ExitCode AddTask(const std::string& name, const TaskOptions& options,
-                 const std::string& password_file, bool check);
+void AddTask(const std::string& name, const TaskOptions& options, const std::string& password_file,
+             bool check);
 /// `new_name` is empty unless the task is to be renamed. The password stays unless `new_password`
 /// or a file is given; `check`: the server is asked with it first.
-ExitCode EditTask(const std::string& name, const TaskOptions& options, const std::string& new_name,
-                  bool new_password, const std::string& password_file, bool check);
-ExitCode ListTasks(bool as_json);
-ExitCode ShowTask(const std::string& name, bool as_json);
+void EditTask(const std::string& name, const TaskOptions& options, const std::string& new_name,
+              bool new_password, const std::string& password_file, bool check);
+void ListTasks(bool as_json);
+void ShowTask(const std::string& name, bool as_json);
 /// `command` is one that says no more than the task's name: "task_remove", "task_cancel",
 /// "task_pause" or "task_resume"; `done` what has happened then.
-ExitCode TellTask(const char* command, const std::string& name, const char* done);
-ExitCode ShowTaskLog(const std::string& name, unsigned int limit, bool details, bool as_json);
-ExitCode ShowTaskRuns(const std::string& name, unsigned int count, bool as_json);
-ExitCode ShowDaemonStatus(bool as_json);
-ExitCode ReloadDaemon();
+void TellTask(const char* command, const std::string& name, const char* done);
+void ShowTaskLog(const std::string& name, unsigned int limit, bool details, bool as_json);
+void ShowTaskRuns(const std::string& name, unsigned int count, bool as_json);
+void ShowDaemonStatus(bool as_json);
+void ReloadDaemon();
 
 }  // namespace zelctl

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <ctime>
 
+#include "programs/common/failure.h"
 #include "programs/common/schedule_words.h"
 #include "programs/common/table.h"
 #include "programs/common/text.h"
@@ -11,6 +12,8 @@ namespace zelctl {
 
 namespace {
 
+using programs::Failure;
+using programs::FailureKind;
 using programs::ParseDate;
 using programs::ParseTimeOfDay;
 
@@ -36,33 +39,34 @@ bool ParseMoment(const std::string& text, long& moment) {
     return moment >= 0;
 }
 
-ExitCode BadValue(const char* option, const std::string& value, const char* form) {
-    return Fail(kUsage, "--%s: '%s' is not %s", option, programs::Printable(value).c_str(), form);
+Failure BadValue(const std::string& option, const std::string& value, const char* form) {
+    return {FailureKind::kUsage,
+            "--" + option + ": '" + programs::Printable(value) + "' is not " + form};
 }
 
 }  // namespace
 
-ExitCode ShowNextRuns(const NextOptions& options) {
+void ShowNextRuns(const NextOptions& options) {
     ZEL::Schedule schedule;
     schedule.SetModeByStr(options.mode);
     if (schedule.GetModeStr() != options.mode) {
-        return BadValue("mode", options.mode, "manual, realtime, weekly, monthly, yearly or once");
+        throw BadValue("mode", options.mode, "manual, realtime, weekly, monthly, yearly or once");
     }
     if (options.week.size() != 7 || options.week.find_first_not_of("01") != std::string::npos ||
         options.week == "0000000") {
-        return BadValue("week", options.week, "seven digits 0 or 1, Sunday first, at least one 1");
+        throw BadValue("week", options.week, "seven digits 0 or 1, Sunday first, at least one 1");
     }
     const auto begin = ParseDate(options.begin);
     if (!begin) {
-        return BadValue("begin", options.begin, "a date YYYY-MM-DD");
+        throw BadValue("begin", options.begin, "a date YYYY-MM-DD");
     }
     const auto start = ParseTimeOfDay(options.start);
     if (!start) {
-        return BadValue("start", options.start, "a time HH:MM");
+        throw BadValue("start", options.start, "a time HH:MM");
     }
     const auto period = ParseTimeOfDay(options.period);
     if (!period) {
-        return BadValue("period", options.period, "a time HH:MM");
+        throw BadValue("period", options.period, "a time HH:MM");
     }
     schedule.SetWeekSchedule(options.week);
     schedule.SetBeginYear(begin->year);
@@ -74,23 +78,24 @@ ExitCode ShowNextRuns(const NextOptions& options) {
     schedule.SetRepeatTimesInDay(static_cast<long>(options.repeat));
     schedule.SetPeriod(period->hours, period->minutes);
     if (!schedule.Validate()) {
-        return Fail(kUsage, "the schedule is not possible: all repeats must fall on the same day");
+        throw Failure(FailureKind::kUsage,
+                      "the schedule is not possible: all repeats must fall on the same day");
     }
     long moment = 0;
     if (!ParseMoment(options.from, moment)) {
-        return BadValue("from", options.from, "a moment 'YYYY-MM-DD HH:MM'");
+        throw BadValue("from", options.from, "a moment 'YYYY-MM-DD HH:MM'");
     }
-    return ShowNextRuns(schedule, moment, options.count, options.as_json);
+    ShowNextRuns(schedule, moment, options.count, options.as_json);
 }
 
-ExitCode ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count, bool as_json) {
+void ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count, bool as_json) {
     programs::Table table(as_json ? std::vector<programs::Column>{"NEXT RUN", "SECONDS"}
                                   : std::vector<programs::Column>{"NEXT RUN"});
     long moment = after;
     for (unsigned int i = 0; i < count; ++i) {
         moment = schedule.GetNextScheduledSeconds(moment);
         if (moment < 0) {
-            return Fail(kFailed, "the next run cannot be computed (see the system log)");
+            throw Failure("the next run cannot be computed (see the system log)");
         }
         if (moment == 0) {
             break;  // no further run
@@ -102,7 +107,6 @@ ExitCode ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int co
         table.Add(std::move(row));
     }
     table.Print(as_json);
-    return kOk;
 }
 
 }  // namespace zelctl

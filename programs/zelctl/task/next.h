@@ -3,7 +3,6 @@
 #include <string>
 
 #include "ZEL/sync_obj.h"
-#include "programs/zelctl/base/exit_codes.h"
 
 namespace zelctl {
 
@@ -21,9 +20,9 @@ struct NextOptions {
 };
 
 /// Prints the next runs of the schedule.
-ExitCode ShowNextRuns(const NextOptions& options);
+void ShowNextRuns(const NextOptions& options);
 
 /// Prints the runs of a schedule after a moment, `count` at most.
-ExitCode ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count, bool as_json);
+void ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count, bool as_json);
 
 }  // namespace zelctl

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <set>
 
+#include "programs/common/failure.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/server/connection.h"
 #include "programs/zelctl/share/commands.h"
@@ -11,18 +12,19 @@ namespace zelctl {
 
 namespace {
 
-ExitCode SetShares(const std::vector<std::string>& shares, ZEL::TaskInfo& info) {
+using programs::Failure;
+using programs::FailureKind;
+
+void SetShares(const std::vector<std::string>& shares, ZEL::TaskInfo& info) {
     std::set<std::string> seen;
     for (const std::string& share : shares) {
         if (!seen.insert(share).second) {
-            return Fail(kUsage, "share '%s' is given twice", programs::Printable(share).c_str());
+            throw Failure(FailureKind::kUsage,
+                          "share '" + programs::Printable(share) + "' is given twice");
         }
     }
-    const ExitCode checked = CheckShares(shares);
-    if (checked == kOk) {
-        info.SetShareList({shares.begin(), shares.end()});
-    }
-    return checked;
+    CheckShares(shares);
+    info.SetShareList({shares.begin(), shares.end()});
 }
 
 template <typename T>
@@ -34,23 +36,20 @@ void Set(const std::optional<T>& value, ZEL::SyncInfo& info, void (ZEL::SyncInfo
 
 }  // namespace
 
-ExitCode TaskOptions::ApplyTo(ZEL::TaskInfo& info) const {
+void TaskOptions::ApplyTo(ZEL::TaskInfo& info) const {
     if (!shares.empty()) {
-        const ExitCode checked = SetShares(shares, info);
-        if (checked != kOk) {
-            return checked;
-        }
+        SetShares(shares, info);
     }
     ZEL::SyncInfo sync = info.GetSyncInfo();
     if (server) {
         if (server->empty()) {
-            return Fail(kUsage, "--server: give the server's name or address");
+            throw Failure(FailureKind::kUsage, "--server: give the server's name or address");
         }
         SetServer(*server, sync);
     }
     if (user) {
         if (user->empty()) {
-            return Fail(kUsage, "--user: give the account's name");
+            throw Failure(FailureKind::kUsage, "--user: give the account's name");
         }
         sync.SetUser(*user);
     }
@@ -64,28 +63,26 @@ ExitCode TaskOptions::ApplyTo(ZEL::TaskInfo& info) const {
     if (schedule.Any()) {
         const std::string fault = programs::ApplyWords(schedule, info.GetSchedule());
         if (!fault.empty()) {
-            return Fail(kUsage, "%s", fault.c_str());
+            throw Failure(FailureKind::kUsage, fault);
         }
     }
-    return kOk;
 }
 
-ExitCode CheckTaskName(const std::string& name) {
+void CheckTaskName(const std::string& name) {
     if (!programs::IsTaskName(name)) {
-        return Fail(kUsage,
-                    "'%s' cannot be a task's name: it has 1 to 128 bytes, without control "
-                    "characters, quotes and brackets",
-                    programs::Printable(name).c_str());
+        throw Failure(FailureKind::kUsage,
+                      "'" + programs::Printable(name) +
+                          "' cannot be a task's name: it has 1 to 128 bytes, without control "
+                          "characters, quotes and brackets");
     }
-    return kOk;
 }
 
-ExitCode CheckTask(const ZEL::TaskInfo& info) {
-    return info.Validate() ? kOk
-                           : Fail(kUsage,
-                                  "task '%s' is not possible: 'zelctl -v' with the same command "
-                                  "says why",
-                                  programs::Printable(info.GetName()).c_str());
+void CheckTask(const ZEL::TaskInfo& info) {
+    if (!info.Validate()) {
+        throw Failure(FailureKind::kUsage, "task '" + programs::Printable(info.GetName()) +
+                                               "' is not possible: 'zelctl -v' with the same "
+                                               "command says why");
+    }
 }
 
 ZEL::PObject ToArray(const std::vector<std::string>& texts) {

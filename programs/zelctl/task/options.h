@@ -8,7 +8,6 @@
 #include "ZEL/pobject.h"
 #include "ZEL/sync_obj.h"
 #include "programs/common/schedule_words.h"
-#include "programs/zelctl/base/exit_codes.h"
 
 namespace zelctl {
 
@@ -27,14 +26,14 @@ struct TaskOptions {
     programs::ScheduleWords schedule;
 
     /// Changes the task to what is given, all checked; the shares are looked up on this machine.
-    ExitCode ApplyTo(ZEL::TaskInfo& info) const;
+    void ApplyTo(ZEL::TaskInfo& info) const;
 };
 
-/// Whether `name` can be a task's.
-ExitCode CheckTaskName(const std::string& name);
+/// Throws Failure when `name` cannot be a task's.
+void CheckTaskName(const std::string& name);
 
 /// The library's own check, as the last word after ours.
-ExitCode CheckTask(const ZEL::TaskInfo& info);
+void CheckTask(const ZEL::TaskInfo& info);
 
 /// Texts as the array that a request carries.
 ZEL::PObject ToArray(const std::vector<std::string>& texts);

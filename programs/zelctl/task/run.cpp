@@ -4,13 +4,16 @@
 #include <chrono>
 #include <cstdio>
 #include <map>
+#include <optional>
 
 #include "ZEL/sync_obj.h"
+#include "programs/common/failure.h"
 #include "programs/common/run_progress.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "programs/zelctl/base/live_block.h"
+#include "programs/zelctl/base/run_failure.h"
 #include "programs/zelctl/push/push.h"
 #include "programs/zelctl/task/view.h"
 
@@ -18,6 +21,8 @@ namespace zelctl {
 
 namespace {
 
+using programs::Failure;
+using programs::FailureKind;
 using programs::Printable;
 using std::chrono::steady_clock;
 using ZEL::PObject;
@@ -28,17 +33,17 @@ constexpr std::chrono::seconds kLineEvery(10);  // where there is no terminal
 class TaskStream {
 public:
     /// `name` is empty for all tasks.
-    ExitCode Open(const std::string& name) {
+    void Open(const std::string& name) {
         PObject request;
         request["command"] = "watch";
         if (!name.empty()) {
             request["task"] = name;
         }
-        const ExitCode code = connection_.Connect();
-        return connection_.Tell(code == kOk ? connection_.Send(request) : code);
+        connection_.Connect();
+        connection_.Send(request);
     }
     /// Waits for the next news.
-    ExitCode Next() { return connection_.Tell(connection_.Receive(reply_)); }
+    void Next() { reply_ = connection_.Receive(); }
     /// Puts the tasks that do something before those that do not.
     void PutBusyFirst() {
         PObject::Array& tasks = reply_["tasks"].asArray();
@@ -81,7 +86,12 @@ public:
     /// `after`: the run that had ended when this one was asked for.
     void Add(const std::string& name, uint64_t after) { left_[name] = after; }
     bool Over() const { return left_.empty(); }
-    ExitCode Result() const { return result_; }
+    /// Throws what the worst of them comes to.
+    void RequireSuccess() const {
+        if (worst_) {
+            throw programs::ReportedFailure(*worst_);
+        }
+    }
 
     /// Takes in what the tasks are doing.
     void See(const PObject::Array& tasks) {
@@ -90,7 +100,9 @@ public:
             const PObject* const task = FindTask(tasks, run->first);
             if (task == nullptr || (*task)["last_run"].asUInt64() != run->second) {
                 block_.Clear();
-                Note(task == nullptr ? Gone(run->first) : Ended(*task));
+                task == nullptr
+                    ? Failed(FailureKind::kFailed, run->first, " has been removed or renamed")
+                    : Ended(*task);
                 run = left_.erase(run);
             } else {
                 lines.push_back(WaitingLine(*task));
@@ -109,47 +121,45 @@ public:
     }
 
     /// The user has had enough.
-    ExitCode Leave() {
+    void Leave() {
         block_.Clear();
         for (const auto& [name, after] : left_) {
-            Fail(kCancelled,
-                 "no longer waiting; the run of '%s' goes on: 'zelctl task watch' looks on, "
-                 "'zelctl task cancel' ends it",
-                 Printable(name).c_str());
+            programs::Report("zelctl", "no longer waiting; the run of '" + Printable(name) +
+                                           "' goes on: 'zelctl task watch' looks on, 'zelctl task "
+                                           "cancel' ends it");
         }
-        return kCancelled;
     }
 
 private:
-    void Note(ExitCode code) { result_ = std::max(result_, code); }
-
-    static ExitCode Gone(const std::string& name) {
-        return Fail(kFailed, "task '%s' has been removed or renamed", Printable(name).c_str());
+    void Failed(FailureKind kind, const std::string& task, const std::string& text) {
+        programs::Report("zelctl", "task '" + Printable(task) + "'" + text);
+        worst_ = std::max(worst_.value_or(kind), kind);
     }
 
-    static ExitCode Ended(const PObject& task) {
-        const std::string name = Printable(task["name"].asString());
+    void Ended(const PObject& task) {
+        const std::string& name = task["name"].asString();
         const int64_t took = task["last_end"].asInt64() - task["last_start"].asInt64();
         const std::string took_words =
             programs::HumanDuration(static_cast<uint64_t>(std::max<int64_t>(took, 0)));
         switch (task["sync_result"].asInt32()) {
             case ZEL::TASK_RESULT_SUCCESS:
-                printf("%s: done in %s\n", name.c_str(), took_words.c_str());
+                printf("%s: done in %s\n", Printable(name).c_str(), took_words.c_str());
                 fflush(stdout);
-                return kOk;
+                return;
             case ZEL::TASK_RESULT_CANCELLED:
-                return Fail(kCancelled, "task '%s': the run was cancelled", name.c_str());
+                return Failed(FailureKind::kCancelled, name, ": the run was cancelled");
             default: {
                 const int status = task["last_status"].asInt32();
-                return Fail(status == 0 ? kLocal : CodeOf(programs::TroubleOf(status)),
-                            "task '%s' failed after %s: %s", name.c_str(), took_words.c_str(),
-                            Printable(OneLine(task["last_error"].asString())).c_str());
+                return Failed(
+                    status == 0 ? FailureKind::kLocal : KindOf(programs::TroubleOf(status)), name,
+                    " failed after " + took_words + ": " +
+                        Printable(OneLine(task["last_error"].asString())));
             }
         }
     }
 
     std::map<std::string, uint64_t> left_;  // by task, the last run before
-    ExitCode result_ = kOk;
+    std::optional<FailureKind> worst_;
     LiveBlock block_;
     steady_clock::time_point last_lines_ = steady_clock::now();
 };
@@ -179,46 +189,40 @@ private:
 
 }  // namespace
 
-ExitCode RunTasks(const std::vector<std::string>& names, bool wait) {
+void RunTasks(const std::vector<std::string>& names, bool wait) {
     Waiting waiting;
     for (const std::string& name : names) {
-        PObject reply;
-        const ExitCode code = AskDaemon(TaskRequest("task_run", name), reply);
-        if (code != kOk) {
-            return code;
-        }
+        const PObject reply = AskDaemon(TaskRequest("task_run", name));
         waiting.Add(name, reply["after"].asUInt64());
         if (!wait) {
             printf("Task '%s' runs as soon as a worker is free.\n", Printable(name).c_str());
         }
     }
     if (!wait) {
-        return kOk;
+        return;
     }
     WatchForInterrupt();
-    TaskStream stream;
-    ExitCode code = stream.Open(names.size() == 1 ? names[0] : "");
-    while (code == kOk && !waiting.Over()) {
-        code = stream.Next();
-        if (code == kOk) {
+    try {
+        TaskStream stream;
+        stream.Open(names.size() == 1 ? names[0] : "");
+        while (!waiting.Over()) {
+            stream.Next();
             waiting.See(stream.Tasks());
         }
+    } catch (const Failure& failure) {
+        if (failure.Kind() == FailureKind::kCancelled) {
+            waiting.Leave();
+        }
+        throw;
     }
-    if (code == kCancelled) {
-        return waiting.Leave();
-    }
-    return code == kOk ? waiting.Result() : code;
+    waiting.RequireSuccess();
 }
 
-ExitCode ListTaskChanges(const std::vector<std::string>& names) {
+void ListTaskChanges(const std::vector<std::string>& names) {
     for (const std::string& name : names) {
         PObject request = TaskRequest("task_show", name);
         request["secrets"] = 1;
-        PObject reply;
-        ExitCode code = AskDaemon(request, reply);
-        if (code != kOk) {
-            return code;
-        }
+        const PObject reply = AskDaemon(request);
         const PObject& task = reply["task"];
         ZEL::SyncTask record;
         ZEL::PObj2SyncTask(task, record);
@@ -231,34 +235,31 @@ ExitCode ListTaskChanges(const std::vector<std::string>& names) {
         options.connection.server = ServerOf(task);
         options.info = record.GetInfo().GetSyncInfo();
         options.dry_run = true;
-        code = Push(options);
-        if (code != kOk) {
-            return code;
-        }
+        Push(options);
     }
-    return kOk;
 }
 
-ExitCode WatchTasks(const std::string& name) {
+void WatchTasks(const std::string& name) {
     WatchForInterrupt();
     TaskStream stream;
     LiveBlock block;
     ChangeLines lines;
-    ExitCode code = stream.Open(name);
-    while (code == kOk) {
-        code = stream.Next();
-        if (code != kOk) {
-            break;
+    try {
+        for (stream.Open(name);;) {
+            stream.Next();
+            if (LiveBlock::Possible()) {
+                stream.PutBusyFirst();  // a window may not hold all
+                block.Draw(TaskLines(stream.Tasks()));
+            } else {
+                lines.See(stream.Tasks());
+            }
         }
-        if (LiveBlock::Possible()) {
-            stream.PutBusyFirst();  // a window may not hold all
-            block.Draw(TaskLines(stream.Tasks()));
-        } else {
-            lines.See(stream.Tasks());
+    } catch (const Failure& failure) {
+        // The user's own end is the only good one.
+        if (failure.Kind() != FailureKind::kCancelled) {
+            throw;
         }
     }
-    // The user's own end is the only good one.
-    return code == kCancelled ? kOk : code;
 }
 
 }  // namespace zelctl

@@ -9,6 +9,7 @@
 #include "ZEL/sync_obj.h"
 #include "base/replace_file.h"
 #include "base/whole_file.h"
+#include "programs/common/failure.h"
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
@@ -21,6 +22,8 @@ namespace zelctl {
 
 namespace {
 
+using programs::Failure;
+using programs::FailureKind;
 using programs::Printable;
 using ZEL::PObject;
 
@@ -29,31 +32,31 @@ constexpr size_t kFaultsShown = 20;
 constexpr mode_t kSecretMode = 0600;
 constexpr mode_t kPlainMode = 0644;
 
-ExitCode GetTasks(bool secrets, PObject& reply) {
+PObject GetTasks(bool secrets) {
     PObject request;
     request["command"] = "task_list";
     if (secrets) {
         request["secrets"] = 1;
     }
-    return AskDaemon(request, reply);
+    return AskDaemon(request);
 }
 
-ExitCode ReadTasks(const std::string& path, std::vector<PObject>& tasks) {
+std::vector<PObject> ReadTasks(const std::string& path) {
     const auto text = base::ReadFile(path == "-" ? "/dev/stdin" : path, kMaxFileBytes);
     const std::string shown = Printable(path);
     if (!text) {
-        return Fail(kLocal, "cannot read %s: %s", shown.c_str(), strerror(errno));
+        throw programs::SystemFailure("cannot read " + shown, FailureKind::kLocal);
     }
     TaskFile file = ReadTaskFile(*text);
     for (size_t i = 0; i < file.faults.size() && i < kFaultsShown; ++i) {
-        Fail(kUsage, "%s: %s", shown.c_str(), file.faults[i].c_str());
+        programs::Report("zelctl", shown + ": " + file.faults[i]);
     }
     if (!file.faults.empty()) {
-        return Fail(kUsage, "%s: %s; nothing was imported", shown.c_str(),
-                    programs::Count(file.faults.size(), "fault").c_str());
+        throw Failure(
+            FailureKind::kUsage,
+            shown + ": " + programs::Count(file.faults.size(), "fault") + "; nothing was imported");
     }
-    tasks = std::move(file.tasks);
-    return kOk;
+    return std::move(file.tasks);
 }
 
 ZEL::TaskInfo ToInfo(const PObject& task) {
@@ -62,21 +65,23 @@ ZEL::TaskInfo ToInfo(const PObject& task) {
     return record.GetInfo();
 }
 
-ExitCode CheckPossible(const PObject& task) {
+void CheckPossible(const PObject& task) {
     const ZEL::TaskInfo info = ToInfo(task);
-    ExitCode code = CheckTaskName(info.GetName());
-    if (code != kOk) {
-        return code;
-    }
+    CheckTaskName(info.GetName());
     const std::string name = Printable(info.GetName());
     if (!info.GetSchedule().Validate()) {
-        return Fail(kUsage,
-                    "task '%s': its schedule is not possible: the begin date must be one of the "
-                    "calendar, and all runs of a day must fall on that day",
-                    name.c_str());
+        throw Failure(FailureKind::kUsage,
+                      "task '" + name +
+                          "': its schedule is not possible: the begin date must be one of the "
+                          "calendar, and all runs of a day must fall on that day");
     }
-    code = CheckShares({info.GetShareList().begin(), info.GetShareList().end()});
-    return code == kOk ? CheckTask(info) : Fail(code, "task '%s' is not possible", name.c_str());
+    try {
+        CheckShares({info.GetShareList().begin(), info.GetShareList().end()});
+    } catch (const Failure& failure) {
+        programs::Report("zelctl", failure.what());
+        throw Failure(failure.Kind(), "task '" + name + "' is not possible");
+    }
+    CheckTask(info);
 }
 
 /// The tasks of a file, on their way to the daemon.
@@ -86,39 +91,35 @@ public:
         : tasks_(std::move(tasks)), replace_(replace), password_file_(std::move(password_file)) {}
 
     /// Looks at the tasks, and tells what is wrong with them, up to a screenful.
-    ExitCode Check() {
-        PObject reply;
-        ExitCode code = GetTasks(false, reply);
-        if (code != kOk) {
-            return code;
-        }
+    void Check() {
+        PObject reply = GetTasks(false);
         for (PObject& task : reply["tasks"].asArray()) {
             const std::string name = static_cast<const PObject&>(task)["name"].asString();
             there_[name].swap(task);
         }
         size_t told = 0;
-        for (const PObject& task : tasks_) {
-            const ExitCode checked = CheckOne(task);
-            code = code == kOk ? checked : code;
-            told += checked == kOk ? 0 : 1;
-            if (told == kFaultsShown) {
-                break;
+        std::optional<FailureKind> first;
+        for (auto task = tasks_.begin(); task != tasks_.end() && told < kFaultsShown; ++task) {
+            try {
+                CheckOne(*task);
+            } catch (const Failure& failure) {
+                programs::Report("zelctl", failure.what());
+                first = first.value_or(failure.Kind());
+                ++told;
             }
         }
-        return code == kOk ? code : Fail(code, "nothing was imported");
+        if (first) {
+            throw Failure(*first, "nothing was imported");
+        }
     }
 
-    ExitCode GetPasswords() {
+    void GetPasswords() {
         for (PObject& task : tasks_) {
-            const ExitCode code = GetPassword(task);
-            if (code != kOk) {
-                return code;
-            }
+            GetPassword(task);
         }
-        return kOk;
     }
 
-    ExitCode Send() {
+    void Send() {
         size_t sent = 0;
         for (PObject& task : tasks_) {
             const PObject& read = task;
@@ -127,54 +128,55 @@ public:
                 task["task"] = name;
             }
             task["command"] = IsThere(name) ? "task_edit" : "task_add";
-            PObject reply;
-            const ExitCode code = AskDaemon(task, reply);
-            if (code != kOk) {
-                return Fail(code, "%zu of %zu tasks are imported; '%s' and those after it are not",
-                            sent, tasks_.size(), Printable(name).c_str());
+            try {
+                AskDaemon(task);
+            } catch (const Failure& failure) {
+                programs::Report("zelctl", failure.what());
+                throw Failure(failure.Kind(), std::to_string(sent) + " of " +
+                                                  std::to_string(tasks_.size()) +
+                                                  " tasks are imported; '" + Printable(name) +
+                                                  "' and those after it are not");
             }
             ++sent;
         }
         printf("%s imported.\n", programs::Count(sent, "task").c_str());
-        return kOk;
     }
 
 private:
     bool IsThere(const std::string& name) const { return there_.count(name) != 0; }
 
-    ExitCode CheckOne(const PObject& task) const {
+    void CheckOne(const PObject& task) const {
         const std::string name = task["name"].asString();
         if (IsThere(name) && !replace_) {
-            return Fail(kLocal, "there is a task '%s' already: --replace makes it that of the file",
-                        Printable(name).c_str());
+            throw Failure(FailureKind::kLocal,
+                          "there is a task '" + Printable(name) +
+                              "' already: --replace makes it that of the file");
         }
-        return CheckPossible(task);
+        CheckPossible(task);
     }
 
-    ExitCode GetPassword(PObject& task) {
+    void GetPassword(PObject& task) {
         const PObject& read = task;
         if (read.hasMember("pswd")) {
-            return kOk;
+            return;
         }
         const auto before = there_.find(read["name"].asString());
         if (before != there_.end() && ServerOf(before->second) == ServerOf(read) &&
             before->second["user"].asString() == read["user"].asString()) {
-            return kOk;  // the daemon has it, and for this very account
+            return;  // the daemon has it, and for this very account
         }
         if (password_file_.empty() || !password_) {
-            std::string error;
-            password_ =
-                programs::ReadNewPassword(password_file_,
-                                          "Password of " + Printable(read["user"].asString()) +
-                                              " on " + Printable(ServerOf(read)) + " (task '" +
-                                              Printable(read["name"].asString()) + "'): ",
-                                          error);
-            if (!password_) {
-                return Fail(kUsage, "%s; nothing was imported", error.c_str());
+            try {
+                password_ = programs::ReadNewPassword(
+                    password_file_, "Password of " + Printable(read["user"].asString()) + " on " +
+                                        Printable(ServerOf(read)) + " (task '" +
+                                        Printable(read["name"].asString()) + "'): ");
+            } catch (const Failure& failure) {
+                throw Failure(failure.Kind(),
+                              std::string(failure.what()) + "; nothing was imported");
             }
         }
         task["pswd"] = *password_;
-        return kOk;
     }
 
     std::vector<PObject> tasks_;
@@ -197,45 +199,35 @@ PObject Whole(const PObject& task) {
 
 }  // namespace
 
-ExitCode ExportTasks(const std::string& path, bool with_passwords) {
+void ExportTasks(const std::string& path, bool with_passwords) {
     const bool to_output = path.empty() || path == "-";
     if (with_passwords && to_output) {
-        return Fail(kUsage, "--with-passwords needs a file: passwords are never shown");
+        throw Failure(FailureKind::kUsage,
+                      "--with-passwords needs a file: passwords are never shown");
     }
-    PObject reply;
-    const ExitCode code = GetTasks(with_passwords, reply);
-    if (code != kOk) {
-        return code;
-    }
-    const PObject::Array& tasks = static_cast<const PObject&>(reply)["tasks"].asArray();
+    const PObject reply = GetTasks(with_passwords);
+    const PObject::Array& tasks = reply["tasks"].asArray();
     const std::string text = WriteTaskFile(tasks, with_passwords);
     if (to_output) {
         fputs(text.c_str(), stdout);
-        return kOk;
+        return;
     }
     if (!base::ReplaceFile(path, text, with_passwords ? kSecretMode : kPlainMode)) {
-        return Fail(kLocal, "cannot write %s: %s", Printable(path).c_str(), strerror(errno));
+        throw programs::SystemFailure("cannot write " + Printable(path), FailureKind::kLocal);
     }
     printf("%s in %s%s\n", programs::Count(tasks.size(), "task").c_str(), Printable(path).c_str(),
            with_passwords ? ", with their passwords: keep it safe" : "");
-    return kOk;
 }
 
-ExitCode ImportTasks(const std::string& path, bool replace, const std::string& password_file) {
-    std::vector<PObject> tasks;
-    ExitCode code = ReadTasks(path, tasks);
-    if (code != kOk) {
-        return code;
-    }
+void ImportTasks(const std::string& path, bool replace, const std::string& password_file) {
+    std::vector<PObject> tasks = ReadTasks(path);
     for (PObject& task : tasks) {
         task = Whole(task);
     }
     Import import(std::move(tasks), replace, password_file);
-    code = import.Check();
-    if (code == kOk) {
-        code = import.GetPasswords();
-    }
-    return code == kOk ? import.Send() : code;
+    import.Check();
+    import.GetPasswords();
+    import.Send();
 }
 
 }  // namespace zelctl

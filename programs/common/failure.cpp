@@ -1,0 +1,36 @@
+#include "programs/common/failure.h"
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+
+namespace programs {
+
+Failure SystemFailure(const std::string& what, FailureKind kind) {
+    return {kind, what + ": " + strerror(errno)};
+}
+
+Failure ReportedFailure(FailureKind kind) {
+    return {kind, ""};
+}
+
+void Report(const char* program, const std::string& text) {
+    if (!text.empty()) {
+        fprintf(stderr, "%s: %s\n", program, text.c_str());
+    }
+}
+
+int RunReporting(const char* program, const std::function<void()>& command) {
+    try {
+        command();
+        return 0;
+    } catch (const Failure& failure) {
+        Report(program, failure.what());
+        return static_cast<int>(failure.Kind());
+    } catch (const std::exception& error) {
+        Report(program, error.what());
+        return static_cast<int>(FailureKind::kFailed);
+    }
+}
+
+}  // namespace programs
