@@ -11,8 +11,6 @@ namespace ZEL {
 
 namespace {
 
-static_assert(sizeof(long) == sizeof(time_t), "times are handed out as long");
-
 constexpr size_t kDaysInWeek = 7;
 constexpr char kEveryDay[] = "1111111";
 constexpr char kNoDay[] = "0000000";
@@ -30,6 +28,13 @@ constexpr const char* kModeTexts[] = {"manual", "realtime", "weekly", "monthly",
 // refuses it.
 int ClampToInt(int64_t value) {
     return static_cast<int>(std::clamp<int64_t>(value, INT_MIN, INT_MAX));
+}
+
+// As mktime(). Times are handed out as long: what that does not hold is no time here, however wide
+// time_t is.
+long MakeTime(struct tm& time) {
+    long seconds = 0;
+    return __builtin_add_overflow(mktime(&time), 0, &seconds) ? -1 : seconds;
 }
 
 // `what`: which seconds could not be had.
@@ -186,7 +191,7 @@ bool Schedule::Validate() const {
     const struct tm begin = GetScheduleBegin();
     struct tm noon = begin;
     noon.tm_hour = 12;  // no change of daylight saving moves noon to another date
-    if (mktime(&noon) < 0) {
+    if (MakeTime(noon) < 0) {
         Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] ZEL/sync_obj(%d): Invalid begin\n", __LINE__);
         Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] ZEL/sync_obj(%d): %d %d %d %d %d %d\n", __LINE__,
                        noon.tm_year, noon.tm_mon, noon.tm_mday, noon.tm_hour, noon.tm_min,
@@ -235,7 +240,8 @@ long Schedule::GetNextScheduledSeconds(long reference) const {
     // `now`, to the second.
     struct tm now = {};
     long now_seconds = reference;
-    if (localtime_r(&reference, &now) == nullptr) {
+    const time_t moment = reference;
+    if (localtime_r(&moment, &now) == nullptr) {
         return -1;
     }
     for (int candidates = 0; candidates < kMaxCandidateDays; ++candidates) {
@@ -250,7 +256,7 @@ long Schedule::GetNextScheduledSeconds(long reference) const {
             return -1;
         }
         if (!IsSameDate(day, now)) {
-            const long day_seconds = mktime(&day);
+            const long day_seconds = MakeTime(day);
             if (day_seconds < 0) {
                 LogTime("scheduled", day);
                 return -1;
@@ -284,7 +290,7 @@ long Schedule::GetNextScheduledSeconds(long reference) const {
         first.tm_hour = start_hour_;
         first.tm_min = start_minute_;
         first.tm_sec = 0;
-        const long first_seconds = mktime(&first);
+        const long first_seconds = MakeTime(first);
         if (first_seconds < 0) {
             LogTime("scheduled", first);
         } else if (const long run =
@@ -297,7 +303,7 @@ long Schedule::GetNextScheduledSeconds(long reference) const {
         now.tm_min = 0;
         now.tm_sec = 0;
         now.tm_mday += 1;
-        now_seconds = mktime(&now);
+        now_seconds = MakeTime(now);
         if (now_seconds < 0) {
             Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/sync_obj(%d): Fail to mktime.\n",
                            __LINE__);

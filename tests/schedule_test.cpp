@@ -128,7 +128,8 @@ long WalkToNextRun(const Schedule& schedule, long reference) {
     const long end = reference + 2 * 366 * 86400L;
     for (long time = reference - reference % 60 + 60; time < end; time += 60) {
         struct tm now = {};
-        localtime_r(&time, &now);
+        const time_t moment = time;
+        localtime_r(&moment, &now);
         const unsigned int mode = schedule.GetMode();
         const bool run_day =
             mode == ZEL::SCHD_MODE_WEEKLY
@@ -170,7 +171,7 @@ TEST(Schedule, AgreesWithAWalkOverTheCalendar) {
             std::bitset<7>(static_cast<unsigned int>(pick(1, 127))).to_string());
         schedule.SetStartMinute(pick(0, 59));
         struct tm begin = schedule.GetScheduleBegin();
-        const long reference = mktime(&begin) + pick(-40 * 86400, 3 * 86400);
+        const long reference = static_cast<long>(mktime(&begin)) + pick(-40 * 86400, 3 * 86400);
         if (schedule.Validate()) {
             const long walked = WalkToNextRun(schedule, reference);
             ASSERT_EQ(schedule.GetNextScheduledSeconds(reference), walked)

@@ -22,7 +22,7 @@ inline void SetZone(const char* zone) {
 inline long Utc(const char* text) {
     struct tm time = {};
     EXPECT_NE(strptime(text, "%Y-%m-%d %H:%M:%S", &time), nullptr) << text;
-    return timegm(&time);
+    return static_cast<long>(timegm(&time));
 }
 inline std::string UtcText(int64_t seconds) {
     const time_t moment = static_cast<time_t>(seconds);
