@@ -352,8 +352,8 @@ int Channel::FlushWrite(int count) {
         const unsigned int chunk = std::min(write_.size, capacity_ - write_.head);
         Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): WriteFd: from %zu, len %zu\n",
                        __LINE__, size_t{write_.head}, size_t{chunk});
-        const int moved = ops_.write(handle_, write_.bytes.get() + write_.head, chunk,
-                                     select_interval_, abort_flag_);
+        const int moved =
+            ops_.write(handle_, write_.bytes.get() + write_.head, chunk, kSlice, abort_flag_);
         if (moved == RESULT_TIMEOUT) {
             if (TimedOut(last_progress)) {
                 Logger::LogMsg(
@@ -485,8 +485,7 @@ int Channel::ConnectWithTimeout(int fd, const char* ip, int port) {
     uint64_t elapsed = 0;
     for (;;) {
         Readiness readiness;
-        const int result =
-            WaitFd(fd, Watch::kWrite, select_interval_, abort_flag_, nullptr, readiness);
+        const int result = WaitFd(fd, Watch::kWrite, kSlice, abort_flag_, nullptr, readiness);
         if (result == 0 && readiness.exception) {
             Logger::LogMsg(Logger::LEVEL_WARNING,
                            "[WARNING] ZEL/channel(%d): connect: exception set\n", __LINE__);
@@ -556,7 +555,7 @@ int Channel::Receive(int want, char* target, int& total) {
             "[DEBUG] ZEL/channel(%d): ReadMore: want = %d, total = %d, len = %zu, r_head = "
             "%zu, r_size = %zu\n",
             __LINE__, want, total, size_t{room}, size_t{read_.head}, size_t{read_.size});
-        const int moved = ops_.read(handle_, place, room, select_interval_, abort_flag_);
+        const int moved = ops_.read(handle_, place, room, kSlice, abort_flag_);
         if (moved == RESULT_TIMEOUT) {
             if (TimedOut(last_progress)) {
                 Logger::LogMsg(

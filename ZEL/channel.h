@@ -245,10 +245,9 @@ private:
     ChannelOps ops_ = {};  // the current mode's
     Ring write_;
     Ring read_;
-    unsigned int capacity_;             // bytes of each ring
-    timeval select_interval_ = {1, 0};  // one slice of waiting
-    unsigned int timeout_ = 60;         // seconds; 0: no limit
-    int* abort_flag_ = nullptr;         // not owned
+    unsigned int capacity_;      // bytes of each ring
+    unsigned int timeout_ = 60;  // seconds; 0: no limit
+    int* abort_flag_ = nullptr;  // not owned
     bool tls_ = false;
     bool allow_untrusted_ = true;
     std::string tls_host_name_;

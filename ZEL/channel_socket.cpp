@@ -20,9 +20,9 @@ constexpr short kWriteEvents = POLLOUT | POLLERR;
 
 }  // namespace
 
-int PollMilliseconds(const timeval& interval) {
+int PollMilliseconds(int64_t seconds, int64_t microseconds) {
     const int64_t milliseconds =
-        int64_t{interval.tv_sec} * 1000 + (int64_t{interval.tv_usec} + 999) / 1000;
+        std::clamp<int64_t>(seconds, -1, INT_MAX) * 1000 + (microseconds + 999) / 1000;
     return static_cast<int>(std::clamp<int64_t>(milliseconds, 0, INT_MAX));
 }
 
@@ -45,7 +45,7 @@ int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Patien
         if (Aborted(flag)) {
             return RESULT_INTERRUPTED;
         }
-        int ready = ask(look ? 0 : PollMilliseconds(interval));
+        int ready = ask(look ? 0 : PollMilliseconds(interval.tv_sec, interval.tv_usec));
         if (ready == 0 && look && patience != nullptr) {
             patience->LookForAMoment(flag, [&] {
                 ready = ask(0);

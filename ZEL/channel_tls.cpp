@@ -441,7 +441,7 @@ int Channel::ConvertToSSLChannel(bool server) {
         return RESULT_IO;
     }
     SSL_set_bio(tls.ssl, bio, bio);
-    const int result = SSLHandshake(tls.ssl, select_interval_, timeout_);
+    const int result = SSLHandshake(tls.ssl, kSlice, timeout_);
     if (result < 0) {
         Logger::LogMsg(Logger::LEVEL_WARNING,
                        "[WARNING] ZEL/channel(%d): Open to SSL connect to server failed\n",

@@ -116,7 +116,8 @@ bool IPCListener::isReady() {
         return false;
     }
     pollfd watched = {fd_, POLLIN, 0};
-    return poll(&watched, 1, PollMilliseconds(timeout_)) > 0 && (watched.revents & POLLNVAL) == 0;
+    return poll(&watched, 1, PollMilliseconds(timeout_seconds_, timeout_microseconds_)) > 0 &&
+           (watched.revents & POLLNVAL) == 0;
 }
 
 int IPCListener::accept() {

@@ -10,6 +10,7 @@
 
 #include <sys/time.h>
 
+#include <cstdint>
 #include <string>
 
 #include "ZEL/channel.h"
@@ -37,7 +38,10 @@ public:
     int prepare(const std::string& path);
 
     /// How long isReady() waits; 3 s unless set.
-    void setTimeout(const timeval& timeout) { timeout_ = timeout; }
+    void setTimeout(const timeval& timeout) {
+        timeout_seconds_ = timeout.tv_sec;
+        timeout_microseconds_ = timeout.tv_usec;
+    }
     /// Whether a connection can be accepted, waiting for one for the time-out. A signal ends the
     /// wait early.
     bool isReady();
@@ -61,7 +65,9 @@ public:
     int CloseDomainSocket(int fd);
 
 private:
-    timeval timeout_ = {3, 0};
+    // No timeval: its size is the program's time_t's.
+    int64_t timeout_seconds_ = 3;
+    int64_t timeout_microseconds_ = 0;
     int fd_ = -1;       // the listening socket
     std::string path_;  // of the domain socket; empty: TCP
 };

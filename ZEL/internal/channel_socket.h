@@ -10,6 +10,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cstdint>
 
 #include "ZEL/channel.h"
 
@@ -76,8 +77,11 @@ struct Readiness {
     bool exception = false;  ///< the peer has sent urgent data
 };
 
-/// A wait of `interval` in the milliseconds that poll(2) takes, rounded up; at least 0.
-int PollMilliseconds(const timeval& interval);
+/// A channel's waits are made of such intervals.
+constexpr timeval kSlice = {1, 0};
+
+/// A wait in the milliseconds that poll(2) takes, rounded up; at least 0.
+int PollMilliseconds(int64_t seconds, int64_t microseconds);
 
 /// Waits for one interval, after a moment's patience where there is any (may be null). 0: something
 /// is in `readiness`; -1: the flag is set; -9: nothing happened; -3.
