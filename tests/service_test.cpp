@@ -47,21 +47,6 @@ private:
     Task task_;
 };
 
-/// No thread can be started in its scope: none has memory for its stack.
-class NoThreads {
-public:
-    NoThreads() {
-        pthread_getattr_default_np(&before_);
-        pthread_attr_t after = before_;
-        pthread_attr_setstacksize(&after, SIZE_MAX / 4);
-        pthread_setattr_default_np(&after);
-    }
-    ~NoThreads() { pthread_setattr_default_np(&before_); }
-
-private:
-    pthread_attr_t before_;
-};
-
 class ServiceTest : public testing::Test {
 protected:
     ServiceTest() {
@@ -215,9 +200,8 @@ TEST_F(ServiceTest, WhatWasMissedWhileTheDaemonWasOffIsMadeUpForOnce) {
     Pass(48 * 3600);
     EXPECT_EQ(State().status, ZEL::TASK_STATUS_PAUSED);
     service_->SetPaused("t", false);
-    Start();
-    Pass(15);
-    EXPECT_THAT(NewRuns(), ElementsAre("retry"));
+    RequestRun();
+    EXPECT_THAT(NewRuns(), ElementsAre("request"));
     for (int i = 0; i < 3; ++i) {  // one change seldom comes alone
         service_->MayHaveRecovered(zel_daemon::Recovery::kNetwork);
     }
@@ -229,12 +213,15 @@ TEST_F(ServiceTest, WhatWasMissedWhileTheDaemonWasOffIsMadeUpForOnce) {
 TEST_F(ServiceTest, WithoutAThreadARunFailsAndIsMadeLater) {
     StartServer();
     Add("t");
-    {
-        const NoThreads none;
-        RequestRun();
-        EXPECT_THAT(State().last->error, HasSubstr("TasksMax="));
-        EXPECT_EQ(State().last->result, ZEL::TASK_RESULT_FAILED);
-    }
+    pthread_attr_t usual;
+    pthread_getattr_default_np(&usual);
+    pthread_attr_t huge = usual;  // stacks for which there is no memory
+    pthread_attr_setstacksize(&huge, SIZE_MAX / 4);
+    pthread_setattr_default_np(&huge);
+    RequestRun();
+    pthread_setattr_default_np(&usual);
+    EXPECT_THAT(State().last->error, HasSubstr("TasksMax="));
+    EXPECT_EQ(State().last->result, ZEL::TASK_RESULT_FAILED);
     Pass(15);
     EXPECT_THAT(NewRuns(), ElementsAre("request", "retry"));
     EXPECT_TRUE(Runs("t"));
