@@ -32,8 +32,7 @@ std::string Text(const TaskRecord& record) {
     for (const std::string& exclude : record.excludes) {
         text += " -" + exclude;
     }
-    return text + " " + std::to_string(record.paused) + std::to_string(record.whole_due) + " " +
-           std::to_string(record.checked_until);
+    return text + " " + std::to_string(record.paused) + " " + std::to_string(record.checked_until);
 }
 
 std::string Fault(const std::function<void()>& work) {
@@ -90,7 +89,6 @@ TEST_F(StoreTest, KeepsEveryFieldOfATask) {
 
     record.task.GetInfo().SetName("Fotos täglich");
     record.paused = false;
-    record.whole_due = true;
     store_->UpdateTask(record);
     EXPECT_EQ(Text(store_->Tasks()[0]), Text(record));
     Database database(path_);
@@ -124,16 +122,16 @@ TEST_F(StoreTest, AChangeWaitsOnceAndOnceMoreWhileItIsBeingSent) {
     store_->AddEvents(other, "s", {"/z"});
     EXPECT_THAT(Pending(task), ElementsAre("s /z", "s /\xff\n", "s /a", "t /z"));
     const std::vector<uint64_t> ids = ids_;
-    store_->MarkSending({ids[0], ids[1], ids[3]});
+    RunRecord run;
+    run.id = store_->BeginRun(task, RunReason::kChange, 100, {ids[0], ids[1], ids[3]});
     store_->AddEvents(task, "s", {"/z", "/a"});
     EXPECT_THAT(Pending(task), ElementsAre("s /a", "s /z"));
     EXPECT_EQ(store_->CountEvents(task), 5U);
-    store_->RemoveEvents({ids[1]});
-    store_->ReturnEvents({ids[0], ids[3], 999});
+    store_->EndRun(run, {{ids[1]}, {ids[0], ids[3], 999}});
     EXPECT_THAT(Pending(task), ElementsAre("s /z", "s /a", "t /z"));
     EXPECT_EQ(store_->CountEvents(task), 3U);
 
-    store_->MarkSending({ids[0]});
+    store_->BeginRun(task, RunReason::kChange, 200, {ids[0]});
     TaskRecord reset = Task("reset");
     reset.task.SetID(task);
     store_->ResetTask(reset);
@@ -180,10 +178,9 @@ TEST_F(StoreTest, KeepsTheLastRunsOfEachTask) {
 
 TEST_F(StoreTest, WhatWasCutOffHasFailedAndWaitsAgain) {
     const uint64_t task = store_->AddTask(Task("a"));
-    store_->BeginRun(task, RunReason::kChange, 100);
     store_->AddEvents(task, "s", {"/a", "/b"});
     Pending(task);
-    store_->MarkSending(ids_);
+    store_->BeginRun(task, RunReason::kChange, 100, ids_);
     store_->AddEvents(task, "s", {"/b"});
     Reopen();
     EXPECT_EQ(store_->Runs(task, 1).at(0).result, ZEL::TASK_RESULT_FAILED);
@@ -395,19 +392,21 @@ TEST_F(StoreTest, LayoutsAreBroughtUpToDateStepByStep) {
             store.AddEvents(task, "s", {name, name + "+"});
             tell('e', name);
             tell('e', name + "+");
+            const ZEL::Event last = store.PendingEvents(task).back();
             RunRecord run;
-            run.id = store.BeginRun(task, RunReason::kChange, 1000);
+            run.id = store.BeginRun(task, RunReason::kChange, 1000, {last.GetID()});
             tell('r', std::to_string(run.id));
-            const std::vector<ZEL::Event> events = store.PendingEvents(task);
-            store.MarkSending({events.back().GetID()});
+            zel_daemon::RunEnd end;
+            if (i % 3 == 0) {
+                tell('t', last.GetRelativePath());
+                end.sent = {last.GetID()};
+            }
             run.end = 2000;
             run.result = ZEL::TASK_RESULT_SUCCESS;
-            store.EndRun(run);
+            store.EndRun(run, end);
             tell('d', std::to_string(run.id));
             if (i % 3 == 0) {
-                tell('t', events.back().GetRelativePath());
-                store.RemoveEvents({events.back().GetID()});
-                tell('g', events.back().GetRelativePath());
+                tell('g', last.GetRelativePath());
             }
         }
     } catch (const StoreError& error) {

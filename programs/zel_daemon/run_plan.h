@@ -1,7 +1,6 @@
-// One run of a task: what it is to send, and what becomes of the changes that it was for.
+// One run of a task: what it is to send.
 #pragma once
 
-#include <cstdint>
 #include <vector>
 
 #include "programs/common/task_run.h"
@@ -13,12 +12,6 @@ struct RunPlan {
     programs::RunOrder order;
     RunRecord record;
     std::vector<ZEL::Event> events;  ///< the stored changes that it sends
-};
-
-/// The numbers of a run's stored changes, after its end.
-struct RunEnd {
-    std::vector<uint64_t> sent;    ///< the server has taken these
-    std::vector<uint64_t> unsent;  ///< and these not
 };
 
 }  // namespace zel_daemon

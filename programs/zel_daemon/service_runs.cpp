@@ -102,9 +102,7 @@ Step Service::DoChores(Task& task) {
 
 void Service::StoreEnd(Task& task) {
     if (const std::optional<RunEnd>& end = task.machine.End()) {
-        store_.RemoveEvents(end->sent);
-        store_.ReturnEvents(end->unsent);
-        store_.EndRun(*task.machine.Last());
+        store_.EndRun(*task.machine.Last(), *end);
         task.machine.EndStored();
         task.pending = store_.CountEvents(task.machine.Record().ID());
     }
@@ -159,8 +157,8 @@ void Service::StartRun(Task& task, const Step& step) {
         if (!plan) {
             return;
         }
-        store_.MarkSending(IdsOf(plan->events));
-        plan->record.id = store_.BeginRun(record.ID(), plan->record.reason, plan->record.start);
+        plan->record.id = store_.BeginRun(record.ID(), plan->record.reason, plan->record.start,
+                                          IdsOf(plan->events));
     } catch (const StoreError& error) {
         StoreFailed(task, error);
         return;

@@ -156,12 +156,15 @@ struct Store::Impl {
         }
     }
 
-    void ForEach(const std::string& what, const std::vector<uint64_t>& ids, const char* statement) {
-        Change(what, [&] {
-            for (const uint64_t id : ids) {
-                Query(*database, statement, id).Run();
-            }
-        });
+    // `statement` has one parameter, the ids as a JSON array: one statement costs half of many.
+    void ForIds(const std::vector<uint64_t>& ids, const char* statement) {
+        std::string list;
+        for (const uint64_t id : ids) {
+            list += (list.empty() ? "[" : ",") + std::to_string(id);
+        }
+        if (!ids.empty()) {
+            Query(*database, statement, list + "]").Run();
+        }
     }
 
     const std::string path;
@@ -273,21 +276,6 @@ std::vector<ZEL::Event> Store::PendingEvents(uint64_t task_id, const std::string
     });
 }
 
-// A change that comes to another one of the same path in the same state takes its place.
-void Store::MarkSending(const std::vector<uint64_t>& ids) {
-    impl_->ForEach("mark changes as being sent", ids,
-                   "UPDATE OR REPLACE events SET status = 1 WHERE id = ?");
-}
-
-void Store::RemoveEvents(const std::vector<uint64_t>& ids) {
-    impl_->ForEach("remove changes that were sent", ids, "DELETE FROM events WHERE id = ?");
-}
-
-void Store::ReturnEvents(const std::vector<uint64_t>& ids) {
-    impl_->ForEach("take back changes", ids,
-                   "UPDATE OR REPLACE events SET status = 0 WHERE id = ?");
-}
-
 uint64_t Store::CountEvents(uint64_t task_id) {
     return impl_->Do("count the changes", [&] {
         Query query(*impl_->database, "SELECT count(*) FROM events WHERE task = ?", task_id);
@@ -296,8 +284,13 @@ uint64_t Store::CountEvents(uint64_t task_id) {
     });
 }
 
-uint64_t Store::BeginRun(uint64_t task_id, RunReason reason, int64_t start) {
+// A change that comes to another one of the same path in the same state takes its place.
+uint64_t Store::BeginRun(uint64_t task_id, RunReason reason, int64_t start,
+                         const std::vector<uint64_t>& sending) {
     return impl_->Change("note the beginning of a run", [&] {
+        impl_->ForIds(sending,
+                      "UPDATE OR REPLACE events SET status = 1 "
+                      "WHERE id IN (SELECT value FROM json_each(?))");
         Query(*impl_->database, "INSERT INTO runs (task, reason, start_time) VALUES (?, ?, ?)",
               task_id, static_cast<int>(reason), start)
             .Run();
@@ -311,8 +304,12 @@ uint64_t Store::BeginRun(uint64_t task_id, RunReason reason, int64_t start) {
     });
 }
 
-void Store::EndRun(const RunRecord& run) {
+void Store::EndRun(const RunRecord& run, const RunEnd& end) {
     impl_->Change("note the end of a run", [&] {
+        impl_->ForIds(end.sent, "DELETE FROM events WHERE id IN (SELECT value FROM json_each(?))");
+        impl_->ForIds(end.unsent,
+                      "UPDATE OR REPLACE events SET status = 0 "
+                      "WHERE id IN (SELECT value FROM json_each(?))");
         Query(*impl_->database,
               "UPDATE runs SET end_time = ?, result = ?, status = ?, error = ?, details = ?, "
               "files_sent = ?, files_deleted = ?, bytes_sent = ?, rsync_runs = ? WHERE id = ?",

@@ -66,19 +66,17 @@ public:
     /// Those of one share whose id is larger than `after`.
     std::vector<ZEL::Event> PendingEvents(uint64_t task_id, const std::string& share,
                                           uint64_t after);
-    /// Marks these as being sent: a change of the same path that comes now waits on its own.
-    void MarkSending(const std::vector<uint64_t>& ids);
-    /// The server took these.
-    void RemoveEvents(const std::vector<uint64_t>& ids);
-    /// The run failed: they wait again, each as one with a change of the same path that came since.
-    void ReturnEvents(const std::vector<uint64_t>& ids);
     /// The changes of a task that the server has not taken yet: that wait or are being sent.
     uint64_t CountEvents(uint64_t task_id);
 
-    /// Notes the beginning of a run and returns its id.
-    uint64_t BeginRun(uint64_t task_id, RunReason reason, int64_t start);
-    /// Notes how the run with the record's id ended; nothing when its task is gone.
-    void EndRun(const RunRecord& run);
+    /// Notes the beginning of a run, which sends these changes, and returns its id. A change of the
+    /// same path that comes now waits on its own.
+    uint64_t BeginRun(uint64_t task_id, RunReason reason, int64_t start,
+                      const std::vector<uint64_t>& sending = {});
+    /// Notes how the run with the record's id ended (nothing of it when its task is gone). The
+    /// changes that were sent are removed; the unsent ones wait again, each as one with a change of
+    /// the same path that came since.
+    void EndRun(const RunRecord& run, const RunEnd& end = {});
     /// The last runs of a task, newest first.
     std::vector<RunRecord> Runs(uint64_t task_id, unsigned int limit);
     /// The last run of each task that has one, the running ones included, by task id.

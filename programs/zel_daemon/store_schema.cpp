@@ -71,10 +71,13 @@ constexpr char kDetails[] = R"(
 ALTER TABLE runs ADD COLUMN details TEXT NOT NULL DEFAULT '';  -- what rsync and ssh wrote
 )";
 
+// Each share's state begins anew with the daemon.
+constexpr char kNoWholeDue[] = "ALTER TABLE tasks DROP COLUMN whole_due";
+
 }  // namespace
 
 const SchemaSteps& StoreSchema() {
-    static const SchemaSteps steps = {kFirst, kDetails};
+    static const SchemaSteps steps = {kFirst, kDetails, kNoWholeDue};
     return steps;
 }
 

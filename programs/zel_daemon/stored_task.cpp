@@ -18,7 +18,6 @@ constexpr char kShareList[] = "share_list";
 constexpr char kExclude[] = "exclude";
 constexpr char kPaused[] = "paused";
 constexpr char kCheckedUntil[] = "checked_until";
-constexpr char kWholeDue[] = "whole_due";
 
 // A row is the task's map with the daemon's own keys beside it.
 constexpr const char* kColumns[] = {
@@ -47,7 +46,6 @@ constexpr const char* kColumns[] = {
     kExclude,
     kPaused,
     kCheckedUntil,
-    kWholeDue,
 };
 
 // A list as a JSON array. An element that is no text, which JSON cannot hold, is an array of its
@@ -101,7 +99,6 @@ void BindTask(Query& query, const TaskRecord& record) {
     row[kExclude] = ToJson(record.excludes);
     row[kPaused] = record.paused;
     row[kCheckedUntil] = record.checked_until;
-    row[kWholeDue] = record.whole_due;
     for (const char* const column : kColumns) {
         const PObject& value = std::as_const(row)[column];
         if (value.isString()) {
@@ -134,7 +131,6 @@ TaskRecord ReadTask(Query& query) {
     record.task.SetID(id);
     record.paused = row[kPaused].asBool();
     record.checked_until = row[kCheckedUntil].asInt64();
-    record.whole_due = row[kWholeDue].asBool();
     return record;
 }
 

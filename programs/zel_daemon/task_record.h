@@ -16,8 +16,6 @@ struct TaskRecord {
     bool paused = false;                ///< started by nobody but a person
     /// Runs of the schedule up to this moment (seconds since the epoch) have been made or given up.
     int64_t checked_until = 0;
-    /// A realtime task's next run takes its shares whole: its events do not tell all that changed.
-    bool whole_due = false;
 
     uint64_t ID() const { return task.GetID(); }
     std::string Name() const { return task.GetInfo().GetName(); }
@@ -49,6 +47,12 @@ struct RunRecord {
     uint64_t files_deleted = 0;
     uint64_t bytes_sent = 0;
     uint64_t rsync_runs = 0;  ///< copies made, without the server commands around them
+};
+
+/// The numbers of a run's stored changes, after its end.
+struct RunEnd {
+    std::vector<uint64_t> sent;    ///< the server has taken these
+    std::vector<uint64_t> unsent;  ///< and these not
 };
 
 }  // namespace zel_daemon
