@@ -10,8 +10,8 @@ namespace {
 
 using namespace test;
 using namespace testing;
+using programs::FailureKind;
 using programs::Reach;
-using programs::Trouble;
 using zel_daemon::Recovery;
 using zel_daemon::RunPlan;
 using zel_daemon::ShareState;
@@ -19,12 +19,12 @@ using zel_daemon::Step;
 using zel_daemon::TaskMachine;
 
 constexpr int64_t kDay = int64_t{24} * 3600;
-const programs::RunFailure kRefused = {Trouble::kRefused, 212, "refused", Reach::kShare};
-const programs::RunFailure kBroken = {Trouble::kFailed, 12, "broken off", Reach::kShare};
-const programs::RunFailure kAway = {Trouble::kLocal, 0, "not mounted", Reach::kShare};
-const programs::RunFailure kBusy = {Trouble::kBusy, 23, "busy", Reach::kPaths};
-const programs::RunFailure kUnreadable = {Trouble::kFailed, 23, "unreadable", Reach::kPaths};
-const programs::RunFailure kDown = {Trouble::kFailed, 10, "refused", Reach::kRun};
+const programs::RunFailure kRefused = {FailureKind::kRefused, 212, "refused", Reach::kShare};
+const programs::RunFailure kBroken = {FailureKind::kFailed, 12, "broken off", Reach::kShare};
+const programs::RunFailure kAway = {FailureKind::kLocal, 0, "not mounted", Reach::kShare};
+const programs::RunFailure kBusy = {FailureKind::kBusy, 23, "busy", Reach::kPaths};
+const programs::RunFailure kUnreadable = {FailureKind::kFailed, 23, "unreadable", Reach::kPaths};
+const programs::RunFailure kDown = {FailureKind::kFailed, 10, "refused", Reach::kRun};
 
 class TaskMachineTest : public testing::Test {
 protected:
@@ -191,7 +191,7 @@ private:
                 for (const std::string& what : {share.share, share.share + path}) {
                     if (bad_.count(what) != 0) {
                         result.undone.push_back({share.share, {path}, bad_.at(what)});
-                        result.verdict = bad_.at(what);
+                        result.failure = bad_.at(what);
                     }
                 }
             }
@@ -388,7 +388,7 @@ TEST_F(TaskMachineTest, WhatAPersonCancelsIsOver) {
     EXPECT_EQ(Ask(), "request a/");
     EXPECT_EQ(Ask(), "");
     EXPECT_TRUE(machine_->Cancelled());
-    down_ = {Trouble::kCancelled, 20, "cancelled", Reach::kRun};
+    down_ = {FailureKind::kCancelled, 20, "cancelled", Reach::kRun};
     End();
     EXPECT_EQ(machine_->Last()->result, ZEL::TASK_RESULT_CANCELLED);
     EXPECT_EQ(Pass(3600), "");

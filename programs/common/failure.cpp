@@ -26,10 +26,10 @@ int RunReporting(const char* program, const std::function<void()>& command) {
         return 0;
     } catch (const Failure& failure) {
         Report(program, failure.what());
-        return static_cast<int>(failure.Kind());
+        return ExitStatusOf(failure.Kind());
     } catch (const std::exception& error) {
         Report(program, error.what());
-        return static_cast<int>(FailureKind::kFailed);
+        return ExitStatusOf(FailureKind::kFailed);
     }
 }
 

@@ -8,16 +8,22 @@
 
 namespace programs {
 
-/// What went wrong, as far as callers act on it. The numbers are what a program that fails so exits
-/// with; the manual pages list them.
-enum class FailureKind : int {
-    kFailed = 1,    ///< the connection, rsync or the server failed: worth another try
-    kUsage = 2,     ///< what was asked for is wrong or not there
-    kLocal = 3,     ///< something on this machine: a share, its volume, a file, a daemon that is
-                    ///< not running
-    kRefused = 4,   ///< the server refuses: conflict, account, password, switch
-    kCancelled = 5  ///< ended by a person
+/// What went wrong, as far as callers act on it.
+enum class FailureKind {
+    kNone,       ///< nothing: a run that went well
+    kFailed,     ///< the connection, rsync or the server failed: worth another try
+    kUsage,      ///< what was asked for is wrong or not there
+    kLocal,      ///< something on this machine: a share, its volume, a file, a daemon that is not
+                 ///< running
+    kRefused,    ///< the server refuses: conflict, account, password, switch
+    kCancelled,  ///< ended by a person
+    kBusy        ///< what was copied changed at the same time: worth another try soon
 };
+
+/// What a program that fails so exits with; the manual pages list them.
+constexpr int ExitStatusOf(FailureKind kind) {
+    return static_cast<int>(kind == FailureKind::kBusy ? FailureKind::kFailed : kind);
+}
 
 class Failure : public std::runtime_error {
 public:

@@ -4,6 +4,11 @@ namespace programs {
 
 std::string ServerStatusText(int status) {
     switch (status) {
+        case kLookupFailed:
+            return "no such server: its name cannot be looked up";
+        case kNothingSent:
+            return "this machine has no identity to show to the server: no serial number and no "
+                   "network interface; give it one in /usr/tarq/etc/tarqsdk.conf";
         case kUnknownCommand:
             return "the server does not know this command: run 'zel_server setup' there, or check "
                    "that the address "

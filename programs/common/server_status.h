@@ -1,4 +1,4 @@
-// The statuses that the server's command handler answers with; docs/server-commands.md says more.
+// The statuses of server commands; docs/server-commands.md says more of the handler's.
 #pragma once
 
 #include <string>
@@ -20,11 +20,22 @@ enum ServerStatus : int {
     kStorage = 216,
     kNameTaken = 217,
     kNotRunning = 218,
-    kServerFault = 219
+    kServerFault = 219,
+
+    // Of other servers.
+    kUnsupportedCommand = 51,
+    kAccepted = 207,       ///< the command was taken
+    kPassedThrough = 208,  ///< and passed on
+
+    // Of the library, which has asked nobody.
+    kLookupFailed = 42,
+    kNothingSent = 213,
+    kKeyFileFailed = 300
 };
+constexpr int kFirstServerStatus = kNoMemory;  ///< what is less is rsync's, but for the few above
 
 /// What a status of a server command means and what to do about it, for a person; empty for one
-/// that is not the command handler's.
+/// that says nothing by itself.
 std::string ServerStatusText(int status);
 
 }  // namespace programs

@@ -35,13 +35,6 @@ using TARQ::Backup::RunReport;
 constexpr std::chrono::seconds kBeaconEvery(60);  // the server takes a task for dead after 120
 constexpr std::chrono::seconds kLastWord(1);
 constexpr int kVanishedFiles = 24;  // rsync: some files were gone before it came to them
-constexpr int kLookupFailed = 42;
-constexpr int kUnsupportedCommand = 51;
-constexpr int kAccepted = 207;
-constexpr int kPassedThrough = 208;
-constexpr int kNothingSent = 213;
-constexpr int kKeyFileFailed = 300;
-constexpr int kFirstServerStatus = 200;
 
 // A share that changes while it is copied is copied so often in one run.
 constexpr int kBusyTries = 3;
@@ -117,13 +110,6 @@ private:
 };
 
 std::string Explain(int status, const RunReport& report) {
-    if (status == kLookupFailed) {
-        return "no such server: its name cannot be looked up";
-    }
-    if (status == kNothingSent) {
-        return "this machine has no identity to show to the server: no serial number and no "
-               "network interface; give it one in /usr/tarq/etc/tarqsdk.conf";
-    }
     std::string server_text = ServerStatusText(status);
     if (!server_text.empty() && (status >= kFirstServerStatus || report.explanation.empty())) {
         return server_text;
@@ -211,21 +197,21 @@ using Orders = std::vector<const ShareOrder*>;
 
 // What a run that has ended did not come to.
 void LeaveUndone(Orders::const_iterator begin, Orders::const_iterator end,
-                 const RunFailure& verdict, std::vector<Undone>& undone) {
+                 const RunFailure& failure, std::vector<Undone>& undone) {
     for (; begin != end; ++begin) {
-        undone.push_back({(*begin)->share, (*begin)->paths, verdict, false});
+        undone.push_back({(*begin)->share, (*begin)->paths, failure, false});
     }
 }
 
-void LeaveAllUndone(const Orders& shares, const RunFailure& verdict, std::vector<Undone>& undone) {
+void LeaveAllUndone(const Orders& shares, const RunFailure& failure, std::vector<Undone>& undone) {
     const size_t first = undone.size();
-    LeaveUndone(shares.begin(), shares.end(), verdict, undone);
+    LeaveUndone(shares.begin(), shares.end(), failure, undone);
     if (first < undone.size()) {
-        undone[first].tried = true;  // it is the one that the verdict is told with
+        undone[first].tried = true;  // the failure is told as its own
     }
 }
 
-// The one verdict of a run: the failure that ended it, or the first, with the others named.
+// What a run has failed with: what ended it, or the first, with the others named.
 RunFailure Summed(const std::vector<Undone>& undone) {
     std::vector<const Undone*> failed;
     size_t not_tried = 0;
@@ -240,26 +226,26 @@ RunFailure Summed(const std::vector<Undone>& undone) {
         return {};
     }
     const auto ended = std::find_if(failed.begin(), failed.end(), [](const Undone* item) {
-        return item->verdict.reach == Reach::kRun;
+        return item->failure.reach == Reach::kRun;
     });
     if (ended != failed.end()) {
         std::rotate(failed.begin(), ended, std::next(ended));
     }
-    RunFailure sum = failed.front()->verdict;
+    RunFailure sum = failed.front()->failure;
     size_t told = 1;
     for (; told < failed.size() && sum.error.size() < kMaxToldBytes; ++told) {
-        sum.error += "; " + failed[told]->verdict.error;
+        sum.error += "; " + failed[told]->failure.error;
     }
-    for (size_t i = 1; i < failed.size() && !failed[i]->verdict.details.empty(); ++i) {
-        if (sum.details.size() + failed[i]->verdict.details.size() >= kMaxDetailBytes) {
+    for (size_t i = 1; i < failed.size() && !failed[i]->failure.details.empty(); ++i) {
+        if (sum.details.size() + failed[i]->failure.details.size() >= kMaxDetailBytes) {
             break;
         }
-        sum.details += (sum.details.empty() ? "" : "\n") + failed[i]->verdict.details;
+        sum.details += (sum.details.empty() ? "" : "\n") + failed[i]->failure.details;
     }
     if (told < failed.size()) {
         sum.error += "; and " + std::to_string(failed.size() - told) + " more like these";
     }
-    if (not_tried > 0 && sum.trouble != Trouble::kCancelled && failed.size() > 1) {
+    if (not_tried > 0 && sum.kind != FailureKind::kCancelled && failed.size() > 1) {
         sum.error += "; " + Count(not_tried, "share") + " not tried";
     }
     return sum;
@@ -267,23 +253,23 @@ RunFailure Summed(const std::vector<Undone>& undone) {
 
 }  // namespace
 
-Trouble TroubleOf(int status) {
+FailureKind KindOf(int status) {
     if (status == kNothingSent || status == kKeyFileFailed) {
-        return Trouble::kLocal;
+        return FailureKind::kLocal;
     }
     return status < kFirstServerStatus && status != TARQ::Backup::STATUS_AUTHENTICATION
-               ? Trouble::kFailed
-               : Trouble::kRefused;
+               ? FailureKind::kFailed
+               : FailureKind::kRefused;
 }
 
-RunResult NothingDone(const RunOrder& order, const RunFailure& verdict) {
+RunResult NothingDone(const RunOrder& order, const RunFailure& failure) {
     Orders shares;
     for (const ShareOrder& share : order.shares) {
         shares.push_back(&share);
     }
     RunResult result;
-    LeaveAllUndone(shares, verdict, result.undone);
-    result.verdict = verdict;
+    LeaveAllUndone(shares, failure, result.undone);
+    result.failure = failure;
     return result;
 }
 
@@ -314,19 +300,21 @@ struct TaskRun::Impl {
 
     RunFailure Failed(const std::string& what, int status, Reach reach = Reach::kRun) const {
         if (cancel) {
-            return {Trouble::kCancelled, 0, "ended by the user; the next run completes the copy"};
+            return {FailureKind::kCancelled, 0,
+                    "ended by the user; the next run completes the copy"};
         }
         const std::string why = status == 0 ? "see the system log" : Explain(status, report);
-        return {status == 0 ? Trouble::kLocal : TroubleOf(status), status, what + ": " + why, reach,
-                report.details};
+        return {status == 0 ? FailureKind::kLocal : KindOf(status), status, what + ": " + why,
+                reach, report.details};
     }
 
     bool Silent() const { return report.status == TARQ::Backup::STATUS_TIMEOUT; }
 
     static RunFailure CheckShare(const std::string& share) {
         std::string problem = ShareProblem(share);
-        return problem.empty() ? RunFailure()
-                               : RunFailure{Trouble::kLocal, 0, std::move(problem), Reach::kShare};
+        return problem.empty()
+                   ? RunFailure()
+                   : RunFailure{FailureKind::kLocal, 0, std::move(problem), Reach::kShare};
     }
 
     // Finds the server. One that answers the probe, and then not the question for its version, is
@@ -383,7 +371,7 @@ struct TaskRun::Impl {
         for (const std::string& share : conflicts) {
             taken += (taken.empty() ? "" : ", ") + Quoted(share);
         }
-        return {Trouble::kRefused, status,
+        return {FailureKind::kRefused, status,
                 taken + (conflicts.size() == 1 ? " belongs" : " belong") +
                     " to another client or account at the server",
                 reach};
@@ -452,7 +440,7 @@ struct TaskRun::Impl {
                 if (undone.size() == before) {
                     continue;
                 }
-                RunFailure end = undone.back().verdict;
+                RunFailure end = undone.back().failure;
                 if (end.reach == Reach::kRun || !heard) {
                     end.reach = Reach::kRun;
                     LeaveUndone(share, shares.end(), end, undone);
@@ -569,8 +557,8 @@ struct TaskRun::Impl {
                 // Nothing was there to run for. A path that has gone meanwhile is a change that
                 // will be told, of the folder above it; a share that has gone is a fault.
                 return path == "/"
-                           ? RunFailure{Trouble::kLocal, 0, Quoted(share) + ": its folder is gone",
-                                        Reach::kShare}
+                           ? RunFailure{FailureKind::kLocal, 0,
+                                        Quoted(share) + ": its folder is gone", Reach::kShare}
                            : RunFailure();
             }
             ++rsync_runs;
@@ -594,8 +582,8 @@ struct TaskRun::Impl {
             path == "/" ? " is not complete" : ": " + Printable(path) + " is not complete";
         RunFailure failed =
             Failed(Quoted(share) + what, status, part ? Reach::kPaths : Reach::kShare);
-        if (busy && failed.trouble == Trouble::kFailed) {
-            failed.trouble = Trouble::kBusy;
+        if (busy && failed.kind == FailureKind::kFailed) {
+            failed.kind = FailureKind::kBusy;
         }
         return failed;
     }
@@ -677,7 +665,7 @@ RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
     } else {
         LeaveAllUndone(ready, found, result.undone);
     }
-    result.verdict = Summed(result.undone);
+    result.failure = Summed(result.undone);
     return result;
 }
 

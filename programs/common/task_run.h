@@ -9,22 +9,13 @@
 #include <vector>
 
 #include "ZEL/sync_obj.h"
+#include "programs/common/failure.h"
 #include "tarq/rsync_wrapper.h"
 
 namespace programs {
 
-/// What went wrong, as far as callers act on it.
-enum class Trouble {
-    kNone,
-    kFailed,    ///< the connection, rsync or the server failed: worth another try
-    kLocal,     ///< something on this machine: a share, its volume, a file
-    kRefused,   ///< the server refuses: conflict, account, password, switch
-    kBusy,      ///< what was copied changed at the same time: worth another try soon
-    kCancelled  ///< ended by a person
-};
-
 /// What a status that is not 0 comes to, see tarq/rsync_wrapper.h.
-Trouble TroubleOf(int status);
+FailureKind KindOf(int status);
 
 /// What a failure stands in the way of.
 enum class Reach {
@@ -35,13 +26,13 @@ enum class Reach {
 
 /// How an operation of a run ended, for a program and for a person.
 struct RunFailure {
-    Trouble trouble = Trouble::kNone;
+    FailureKind kind = FailureKind::kNone;
     int status = 0;     ///< the server's or rsync's (tarq/rsync_wrapper.h); 0 for local troubles
     std::string error;  ///< what failed, where and what to do; empty when nothing did
     Reach reach = Reach::kRun;
     std::string details = {};  ///< what rsync and ssh wrote about it, line by line; may be empty
 
-    bool Ok() const { return trouble == Trouble::kNone; }
+    bool Ok() const { return kind == FailureKind::kNone; }
 };
 
 /// What a run sent, all shares together.
@@ -77,7 +68,7 @@ struct RunOrder {
 struct Undone {
     std::string share;
     std::vector<std::string> paths;  ///< of its order
-    RunFailure verdict;
+    RunFailure failure;
     bool tried = true;  ///< false: the run had ended before it came to them
 };
 
@@ -85,12 +76,12 @@ struct Undone {
 struct RunResult {
     /// Of the failure that ended the run, else of the first. Its text names each failure, with its
     /// reason; after many it tells their number.
-    RunFailure verdict;
+    RunFailure failure;
     std::vector<Undone> undone;  ///< in the order of the run
 };
 
 /// That of a run that has failed as a whole, before anything of `order` was taken.
-RunResult NothingDone(const RunOrder& order, const RunFailure& verdict);
+RunResult NothingDone(const RunOrder& order, const RunFailure& failure);
 
 /// Told on the running thread; each may be empty.
 struct RunListener {

@@ -94,7 +94,7 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
 }
 
 RunResult ActiveRun::NothingDone(const std::string& why) const {
-    return programs::NothingDone(order_, {programs::Trouble::kLocal, 0, why});
+    return programs::NothingDone(order_, {programs::FailureKind::kLocal, 0, why});
 }
 
 void ActiveRun::End(EventLoop& loop, const OnEnd& on_end, const RunResult& result,

@@ -43,7 +43,7 @@ Service::~Service() {
         if (task.active) {
             task.active.reset();
             task.machine.Ended(programs::NothingDone(task.machine.Running()->order,
-                                                     {programs::Trouble::kLocal, 0, kStopped}),
+                                                     {programs::FailureKind::kLocal, 0, kStopped}),
                                {});
         }
         try {

@@ -193,7 +193,7 @@ void Service::EndRun(Task& task, const programs::RunResult& result,
         Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s': %s\n", __LINE__,
                        task.machine.Record().Name().c_str(), run.error.c_str());
     }
-    if (!result.verdict.Ok() && result.verdict.reach == programs::Reach::kRun) {
+    if (!result.failure.Ok() && result.failure.reach == programs::Reach::kRun) {
         task.connection.reset();
     }
     Advance();

@@ -7,8 +7,8 @@ namespace zel_daemon {
 
 namespace {
 
+using programs::FailureKind;
 using programs::Reach;
-using programs::Trouble;
 
 constexpr int64_t kAtOnce = std::numeric_limits<int64_t>::min();
 // A share that is always busy is tried this often, at least.
@@ -88,9 +88,9 @@ void ShareDebts::Release() {
 }
 
 void ShareDebts::Hasten(int64_t now, int64_t gap,
-                        const std::function<bool(const std::string& share, Trouble)>& fits) {
+                        const std::function<bool(const std::string& share, FailureKind)>& fits) {
     for (auto& [name, share] : shares_) {
-        if (share.retry.Waiting() && fits(name, share.trouble)) {
+        if (share.retry.Waiting() && fits(name, share.kind)) {
             share.retry.Hasten(now, gap);
             sums_.reset();
         }
@@ -106,7 +106,7 @@ const ShareDebts::Sums& ShareDebts::Summed() const {
                 TakeEarlier(sums_->next_retry, share.retry.At());
                 if (sums_->waiting.shares++ == 0) {
                     sums_->waiting.first = name;
-                    sums_->waiting.trouble = share.trouble;
+                    sums_->waiting.kind = share.kind;
                 }
             }
         }
@@ -184,18 +184,18 @@ void ShareDebts::Settle(int64_t now, const std::map<std::string, Outcome>& outco
             }
             share->failed_upto = std::max(share->failed_upto, outcome.last_change);
             share->shut = outcome.reach != Reach::kPaths;
-            share->trouble = outcome.trouble;
+            share->kind = outcome.kind;
             // What waited already does not wait longer for what has come to it.
             if (!share->retry.Waiting()) {
                 RetryDelays waits = delays;
-                if (outcome.trouble == Trouble::kBusy) {
+                if (outcome.kind == FailureKind::kBusy) {
                     waits.longest = std::min(waits.longest, kLongestBusyMs);
                 }
                 share->retry.Failed(now, waits, chance);
             }
         } else if (!share->retry.Waiting()) {
             share->retry.Settled();
-            share->trouble = Trouble::kNone;
+            share->kind = FailureKind::kNone;
         }
     }
     taken_.clear();

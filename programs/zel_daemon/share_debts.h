@@ -51,14 +51,14 @@ public:
         bool failed = false;
         bool broke_off = false;  ///< the server may have kept something of it: a resync is owed
         programs::Reach reach = programs::Reach::kPaths;
-        programs::Trouble trouble = programs::Trouble::kNone;
+        programs::FailureKind kind = programs::FailureKind::kNone;
         uint64_t last_change = 0;  ///< the highest number of its changes that failed
     };
     /// What waits for its next try, for a person.
     struct Waiting {
         size_t shares = 0;
-        std::string first;                                     ///< one of them
-        programs::Trouble trouble = programs::Trouble::kNone;  ///< that one's
+        std::string first;                                          ///< one of them
+        programs::FailureKind kind = programs::FailureKind::kNone;  ///< that one's
     };
 
     /// Forgets what is owed, and begins with these.
@@ -78,7 +78,7 @@ public:
     void Release();
     /// What these shares failed for may be over, see Backoff. `fits` is asked for each that waits.
     void Hasten(int64_t now, int64_t gap,
-                const std::function<bool(const std::string& share, programs::Trouble)>& fits);
+                const std::function<bool(const std::string& share, programs::FailureKind)>& fits);
 
     /// When something may be tried; now or earlier: at once. Nothing: never, as things are.
     std::optional<int64_t> Next() const;
@@ -102,7 +102,7 @@ private:
         uint64_t failed_upto = 0;    // those up to this number have; 0: none
         bool shut = false;           // and keep all else from being tried
         Backoff retry;
-        programs::Trouble trouble = programs::Trouble::kNone;
+        programs::FailureKind kind = programs::FailureKind::kNone;
 
         bool Owes() const { return state == ShareState::kUnknown || fresh || failed_upto != 0; }
         bool MayTry(int64_t now) const;

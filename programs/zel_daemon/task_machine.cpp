@@ -9,9 +9,9 @@ namespace zel_daemon {
 
 namespace {
 
+using programs::FailureKind;
 using programs::Reach;
 using programs::RunFailure;
-using programs::Trouble;
 
 // A store that could not be written is tried again after so long.
 constexpr int64_t kStoreRetryMs = 10000;
@@ -21,11 +21,11 @@ constexpr int64_t kLongestWaitMs = int64_t{24} * 3600 * 1000;
 constexpr int64_t kChangedAgainMs = 60000;
 
 // A receiver that died in a copy has left what it had of a file beside it, under another name.
-bool BrokeOff(const RunFailure& verdict) {
-    return verdict.reach == Reach::kShare &&
-           (verdict.status == TARQ::Backup::STATUS_SOCKET ||
-            verdict.status == TARQ::Backup::STATUS_PROTOCOL_STREAM ||
-            verdict.status == TARQ::Backup::STATUS_TIMEOUT);
+bool BrokeOff(const RunFailure& failure) {
+    return failure.reach == Reach::kShare &&
+           (failure.status == TARQ::Backup::STATUS_SOCKET ||
+            failure.status == TARQ::Backup::STATUS_PROTOCOL_STREAM ||
+            failure.status == TARQ::Backup::STATUS_TIMEOUT);
 }
 
 }  // namespace
@@ -183,9 +183,9 @@ void TaskMachine::Recovered(const std::set<Recovery>& what,
     if ((network || settings) && !running_) {
         plan_->Hasten(gap);
     }
-    debts_.Hasten(clock_.Elapsed(), gap, [&](const std::string& share, Trouble trouble) {
-        return trouble == Trouble::kLocal ? (volume || settings) && is_there(share)
-                                          : settings || (network && trouble == Trouble::kFailed);
+    debts_.Hasten(clock_.Elapsed(), gap, [&](const std::string& share, FailureKind kind) {
+        return kind == FailureKind::kLocal ? (volume || settings) && is_there(share)
+                                           : settings || (network && kind == FailureKind::kFailed);
     });
 }
 
@@ -296,8 +296,9 @@ std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& r
             plan.order.shares.push_back({due.share, changes.Take(), due.rest_waits});
         } else if (due.rest_waits) {
             // What changed is what has failed before: that may have mended it.
-            debts_.Hasten(now, kChangedAgainMs,
-                          [&](const std::string& share, Trouble) { return share == due.share; });
+            debts_.Hasten(now, kChangedAgainMs, [&](const std::string& share, FailureKind) {
+                return share == due.share;
+            });
         }
         if (due.again && step.reason == RunReason::kChange) {
             plan.record.reason = RunReason::kRetry;
@@ -335,20 +336,20 @@ void TaskMachine::Started(RunPlan plan) {
 const RunRecord& TaskMachine::Ended(const programs::RunResult& result,
                                     const programs::RunTotals& totals) {
     const RunPlan plan = std::move(*std::exchange(running_, std::nullopt));
-    const RunFailure& verdict = result.verdict;
+    const RunFailure& failure = result.failure;
     RunRecord& record = last_.emplace(plan.record);
     record.end = clock_.Now();
-    record.status = verdict.status;
-    record.error = verdict.error;
-    record.details = verdict.details;
+    record.status = failure.status;
+    record.error = failure.error;
+    record.details = failure.details;
     record.files_sent = totals.files_sent;
     record.files_deleted = totals.files_deleted;
     record.bytes_sent = totals.bytes_sent;
     record.rsync_runs = totals.rsync_runs;
-    record.result = verdict.Ok() ? ZEL::TASK_RESULT_SUCCESS
+    record.result = failure.Ok() ? ZEL::TASK_RESULT_SUCCESS
                     : by_person_ ? ZEL::TASK_RESULT_CANCELLED
                                  : ZEL::TASK_RESULT_FAILED;
-    if (record.result == ZEL::TASK_RESULT_FAILED && verdict.reach == Reach::kRun) {
+    if (record.result == ZEL::TASK_RESULT_FAILED && failure.reach == Reach::kRun) {
         plan_->Failed(Delays());
     } else {
         plan_->Settled();
@@ -363,13 +364,13 @@ void TaskMachine::Settle(const RunPlan& plan, const programs::RunResult& result)
     std::map<std::string, ShareDebts::Outcome> outcomes;
     for (const programs::Undone& undone : result.undone) {
         ShareDebts::Outcome& outcome = outcomes[undone.share];
-        if (!outcome.failed || undone.verdict.reach == Reach::kShare) {
-            outcome.reach = undone.verdict.reach;
-            outcome.trouble = undone.verdict.trouble;
+        if (!outcome.failed || undone.failure.reach == Reach::kShare) {
+            outcome.reach = undone.failure.reach;
+            outcome.kind = undone.failure.kind;
         }
         outcome.failed = true;
-        outcome.tried = outcome.tried && undone.verdict.reach != Reach::kRun;
-        outcome.broke_off = outcome.broke_off || BrokeOff(undone.verdict);
+        outcome.tried = outcome.tried && undone.failure.reach != Reach::kRun;
+        outcome.broke_off = outcome.broke_off || BrokeOff(undone.failure);
         for (const std::string& path : undone.paths) {
             unsent_paths[undone.share].push_back(&path);
         }
@@ -426,12 +427,12 @@ std::string TaskMachine::WaitsFor() const {
     } else {
         words += " waits";
     }
-    switch (waiting.trouble) {
-        case Trouble::kLocal:
+    switch (waiting.kind) {
+        case FailureKind::kLocal:
             return words + " for the volume or folder; tried at once when it is there";
-        case Trouble::kRefused:
+        case FailureKind::kRefused:
             return words + " for the server to take it";
-        case Trouble::kBusy:
+        case FailureKind::kBusy:
             return words + " until fewer files change while they are read";
         default:
             return words + " for the next try";

@@ -10,5 +10,6 @@ int main(int argc, char** argv) {
         return 0;
     }
     return programs::RunFromLibrary("zelctl", "libzelctl_commands.so",
-                                    static_cast<int>(programs::FailureKind::kLocal), argc, argv);
+                                    programs::ExitStatusOf(programs::FailureKind::kLocal), argc,
+                                    argv);
 }

@@ -87,9 +87,9 @@ std::string Quoted(const std::string& name) {
 }
 
 // What to do about a server's refusal, where its own words do not say.
-std::string RemedyOfRefusal(const programs::RunFailure& verdict, const PatientTask& task) {
+std::string RemedyOfRefusal(const programs::RunFailure& failure, const PatientTask& task) {
     const ZEL::TaskInfo& info = task.record.GetInfo();
-    switch (verdict.status) {
+    switch (failure.status) {
         case TARQ::Backup::STATUS_AUTHENTICATION:
             return "zelctl task edit " + Quoted(info.GetName()) +
                    " --password; at the server 'zel_server account add " +
@@ -101,15 +101,15 @@ std::string RemedyOfRefusal(const programs::RunFailure& verdict, const PatientTa
     }
 }
 
-void CheckAnswer(const programs::RunFailure& verdict, bool skipped, const PatientTask& task,
+void CheckAnswer(const programs::RunFailure& failure, bool skipped, const PatientTask& task,
                  Findings& found) {
     if (skipped) {
         found.push_back({"", Severity::kFailed,
                          "its server was not asked: it gave no answer for another task",
                          "see that task"});
-    } else if (!verdict.Ok()) {
+    } else if (!failure.Ok()) {
         found.push_back(
-            {"", Severity::kFailed, OneLine(verdict.error), RemedyOfRefusal(verdict, task)});
+            {"", Severity::kFailed, OneLine(failure.error), RemedyOfRefusal(failure, task)});
     }
 }
 

@@ -6,7 +6,6 @@
 #include "programs/common/text.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "programs/zelctl/base/prepare.h"
-#include "programs/zelctl/base/run_failure.h"
 #include "programs/zelctl/push/progress.h"
 #include "programs/zelctl/share/commands.h"
 
@@ -23,7 +22,7 @@ using TARQ::Backup::RunChange;
 
 void Require(const programs::RunFailure& ended) {
     if (!ended.Ok()) {
-        throw Failure(KindOf(ended.trouble), ended.error, ended.status);
+        throw Failure(ended.kind, ended.error, ended.status);
     }
 }
 
@@ -145,7 +144,7 @@ void Push(const PushOptions& options) {
     RunTotals totals;
     const programs::RunResult result = run.Push(order, totals);
     display.Clear();
-    Require(result.verdict);
+    Require(result.failure);
 }
 
 void CheckPairing(const ConnectionOptions& connection, const std::vector<std::string>& shares) {

@@ -13,8 +13,8 @@ namespace zelctl {
 
 namespace {
 
+using programs::FailureKind;
 using programs::RunFailure;
-using programs::Trouble;
 using std::chrono::steady_clock;
 
 constexpr std::chrono::milliseconds kLookForInterrupt(100);
@@ -62,25 +62,25 @@ RunFailure AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& 
                      std::chrono::seconds patience) {
     const Patience waiting(patience);
     programs::TaskRun run(info, waiting.Ended());
-    RunFailure verdict = run.Connect();
-    if (verdict.Ok()) {
-        verdict = run.CheckPairing(shares);
+    RunFailure failure = run.Connect();
+    if (failure.Ok()) {
+        failure = run.CheckPairing(shares);
     }
-    if (!verdict.Ok() && waiting.Ended() && !Interrupted()) {
+    if (!failure.Ok() && waiting.Ended() && !Interrupted()) {
         const std::string& name = info.GetServerName();
-        return {Trouble::kFailed, 0,
+        return {FailureKind::kFailed, 0,
                 "server " + (name.empty() ? info.GetServerIP() : name) + " gave no answer within " +
                     programs::Count(static_cast<uint64_t>(patience.count()), "second")};
     }
-    return verdict;
+    return failure;
 }
 
-bool IsSilence(const RunFailure& verdict) {
-    return verdict.trouble == Trouble::kFailed && verdict.status == 0;
+bool IsSilence(const RunFailure& failure) {
+    return failure.kind == FailureKind::kFailed && failure.status == 0;
 }
 
-bool IsRefusedForGood(const RunFailure& verdict) {
-    switch (verdict.status) {
+bool IsRefusedForGood(const RunFailure& failure) {
+    switch (failure.status) {
         case TARQ::Backup::STATUS_AUTHENTICATION:
         case programs::kUnknownCommand:
         case programs::kBadArgument:

@@ -15,10 +15,10 @@ programs::RunFailure AskServer(const ZEL::SyncInfo& info, const std::vector<std:
                                std::chrono::seconds patience);
 
 /// Whether that was the end of the patience.
-bool IsSilence(const programs::RunFailure& verdict);
+bool IsSilence(const programs::RunFailure& failure);
 
 /// Whether no later push would fare better: the account, or the shares' owner, has to be another
 /// one, or it is no server of ours.
-bool IsRefusedForGood(const programs::RunFailure& verdict);
+bool IsRefusedForGood(const programs::RunFailure& failure);
 
 }  // namespace zelctl

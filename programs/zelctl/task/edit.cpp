@@ -44,17 +44,17 @@ void TryServer(const ZEL::TaskInfo& info, const std::string& done) {
     }
     WatchForInterrupt();
     const std::list<std::string>& shares = info.GetShareList();
-    const programs::RunFailure verdict =
+    const programs::RunFailure failure =
         AskServer(info.GetSyncInfo(), {shares.begin(), shares.end()}, kPatience);
-    if (verdict.Ok()) {
+    if (failure.Ok()) {
         puts("The server takes the account and the shares.");
         return;
     }
-    const std::string error = Printable(OneLine(verdict.error));
-    if (verdict.trouble == programs::Trouble::kCancelled) {
+    const std::string error = Printable(OneLine(failure.error));
+    if (failure.kind == programs::FailureKind::kCancelled) {
         throw Failure(FailureKind::kCancelled, "ended by the user; nothing was " + done);
     }
-    if (IsRefusedForGood(verdict)) {
+    if (IsRefusedForGood(failure)) {
         throw Failure(FailureKind::kRefused,
                       error + "; nothing was " + done + " (--no-check does not ask the server)");
     }

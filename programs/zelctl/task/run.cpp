@@ -9,11 +9,11 @@
 #include "ZEL/sync_obj.h"
 #include "programs/common/failure.h"
 #include "programs/common/run_progress.h"
+#include "programs/common/task_run.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "programs/zelctl/base/live_block.h"
-#include "programs/zelctl/base/run_failure.h"
 #include "programs/zelctl/push/push.h"
 #include "programs/zelctl/task/view.h"
 
@@ -150,10 +150,9 @@ private:
                 return Failed(FailureKind::kCancelled, name, ": the run was cancelled");
             default: {
                 const int status = task["last_status"].asInt32();
-                return Failed(
-                    status == 0 ? FailureKind::kLocal : KindOf(programs::TroubleOf(status)), name,
-                    " failed after " + took_words + ": " +
-                        Printable(OneLine(task["last_error"].asString())));
+                return Failed(status == 0 ? FailureKind::kLocal : programs::KindOf(status), name,
+                              " failed after " + took_words + ": " +
+                                  Printable(OneLine(task["last_error"].asString())));
             }
         }
     }
