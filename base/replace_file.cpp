@@ -40,9 +40,8 @@ public:
 
     bool Create(mode_t mode) {
         struct stat there {};
-        if (fstatat(folder_, target_.c_str(), &there, AT_SYMLINK_NOFOLLOW) == 0 &&
-            !S_ISREG(there.st_mode) && !S_ISLNK(there.st_mode)) {
-            errno = S_ISDIR(there.st_mode) ? EISDIR : ENOTSUP;  // a device is nobody's to replace
+        if (fstatat(folder_, target_.c_str(), &there, 0) == 0 && !S_ISREG(there.st_mode)) {
+            errno = S_ISDIR(there.st_mode) ? EISDIR : ENOTSUP;  // no device, nor a link to one
             return false;
         }
         for (int attempt = 0; attempt < kTemporaryNames; ++attempt) {

@@ -8,9 +8,10 @@
 
 namespace base {
 
-/// Puts a file of the given content at `path` (no symbolic link) in one step: after a crash at any
-/// instant the old file or the new one is there, whole. `old` is the file's status, none when there
-/// is none: the new file takes its mode and owner.
+/// Puts a file of the given content at `path` in one step: after a crash at any instant the old
+/// file or the new one is there, whole. A symbolic link is replaced, not followed; what is no file
+/// is left alone. `old` is the file's status, none when there is none: the new file takes its mode
+/// and owner.
 ///
 /// The folder holds a file `.<name>.tmp<digit>` meanwhile; what a killed writer left behind is
 /// removed by the next one.

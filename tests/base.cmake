@@ -1,1 +1,1 @@
-zel_test(open_beneath_test open_beneath_test.cpp LIBRARIES base)
+zel_test(base_test base_test.cpp LIBRARIES base)

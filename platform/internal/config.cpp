@@ -24,11 +24,7 @@ ReadResult ReadSection(const std::string& path, const std::string& section, Sect
     if (result <= 0) {
         return result == 0 ? ReadResult::kAbsent : ReadResult::kFailed;
     }
-    const char* key = nullptr;
-    const char* value = nullptr;
-    for (int position = 0; KAPICSzHashNext(hash.get(), &position, &key, &value) == 1;) {
-        (*values)[key] = value;
-    }
+    *values = TARQ::Entries(hash);
     return ReadResult::kFound;
 }
 

@@ -220,18 +220,14 @@ std::optional<Share> ReadShare(const std::string& name) {
 
 std::optional<std::vector<std::string>> ReadShareNames() {
     const std::string path = CataloguePath();
-    std::vector<std::string> names;
     if (KAPICFileExist(path.c_str()) == 0) {
-        return names;
+        return std::vector<std::string>();
     }
     const TARQ::ListOwner list(KAPICSzListAlloc(0));
     if (!list || KAPICFileEnumSection(path.c_str(), list.get()) < 0) {
         return std::nullopt;
     }
-    for (int i = 0; i < KAPICSzListCount(list.get()); ++i) {
-        names.emplace_back(KAPICSzListGet(list.get(), i));
-    }
-    return names;
+    return TARQ::Entries(list);
 }
 
 bool WriteShare(const Share& share) {

@@ -11,16 +11,6 @@ namespace {
 
 constexpr int kHashCapacity = 64;
 
-TARQ::HashOwner ToHash(const Section& section) {
-    TARQ::HashOwner hash(KAPICSzHashAlloc(kHashCapacity));
-    for (const auto& [key, value] : section) {
-        if (!hash || KAPICSzHashSetValue(hash.get(), key.c_str(), value.c_str()) != 0) {
-            return nullptr;
-        }
-    }
-    return hash;
-}
-
 // The keys of a share's section, and what they hold.
 struct ShareKey {
     const char* key;
@@ -55,10 +45,7 @@ ReadResult ReadSection(const std::string& name, Section& section) {
     if (read <= 0) {
         return read == 0 ? ReadResult::kMissing : ReadResult::kFailed;
     }
-    int position = 0;
-    for (const char *key, *value; KAPICSzHashNext(hash.get(), &position, &key, &value) != 0;) {
-        section[key] = value;
-    }
+    section = TARQ::Entries(hash);
     return ReadResult::kRead;
 }
 
@@ -68,12 +55,7 @@ std::optional<std::vector<std::string>> SectionNames() {
         KAPICFileEnumSection(RegistryFile().c_str(), list.get()) < 0) {
         return std::nullopt;
     }
-    std::vector<std::string> names;
-    names.reserve(static_cast<size_t>(KAPICSzListCount(list.get())));
-    for (int i = 0; i < KAPICSzListCount(list.get()); ++i) {
-        names.emplace_back(KAPICSzListGet(list.get(), i));
-    }
-    return names;
+    return TARQ::Entries(list);
 }
 
 ReadResult ReadShare(const std::string& share, ShareState& state) {
@@ -102,7 +84,7 @@ bool WriteShare(const std::string& share, const ShareState& state) {
     for (const ShareKey& entry : kShareKeys) {
         section[entry.key] = state.*entry.member;
     }
-    const TARQ::HashOwner hash = ToHash(section);
+    const TARQ::HashOwner hash = TARQ::MakeHash(section);
     return hash && ZELServerUpdateShare(share.c_str(), hash.get()) == 0;
 }
 
@@ -112,7 +94,7 @@ std::string ShareOfModule(const std::string& module) {
 }
 
 bool WriteTaskStatus(const std::string& task, const std::string& status) {
-    const TARQ::HashOwner hash = ToHash({{"status", status}});
+    const TARQ::HashOwner hash = TARQ::MakeHash({{"status", status}});
     return hash && ZELServerUpdateTask(task.c_str(), hash.get()) == 0;
 }
 

@@ -22,27 +22,20 @@ constexpr char kServerSection[] = "server";
 constexpr char kVolumesSection[] = "volumes";
 constexpr char kDisksSection[] = "disks";  // folder to mount path, as they were at set-up
 
-bool GetSection(const char* section, TARQ::HashOwner& values) {
-    values.reset(KAPICSzHashAlloc(16));
-    return values && KAPICFileGetSection(ConfigFile().c_str(), section, values.get()) > 0;
-}
+using Entries = std::map<std::string, std::string>;
 
-std::string Value(const TARQ::HashOwner& values, const char* key) {
-    const char* const value = KAPICSzHashGetValue(values.get(), key);
-    return value != nullptr ? value : "";
-}
-
-bool SetSection(const char* section, const std::map<std::string, std::string>& entries) {
+// None without a section.
+Entries GetSection(const char* section) {
     const TARQ::HashOwner values(KAPICSzHashAlloc(16));
-    if (!values) {
-        return false;
-    }
-    for (const auto& [key, value] : entries) {
-        if (KAPICSzHashSetValue(values.get(), key.c_str(), value.c_str()) != 0) {
-            return false;
-        }
-    }
-    return KAPICFileSetSection(ConfigFile().c_str(), section, 0, values.get(), nullptr) > 0;
+    const bool read =
+        values && KAPICFileGetSection(ConfigFile().c_str(), section, values.get()) > 0;
+    return read ? TARQ::Entries(values) : Entries();
+}
+
+bool SetSection(const char* section, const Entries& entries) {
+    const TARQ::HashOwner values = TARQ::MakeHash(entries);
+    return values &&
+           KAPICFileSetSection(ConfigFile().c_str(), section, 0, values.get(), nullptr) > 0;
 }
 
 std::string MountPathOf(const std::string& folder) {
@@ -94,30 +87,20 @@ std::string LockFile() {
 }
 
 std::optional<ServerConfig> LoadServerConfig() {
-    TARQ::HashOwner values;
-    if (!GetSection(kServerSection, values)) {
-        return std::nullopt;
-    }
+    Entries values = GetSection(kServerSection);
     ServerConfig config;
-    const auto port = base::ParseNumber(Value(values, "port"), base::kMaxPort);
-    config.address = Value(values, "address");
-    config.storage = Value(values, "storage");
-    config.encryption = Value(values, "encryption") != "no";
-    config.user = Value(values, "user");
-    config.program = Value(values, "program");
-    config.switched_off = Value(values, "switch") == "off";
+    const auto port = base::ParseNumber(values["port"], base::kMaxPort);
+    config.address = values["address"];
+    config.storage = values["storage"];
+    config.encryption = values["encryption"] != "no";
+    config.user = values["user"];
+    config.program = values["program"];
+    config.switched_off = values["switch"] == "off";
     if (!port || *port == 0 || config.storage.empty() || config.program.empty()) {
         return std::nullopt;
     }
     config.port = static_cast<int>(*port);
-    TARQ::HashOwner volumes;
-    if (GetSection(kVolumesSection, volumes)) {
-        int position = 0;
-        for (const char *name, *folder;
-             KAPICSzHashNext(volumes.get(), &position, &name, &folder) != 0;) {
-            config.volumes[name] = folder;
-        }
-    }
+    config.volumes = GetSection(kVolumesSection);
     return config;
 }
 
@@ -166,20 +149,13 @@ StorageState CheckStorage(const std::string& folder) {
 }
 
 std::string RecordedDiskOf(const std::string& folder) {
-    TARQ::HashOwner disks;
-    return GetSection(kDisksSection, disks) ? Value(disks, folder.c_str()) : "";
+    return GetSection(kDisksSection)[folder];
 }
 
 std::string RecordDiskOf(const std::string& folder) {
     const std::string mount_path = MountPathOf(folder);
-    std::map<std::string, std::string> entries = {{folder, mount_path}};
-    TARQ::HashOwner disks;
-    if (GetSection(kDisksSection, disks)) {
-        int position = 0;
-        for (const char *name, *path; KAPICSzHashNext(disks.get(), &position, &name, &path) != 0;) {
-            entries.emplace(name, path);
-        }
-    }
+    Entries entries = GetSection(kDisksSection);
+    entries[folder] = mount_path;
     return !mount_path.empty() && SetSection(kDisksSection, entries) ? mount_path : "";
 }
 

@@ -93,8 +93,8 @@ Patient Examine() {
     if (!names || TARQShareEnum(names.get()) < 0) {
         patient.catalogue_error = KAPICErrText(KAPICErrGet());
     }
-    for (int i = 0; i < KAPICSzListCount(names.get()); ++i) {
-        patient.shares[KAPICSzListGet(names.get(), i)];
+    for (const std::string& name : TARQ::Entries(names)) {
+        patient.shares[name];
     }
     return patient;
 }

@@ -104,13 +104,7 @@ std::vector<std::string> ShareNames() {
     if (!list || TARQShareEnum(list.get()) < 0) {
         throw Failure(FailureKind::kLocal, "cannot read the share catalogue: " + LastError());
     }
-    std::vector<std::string> names;
-    const int count = KAPICSzListCount(list.get());
-    names.reserve(static_cast<size_t>(count));
-    for (int i = 0; i < count; ++i) {
-        names.emplace_back(KAPICSzListGet(list.get(), i));
-    }
-    return names;
+    return TARQ::Entries(list);
 }
 
 void ListShares(bool as_json) {

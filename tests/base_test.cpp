@@ -1,10 +1,11 @@
-#include "base/open_beneath.h"
-
 #include <linux/filter.h>
 #include <linux/seccomp.h>
 #include <sys/prctl.h>
 #include <sys/syscall.h>
 
+#include "base/open_beneath.h"
+#include "base/replace_file.h"
+#include "base/whole_file.h"
 #include "tests/support/testing.h"
 
 namespace {
@@ -132,5 +133,29 @@ TEST_P(OpenBeneathTest, NothingLeadsOut) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Confinement, OpenBeneathTest, Values(0u, ENOSYS, EPERM));
+
+TEST(ReplaceFileTest, TakesTheModeThatIsGivenAndLeavesDevicesAndLinksTargetsAlone) {
+    const test::TempFolder files;
+    const std::string path = files.Write("file", "old");
+    EXPECT_TRUE(base::ReplaceFile(path, "new", 0600));
+    EXPECT_EQ(base::ReadFile(path), "new");
+    EXPECT_EQ(fs::status(path).permissions(), fs::perms::owner_read | fs::perms::owner_write);
+    EXPECT_EQ(base::ReadFile(path, 2), std::nullopt);
+    EXPECT_EQ(errno, EFBIG);
+
+    fs::create_symlink("file", files.Path("link"));
+    EXPECT_TRUE(base::ReplaceFile(files.Path("link"), "other", 0600));
+    EXPECT_EQ(base::ReadFile(path), "new");
+
+    const std::string pipe = files.Path("pipe");
+    ASSERT_EQ(mkfifo(pipe.c_str(), 0600), 0);
+    fs::create_symlink("pipe", files.Path("to_pipe"));
+    for (const std::string& name : {pipe, files.Path("to_pipe"), files.Path("missing/file")}) {
+        EXPECT_FALSE(base::ReplaceFile(name, "new", 0600)) << name;
+    }
+    EXPECT_TRUE(fs::is_fifo(files.Path("to_pipe")));
+    // Nothing is left beside them.
+    EXPECT_EQ(std::distance(fs::directory_iterator(files.Path("")), fs::directory_iterator()), 4);
+}
 
 }  // namespace
