@@ -8,6 +8,7 @@
 #include <map>
 #include <memory>
 
+#include "base/section_view.h"
 #include "platform/tarqcore/section_edit.h"
 #include "platform/tarqcore/section_image.h"
 #include "tests/support/string_hash.h"

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 
+#include "base/section_view.h"
 #include "platform/tarqcore/format_string.h"
 
 namespace tarqcore {

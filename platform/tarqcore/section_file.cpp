@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "base/replace_file.h"
+#include "base/section_view.h"
 #include "platform/internal/error.h"
 #include "platform/tarqcore/section_edit.h"
 #include "platform/tarqcore/section_image.h"

@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <numeric>
 
+#include "base/section_view.h"
+
 namespace tarqcore {
 namespace {
 

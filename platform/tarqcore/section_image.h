@@ -10,8 +10,6 @@
 #include <string_view>
 #include <vector>
 
-#include "base/section_view.h"
-
 namespace tarqcore {
 
 /// A section's place in the text, in bytes from the start.

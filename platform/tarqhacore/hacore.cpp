@@ -2,7 +2,6 @@
 #include <tarq/hacore.h>
 #include <tarq/root_path.h>
 
-#include <cctype>
 #include <string>
 
 #include "base/text.h"

@@ -4,7 +4,6 @@
 #include <stdio.h>
 
 #include <algorithm>
-#include <cctype>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>

@@ -4,7 +4,6 @@
 #include <tarq/systemd.h>
 
 #include <algorithm>
-#include <cctype>
 #include <cstring>
 #include <memory>
 #include <string>

@@ -3,14 +3,11 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cstring>
 #include <fstream>
-#include <iterator>
 
 #include "base/config_file.h"
 #include "base/rsync_config.h"
-#include "base/text.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/daemon_config.h"
 #include "programs/zelctl/base/child_output.h"
