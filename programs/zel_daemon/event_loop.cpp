@@ -103,6 +103,9 @@ struct EventLoop::Impl {
     }
 
     void AddIo(int fd, uint32_t events, Task task) {
+        if (fd < 0) {
+            return;
+        }
         Handler& handler = AddHandler(std::move(task));
         sd_event_source* added = nullptr;
         Require(sd_event_add_io(event.get(), &added, fd, events, OnIo, &handler),

@@ -20,7 +20,7 @@ public:
     EventLoop(const EventLoop&) = delete;
     EventLoop& operator=(const EventLoop&) = delete;
 
-    /// Calls `task` whenever `fd` can be read, for the life of the loop.
+    /// Calls `task` whenever `fd` can be read, for the life of the loop; never for -1.
     void OnReadable(int fd, Task task);
     /// The same, whenever it has urgent data (POLLPRI).
     void OnUrgent(int fd, Task task);

@@ -21,12 +21,12 @@
 #include "programs/zel_daemon/background.h"
 #include "programs/zel_daemon/daemon_config.h"
 #include "programs/zel_daemon/event_loop.h"
+#include "programs/zel_daemon/file_watch.h"
 #include "programs/zel_daemon/ipc_server.h"
 #include "programs/zel_daemon/recovery_watch.h"
 #include "programs/zel_daemon/requests.h"
 #include "programs/zel_daemon/service.h"
 #include "programs/zel_daemon/store.h"
-#include "programs/zel_daemon/zone_watch.h"
 #include "tarq/root_path.h"
 
 namespace {
@@ -165,32 +165,24 @@ void Serve(const Options& options) {
         }
     });
     loop.OnClockSet([&] { service.Refresh(); });
-    ZoneWatch zone;
-    if (zone.Fd() >= 0) {
-        loop.OnReadable(zone.Fd(), [&] {
-            if (zone.Changed()) {
-                service.Refresh();
-            }
-        });
-    }
+    FileWatch zone("/etc", {"localtime"});
+    loop.OnReadable(zone.Fd(), [&] {
+        if (zone.Changed()) {
+            service.Refresh();
+        }
+    });
     RecoveryWatch recovery;
-    if (recovery.MountsFd() >= 0) {
-        loop.OnUrgent(recovery.MountsFd(), [&] { service.MayHaveRecovered(Recovery::kVolume); });
-    }
-    if (recovery.NetworkFd() >= 0) {
-        loop.OnReadable(recovery.NetworkFd(), [&] {
-            if (recovery.NetworkChanged()) {
-                service.MayHaveRecovered(Recovery::kNetwork);
-            }
-        });
-    }
-    if (recovery.SettingsFd() >= 0) {
-        loop.OnReadable(recovery.SettingsFd(), [&] {
-            if (recovery.SettingsChanged()) {
-                service.MayHaveRecovered(Recovery::kSettings);
-            }
-        });
-    }
+    loop.OnUrgent(recovery.MountsFd(), [&] { service.MayHaveRecovered(Recovery::kVolume); });
+    loop.OnReadable(recovery.NetworkFd(), [&] {
+        if (recovery.NetworkChanged()) {
+            service.MayHaveRecovered(Recovery::kNetwork);
+        }
+    });
+    loop.OnReadable(recovery.SettingsFd(), [&] {
+        if (recovery.SettingsChanged()) {
+            service.MayHaveRecovered(Recovery::kSettings);
+        }
+    });
     service.Start();
     server.emplace(loop, TARQ::RootPath(kSocketPath), config.group,
                    [&](const Peer& peer, const ZEL::PObject& request) {

@@ -4,23 +4,17 @@
 #include <linux/netlink.h>
 #include <linux/rtnetlink.h>
 #include <net/if.h>
-#include <sys/inotify.h>
 #include <sys/socket.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
-#include <iterator>
 
 #include "tarq/root_path.h"
 
 namespace zel_daemon {
 
 namespace {
-
-constexpr char kFolder[] = "/usr/tarq/etc";
-constexpr const char* kFiles[] = {"tarqshare.conf", "tarqrsync.conf", "tarqsdk.conf"};
 
 base::UniqueFd OpenNetwork() {
     base::UniqueFd fd(socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC | SOCK_NONBLOCK, NETLINK_ROUTE));
@@ -29,15 +23,6 @@ base::UniqueFd OpenNetwork() {
     address.nl_groups = RTMGRP_LINK | RTMGRP_IPV4_IFADDR | RTMGRP_IPV4_ROUTE | RTMGRP_IPV6_IFADDR |
                         RTMGRP_IPV6_ROUTE;
     if (fd && bind(fd.Get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-        fd.Reset();
-    }
-    return fd;
-}
-
-base::UniqueFd OpenSettings() {
-    base::UniqueFd fd(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
-    if (fd && inotify_add_watch(fd.Get(), TARQ::RootPath(kFolder).c_str(),
-                                IN_MOVED_TO | IN_CLOSE_WRITE) < 0) {
         fd.Reset();
     }
     return fd;
@@ -61,7 +46,8 @@ bool Brings(const nlmsghdr& message) {
 RecoveryWatch::RecoveryWatch()
     : mounts_(open("/proc/self/mountinfo", O_RDONLY | O_CLOEXEC)),
       network_(OpenNetwork()),
-      settings_(OpenSettings()) {}
+      settings_(TARQ::RootPath("/usr/tarq/etc"),
+                {"tarqshare.conf", "tarqrsync.conf", "tarqsdk.conf"}) {}
 
 bool RecoveryWatch::NetworkChanged() {
     bool changed = false;
@@ -88,24 +74,6 @@ bool RecoveryWatch::NetworkChanged() {
             left -= step;
         }
     }
-}
-
-bool RecoveryWatch::SettingsChanged() {
-    bool changed = false;
-    alignas(inotify_event) char buffer[4096];
-    for (ssize_t size; (size = read(settings_.Get(), buffer, sizeof buffer)) > 0;) {
-        for (const char* at = buffer; at < buffer + size;) {
-            inotify_event event;
-            memcpy(&event, at, sizeof event);
-            const char* name = at + sizeof event;
-            changed = changed || (event.mask & IN_Q_OVERFLOW) != 0 ||
-                      (event.len > 0 &&
-                       std::any_of(std::begin(kFiles), std::end(kFiles),
-                                   [name](const char* file) { return strcmp(name, file) == 0; }));
-            at = name + event.len;
-        }
-    }
-    return changed;
 }
 
 }  // namespace zel_daemon

@@ -1,9 +1,8 @@
 // Notices that what a run failed for may be over.
 #pragma once
 
-#include <string>
-
 #include "base/unique_fd.h"
+#include "programs/zel_daemon/file_watch.h"
 
 namespace zel_daemon {
 
@@ -27,16 +26,16 @@ public:
     /// Readable after a change of the network.
     int NetworkFd() const { return network_.Get(); }
     /// Readable when something has happened in the folder of the settings.
-    int SettingsFd() const { return settings_.Get(); }
+    int SettingsFd() const { return settings_.Fd(); }
 
     /// Take in what is there to read. Whether it is one that matters.
     bool NetworkChanged();
-    bool SettingsChanged();
+    bool SettingsChanged() { return settings_.Changed(); }
 
 private:
     base::UniqueFd mounts_;
     base::UniqueFd network_;
-    base::UniqueFd settings_;
+    FileWatch settings_;
 };
 
 }  // namespace zel_daemon
