@@ -37,13 +37,13 @@ programs::TaskRun& Connection::For(const programs::RunOrder& order) {
     }
     if (!usable) {
         since_ = now;
-        const auto told = [this](const std::string& share, const RunProgress& progress) {
+        const auto forward = [this](const std::string& share, const RunProgress& progress) {
             if (on_progress) {
                 on_progress(share, progress);
             }
         };
-        run_ = std::make_unique<programs::TaskRun>(info_, cancel,
-                                                   programs::RunListener{told, nullptr, nullptr});
+        run_ = std::make_unique<programs::TaskRun>(
+            info_, cancel, programs::RunListener{forward, nullptr, nullptr});
     }
     return *run_;
 }

@@ -13,7 +13,7 @@ struct DaemonConfig {
     unsigned int workers = 2;                       ///< runs at the same time
     std::chrono::milliseconds debounce{1000};       ///< quiet time before changes are sent ...
     std::chrono::milliseconds debounce_max{10000};  ///< ... but they wait no longer than this
-    std::chrono::seconds poll{900};  ///< how often what cannot be watched is compared whole
+    std::chrono::seconds poll{900};  ///< how often what cannot be watched has a full resync
     std::chrono::milliseconds retry_first{10000};  ///< a run that failed is tried again after ...
     std::chrono::milliseconds retry_max{3600000};  ///< ... which doubles with each try, up to this
     std::string group;  ///< whose members may use the socket; empty: nobody's

@@ -15,8 +15,8 @@ namespace {
 /// Some 2,000 events with names of usual length.
 constexpr size_t kBufferSize = size_t{64} * 1024;
 
-/// Files that were unlinked while open are told too (no IN_EXCL_UNLINK): what is written to them
-/// may show under another name in the same folder.
+/// Files that were unlinked while open are notified of too (no IN_EXCL_UNLINK): what is written to
+/// them may show under another name in the same folder.
 constexpr uint32_t kMask = IN_CREATE | IN_DELETE | IN_MODIFY | IN_CLOSE_WRITE | IN_ATTRIB |
                            IN_MOVED_FROM | IN_MOVED_TO | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR;
 

@@ -163,7 +163,7 @@ void Service::StartRun(Task& task, const Step& step) {
         StoreFailed(task, error);
         return;
     }
-    if (plan->order.announce) {  // resyncs: what changes from here on is told
+    if (plan->order.announce) {  // a resync: what changes from here on is notified of
         ForgetSettledProblems(task);
     }
     if (!task.connection || task.connection->cancel) {

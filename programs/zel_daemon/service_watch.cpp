@@ -1,4 +1,4 @@
-// What the service watches, and whom it tells.
+// The service's watch: which folders, and which tasks are notified.
 #include <algorithm>
 #include <cerrno>
 #include <utility>

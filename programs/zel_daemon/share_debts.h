@@ -26,9 +26,8 @@ enum class ShareState {
 /// - unless the failure was one of the whole share (its volume is away, the server refuses it):
 ///   then all of it waits.
 ///
-/// A failure of the whole run puts everything back as it was; when the run is tried again is not
-/// said here (see TaskPlan). Changes are told apart by their number in the store: those up to
-/// `after` have failed before.
+/// A failure of the whole run puts everything back as it was; TaskPlan knows when the run is tried
+/// again. Changes are known by their number in the store: those up to `after` have failed before.
 ///
 /// Costs: Next() and Wait() look at each share only after something has changed, and at none
 /// otherwise.
@@ -88,7 +87,7 @@ public:
     /// Whether `test` holds for one of the shares that may be tried now.
     bool AnyDue(int64_t now, const std::function<bool(const std::string& share)>& test) const;
 
-    /// A run begins with all that may be tried now, until Settle() is told how it ended.
+    /// A run begins with all that may be tried now, until Settle().
     std::vector<Due> Take(int64_t now);
     /// How it ended, for each share taken; those that `outcomes` leaves out went well.
     void Settle(int64_t now, const std::map<std::string, Outcome>& outcomes,

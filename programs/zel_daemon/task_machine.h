@@ -1,4 +1,4 @@
-// A task as a machine: it is told what happens, and says what is to be done for the task, and when.
+// A task as a state machine: events go in, and the next step to be done for the task comes out.
 #pragma once
 
 #include <cstdint>
@@ -18,7 +18,7 @@
 
 namespace zel_daemon {
 
-/// What is to be done for a task now. What it takes is done by who asked, and then told.
+/// What is to be done for a task now: by the caller, who reports back when it is done.
 struct Step {
     enum class Kind {
         kWait,          ///< nothing

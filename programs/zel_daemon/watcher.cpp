@@ -5,10 +5,10 @@
 // - A folder is opened by its path, watched by its descriptor, and then known by its watch. When
 //   that is not the watch in the table, another folder has taken the place: what is known below is
 //   dropped and found anew.
-// - A folder is watched before it is read: what appears in between is told by an event.
-// - A path that leads nowhere now is dropped: what took it away is told by an event that waits. If
+// - A folder is watched before it is read: what appears in between comes as an event.
+// - A path that leads nowhere now is dropped: what took it away is an event that still waits. If
 //   that is the move of a folder above, all below that one is scanned again once it is in place.
-// - A folder that gets its watch later than its share's first scan is told then: whatever was
+// - A folder that gets its watch later than its share's first scan is notified of then: what was
 //   sent before may lack what changed in it unwatched.
 #include "programs/zel_daemon/watcher.h"
 
@@ -53,7 +53,7 @@ constexpr size_t kListBufferSize = size_t{32} * 1024;
 // What is known of a folder beside its place.
 constexpr uint8_t kQueued = 1;    // waits in jobs_
 constexpr uint8_t kDeep = 2;      // its next scan goes through all below, known or not
-constexpr uint8_t kNotified = 4;  // told by an event, or below such a one
+constexpr uint8_t kNotified = 4;  // has an event of its own, or is below such a one
 constexpr uint8_t kUnseen = 8;    // its parent is being read and has not shown it yet
 constexpr uint8_t kMissing = 16;  // cannot be watched, or not all below it
 
@@ -89,7 +89,7 @@ struct Watcher::Impl {
         size_t missing = 0;
         size_t jobs = 0;  // scans that wait or are under way
         bool first_scan = true;
-        std::set<int> told;  // errors of this scan
+        std::set<int> notified;  // errors of this scan
     };
 
     /// A folder whose entries are being read.
@@ -122,7 +122,7 @@ struct Watcher::Impl {
     // The callbacks may end the share whose name they are given, so they get a copy; a share that
     // was found before is not used after one.
 
-    /// Tells `path`.
+    /// A change at `path`.
     void Notify(const Share& share) {
         on_change(std::string(share.name), path.empty() ? "/" : path);
     }
@@ -207,7 +207,7 @@ struct Watcher::Impl {
             return;
         }
         if (share->jobs++ == 0) {
-            share->told.clear();
+            share->notified.clear();
         }
         marks |= kQueued;
         jobs.push_back(id);
@@ -227,16 +227,16 @@ struct Watcher::Impl {
         EndJob(share);
     }
 
-    /// The folder that Locate() was asked for last is not watched. Told once in a scan for each
-    /// reason.
+    /// The folder that Locate() was asked for last is not watched. One notification in a scan
+    /// for each reason.
     void NotifyUnwatched(Share& share, int error) {
-        if (share.told.insert(error).second) {
+        if (share.notified.insert(error).second) {
             NotifyLoss(share, {WatchLoss::kUnwatched, error, path.empty() ? "/" : path});
         }
     }
 
-    /// The same, when nothing below it is watched either. A change of its mode, which its parent
-    /// tells, brings it back; the root has to tell its own.
+    /// The same, when nothing below it is watched either. A change of its mode, of which its parent
+    /// notifies, brings it back; the root has to notify of its own.
     void Miss(Share& share, FolderId id, int error) {
         if (id != share.root) {
             Unwatch(id);
@@ -363,24 +363,24 @@ struct Watcher::Impl {
             EndDeepListing();
             return;
         }
-        const uint8_t told = share->first_scan ? table[id].marks & kNotified : kNotified;
+        const uint8_t notified = share->first_scan ? table[id].marks & kNotified : kNotified;
         for (ssize_t at = 0; at < got;) {
             const auto* entry = reinterpret_cast<const dirent64*>(list_buffer.get() + at);
             at += entry->d_reclen;
             const std::string_view name = entry->d_name;
             if (name != "." && name != ".." && IsFolder(listing->fd.Get(), *entry)) {
-                Found(id, name, told);
+                Found(id, name, notified);
             }
         }
     }
 
-    void Found(FolderId parent, std::string_view name, uint8_t told) {
+    void Found(FolderId parent, std::string_view name, uint8_t notified) {
         FolderId id = table.Child(parent, name);
         const bool is_new = id == kNoFolder;
         if (is_new) {
             id = AddChild(parent, name);
         }
-        table[id].marks = static_cast<uint8_t>((table[id].marks & ~kUnseen) | told);
+        table[id].marks = static_cast<uint8_t>((table[id].marks & ~kUnseen) | notified);
         if (is_new || listing->deep) {
             Enqueue(id, listing->deep);
         }
@@ -431,7 +431,7 @@ struct Watcher::Impl {
             Share* share = FindShare(number);
             if (share != nullptr && share->root != kNoFolder) {
                 Enqueue(share->root, true);
-                share->told.clear();
+                share->notified.clear();
                 NotifyLoss(*share, {WatchLoss::kOverflow});
             }
         }
@@ -463,7 +463,7 @@ struct Watcher::Impl {
         } else if (id == share->root &&
                    (mask & (IN_DELETE_SELF | IN_MOVE_SELF | IN_UNMOUNT)) != 0) {
             RootGone(*share);
-        }  // else the folder's parent tells
+        }  // else the folder's parent notifies
     }
 
     void Entry(FolderId parent, const Inotify::Event& event) {
@@ -628,7 +628,7 @@ void Watcher::Rescan(const std::string& share) {
     Impl::Share& found = impl_->shares.at(number->second);
     if (found.root != kNoFolder) {
         impl_->Enqueue(found.root, true);
-        found.told.clear();
+        found.notified.clear();
     }
 }
 

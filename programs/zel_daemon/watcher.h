@@ -1,4 +1,4 @@
-// Tells what changes below the folders of shares, by inotify.
+// Notifies of changes below the folders of shares, by inotify.
 #pragma once
 
 #include <chrono>
@@ -9,7 +9,7 @@
 
 namespace zel_daemon {
 
-/// Why a watcher can no longer tell all that changes in a share.
+/// A watch loss: why a watcher no longer notices everything that changes in a share.
 struct WatchLoss {
     enum Kind {
         kOverflow,    ///< the kernel dropped events; the folders are scanned anew, watching goes on
@@ -33,14 +33,14 @@ struct WatchStats {
     bool complete = false;  ///< all folders found are watched
 };
 
-/// Watches whole trees: new folders are taken in as they appear, and what they hold by then is told
-/// as changed with them. Symbolic links are not followed, other file systems mounted below a share
-/// are watched as its own.
+/// Watches whole trees: new folders are taken in as they appear, and the notification of a new
+/// folder stands for all that it holds by then. Symbolic links are not followed, other file systems
+/// mounted below a share are watched as its own.
 ///
-/// From the moment that a folder was told or scanned, no later change in it is missed without a
-/// loss that says so. What the kernel does not tell is missed: changes made through a name outside
-/// the share that a file also has (a hard link), changes that another host makes on a network file
-/// system, and a file system that is mounted over a folder already watched.
+/// Once a folder was notified of or scanned, no later change in it is missed without a watch loss.
+/// What the kernel does not notify of is missed: changes made through a name outside the share that
+/// a file also has (a hard link), changes that another host makes on a network file system, and a
+/// file system that is mounted over a folder already watched.
 ///
 /// The work is done in slices by the thread that calls Work(): neither a large tree nor a flood of
 /// events holds it up.
@@ -60,23 +60,23 @@ public:
     Watcher& operator=(const Watcher&) = delete;
 
     /// Gets what the kernel gives notices by, unless it has been got. False when that is not to be
-    /// had now: shares that are scanned without it are told as not watched.
+    /// had now: a share that is scanned without it is a watch loss.
     bool Open();
     /// Readable when there is something for Work(). REQUIRES Open().
     int Fd() const;
 
     /// Watches `folder` for `share`, in place of what was watched for it before. The folders below
-    /// it are found by Work(), which must be called after this and after Remove(): Fd() does not
-    /// tell of them. What changes in a folder before it is found is not told, so a run that is to
-    /// leave nothing out begins when the share is no longer scanned.
+    /// it are found by Work(), which must be called after this and after Remove(): Fd() is not
+    /// readable for them. What changes in a folder before it is found is not notified of, so a full
+    /// resync begins when the share is no longer being scanned.
     void Add(const std::string& share, const std::string& folder);
     void Remove(const std::string& share);
-    /// Searches all folders of a share again, as after an overflow: what could not be watched may
-    /// be by now, and is told again when it cannot. As Add(), this is done by Work().
+    /// Scans all folders of a share again, as after an overflow: what could not be watched may be
+    /// by now, and is a watch loss again when it cannot. As Add(), this is done by Work().
     void Rescan(const std::string& share);
 
-    /// Reads events and scans folders for about so long. True when work is left that Fd() does
-    /// not tell of, folders to scan above all: call again soon. False: wait for Fd().
+    /// Reads events and scans folders for about so long. True when work is left for which
+    /// Fd() is not readable, folders to scan above all: call again soon. False: wait for Fd().
     bool Work(std::chrono::milliseconds budget);
 
     /// Of one share; none and not complete for one that is not watched.
