@@ -44,8 +44,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     const std::string before = zel_daemon::TaskToMap(task, true).toString();
     try {
         zel_daemon::ApplyTaskKeys(request, task);
-    } catch (const zel_daemon::RequestError& error) {
-        Require(error.what()[0] != '\0' && error.Code() < 0);
+    } catch (const programs::Failure& error) {
+        Require(error.what()[0] != '\0' && error.Status() < 0);
         Require(zel_daemon::TaskToMap(task, true).toString() == before);
         return 0;
     }

@@ -172,9 +172,9 @@ TEST_F(ServiceTest, NoShareIsCopiedTwiceAtATimeAndNoMoreTasksRunThanWorkers) {
     Settle();
     EXPECT_TRUE(Runs("1") && Runs("3"));  // 2 waits for its share, and 3 goes first
     EXPECT_EQ(State("2").status, ZEL::TASK_STATUS_WAITING);
-    EXPECT_THROW(service_->Edit("1", service_->Find("1")), zel_daemon::RequestError);
+    EXPECT_THROW(service_->Edit("1", service_->Find("1")), programs::Failure);
     Cancel("1");
-    EXPECT_THROW(service_->Cancel("1"), zel_daemon::RequestError);
+    EXPECT_THROW(service_->Cancel("1"), programs::Failure);
     EXPECT_TRUE(Runs("2") && Runs("3"));
     EXPECT_EQ(service_->Stats().running, 2u);
     Cancel("3");

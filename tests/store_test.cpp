@@ -2,6 +2,7 @@
 
 #include <poll.h>
 
+#include "programs/common/failure.h"
 #include "programs/zel_daemon/store_schema.h"
 #include "tests/support/full_disk.h"
 #include "tests/support/schedules.h"
@@ -16,7 +17,6 @@ using zel_daemon::Query;
 using zel_daemon::RunReason;
 using zel_daemon::RunRecord;
 using zel_daemon::Store;
-using zel_daemon::StoreError;
 using zel_daemon::TaskRecord;
 
 TaskRecord Task(const std::string& name) {
@@ -38,7 +38,7 @@ std::string Text(const TaskRecord& record) {
 std::string Fault(const std::function<void()>& work) {
     try {
         work();
-    } catch (const StoreError& error) {
+    } catch (const programs::Failure& error) {
         return error.what();
     }
     return "none";
@@ -230,8 +230,9 @@ TEST_F(StoreTest, AStoreThatWasLostIsNoFreshStart) {
         std::string told = "none";
         try {
             const Store store(path_);
-        } catch (const zel_daemon::DamagedStore& error) {
-            told = error.what();
+        } catch (const programs::Failure& failure) {
+            EXPECT_TRUE(failure.Kind() == programs::FailureKind::kLocal);
+            told = failure.what();
         }
         return told;
     };
@@ -372,7 +373,7 @@ TEST_F(StoreTest, LayoutsAreBroughtUpToDateStepByStep) {
     EXPECT_EQ(bring({first}), 100);
     EXPECT_THROW(bring({first, second, broken}), zel_daemon::SqliteError);
     EXPECT_EQ(bring({first, second}), 206);
-    EXPECT_THROW(bring({first}), zel_daemon::SchemaError);
+    EXPECT_THROW(bring({first}), programs::Failure);
     EXPECT_EQ(bring({first, second, "UPDATE t SET b = b + 1"}), 307);
 }
 
@@ -409,7 +410,7 @@ TEST_F(StoreTest, LayoutsAreBroughtUpToDateStepByStep) {
                 tell('g', last.GetRelativePath());
             }
         }
-    } catch (const StoreError& error) {
+    } catch (const programs::Failure& error) {
         fprintf(stderr, "%s\n", error.what());
         _exit(1);
     }

@@ -232,8 +232,8 @@ void Act(const Options& options) {
     } catch (const base::ConfigError& error) {
         kind = FailureKind::kLocal;
         Say(options, error);
-    } catch (const DamagedStore& error) {
-        kind = FailureKind::kLocal;
+    } catch (const Failure& error) {
+        kind = error.Kind();
         Say(options, error);
     } catch (const std::exception& error) {
         Say(options, error);

@@ -57,7 +57,7 @@ PObject Number(uint64_t value) {
     return PObject(static_cast<unsigned long long>(value));
 }
 
-PObject Failure(int code, const std::string& text) {
+PObject ErrorReply(int code, const std::string& text) {
     PObject reply;
     reply["result"] = code;
     reply["error"] = text;
@@ -135,14 +135,16 @@ bool Requests::IsWatch(const PObject& request) {
 PObject Requests::Answer(const Peer& peer, const PObject& request) {
     try {
         return Dispatch(peer, request);
-    } catch (const RequestError& error) {
-        return Failure(error.Code(), error.what());
-    } catch (const StoreError& error) {
+    } catch (const programs::Failure& failure) {
+        if (failure.Status() != 0) {
+            return ErrorReply(failure.Status(), failure.what());
+        }
+        // Not the request's, but the store's.
         ZEL::Logger::LogMsg(ZEL::Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__,
-                            error.what());
-        return Failure(ZEL::RESULT_SYSTEM, error.what());
+                            failure.what());
+        return ErrorReply(ZEL::RESULT_SYSTEM, failure.what());
     } catch (const std::exception& error) {
-        return Failure(ZEL::RESULT_SYSTEM, error.what());
+        return ErrorReply(ZEL::RESULT_SYSTEM, error.what());
     }
 }
 

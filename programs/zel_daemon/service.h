@@ -50,8 +50,8 @@ struct ServiceStats {
 /// host and among people, does what it wants done, and picks the tasks that run: no more at a time
 /// than there are workers, no share in two runs at a time, who is due longest goes first.
 ///
-/// Threads: the loop's. Operations that a person asks for throw RequestError (task_map.h) or
-/// StoreError, and have changed nothing then.
+/// Threads: the loop's. Operations that a person asks for throw RequestError() (task_map.h)
+/// or a failure of the store, and have changed nothing then.
 class Service {
 public:
     /// `on_change` is called whenever what a person sees may have changed.
@@ -82,7 +82,7 @@ public:
     void Cancel(const std::string& name);
     void SetPaused(const std::string& name, bool paused);
 
-    /// REQUIRES that there is such a task, else RequestError.
+    /// REQUIRES that there is such a task, else RequestError().
     const TaskRecord& Find(const std::string& name) const;
     std::vector<const TaskRecord*> Tasks() const;  ///< by name
     TaskState StateOf(const TaskRecord& record) const;
@@ -130,7 +130,7 @@ private:
     Step DoChores(Task& task);
     void StoreEnd(Task& task);
     void StoreChanges(Task& task);
-    void StoreFailed(Task& task, const StoreError& error);
+    void StoreFailed(Task& task, const programs::Failure& failure);
     void Rescan(Task& task);
     void TakeRoom(const Task& task, Room& room) const;
     bool MayStart(const Task& task, const Step& step, const Room& room) const;

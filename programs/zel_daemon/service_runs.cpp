@@ -94,8 +94,8 @@ Step Service::DoChores(Task& task) {
                 case Step::Kind::kWait:
                     return step;
             }
-        } catch (const StoreError& error) {
-            StoreFailed(task, error);
+        } catch (const programs::Failure& failure) {
+            StoreFailed(task, failure);
         }
     }
 }
@@ -119,10 +119,10 @@ void Service::StoreChanges(Task& task) {
     }
 }
 
-void Service::StoreFailed(Task& task, const StoreError& error) {
+void Service::StoreFailed(Task& task, const programs::Failure& failure) {
     Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s': %s\n", __LINE__,
-                   task.machine.Record().Name().c_str(), error.what());
-    task.machine.StoreFailed(error.what());
+                   task.machine.Record().Name().c_str(), failure.what());
+    task.machine.StoreFailed(failure.what());
 }
 
 // ---- Runs ----
@@ -159,8 +159,8 @@ void Service::StartRun(Task& task, const Step& step) {
         }
         plan->record.id = store_.BeginRun(record.ID(), plan->record.reason, plan->record.start,
                                           IdsOf(plan->events));
-    } catch (const StoreError& error) {
-        StoreFailed(task, error);
+    } catch (const programs::Failure& failure) {
+        StoreFailed(task, failure);
         return;
     }
     if (plan->order.announce) {  // a resync: what changes from here on is notified of

@@ -3,6 +3,7 @@
 #include <cerrno>
 #include <system_error>
 
+#include "programs/common/failure.h"
 #include "programs/zel_daemon/shortage.h"
 #include "programs/zel_daemon/store_file.h"
 #include "programs/zel_daemon/store_schema.h"
@@ -12,6 +13,9 @@ namespace zel_daemon {
 
 namespace {
 
+using programs::Failure;
+using programs::FailureKind;
+
 constexpr char kStopped[] = "the daemon was stopped";
 
 constexpr char kRunColumns[] =
@@ -19,10 +23,6 @@ constexpr char kRunColumns[] =
     "files_deleted, bytes_sent, rsync_runs";
 
 constexpr char kMakeRoom[] = "the disk is full; make room on it";
-constexpr char kBeginAnew[] =
-    "stop the daemon and put back a copy, or begin with an empty store by 'zel_daemon "
-    "--new-store', "
-    "which moves away what is there";
 
 const char* Advice(const std::error_code& error) {
     return error == std::errc::no_space_on_device || error.value() == EDQUOT
@@ -113,19 +113,12 @@ struct Store::Impl {
         try {
             return work();
         } catch (const SqliteError& error) {
-            const std::string why = failed + error.what() + "; " + Advice(error);
-            IsDamage(error) ? throw DamagedStore(why) : throw StoreError(why);
-        } catch (const SchemaError& error) {
-            throw DamagedStore(failed + error.what());
-        } catch (const LostError& error) {
-            throw DamagedStore(failed + error.what() + "; " + kBeginAnew);
-        } catch (const RowError& error) {
-            throw DamagedStore(
-                failed + error.what() +
-                "; mend it, or remove the row, in the sqlite3 shell while the daemon "
-                "is stopped");
+            throw Failure(IsDamage(error) ? FailureKind::kLocal : FailureKind::kFailed,
+                          failed + error.what() + "; " + Advice(error));
+        } catch (const Failure& failure) {
+            throw Failure(failure.Kind(), failed + failure.what());
         } catch (const std::system_error& error) {
-            throw StoreError(failed + error.what() + "; " + Advice(error.code()));
+            throw Failure(failed + error.what() + "; " + Advice(error.code()));
         }
     }
 
@@ -176,7 +169,7 @@ Store::Store(const std::string& path) : impl_(std::make_unique<Impl>(path)) {
         PrepareStoreFile(path);
         Database& database = impl_->database.emplace(path);
         if (IsBlank(database)) {
-            throw LostError("it is a database without anything in it");
+            throw LostStore("it is a database without anything in it");
         }
         if (database.IsReadOnly()) {
             throw SqliteError(SQLITE_READONLY, sqlite3_errstr(SQLITE_READONLY));

@@ -6,7 +6,6 @@
 
 #include <memory>
 #include <optional>
-#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -14,19 +13,11 @@
 
 namespace zel_daemon {
 
-/// The store cannot be read or written: what() says which file, what failed and what to do.
-class StoreError : public std::runtime_error {
-public:
-    using std::runtime_error::runtime_error;
-};
-
-/// Only a person can mend it: the file is damaged, lost, or not this program's.
-class DamagedStore : public StoreError {
-public:
-    using StoreError::StoreError;
-};
-
-/// Threads: one thread. Every operation may throw StoreError; nothing has changed then.
+/// Every operation may throw Failure, whose text says which file, what failed and
+/// what to do; nothing has changed then. Its kind is kLocal where only a person can mend it: the
+/// file is damaged, lost, or not this program's.
+///
+/// Threads: one thread.
 class Store {
 public:
     /// Runs kept of each task; the oldest are dropped when new ones begin.
@@ -40,7 +31,7 @@ public:
     /// events wait again.
     explicit Store(const std::string& path);
     /// Puts what is there aside and makes a new, empty store. The name that the old one has now,
-    /// empty when there was none. REQUIRES that no daemon uses it. Throws StoreError.
+    /// empty when there was none. REQUIRES that no daemon uses it.
     static std::string Renew(const std::string& path);
     ~Store();
     Store(const Store&) = delete;

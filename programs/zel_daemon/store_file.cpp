@@ -95,7 +95,7 @@ void PrepareStoreFile(const std::string& path) {
     if (!IsThere(path)) {
         for (const char* const trace : {kMark, kLog}) {
             if (IsThere(path + trace)) {
-                throw LostError("it is gone, though it was there (" + path + trace + " tells)");
+                throw LostStore("it is gone, though it was there (" + path + trace + " tells)");
             }
         }
         MakeStoreFile(path);
@@ -106,7 +106,7 @@ void PrepareStoreFile(const std::string& path) {
     }
     // SQLite would take it for a new database, and throw away the log of changes.
     if (info.st_size == 0) {
-        throw LostError("it is empty, its content is lost");
+        throw LostStore("it is empty, its content is lost");
     }
     if ((info.st_mode & 0077) != 0 && chmod(path.c_str(), 0600) != 0) {
         ThrowErrno(path);

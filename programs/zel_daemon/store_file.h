@@ -1,22 +1,26 @@
 // The store's file: made whole or not at all, and never made anew where there was one.
 #pragma once
 
-#include <stdexcept>
 #include <string>
+
+#include "programs/common/failure.h"
 
 namespace zel_daemon {
 
-/// There was a store, and what is there now is none: what() says how that is known.
-class LostError : public std::runtime_error {
-public:
-    using std::runtime_error::runtime_error;
-};
+inline constexpr char kBeginAnew[] =
+    "stop the daemon and put back a copy, or begin with an empty store by 'zel_daemon "
+    "--new-store', which moves away what is there";
+
+/// There was a store, and what is there now is none: `how` says how that is known.
+inline programs::Failure LostStore(const std::string& how) {
+    return {programs::FailureKind::kLocal, how + "; " + kBeginAnew};
+}
 
 /// Sees that the file at `path` can be opened: for the daemon alone (0600, its folder 0700), since
 /// tasks have passwords. The first time it is made, with all tables; whenever that is cut off, it
 /// begins anew.
 ///
-/// Throws LostError where there was a store: the file is empty; or it is gone, and its mark
+/// Throws LostStore() where there was a store: the file is empty; or it is gone, and its mark
 /// (`path`.made) or its log of changes tells that it was there. Throws std::system_error and
 /// SqliteError.
 void PrepareStoreFile(const std::string& path);

@@ -2,9 +2,14 @@
 
 #include <string>
 
+#include "programs/common/failure.h"
+
 namespace zel_daemon {
 
 namespace {
+
+using programs::Failure;
+using programs::FailureKind;
 
 // Marks the file as a store ("ZELd"), so that no other program's database is ever written to.
 constexpr int64_t kApplicationId = 0x5a454c64;
@@ -91,11 +96,13 @@ void BringUpToDate(Database& database, const SchemaSteps& steps) {
     const int64_t application = database.Number("PRAGMA application_id");
     const int64_t version = database.Number("PRAGMA user_version");
     if (application != kApplicationId && !IsBlank(database)) {
-        throw SchemaError("it is a database of another program; name another file");
+        throw Failure(FailureKind::kLocal,
+                      "it is a database of another program; name another file");
     }
     const auto known = static_cast<int64_t>(steps.size());
     if (version < 0 || version > known) {
-        throw SchemaError("its layout has version " + std::to_string(version) +
+        throw Failure(FailureKind::kLocal,
+                      "its layout has version " + std::to_string(version) +
                           ", and this program knows versions up to " + std::to_string(known) +
                           "; install the newer program again, or put back a copy of the file");
     }

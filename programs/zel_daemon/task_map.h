@@ -2,23 +2,17 @@
 // keys.
 #pragma once
 
-#include <stdexcept>
 #include <string>
 
+#include "programs/common/failure.h"
 #include "programs/zel_daemon/task_record.h"
 
 namespace zel_daemon {
 
-/// A request that cannot be fulfilled: the result code and the words for its reply.
-class RequestError : public std::runtime_error {
-public:
-    RequestError(int code, const std::string& text) : std::runtime_error(text), code_(code) {}
-    /// A ZEL::ResultCode.
-    int Code() const { return code_; }
-
-private:
-    int code_;
-};
+/// A request that cannot be fulfilled: the ZEL::ResultCode and the words for its reply.
+inline programs::Failure RequestError(int result, const std::string& text) {
+    return {programs::FailureKind::kUsage, text, result};
+}
 
 /// Sets the fields of `record` whose keys `request` has. Keys that are none of a task's are left to
 /// the caller. Throws RequestError (-4) for a value of the wrong kind or size, and for a task that
