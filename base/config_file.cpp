@@ -101,9 +101,9 @@ ConfigFile::ConfigFile(const std::string& path, const std::string& section,
     for (int number = 1; TakeLine(text, line); ++number) {
         const std::string problem = reader.Take(line);
         if (!problem.empty()) {
-            std::string text = path;
-            text.append(", line ").append(std::to_string(number)).append(": ").append(problem);
-            throw ConfigError(text);
+            std::string where = path;
+            where.append(", line ").append(std::to_string(number)).append(": ").append(problem);
+            throw ConfigError(where);
         }
     }
 }

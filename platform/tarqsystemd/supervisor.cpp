@@ -30,7 +30,7 @@ using tarq_internal::ReadResult;
 constexpr char kConfiguration[] = "/usr/tarq/etc/tarqsystemd.conf";
 constexpr char kRunFolder[] = "/var/run/";
 constexpr seconds kStopLimit(30);
-constexpr uint64_t kLongestStopLimit = 24 * 60 * 60;
+constexpr uint64_t kLongestStopLimit = 86400;
 constexpr seconds kKillLimit(10);  // for the kernel to take down what no longer has a say in it
 
 std::string PidFile(const std::string& unit) {
