@@ -10,7 +10,7 @@
 
 #include "ZEL/log.h"
 #include "ZEL/zel.h"
-#include "programs/common/task_run.h"
+#include "programs/common/host.h"
 #include "programs/common/text.h"
 #include "tarq/owners.h"
 #include "tarq/root_path.h"

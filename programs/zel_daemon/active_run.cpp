@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "ZEL/zel.h"
+#include "programs/common/host.h"
 #include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {

@@ -16,7 +16,7 @@
 #include "base/unique_fd.h"
 #include "programs/common/failure.h"
 #include "programs/common/help.h"
-#include "programs/common/task_run.h"
+#include "programs/common/host.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/background.h"
 #include "programs/zel_daemon/daemon_config.h"

@@ -3,7 +3,7 @@
 
 #include <vector>
 
-#include "programs/common/task_run.h"
+#include "programs/common/run_result.h"
 #include "programs/zel_daemon/task_record.h"
 
 namespace zel_daemon {

@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "ZEL/log.h"
+#include "programs/common/host.h"
 #include "programs/zel_daemon/service.h"
 
 namespace zel_daemon {
@@ -193,7 +194,7 @@ void Service::EndRun(Task& task, const programs::RunResult& result,
         Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s': %s\n", __LINE__,
                        task.machine.Record().Name().c_str(), run.error.c_str());
     }
-    if (!result.failure.Ok() && result.failure.reach == programs::Reach::kRun) {
+    if (result.failure && result.failure->reach == programs::Reach::kRun) {
         task.connection.reset();
     }
     Advance();

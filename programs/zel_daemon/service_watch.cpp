@@ -5,7 +5,7 @@
 
 #include "ZEL/log.h"
 #include "ZEL/zel.h"
-#include "programs/common/task_run.h"
+#include "programs/common/host.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/service.h"
 #include "programs/zel_daemon/shortage.h"

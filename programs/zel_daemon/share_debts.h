@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "programs/common/task_run.h"
+#include "programs/common/run_result.h"
 #include "programs/zel_daemon/backoff.h"
 
 namespace zel_daemon {

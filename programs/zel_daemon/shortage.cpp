@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "base/unique_fd.h"
-#include "programs/common/task_run.h"
+#include "programs/common/host.h"
 #include "programs/common/text.h"
 
 namespace zel_daemon {

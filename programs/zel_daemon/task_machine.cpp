@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "programs/common/text.h"
+#include "tarq/rsync_wrapper.h"
 
 namespace zel_daemon {
 
@@ -23,9 +24,9 @@ constexpr int64_t kChangedAgainMs = 60000;
 // A receiver that died in a copy has left what it had of a file beside it, under another name.
 bool BrokeOff(const RunFailure& failure) {
     return failure.reach == Reach::kShare &&
-           (failure.status == TARQ::Backup::STATUS_SOCKET ||
-            failure.status == TARQ::Backup::STATUS_PROTOCOL_STREAM ||
-            failure.status == TARQ::Backup::STATUS_TIMEOUT);
+           (failure.Status() == TARQ::Backup::STATUS_SOCKET ||
+            failure.Status() == TARQ::Backup::STATUS_PROTOCOL_STREAM ||
+            failure.Status() == TARQ::Backup::STATUS_TIMEOUT);
 }
 
 }  // namespace
@@ -336,20 +337,22 @@ void TaskMachine::Started(RunPlan plan) {
 const RunRecord& TaskMachine::Ended(const programs::RunResult& result,
                                     const programs::RunTotals& totals) {
     const RunPlan plan = std::move(*std::exchange(running_, std::nullopt));
-    const RunFailure& failure = result.failure;
+    const auto& failure = result.failure;
     RunRecord& record = last_.emplace(plan.record);
     record.end = clock_.Now();
-    record.status = failure.status;
-    record.error = failure.error;
-    record.details = failure.details;
+    if (failure) {
+        record.status = failure->Status();
+        record.error = failure->what();
+        record.details = failure->details;
+    }
     record.files_sent = totals.files_sent;
     record.files_deleted = totals.files_deleted;
     record.bytes_sent = totals.bytes_sent;
     record.rsync_runs = totals.rsync_runs;
-    record.result = failure.Ok() ? ZEL::TASK_RESULT_SUCCESS
+    record.result = !failure     ? ZEL::TASK_RESULT_SUCCESS
                     : by_person_ ? ZEL::TASK_RESULT_CANCELLED
                                  : ZEL::TASK_RESULT_FAILED;
-    if (record.result == ZEL::TASK_RESULT_FAILED && failure.reach == Reach::kRun) {
+    if (record.result == ZEL::TASK_RESULT_FAILED && failure->reach == Reach::kRun) {
         plan_->Failed(Delays());
     } else {
         plan_->Settled();
@@ -366,7 +369,7 @@ void TaskMachine::Settle(const RunPlan& plan, const programs::RunResult& result)
         ShareDebts::Outcome& outcome = outcomes[undone.share];
         if (!outcome.failed || undone.failure.reach == Reach::kShare) {
             outcome.reach = undone.failure.reach;
-            outcome.kind = undone.failure.kind;
+            outcome.kind = undone.failure.Kind();
         }
         outcome.failed = true;
         outcome.tried = outcome.tried && undone.failure.reach != Reach::kRun;

@@ -1,7 +1,7 @@
 #include "programs/zelctl/base/prepare.h"
 
 #include "programs/common/failure.h"
-#include "programs/common/task_run.h"
+#include "programs/common/host.h"
 
 namespace zelctl {
 

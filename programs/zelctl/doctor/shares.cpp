@@ -6,7 +6,7 @@
 #include <cstring>
 #include <filesystem>
 
-#include "programs/common/task_run.h"
+#include "programs/common/host.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/doctor/checks.h"
 #include "tarq/core.h"

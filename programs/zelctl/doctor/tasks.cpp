@@ -4,11 +4,12 @@
 #include <atomic>
 #include <chrono>
 #include <map>
+#include <optional>
 #include <system_error>
 #include <thread>
 
+#include "programs/common/run_result.h"
 #include "programs/common/server_status.h"
-#include "programs/common/task_run.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/doctor/checks.h"
 #include "programs/zelctl/server/ask.h"
@@ -19,6 +20,8 @@ namespace zelctl {
 namespace {
 
 using ZEL::PObject;
+/// Why a server does not take a task's shares; none when it does.
+using Refusal = std::optional<programs::RunFailure>;
 
 constexpr std::chrono::seconds kPatience(15);
 constexpr size_t kAtOnce = 8;
@@ -54,7 +57,7 @@ public:
     }
 
     /// In the order of the tasks.
-    const programs::RunFailure& Answer(size_t task) const { return answers_[task]; }
+    const Refusal& Answer(size_t task) const { return answers_[task]; }
     /// Its server was silent for another task.
     bool Skipped(size_t task) const { return skipped_[task]; }
 
@@ -69,7 +72,7 @@ private:
             }
             const std::list<std::string>& shares = info.GetShareList();
             answers_[i] = AskServer(info.GetSyncInfo(), {shares.begin(), shares.end()}, kPatience);
-            if (IsSilence(answers_[i])) {
+            if (answers_[i] && IsSilence(*answers_[i])) {
                 silent = true;
             }
         }
@@ -77,7 +80,7 @@ private:
 
     const std::vector<const PatientTask*>& tasks_;
     std::atomic<size_t> next_{0};
-    std::vector<programs::RunFailure> answers_;
+    std::vector<Refusal> answers_;
     std::vector<char> skipped_;  // one byte each: threads write side by side
     std::map<std::string, std::atomic<bool>> silent_;
 };
@@ -87,9 +90,9 @@ std::string Quoted(const std::string& name) {
 }
 
 // What to do about a server's refusal, where its own words do not say.
-std::string RemedyOfRefusal(const programs::RunFailure& failure, const PatientTask& task) {
+std::string RemedyOfRefusal(int status, const PatientTask& task) {
     const ZEL::TaskInfo& info = task.record.GetInfo();
-    switch (failure.status) {
+    switch (status) {
         case TARQ::Backup::STATUS_AUTHENTICATION:
             return "zelctl task edit " + Quoted(info.GetName()) +
                    " --password; at the server 'zel_server account add " +
@@ -101,15 +104,14 @@ std::string RemedyOfRefusal(const programs::RunFailure& failure, const PatientTa
     }
 }
 
-void CheckAnswer(const programs::RunFailure& failure, bool skipped, const PatientTask& task,
-                 Findings& found) {
+void CheckAnswer(const Refusal& refusal, bool skipped, const PatientTask& task, Findings& found) {
     if (skipped) {
         found.push_back({"", Severity::kFailed,
                          "its server was not asked: it gave no answer for another task",
                          "see that task"});
-    } else if (!failure.Ok()) {
-        found.push_back(
-            {"", Severity::kFailed, OneLine(failure.error), RemedyOfRefusal(failure, task)});
+    } else if (refusal) {
+        found.push_back({"", Severity::kFailed, OneLine(refusal->what()),
+                         RemedyOfRefusal(refusal->Status(), task)});
     }
 }
 

@@ -20,12 +20,6 @@ using programs::RunTotals;
 using programs::TaskRun;
 using TARQ::Backup::RunChange;
 
-void Require(const programs::RunFailure& ended) {
-    if (!ended.Ok()) {
-        throw Failure(ended.kind, ended.error, ended.status);
-    }
-}
-
 // A path that a person names has to be there: it is a slip of the pen, not a deletion.
 void CheckPath(const PushOptions& options) {
     for (const std::string& share : options.shares) {
@@ -58,8 +52,8 @@ ZEL::SyncInfo Prepare(const PushOptions& options) {
 }
 
 void Connect(TaskRun& run, const std::vector<std::string>& shares) {
-    Require(run.Connect());
-    Require(run.CheckPairing(shares));
+    run.Connect();
+    run.CheckPairing(shares);
 }
 
 /// Prints what a push would do, and a sum a share.
@@ -101,9 +95,9 @@ void ListChanges(TaskRun& run, const RunOrder& order) {
         ChangeList list;
         RunOrder alone = order;
         alone.shares = {share};
-        Require(run.List(
+        run.List(
             alone, [&](const std::string&, const RunChange& change) { list.Add(change); },
-            [&](const std::string& name) { list.AddMissing(name); }));
+            [&](const std::string& name) { list.AddMissing(name); });
         list.Sum(share.share);
     }
 }
@@ -144,7 +138,9 @@ void Push(const PushOptions& options) {
     RunTotals totals;
     const programs::RunResult result = run.Push(order, totals);
     display.Clear();
-    Require(result.failure);
+    if (result.failure) {
+        throw *result.failure;
+    }
 }
 
 void CheckPairing(const ConnectionOptions& connection, const std::vector<std::string>& shares) {

@@ -58,29 +58,33 @@ private:
 
 }  // namespace
 
-RunFailure AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& shares,
-                     std::chrono::seconds patience) {
+std::optional<RunFailure> AskServer(const ZEL::SyncInfo& info,
+                                    const std::vector<std::string>& shares,
+                                    std::chrono::seconds patience) {
     const Patience waiting(patience);
-    programs::TaskRun run(info, waiting.Ended());
-    RunFailure failure = run.Connect();
-    if (failure.Ok()) {
-        failure = run.CheckPairing(shares);
+    try {
+        programs::TaskRun run(info, waiting.Ended());
+        run.Connect();
+        run.CheckPairing(shares);
+        return {};
+    } catch (const RunFailure& failure) {
+        if (!waiting.Ended() || Interrupted()) {
+            return failure;
+        }
     }
-    if (!failure.Ok() && waiting.Ended() && !Interrupted()) {
-        const std::string& name = info.GetServerName();
-        return {FailureKind::kFailed, 0,
-                "server " + (name.empty() ? info.GetServerIP() : name) + " gave no answer within " +
-                    programs::Count(static_cast<uint64_t>(patience.count()), "second")};
-    }
-    return failure;
+    const std::string& name = info.GetServerName();
+    return RunFailure(FailureKind::kFailed, 0,
+                      "server " + (name.empty() ? info.GetServerIP() : name) +
+                          " gave no answer within " +
+                          programs::Count(static_cast<uint64_t>(patience.count()), "second"));
 }
 
 bool IsSilence(const RunFailure& failure) {
-    return failure.kind == FailureKind::kFailed && failure.status == 0;
+    return failure.Kind() == FailureKind::kFailed && failure.Status() == 0;
 }
 
 bool IsRefusedForGood(const RunFailure& failure) {
-    switch (failure.status) {
+    switch (failure.Status()) {
         case TARQ::Backup::STATUS_AUTHENTICATION:
         case programs::kUnknownCommand:
         case programs::kBadArgument:

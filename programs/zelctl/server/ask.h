@@ -2,6 +2,7 @@
 #pragma once
 
 #include <chrono>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -9,10 +10,11 @@
 
 namespace zelctl {
 
-/// Whether the server takes the shares from this client and account. Changes nothing there. One
-/// that does not answer within `patience` has failed. Any thread.
-programs::RunFailure AskServer(const ZEL::SyncInfo& info, const std::vector<std::string>& shares,
-                               std::chrono::seconds patience);
+/// Why the server does not take the shares from this client and account; none when it does. Changes
+/// nothing there. One that does not answer within `patience` has failed. Any thread.
+std::optional<programs::RunFailure> AskServer(const ZEL::SyncInfo& info,
+                                              const std::vector<std::string>& shares,
+                                              std::chrono::seconds patience);
 
 /// Whether that was the end of the patience.
 bool IsSilence(const programs::RunFailure& failure);

@@ -5,8 +5,8 @@
 #include <set>
 
 #include "programs/common/failure.h"
+#include "programs/common/host.h"
 #include "programs/common/table.h"
-#include "programs/common/task_run.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
 #include "programs/zelctl/base/prepare.h"

@@ -5,6 +5,7 @@
 #include <ctime>
 
 #include "programs/common/failure.h"
+#include "programs/common/host.h"
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
@@ -44,17 +45,16 @@ void TryServer(const ZEL::TaskInfo& info, const std::string& done) {
     }
     WatchForInterrupt();
     const std::list<std::string>& shares = info.GetShareList();
-    const programs::RunFailure failure =
-        AskServer(info.GetSyncInfo(), {shares.begin(), shares.end()}, kPatience);
-    if (failure.Ok()) {
+    const auto refusal = AskServer(info.GetSyncInfo(), {shares.begin(), shares.end()}, kPatience);
+    if (!refusal) {
         puts("The server takes the account and the shares.");
         return;
     }
-    const std::string error = Printable(OneLine(failure.error));
-    if (failure.kind == programs::FailureKind::kCancelled) {
+    const std::string error = Printable(OneLine(refusal->what()));
+    if (refusal->Kind() == FailureKind::kCancelled) {
         throw Failure(FailureKind::kCancelled, "ended by the user; nothing was " + done);
     }
-    if (IsRefusedForGood(failure)) {
+    if (IsRefusedForGood(*refusal)) {
         throw Failure(FailureKind::kRefused,
                       error + "; nothing was " + done + " (--no-check does not ask the server)");
     }
