@@ -1,8 +1,6 @@
 // What a task does when, on a clock that the test sets; store, server and watch are played.
 #include "programs/zel_daemon/task_machine.h"
 
-#include <cstring>
-
 #include "tests/support/test_clock.h"
 #include "tests/support/testing.h"
 
@@ -43,9 +41,6 @@ protected:
     void HaveRealtime(const std::list<std::string>& shares = {"a"}) {
         Have(Make("realtime", "", 0), shares);
         Pass(0);
-    }
-    void HaveManual(const std::list<std::string>& shares = {"a"}) {
-        Have(Make("manual", "", 0), shares);
     }
     void Pause(bool paused) {
         zel_daemon::TaskRecord record = machine_->Record();
@@ -102,9 +97,9 @@ protected:
     bool hold_ = false;       // a run lasts until End()
     bool disk_full_ = false;  // nothing can be stored
     int rescans_ = 0;
-    std::optional<programs::RunFailure> down_;         // no run comes further
-    std::map<std::string, programs::RunFailure> bad_;  // "share", or "share/path"
-    std::vector<ZEL::Event> stored_;
+    std::optional<programs::RunFailure> down_;                        // no run comes further
+    std::map<std::string, programs::RunFailure> bad_;                 // "share", or "share/path"
+    std::map<std::pair<std::string, std::string>, uint64_t> stored_;  // changes, and their numbers
 
 private:
     void Do(const Step& step) {
@@ -121,11 +116,10 @@ private:
         } else if (step.kind == Step::Kind::kStoreChanges) {
             Store();
         } else if (step.kind == Step::Kind::kStoreEnd) {
-            const std::vector<uint64_t>& sent = machine_->End()->sent;
-            const auto gone = [&](const ZEL::Event& event) {
-                return std::find(sent.begin(), sent.end(), event.GetID()) != sent.end();
-            };
-            stored_.erase(std::remove_if(stored_.begin(), stored_.end(), gone), stored_.end());
+            for (const uint64_t id : machine_->End()->sent) {
+                stored_.erase(std::find_if(stored_.begin(), stored_.end(),
+                                           [&](const auto& entry) { return entry.second == id; }));
+            }
             machine_->EndStored();
         } else {
             if (machine_->HasDebounced()) {
@@ -137,17 +131,7 @@ private:
     void Store() {
         for (const auto& [share, paths] : machine_->DebouncedChanges()) {
             for (const std::string& path : paths) {
-                const bool waits = std::any_of(
-                    stored_.begin(), stored_.end(), [&, &in = share](const ZEL::Event& event) {
-                        return event.GetShareName() == in && event.GetRelativePath() == path;
-                    });
-                if (waits && !machine_->Running()) {
-                    continue;
-                }
-                ZEL::Event& event = stored_.emplace_back();
-                event.SetID(++last_id_);
-                event.SetShareName(share);
-                event.SetRelativePath(path);
+                stored_.emplace(std::pair(share, path), ++last_id_);
             }
         }
         machine_->ChangesStored();
@@ -155,9 +139,12 @@ private:
     std::optional<RunPlan> Begin(const Step& step) {
         return machine_->Begin(step, [&](const std::string& share, uint64_t after) {
             std::vector<ZEL::Event> events;
-            for (const ZEL::Event& event : stored_) {
-                if (event.GetShareName() == share && event.GetID() > after) {
-                    events.push_back(event);
+            for (const auto& [what, id] : stored_) {
+                if (what.first == share && id > after) {
+                    ZEL::Event& event = events.emplace_back();
+                    event.SetID(id);
+                    event.SetShareName(share);
+                    event.SetRelativePath(what.second);
                 }
             }
             return events;
@@ -282,7 +269,7 @@ TEST_F(TaskMachineTest, ClocksAndZonesThatJumpMakeUpForOneRunAndLoseNone) {
 // ---- What fails ----
 
 TEST_F(TaskMachineTest, RetriesOfARunComeLaterAndLaterAndNotAllAtTheSameMoment) {
-    HaveManual();
+    Have(Make("manual", "", 0));
     down_ = kDown;
     const std::pair<double, int64_t> tries[] = {
         {0.5, 10000},  {0.5, 20000},   {0, 32000},   {1, 96000},     {0.25, 144000}, {0.5, 320000},
@@ -340,7 +327,7 @@ TEST_F(TaskMachineTest, OnlyTheShareOrThePathThatFailedWaits) {
     EXPECT_THAT(machine_->WaitsFor(), HasSubstr("until fewer files change"));
 
     // A task with a schedule tries the shares that failed again, not the others.
-    HaveManual({"a", "b", "c"});
+    Have(Make("manual", "", 0), {"a", "b", "c"});
     bad_ = {{"b", kRefused}, {"c", kAway}};
     EXPECT_EQ(Ask(), "request a/ b/ c/");
     EXPECT_THAT(machine_->WaitsFor(), HasSubstr("share 'b' and 1 other share wait for the server"));
@@ -354,7 +341,7 @@ TEST_F(TaskMachineTest, WhatHasComeBackIsTriedAtOnceButNotAllTheTime) {
         machine_->Recovered({what}, [&](const std::string&) { return is_there; });
         return Pass(0);
     };
-    HaveManual();
+    Have(Make("manual", "", 0));
     bad_ = {{"a", kAway}};
     EXPECT_EQ(Ask(), "request a/");
     EXPECT_THAT(Count(Pass(700)), Ge(5u));
@@ -366,7 +353,7 @@ TEST_F(TaskMachineTest, WhatHasComeBackIsTriedAtOnceButNotAllTheTime) {
 
     // A network that comes and goes: between two tries lies the first wait.
     for (const bool whole : {true, false}) {
-        HaveManual();
+        Have(Make("manual", "", 0));
         bad_ = {{"a", kBroken}};
         down_ = whole ? std::optional(kDown) : std::nullopt;
         Ask();
@@ -510,7 +497,7 @@ TEST_F(TaskMachineTest, AfterARestartAllIsResyncedAndWhatWasCutOffMadeUpFor) {
     HaveRealtime();
     down_ = kDown;
     Change("a", "/x");
-    const std::vector<ZEL::Event> stored = stored_;
+    const auto stored = stored_;
     const zel_daemon::RunRecord failed = *machine_->Last();
     down_.reset();
     HaveRealtime();
@@ -519,7 +506,7 @@ TEST_F(TaskMachineTest, AfterARestartAllIsResyncedAndWhatWasCutOffMadeUpFor) {
     EXPECT_EQ(Pass(0), "");
     EXPECT_EQ(Pass(15), "retry a/");
     EXPECT_THAT(stored_, IsEmpty());
-    HaveManual();
+    Have(Make("manual", "", 0));
     machine_->Restored(false, failed);
     EXPECT_EQ(Pass(15), "retry a/");
     machine_->Edited(machine_->Record());

@@ -191,8 +191,10 @@ void TaskMachine::Recovered(const std::set<Recovery>& what,
 }
 
 void TaskMachine::Asked() {
-    requested_ = !running_;
-    held_ = false;
+    if (!running_) {
+        requested_ = true;
+        held_ = false;
+    }
 }
 
 bool TaskMachine::Cancelled() {
