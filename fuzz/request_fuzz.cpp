@@ -8,6 +8,7 @@
 
 #include "ZEL/log.h"
 #include "ZEL/stream.h"
+#include "programs/common/failure.h"
 #include "programs/zel_daemon/task_map.h"
 
 namespace {
@@ -41,21 +42,23 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     // Shares are looked up on this host, which has none.
     request.asMap().erase("share_list");
     zel_daemon::TaskRecord task;
-    const std::string before = zel_daemon::TaskToMap(task, true).toString();
+    task.task.GetInfo().SetShareList({"share"});
+    const std::string before = task.ToMap().toString();
     try {
-        zel_daemon::ApplyTaskKeys(request, task);
-    } catch (const programs::Failure& error) {
-        Require(error.what()[0] != '\0' && error.Status() < 0);
-        Require(zel_daemon::TaskToMap(task, true).toString() == before);
+        zel_daemon::ApplyRequest(request, task);
+    } catch (const programs::Failure& failure) {
+        Require(failure.what()[0] != '\0' && failure.Status() < 0);
+        Require(task.ToMap().toString() == before);
         return 0;
     }
     Require(!task.Name().empty() && task.Info().GetSyncInfo().Validate() &&
             task.Info().GetSchedule().Validate());
-    const ZEL::PObject taken = zel_daemon::TaskToMap(task, true);
+    const ZEL::PObject taken = task.ToMap();
     zel_daemon::TaskRecord again;
+    again.task.GetInfo().SetShareList({"share"});
     ZEL::PObject settings = taken;
     settings.asMap().erase("share_list");
-    zel_daemon::ApplyTaskKeys(settings, again);
-    Require(zel_daemon::TaskToMap(again, true).toString() == taken.toString());
+    zel_daemon::ApplyRequest(settings, again);
+    Require(again.ToMap().toString() == taken.toString());
     return 0;
 }

@@ -11,5 +11,6 @@ if(ZEL_BUILD_PROGRAMS)
     zel_test(push_test integration/push_test.cpp
         LIBRARIES test_whole TIMEOUT 300 LABELS integration)
     add_test(NAME completion_test
-        COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/integration/completion_test.sh ${PROJECT_SOURCE_DIR})
+        COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/integration/completion_test.sh ${PROJECT_SOURCE_DIR}
+            $<TARGET_FILE:zelctl>)
 endif()

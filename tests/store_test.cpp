@@ -26,13 +26,8 @@ TaskRecord Task(const std::string& name) {
 }
 
 std::string Text(const TaskRecord& record) {
-    ZEL::PObject map;
-    ZEL::SyncTask2PObj(record.task, map);
-    std::string text = map.toString();
-    for (const std::string& exclude : record.excludes) {
-        text += " -" + exclude;
-    }
-    return text + " " + std::to_string(record.paused) + " " + std::to_string(record.checked_until);
+    return record.ToMap().toString() + " " + std::to_string(record.paused) + " " +
+           std::to_string(record.checked_until);
 }
 
 std::string Fault(const std::function<void()>& work) {
@@ -78,7 +73,7 @@ TEST_F(StoreTest, KeepsEveryFieldOfATask) {
     ZEL::PObj2SyncTask(map, record.task);
     record.task.GetInfo().SetName("n\xffi\0ghtly"s);
     record.task.GetInfo().SetShareList({"photo", "\xfe\0x"s, "it's \"q\"\n", ""});
-    record.excludes = {"*.tmp", "\xff*", "#re*"};
+    record.own["exclude"].asArray() = {"*.tmp", "\xff*", "#re*"};
     record.paused = true;
     record.checked_until = INT64_MAX;
     const uint64_t id = store_->AddTask(record);

@@ -9,14 +9,15 @@
 #include "ZEL/stream.h"
 #include "programs/common/run_progress.h"
 #include "programs/common/schedule_words.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/task_row.h"
+#include "programs/common/task_settings.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/child_output.h"
 #include "programs/zelctl/base/live_block.h"
 #include "programs/zelctl/doctor/checks.h"
 #include "programs/zelctl/share/samba.h"
 #include "programs/zelctl/task/file.h"
-#include "programs/zelctl/task/quick_list.h"
 #include "tests/integration/client_and_server.h"
 #include "tests/support/schedules.h"
 #include "tests/support/testing.h"
@@ -32,8 +33,9 @@ namespace {
 
 // ---- Schedules in words ----
 
-// What a line like "weekly=mon,tue at=08:00 every=1h times=2" says.
-ScheduleWords Words(const std::string& line) {
+// Puts what a line like "weekly=mon,tue at=08:00 every=1h times=2" says into a task; what is
+// wrong with it, or nothing.
+std::string Say(const std::string& line, programs::TaskSettings& task) {
     ScheduleWords said;
     const std::map<std::string, std::optional<std::string>*> options = {
         {"weekly", &said.weekly}, {"monthly", &said.monthly}, {"yearly", &said.yearly},
@@ -50,7 +52,24 @@ ScheduleWords Words(const std::string& line) {
             (name == "manual" ? said.manual : said.on_change) = true;
         }
     }
-    return said;
+    try {
+        PObject settings;
+        SayWords(said, settings);
+        task.Apply(settings);
+        return "";
+    } catch (const programs::Failure& failure) {
+        return failure.what();
+    }
+}
+
+// One that lacks nothing but a schedule.
+programs::TaskSettings Unscheduled() {
+    programs::TaskSettings task;
+    PObject said;
+    said = PObject::Map{{"name", "t"}, {"user", "u"}, {"server_name", "s"}};
+    said["share_list"].asArray().emplace_back("docs");
+    task.Apply(said);
+    return task;
 }
 
 TEST(ScheduleWords, WhatIsSaidIsWhatIsDescribedAndPassesTheLibrary) {
@@ -66,18 +85,24 @@ TEST(ScheduleWords, WhatIsSaidIsWhatIsDescribedAndPassesTheLibrary) {
         {"once=2032-02-29 every=2h times=11", "once 2032-02-29 00:00, 11 more every 2h"},
     };
     for (const auto& [line, described] : cases) {
-        ZEL::Schedule schedule;
-        EXPECT_EQ(ApplyWords(Words(line), schedule), "") << line;
-        EXPECT_EQ(DescribeSchedule(schedule), described);
-        EXPECT_TRUE(schedule.Validate()) << line;
+        programs::TaskSettings task = Unscheduled();
+        EXPECT_EQ(Say(line, task), "") << line;
+        EXPECT_EQ(DescribeSchedule(task.Info().GetSchedule()), described);
     }
     // What is not said stays, and a count of 0 takes the repeats away.
-    ZEL::Schedule schedule;
-    ApplyWords(Words("weekly=sat at=05:00 every=1h times=4"), schedule);
-    EXPECT_EQ(ApplyWords(Words("at=06:00"), schedule), "");
-    EXPECT_EQ(DescribeSchedule(schedule), "weekly sat 06:00, 4 more every 1h");
-    EXPECT_EQ(ApplyWords(Words("monthly=2 times=0"), schedule), "");
-    EXPECT_EQ(DescribeSchedule(schedule), "monthly 2 06:00");
+    programs::TaskSettings task = Unscheduled();
+    const std::pair<const char*, const char*> steps[] = {
+        {"weekly=sat at=05:00 every=1h times=4", "weekly sat 05:00, 4 more every 1h"},
+        {"at=06:00", "weekly sat 06:00, 4 more every 1h"},
+        {"every=2h", "weekly sat 06:00, 4 more every 2h"},
+        {"monthly=2 times=0", "monthly 2 06:00"},
+        {"on-change=", "on change"},
+    };
+    for (const auto& [line, described] : steps) {
+        EXPECT_EQ(Say(line, task), "") << line;
+        EXPECT_EQ(DescribeSchedule(task.Info().GetSchedule()), described);
+    }
+    EXPECT_EQ(task.Info().GetSchedule().GetPeriodSeconds(), 0);
 }
 
 TEST(ScheduleWords, FaultsNameTheOption) {
@@ -93,6 +118,7 @@ TEST(ScheduleWords, FaultsNameTheOption) {
         {"weekly=mon at=24:00", "--at"},
         {"weekly=mon at=+7:00", "--at"},
         {"on-change= every=1h times=2", "go with"},
+        {"at=07:00", "go with"},
         {"weekly=mon every=1h", "--every needs --times"},
         {"weekly=mon times=2", "--times needs --every"},
         {"weekly=mon every=0m times=2", "--every"},
@@ -102,8 +128,9 @@ TEST(ScheduleWords, FaultsNameTheOption) {
         {"weekly=mon at=23:00 every=30m times=2", "on another day"},
     };
     for (const auto& [line, fault] : cases) {
-        ZEL::Schedule schedule;
-        EXPECT_THAT(ApplyWords(Words(line), schedule), HasSubstr(fault));
+        programs::TaskSettings task = Unscheduled();
+        EXPECT_THAT(Say(line, task), HasSubstr(fault));
+        EXPECT_EQ(task.ToMap().toString(), Unscheduled().ToMap().toString());
     }
 }
 
@@ -169,7 +196,7 @@ PObject SomeTask(const std::string& name, const std::string& share = "b") {
     task["name"] = name;
     task["share_list"].asArray() = {share};
     task["schedule_mode"] = ZEL::SCHD_MODE_WEEKLY;
-    task["max_bandwidth"] = UINT32_MAX;
+    task["max_bandwidth"] = INT32_MAX;
     task["exclude"].asArray().emplace_back("*.tmp");
     return task;
 }
@@ -193,9 +220,12 @@ TEST(TaskFile, EachFaultHasItsPlace) {
         {"[{" + good + R"(,"pswd":"a\u0000b"}])", "pswd must not hold a zero byte"},
         {"[{" + good + R"(,"pswd":")" + std::string(65536, 'p') + "\"}]", "pswd is too long"},
         {"[{" + good + "},{" + good + "}]", "tasks[1]: a task before has the name 'a'"},
-        {R"([{"name":"\u001b","share_list":[],"user":"u","server_name":"s"}])",
-         "('\\033'): share_list is empty"},
-        {R"([{"name":"b","share_list":["x"],"user":"u"}])", "server_name is missing"},
+        {R"([{"name":"\u001b","share_list":["x"],"user":"u","server_name":"s"}])",
+         "('\\033'): name cannot be '\\033'"},
+        {"[{" + good + R"(,"week_schd":"1111112"}])", "week_schd must be seven digits"},
+        {"[{" + good + R"(,"ssh":1}])", "ssh must be on or off"},
+        {"[{" + good + R"(,"repeat_times_in_day":3}])", "--times go with"},
+        {R"([{"name":"b","share_list":["x"],"user":"u"}])", "server_name (--server) is missing"},
     };
     for (const auto& [tasks, fault] : cases) {
         EXPECT_THAT(faults(tasks), ElementsAre(HasSubstr(fault))) << tasks.substr(0, 100);
@@ -203,6 +233,22 @@ TEST(TaskFile, EachFaultHasItsPlace) {
     EXPECT_THAT(zelctl::ReadTaskFile("[]").faults, ElementsAre(HasSubstr("format")));
     EXPECT_THAT(zelctl::ReadTaskFile(R"({"format":"zelctl tasks","version":2})").faults,
                 ElementsAre(HasSubstr("version")));
+}
+
+TEST(TaskFields, TheDocumentationKnowsEach) {
+    const std::string protocol = test::ReadFile(SOURCE_FOLDER "/docs/daemon-protocol.md");
+    const std::string manual = test::ReadFile(SOURCE_FOLDER "/packaging/man/zelctl.1");
+    for (const programs::TaskField& field : programs::TaskFields()) {
+        const std::string row = DocumentedRow(field);
+        EXPECT_NE(protocol.find(row + "\n"), std::string::npos) << row;
+        if (field.option != nullptr) {
+            const std::string option = field.option;
+            const std::string name = "Fl -" + option.substr(option.find("--") + 2);
+            EXPECT_TRUE(manual.find(name + " ") != std::string::npos ||
+                        manual.find(name + "\n") != std::string::npos)
+                << name;
+        }
+    }
 }
 
 constexpr char kSamba[] =
@@ -317,11 +363,18 @@ PObject TasksReply(const std::vector<PObject>& tasks) {
 }
 
 // A task as the daemon tells it in brief.
-PObject Brief(const std::string& name, int status, int result, int last_run) {
+PObject Brief(const std::string& name, int status, int result, int last_run,
+              const programs::TaskRow& more = {}) {
+    programs::TaskRow row = more;
+    row.name = name;
+    row.schedule = "daily 02:30";
+    row.status = status;
+    row.result = result;
+    row.last_end = 1065;
     PObject task;
-    task = PObject::Map{{"name", name},          {"schedule", "daily 02:30"}, {"status", status},
-                        {"sync_result", result}, {"last_run", last_run},      {"last_start", 1000},
-                        {"last_end", 1065}};
+    task = PObject::Map{{"name", name},          {"row", PackTaskRow(row)}, {"status", status},
+                        {"sync_result", result}, {"last_run", last_run},    {"last_start", 1000},
+                        {"last_end", 1065},      {"schedule", row.schedule}};
     return task;
 }
 
@@ -397,8 +450,8 @@ TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
     const std::pair<std::string, const char*> refused[] = {
         {"--once 2001-01-01", "lies in the past"},
         {"--share none", "share 'none'"},
-        {"--share docs", "given twice"},
-        {"--exclude " + std::string(65536, 'x'), "'exclude' is too long"},
+        {"--share docs", "names share 'docs' twice"},
+        {"--exclude " + std::string(65536, 'x'), "(--exclude) each of its elements is too long"},
         {"--password hunter2", "no option '--password'"},
     };
     for (const auto& [more, text] : refused) {
@@ -407,22 +460,31 @@ TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
     EXPECT_EQ(daemon.Requests().size(), 1U);
 }
 
-TEST_F(Zelctl, EditSendsOnlyWhatChanges) {
-    FakeDaemon daemon(root_.Path(), [](const PObject&) {
-        return Success({{"task", SomeTask("nightly")}});
+TEST_F(Zelctl, EditSendsOnlyWhatIsSaid) {
+    bool changed = true;
+    FakeDaemon daemon(root_.Path(), [&](const PObject&) {
+        return Success({{"task", SomeTask("nightly")}, {"changed", changed}});
     });
     EXPECT_THAT(Run("task edit nightly --at 09:00 --no-ssh --server 10.0.0.1 --rename daily "
                     "--user lena --no-exclude"),
                 Ended(0));
-    EXPECT_THAT(Run("task edit nightly --user lena").output, HasSubstr("already"));
-    EXPECT_THAT(Run("task edit nightly --at 20:00").output, HasSubstr("another day"));
-    EXPECT_THAT(daemon.Requests(),
-                ElementsAre(HasSubstr("task_show"),
-                            "{\"command\": \"task_edit\", \"exclude\": [], \"name\": \"daily\", "
-                            "\"schedule_begin_hour\": 9, \"schedule_begin_min\": 0, \"server_ip\": "
-                            "\"10.0.0.1\", \"server_name\": "
-                            "\"\", \"ssh\": 0, \"task\": \"nightly\"}",
-                            HasSubstr("task_show"), HasSubstr("task_show")));
+    // The password is asked for with what the task is otherwise.
+    EXPECT_THAT(
+        Run("task edit nightly --no-check --bwlimit 7 --password-file " + root_.Path("password")),
+        Ended(0));
+    changed = false;
+    EXPECT_THAT(Run("task edit nightly --on-change").output, HasSubstr("already"));
+    EXPECT_THAT(Run("task edit nightly --once 2001-01-01").output, HasSubstr("lies in the past"));
+    EXPECT_THAT(
+        daemon.Requests(),
+        ElementsAre("{\"command\": \"task_edit\", \"exclude\": [], \"name\": \"daily\", "
+                    "\"schedule_begin_hour\": 9, \"schedule_begin_min\": 0, \"server_ip\": "
+                    "\"10.0.0.1\", \"server_name\": \"\", \"ssh\": 0, \"task\": \"nightly\", "
+                    "\"user\": \"lena\"}",
+                    HasSubstr("task_show"),
+                    "{\"command\": \"task_edit\", \"max_bandwidth\": 7, \"pswd\": \"top secret\", "
+                    "\"task\": \"nightly\"}",
+                    HasSubstr("\"schedule_mode\": 1"), HasSubstr("task_show")));
 }
 
 TEST_F(Zelctl, AShareThatTasksSendIsNotRemovedUnasked) {
@@ -446,33 +508,24 @@ TEST_F(Zelctl, ErrorRepliesBecomeWordsAndExitCodes) {
     EXPECT_THAT(Run("task list").output, HasSubstr("is no reply"));
 }
 
-TEST_F(Zelctl, ListsAreReadAsRowsOrAsMapsAndNothingInThemReachesTheTerminal) {
-    bool knows_rows = true;
+TEST_F(Zelctl, NothingInAListReachesTheTerminal) {
+    programs::TaskRow row;
+    row.name = "bad\302\233]0;x";
+    row.note = "disk\302\233 full";
+    row.error = "no disk";
+    PObject rows;
+    rows.asArray().emplace_back(PackTaskRow(row));
     FakeDaemon daemon(root_.Path(), [&](const PObject& request) {
-        PObject task = Brief("bad\033]0;x\007", 0, 2, 4);
-        task["note"] = "disk\033 full";
-        task["last_error"] = "no disk";
-        if (!request.hasMember("rows")) {
-            return TasksReply({task});
-        }
-        programs::TaskRow row;
-        row.name = "in rows";
-        row.note = "disk\302\233 full";
-        PObject reply = Success();
-        reply["rows"].asArray().emplace_back(PackTaskRow(row));
-        reply["result"] = knows_rows ? 0 : -4;
-        return reply;
+        return request.hasMember("rows") ? Success({{"rows", rows}})
+                                         : TasksReply({Brief("bad\033]0;x\007", 0, 2, 4)});
     });
-    EXPECT_THAT(Run("task list").output,
-                AllOf(HasSubstr("NAME"), HasSubstr("in rows  "), Not(HasSubstr("\302\233"))));
-    knows_rows = false;
-    EXPECT_THAT(
-        Run("task list").output,
-        AllOf(HasSubstr("bad\\033]0;x\\007  "), HasSubstr("daily 02:30"), HasSubstr("failed"),
-              HasSubstr("\n  ! no disk\n  ! disk\\033 full\n"), Not(HasSubstr("\033"))));
-    EXPECT_THAT(daemon.Requests(),
-                ElementsAre(HasSubstr("rows"), HasSubstr("rows"), HasSubstr("brief")));
+    for (const char* list : {"task list", "-v task list"}) {
+        EXPECT_THAT(Run(list).output, AllOf(HasSubstr("NAME"), HasSubstr("bad\\302\x9b]0;x  "),
+                                            HasSubstr("\n  ! no disk\n  ! disk\\302\x9b full\n")));
+    }
     EXPECT_EQ(nlohmann::json::parse(Run("task list --json").output)[0]["name"], "bad\033]0;x\007");
+    rows.asArray().emplace_back("no row");
+    EXPECT_THAT(Run("task list"), Ended(3, "of one version?"));
 }
 
 TEST_F(Zelctl, RunWaitsForItsOwnRunAndExitsByItsResult) {
@@ -544,8 +597,8 @@ TEST_F(Zelctl, ATerminalIsDrawnInPlaceWithinItsWindowAndLeftAsItWas) {
     ASSERT_NE(again, std::string::npos) << watched;
     EXPECT_THAT(
         watched.substr(0, again),
-        AllOf(HasSubstr("NAME"), HasSubstr("busy\\011"), HasSubstr("idle1"),
-              Not(HasSubstr("idle2")), HasSubstr("and 28 lines more"), Not(HasSubstr("PENDING"))));
+        AllOf(HasSubstr("NAME"), HasSubstr("busy?"), HasSubstr("idle1"), Not(HasSubstr("idle2")),
+              HasSubstr("and 28 lines more"), Not(HasSubstr("PENDING"))));
     EXPECT_THAT(watched, AllOf(HasSubstr("\033[?25l"), testing::EndsWith("\033[?25h")));
     EXPECT_THAT(on_terminal("run \"$(printf 'busy\\t')\" --wait"),
                 AllOf(HasSubstr("docs [###.....] 40%"), HasSubstr("goes on")));
@@ -596,53 +649,6 @@ TEST_F(Zelctl, EachVerbAsksForWhatItSaysAndShowsTheAnswer) {
         EXPECT_THAT(outcome, Ended(0, shown)) << arguments;
         EXPECT_THAT(outcome.output, Not(HasSubstr("secret")));
         EXPECT_EQ(daemon.Requests().back(), "{\"command\": " + std::string(request) + "}");
-    }
-}
-
-// ---- The list that stands on the wire format alone ----
-
-/// What PrintTaskListQuickly() makes of these bytes.
-bool ListQuickly(const test::TempRoot& root, const std::string& bytes) {
-    ZEL::IPCListener listener;
-    EXPECT_EQ(listener.prepare(root.Path("var/run/zel_daemon.sock")), 0);
-    std::thread daemon([&] {
-        ZEL::Channel channel(81920);
-        PObject request;
-        channel.Open(listener.accept(), true);
-        EXPECT_EQ(ZEL::PStream().Recv(channel, request), 0);
-        EXPECT_EQ(request.toString(), "{\"command\": \"task_list\", \"rows\": 1}");
-        channel.Write(bytes.data(), static_cast<unsigned int>(bytes.size()));
-        channel.Close();
-    });
-    testing::internal::CaptureStdout();
-    const bool printed = zelctl::PrintTaskListQuickly();
-    daemon.join();
-    const std::string output = testing::internal::GetCapturedStdout();
-    EXPECT_EQ(printed, !output.empty());
-    return printed;
-}
-
-TEST(QuickList, TakesAWholeReplyAndNothingLess) {
-    const test::TempRoot root;
-    EXPECT_FALSE(zelctl::PrintTaskListQuickly()) << "nobody listens";
-    const std::string result("\x10\0\x06result\x01\x01\0", 12);
-    const std::string row = programs::PackTaskRow({});
-    const std::string rows =
-        std::string("\x10\0\x04rows\x41\x10\0", 10) + static_cast<char>(row.size()) + row + "\x40";
-    const std::string whole = "\x42" + result + rows + "\x40";
-    EXPECT_TRUE(ListQuickly(root, whole));
-    EXPECT_TRUE(ListQuickly(root, "\x42" + rows + result + "\x40"));
-    for (size_t cut = 0; cut < whole.size(); cut += 3) {
-        EXPECT_FALSE(ListQuickly(root, whole.substr(0, cut))) << cut;
-    }
-    std::string failed = whole;
-    failed[12] = '\x05';
-    std::string no_row = whole;
-    no_row[whole.size() - 4] = 'x';
-    for (const std::string& other : {failed, no_row, "\x42" + result + "\x40", "\x41" + whole,
-                                     "\x42" + result + rows + result.substr(0, 9) + rows + "\x40",
-                                     std::string("\x42\x42\x42")}) {
-        EXPECT_FALSE(ListQuickly(root, other));
     }
 }
 

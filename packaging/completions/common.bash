@@ -57,3 +57,31 @@ _zel_from_list() {
 
 # Leaves it to readline to complete files, or folders with "dirnames".
 _zel_files() { compopt -o "${1:-default}"; }
+
+# What a command's help says that it takes, COMMAND...: sets options, valued (those of them that want a value, each between
+# blanks) and commands.
+_zel_learn() {
+    local line word names section=
+    options=() valued=" " commands=()
+    while IFS= read -r line; do
+        case $line in
+            [A-Z]*:) section=$line ;;
+            "  -"*)
+                names=
+                line=${line#  }
+                for word in ${line%%  *}; do
+                    word=${word%,}
+                    case $word in
+                        --*) options+=("$word") names+="$word " ;;
+                        -*) names+="$word " ;;
+                        *) valued+=$names ;;
+                    esac
+                done
+                ;;
+            "  "[a-z]*)
+                line=${line#  }
+                [[ $section != Commands: ]] || commands+=("${line%% *}")
+                ;;
+        esac
+    done < <(timeout 2 "$@" --help 2>/dev/null </dev/null)
+}

@@ -7,11 +7,14 @@
 
 #include "ZEL/rsyncer.h"
 #include "base/text.h"
+#include "programs/common/failure.h"
 #include "programs/common/text.h"
 
 namespace programs {
 
 namespace {
+
+using ZEL::PObject;
 
 constexpr const char* kDays[] = {"sunday",   "monday", "tuesday", "wednesday",
                                  "thursday", "friday", "saturday"};
@@ -31,6 +34,10 @@ constexpr int kJanuary = 1;
 
 constexpr int kLastMinuteOfDay = 24 * 60 - 1;
 constexpr long kMaxTimes = 95;  // the library's bound: a run each quarter of an hour
+
+constexpr char kTimesNeedDays[] =
+    "--at, --every and --times go with --weekly, --monthly, --yearly or --once";
+constexpr char kEveryAlone[] = "--every needs --times N: how often a day's run is repeated";
 
 std::string Quoted(const std::string& text) {
     return "'" + Printable(text) + "'";
@@ -93,7 +100,11 @@ std::string DescribePeriod(long seconds) {
     return text;
 }
 
-std::string ApplyWeek(const std::string& words, ZEL::Schedule& schedule) {
+[[noreturn]] void Refuse(const std::string& text) {
+    throw Failure(FailureKind::kUsage, text);
+}
+
+std::string ParseWeek(const std::string& words) {
     std::vector<std::string> pieces;
     ZEL::SplitStringByChars(base::Lower(words), ",", pieces);
     std::string week = "0000000";
@@ -112,86 +123,90 @@ std::string ApplyWeek(const std::string& words, ZEL::Schedule& schedule) {
         } else if (day != std::end(kDays)) {
             week[static_cast<size_t>(day - std::begin(kDays))] = '1';
         } else {
-            return "--weekly: " + Quoted(piece) +
-                   " is no day: give days as in mon,thu or monday, or daily, weekdays, weekends";
+            Refuse("--weekly: " + Quoted(piece) +
+                   " is no day: give days as in mon,thu or monday, or daily, weekdays, weekends");
         }
     }
-    schedule.SetMode(ZEL::SCHD_MODE_WEEKLY);
-    schedule.SetWeekSchedule(week);
-    return "";
+    return week;
 }
 
-void SetBegin(ZEL::Schedule& schedule, ZEL::SCHD_MODE mode, const CalendarDate& date) {
-    schedule.SetMode(mode);
-    schedule.SetBeginYear(date.year);
-    schedule.SetBeginMonth(date.month);
-    schedule.SetBeginDay(date.day);
+void SayBegin(const CalendarDate& date, PObject& settings) {
+    settings["schedule_begin_year"] = date.year;
+    settings["schedule_begin_month"] = date.month;
+    settings["schedule_begin_day"] = date.day;
+}
+
+void SayStart(const TimeOfDay& start, PObject& settings) {
+    settings["schedule_begin_hour"] = start.hours;
+    settings["schedule_begin_min"] = start.minutes;
+}
+
+void SayPeriod(int minutes, PObject& settings) {
+    settings["period_hour"] = minutes / 60;
+    settings["period_minute"] = minutes % 60;
+}
+
+void SayMode(ZEL::SCHD_MODE mode, PObject& settings) {
+    settings["schedule_mode"] = static_cast<int>(mode);
 }
 
 // The mode with its days.
-std::string ApplyDays(const ScheduleWords& words, ZEL::Schedule& schedule) {
+void SayDays(const ScheduleWords& words, PObject& settings) {
     const int modes = int{words.manual} + int{words.on_change} + int{words.weekly.has_value()} +
                       int{words.monthly.has_value()} + int{words.yearly.has_value()} +
                       int{words.once.has_value()};
     if (modes > 1) {
-        return "give only one of --manual, --on-change, --weekly, --monthly, --yearly and --once";
+        Refuse("give only one of --manual, --on-change, --weekly, --monthly, --yearly and --once");
     }
     if (words.manual || words.on_change) {
-        schedule.SetMode(words.manual ? ZEL::SCHD_MODE_MANUAL : ZEL::SCHD_MODE_REALTIME);
-        schedule.SetRepeatTimesInDay(0);
-        schedule.SetStartHour(0);
-        schedule.SetStartMinute(0);
+        SayMode(words.manual ? ZEL::SCHD_MODE_MANUAL : ZEL::SCHD_MODE_REALTIME, settings);
+        SayStart({0, 0}, settings);
+        settings["repeat_times_in_day"] = 0;
     } else if (words.weekly) {
-        return ApplyWeek(*words.weekly, schedule);
+        SayMode(ZEL::SCHD_MODE_WEEKLY, settings);
+        settings["week_schd"] = ParseWeek(*words.weekly);
     } else if (words.monthly) {
         const auto day = base::ParseNumber(*words.monthly, 31);
         if (!day || *day == 0) {
-            return "--monthly: " + Quoted(*words.monthly) + " is no day of a month: give 1 to 31";
+            Refuse("--monthly: " + Quoted(*words.monthly) + " is no day of a month: give 1 to 31");
         }
-        SetBegin(schedule, ZEL::SCHD_MODE_MONTHLY, {kLeapYear, kJanuary, static_cast<int>(*day)});
+        SayMode(ZEL::SCHD_MODE_MONTHLY, settings);
+        SayBegin({kLeapYear, kJanuary, static_cast<int>(*day)}, settings);
     } else if (words.yearly) {
         const std::vector<int> date = Numbers(*words.yearly, '-', {2, 2});
         if (date.empty() || !IsDate(kLeapYear, date[0], date[1])) {
-            return "--yearly: " + Quoted(*words.yearly) + " is no date MM-DD, as in 03-31";
+            Refuse("--yearly: " + Quoted(*words.yearly) + " is no date MM-DD, as in 03-31");
         }
-        SetBegin(schedule, ZEL::SCHD_MODE_YEARLY, {kLeapYear, date[0], date[1]});
+        SayMode(ZEL::SCHD_MODE_YEARLY, settings);
+        SayBegin({kLeapYear, date[0], date[1]}, settings);
     } else if (words.once) {
         const auto date = ParseDate(*words.once);
         if (!date) {
-            return "--once: " + Quoted(*words.once) + " is no date YYYY-MM-DD, as in 2026-03-31";
+            Refuse("--once: " + Quoted(*words.once) + " is no date YYYY-MM-DD, as in 2026-03-31");
         }
-        SetBegin(schedule, ZEL::SCHD_MODE_ONCE, *date);
+        SayMode(ZEL::SCHD_MODE_ONCE, settings);
+        SayBegin(*date, settings);
     }
-    return "";
 }
 
-std::string ApplyRepeats(const ScheduleWords& words, ZEL::Schedule& schedule) {
-    std::optional<int> period;
+void SayRepeats(const ScheduleWords& words, PObject& settings) {
     if (words.every) {
-        period = ParsePeriod(*words.every);
+        const auto period = ParsePeriod(*words.every);
         if (!period) {
-            return "--every: " + Quoted(*words.every) +
-                   " is no time span: give hours and minutes, as in 90m, 2h or 1h30m";
+            Refuse("--every: " + Quoted(*words.every) +
+                   " is no time span: give hours and minutes, as in 90m, 2h or 1h30m");
         }
-    } else if (schedule.GetPeriodSeconds() > 0) {
-        period = static_cast<int>(schedule.GetPeriodSeconds() / 60);
+        if (words.times && *words.times == 0) {
+            Refuse(kEveryAlone);
+        }
+        SayPeriod(*period, settings);
     }
-    const int64_t times = words.times ? int64_t{*words.times} : schedule.GetRepeatTimesInDay();
-    if (times > kMaxTimes) {
-        return "--times: a day has at most 95 runs after the first";
+    if (words.times) {
+        if (*words.times > kMaxTimes) {
+            Refuse("--times: a day has at most 95 runs after the first");
+        }
+        settings["repeat_times_in_day"] = *words.times;
     }
-    if (words.every && times == 0) {
-        return "--every needs --times N: how often a day's run is repeated";
-    }
-    if (times > 0 && !period) {
-        return "--times needs --every: the time between two runs, as in 1h30m";
-    }
-    // The count first: set after it, a period stands.
-    schedule.SetRepeatTimesInDay(static_cast<long>(times));
-    if (times > 0) {
-        schedule.SetPeriod(0, *period);
-    }
-    return "";
 }
 
 std::string DescribeDays(const ZEL::Schedule& schedule) {
@@ -231,42 +246,57 @@ std::string DescribeDays(const ZEL::Schedule& schedule) {
 
 }  // namespace
 
-bool ScheduleWords::Any() const {
-    return manual || on_change || weekly || monthly || yearly || once || at || every || times;
-}
-
-std::string ApplyWords(const ScheduleWords& words, ZEL::Schedule& schedule) {
-    std::string fault = ApplyDays(words, schedule);
-    if (!fault.empty()) {
-        return fault;
-    }
-    const bool has_times = words.at || words.every || words.times;
-    if (has_times && schedule.GetMode() <= ZEL::SCHD_MODE_REALTIME) {
-        return "--at, --every and --times go with --weekly, --monthly, --yearly or --once";
+void SayWords(const ScheduleWords& words, PObject& settings) {
+    SayDays(words, settings);
+    if ((words.manual || words.on_change) && (words.at || words.every || words.times)) {
+        Refuse(kTimesNeedDays);
     }
     if (words.at) {
         const auto start = ParseTimeOfDay(*words.at);
         if (!start) {
-            return "--at: " + Quoted(*words.at) + " is no time HH:MM from 00:00 to 23:59";
+            Refuse("--at: " + Quoted(*words.at) + " is no time HH:MM from 00:00 to 23:59");
         }
-        schedule.SetStartHour(start->hours);
-        schedule.SetStartMinute(start->minutes);
+        SayStart(*start, settings);
     }
-    if (words.every || words.times) {
-        fault = ApplyRepeats(words, schedule);
+    SayRepeats(words, settings);
+}
+
+std::string SettleSchedule(const PObject& said, PObject& settings) {
+    const PObject& now = settings;
+    const bool says_period = said["period_hour"].asBool() || said["period_minute"].asBool();
+    const bool says_times = said["repeat_times_in_day"].asBool();
+    const bool says_start =
+        said["schedule_begin_hour"].asBool() || said["schedule_begin_min"].asBool();
+    if ((says_period || says_times || says_start) && !said.hasMember("schedule_mode") &&
+        now["schedule_mode"].asUInt32() <= ZEL::SCHD_MODE_REALTIME) {
+        return kTimesNeedDays;
     }
+    if (says_period && !now["repeat_times_in_day"].asBool() &&
+        !said.hasMember("repeat_times_in_day")) {
+        return kEveryAlone;
+    }
+    const bool has_period = now["period_hour"].asBool() || now["period_minute"].asBool();
+    if (says_times && !has_period && !said.hasMember("period_hour")) {
+        return "--times needs --every: the time between two runs, as in 1h30m";
+    }
+    if (said.hasMember("repeat_times_in_day") && !says_times && !says_period) {
+        SayPeriod(0, settings);
+    }
+    return "";
+}
+
+std::string FaultOfTimes(const ZEL::Schedule& schedule) {
     // A schedule that came from elsewhere may hold any numbers; these bounds keep the sum small.
     const long period = std::clamp(schedule.GetPeriodSeconds() / 60, 0L, kLastMinuteOfDay + 1L);
     const long times = std::clamp(schedule.GetRepeatTimesInDay(), 0L, kMaxTimes + 1L);
     const long start = std::clamp(schedule.GetStartHour(), 0, 24) * 60L +
                        std::clamp(schedule.GetStartMinute(), 0, 60);
     const long last = start + period * times;  // minutes
-    if (fault.empty() && last > kLastMinuteOfDay) {
-        fault = "the last of the day's runs would be " + DescribePeriod(last * 60) +
-                " after midnight, on another day: choose an earlier --at, a shorter --every or "
-                "fewer --times";
-    }
-    return fault;
+    return last <= kLastMinuteOfDay
+               ? ""
+               : "the last of the day's runs would be " + DescribePeriod(last * 60) +
+                     " after midnight, on another day: choose an earlier --at, a shorter --every "
+                     "or fewer --times";
 }
 
 std::string DescribeSchedule(const ZEL::Schedule& schedule) {

@@ -4,6 +4,7 @@
 #include <optional>
 #include <string>
 
+#include "ZEL/pobject.h"
 #include "ZEL/sync_obj.h"
 
 namespace programs {
@@ -19,15 +20,21 @@ struct ScheduleWords {
     std::optional<std::string> at;       ///< HH:MM, the first run of a day
     std::optional<std::string> every;    ///< "90m", "1h30m", "2h": between the runs of a day
     std::optional<unsigned int> times;   ///< runs of a day after the first
-
-    bool Any() const;
 };
 
-/// Changes `schedule` to what the words say and leaves the rest of it. Empty, or what is wrong, in
-/// terms of the options that carry the words; the schedule then counts no more.
-std::string ApplyWords(const ScheduleWords& words, ZEL::Schedule& schedule);
+/// Adds the keys of a task's settings that say the same; what is not said has none. Throws Failure
+/// (kUsage), in terms of the options that carry the words.
+void SayWords(const ScheduleWords& words, ZEL::PObject& settings);
 
-/// The reverse, for a person.
+// What belongs together in a schedule, whoever says it: each gives what is wrong, or nothing.
+
+/// `settings` are a task's after `said` has been put into them. A day's repeats need a count and a
+/// period: one that is said alone has to find the other there. A count of 0 takes the period away.
+std::string SettleSchedule(const ZEL::PObject& said, ZEL::PObject& settings);
+/// Whether all runs of a day fall on that day.
+std::string FaultOfTimes(const ZEL::Schedule& schedule);
+
+/// A schedule in a person's words.
 std::string DescribeSchedule(const ZEL::Schedule& schedule);
 
 /// When it runs in a month or year without its day; empty when each has it.

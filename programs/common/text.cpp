@@ -113,6 +113,18 @@ std::string Printable(const std::string& text) {
     return printable;
 }
 
+std::string OneLine(const std::string& text) {
+    std::string line;
+    for (const char c : text) {
+        if (c == '\n') {
+            line += "; ";
+        } else {
+            line += c;
+        }
+    }
+    return line;
+}
+
 bool IsTaskName(const std::string& name) {
     constexpr size_t kMaxBytes = 128;
     return !name.empty() && name.size() <= kMaxBytes &&

@@ -30,6 +30,9 @@ std::string Printable(const std::string& text);
 /// Whether Printable() would give the text as it is.
 bool IsPrintable(const std::string& text);
 
+/// A text of several lines as one.
+std::string OneLine(const std::string& text);
+
 /// Whether a task may be called so: 1 to 128 bytes without control characters, quotes and brackets,
 /// which the server's registry has no place for.
 bool IsTaskName(const std::string& name);

@@ -10,12 +10,14 @@
 
 #include "ZEL/channel.h"
 #include "ZEL/log.h"
+#include "programs/common/failure.h"
 #include "programs/common/run_progress.h"
 #include "programs/common/schedule_words.h"
 #include "programs/common/seen_folder.h"
+#include "programs/common/task_fields.h"
+#include "programs/common/task_row.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/store.h"
-#include "programs/zel_daemon/task_map.h"
 
 namespace zel_daemon {
 
@@ -30,6 +32,7 @@ constexpr unsigned int kLogLimit = 20;
 const std::set<std::string>& StateKeys() {
     static const std::set<std::string> keys = [] {
         std::set<std::string> all = {"id",
+                                     "row",
                                      "schedule",
                                      "status",
                                      "sync_result",
@@ -103,6 +106,37 @@ bool FlagOf(const PObject& request, const char* key) {
     return NumberOf(request, key, 0, 1) == 1;
 }
 
+// The task as a list shows it.
+std::string RowOf(const TaskRecord& record, const TaskState& state) {
+    const ZEL::TaskInfo& info = record.Info();
+    const ZEL::SyncInfo& sync = info.GetSyncInfo();
+    programs::TaskRow row;
+    row.name = info.GetName();
+    for (const std::string& share : info.GetShareList()) {
+        row.shares += (row.shares.empty() ? "" : ",") + share;
+    }
+    row.server = sync.GetServerName().empty() ? sync.GetServerIP() : sync.GetServerName();
+    row.schedule = programs::DescribeSchedule(info.GetSchedule());
+    row.status = state.status;
+    if (state.last != nullptr) {
+        row.result = state.last->result;
+        row.last_end = state.last->end;
+        if (row.result == ZEL::TASK_RESULT_FAILED) {
+            row.error = programs::OneLine(state.last->error);
+        }
+    }
+    row.next_run = state.next_run;
+    if (state.retry_in) {
+        row.retry_in = static_cast<uint64_t>(*state.retry_in);
+    }
+    if (state.active != nullptr && !state.active->progress_share.empty()) {
+        row.progress = programs::ProgressState(state.active->progress);
+    }
+    row.pending = state.pending;
+    row.note = state.note;
+    return programs::PackTaskRow(row);
+}
+
 bool AsksForSecrets(const Peer& peer, const PObject& request) {
     const bool secrets = FlagOf(request, "secrets");
     if (secrets && !peer.trusted) {
@@ -173,7 +207,7 @@ PObject Requests::Dispatch(const Peer& peer, const PObject& request) {
     }
     for (const auto& [key, value] : request.asMap()) {
         if (key != "command" && command->keys.count(key) == 0 &&
-            !(command->takes_task && IsTaskKey(key))) {
+            !(command->takes_task && programs::FindTaskField(key) != nullptr)) {
             Refuse("command " + name + " has no key '" + programs::Printable(key) + "'");
         }
     }
@@ -182,21 +216,23 @@ PObject Requests::Dispatch(const Peer& peer, const PObject& request) {
 
 PObject Requests::TaskAdd(const Peer&, const PObject& request) {
     TaskRecord record;
-    ApplyTaskKeys(request, record);
-    if (record.Info().GetShareList().empty()) {
-        Refuse("share_list names no share");
-    }
+    ApplyRequest(request, record);
     PObject reply = Success();
-    reply["task"] = ShownTask(service_.Add(std::move(record)), false);
+    reply["task"] = ShownTask(service_.Add(std::move(record)), TaskDetail::kAll);
     return reply;
 }
 
 PObject Requests::TaskEdit(const Peer&, const PObject& request) {
     const std::string name = TextOf(request, "task");
-    TaskRecord record = service_.Find(name);
-    ApplyTaskKeys(request, record);
+    const TaskRecord& before = service_.Find(name);
+    TaskRecord record = before;
+    ApplyRequest(request, record);
+    const bool changed = !record.SameAs(before);
     PObject reply = Success();
-    reply["task"] = ShownTask(service_.Edit(name, std::move(record)), false);
+    reply["changed"] = changed;
+    // What is so already does not begin anew.
+    reply["task"] =
+        ShownTask(changed ? service_.Edit(name, std::move(record)) : before, TaskDetail::kAll);
     return reply;
 }
 
@@ -206,14 +242,16 @@ PObject Requests::TaskList(const Peer& peer, const PObject& request) {
     PObject reply = Success();
     if (FlagOf(request, "rows")) {
         for (const TaskRecord* record : service_.Tasks()) {
-            reply["rows"].asArray().emplace_back(programs::PackTaskRow(RowOf(*record)));
+            reply["rows"].asArray().emplace_back(RowOf(*record, service_.StateOf(*record)));
         }
         reply["rows"].asArray();  // also without tasks
         return reply;
     }
     PObject::Array& tasks = reply["tasks"].asArray();
     for (const TaskRecord* record : service_.Tasks()) {
-        tasks.push_back(brief ? BriefTask(*record) : ShownTask(*record, secrets));
+        tasks.push_back(ShownTask(*record, brief     ? TaskDetail::kBrief
+                                           : secrets ? TaskDetail::kWithSecrets
+                                                     : TaskDetail::kAll));
     }
     return reply;
 }
@@ -221,7 +259,8 @@ PObject Requests::TaskList(const Peer& peer, const PObject& request) {
 PObject Requests::TaskShow(const Peer& peer, const PObject& request) {
     const bool secrets = AsksForSecrets(peer, request);
     PObject reply = Success();
-    reply["task"] = ShownTask(service_.Find(TextOf(request, "task")), secrets);
+    reply["task"] = ShownTask(service_.Find(TextOf(request, "task")),
+                              secrets ? TaskDetail::kWithSecrets : TaskDetail::kAll);
     return reply;
 }
 
@@ -283,11 +322,11 @@ PObject Requests::Watch(const Peer&, const PObject& request) {
     PObject reply = Success();
     PObject::Array& tasks = reply["tasks"].asArray();
     if (request.hasMember("task")) {
-        tasks.push_back(BriefTask(service_.Find(TextOf(request, "task"))));
+        tasks.push_back(ShownTask(service_.Find(TextOf(request, "task")), TaskDetail::kBrief));
         return reply;
     }
     for (const TaskRecord* record : service_.Tasks()) {
-        tasks.push_back(BriefTask(*record));
+        tasks.push_back(ShownTask(*record, TaskDetail::kBrief));
     }
     return reply;
 }
@@ -316,53 +355,16 @@ PObject Requests::Reload(const Peer&, const PObject&) {
     return Success();
 }
 
-PObject Requests::ShownTask(const TaskRecord& record, bool secrets) const {
-    PObject map = TaskToMap(record, secrets);
+PObject Requests::ShownTask(const TaskRecord& record, TaskDetail detail) const {
+    PObject map = TaskToMap(record, detail);
     AddState(record, map);
     return map;
-}
-
-PObject Requests::BriefTask(const TaskRecord& record) const {
-    PObject map = TaskToBriefMap(record);
-    map["schedule"] = programs::DescribeSchedule(record.Info().GetSchedule());
-    AddState(record, map);
-    return map;
-}
-
-programs::TaskRow Requests::RowOf(const TaskRecord& record) const {
-    const TaskState state = service_.StateOf(record);
-    const ZEL::TaskInfo& info = record.Info();
-    const ZEL::SyncInfo& sync = info.GetSyncInfo();
-    programs::TaskRow row;
-    row.name = info.GetName();
-    for (const std::string& share : info.GetShareList()) {
-        row.shares += (row.shares.empty() ? "" : ",") + share;
-    }
-    row.server = sync.GetServerName().empty() ? sync.GetServerIP() : sync.GetServerName();
-    row.schedule = programs::DescribeSchedule(info.GetSchedule());
-    row.status = state.status;
-    if (state.last != nullptr) {
-        row.result = state.last->result;
-        row.last_end = state.last->end;
-        if (row.result == ZEL::TASK_RESULT_FAILED) {
-            row.error = state.last->error;
-            std::replace(row.error.begin(), row.error.end(), '\n', ' ');
-        }
-    }
-    row.next_run = state.next_run;
-    if (state.retry_in) {
-        row.retry_in = static_cast<uint64_t>(*state.retry_in);
-    }
-    if (state.active != nullptr && !state.active->progress_share.empty()) {
-        row.progress = programs::ProgressState(state.active->progress);
-    }
-    row.pending = state.pending;
-    row.note = state.note;
-    return row;
 }
 
 void Requests::AddState(const TaskRecord& record, PObject& map) const {
     const TaskState state = service_.StateOf(record);
+    map["row"] = RowOf(record, state);
+    map["schedule"] = programs::DescribeSchedule(record.Info().GetSchedule());
     map["status"] = static_cast<int>(state.status);
     map["sync_result"] =
         static_cast<int>(state.last != nullptr ? state.last->result : ZEL::TASK_RESULT_NONE);

@@ -6,8 +6,8 @@
 #include <string>
 
 #include "ZEL/pobject.h"
-#include "programs/common/task_row.h"
 #include "programs/zel_daemon/service.h"
+#include "programs/zel_daemon/task_map.h"
 
 namespace zel_daemon {
 
@@ -49,9 +49,7 @@ private:
     ZEL::PObject DaemonStatus(const Peer&, const ZEL::PObject& request);
     ZEL::PObject Reload(const Peer&, const ZEL::PObject& request);
 
-    ZEL::PObject ShownTask(const TaskRecord& record, bool secrets) const;
-    ZEL::PObject BriefTask(const TaskRecord& record) const;
-    programs::TaskRow RowOf(const TaskRecord& record) const;
+    ZEL::PObject ShownTask(const TaskRecord& record, TaskDetail detail) const;
     void AddState(const TaskRecord& record, ZEL::PObject& map) const;
 
     Service& service_;

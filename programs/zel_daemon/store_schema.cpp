@@ -1,8 +1,10 @@
 #include "programs/zel_daemon/store_schema.h"
 
+#include <algorithm>
 #include <string>
 
 #include "programs/common/failure.h"
+#include "programs/common/task_fields.h"
 
 namespace zel_daemon {
 
@@ -14,7 +16,7 @@ using programs::FailureKind;
 // Marks the file as a store ("ZELd"), so that no other program's database is ever written to.
 constexpr int64_t kApplicationId = 0x5a454c64;
 
-// Columns of tasks are named like the keys of a task's map. Lists are JSON arrays. Ids are never
+// Columns of tasks are named like the keys of TaskFields(). Lists are JSON arrays. Ids are never
 // used again: a late answer about what is gone meets nothing.
 constexpr char kFirst[] = R"(
 CREATE TABLE tasks (
@@ -79,10 +81,29 @@ ALTER TABLE runs ADD COLUMN details TEXT NOT NULL DEFAULT '';  -- what rsync and
 // Each share's state begins anew with the daemon.
 constexpr char kNoWholeDue[] = "ALTER TABLE tasks DROP COLUMN whole_due";
 
+// A setting that tasks have not always had: nobody has said anything of it yet.
+std::string NewColumn(const programs::TaskField& field) {
+    const char* const type = field.kind == programs::FieldKind::kText ? " TEXT NOT NULL DEFAULT ''"
+                             : field.kind == programs::FieldKind::kTexts
+                                 ? " TEXT NOT NULL DEFAULT '[]'"
+                                 : " INTEGER NOT NULL DEFAULT 0";
+    return std::string("ALTER TABLE tasks ADD COLUMN ") + field.key + type + ";\n";
+}
+
 }  // namespace
 
 const SchemaSteps& StoreSchema() {
-    static const SchemaSteps steps = {kFirst, kDetails, kNoWholeDue};
+    static const SchemaSteps steps = [] {
+        SchemaSteps all = {kFirst, kDetails, kNoWholeDue};
+        for (const programs::TaskField& field : programs::TaskFields()) {
+            if (field.layout > 1) {
+                const auto layout = static_cast<size_t>(field.layout);
+                all.resize(std::max(all.size(), layout));
+                all[layout - 1] += NewColumn(field);
+            }
+        }
+        return all;
+    }();
     return steps;
 }
 
@@ -108,7 +129,7 @@ void BringUpToDate(Database& database, const SchemaSteps& steps) {
     }
     for (int64_t step = version; step < known; ++step) {
         Transaction transaction(database);
-        database.Execute(steps[static_cast<size_t>(step)]);
+        database.Execute(steps[static_cast<size_t>(step)].c_str());
         database.Execute(("PRAGMA application_id = " + std::to_string(kApplicationId)).c_str());
         database.Execute(("PRAGMA user_version = " + std::to_string(step + 1)).c_str());
         transaction.Commit();

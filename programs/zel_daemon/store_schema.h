@@ -1,6 +1,7 @@
 // The layout of the store's file, and how an older one becomes the one of today.
 #pragma once
 
+#include <string>
 #include <vector>
 
 #include "programs/zel_daemon/sqlite.h"
@@ -9,7 +10,7 @@ namespace zel_daemon {
 
 /// Each step brings the layout from the version that is its index to the next one. A step that has
 /// been released never changes: what is new comes as a further step.
-using SchemaSteps = std::vector<const char*>;
+using SchemaSteps = std::vector<std::string>;
 
 /// The steps of the store.
 const SchemaSteps& StoreSchema();

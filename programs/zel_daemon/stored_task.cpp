@@ -1,9 +1,10 @@
 #include "programs/zel_daemon/stored_task.h"
 
+#include <iterator>
 #include <nlohmann/json.hpp>
-#include <utility>
 
 #include "base/utf8.h"
+#include "programs/common/task_fields.h"
 
 namespace zel_daemon {
 
@@ -14,61 +15,29 @@ using ZEL::PObject;
 
 using Bytes = std::vector<unsigned char>;
 
-constexpr char kShareList[] = "share_list";
-constexpr char kExclude[] = "exclude";
-constexpr char kPaused[] = "paused";
-constexpr char kCheckedUntil[] = "checked_until";
-
-// A row is the task's map with the daemon's own keys beside it.
-constexpr const char* kColumns[] = {
-    "name",
-    kShareList,
-    "user",
-    "pswd",
-    "server_ip",
-    "server_name",
-    "compress",
-    "block",
-    "ssh",
-    "ssh_port",
-    "max_bandwidth",
-    "rsync_timeout",
-    "schedule_mode",
-    "week_schd",
-    "repeat_times_in_day",
-    "period_hour",
-    "period_minute",
-    "schedule_begin_year",
-    "schedule_begin_month",
-    "schedule_begin_day",
-    "schedule_begin_hour",
-    "schedule_begin_min",
-    kExclude,
-    kPaused,
-    kCheckedUntil,
-};
+// Columns beside those of the settings, which are named like the settings' keys.
+constexpr const char* kOwnColumns[] = {"paused", "checked_until"};
 
 // A list as a JSON array. An element that is no text, which JSON cannot hold, is an array of its
 // bytes.
-template <typename Strings>
-std::string ToJson(const Strings& strings) {
+std::string ToJson(const PObject& strings) {
     json list = json::array();
-    for (const std::string& string : strings) {
+    for (const std::string& string : programs::TextsOf(strings)) {
         list.push_back(base::IsUtf8(string) ? json(string)
                                             : json(Bytes(string.begin(), string.end())));
     }
     return list.dump();
 }
 
-template <typename Strings>
-Strings FromJson(const std::string& text) {
-    Strings strings;
+PObject FromJson(const std::string& text) {
+    PObject strings;
+    strings.asArray();
     for (const json& item : json::parse(text).get<std::vector<json>>()) {
         if (item.is_array()) {
             const Bytes bytes = item.get<Bytes>();
-            strings.emplace_back(std::string(bytes.begin(), bytes.end()));
+            strings.asArray().emplace_back(std::string(bytes.begin(), bytes.end()));
         } else {
-            strings.emplace_back(item.get<std::string>());
+            strings.asArray().emplace_back(item.get<std::string>());
         }
     }
     return strings;
@@ -76,8 +45,11 @@ Strings FromJson(const std::string& text) {
 
 std::string Repeat(const std::string& separator, const char* (*text)(const char* column)) {
     std::string all;
-    for (const char* const column : kColumns) {
-        all += (all.empty() ? "" : separator) + text(column);
+    for (const programs::TaskField& field : programs::TaskFields()) {
+        all += text(field.key) + separator;
+    }
+    for (const char* const column : kOwnColumns) {
+        all += text(column) + (column == std::end(kOwnColumns)[-1] ? "" : separator);
     }
     return all;
 }
@@ -93,44 +65,44 @@ std::string TaskParameters() {
 }
 
 void BindTask(Query& query, const TaskRecord& record) {
-    PObject row;
-    ZEL::TaskInfo2PObj(record.Info(), row);
-    row[kShareList] = ToJson(record.Info().GetShareList());
-    row[kExclude] = ToJson(record.excludes);
-    row[kPaused] = record.paused;
-    row[kCheckedUntil] = record.checked_until;
-    for (const char* const column : kColumns) {
-        const PObject& value = std::as_const(row)[column];
-        if (value.isString()) {
+    const PObject settings = record.ToMap();
+    for (const programs::TaskField& field : programs::TaskFields()) {
+        const PObject& value = settings[field.key];
+        if (field.kind == programs::FieldKind::kTexts) {
+            query.Bind(ToJson(value));
+        } else if (field.kind == programs::FieldKind::kText) {
             query.Bind(value.asString());
         } else {
             query.Bind(value.asInt64());
         }
     }
+    query.Bind(record.paused);
+    query.Bind(record.checked_until);
 }
 
 TaskRecord ReadTask(Query& query) {
-    PObject row;
     const uint64_t id = static_cast<uint64_t>(query.Number());
-    for (const char* const column : kColumns) {
-        if (query.NextIsNumber()) {
-            row[column] = query.Number();
+    PObject settings;
+    for (const programs::TaskField& field : programs::TaskFields()) {
+        PObject& value = settings[field.key];
+        if (field.kind == programs::FieldKind::kTexts) {
+            try {
+                value = FromJson(query.Text());
+            } catch (const json::exception& error) {
+                throw RowError("the lists of task " + std::to_string(id) +
+                               " cannot be read: " + error.what());
+            }
+        } else if (field.kind == programs::FieldKind::kText) {
+            value = query.Text();
         } else {
-            row[column] = query.Text();
+            value = query.Number();
         }
     }
     TaskRecord record;
-    try {
-        row[kShareList] = FromJson<PObject::Array>(row[kShareList].asString());
-        record.excludes = FromJson<std::vector<std::string>>(row[kExclude].asString());
-    } catch (const json::exception& error) {
-        throw RowError("the lists of task " + std::to_string(id) +
-                       " cannot be read: " + error.what());
-    }
-    ZEL::PObj2SyncTask(row, record.task);
+    record.SetMap(settings);
     record.task.SetID(id);
-    record.paused = row[kPaused].asBool();
-    record.checked_until = row[kCheckedUntil].asInt64();
+    record.paused = query.Number() != 0;
+    record.checked_until = query.Number();
     return record;
 }
 

@@ -279,7 +279,7 @@ std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& r
     RunPlan plan;
     plan.order.task = record_.Name();
     plan.order.task_id = record_.ID();
-    plan.order.excludes = record_.excludes;
+    plan.order.excludes = record_.ExcludeRules();
     plan.order.announce = false;
     plan.record.task_id = record_.ID();
     plan.record.reason = step.reason;

@@ -14,19 +14,16 @@ inline programs::Failure RequestError(int result, const std::string& text) {
     return {programs::FailureKind::kUsage, text, result};
 }
 
-/// Sets the fields of `record` whose keys `request` has. Keys that are none of a task's are left to
-/// the caller. Throws RequestError (-4) for a value of the wrong kind or size, and for a task that
-/// would not pass; `record` is then as it was. Shares are looked up on this host when the request
-/// names them (-17 for one that cannot be pushed from here).
-void ApplyTaskKeys(const ZEL::PObject& request, TaskRecord& record);
+/// Changes the settings of `record` that `request` names; keys that are none of a task's are left
+/// to the caller. Throws Failure (-4) for a value that does not pass and for a task that would not;
+/// `record` is then as it was. Shares are looked up on this host when the request names them
+/// (RequestError, -17, for one that cannot be pushed from here).
+void ApplyRequest(const ZEL::PObject& request, TaskRecord& record);
 
-/// Whether `key` is one that ApplyTaskKeys() takes.
-bool IsTaskKey(const std::string& key);
+enum class TaskDetail { kBrief, kAll, kWithSecrets };
 
-/// The task's own keys; the password only with `secrets`.
-ZEL::PObject TaskToMap(const TaskRecord& record, bool secrets);
-/// Those of them that a list shows.
-ZEL::PObject TaskToBriefMap(const TaskRecord& record);
+/// The task's own keys: those that a list shows, all, or with what only a few may see.
+ZEL::PObject TaskToMap(const TaskRecord& record, TaskDetail detail);
 
 /// One run of the history.
 ZEL::PObject RunToMap(const RunRecord& run, bool with_details);

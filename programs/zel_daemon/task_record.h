@@ -1,25 +1,19 @@
-// A task as the daemon keeps it: what the library knows of it, and what is the daemon's own.
+// A task as the daemon keeps it: its settings, and what is the daemon's own.
 #pragma once
 
 #include <cstdint>
 #include <string>
-#include <vector>
 
-#include "ZEL/pobject.h"
 #include "ZEL/sync_obj.h"
+#include "programs/common/task_settings.h"
 
 namespace zel_daemon {
 
-struct TaskRecord {
-    ZEL::SyncTask task;
-    std::vector<std::string> excludes;  ///< rsync patterns of files that stay behind
-    bool paused = false;                ///< started by nobody but a person
+struct TaskRecord : programs::TaskSettings {
+    bool paused = false;  ///< started by nobody but a person
     /// Runs of the schedule up to this moment (seconds since the epoch) have been made or given up.
     int64_t checked_until = 0;
 
-    uint64_t ID() const { return task.GetID(); }
-    std::string Name() const { return task.GetInfo().GetName(); }
-    const ZEL::TaskInfo& Info() const { return task.GetInfo(); }
     bool IsRealtime() const { return Info().GetSchedule().GetMode() == ZEL::SCHD_MODE_REALTIME; }
 };
 

@@ -1,15 +1,19 @@
 #!/usr/bin/env bash
-# The completions, driven as readline drives them, with programs that answer from here.  completion_test.sh SOURCE-FOLDER
+# The completions, driven as readline drives them, with lists that come from here.  completion_test.sh SOURCE-FOLDER ZELCTL
 set -euo pipefail
 work=$(mktemp -d)
 trap 'rm -rf "$work"' EXIT
 mkdir -p "$work"/{bin,zel,bash-completion/completions}
 cp "$1"/packaging/completions/z* "$work/bash-completion/completions/"
 cp "$1/packaging/completions/common.bash" "$work/zel/completion.bash"
-cat >"$work/bin/zelctl" <<'END'
+cat >"$work/bin/zelctl" <<END
 #!/bin/sh
+zelctl=$2
+END
+cat >>"$work/bin/zelctl" <<'END'
 echo "a complaint" >&2
 case "$*" in
+    *--help) exec "$zelctl" "$@" ;;
     "task list --json") printf '%s\n' '[{"id": 1, "name": "my photos", "server_name": "nas"},' '{"name": "a:b=c"},' '{"name": "x\\y"}]' ;;
     "share list --json") printf '%s\n' '[' '  {' '    "share": "Übungen",' '    "folder": "/srv"' '  }' ']' ;;
 esac
@@ -42,8 +46,11 @@ expect '<Übungen>' zelctl task add x --share ''
 expect '<Übungen>' zelctl task edit x --share = Ü
 expect '<my\ photos>' zelctl task edit --server nas my
 expect '<Übungen>' zelctl push --server nas other ''
-expect '<--limit><--verbose><--json><--help>' zelctl task log x --
-expect '<rm><run><resume>' zelctl help task r
+expect '<--help><--limit><--json><--verbose>' zelctl task log x --
+expect '<--ssh><--ssh-port>' zelctl task add x --bwlimit 7 --ss
+expect '<--no-exclude>' zelctl task edit x --no-e
+expect '<--monthly>' zelctl next --mo
+expect '<run><rm><resume>' zelctl help task r
 expect '<>' zel_server account rm ''
 expect '<syslog>' zel_daemon --foreground --log sy
 exit "$((failures > 0))"

@@ -110,7 +110,7 @@ void CheckAnswer(const Refusal& refusal, bool skipped, const PatientTask& task, 
                          "its server was not asked: it gave no answer for another task",
                          "see that task"});
     } else if (refusal) {
-        found.push_back({"", Severity::kFailed, OneLine(refusal->what()),
+        found.push_back({"", Severity::kFailed, programs::OneLine(refusal->what()),
                          RemedyOfRefusal(refusal->Status(), task)});
     }
 }
@@ -145,7 +145,7 @@ void CheckLastRun(const PatientTask& task, Findings& found) {
                   Quoted(task.record.GetInfo().GetName());
     found.push_back({"", Severity::kFailed,
                      "its last run failed at " + programs::HumanTime(state["last_end"].asInt64()) +
-                         ": " + OneLine(state["last_error"].asString()),
+                         ": " + programs::OneLine(state["last_error"].asString()),
                      retry});
 }
 

@@ -1,10 +1,19 @@
+#include "base/text.h"
+#include "programs/common/schedule_words.h"
+#include "programs/common/task_fields.h"
 #include "programs/zelctl/declare.h"
 #include "programs/zelctl/task/edit.h"
+#include "programs/zelctl/task/list.h"
+#include "programs/zelctl/task/next.h"
 #include "programs/zelctl/task/run.h"
 
 namespace zelctl {
 
 namespace {
+
+using programs::FieldKind;
+using programs::TaskField;
+using ZEL::PObject;
 
 constexpr char kScheduleHelp[] =
     "It runs by one of --manual, --on-change, --weekly, --monthly, --yearly, --once.\n"
@@ -15,30 +24,62 @@ constexpr char kScheduleHelp[] =
 /// What `task add` and `task edit` are given.
 struct TaskArguments {
     std::string name;
-    std::string new_name;
-    std::string password_file;
-    bool new_password = false;
-    bool no_excludes = false;
-    bool no_check = false;
-    std::vector<std::string> excludes;
-    TaskOptions options;
+    programs::ScheduleWords schedule;
+    EditOptions options;
 
-    const TaskOptions& Options() {
-        if (no_excludes || !excludes.empty()) {
-            options.excludes = excludes;
-        }
+    const EditOptions& Options() {
+        programs::SayWords(schedule, options.said);
         return options;
     }
 };
 
-// A switch that can be given, given as "no", and left as it is.
-void AddSwitch(CLI::App& command, const std::string& name, std::optional<bool>& value,
-               const std::string& about) {
-    command.add_flag_function(
-        "--" + name + ",!--no-" + name, [&value](int64_t count) { value = count > 0; }, about);
+// The option that says a setting. `is_new`: of a task that does not exist yet.
+void AddSetting(CLI::App& command, const TaskField& field, PObject& said, bool is_new) {
+    const std::string names = field.option;
+    PObject* const settings = &said;  // outlives the command
+    if (field.kind == FieldKind::kSwitch) {
+        command.add_flag_function(
+            names + ",!--no-" + names.substr(2),
+            [=](int64_t count) { (*settings)[field.key] = count > 0; }, field.about);
+        return;
+    }
+    CLI::Option* option = nullptr;
+    if (field.kind == FieldKind::kTexts) {
+        const auto take = [=](const std::vector<std::string>& texts) {
+            (*settings)[field.key].asArray().assign(texts.begin(), texts.end());
+        };
+        option = command.add_option_function<std::vector<std::string>>(names, take, field.about);
+    } else {
+        const auto take = [=](const std::string& word) {
+            if (field.take != nullptr) {
+                field.take(word, *settings);
+            } else if (field.kind == FieldKind::kNumber) {
+                (*settings)[field.key] = *base::ParseNumber(word, field.max);
+            } else {
+                (*settings)[field.key] = word;
+            }
+        };
+        option = command.add_option_function<std::string>(names, take, field.about);
+    }
+    if (field.kind == FieldKind::kNumber) {
+        const CLI::Validator bounds = programs::Between(field.min, field.max);
+        const bool any = field.min == 0 && field.max == programs::kAnyNumber;
+        option->check(any ? CLI::Validator(bounds).description("") : bounds);
+    }
+    const bool required = field.required || field.take != nullptr;
+    option->option_text(field.value)
+        ->default_str(is_new ? field.unless_given : "")
+        ->required(is_new && required);
+    if (!is_new && !required && field.kind == FieldKind::kTexts) {
+        command
+            .add_flag_callback(
+                "--no-" + names.substr(2), [=] { (*settings)[field.key].asArray().clear(); },
+                "No " + names + " any more")
+            ->excludes(option);
+    }
 }
 
-void AddScheduleOptions(CLI::App& command, programs::ScheduleWords& words, bool required) {
+void AddScheduleOptions(CLI::App& command, programs::ScheduleWords& words, bool is_new) {
     const char* const group = "When it runs";
     command.add_flag("--manual", words.manual, "Only when asked to")->group(group);
     command.add_flag("--on-change", words.on_change, "As soon as something has changed")
@@ -61,7 +102,7 @@ void AddScheduleOptions(CLI::App& command, programs::ScheduleWords& words, bool 
         ->option_text("YYYY-MM-DD")
         ->group(group);
     command.add_option("--at", words.at, "When a day's first run begins")
-        ->default_str(required ? "00:00" : "")
+        ->default_str(is_new ? "00:00" : "")
         ->option_text("HH:MM")
         ->group(group);
     command.add_option("--every", words.every, "Time between a day's runs: 90m, 2h or 1h30m")
@@ -75,43 +116,27 @@ void AddScheduleOptions(CLI::App& command, programs::ScheduleWords& words, bool 
         ->group(group);
 }
 
-// `required`: of a task that does not exist yet.
-void AddTaskOptions(CLI::App& command, TaskArguments& arguments, bool required) {
-    TaskOptions& options = arguments.options;
-    command.add_option("name", arguments.name, "The task's name")->required();
-    command
-        .add_option("--share", options.shares, "The shares, in the order in which they are sent")
-        ->required(required);
-    command.add_option("-s,--server", options.server, "The server's name or address")
-        ->required(required);
-    command.add_option("-u,--user", options.user, "Account on the server")->required(required);
-    command.add_option("--password-file", arguments.password_file,
-                       "File with the account's password ('-': standard input)");
-    command.add_flag("--no-check", arguments.no_check,
-                     "Do not ask the server whether it takes the account and the shares");
-    AddSwitch(command, "ssh", options.ssh, "Carry everything through ssh");
-    command.add_option("--ssh-port", options.ssh_port, "Port of the ssh server")
-        ->default_str(required ? "22" : "")
-        ->check(programs::Between(1, 65535));
-    command
-        .add_option("--timeout", options.timeout, "Give up when nothing moves for so many seconds")
-        ->default_str(required ? "600" : "")
-        ->option_text("SECONDS")
-        ->check(programs::Between(600, 86400));
-    AddSwitch(command, "compress", options.compress, "Compress on the way");
-    AddSwitch(command, "delta", options.delta, "Send only the changed blocks of files");
-    command.add_option("--exclude", arguments.excludes, "rsync patterns of files that stay behind")
-        ->option_text("PATTERN");
-    command.add_option("--bwlimit", options.bandwidth_limit, "Limit in KiB a second (0: none)")
-        ->option_text("KIB")
-        ->check(programs::WholeNumber());
-    AddScheduleOptions(command, options.schedule, required);
-    command.footer(kScheduleHelp);
-}
-
 CLI::App* AddNamed(CLI::App& task, const char* command, const char* about, std::string& name) {
     CLI::App* const added = task.add_subcommand(command, about);
     added->add_option("name", name, "The task's name")->required();
+    return added;
+}
+
+CLI::App* AddChanging(CLI::App& task, const char* command, const char* about,
+                      TaskArguments& arguments, bool is_new) {
+    CLI::App* const added = AddNamed(task, command, about, arguments.name);
+    EditOptions& options = arguments.options;
+    for (const TaskField& field : programs::TaskFields()) {
+        if (field.option != nullptr) {
+            AddSetting(*added, field, options.said, is_new);
+        }
+    }
+    added->add_option("--password-file", options.password_file,
+                      "File with the account's password ('-': standard input)");
+    added->add_flag("--no-check", options.no_check,
+                    "Do not ask the server whether it takes the account and the shares");
+    AddScheduleOptions(*added, arguments.schedule, is_new);
+    added->footer(kScheduleHelp);
     return added;
 }
 
@@ -124,21 +149,18 @@ void DeclareTelling(CLI::App& task, std::string& name, const char* command, cons
 }
 
 void DeclareChanging(CLI::App& task, TaskArguments& arguments) {
-    CLI::App* const add = task.add_subcommand("add", "Add a task");
-    AddTaskOptions(*add, arguments, true);
-    add->callback([&arguments] {
-        AddTask(arguments.name, arguments.Options(), arguments.password_file, !arguments.no_check);
+    AddChanging(task, "add", "Add a task", arguments, true)->callback([&arguments] {
+        AddTask(arguments.name, arguments.Options());
     });
-    CLI::App* const edit =
-        task.add_subcommand("edit", "Change a task; what is not given stays as it is");
-    AddTaskOptions(*edit, arguments, false);
-    edit->add_option("--rename", arguments.new_name, "Another name for it")->option_text("NAME");
-    edit->add_flag("--password", arguments.new_password, "Ask for another password");
-    edit->add_flag("--no-exclude", arguments.no_excludes, "No file stays behind any more");
-    edit->callback([&arguments] {
-        EditTask(arguments.name, arguments.Options(), arguments.new_name, arguments.new_password,
-                 arguments.password_file, !arguments.no_check);
-    });
+    CLI::App* const edit = AddChanging(
+        task, "edit", "Change a task; what is not given stays as it is", arguments, false);
+    edit->add_option_function<std::string>(
+            "--rename",
+            [&arguments](const std::string& name) { arguments.options.said["name"] = name; },
+            "Another name for it")
+        ->option_text("NAME");
+    edit->add_flag("--password", arguments.options.new_password, "Ask for another password");
+    edit->callback([&arguments] { EditTask(arguments.name, arguments.Options()); });
 }
 
 void DeclareRun(CLI::App& task) {
@@ -167,7 +189,7 @@ void DeclareTask(CLI::App& task) {
     DeclareChanging(task, arguments);
     CLI::App* const list = task.add_subcommand("list", "List the tasks");
     list->add_flag("--json", as_json, "Write JSON, for programs");
-    list->callback([] { ListTasks(as_json); });
+    list->callback([] { as_json ? ListTasksAsJson() : ListTasks(); });
 
     CLI::App* const show = AddNamed(task, "show", "Show all of a task", name);
     show->add_flag("--json", as_json, "Write JSON, for programs");
@@ -204,6 +226,25 @@ void DeclareTask(CLI::App& task) {
     CLI::App* const watch = task.add_subcommand("watch", "Show what tasks are doing, until Ctrl-C");
     watch->add_option("name", name, "The task (all)");
     watch->callback([] { WatchTasks(name); });
+}
+
+void DeclareNext(CLI::App& next) {
+    static programs::ScheduleWords words;
+    static NextOptions options;
+    AddScheduleOptions(next, words, true);
+    next.add_option("--count", options.count, "How many runs to show")
+        ->option_text("NUMBER")
+        ->check(programs::Between(1, 1000))
+        ->capture_default_str();
+    next.add_option("--from", options.from,
+                    "Moment to count from, 'YYYY-MM-DD HH:MM' (now unless given)")
+        ->option_text("MOMENT");
+    next.add_flag("--json", options.as_json, "Write JSON, for programs");
+    next.footer(kScheduleHelp);
+    next.callback([] {
+        programs::SayWords(words, options.said);
+        ShowNextRuns(options);
+    });
 }
 
 }  // namespace zelctl

@@ -6,11 +6,15 @@
 
 #include "programs/common/failure.h"
 #include "programs/common/host.h"
+#include "programs/common/schedule_words.h"
+#include "programs/common/task_fields.h"
+#include "programs/common/task_settings.h"
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "programs/zelctl/server/ask.h"
+#include "programs/zelctl/share/commands.h"
 #include "programs/zelctl/task/next.h"
 #include "programs/zelctl/task/view.h"
 
@@ -26,13 +30,9 @@ using ZEL::PObject;
 constexpr std::chrono::seconds kPatience(30);
 constexpr unsigned int kRunsShown = 3;  // after a task has been added or edited
 
-void AskPassword(const std::string& file, ZEL::TaskInfo& info) {
-    ZEL::SyncInfo sync = info.GetSyncInfo();
-    const std::string server =
-        sync.GetServerName().empty() ? sync.GetServerIP() : sync.GetServerName();
-    sync.SetPassword(
-        programs::ReadNewPassword(file, "Password of " + sync.GetUser() + " on " + server + ": "));
-    info.SetSyncInfo(sync);
+std::string AskPassword(const std::string& file, const PObject& task) {
+    return programs::ReadNewPassword(
+        file, "Password of " + task["user"].asString() + " on " + programs::ServerOf(task) + ": ");
 }
 
 // Asks the server, with a password that has just been given, what the first run would ask. A server
@@ -50,7 +50,7 @@ void TryServer(const ZEL::TaskInfo& info, const std::string& done) {
         puts("The server takes the account and the shares.");
         return;
     }
-    const std::string error = Printable(OneLine(refusal->what()));
+    const std::string error = Printable(programs::OneLine(refusal->what()));
     if (refusal->Kind() == FailureKind::kCancelled) {
         throw Failure(FailureKind::kCancelled, "ended by the user; nothing was " + done);
     }
@@ -62,24 +62,11 @@ void TryServer(const ZEL::TaskInfo& info, const std::string& done) {
 }
 
 // A date in the past is no wish for a task.
-void CheckFuture(const TaskOptions& options, const ZEL::Schedule& schedule) {
-    if (options.schedule.once && schedule.GetNextScheduledSeconds(time(nullptr)) == 0) {
+void CheckFuture(const PObject& said, const ZEL::Schedule& schedule) {
+    if (said["schedule_mode"].asUInt32() == ZEL::SCHD_MODE_ONCE &&
+        schedule.GetNextScheduledSeconds(time(nullptr)) == 0) {
         throw Failure(FailureKind::kUsage,
                       "'" + programs::DescribeSchedule(schedule) + "' lies in the past");
-    }
-}
-
-// What there is to do without a schedule's next runs; empty when there are any.
-std::string WithoutRuns(const ZEL::Schedule& schedule, const std::string& name) {
-    switch (schedule.GetMode()) {
-        case ZEL::SCHD_MODE_MANUAL:
-            return "It runs when you ask for it: zelctl task run " + name;
-        case ZEL::SCHD_MODE_REALTIME:
-            return "It runs whenever something changes in its shares.";
-        default:
-            return schedule.GetNextScheduledSeconds(time(nullptr)) == 0
-                       ? "Its schedule is over: no further run will come."
-                       : "";
     }
 }
 
@@ -95,12 +82,7 @@ void ShowStored(const PObject& reply, const char* done) {
     if (!missing_day.empty()) {
         puts(missing_day.c_str());
     }
-    const std::string words = WithoutRuns(schedule, name);
-    if (!words.empty()) {
-        puts(words.c_str());
-        return;
-    }
-    ShowNextRuns(schedule, time(nullptr), kRunsShown, false);
+    ShowNextRuns(schedule, name, kRunsShown, false);
 }
 
 // The daemon's task of that name.
@@ -110,85 +92,56 @@ PObject GetTask(const std::string& name) {
 
 }  // namespace
 
-void AddTask(const std::string& name, const TaskOptions& options, const std::string& password_file,
-             bool check) {
-    CheckTaskName(name);
-    ZEL::TaskInfo info;
-    info.SetName(name);
-    options.ApplyTo(info);
-    CheckFuture(options, info.GetSchedule());
+void AddTask(const std::string& name, const EditOptions& options) {
+    PObject said(options.said);
+    said["name"] = name;
+    programs::TaskSettings task;
+    task.Apply(said);
+    CheckShares(programs::TextsOf(said["share_list"]));
+    CheckFuture(said, task.Info().GetSchedule());
     DaemonConnection().Connect();  // nobody types a password for a daemon that is not there
-    AskPassword(password_file, info);
-    CheckTask(info);
-    if (check) {
-        TryServer(info, "added");
+    said["pswd"] = AskPassword(options.password_file, said);
+    if (!options.no_check) {
+        task.Apply(said);
+        TryServer(task.Info(), "added");
     }
-    PObject request;
-    ZEL::TaskInfo2PObj(info, request);
-    request["command"] = "task_add";
-    if (options.excludes) {
-        request["exclude"] = ToArray(*options.excludes);
-    }
-    ShowStored(AskDaemon(request), "added");
+    said["command"] = "task_add";
+    ShowStored(AskDaemon(said), "added");
 }
 
-void EditTask(const std::string& name, const TaskOptions& options, const std::string& new_name,
-              bool new_password, const std::string& password_file, bool check) {
-    if (!new_name.empty()) {
-        CheckTaskName(new_name);
-    }
-    const PObject shown = GetTask(name);
-    ZEL::SyncTask record;
-    ZEL::PObj2SyncTask(shown, record);
-    ZEL::TaskInfo& info = record.GetInfo();
-    PObject before;
-    ZEL::TaskInfo2PObj(info, before);
-    before["exclude"] = shown["exclude"];
-
-    if (!new_name.empty()) {
-        info.SetName(new_name);
-    }
-    options.ApplyTo(info);
-    CheckFuture(options, info.GetSchedule());
-    const bool has_password = new_password || !password_file.empty();
-    if (has_password) {
-        AskPassword(password_file, info);
-    }
-    // Shares that the task has had before are not looked at: a disk that is away for now must not
-    // keep anybody from changing a time.
-    if (!(info.GetSyncInfo().Validate() && info.GetSchedule().Validate())) {
-        CheckTask(info);
-    }
-    if (check && has_password) {
-        TryServer(info, "changed");
-    }
-    PObject after;
-    ZEL::TaskInfo2PObj(info, after);
-    if (options.excludes) {
-        after["exclude"] = ToArray(*options.excludes);
-    }
-    PObject request = TaskRequest("task_edit", name);
-    bool changed = false;
-    for (const auto& [key, value] : after.asMap()) {
-        if (value.toString() != before[key].toString()) {
-            request[key] = value;
-            changed = true;
+// The request carries what was said alone; what the task is otherwise is looked at only where that
+// cannot be judged, or asked for, without it.
+void EditTask(const std::string& name, const EditOptions& options) {
+    PObject said(options.said);
+    CheckShares(programs::TextsOf(options.said["share_list"]));
+    const bool has_password = options.new_password || !options.password_file.empty();
+    if (has_password || options.said["schedule_mode"].asUInt32() == ZEL::SCHD_MODE_ONCE) {
+        programs::TaskSettings task;
+        task.SetMap(GetTask(name));
+        task.Apply(said);
+        CheckFuture(said, task.Info().GetSchedule());
+        if (has_password) {
+            said["pswd"] = AskPassword(options.password_file, task.ToMap());
+            task.Apply(said);
+        }
+        if (has_password && !options.no_check) {
+            TryServer(task.Info(), "changed");
         }
     }
-    if (!changed) {
+    said["command"] = "task_edit";
+    said["task"] = name;
+    const PObject reply = AskDaemon(said);
+    if (reply["changed"].isInteger() && !reply["changed"].asBool()) {
         printf("Task '%s' is so already.\n", Printable(name).c_str());
         return;
     }
-    ShowStored(AskDaemon(request), "changed");
+    ShowStored(reply, "changed");
 }
 
-void ListTasks(bool as_json) {
+void ListTasksAsJson() {
     PObject request;
     request["command"] = "task_list";
-    if (!as_json) {
-        request["brief"] = 1;
-    }
-    PrintTasks(AskDaemon(request)["tasks"].asArray(), as_json);
+    PrintTasks(AskDaemon(request)["tasks"].asArray());
 }
 
 void ShowTask(const std::string& name, bool as_json) {
@@ -210,13 +163,7 @@ void ShowTaskLog(const std::string& name, unsigned int limit, bool details, bool
 void ShowTaskRuns(const std::string& name, unsigned int count, bool as_json) {
     ZEL::SyncTask record;
     ZEL::PObj2SyncTask(GetTask(name), record);
-    const ZEL::Schedule& schedule = record.GetInfo().GetSchedule();
-    const std::string words = WithoutRuns(schedule, Printable(name));
-    if (!words.empty() && !as_json) {
-        puts(words.c_str());
-        return;
-    }
-    ShowNextRuns(schedule, time(nullptr), words.empty() ? count : 0, as_json);
+    ShowNextRuns(record.GetInfo().GetSchedule(), Printable(name), count, as_json);
 }
 
 void ShowDaemonStatus(bool as_json) {

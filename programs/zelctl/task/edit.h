@@ -1,22 +1,26 @@
 // The commands about tasks; the daemon keeps them.
 #pragma once
 
-#include <optional>
 #include <string>
 
-#include "programs/zelctl/task/options.h"
+#include "ZEL/pobject.h"
 
 namespace zelctl {
 
-/// `password_file`: as programs::ReadPassword takes it. `check`: the server is asked first; a task
-/// that it refuses for good is not added.
-void AddTask(const std::string& name, const TaskOptions& options, const std::string& password_file,
-             bool check);
-/// `new_name` is empty unless the task is to be renamed. The password stays unless `new_password`
-/// or a file is given; `check`: the server is asked with it first.
-void EditTask(const std::string& name, const TaskOptions& options, const std::string& new_name,
-              bool new_password, const std::string& password_file, bool check);
-void ListTasks(bool as_json);
+/// What is said of a task.
+struct EditOptions {
+    ZEL::PObject said;          ///< its settings, by key; what is not said has none
+    std::string password_file;  ///< as programs::ReadPassword takes it
+    bool new_password = false;  ///< of an edit: ask for one
+    bool no_check = false;      ///< do not ask the server first
+};
+
+/// A task that the server refuses for good is not added.
+void AddTask(const std::string& name, const EditOptions& options);
+/// The password stays unless there is a file with one, or it is to be asked for; the server is
+/// asked only then.
+void EditTask(const std::string& name, const EditOptions& options);
+void ListTasksAsJson();
 void ShowTask(const std::string& name, bool as_json);
 /// `command` is one that says no more than the task's name: "task_remove", "task_cancel",
 /// "task_pause" or "task_resume"; `done` what has happened then.

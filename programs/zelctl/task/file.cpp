@@ -1,9 +1,12 @@
 #include "programs/zelctl/task/file.h"
 
-#include <climits>
 #include <nlohmann/json.hpp>
 #include <set>
+#include <utility>
 
+#include "programs/common/failure.h"
+#include "programs/common/task_fields.h"
+#include "programs/common/task_settings.h"
 #include "programs/common/text.h"
 
 namespace zelctl {
@@ -11,130 +14,51 @@ namespace zelctl {
 namespace {
 
 using nlohmann::ordered_json;
+using programs::FieldKind;
+using programs::TaskField;
 using ZEL::PObject;
 
 constexpr char kFormat[] = "zelctl tasks";
 constexpr int kVersion = 1;
-constexpr size_t kMaxText = 65535;  // bytes; what a request to the daemon can carry
-
-enum class Kind { kText, kTexts, kSwitch, kNumber };
-
-struct Field {
-    const char* key;
-    Kind kind;
-    uint64_t min = 0;  // of a number
-    uint64_t max = 0;
-};
-
-constexpr Field kFields[] = {{"name", Kind::kText},
-                             {"share_list", Kind::kTexts},
-                             {"server_name", Kind::kText},
-                             {"server_ip", Kind::kText},
-                             {"user", Kind::kText},
-                             {"pswd", Kind::kText},
-                             {"ssh", Kind::kSwitch},
-                             {"ssh_port", Kind::kNumber, 0, 65535},
-                             {"compress", Kind::kSwitch},
-                             {"block", Kind::kSwitch},
-                             {"rsync_timeout", Kind::kNumber, 600, 86400},
-                             {"max_bandwidth", Kind::kNumber, 0, UINT32_MAX},
-                             {"exclude", Kind::kTexts},
-                             {"schedule_mode", Kind::kNumber, 0, 5},
-                             {"week_schd", Kind::kText},
-                             {"schedule_begin_year", Kind::kNumber, 1970, 9999},
-                             {"schedule_begin_month", Kind::kNumber, 1, 12},
-                             {"schedule_begin_day", Kind::kNumber, 1, 31},
-                             {"schedule_begin_hour", Kind::kNumber, 0, 23},
-                             {"schedule_begin_min", Kind::kNumber, 0, 59},
-                             {"period_hour", Kind::kNumber, 0, 23},
-                             {"period_minute", Kind::kNumber, 0, 59},
-                             {"repeat_times_in_day", Kind::kNumber, 0, 95}};
-
-const Field* FindField(const std::string& key) {
-    for (const Field& field : kFields) {
-        if (key == field.key) {
-            return &field;
-        }
-    }
-    return nullptr;
-}
-
-ordered_json ValueToJson(const Field& field, const PObject& value) {
+ordered_json ToJson(const TaskField& field, const PObject& value) {
     switch (field.kind) {
-        case Kind::kText:
+        case FieldKind::kText:
             return value.asString();
-        case Kind::kSwitch:
+        case FieldKind::kTexts:
+            return programs::TextsOf(value);
+        case FieldKind::kSwitch:
             return value.asBool();
-        case Kind::kNumber:
+        default:
             return value.asInt64();
-        default: {
-            ordered_json texts = ordered_json::array();
-            for (const PObject& text : value.asArray()) {
-                texts.push_back(text.asString());
-            }
-            return texts;
+    }
+}
+
+// Null for what is no value of a setting's kind.
+PObject FromJson(const TaskField& field, const ordered_json& json) {
+    if (field.kind == FieldKind::kSwitch) {
+        return json.is_boolean() ? PObject(json.get<bool>()) : PObject();
+    }
+    if (json.is_number_unsigned()) {
+        return PObject(json.get<unsigned long long>());
+    }
+    if (json.is_string()) {
+        return PObject(json.get<std::string>());
+    }
+    PObject texts;
+    if (json.is_array()) {
+        for (const ordered_json& element : json) {
+            texts.asArray().push_back(FromJson(field, element));
         }
+        texts.asArray();
     }
-}
-
-// What is wrong with a text; empty when nothing is.
-std::string FaultOfText(const ordered_json& json) {
-    if (!json.is_string()) {
-        return "must be a text";
-    }
-    const auto& text = json.get_ref<const std::string&>();
-    if (text.size() > kMaxText) {
-        return "is too long: a text has at most 65535 bytes";
-    }
-    return text.find('\0') == std::string::npos ? "" : "must not hold a zero byte";
-}
-
-// Takes a value over; what is wrong with it, or nothing.
-std::string TakeValue(const Field& field, const ordered_json& json, PObject& value) {
-    std::string fault;
-    switch (field.kind) {
-        case Kind::kText:
-            fault = FaultOfText(json);
-            if (fault.empty()) {
-                value = json.get<std::string>();
-            }
-            break;
-        case Kind::kSwitch:
-            if (!json.is_boolean()) {
-                return "must be true or false";
-            }
-            value = json.get<bool>();
-            break;
-        case Kind::kNumber:
-            if (!json.is_number_unsigned() || json.get<uint64_t>() < field.min ||
-                json.get<uint64_t>() > field.max) {
-                return "must be a whole number from " + std::to_string(field.min) + " to " +
-                       std::to_string(field.max);
-            }
-            value = json.get<uint64_t>();
-            break;
-        case Kind::kTexts:
-            if (!json.is_array()) {
-                return "must be an array of texts";
-            }
-            value.asArray();
-            for (const ordered_json& element : json) {
-                fault = FaultOfText(element);
-                if (!fault.empty()) {
-                    return "each of its elements " + fault;
-                }
-                value.asArray().emplace_back(element.get<std::string>());
-            }
-            break;
-    }
-    return fault;
+    return texts;
 }
 
 /// Reads one task and gathers what is wrong with it.
 class TaskReader {
 public:
     TaskReader(size_t index, std::vector<std::string>& faults)
-        : place_("tasks[" + std::to_string(index) + "]"), faults_(faults) {}
+        : place_("tasks[" + std::to_string(index) + "]"), faults_(faults), before_(faults.size()) {}
 
     PObject Read(const ordered_json& json) {
         PObject task;
@@ -146,28 +70,18 @@ public:
             place_ += " ('" + programs::Printable(json["name"].get<std::string>()) + "')";
         }
         for (const auto& [key, value] : json.items()) {
-            const Field* const field = FindField(key);
+            const TaskField* const field = programs::FindTaskField(key);
             if (field == nullptr) {
                 Fault(key, "is no key of a task");
                 continue;
             }
-            const std::string fault = TakeValue(*field, value, task[key]);
+            task[key] = FromJson(*field, value);
+            const std::string fault = FaultOf(*field, std::as_const(task)[key]);
             if (!fault.empty()) {
                 Fault(key, fault);
             }
         }
-        const PObject& taken = task;
-        for (const char* key : {"name", "share_list", "user"}) {
-            if (!json.contains(key)) {
-                Fault(key, "is missing");
-            } else if (taken[key].isEmpty()) {
-                Fault(key, "is empty");
-            }
-        }
-        if (taken["server_name"].isEmpty() && taken["server_ip"].isEmpty()) {
-            Fault("server_name", "is missing, and so is server_ip");
-        }
-        CheckWeek(taken["week_schd"]);
+        CheckWhole(task);
         return task;
     }
 
@@ -176,16 +90,20 @@ private:
         faults_.push_back(place_ + ": " + (key.empty() ? "" : programs::Printable(key) + " ") +
                           fault);
     }
-    void CheckWeek(const PObject& week) {
-        const std::string days = week.asString();
-        if (week.isString() && (days.size() != 7 || days == "0000000" ||
-                                days.find_first_not_of("01") != std::string::npos)) {
-            Fault("week_schd", "must be seven digits 0 or 1, Sunday first, at least one 1");
+    // Once each value is one by itself.
+    void CheckWhole(const PObject& task) {
+        if (faults_.size() == before_) {
+            try {
+                programs::TaskSettings().Apply(task);
+            } catch (const programs::Failure& failure) {
+                Fault("", failure.what());
+            }
         }
     }
 
     std::string place_;
     std::vector<std::string>& faults_;
+    size_t before_;  // faults of other tasks
 };
 
 }  // namespace
@@ -197,10 +115,9 @@ std::string WriteTaskFile(const PObject::Array& tasks, bool with_passwords) {
     file["tasks"] = ordered_json::array();
     for (const PObject& task : tasks) {
         ordered_json json = ordered_json::object();
-        for (const Field& field : kFields) {
-            const bool is_password = std::string("pswd") == field.key;
-            if (task.hasMember(field.key) && (with_passwords || !is_password)) {
-                json[field.key] = ValueToJson(field, task[field.key]);
+        for (const TaskField& field : programs::TaskFields()) {
+            if (task.hasMember(field.key) && (with_passwords || !field.secret)) {
+                json[field.key] = ToJson(field, task[field.key]);
             }
         }
         file["tasks"].push_back(std::move(json));

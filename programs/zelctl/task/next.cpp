@@ -1,11 +1,13 @@
 #include "programs/zelctl/task/next.h"
 
 #include <algorithm>
+#include <cstdio>
 #include <ctime>
 
 #include "programs/common/failure.h"
 #include "programs/common/schedule_words.h"
 #include "programs/common/table.h"
+#include "programs/common/task_settings.h"
 #include "programs/common/text.h"
 
 namespace zelctl {
@@ -39,60 +41,32 @@ bool ParseMoment(const std::string& text, long& moment) {
     return moment >= 0;
 }
 
-Failure BadValue(const std::string& option, const std::string& value, const char* form) {
-    return {FailureKind::kUsage,
-            "--" + option + ": '" + programs::Printable(value) + "' is not " + form};
+// What there is to do without a schedule's runs after a moment; empty when there are any.
+std::string WithoutRuns(const ZEL::Schedule& schedule, const std::string& name, long after) {
+    switch (schedule.GetMode()) {
+        case ZEL::SCHD_MODE_MANUAL:
+            return "It runs when you ask for it" +
+                   (name.empty() ? "." : ": zelctl task run " + name);
+        case ZEL::SCHD_MODE_REALTIME:
+            return "It runs whenever something changes in its shares.";
+        default:
+            return schedule.GetNextScheduledSeconds(after) == 0
+                       ? "Its schedule is over: no further run will come."
+                       : "";
+    }
 }
 
-}  // namespace
-
-void ShowNextRuns(const NextOptions& options) {
-    ZEL::Schedule schedule;
-    schedule.SetModeByStr(options.mode);
-    if (schedule.GetModeStr() != options.mode) {
-        throw BadValue("mode", options.mode, "manual, realtime, weekly, monthly, yearly or once");
+void Show(const ZEL::Schedule& schedule, const std::string& name, long after, unsigned int count,
+          bool as_json) {
+    const std::string words = WithoutRuns(schedule, name, after);
+    if (!words.empty() && !as_json) {
+        puts(words.c_str());
+        return;
     }
-    if (options.week.size() != 7 || options.week.find_first_not_of("01") != std::string::npos ||
-        options.week == "0000000") {
-        throw BadValue("week", options.week, "seven digits 0 or 1, Sunday first, at least one 1");
-    }
-    const auto begin = ParseDate(options.begin);
-    if (!begin) {
-        throw BadValue("begin", options.begin, "a date YYYY-MM-DD");
-    }
-    const auto start = ParseTimeOfDay(options.start);
-    if (!start) {
-        throw BadValue("start", options.start, "a time HH:MM");
-    }
-    const auto period = ParseTimeOfDay(options.period);
-    if (!period) {
-        throw BadValue("period", options.period, "a time HH:MM");
-    }
-    schedule.SetWeekSchedule(options.week);
-    schedule.SetBeginYear(begin->year);
-    schedule.SetBeginMonth(begin->month);
-    schedule.SetBeginDay(begin->day);
-    schedule.SetStartHour(start->hours);
-    schedule.SetStartMinute(start->minutes);
-    // The count first: a period of 0 then takes it back, as a period without a count would go.
-    schedule.SetRepeatTimesInDay(static_cast<long>(options.repeat));
-    schedule.SetPeriod(period->hours, period->minutes);
-    if (!schedule.Validate()) {
-        throw Failure(FailureKind::kUsage,
-                      "the schedule is not possible: all repeats must fall on the same day");
-    }
-    long moment = 0;
-    if (!ParseMoment(options.from, moment)) {
-        throw BadValue("from", options.from, "a moment 'YYYY-MM-DD HH:MM'");
-    }
-    ShowNextRuns(schedule, moment, options.count, options.as_json);
-}
-
-void ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count, bool as_json) {
     programs::Table table(as_json ? std::vector<programs::Column>{"NEXT RUN", "SECONDS"}
                                   : std::vector<programs::Column>{"NEXT RUN"});
     long moment = after;
-    for (unsigned int i = 0; i < count; ++i) {
+    for (unsigned int i = 0; i < count && words.empty(); ++i) {
         moment = schedule.GetNextScheduledSeconds(moment);
         if (moment < 0) {
             throw Failure("the next run cannot be computed (see the system log)");
@@ -107,6 +81,27 @@ void ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count,
         table.Add(std::move(row));
     }
     table.Print(as_json);
+}
+
+}  // namespace
+
+void ShowNextRuns(const NextOptions& options) {
+    const ZEL::Schedule schedule = programs::ScheduleFrom(options.said);
+    if (!options.said.hasMember("schedule_mode")) {
+        throw Failure(FailureKind::kUsage,
+                      "say when it runs, as for 'zelctl task add': --weekly daily --at 02:00");
+    }
+    long moment = 0;
+    if (!ParseMoment(options.from, moment)) {
+        throw Failure(FailureKind::kUsage, "--from: '" + programs::Printable(options.from) +
+                                               "' is not a moment 'YYYY-MM-DD HH:MM'");
+    }
+    Show(schedule, "", moment, options.count, options.as_json);
+}
+
+void ShowNextRuns(const ZEL::Schedule& schedule, const std::string& name, unsigned int count,
+                  bool as_json) {
+    Show(schedule, name, time(nullptr), count, as_json);
 }
 
 }  // namespace zelctl

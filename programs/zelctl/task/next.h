@@ -2,18 +2,13 @@
 
 #include <string>
 
+#include "ZEL/pobject.h"
 #include "ZEL/sync_obj.h"
 
 namespace zelctl {
 
-/// A schedule as the command line gives it.
 struct NextOptions {
-    std::string mode = "weekly";
-    std::string week = "1111111";
-    std::string begin = "2014-01-01";  ///< YYYY-MM-DD
-    std::string start = "00:00";       ///< HH:MM
-    std::string period = "00:00";      ///< HH:MM between repeats
-    unsigned int repeat = 0;
+    ZEL::PObject said;  ///< of a schedule, by the keys of a task's settings
     unsigned int count = 5;
     std::string from;  ///< "YYYY-MM-DD HH:MM"; empty: now
     bool as_json = false;
@@ -22,7 +17,9 @@ struct NextOptions {
 /// Prints the next runs of the schedule.
 void ShowNextRuns(const NextOptions& options);
 
-/// Prints the runs of a schedule after a moment, `count` at most.
-void ShowNextRuns(const ZEL::Schedule& schedule, long after, unsigned int count, bool as_json);
+/// Prints the next runs of a task, `count` at most, or what there is to say without any. `name` is
+/// printable.
+void ShowNextRuns(const ZEL::Schedule& schedule, const std::string& name, unsigned int count,
+                  bool as_json);
 
 }  // namespace zelctl

@@ -9,7 +9,9 @@
 #include "ZEL/sync_obj.h"
 #include "programs/common/failure.h"
 #include "programs/common/run_progress.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/task_run.h"
+#include "programs/common/task_settings.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
 #include "programs/zelctl/base/interrupt.h"
@@ -152,7 +154,7 @@ private:
                 const int status = task["last_status"].asInt32();
                 return Failed(status == 0 ? FailureKind::kLocal : programs::KindOf(status), name,
                               " failed after " + took_words + ": " +
-                                  Printable(OneLine(task["last_error"].asString())));
+                                  Printable(programs::OneLine(task["last_error"].asString())));
             }
         }
     }
@@ -222,17 +224,13 @@ void ListTaskChanges(const std::vector<std::string>& names) {
         PObject request = TaskRequest("task_show", name);
         request["secrets"] = 1;
         const PObject reply = AskDaemon(request);
-        const PObject& task = reply["task"];
-        ZEL::SyncTask record;
-        ZEL::PObj2SyncTask(task, record);
+        programs::TaskSettings task;
+        task.SetMap(reply["task"]);
         PushOptions options;
-        const auto& shares = record.GetInfo().GetShareList();
-        options.shares.assign(shares.begin(), shares.end());
-        for (const PObject& pattern : task["exclude"].asArray()) {
-            options.excludes.push_back(pattern.asString());
-        }
-        options.connection.server = ServerOf(task);
-        options.info = record.GetInfo().GetSyncInfo();
+        options.shares = programs::TextsOf(reply["task"]["share_list"]);
+        options.excludes = task.ExcludeRules();
+        options.connection.server = programs::ServerOf(reply["task"]);
+        options.info = task.Info().GetSyncInfo();
         options.dry_run = true;
         Push(options);
     }

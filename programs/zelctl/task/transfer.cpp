@@ -6,17 +6,16 @@
 #include <map>
 #include <optional>
 
-#include "ZEL/sync_obj.h"
+#include "ZEL/pobject.h"
 #include "base/replace_file.h"
 #include "base/whole_file.h"
 #include "programs/common/failure.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
 #include "programs/zelctl/share/commands.h"
 #include "programs/zelctl/task/file.h"
-#include "programs/zelctl/task/options.h"
-#include "programs/zelctl/task/view.h"
 
 namespace zelctl {
 
@@ -59,29 +58,14 @@ std::vector<PObject> ReadTasks(const std::string& path) {
     return std::move(file.tasks);
 }
 
-ZEL::TaskInfo ToInfo(const PObject& task) {
-    ZEL::SyncTask record;
-    ZEL::PObj2SyncTask(task, record);
-    return record.GetInfo();
-}
-
 void CheckPossible(const PObject& task) {
-    const ZEL::TaskInfo info = ToInfo(task);
-    CheckTaskName(info.GetName());
-    const std::string name = Printable(info.GetName());
-    if (!info.GetSchedule().Validate()) {
-        throw Failure(FailureKind::kUsage,
-                      "task '" + name +
-                          "': its schedule is not possible: the begin date must be one of the "
-                          "calendar, and all runs of a day must fall on that day");
-    }
     try {
-        CheckShares({info.GetShareList().begin(), info.GetShareList().end()});
+        CheckShares(programs::TextsOf(task["share_list"]));
     } catch (const Failure& failure) {
         programs::Report("zelctl", failure.what());
-        throw Failure(failure.Kind(), "task '" + name + "' is not possible");
+        throw Failure(failure.Kind(),
+                      "task '" + Printable(task["name"].asString()) + "' is not possible");
     }
-    CheckTask(info);
 }
 
 /// The tasks of a file, on their way to the daemon.
@@ -161,7 +145,8 @@ private:
             return;
         }
         const auto before = there_.find(read["name"].asString());
-        if (before != there_.end() && ServerOf(before->second) == ServerOf(read) &&
+        if (before != there_.end() &&
+            programs::ServerOf(before->second) == programs::ServerOf(read) &&
             before->second["user"].asString() == read["user"].asString()) {
             return;  // the daemon has it, and for this very account
         }
@@ -169,7 +154,7 @@ private:
             try {
                 password_ = programs::ReadNewPassword(
                     password_file_, "Password of " + Printable(read["user"].asString()) + " on " +
-                                        Printable(ServerOf(read)) + " (task '" +
+                                        Printable(programs::ServerOf(read)) + " (task '" +
                                         Printable(read["name"].asString()) + "'): ");
             } catch (const Failure& failure) {
                 throw Failure(failure.Kind(),
@@ -188,12 +173,11 @@ private:
 
 // A task of the file that replaces one is whole: what it does not say has its default.
 PObject Whole(const PObject& task) {
-    PObject whole;
-    ZEL::TaskInfo2PObj(ToInfo(task), whole);
-    if (!task.hasMember("pswd")) {
-        whole.asMap().erase("pswd");
+    PObject whole(programs::DefaultSettings());
+    whole.asMap().erase("pswd");
+    for (const auto& [key, value] : task.asMap()) {
+        whole[key] = value;
     }
-    whole["exclude"].asArray() = task["exclude"].asArray();
     return whole;
 }
 

@@ -5,10 +5,9 @@
 #include <iterator>
 #include <nlohmann/json.hpp>
 
-#include "ZEL/sync_obj.h"
 #include "programs/common/run_progress.h"
-#include "programs/common/schedule_words.h"
 #include "programs/common/table.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/text.h"
 
 namespace zelctl {
@@ -20,25 +19,8 @@ using programs::HumanTime;
 using programs::Table;
 using ZEL::PObject;
 
-std::string Joined(const PObject::Array& texts) {
-    std::string joined;
-    for (const PObject& text : texts) {
-        joined += (joined.empty() ? "" : ",") + text.asString();
-    }
-    return joined;
-}
-
-template <typename T>
-std::optional<T> NumberOf(const PObject& value) {
-    return value.isInteger() ? std::optional<T>(static_cast<T>(value.asUInt64())) : std::nullopt;
-}
-
 std::string TimeOf(const PObject& moment, const char* otherwise) {
     return moment.isInteger() ? HumanTime(moment.asInt64()) : otherwise;
-}
-
-std::string OnOff(const PObject& flag) {
-    return flag.asBool() ? "yes" : "no";
 }
 
 /// What there is to say of one thing: a line for each fact, or JSON.
@@ -68,7 +50,7 @@ private:
 ordered_json TaskJson(const PObject& task) {
     ordered_json json = ToJson(task);
     json.erase("pswd");  // never shown, whoever sends it
-    json["schedule"] = ScheduleOf(task);
+    json.erase("row");   // the same in few characters
     json["state"] = programs::TaskStatusWord(task["status"].asInt32());
     json["result"] = programs::TaskResultWord(task["sync_result"].asInt32());
     return json;
@@ -102,53 +84,8 @@ ordered_json RunJson(const PObject& run) {
 
 programs::TaskRow RowOf(const PObject& task) {
     programs::TaskRow row;
-    row.name = task["name"].asString();
-    row.shares = Joined(task["share_list"].asArray());
-    row.server = ServerOf(task);
-    row.schedule = ScheduleOf(task);
-    row.status = task["status"].asInt32();
-    row.result = task["sync_result"].asInt32();
-    row.last_end = NumberOf<int64_t>(task["last_end"]);
-    row.next_run = NumberOf<int64_t>(task["next_run"]);
-    row.retry_in = NumberOf<uint64_t>(task["retry_in"]);
-    if (task["progress_share"].isString()) {
-        row.progress = programs::ProgressState(programs::ProgressOf(task));
-    }
-    row.pending = task["pending"].asUInt64();
-    row.note = task["note"].asString();
-    if (row.result == ZEL::TASK_RESULT_FAILED) {
-        row.error = OneLine(task["last_error"].asString());
-    }
+    programs::UnpackTaskRow(task["row"].asString(), row);
     return row;
-}
-
-std::string ScheduleOf(const PObject& task) {
-    if (task["schedule"].isString()) {
-        return task["schedule"].asString();
-    }
-    ZEL::SyncTask record;
-    ZEL::PObj2SyncTask(task, record);
-    // A list may leave all but the mode out.
-    return task.hasMember("schedule_begin_hour")
-               ? programs::DescribeSchedule(record.GetInfo().GetSchedule())
-               : record.GetInfo().GetSchedule().GetModeStr();
-}
-
-std::string ServerOf(const PObject& task) {
-    std::string name = task["server_name"].asString();
-    return name.empty() ? task["server_ip"].asString() : name;
-}
-
-std::string OneLine(const std::string& text) {
-    std::string line;
-    for (const char c : text) {
-        if (c == '\n') {
-            line += "; ";
-        } else {
-            line += c;
-        }
-    }
-    return line;
 }
 
 std::vector<std::string> TaskLines(const PObject::Array& tasks) {
@@ -158,14 +95,8 @@ std::vector<std::string> TaskLines(const PObject::Array& tasks) {
     return programs::TaskLines(std::move(rows), programs::OutputWidth());
 }
 
-void PrintTasks(const PObject::Array& tasks, bool as_json) {
-    if (as_json) {
-        PrintJson(ListJson(tasks, TaskJson));
-        return;
-    }
-    for (const std::string& line : TaskLines(tasks)) {
-        puts(line.c_str());
-    }
+void PrintTasks(const PObject::Array& tasks) {
+    PrintJson(ListJson(tasks, TaskJson));
 }
 
 void PrintTask(const PObject& task, bool as_json) {
@@ -176,19 +107,11 @@ void PrintTask(const PObject& task, bool as_json) {
     Facts facts;
     facts.Add("name", task["name"].asString());
     facts.Add("id", std::to_string(task["id"].asUInt64()));
-    facts.Add("shares", Joined(task["share_list"].asArray()));
-    facts.Add("server", ServerOf(task));
-    facts.Add("user", task["user"].asString());
-    facts.Add("ssh", task["ssh"].asBool() && task["ssh_port"].asUInt32() != 0
-                         ? "yes, port " + std::to_string(task["ssh_port"].asUInt32())
-                         : OnOff(task["ssh"]));
-    facts.Add("compress", OnOff(task["compress"]));
-    facts.Add("delta", OnOff(task["block"]));
-    facts.Add("time-out", programs::Count(task["rsync_timeout"].asUInt32(), "second"));
-    const uint32_t limit = task["max_bandwidth"].asUInt32();
-    facts.Add("bandwidth limit", limit == 0 ? "none" : std::to_string(limit) + " KiB/s");
-    facts.Add("exclude", Joined(task["exclude"].asArray()));
-    facts.Add("schedule", ScheduleOf(task));
+    for (const programs::TaskField& field : programs::TaskFields()) {
+        if (field.label != nullptr) {
+            facts.Add(field.label, WordsOf(field, task));
+        }
+    }
     facts.Add("next run", TimeOf(task["next_run"], "-"));
     facts.Add("state", programs::TaskStateWords(RowOf(task)));
     if (task["progress_share"].isString()) {
@@ -196,7 +119,7 @@ void PrintTask(const PObject& task, bool as_json) {
                                   programs::ProgressWords(programs::ProgressOf(task)));
     }
     facts.Add("last run", programs::TaskLastRunWords(RowOf(task)));
-    facts.Add("error", OneLine(task["last_error"].asString()));
+    facts.Add("error", programs::OneLine(task["last_error"].asString()));
     facts.Add("pending changes", std::to_string(task["pending"].asUInt64()));
     facts.Add("note", task["note"].asString());
     facts.Print();
@@ -217,7 +140,8 @@ void PrintRuns(const PObject::Array& runs, bool as_json) {
              ended ? programs::TaskResultWord(run["sync_result"].asInt32()) : "running",
              run["reason"].asString(), std::to_string(run["files_sent"].asUInt64()),
              std::to_string(run["files_deleted"].asUInt64()),
-             programs::HumanBytes(run["bytes_sent"].asUInt64()), OneLine(run["error"].asString())});
+             programs::HumanBytes(run["bytes_sent"].asUInt64()),
+             programs::OneLine(run["error"].asString())});
     }
     table.Print(false);
     for (const PObject& run : runs) {

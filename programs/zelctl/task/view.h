@@ -14,16 +14,11 @@ namespace zelctl {
 // show them printable, other places have to.
 
 programs::TaskRow RowOf(const ZEL::PObject& task);
-std::string ScheduleOf(const ZEL::PObject& task);
-/// The server's name, or its address.
-std::string ServerOf(const ZEL::PObject& task);
-/// An error, which may have several lines, as one.
-std::string OneLine(const std::string& text);
 
 /// The list of tasks as this terminal shows it.
 std::vector<std::string> TaskLines(const ZEL::PObject::Array& tasks);
 
-void PrintTasks(const ZEL::PObject::Array& tasks, bool as_json);
+void PrintTasks(const ZEL::PObject::Array& tasks);  ///< as JSON
 void PrintTask(const ZEL::PObject& task, bool as_json);
 void PrintRuns(const ZEL::PObject::Array& runs, bool as_json);
 void PrintDaemonStatus(const ZEL::PObject& status, bool as_json);
