@@ -216,7 +216,7 @@ TEST_F(ServiceTest, WithoutAThreadARunFailsAndIsMadeLater) {
     pthread_attr_t usual;
     pthread_getattr_default_np(&usual);
     pthread_attr_t huge = usual;  // stacks for which there is no memory
-    pthread_attr_setstacksize(&huge, SIZE_MAX / 4);
+    pthread_attr_setstacksize(&huge, SIZE_MAX / 4 * 3);
     pthread_setattr_default_np(&huge);
     RequestRun();
     pthread_setattr_default_np(&usual);
