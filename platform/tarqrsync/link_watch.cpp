@@ -139,8 +139,9 @@ std::vector<pid_t> Descendants(pid_t program) {
     std::vector<pid_t> processes = {program};
     for (size_t i = 0; i < processes.size() && processes.size() < kMaxProcesses; ++i) {
         const std::string pid = std::to_string(processes[i]);
-        const std::string process = "/proc/" + pid;
-        std::ifstream children(process + "/task/" + pid + "/children");
+        std::string path = "/proc/" + pid;
+        path.append("/task/").append(pid).append("/children");
+        std::ifstream children(path);
         for (pid_t child = 0; children >> child;) {
             processes.push_back(child);
         }
