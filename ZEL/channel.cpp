@@ -31,16 +31,16 @@ using base::UniqueFd;
 using std::chrono::steady_clock;
 
 constexpr int kLingerSeconds = 1;
-// What one waited second counts while connecting. A server that is up answers at once, and several
-// addresses may have to be tried within one time-out.
+// Each second of waiting counts as this many while connecting. A server that is up answers at once,
+// and several addresses may have to be tried within one time-out.
 constexpr unsigned int kConnectSecondsPerSlice = 3;
 
-// A block of so many bytes is received where it is wanted: that saves a copy. Reading ahead into
-// the ring saves more for smaller ones.
+// A block of at least this many bytes is received straight into the caller's buffer, which saves a
+// copy. For smaller ones, reading ahead into the ring saves more.
 constexpr unsigned int kLargeRead = 16384;
 
 const char* ResultText(int code) {
-    // The texts as they have always been; index: the code negated.
+    // Fixed texts, indexed by the negated code.
     static const char* const texts[] = {
         "Successful",
         "Interrupted",
@@ -72,7 +72,7 @@ const char* ResultText(int code) {
     return code < RESULT_READ_ONLY || code > 0 ? "Unknown error" : texts[-code];
 }
 
-// What the system lets a program ask for with SO_SNDBUF, in bytes; 0 when it cannot be read.
+// The system's limit for SO_SNDBUF in bytes; 0 when it cannot be read.
 int LargestSendBuffer() {
     static const int largest = [] {
         const UniqueFd file(open("/proc/sys/net/core/wmem_max", O_RDONLY | O_CLOEXEC));
@@ -83,19 +83,18 @@ int LargestSendBuffer() {
     return largest;
 }
 
-// Keeps sender and receiver from waiting for each other. What cannot be set is left as it is.
+// Sets socket options so that sender and receiver do not wait for each other. Failures are ignored.
 void TuneForThroughput(int fd, unsigned int capacity) {
-    // Writes are gathered here already: a message's last small packet must not wait for the
-    // acknowledgement of those before it. Sockets that are no TCP have no such delay, and refuse
-    // the option.
+    // Writes are already batched in the ring, so a message's last small packet must not wait for
+    // the acknowledgement of earlier ones. Sockets other than TCP have no such delay and refuse the
+    // option.
     const int on = 1;
     if (setsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &on, sizeof on) == 0) {
         return;
     }
-    // A unix socket counts as writable while a quarter of its buffer at most is taken. That quarter
-    // shall hold two full rings; the kernel doubles what it is asked for, and cuts it at a limit of
-    // the system first. A buffer that is larger already, as it comes or by the caller's wish,
-    // stays.
+    // A unix socket is writable while at most a quarter of its send buffer is used. That quarter
+    // should hold two full rings. The kernel limits the requested size and then doubles it. A
+    // buffer that is already larger stays as it is.
     const int wanted =
         static_cast<int>(std::min<int64_t>(int64_t{capacity} * 4, LargestSendBuffer()));
     int present = 0;
@@ -202,7 +201,7 @@ int Channel::Open(const char* ip, int port) {
     return RESULT_SUCCESS;
 }
 
-// The destructor comes here too, when what a derived class had overridden is gone with it.
+// Also called by the destructor, when a derived class's overrides are no longer in effect.
 // NOLINTBEGIN(clang-analyzer-optin.cplusplus.VirtualCall)
 void Channel::Close() {
     if (!IsClosed()) {
@@ -400,7 +399,7 @@ int Channel::GetPeerInfo(std::string& ip, int& port) const {
                        strerror(errno));
         return RESULT_INTERRUPTED;
     }
-    // Anything but IPv4 is passed on as a family that cannot be written as text.
+    // Other families than IPv4 are passed on as one that inet_ntop() refuses.
     const int family = peer.ss_family == AF_INET ? AF_INET : AF_UNSPEC;
     const auto* address = reinterpret_cast<const sockaddr_in*>(&peer);
     char text[INET_ADDRSTRLEN] = "";
@@ -515,7 +514,7 @@ void Channel::SwitchChannelOp(int plain) {
     ops_ = plain == 1 ? kPlainOps : kTlsOps;
 }
 
-// Closes what the channel holds and goes on in plain mode with `handle`.
+// Closes the current connection and continues in plain mode with `handle`.
 void Channel::Adopt(void* handle) {
     if (handle_ != nullptr) {
         ops_.close(handle_);

@@ -26,12 +26,11 @@ class PStream;
 /// belong to the service's programs.
 enum ResultCode : int {
     RESULT_SUCCESS = 0,
-    RESULT_INTERRUPTED = -1,  ///< the abort flag was set; a set-up step failed; a closed channel
-    RESULT_IO = -2,      ///< the connection broke or ended, or a value could not be moved in full
-    RESULT_SYSTEM = -3,  ///< a call of the system or of the TLS library failed
-    RESULT_INVALID_ARGUMENT =
-        -4,                ///< a null buffer, a block that is too large, an unusable address
-    RESULT_PROTOCOL = -5,  ///< the peer sent bytes that are no value
+    RESULT_INTERRUPTED = -1,       ///< the abort flag was set; a set-up failed; closed channel
+    RESULT_IO = -2,                ///< the connection broke or ended in the middle of a value
+    RESULT_SYSTEM = -3,            ///< a call of the system or of the TLS library failed
+    RESULT_INVALID_ARGUMENT = -4,  ///< a null buffer, too large a block, an unusable address
+    RESULT_PROTOCOL = -5,          ///< the peer sent bytes that are not a value
     RESULT_AUTHENTICATION = -6,
     RESULT_SERVER = -7,
     RESULT_EVENT_CONFLICT = -8,
@@ -54,8 +53,8 @@ enum ResultCode : int {
     RESULT_READ_ONLY = -25
 };
 
-/// What a channel in one mode does with its handle. `read` and `write` wait for one interval at
-/// most and return a count above 0 or a result code; `flag` is the abort flag.
+/// The operations of one mode of a channel. `read` and `write` wait for one interval at most and
+/// return a count above 0 or a result code; `flag` is the abort flag.
 struct ChannelOps {
     int (*read)(void* handle, char* buffer, unsigned int length, const timeval& interval,
                 const int* flag);
@@ -73,16 +72,15 @@ struct ChannelOps {
 /// served from a second ring. Each wait is made of slices of one second, between which the abort
 /// flag is looked at. A peer that goes away never raises SIGPIPE.
 ///
-/// Urgent data on a TCP connection is an error at the next transfer: no peer of ours sends any. On
-/// a unix socket it is one only where a transfer has to wait: a look before each transfer would
-/// cost as much as the transfer, for what kernels know there only since 5.15.
+/// Urgent data on a TCP connection is an error at the next transfer: our peers never send any. On a
+/// unix socket it is noticed only when a transfer has to wait: checking before each transfer would
+/// cost as much as the transfer itself, and kernels support urgent data there only since 5.15.
 ///
-/// A read looks for bytes for up to 100 microseconds, yielding the processor, before it sleeps: a
-/// peer that answers at once is not slowed down by a sleep and a wake-up. Where bytes keep coming
-/// later than that, up to 255 reads in turn sleep at once.
+/// A read polls for up to 100 microseconds, yielding the processor, before it blocks: a peer that
+/// answers at once then costs no sleep and wake-up. As long as polling is in vain, it is skipped
+/// for up to 255 reads in a row.
 ///
-/// Results are 0 or a ResultCode unless said otherwise. A channel that failed is only good for
-/// Close().
+/// Results are 0 or a ResultCode unless said otherwise. After a failure only Close() is useful.
 ///
 /// Threads: a channel belongs to one thread at a time. Another thread may set the int that the
 /// abort flag points to (an atomic store keeps race detectors quiet).
@@ -106,10 +104,10 @@ public:
     /// otherwise. `setup`: lets close() linger for 1 s and makes the socket non-blocking. -4: the
     /// channel is open, or fd is no descriptor; -3: setup failed.
     virtual int Open(int fd, bool setup);
-    /// Connects to a dotted IPv4 address, in place of a connection that it still has. -2: no
-    /// connection; -3: setup failed. A null address or a negative port opens nothing and gives 0:
-    /// look at IsClosed(). The wait ends with the first answer of the other side, be it a refusal:
-    /// that one shows at the first transfer, as -2.
+    /// Connects to a dotted IPv4 address; an open connection is replaced. -2: no connection; -3:
+    /// setup failed. A null address or a negative port opens nothing and gives 0: look at
+    /// IsClosed(). The wait ends with the peer's first answer, even a refusal, which shows as -2 at
+    /// the first transfer.
     virtual int Open(const char* ip, int port);
     /// Sends what the write ring holds, as long as that makes progress, ends TLS and closes the
     /// socket. The channel can be opened again.
@@ -127,9 +125,9 @@ public:
     ///
     /// A client with SetAllowUntrust(false) accepts only a certificate that GetCAPath() vouches for
     /// and, when a host name is set, only one of that name. The abort flag is not looked at during
-    /// the handshake. -2: set-up or handshake failed; -9: the peer was silent for the time-out;
-    /// -24: the certificate. The channel then is open and plain, and the handshake's bytes are
-    /// lost: close it.
+    /// the handshake. -2: set-up or handshake failed; -9: no message of the handshake was
+    /// completed for the time-out; -24: the certificate. The channel then is open and plain, and
+    /// the handshake's bytes are lost: close it.
     virtual int ConvertToSSLChannel(bool server);
 
     // Read and write integers, most significant byte first. What Read() and Write() return.
@@ -149,7 +147,7 @@ public:
     /// Puts a block into the write ring, sending older bytes when there is no room. -4, and nothing
     /// written, for a block larger than the ring. Nothing else is sent before FlushWrite().
     virtual int Write(const char* data, unsigned int length);
-    /// Forget what was read ahead, or written and not sent.
+    /// Discard what was read ahead, or written and not yet sent.
     virtual void ClearRead();
     virtual void ClearWrite();
     /// Sends at least `count` bytes of the write ring; 0: all that it holds.
@@ -189,7 +187,8 @@ public:
 
     // The TLS files of the process: the server's certificate chain and private key (PEM), and the
     // CA certificates that a client trusts. Any thread may call; a conversion uses what is set when
-    // it starts.
+    // it starts. Certificate and key at the default paths must belong to root or the caller:
+    // anybody may make files there. Better set paths of your own.
     static std::string GetCertPath();  ///< "/tmp/.cloud_certs" unless set
     static void SetCERTPath(const std::string& path);
     static std::string GetKeyPath();  ///< "/tmp/.cloud_server.key" unless set
@@ -220,9 +219,9 @@ private:
         unsigned int size = 0;  // bytes held, from head on, round the end
     };
 
-    // Shortcuts past Write() and Read() for pieces of a few bytes. They do what these would do when
-    // the piece lies in the ring without a break, which is nearly always. Otherwise, and while each
-    // step is traced, they do nothing and the operation itself is to be called.
+    // Fast paths of Write() and Read() for a few bytes that are contiguous in the ring, as they
+    // nearly always are. Otherwise, and while tracing is on, they do nothing, and the caller uses
+    // the operation itself.
     bool CanStore(size_t count) const;
     bool Store(const void* data, size_t count);
     bool Fetch(void* buffer, size_t count);
@@ -240,9 +239,8 @@ private:
     template <typename T>
     int WriteInteger(T value);
 
-    void* handle_ =
-        nullptr;           // plain: a heap cell with the socket; TLS: the TLS object; null: closed
-    ChannelOps ops_ = {};  // the current mode's
+    void* handle_ = nullptr;  // plain: a PlainSocket; TLS: the TLS object; null: closed
+    ChannelOps ops_ = {};     // of the current mode
     Ring write_;
     Ring read_;
     unsigned int capacity_;      // bytes of each ring
@@ -251,7 +249,7 @@ private:
     bool tls_ = false;
     bool allow_untrusted_ = true;
     std::string tls_host_name_;
-    bool shortcuts_ = false;  // open, and of no derived class: that one's own operations are called
+    bool shortcuts_ = false;  // open, and not of a derived class, which may override operations
 };
 
 inline bool Channel::CanStore(size_t count) const {

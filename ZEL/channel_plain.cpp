@@ -15,8 +15,8 @@ int SocketOf(void* handle) {
     return handle == nullptr ? -1 : static_cast<PlainSocket*>(handle)->fd;
 }
 
-// Whether a wait may see urgent data, which ends the connection before anything else is moved. On
-// other sockets a transfer itself tells whether there is something to wait for.
+// Whether the peer can send urgent data, which must be noticed before anything is transferred. On
+// other sockets the transfer itself tells whether it would block.
 bool SeesUrgentData(void* handle) {
     return handle == nullptr || static_cast<PlainSocket*>(handle)->can_be_urgent;
 }
@@ -70,8 +70,8 @@ int ReadFd(void* handle, char* buffer, unsigned int length, const timeval& inter
 int WriteFd(void* handle, const char* data, unsigned int length, const timeval& interval,
             const int* flag) {
     const int fd = SocketOf(handle);
-    // MSG_DONTWAIT: on a descriptor that was left blocking, a large block would wait beyond the
-    // slice.
+    // MSG_DONTWAIT: on a descriptor that was left blocking, a large block would wait for longer
+    // than the slice.
     const auto try_send = [&] {
         errno = 0;
         return send(fd, data, length, MSG_NOSIGNAL | MSG_DONTWAIT);

@@ -14,7 +14,7 @@ namespace ZEL {
 
 namespace {
 
-// What select(2) puts into its sets of the events that poll(2) reports.
+// The events of poll(2) that select(2) would report in each of its sets.
 constexpr short kReadEvents = POLLIN | POLLHUP | POLLERR;
 constexpr short kWriteEvents = POLLOUT | POLLERR;
 
@@ -31,8 +31,7 @@ int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Patien
     const bool reading = watch == Watch::kRead;
     pollfd watched = {fd, static_cast<short>((reading ? POLLIN : POLLOUT) | POLLPRI), 0};
     const auto ask = [&](int milliseconds) {
-        // poll() passes over a negative descriptor and reports one that is not open; both are
-        // errors here.
+        // poll() ignores negative descriptors and reports closed ones; both are errors here.
         const int ready = fd < 0 ? 1 : poll(&watched, 1, milliseconds);
         if (fd < 0 || (ready > 0 && (watched.revents & POLLNVAL) != 0)) {
             errno = EBADF;
@@ -40,7 +39,7 @@ int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Patien
         }
         return ready;
     };
-    // A socket nearly always takes more, and a look is cheaper than a wait.
+    // A socket is nearly always writable, and asking without a time-out is cheaper than waiting.
     for (bool look = !reading || patience != nullptr;; look = false) {
         if (Aborted(flag)) {
             return RESULT_INTERRUPTED;

@@ -8,8 +8,11 @@
 #include <openssl/ssl.h>
 #include <openssl/x509v3.h>
 #include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <chrono>
 #include <memory>
 #include <mutex>
 #include <utility>
@@ -25,6 +28,8 @@ namespace ZEL {
 
 namespace {
 
+using std::chrono::steady_clock;
+
 constexpr char kClientCiphers[] = "RC4-MD5";
 
 template <auto function>
@@ -37,7 +42,7 @@ struct Deleter {
 using OwnedX509 = std::unique_ptr<X509, Deleter<X509_free>>;
 using OwnedNames = std::unique_ptr<GENERAL_NAMES, Deleter<GENERAL_NAMES_free>>;
 
-// A path of the process: the default, below the root folder of the moment, until it is set.
+// A process-wide path: until it is set, the default below the current root folder.
 class PathSetting {
 public:
     explicit PathSetting(const char* default_path) : default_path_(default_path) {}
@@ -51,6 +56,20 @@ public:
         const std::lock_guard<std::mutex> lock(mutex_);
         path_ = path;
         set_ = true;
+    }
+
+    /// The file, safe to use: the default lies in a folder where anybody may have been first, so
+    /// there it must be root's or the caller's own. Empty otherwise.
+    std::string GetOwn() {
+        const std::lock_guard<std::mutex> lock(mutex_);
+        if (set_) {
+            return path_;
+        }
+        const std::string path = TARQ::RootPath(default_path_);
+        struct stat info {};
+        const bool own =
+            lstat(path.c_str(), &info) == 0 && (info.st_uid == 0 || info.st_uid == geteuid());
+        return own ? path : "";
     }
 
 private:
@@ -75,7 +94,7 @@ PathSetting& CaSetting() {
     return setting;
 }
 
-// Nobody sits at the terminal of a daemon: an encrypted key cannot be read.
+// A daemon has no terminal to ask for a passphrase: encrypted keys are refused.
 int RefusePassphrase(char*, int, int, void*) {
     return 0;
 }
@@ -88,13 +107,12 @@ bool NewContext(SSL_CTX*& ctx, const SSL_METHOD* method) {
                        "[WARNING] ZEL/channel(%d): m_ssl_ctx created failed\n", __LINE__);
         return false;
     }
-    // A retried write may come from another place of the ring, and each record that went out is
-    // progress.
+    // A retried write may come from another place in the ring, and each record that was sent counts
+    // as progress.
     SSL_CTX_set_mode(ctx, SSL_MODE_ENABLE_PARTIAL_WRITE | SSL_MODE_ACCEPT_MOVING_WRITE_BUFFER);
-    // A peer that begins a new handshake in mid-stream would make writes wait for something to
-    // read.
+    // Renegotiation by the peer would make writes wait for reads.
     SSL_CTX_set_options(ctx, SSL_OP_NO_RENEGOTIATION);
-    // Several records with one call of the system.
+    // Reads several records with one system call.
     SSL_CTX_set_read_ahead(ctx, 1);
     SSL_CTX_set_default_read_buffer_len(ctx, size_t{4} * SSL3_RT_MAX_PACKET_SIZE);
     SSL_CTX_set_default_passwd_cb(ctx, RefusePassphrase);
@@ -119,15 +137,14 @@ bool SetUpServer(SSL*& ssl, SSL_CTX*& ctx) {
                        "[WARNING] ZEL/channel(%d): Open: init ssl certificate failed\n", __LINE__);
         return false;
     }
-    // The check finds a key of another kind than the certificate's, which loads without complaint.
+    // A key of another type than the certificate's loads without an error; only the check finds it.
     if (Channel::InstallPriKey(ctx) != 0 || SSL_CTX_check_private_key(ctx) != 1) {
         Logger::LogMsg(Logger::LEVEL_WARNING,
                        "[WARNING] ZEL/channel(%d): Open: init ssl private key failed\n", __LINE__);
         return false;
     }
-    // Every connection has a context of its own: no session is ever resumed. A ticket would only
-    // wait unread in the socket of a client that sends and closes, and so turn its close into a
-    // reset.
+    // Each connection has its own context, so sessions are never resumed and tickets are useless.
+    // An unread ticket would also turn the close of a client that only sends into a reset.
     SSL_CTX_set_num_tickets(ctx, 0);
     if (!NewTlsObject(ssl, ctx)) {
         return false;
@@ -145,7 +162,8 @@ bool SetUpClient(SSL*& ssl, SSL_CTX*& ctx, bool allow_untrusted) {
             Logger::LEVEL_WARNING,
             "[WARNING] ZEL/channel(%d): can't set cipher suit to SSL3_TXT_RSA_RC4_128_MD5\n",
             __LINE__);
-        // The refused list has already taken the place of the defaults for TLS 1.2 and below.
+        // The refused list has already replaced the default ciphers of TLS 1.2 and below: start
+        // over.
         if (!NewContext(ctx, TLS_client_method())) {
             return false;
         }
@@ -158,7 +176,7 @@ bool SetUpClient(SSL*& ssl, SSL_CTX*& ctx, bool allow_untrusted) {
                        "[WARNING] ZEL/channel(%d): InitSSL(): set Verify store fail\n", __LINE__);
         return false;
     }
-    // The chain is checked all the same; its result is looked at after the handshake.
+    // The chain is verified anyway; the result is checked after the handshake.
     SSL_set_verify(ssl, SSL_VERIFY_NONE, nullptr);
     SSL_set_connect_state(ssl);
     return true;
@@ -168,7 +186,7 @@ bool WantsRetry(int error) {
     return error == SSL_ERROR_WANT_READ || error == SSL_ERROR_WANT_WRITE;
 }
 
-// After a fatal error nothing may be sent any more: the later shutdown then is a quiet one.
+// After a fatal error nothing may be sent any more, so the later shutdown must be a quiet one.
 void ForbidAlerts(SSL* ssl, int error) {
     if (error == SSL_ERROR_SSL || error == SSL_ERROR_SYSCALL) {
         SSL_set_quiet_shutdown(ssl, 1);
@@ -198,13 +216,20 @@ int WaitForHandshake(SSL* ssl, Watch watch, const timeval& interval) {
     return RESULT_SUCCESS;
 }
 
+// Only a complete handshake message counts as progress, and there are few of them. Single bytes do
+// not: a peer could send one at a time and hold the caller for as long as it likes.
 int SSLHandshake(SSL* ssl, const timeval& interval, unsigned int timeout) {
-    int64_t elapsed = 0;
+    auto last_progress = steady_clock::now();
+    OSSL_HANDSHAKE_STATE state = SSL_get_state(ssl);
     for (;;) {
         ERR_clear_error();
         const int step = SSL_do_handshake(ssl);
         if (step == 1) {
             return RESULT_SUCCESS;
+        }
+        if (SSL_get_state(ssl) != state) {
+            state = SSL_get_state(ssl);
+            last_progress = steady_clock::now();
         }
         const int error = SSL_get_error(ssl, step);
         if (step == 0) {
@@ -223,20 +248,15 @@ int SSLHandshake(SSL* ssl, const timeval& interval, unsigned int timeout) {
         }
         const int result = WaitForHandshake(
             ssl, error == SSL_ERROR_WANT_READ ? Watch::kRead : Watch::kWrite, interval);
-        if (result == RESULT_SUCCESS) {
-            elapsed = 0;
-        } else if (result != RESULT_TIMEOUT) {
+        if (result != RESULT_SUCCESS && result != RESULT_TIMEOUT) {
             return result;
-        } else {
-            elapsed += interval.tv_sec;
-            if (timeout != 0 && elapsed >= int64_t{timeout}) {
-                Logger::LogMsg(
-                    Logger::LEVEL_WARNING,
-                    "[WARNING] ZEL/channel(%d): SSLHandshake: timed out during connect (%d "
-                    "seconds), abort anyway\n",
-                    __LINE__, static_cast<int>(timeout));
-                return RESULT_TIMEOUT;
-            }
+        }
+        if (timeout != 0 && steady_clock::now() - last_progress >= std::chrono::seconds(timeout)) {
+            Logger::LogMsg(Logger::LEVEL_WARNING,
+                           "[WARNING] ZEL/channel(%d): SSLHandshake: timed out during connect (%d "
+                           "seconds), abort anyway\n",
+                           __LINE__, static_cast<int>(timeout));
+            return RESULT_TIMEOUT;
         }
     }
 }
@@ -300,11 +320,11 @@ int TlsSocket(void* handle) {
     return handle == nullptr ? -1 : SSL_get_fd(static_cast<SSL*>(handle));
 }
 
-// What a read that gave no bytes comes to.
+// The result code of a read that returned no bytes.
 int ReadFailure(SSL* ssl, int count) {
     const int error = SSL_get_error(ssl, count);
     if (WantsRetry(error)) {
-        // The peer's record has not arrived in full, or was none with data in it.
+        // The record is incomplete, or it carried no data.
         Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): SSL want read", __LINE__);
         return RESULT_TIMEOUT;
     }
@@ -313,8 +333,8 @@ int ReadFailure(SSL* ssl, int count) {
     return RESULT_IO;
 }
 
-// As SSL_read(), but of full records as many as are there. A failure behind the first one shows
-// again at the next call.
+// Like SSL_read(), but reads all full records that are available. A failure after the first one
+// shows again at the next call.
 int ReadRecords(SSL* ssl, char* buffer, int length) {
     ERR_clear_error();
     int total = 0;
@@ -334,7 +354,8 @@ int SSLReadFd(void* handle, char* buffer, unsigned int length, const timeval& in
         return result;
     }
     const bool decrypted = ssl != nullptr && SSL_pending(ssl) > 0;
-    // What was read ahead may hold a whole record, which no wait would see.
+    // Bytes that were read ahead may hold a complete record, which waiting for the socket would
+    // miss.
     bool look = ssl != nullptr && SSL_has_pending(ssl) != 0;
     int count = 0;
     do {
@@ -369,8 +390,8 @@ int SSLWriteFd(void* handle, const char* data, unsigned int length, const timeva
     }
     ERR_clear_error();
     errno = 0;
-    // One wait serves all the records that the socket takes. A failure behind the first one shows
-    // again at the next call.
+    // Writes as many records as the socket takes after one wait. A failure after the first one
+    // shows again at the next call.
     int total = 0;
     int count = 0;
     do {
@@ -500,7 +521,7 @@ int Channel::InstallCERT(SSL_CTX* ctx) {
     const std::string path = GetCertPath();
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/channel(%d): cert path = %s\n", __LINE__,
                    path.c_str());
-    if (SSL_CTX_use_certificate_chain_file(ctx, path.c_str()) != 1) {
+    if (SSL_CTX_use_certificate_chain_file(ctx, CertSetting().GetOwn().c_str()) != 1) {
         Logger::LogMsg(Logger::LEVEL_WARNING,
                        "[WARNING] ZEL/channel(%d): Install certificate failed\n", __LINE__);
         return -1;
@@ -509,7 +530,7 @@ int Channel::InstallCERT(SSL_CTX* ctx) {
 }
 
 int Channel::InstallPriKey(SSL_CTX* ctx) {
-    if (SSL_CTX_use_PrivateKey_file(ctx, GetKeyPath().c_str(), SSL_FILETYPE_PEM) != 1) {
+    if (SSL_CTX_use_PrivateKey_file(ctx, KeySetting().GetOwn().c_str(), SSL_FILETYPE_PEM) != 1) {
         Logger::LogMsg(Logger::LEVEL_WARNING,
                        "[WARNING] ZEL/channel(%d): Install private key failed\n", __LINE__);
         return -1;
@@ -533,7 +554,7 @@ void Channel::DeinitSSL(SSL*& ssl, SSL_CTX*& ctx, bool quiet) {
         if (quiet) {
             SSL_set_quiet_shutdown(ssl, 1);
         }
-        // Told once, the peer's answer is not waited for: the socket is closed next.
+        // Sends our close notification without waiting for the peer's: the socket is closed next.
         SSL_shutdown(ssl);
         SSL_free(ssl);
     }

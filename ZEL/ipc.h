@@ -60,7 +60,8 @@ public:
     /// descriptor, which the caller owns, or -1.
     int OpenSocket(int port);
     int OpenDomainSocket(const std::string& path);
-    /// Close a listening socket; the second also removes its socket file. 0, or -1 when fd is none.
+    /// Close a listening socket; the second also removes its socket file. 0, or -1 when fd is not a
+    /// descriptor.
     int CloseSocket(int fd);
     int CloseDomainSocket(int fd);
 

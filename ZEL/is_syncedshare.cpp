@@ -35,8 +35,7 @@ bool CreateFile(const std::string& path, int flags, mode_t mode) {
     return true;
 }
 
-/// The key of the writers' semaphore; 0, which cannot be opened, when there is no memory to work it
-/// out.
+/// The key of the writers' semaphore; 0, which cannot be opened, when memory runs out.
 int SemaphoreKey() noexcept {
     try {
         return TARQ::RootSemaphoreKey(kSemaphoreKey);
@@ -228,7 +227,7 @@ int TARQUISetZEL(int enable, const char* clientID, const char* serverName) {
     if (pairing == nullptr) {
         return -1;
     }
-    // What stays as it is is left out: somebody may change it before the merge has the lock.
+    // Unchanged keys are left out: another process may change them before the merge takes the lock.
     KAPICHashRemoveAll(pairing.get());
     if (clientID != nullptr && serverName != nullptr &&
         !SetPair(pairing.get(), clientID, serverName)) {

@@ -18,7 +18,7 @@ constexpr size_t kIdentityCharacters = 36;  // how much of two identities is com
 
 enum class Verdict { kFree, kHeld, kFailed };
 
-/// Whether `name` in lower case is `lowered`, as far as names count.
+/// Whether `name` in lower case equals `lowered`, over the significant length of names.
 bool IsSpelling(const char* name, const char (&lowered)[kNameCharacters + 1]) {
     for (int i = 0; i < kNameCharacters; ++i) {
         if (base::Lower(name[i]) != lowered[i]) {
@@ -130,7 +130,7 @@ int ZELCheckIfSharePaired(KAPICSzList shares, const char* clientID, KAPICSzList*
         if (verdict == Verdict::kFailed) {
             return ZEL_PAIR_READ_FAILED;
         }
-        // A refusal that cannot be told must not pass for an admission.
+        // A refusal that cannot be reported must not be taken for an admission.
         if (verdict == Verdict::kHeld &&
             KAPICSzListPush(*refused, share != nullptr ? share : "") < 0) {
             return ZEL_PAIR_READ_FAILED;

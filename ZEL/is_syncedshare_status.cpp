@@ -41,8 +41,8 @@ char* CopyOf(KAPICSzHash hash, const char* key) {
     return value != nullptr ? KAPICStrGet("%s", value) : nullptr;
 }
 
-/// Whether a task's status is a time less than two minutes ago. Both times count modulo 2^32, so
-/// that their difference holds where time_t has 32 bits and where it has 64.
+/// Whether a task's status is a time less than two minutes ago. Both are taken modulo 2^32, so that
+/// the difference is right for 32-bit and 64-bit time_t.
 bool IsRecent(const char* status) {
     const auto then = static_cast<uint32_t>(strtoll(status, nullptr, 10));
     const auto age = static_cast<int32_t>(static_cast<uint32_t>(time(nullptr)) - then);
@@ -137,7 +137,7 @@ int zel_svr_reset_pair(void) {
         return -1;
     }
     AddClientSection(pairing.get());
-    // The other keys stay as the file has them: the merge keeps what it is not given.
+    // The merge keeps the keys that it is not given.
     KAPICHashRemoveAll(pairing.get());
     if (!SetPair(pairing.get(), kMultiSource, kMultiSource)) {
         return -1;

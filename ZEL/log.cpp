@@ -1,9 +1,11 @@
 #include "ZEL/log.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <stdarg.h>
 #include <syslog.h>
 #include <time.h>
+#include <unistd.h>
 
 namespace ZEL {
 
@@ -13,10 +15,22 @@ constexpr int kDefaultLevel = Logger::LEVEL_ERROR;
 constexpr int kDefaultRotateCount = 50;
 constexpr int32_t kRotateAbove = 0x100000;  // bytes; small enough to read, large enough for a day
 
-// Where the two rotation complaints are said to come from.
+// The places that the two messages about rotation name.
 constexpr char kSource[] = "ZEL/log";
 constexpr int kRenameLine = 145;
 constexpr int kRemoveLine = 152;
+
+// Opened for appending. A file that is made is nobody else's to read, whatever the umask: what it
+// says is about other people's files.
+FILE* OpenLog(const std::string& path) {
+    const int fd =
+        open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC | O_LARGEFILE, 0640);
+    FILE* const file = fd < 0 ? nullptr : fdopen(fd, "a");
+    if (fd >= 0 && file == nullptr) {
+        close(fd);
+    }
+    return file;
+}
 
 class MutexGuard {
 public:
@@ -29,7 +43,7 @@ private:
     pthread_mutex_t* mutex_;
 };
 
-// A caller that logs between a failed call and its own look at errno finds errno as it was.
+// Keeps errno: callers log between a failed call and their own use of errno.
 class ErrnoKeeper {
 public:
     ErrnoKeeper() : saved_(errno) {}
@@ -99,7 +113,7 @@ int Logger::Initialize(Type type, int level, const std::string& path, int rotate
     if (path.empty()) {
         return -1;
     }
-    FILE* file = fopen64(path.c_str(), "ae");
+    FILE* file = OpenLog(path);
     if (file == nullptr) {
         return -1;
     }
@@ -204,7 +218,7 @@ int Logger::Rotate() {
     if (rename(log_path.c_str(), RotatedName(log_path, 0).c_str()) != 0) {
         return -1;
     }
-    log_fp = fopen64(log_path.c_str(), "ae");
+    log_fp = OpenLog(log_path);
     return log_fp == nullptr ? -1 : 0;
 }
 

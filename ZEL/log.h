@@ -46,7 +46,8 @@ public:
     ///
     /// `path` and `rotate_cnt` count only for a file: lines are appended to `path`, and after a
     /// rotation `path`_0 (the newest) to `path`_(rotate_cnt - 2) hold the older lines. What the
-    /// file already holds does not count towards its size. Any type but 0, 1 and 2 means a file.
+    /// file already holds does not count towards its size. A file that is made has mode 0640 at
+    /// most. Any type but 0, 1 and 2 means a file.
     ///
     /// Returns 0, or -1 when the path is empty or the file cannot be opened; type and level are set
     /// all the same, and the stream of an earlier call stays in use. May be called again to switch;

@@ -10,7 +10,8 @@ namespace ZEL {
 
 namespace {
 
-// So many levels of containers are freed by recursion, which is quick; what lies deeper, by a loop.
+// Containers are freed by recursion, which is fast, down to this many levels, and by a loop below
+// them.
 constexpr int kLevelsByRecursion = 32;
 thread_local int levels_being_freed = 0;
 
@@ -24,9 +25,8 @@ PObject::PObject(const std::string& value) : type_(TYPE_STRING), value_(new std:
 PObject::PObject(const char* value)
     : type_(TYPE_STRING), value_(new std::string(value == nullptr ? "" : value)) {}
 
-// A list of work instead of recursion: a copy must not need more stack than the value it copies
-// did. The delegation makes this a whole object before the first allocation, so that a failing one
-// frees the rest.
+// A work list instead of recursion, so that deeply nested values can be copied. The delegated
+// constructor completes the object first, so that the destructor runs when an allocation fails.
 PObject::PObject(const PObject& other) : PObject() {
     std::vector<std::pair<const PObject*, PObject*>> containers;
     const auto copy_one = [&containers](const PObject& from, PObject& to) {
@@ -157,8 +157,8 @@ void PObject::clear() noexcept {
     }
 }
 
-// Frees a container of any depth with neither recursion nor memory: on the way down, the slot that
-// a container was taken from keeps the container above, until the way up leads there again.
+// Frees a container of any depth without recursion and without allocating: on the way down, the
+// slot that a child was taken from stores the parent, where the way up finds it again.
 void PObject::clearByLoop() noexcept {
     PObject node;
     PObject parent;
@@ -178,9 +178,9 @@ void PObject::clearByLoop() noexcept {
     }
 }
 
-// The first child that is a container, counted from the end that is cheap to take from; the
-// children before it are gone, so that firstSlot() finds it again. Null, and nothing gone, when no
-// child is a container.
+// Finds a child that is a container, starting at the end where removing is cheap, and removes the
+// children that it passes, so that firstSlot() finds the same child again. Null, with nothing
+// removed, when no child is a container.
 PObject* PObject::findContainer() {
     if (isMap()) {
         Map& map = get<Map>();
@@ -297,7 +297,7 @@ PObject& PObject::operator[](const std::string& key) {
     if (isMap()) {
         return get<Map>()[key];
     }
-    // The key may be a part of the value that goes.
+    // The key may be part of the value that is freed here.
     Map fresh;
     PObject& entry = fresh[key];
     become<Map>().swap(fresh);

@@ -1,4 +1,4 @@
-// The service's one dynamic value.
+// The service's dynamic value type.
 //
 // Every message between the service's processes is a PObject, and tasks are turned into PObjects
 // and back. Reading never fails: a read of the wrong type gives 0, an empty string or a shared
@@ -165,7 +165,7 @@ private:
     // The value, after becoming an empty T if it was of another type.
     template <typename T>
     T& become();
-    // Replaces the value by `value`, which is whole before the old one is freed.
+    // Replaces the value; the new one is complete before the old one is freed.
     template <typename T>
     PObject& copy(T value);
 

@@ -7,7 +7,7 @@
 #include "ZEL/log.h"
 #include "tarq/owners.h"
 
-// The texts name the place in this file that speaks, but for two that say a number of their own.
+// Log messages contain a line number of this file, except for two with fixed numbers.
 #define LOG_ERROR_AT(line, text, ...) \
     Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] ZEL/rsyncer(%d): " text "\n", line, ##__VA_ARGS__)
 #define LOG_ERROR(text, ...) LOG_ERROR_AT(__LINE__, text, ##__VA_ARGS__)
@@ -22,7 +22,7 @@ namespace {
 using Lines = std::list<std::string>;
 using Params = std::list<std::pair<std::string, std::string>>;
 
-// Statuses of the wrapper and of the server that the driver tells apart.
+// Statuses of the wrapper and of the server that the driver distinguishes.
 constexpr int kDone = 0;
 constexpr int kLookupFailed = 42;
 constexpr int kUnknownCommand = 43;
@@ -245,8 +245,8 @@ void Rsyncer::InitRsyncTask(RsyncTask& task, bool is_test) const {
     }
 }
 
-// Runs a command whose lines a builder has made with the result `built`. `sender` is who says that
-// it failed.
+// Runs a command whose lines were built with the result `built`. `sender` is named in the log line
+// of a failure.
 int Rsyncer::SendCommand(const char* sender, int built, const Lines& lines, bool is_test,
                          int& status) const {
     if (built != 0) {
@@ -319,7 +319,8 @@ int Rsyncer::TestServer() {
             syncInfo.SetServerIP(configured_ip);
             continue;
         }
-        // One that answers but tells no version stays in place while the next is tried.
+        // A server that answers but sends no version stays selected while the next address is
+        // tried.
         GetServerVersion();
         if (serverVersion >= 0) {
             LOG_INFO("Get server version [%d]", serverVersion);
@@ -349,7 +350,7 @@ int Rsyncer::DoPairing(bool dry_run, const std::list<std::string>& shares,
             LOG_ERROR("Fail to get share info of '%s'", share.c_str());
             return -1;
         }
-        // One is enough: the shares behind it are not looked up.
+        // One is enough: the remaining shares are not looked up.
         if (info.IsEncrypted()) {
             require_encryption = true;
             break;
@@ -454,7 +455,7 @@ int Rsyncer::SyncEncryptKey(const std::string& share_name) const {
     InitRsyncTask(task, false);
     task.SetCompression(syncInfo.UseCompression());
     task.SetBlockLevelSync(syncInfo.UseBlockLevelSync());
-    // A key never travels in the clear, whatever the task says.
+    // An encryption key is never sent in the clear, whatever the task says.
     task.SetSSH(true);
     task.SetServerPort(syncInfo.GetSSHPort());
     return task.Execute(key_path, kServerKeyFolder, cancelChecker, share_name, {});
@@ -537,7 +538,7 @@ int Rsyncer::RunSync(uint64_t /*task_id*/, const std::string& share_name, const 
     task.SetSyncACL(true);
     std::string source = info.GetModulePath() + "/";
     if (path != "/") {
-        // rsync keeps what stands behind the "/./" as the path at the server.
+        // rsync uses the part after "/./" as the path at the server.
         source += "." + path;
         task.SetRelativePath(true);
     }

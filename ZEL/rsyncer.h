@@ -97,18 +97,20 @@ public:
     int Initialize(const SyncInfo& info);
     /// Does nothing; an Rsyncer keeps what it learned.
     void Clear();
-    /// Asked during every run from now on; null: the task's canceller is, if it has one.
+    /// The function that is asked during every run from now on; null: the task's own canceller is
+    /// used, if any.
     void SetCancelChecker(CancelChecker checker);
-    /// Called with every task from now on, once that has the settings: gives it what no setting
-    /// says, such as a canceller, or what the host's wrapper can do besides. Empty: nothing.
+    /// A function that is called with every task from now on, after the settings were applied, to
+    /// add what they do not cover: a canceller, or other abilities of the host's wrapper. Empty:
+    /// none.
     void SetTaskSetup(std::function<void(RsyncTask&)> setup);
     /// True when the server pairs several sources share by share. Known after Initialize.
     bool SupportMultiSource() const;
     SyncInfo GetSyncInfo() const;
     /// The address that the last Initialize settled on.
     std::string GetLatestIP() const;
-    /// Configures a task for the settings held here, then by the task set-up. `is_test` keeps the
-    /// run out of rsync's debug log.
+    /// Configures a task with the settings held here, then with the task set-up function. `is_test`
+    /// keeps the run out of rsync's debug log.
     void InitRsyncTask(RsyncTask& task, bool is_test) const;
 
     // ---- Finding the server ----

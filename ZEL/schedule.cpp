@@ -17,27 +17,27 @@ constexpr char kNoDay[] = "0000000";
 constexpr int kLastSecondOfDay = 86399;
 constexpr int kMaxRepeatTimes = 95;  // a run each quarter of an hour
 
-// A valid schedule finds its run within a few candidate days. One that can never find any (a
-// negative repeat count, an hour years before the day) gives up here.
+// The search's limit: a valid schedule finds a run within a few candidate days; an invalid one (a
+// negative repeat count, an hour years before the day) might never find any.
 constexpr int kMaxCandidateDays = 400;
 
 // By mode.
 constexpr const char* kModeTexts[] = {"manual", "realtime", "weekly", "monthly", "yearly", "once"};
 
-// A field of a broken-down time that does not fit is as far away as the type goes, where mktime()
-// refuses it.
+// A value that does not fit a field of struct tm becomes the limit of the field's type, which
+// mktime() refuses.
 int ClampToInt(int64_t value) {
     return static_cast<int>(std::clamp<int64_t>(value, INT_MIN, INT_MAX));
 }
 
-// As mktime(). Times are handed out as long: what that does not hold is no time here, however wide
-// time_t is.
+// Like mktime(). Times are returned as long: a result that does not fit is a failure, even where
+// time_t is wider.
 long MakeTime(struct tm& time) {
     long seconds = 0;
     return __builtin_add_overflow(mktime(&time), 0, &seconds) ? -1 : seconds;
 }
 
-// `what`: which seconds could not be had.
+// `what`: which time could not be computed, for the log.
 void LogTime(const char* what, const struct tm& time) {
     Logger::LogMsg(
         Logger::LEVEL_ERROR,
@@ -51,8 +51,8 @@ bool IsSameDate(const struct tm& a, const struct tm& b) {
     return a.tm_mday == b.tm_mday && a.tm_mon == b.tm_mon && a.tm_year == b.tm_year;
 }
 
-// Moves `day` to the candidate day that its date leads to; its time of day stays. False when there
-// is none.
+// Moves `day` to the candidate day for its date and keeps the time of day. False when there is
+// none.
 bool AlignToScheduledDay(SCHD_MODE mode, const std::string& week, const struct tm& begin,
                          struct tm& day) {
     switch (mode) {
@@ -203,7 +203,7 @@ bool Schedule::Validate() const {
                        __LINE__);
         return false;
     }
-    // The setter lets no such week in, but a schedule that was moved from has an empty one.
+    // The setter never stores such a week, but a moved-from schedule has an empty one.
     if (week_schedule_.size() != kDaysInWeek) {
         Logger::LogMsg(Logger::LEVEL_NOTE,
                        "[NOTE] ZEL/sync_obj(%d): Wrong length of weekday '%s'\n", __LINE__,
@@ -235,9 +235,9 @@ long Schedule::GetNextScheduledSeconds(long reference) const {
     }
     const struct tm begin = GetScheduleBegin();
     // Where the search for a day starts: the reference, then the midnight after each day that has
-    // no run left. One mktime() costs more than all the rest here, so none is asked for what is
-    // known: `now` comes normalised from localtime_r(), and a candidate day on the date of `now` is
-    // `now`, to the second.
+    // no run left. mktime() costs more than all the rest here, so it is not called for what is
+    // already known: `now` comes normalised from localtime_r(), and a candidate day on the date of
+    // `now` is `now`, to the second.
     struct tm now = {};
     long now_seconds = reference;
     const time_t moment = reference;
@@ -284,8 +284,8 @@ long Schedule::GetNextScheduledSeconds(long reference) const {
                 }
             }
         }
-        // The day keeps the daylight flag that it was reached with: a start on the far side of a
-        // change moves by it.
+        // The day keeps the daylight-saving flag of the date that it was computed from: a start on
+        // the other side of a change is shifted by it.
         struct tm first = day;
         first.tm_hour = start_hour_;
         first.tm_min = start_minute_;

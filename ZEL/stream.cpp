@@ -17,21 +17,42 @@ namespace ZEL {
 
 namespace {
 
+// The value under this key (see sync_obj.h) is a password: it is kept out of the log.
+constexpr std::string_view kPasswordKey = "pswd";
+
 constexpr size_t kIndentLevels = 11;  // deeper levels of the trace are not indented further
 constexpr char kIndent[] = "                      ";
 static_assert(sizeof kIndent - 1 == 2 * kIndentLevels);
 
-// A received string grows by so many bytes at a time, so that a length costs memory only as its
-// bytes arrive.
+// A received string grows in steps of this many bytes: memory is used only as bytes arrive, not for
+// an announced length.
 constexpr size_t kStringStep = 4096;
 
-// Many arrays are no longer.
+// Room reserved for a new array: many have no more elements.
 constexpr size_t kUsualLength = 4;
 
-// Most messages are no deeper.
+// Estimates of the memory that values take, the allocator's overhead included.
+constexpr int64_t kAllocation = 16;
+template <typename T>
+constexpr int64_t kHeapMemory = sizeof(T) + kAllocation;
+// A growing vector reserves up to twice the room that it needs.
+constexpr int64_t kElementMemory = 2 * sizeof(PObject);
+constexpr int64_t kArrayMemory = kUsualLength * sizeof(PObject) + kAllocation;
+// The tree node of a map has four words in addition to the entry.
+constexpr int64_t kEntryMemory = kHeapMemory<PObject::Map::value_type> + 4 * sizeof(void*);
+// The shortest encoding of each, in bytes.
+constexpr size_t kKeyBytes = 3;
+template <typename T>
+constexpr size_t kWireBytes = 2;
+template <>
+constexpr size_t kWireBytes<unsigned long long> = 3;
+template <>
+constexpr size_t kWireBytes<std::string> = 3;
+
+// Levels kept without an allocation: most messages are not deeper.
 constexpr size_t kUsualDepth = 8;
 
-// A stack whose first elements need no memory of their own, and none of which ever moves.
+// A stack that allocates only beyond its first kFirst elements. Elements never move.
 template <typename T, size_t kFirst>
 class SteadyStack {
 public:
@@ -70,7 +91,7 @@ private:
     size_t size_ = 0;
 };
 
-// Whether a step of the channel went well; a failure is told here.
+// Whether a channel operation succeeded; logs a failure.
 bool Passed(int code) {
     if (code < 0) {
         Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] ZEL/stream(%d): Channel: %d\n", __LINE__,
@@ -89,7 +110,7 @@ unsigned char IntegerLength(unsigned long long value) {
     return value >> 32 == 0 ? 4 : 8;
 }
 
-// The low 64 bits of a number on the wire.
+// Decodes a big-endian number; only its low 64 bits are kept.
 unsigned long long Fold(const char* bytes, unsigned int length) {
     unsigned long long value = 0;
     for (unsigned int i = 0; i < length; ++i) {
@@ -100,19 +121,20 @@ unsigned long long Fold(const char* bytes, unsigned int length) {
 
 }  // namespace
 
-// A map's entry in transfer, in the frame of the call that transfers it.
+// A map entry that is being transferred; lives on the stack of the call that transfers it.
 struct PStream::Entry {
     std::string_view key;
     Entry* outer = nullptr;
 };
 
-// Steps that may wait, or fail, are the channel's own operations; all others are its shortcuts.
+// Brings the key path up to date and returns the channel, for an operation that may block or fail.
+// Whatever needs the ring buffers alone uses the channel's shortcuts instead.
 inline Channel& PStream::Slowly(Channel& channel) {
     ShowPath();
     return channel;
 }
 
-// The steps of one byte.
+// Single bytes.
 
 inline bool PStream::WriteByte(Channel& channel, unsigned char value) {
     return channel.Store(&value, sizeof value) || Passed(Slowly(channel).WriteByte(value));
@@ -122,7 +144,7 @@ inline bool PStream::ReadByte(Channel& channel, unsigned char& value) {
     return channel.Fetch(&value, sizeof value) || Passed(Slowly(channel).ReadByte(&value));
 }
 
-// The body of an integer or of a string, when all of it lies in the read ring.
+// Decode the body of an integer or a string that is complete in the read ring.
 
 inline bool PStream::Take(Channel& channel, unsigned long long& value) {
     const char* head = channel.Ahead(1);
@@ -166,7 +188,7 @@ inline void PStream::Leave(const Entry& entry) {
     }
 }
 
-// Makes the history what it should be.
+// Brings the history up to date.
 void PStream::ShowPath() {
     if (shown_ == entries_ && history_.size() == kept_ + shown_) {
         return;
@@ -180,7 +202,7 @@ void PStream::ShowPath() {
     shown_ = entries_;
 }
 
-// After a failure: the history stays as it is, and the entries, whose keys may go, are forgotten.
+// After a failure: keeps the history and drops the entries, whose keys may be destroyed.
 void PStream::KeepPath() {
     ShowPath();
     kept_ = history_.size();
@@ -188,7 +210,7 @@ void PStream::KeepPath() {
     entries_ = shown_ = 0;
 }
 
-// An entry for as long as it is in transfer.
+// Registers an entry while it is being transferred.
 class PStream::EntryInTransfer {
 public:
     EntryInTransfer(PStream& stream, std::string_view key) : stream_(stream), entry_{key} {
@@ -203,8 +225,7 @@ private:
     Entry entry_;
 };
 
-// A whole value in one direction. A value may be larger than memory: that is a failure like any
-// other.
+// Sends or receives one whole value. Running out of memory is a failure like any other.
 template <typename Step>
 int PStream::Transfer(Step step) {
     int result = RESULT_IO;
@@ -284,23 +305,21 @@ int PStream::Send(Channel& channel, const std::string& value) {
 // REQUIRES text[size] == 0.
 int PStream::SendText(Channel& channel, const char* text, size_t size) {
     UpdateStatus(0, 0);
-    // The length is the low 16 bits whatever the string's length is: short strings are the caller's
-    // business.
+    // Only the low 16 bits of the length are sent: the caller must keep strings short enough.
     const auto length = static_cast<unsigned short>(size);
     const char head[] = {TAG_STRING, static_cast<char>(length >> 8), static_cast<char>(length)};
     if (!channel.Store(head, sizeof head) &&
         (!Passed(Slowly(channel).WriteByte(TAG_STRING)) || !Passed(channel.WriteInt16(length)))) {
         return RESULT_IO;
     }
-    // A larger string than a channel can be given is refused by the channel, as it would be in full
-    // length.
+    // Cut to the largest length that the channel's parameter can hold: it refuses such a block
+    // anyway.
     if (!channel.Store(text, size) &&
         !Passed(Slowly(channel).Write(
             text, static_cast<unsigned int>(std::min<size_t>(size, UINT32_MAX))))) {
         return RESULT_IO;
     }
-    Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s\"%s\"\n", __LINE__, Indent(),
-                   text);
+    TraceText(text);
     return RESULT_SUCCESS;
 }
 
@@ -347,8 +366,7 @@ int PStream::Recv(Channel& channel, std::string& value) {
     if (!passed) {
         return RESULT_IO;
     }
-    Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s\"%s\"\n", __LINE__, Indent(),
-                   value.c_str());
+    TraceText(value.c_str());
     return RESULT_SUCCESS;
 }
 
@@ -375,7 +393,10 @@ int PStream::Recv(Channel& channel, std::map<std::string, PObject>& value) {
         if (result < 0) {
             break;
         }
-        // Keys come in order, so the end is where a new one belongs.
+        if (!Afford(kEntryMemory, kKeyBytes + key.size())) {
+            return RESULT_PROTOCOL;
+        }
+        // Senders send keys in order, so a new one usually belongs at the end.
         const auto entry = value.emplace_hint(value.end(), std::move(key), PObject());
         const EntryInTransfer in_transfer(*this, entry->first);
         result = RecvObject(channel, entry->second);
@@ -398,6 +419,9 @@ int PStream::Recv(Channel& channel, std::vector<PObject>& value) {
             LeaveBody("]");
             break;
         }
+        if (!Afford(kElementMemory + (value.empty() ? kArrayMemory : 0), 0)) {
+            return RESULT_PROTOCOL;
+        }
         if (value.empty()) {
             value.reserve(kUsualLength);
         }
@@ -416,14 +440,18 @@ int PStream::RecvTag(Channel& channel, unsigned char& tag) {
 
 int PStream::RecvDispatch(Channel& channel, unsigned char tag, PObject& value) {
     switch (tag) {
-        case TAG_STRING:
-            return Recv(channel, value.become<std::string>());
+        case TAG_STRING: {
+            const int result = RecvInto<std::string>(channel, value);
+            // A text takes about as much memory as it has bytes on the wire.
+            return result < 0 || Afford(0, value.get<std::string>().size()) ? result
+                                                                            : RESULT_PROTOCOL;
+        }
         case TAG_INTEGER:
-            return Recv(channel, value.become<unsigned long long>());
+            return RecvInto<unsigned long long>(channel, value);
         case TAG_MAP:
-            return Recv(channel, value.become<PObject::Map>());
+            return RecvInto<PObject::Map>(channel, value);
         case TAG_ARRAY:
-            return Recv(channel, value.become<PObject::Array>());
+            return RecvInto<PObject::Array>(channel, value);
         case TAG_NULL:
             break;
         default:
@@ -443,13 +471,21 @@ int PStream::RecvDispatch(Channel& channel, unsigned char tag, PObject& value) {
     return RESULT_SUCCESS;
 }
 
+template <typename T>
+int PStream::RecvInto(Channel& channel, PObject& value) {
+    if (depth_ > 0 && !Afford(kHeapMemory<T>, kWireBytes<T>)) {
+        return RESULT_PROTOCOL;
+    }
+    return Recv(channel, value.become<T>());
+}
+
 int PStream::Skip(Channel&, unsigned char) {
     return RESULT_PROTOCOL;
 }
 
 void PStream::UpdateStatus(unsigned long long done, unsigned long long total) {
-    // Every scalar comes here. Only the thread that transfers writes the counters, so it may look
-    // at them unlocked.
+    // Called for every scalar. Only the transferring thread writes the counters, so it may read
+    // them without the lock.
     if (status_done_ == done && status_total_ == total) {
         return;
     }
@@ -481,7 +517,7 @@ void PStream::DumpHistory() {
 }
 
 void PStream::ClearHistory() {
-    // Only the thread that transfers writes what the lock is over, so it may look unlocked.
+    // Only the transferring thread writes what the lock protects, so it may read without it.
     if (!history_.empty() || status_total_ != 0 || status_done_ != 0) {
         const std::lock_guard<std::mutex> lock(mutex_);
         history_.clear();
@@ -503,8 +539,20 @@ const char* PStream::Indent() const {
     return kIndent + 2 * (kIndentLevels - std::min<size_t>(depth_, kIndentLevels));
 }
 
-// A loop with a stack of its own: a sender's value may be nested deeper than the thread's stack
-// allows.
+void PStream::TraceText(const char* text) const {
+    if (!Logger::Passes(Logger::LEVEL_DEBUG)) {
+        return;
+    }
+    for (const Entry* entry = innermost_; entry != nullptr; entry = entry->outer) {
+        if (entry->key == kPasswordKey) {
+            return;
+        }
+    }
+    Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s\"%s\"\n", __LINE__, Indent(),
+                   text);
+}
+
+// Iterative, with an explicit stack: a value may be nested too deeply for recursion.
 int PStream::SendContainer(Channel& channel, const PObjectCursor& outermost) {
     struct Level {
         explicit Level(const PObjectCursor& container) : place(container) {}
@@ -579,8 +627,27 @@ int PStream::EnterBody(const char* bracket) {
     }
     Logger::LogMsg(Logger::LEVEL_DEBUG, "[DEBUG] ZEL/stream(%d): %s%s\n", __LINE__, Indent(),
                    bracket);
+    if (depth_ == 0) {
+        memory_left_ = kFreeMemory;
+    }
     ++depth_;
     return RESULT_SUCCESS;
+}
+
+// Accounts for `memory` that the value takes and for `bytes` that were received for it. False when
+// the budget is exceeded.
+bool PStream::Afford(int64_t memory, size_t bytes) {
+    const int64_t left = memory_left_ + kMemoryPerByte * static_cast<int64_t>(bytes) - memory;
+    memory_left_ = static_cast<int32_t>(std::min<int64_t>(left, INT32_MAX));
+    if (memory_left_ < 0) {
+        Logger::LogMsg(
+            Logger::LEVEL_ERROR,
+            "[ERROR] ZEL/stream(%d): PStream: takes more memory than %d MiB and %d times "
+            "its bytes\n",
+            __LINE__, static_cast<int>(kFreeMemory >> 20), static_cast<int>(kMemoryPerByte));
+        return false;
+    }
+    return true;
 }
 
 void PStream::LeaveBody(const char* bracket) {

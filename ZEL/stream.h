@@ -21,10 +21,13 @@ class PObjectCursor;
 /// Sends and receives PObjects over a Channel that each call is given. It keeps no connection, only
 /// the path of map keys that is being transferred and two progress counters.
 ///
-/// Results are 0 or: -2, the channel failed; -5, the peer sent no value; -1, a value of no known
-/// type. After a failure the connection stands in the middle of a value: close it.
+/// Results: 0 on success; -2: the channel failed; -5: the peer sent bytes that are not a value; -1:
+/// a value of unknown type. After a failure the connection is in the middle of a value: close it.
 ///
-/// A value of any depth can be sent; one nested deeper than kMaxDepth is not received (-5).
+/// A value of any depth can be sent; one nested deeper than kMaxDepth is not received (-5), nor one
+/// that would take more memory than kFreeMemory and kMemoryPerByte allow (-5).
+///
+/// At debug level each value is traced in the log, but for texts under the key "pswd".
 ///
 /// Threads: one thread sends or receives; any other may call GetStatus() meanwhile.
 class PStream {
@@ -32,6 +35,12 @@ public:
     /// The deepest nesting of maps and arrays that is received: the outermost one is level 1.
     /// Receiving calls itself once a level: this bounds the stack that a peer can make it use.
     static constexpr uint32_t kMaxDepth = 512;
+
+    /// What a received value may take in memory: this much, and so many bytes for each byte that
+    /// has arrived. Two bytes can be an empty map, which takes forty times as much: a peer must not
+    /// be able to make the receiver hold many times what it sends.
+    static constexpr int64_t kFreeMemory = int64_t{32} << 20;
+    static constexpr int64_t kMemoryPerByte = 8;
 
     /// The first byte of each element on the wire.
     enum Tag : unsigned char {
@@ -86,7 +95,7 @@ public:
     int RecvTag(Channel& channel, unsigned char& tag);
     /// Receives the body of an element with that tag.
     int RecvDispatch(Channel& channel, unsigned char tag, PObject& value);
-    /// What an unknown tag comes to: always -5, it is never skipped.
+    /// Handles an unknown tag: always -5; it is never skipped.
     int Skip(Channel& channel, unsigned char tag);
 
     /// Sets the counters that GetStatus() gives; only on the thread that transfers. The start of
@@ -99,10 +108,10 @@ public:
     std::string GetHistory();
     /// Writes the key path to the log, at error level.
     void DumpHistory();
-    /// Forgets key path, counters and depth.
+    /// Clears key path, counters and depth.
     void ClearHistory();
 
-    /// A place for received files, kept for callers; nothing here reads it.
+    /// A folder for received files, stored for callers; the library does not use it.
     void SetDefaultRecvLocation(const std::string& location) { default_recv_location_ = location; }
     /// The protocol's version: 1, 0, 0.
     void GetVersion(unsigned int& major, unsigned int& minor, unsigned int& third);
@@ -124,20 +133,25 @@ private:
     void KeepPath();
     int SendText(Channel& channel, const char* text, size_t size);
     const char* Indent() const;
+    void TraceText(const char* text) const;
     int OpenContainer(Channel& channel, const PObjectCursor& container);
     int CloseContainer(Channel& channel, const PObjectCursor& container);
     int SendContainer(Channel& channel, const PObjectCursor& outermost);
     int EnterBody(const char* bracket);
+    bool Afford(int64_t memory, size_t bytes);
+    template <typename T>
+    int RecvInto(Channel& channel, PObject& value);
     void LeaveBody(const char* bracket);
 
-    // Keys from the outermost map to the entry in transfer. Brought up to date before whatever may
-    // wait or fail, and at the end: of what moves at once between ring and value no one can tell
-    // that it was in between, and most entries are such.
+    // Keys from the outermost map to the entry in transfer. Brought up to date only before steps
+    // that may wait or fail, and at the end. Most entries are copied between ring and value without
+    // such a step, and no other thread can see a difference.
     std::vector<std::string> history_;
     unsigned long long status_total_ = 0;
     unsigned long long status_done_ = 0;
-    std::mutex mutex_;    // over the three above
-    uint32_t depth_ = 0;  // maps and arrays that are open
+    std::mutex mutex_;         // over the three above
+    uint32_t depth_ = 0;       // maps and arrays that are open
+    int32_t memory_left_ = 0;  // bytes that the value being received may still take
     std::string default_recv_location_;
     Entry* innermost_ = nullptr;  // the entry in transfer, which leads to those around it
     size_t entries_ = 0;          // how many they are

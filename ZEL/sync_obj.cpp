@@ -41,7 +41,7 @@ bool TaskInfo::Validate() const {
     if (!sync_info_.Validate() || !schedule_.Validate()) {
         return false;
     }
-    // The next two texts have never ended a line, and those who read logs by pattern rely on it.
+    // The next two messages have no line end: programs that parse the log rely on it.
     if (name_.empty()) {
         Logger::LogMsg(Logger::LEVEL_NOTE, "[NOTE] ZEL/sync_obj(%d): Empty task name", __LINE__);
         return false;

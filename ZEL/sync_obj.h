@@ -33,7 +33,8 @@ enum TASK_STATUS : int32_t {
     TASK_STATUS_IDLE = 0,     ///< nothing to do, or waiting for its next run
     TASK_STATUS_WAITING = 1,  ///< due; waits for its turn
     TASK_STATUS_RUNNING = 2,  ///< runs now
-    TASK_STATUS_PAUSED = 3    ///< not started by the schedule until it is resumed
+    TASK_STATUS_PAUSED = 3,   ///< not started by the schedule until it is resumed
+    TASK_STATUS_CONFIRM = 4   ///< something of it waits until a person allows it
 };
 
 /// How a task's last run ended.
@@ -181,13 +182,13 @@ public:
 
     /// The time of the first run after `reference`, both in seconds since the epoch; `reference` +
     /// 1 in realtime mode; 0 when no run will come (manual, or once and over); -1 on failure: a
-    /// negative reference, or a time that cannot be reckoned with.
+    /// negative reference, or a time that cannot be computed.
     ///
-    /// A run at exactly `reference` is not returned. Days that a month lacks count on into the next
-    /// one: the 31st of April is the 1st of May. For schedules that pass Validate(); with any other
-    /// the call ends too, but may give -1. The daylight-saving state that the search comes from is
-    /// kept where mktime() does not settle it, so a run on the day of a change can move by the
-    /// change. Call tzset() after changing the zone of a running process.
+    /// A run at exactly `reference` is not returned. A day that a month does not have carries over
+    /// into the next month: the 31st of April is the 1st of May. For schedules that pass
+    /// Validate(); with any other the call ends too, but may give -1. The daylight-saving state
+    /// that the search comes from is kept where mktime() does not settle it, so a run on the day of
+    /// a change can move by the change. Call tzset() after changing the zone of a running process.
     long GetNextScheduledSeconds(long reference) const;
 
 private:

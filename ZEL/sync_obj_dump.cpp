@@ -9,8 +9,7 @@ namespace ZEL {
 
 namespace {
 
-// Numbers go out as text of their own: decimal, whatever base, sign or grouping the stream has been
-// told to use.
+// Numbers are formatted here: decimal, whatever base, sign or grouping the stream is set to.
 struct TwoWide {
     int64_t number;
 };
@@ -73,8 +72,8 @@ std::ostream& operator<<(std::ostream& stream, const SyncInfo& info) {
 
 std::ostream& operator<<(std::ostream& stream, const Schedule& schedule) {
     const struct tm begin = schedule.GetScheduleBegin();
-    // The week's label is two wider than the others, and no line end follows the last value: those
-    // who read dumps by pattern rely on both.
+    // The week's label is two wider than the others, and no line end follows the last value:
+    // programs that parse dumps rely on both.
     return stream << "mode: ................ " << schedule.GetModeStr() << std::endl
                   << "week_schd: ............. " << schedule.GetWeekSchedule() << std::endl
                   << "schedule_begin: ...... " << std::to_string(int64_t{begin.tm_year} + 1900)

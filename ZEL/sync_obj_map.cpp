@@ -65,7 +65,8 @@ Value Read(const PObject& value) {
     }
 }
 
-// The mode and whatever is signed travel as signed 32-bit integers, on hosts with a wider long too.
+// The mode and all signed values are sent as signed 32-bit integers, also on hosts with a wider
+// long.
 template <typename Value>
 void Write(const Value& value, PObject& into) {
     if constexpr (std::is_enum_v<Value> || std::is_same_v<Value, long>) {
@@ -96,7 +97,7 @@ void WriteFields(const std::tuple<Fields...>& fields, const Record& record, PObj
 Schedule ReadSchedule(const PObject& obj) {
     Schedule schedule;
     ReadFields(kScheduleFields, obj, schedule);
-    // After the repeat count: each of the two takes the other to 0 when it is set to 0.
+    // Set after the repeat count: setting either of the two to 0 also sets the other to 0.
     if (obj.hasMember(kPeriodHour) && obj.hasMember(kPeriodMinute)) {
         schedule.SetPeriod(obj[kPeriodHour].asInt32(), obj[kPeriodMinute].asInt32());
     }

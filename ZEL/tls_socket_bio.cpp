@@ -62,7 +62,7 @@ long Control(BIO* bio, int command, long, void* argument) {
 }
 
 const BIO_METHOD* MakeMethod() {
-    // The type says that there is a descriptor below, which is how SSL_get_fd() finds it.
+    // BIO_TYPE_DESCRIPTOR lets SSL_get_fd() find the socket.
     BIO_METHOD* method = BIO_meth_new(
         BIO_get_new_index() | BIO_TYPE_SOURCE_SINK | BIO_TYPE_DESCRIPTOR, "channel socket");
     if (method != nullptr) {

@@ -125,9 +125,9 @@ int StopDaemon();
 /// Whether something exists at `path`, readable or not. A dangling symbolic link does not.
 bool IsPathExist(const std::string& path);
 
-/// Makes a new empty file in /tmp/ZEL (below the root folder, see tarq/root_path.h), which must
-/// exist; only its owner may read and write it. Returns its path, for PutTempFile in the end; empty
-/// on failure, which is not logged.
+/// Makes a new empty file in /tmp/ZEL (below the root folder, see tarq/root_path.h); only its owner
+/// may read and write it. The folder must exist, belong to root or the caller, and be nobody else's
+/// to write. Returns its path, for PutTempFile in the end; empty on failure, which is not logged.
 std::string GetTempFile();
 
 /// Removes a file of GetTempFile. An empty path is ignored.

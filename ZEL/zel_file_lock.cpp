@@ -61,7 +61,7 @@ int SimpleFileLock::ExLock() {
     if (fd_ < 0) {
         return -1;
     }
-    // A wait that a signal cuts short goes on: whoever wants out of it ends the process.
+    // An interrupted wait is resumed: signals do not cancel it.
     if (RetryInterrupted([&] { return flock(fd_, LOCK_EX); }) != 0) {
         Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] ZEL/zel(%d): Fail to lock, error:'%s'\n",
                        __LINE__, strerror(errno));

@@ -21,7 +21,7 @@ namespace {
 constexpr char kNmblookup[] = "/usr/local/bin/nmblookup";
 
 constexpr int kIdentitySize = 1024;
-// What servers know single devices by was read with this much room, and must stay what it is.
+// This size limits the identity by which servers already know devices: it must not change.
 constexpr int kSingleSerialSize = 36;
 constexpr size_t kHostNameSize = 64;
 constexpr int kMaxAddresses = 20;
@@ -86,7 +86,7 @@ int LookUp(const std::string& name, std::vector<std::string>& addresses) {
 
 std::string GetClientID() {
     char identity[kIdentitySize] = "";
-    // Whether a call gave an identity shows in the text alone: a device without a number is no
+    // Only the text shows whether there is an identity: a device without a serial number is not a
     // failure.
     if (TARQHAIsRunning() != 0) {
         KAPIGetSerialNumber(identity, kIdentitySize);
@@ -141,8 +141,7 @@ int GetUsableIP(const std::string& server_name, const std::string& server_addres
         if (count < 0) {
             return -1;
         }
-        // An address that the name still leads to is better than its siblings: it answered last
-        // time.
+        // Of the addresses that the name resolves to, prefer the one that answered last time.
         const bool still_there = std::any_of(
             found.begin(), found.end(),
             [&](const std::string& address) { return EqualIgnoringCase(address, server_address); });

@@ -6,6 +6,7 @@
 
 #include "ZEL/log.h"
 #include "ZEL/zel.h"
+#include "base/own_folder.h"
 #include "tarq/core.h"
 #include "tarq/root_path.h"
 #include "tarq/systemd.h"
@@ -15,6 +16,7 @@ namespace ZEL {
 namespace {
 
 constexpr char kDaemonUnit[] = "zel_daemon";
+constexpr char kTempFolder[] = "/tmp/ZEL";
 constexpr char kTempTemplate[] = "/tmp/ZEL/temp.XXXXXX";
 
 }  // namespace
@@ -52,6 +54,10 @@ bool IsPathExist(const std::string& path) {
 }
 
 std::string GetTempFile() {
+    // Anybody may have made that folder, and would own what is put there.
+    if (!base::IsOwnFolder(TARQ::RootPath(kTempFolder))) {
+        return "";
+    }
     std::string path = TARQ::RootPath(kTempTemplate);
     const int fd = mkostemp64(path.data(), O_CLOEXEC);
     if (fd < 0) {

@@ -16,8 +16,8 @@ constexpr size_t kEncryptPathSize = 4095;
 
 using ShareRecord = TARQ::ShareOwner;
 
-// Null when there is no such share. A name with a NUL inside names none: the platform would take
-// its head for it.
+// Null when there is no such share. A name with a NUL in it matches none: the platform would see
+// only the part before the NUL.
 ShareRecord FindShare(const std::string& name) {
     TARQShare share = nullptr;
     const bool found =

@@ -29,12 +29,12 @@ using std::chrono::milliseconds;
 
 // How often the caller is asked whether to go on.
 constexpr milliseconds kAskInterval(100);
-// What a program gets to clear up after itself before it is killed.
+// The time between SIGTERM and SIGKILL, in which a program can clean up.
 constexpr milliseconds kTermGrace(300);
-// What the kernel gets to bury the rest of a killed group: it needs far less.
+// How long to wait for the kernel to end a killed group: it needs far less.
 constexpr milliseconds kBurialGrace(200);
 
-// How long and how often a program is watched that has done its work.
+// For how long and how often EarlyEnd::reached is asked.
 constexpr milliseconds kEarlyEndWatch(100);
 constexpr microseconds kEarlyEndStep(200);
 
@@ -104,6 +104,7 @@ struct ChildPlan {
     char* const* environment;
     int input, output, error, report;
     uint64_t max_file_bytes;
+    int folder;
     pid_t parent;
 };
 
@@ -111,19 +112,18 @@ struct ChildPlan {
 [[noreturn]] void BecomeProgram(const ChildPlan& plan) {
     ResetSignals();
     setsid();
-    // The second line is for a parent that died before the first one took effect.
-    prctl(PR_SET_PDEATHSIG, SIGTERM);
-    bool ready = getppid() == plan.parent;
+    bool ready = EndWithParent(plan.parent);
     if (plan.max_file_bytes != 0) {
         const rlimit limit = {static_cast<rlim_t>(plan.max_file_bytes),
                               static_cast<rlim_t>(plan.max_file_bytes)};
         ready = ready && setrlimit(RLIMIT_FSIZE, &limit) == 0;
     }
+    ready = ready && (plan.folder < 0 || fchdir(plan.folder) == 0);
     ready = ready && dup2(plan.input, STDIN_FILENO) >= 0 && dup2(plan.output, STDOUT_FILENO) >= 0 &&
             dup2(plan.error, STDERR_FILENO) >= 0;
 #ifdef SYS_close_range
-    // What the host has left open without close-on-exec. A kernel without the call lets the program
-    // have it.
+    // Closes descriptors that the host left open without close-on-exec. On a kernel without the
+    // call the program inherits them.
     constexpr unsigned int kCloseRangeCloexec = 4;
     syscall(SYS_close_range, kFirstFreeFd, ~0U, kCloseRangeCloexec);
 #endif
@@ -187,7 +187,7 @@ public:
         return wait_status_;
     }
 
-    // The leader's children are buried by the system's first process, in its own time.
+    // The leader's children are reaped by init, in its own time.
     void AwaitBurial() const {
         const Clock::time_point give_up = Clock::now() + kBurialGrace;
         while (kill(-leader_, 0) == 0 && Clock::now() < give_up) {
@@ -238,15 +238,11 @@ int Start(const ChildSetup& setup, std::optional<ProcessGroup>* group, Stream* o
     for (const UniqueFd* end : {&out.read_end, &err.read_end}) {
         fcntl(end->Get(), F_SETFL, O_NONBLOCK);
     }
-    const ChildPlan plan = {setup.program.c_str(),
-                            arguments.data(),
-                            environment.data(),
-                            input.Get(),
-                            out.write_end.Get(),
-                            err.write_end.Get(),
-                            report.write_end.Get(),
-                            setup.max_file_bytes,
-                            getpid()};
+    const ChildPlan plan = {setup.program.c_str(),  arguments.data(),
+                            environment.data(),     input.Get(),
+                            out.write_end.Get(),    err.write_end.Get(),
+                            report.write_end.Get(), setup.max_file_bytes,
+                            setup.folder,           getpid()};
     pid_t pid;
     int fork_error;
     {
@@ -261,7 +257,7 @@ int Start(const ChildSetup& setup, std::optional<ProcessGroup>* group, Stream* o
         return fork_error;
     }
     group->emplace(pid);
-    // The report closes by itself when the program starts; from then on the group exists.
+    // The report pipe is closed by the program's start; from then on the group exists.
     report.write_end.Reset();
     int reason = 0;
     ssize_t count;
@@ -344,6 +340,11 @@ std::vector<char*> ArgumentVector(const std::vector<std::string>& words) {
     return pointers;
 }
 
+bool EndWithParent(pid_t parent) {
+    // The second look is for a parent that died before the first call took effect.
+    return prctl(PR_SET_PDEATHSIG, SIGTERM) == 0 && getppid() == parent;
+}
+
 void ResetSignals() {
     struct sigaction default_action = {};
     default_action.sa_handler = SIG_DFL;
@@ -409,7 +410,7 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
     if (!result.ended_early) {
         group->AwaitBurial();
     }
-    // With the whole group gone the rest is what lies in the pipes.
+    // The whole group has ended: what is left to read is already in the pipes.
     for (Stream* stream : {&output, &error}) {
         while (stream->fd && stream->ReadOnce()) {
         }

@@ -17,24 +17,25 @@ struct ChildSetup {
     std::string program;                   ///< path of the executable, see FindProgram()
     std::vector<std::string> arguments;    ///< argv, the program's own name included
     std::vector<std::string> environment;  ///< NAME=value
-    std::string input;            ///< all of its standard input; at most kMaxChildInput bytes
-    uint64_t max_file_bytes = 0;  ///< no file that it writes may grow longer; 0: no limit
-    std::function<void(pid_t)> on_start;  ///< told once the program runs; may be empty
+    std::string input;  ///< all of its standard input; at most kMaxChildInput bytes
+    int folder = -1;    ///< descriptor of the folder that it runs in; -1: this process's own
+    uint64_t max_file_bytes = 0;          ///< no file that it writes may grow longer; 0: no limit
+    std::function<void(pid_t)> on_start;  ///< called once the program runs; may be empty
 };
 
-/// What a pipe takes without anybody reading.
+/// How many bytes a pipe takes without a reader.
 constexpr size_t kMaxChildInput = 4096;
 
 struct ChildResult {
     int start_error = 0;       ///< errno when the program could not be started, else 0
     bool cancelled = false;    ///< `cancelled` said true
     bool ended_early = false;  ///< EarlyEnd::reached said true
-    int wait_status = 0;       ///< as waitpid() gives it; -1 when somebody else has taken it
+    int wait_status = 0;       ///< as waitpid() gives it; -1 when the child was reaped elsewhere
 };
 
 /// For a program whose work is done some time before it ends by itself.
 struct EarlyEnd {
-    int ready_fd = -1;  ///< from when it is readable, `reached` is asked often for a while
+    int ready_fd = -1;  ///< once it is readable, `reached` is called often for a while
     std::function<bool(pid_t leader)> reached;  ///< true: the rest of the program is not needed
 };
 
@@ -59,8 +60,13 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
 /// along `search_path` (folders joined by ":"). Empty when there is none.
 std::string FindProgram(const std::string& name, const std::string& search_path);
 
-/// The words as execv() takes them, which changes none: valid as long as they are.
+/// The words as an argument vector for execv(), which does not change them. Valid as long as
+/// `words` is.
 std::vector<char*> ArgumentVector(const std::vector<std::string>& words);
+
+/// Has this process end with SIGTERM when `parent`, which has forked it, ends. False when that has
+/// ended already. For a child between fork() and execv().
+bool EndWithParent(pid_t parent);
 
 /// Every signal does what it does by default, and none is blocked. For a child between fork() and
 /// execv().

@@ -14,7 +14,7 @@ namespace {
 
 constexpr size_t kMaxBytes = size_t{1} << 20;
 
-/// Within the quotes of a message, in which a file's odd bytes have no place.
+/// The text as it can be quoted in a message: without control characters, and cut.
 std::string Shown(std::string_view text) {
     constexpr size_t kMost = 60;
     std::string shown;

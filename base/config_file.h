@@ -10,14 +10,14 @@
 
 namespace base {
 
-/// A file is not as it should be: what() says where, and what is wrong.
+/// An error in a configuration file: what() names the place and the problem.
 class ConfigError : public std::runtime_error {
 public:
     using std::runtime_error::runtime_error;
 };
 
-/// What a file says. A key that it does not have, or has with nothing behind it, has its default;
-/// without a file all have.
+/// The values in a file. A key that is missing or empty has its default, and so have all keys when
+/// there is no file.
 class ConfigFile {
 public:
     /// Throws ConfigError when the file cannot be read, and for the first line that nobody would
@@ -27,9 +27,9 @@ public:
                const std::set<std::string>& keys);
 
     std::string Text(const std::string& key, const std::string& otherwise = "") const;
-    /// Throws ConfigError for what is no number from `min` to `max`.
+    /// Throws ConfigError for anything but a number from `min` to `max`.
     uint64_t Number(const std::string& key, uint64_t otherwise, uint64_t min, uint64_t max) const;
-    /// The error for a value that is none: `problem` goes on from "<key> is '<value>', ".
+    /// The error for an invalid value: `problem` goes on from "<key> is '<value>', ".
     ConfigError Wrong(const std::string& key, const std::string& problem) const;
 
 private:

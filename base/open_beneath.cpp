@@ -22,7 +22,7 @@ UniqueFd OpenInKernel(int folder, const char* path, int flags) {
 
 /// Whether the call itself is refused, by an old kernel or by a filter on system calls (systemd's
 /// RestrictSUIDSGID= has one, containers have others, and each chooses its own errno). A kernel
-/// that gets the call looks at the size first.
+/// that supports the call checks the size first.
 bool IsRefused() {
     const int saved = errno;
     const bool refused = syscall(SYS_openat2, -1, nullptr, nullptr, 0) == -1 && errno != EINVAL;

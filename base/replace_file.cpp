@@ -3,6 +3,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <sys/file.h>
 #include <unistd.h>
 
@@ -38,7 +39,9 @@ public:
         }
     }
 
-    bool Create(mode_t mode) {
+    /// Nobody else may open the new file: he could lock it, look into it before it has its mode,
+    /// and keep its name from all later writers.
+    bool Create() {
         struct stat there {};
         if (fstatat(folder_, target_.c_str(), &there, 0) == 0 && !S_ISREG(there.st_mode)) {
             errno = S_ISDIR(there.st_mode) ? EISDIR : ENOTSUP;  // no device, nor a link to one
@@ -48,7 +51,7 @@ public:
             name_ = "." + target_ + ".tmp" + std::to_string(attempt);
             RemoveAbandoned();
             UniqueFd fd(openat(folder_, name_.c_str(),
-                               O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, mode));
+                               O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, kPrivateMode));
             if (!fd && errno != EEXIST) {
                 return false;
             }
@@ -119,9 +122,21 @@ bool FlushFolder(int folder) {
     return fsync(folder) == 0 || errno == EINVAL || errno == ENOSYS;
 }
 
+/// 0644 with the process's umask applied. The umask is read from /proc: the system call that
+/// returns it also sets it, for all threads.
+mode_t NewFileMode() {
+    constexpr std::string_view kUmask = "\nUmask:";
+    const std::string status = ReadFile("/proc/self/status").value_or("");
+    const size_t at = status.find(kUmask);
+    return at == std::string::npos
+               ? kPrivateMode
+               : kNewFileMode &
+                     ~static_cast<mode_t>(strtoul(status.c_str() + at + kUmask.size(), nullptr, 8));
+}
+
 /// `prepare` gives the new file its owner and mode.
 template <typename Prepare>
-bool Replace(const std::string& path, const std::vector<std::string_view>& content, mode_t mode,
+bool Replace(const std::string& path, const std::vector<std::string_view>& content,
              Prepare&& prepare) {
     const size_t slash = path.rfind('/');
     const bool bare = slash == std::string::npos;
@@ -132,7 +147,7 @@ bool Replace(const std::string& path, const std::vector<std::string_view>& conte
         return false;
     }
     TemporaryFile file(folder.Get(), name);
-    return file.Create(mode) &&
+    return file.Create() &&
            std::all_of(content.begin(), content.end(),
                        [&](std::string_view piece) { return file.Write(piece); }) &&
            prepare(file) && file.Flush() && file.RenameToTarget() && FlushFolder(folder.Get());
@@ -142,15 +157,13 @@ bool Replace(const std::string& path, const std::vector<std::string_view>& conte
 
 bool ReplaceFile(const std::string& path, const std::vector<std::string_view>& content,
                  const struct stat* old) {
-    // Nobody else may look into the new file before it has the old one's mode.
-    return Replace(
-        path, content, old != nullptr ? kPrivateMode : kNewFileMode,
-        [&](TemporaryFile& file) { return old == nullptr || file.TakeOwnerAndMode(*old); });
+    return Replace(path, content, [&](TemporaryFile& file) {
+        return old != nullptr ? file.TakeOwnerAndMode(*old) : file.SetMode(NewFileMode());
+    });
 }
 
 bool ReplaceFile(const std::string& path, std::string_view content, mode_t mode) {
-    return Replace(path, {content}, kPrivateMode,
-                   [&](TemporaryFile& file) { return file.SetMode(mode); });
+    return Replace(path, {content}, [&](TemporaryFile& file) { return file.SetMode(mode); });
 }
 
 }  // namespace base

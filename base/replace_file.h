@@ -9,9 +9,9 @@
 namespace base {
 
 /// Puts a file of the given content at `path` in one step: after a crash at any instant the old
-/// file or the new one is there, whole. A symbolic link is replaced, not followed; what is no file
-/// is left alone. `old` is the file's status, none when there is none: the new file takes its mode
-/// and owner.
+/// file or the new one is there, whole. A symbolic link is replaced, not followed; anything else
+/// but a regular file is left alone. `old` is the file's status, none when there is none: the new
+/// file takes its mode and owner.
 ///
 /// The folder holds a file `.<name>.tmp<digit>` meanwhile; what a killed writer left behind is
 /// removed by the next one.

@@ -7,12 +7,14 @@ namespace base {
 
 /// The port of the rsync daemon.
 constexpr int kRsyncPort = 873;
+/// The port on which it is reached through TLS.
+constexpr int kRsyncTlsPort = 874;
 constexpr int kMaxPort = 65535;
 
 /// How rsync and ssh are run: this file, section "rsync".
 constexpr char kRsyncConfigPath[] = "/usr/tarq/etc/tarqrsync.conf";
 
-/// What the file does not say stays as it is here.
+/// The defaults hold for what the file does not set.
 struct RsyncConfig {
     int daemon_port = kRsyncPort;
     std::string rsync = "rsync";

@@ -40,7 +40,7 @@ bool WriteAll(int fd, std::string_view bytes) {
         if (count > 0) {
             bytes.remove_prefix(static_cast<size_t>(count));
         } else if (count == 0) {
-            errno = ENOSPC;  // what takes nothing and gives no reason would be tried for ever
+            errno = ENOSPC;  // a write of 0 bytes without an error would be retried for ever
             return false;
         } else if (errno != EINTR) {
             return false;

@@ -9,7 +9,6 @@
 #include <glib.h>
 #include <stdio.h>
 #include <stdlib.h>
-#include <sys/sem.h>
 #include <sys/stat.h>
 #include <time.h>
 #include <unistd.h>
@@ -255,9 +254,5 @@ int main() {
         "%.2f times)\n",
         large[6] / large[7], large[8] / large[7]);
 
-    const int semaphore = semget(TARQ::RootSemaphoreKey(0x2980298), 0, 0);
-    if (semaphore >= 0) {
-        semctl(semaphore, 0, IPC_RMID);
-    }
     std::filesystem::remove_all(folder);
 }

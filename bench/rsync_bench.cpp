@@ -1,11 +1,13 @@
 // What the wrapper costs beside bare rsync, over a daemon of its own on loopback.
 //
-//   rsync_bench [--copies]
+//   rsync_bench [--copies | --encrypted | --versions]
 //
-// The server is a real one: zel_server's configuration, handler and admission on an rsync daemon.
-// --copies: also the two large copies, which write 2 GB below $TMPDIR; in memory (/dev/shm) a
-// disk's moods stay out of it. Runs alternate, medians are compared; each line ends in the ratio
-// and the ratio that is wanted.
+// The server is a real one, `zel_server serve` with its front; the peers have a plain rsync daemon,
+// or an ssh server.
+// --copies: also the large copies, which write 2 GB below $TMPDIR; in memory (/dev/shm) a disk's
+// moods stay out of it. --encrypted: of those the ones over TLS and ssh, and nothing else.
+// --versions: what it costs to keep what is replaced, and a restore by `zelctl restore`. Runs
+// alternate, medians are compared; each line ends in the ratio and the ratio that is wanted.
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/time.h>
@@ -24,6 +26,7 @@
 #include <vector>
 
 #include "base/child_process.h"
+#include "tarq/rsync_servers.h"
 #include "tarq/rsync_wrapper.h"
 #include "tests/integration/servers.h"
 
@@ -34,6 +37,9 @@ using Words = std::vector<std::string>;
 
 constexpr int kCommandRuns = 101;
 constexpr int kCopyRuns = 9;
+// Writing many small files takes longer at some times than at others.
+constexpr int kManyFilesRuns = 31;
+constexpr int kCrowd = 10000;  // shares of a server
 
 /// One way to do the job: prepares, unmeasured, then runs.
 struct Contestant {
@@ -104,47 +110,76 @@ void Print(const char* what, const Contestant& ours, const char* peer, const Con
 }
 
 constexpr char kUser[] = "bob";
-constexpr char kPassword[] = "secret";
+constexpr char kPassword[] = "secret words";
 constexpr char kShare[] = "data";
+constexpr char kOurs[] = "--filter=- /.zel_*";       // the server's own folders in the copy
+constexpr char kQuick[] = "--sockopts=TCP_NODELAY";  // as the wrapper's runs have it
+// The same server by three names, each with a way of its own.
+constexpr char kPlain[] = "plain";
+constexpr char kTls[] = "tls";
+constexpr char kSsh[] = "ssh";
 
 class Bench {
 public:
-    Bench() : port_(test::FreePort()) {
+    Bench() : port_(test::FreePort()), tls_port_(test::FreePort()), peer_port_(test::FreePort()) {
         password_file_ = root_.Write("password", std::string(kPassword) + "\n");
         chmod(password_file_.c_str(), 0600);
         root_.Write("usr/tarq/etc/tarqrsync.conf",
                     "[rsync]\nport=\"" + std::to_string(port_) + "\"\n");
-        ZelServer({"setup", "--storage", root_.Path("storage"), "--port", std::to_string(port_),
-                   "--address", "127.0.0.1"});
+        ZelServer({"setup", "--storage", root_.Path("storage"), "--plain-port",
+                   std::to_string(port_), "--port", std::to_string(tls_port_), "--address",
+                   "127.0.0.1"});
         ZelServer({"account", "add", kUser, "--password-file", password_file_});
-        // The peers' modules: nothing of ours is asked there. Copies go to the folder that the
-        // share has, too: two folders of one disk are not equally fast.
-        const std::string configuration = root_.Path("server/usr/tarq/etc/zel_server");
+        // The peers' modules, of a daemon of their own: nothing of ours is asked there. Copies go
+        // to the folder that the share has, too: two folders of one disk are not equally fast.
         const std::string common =
-            "\nread only = no\nuse chroot = no\nfake super = yes\nauth users = " +
-            std::string(kUser) + "\nsecrets file = " + configuration + "/rsyncd.secrets\n" +
-            (geteuid() == 0 ? "uid = 0\ngid = 0\n" : "");
+            "\nread only = no\nfake super = yes\nauth users = " + std::string(kUser) +
+            "\nsecrets file = " + root_.Path("server/usr/tarq/etc/zel_server/rsyncd.secrets") +
+            "\n" + (geteuid() == 0 ? "use chroot = yes\nuid = 0\ngid = 0\n" : "use chroot = no\n");
         root_.Write("byte/byte", "x");
-        root_.Write(
-            "server/usr/tarq/etc/zel_server/admin.d/peers.conf",
-            "[byte]\npath = " + root_.Path("byte") + common + "[plain]\npath = " + copy_ + common);
-        daemon_.Start(
-            {"rsync", "--daemon", "--no-detach", "--config=" + configuration + "/rsyncd.conf"},
-            root_.Path("daemon.log"), port_);
+        const std::string peers = root_.Write(
+            "peers.conf", "socket options = TCP_NODELAY\nreverse lookup = no\n[byte]\npath = " +
+                              root_.Path("byte") + common + "[plain]\npath = " + copy_ + common);
+        peer_.Start({"rsync", "--daemon", "--no-detach", "--config=" + peers,
+                     "--port=" + std::to_string(peer_port_), "--address=127.0.0.1"},
+                    root_.Path("peer.log"), peer_port_);
+        server_.Start({"env", "TARQ_ROOT=" + root_.Path("server"), ZEL_SERVER, "serve"},
+                      root_.Path("server.log"), port_);
+        using namespace TARQ::Backup;
+        TrustServer(
+            {kTls, ServerTransport::TLS, tls_port_, FetchFingerprint("127.0.0.1", tls_port_, 10)});
         Must(Command({"command=\"ZEL_PairingMultiSrc\"", "clientID=\"BENCH\"",
                       "serverName=\"bench\"", "syncShares=\"data\"", "dryRun=\"no\"",
                       "outfile=\"\"", "requireEncryptionShareSupport=\"no\""}));
-        Must(Command({"command=\"ZEL_SyncStart\"", "clientID=\"BENCH\"", "volumeName=\"\"",
-                      "shareName=\"data\""}));
+        Must(StartShare());
     }
 
     void Commands() {
         Contestant wrapper = {nullptr, [this] { return WrapperCommand(); }};
         Contestant plain = {nullptr, [this] { return BareByte({}); }};
         Contestant quick = {nullptr, [this] { return BareByte({"--sockopts=TCP_NODELAY"}); }};
-        Measure({&wrapper, &plain, &quick}, kCommandRuns);
+        Contestant tls = {nullptr, [this] { return WrapperCommand(kTls); }};
+        Measure({&wrapper, &plain, &quick, &tls}, kCommandRuns);
+        Print("command over TLS", tls, "the same without TLS", wrapper, 1.5);
         Print("server command", wrapper, "rsync, one byte", plain, 0.35);
         Print("server command", wrapper, "rsync TCP_NODELAY, one byte", quick, 1.2);
+    }
+
+    // What a command costs a server that has as many shares as one ever has.
+    void Crowd() {
+        RegisterShares(kCrowd);
+        const auto compare = [this](const char* what, const std::function<bool()>& command) {
+            Contestant crowded = {[this] { Have(true); }, command};
+            Contestant alone = {[this] { Have(false); }, command};
+            Measure({&crowded, &alone}, kCommandRuns);
+            Print(what, crowded, "the same beside one share", alone, 1.2);
+        };
+        compare("10,000: version", [this] { return WrapperCommand(); });
+        compare("10,000: start", StartShare);
+        compare("10,000: beacon", [] {
+            return Command(
+                {"command=\"ZEL_UpdateTaskStatus\"", "clientID=\"BENCH\"", "taskName=\"bench\""});
+        });
     }
 
     void Unchanged() {
@@ -162,17 +197,113 @@ public:
     void Copies() {
         Copy("20,000 files of 4 KB", "many", 20000, 4096);
         Copy("1 GB in 8 files", "large", 8, 128 << 20);
+        Encrypted();
+    }
+
+    // Where nothing changed, and what is brought back, is a tree of such a size that the files cost
+    // and not the commands around the run, which are measured by themselves.
+    void Versions() {
+        Restored(100000);
+        NothingChanged(200000);
+        Replaced(20000);
+    }
+
+    void NothingChanged(int count) {
+        const std::string source = root_.Path("kept");
+        Fill(source, count, 64);
+        Contestant wrapper = {nullptr, [&] { return WrapperCopy(source); }};
+        Contestant bare = {nullptr, [&] { return BareCopy(source, {kQuick, kOurs}); }};
+        Measure({&wrapper, &bare}, kCopyRuns);
+        Print("200,000 unchanged", wrapper, "rsync", bare, 1.02);
+        EmptyCopy();
+        fs::remove_all(source);
+    }
+
+    void Replaced(int count) {
+        const std::string source = root_.Path("replaced");
+        int turn = 0;
+        const auto replace = [&] {
+            fs::remove_all(root_.Path("storage/.versions"));
+            fs::remove_all(copy_ + "/kept-by-rsync");
+            Fill(source, count, 4096 + static_cast<size_t>(++turn));
+            sync();
+        };
+        Contestant replaced = {replace, [&] { return WrapperCopy(source); }};
+        Contestant backup = {replace, [&] {
+                                 return BareCopy(source,
+                                                 {kQuick, "--backup", "--backup-dir=/kept-by-rsync",
+                                                  "--filter=P /kept-by-rsync", kOurs});
+                             }};
+        Measure({&replaced, &backup}, kManyFilesRuns);
+        Print("20,000 replaced", replaced, "rsync --backup", backup, 1.15);
+        fs::remove_all(source);
+    }
+
+    void Restored(int count) {
+        const std::string source = root_.Path("kept");
+        Fill(source, count, 4096);
+        Must(WrapperCopy(source));
+        fs::remove_all(source);
+        Must(Command({"command=\"ZEL_SyncFinish\"", "clientID=\"BENCH\"", "finishType=\"share\"",
+                      "name=\"data\""}));
+        const std::string back = root_.Path("back");
+        const auto empty = [&] {
+            fs::remove_all(back);
+            sync();
+        };
+        Contestant restore = {empty, [&] {
+                                  return RunProgram(
+                                      ZELCTL, {"restore", "--quiet", "--share", kShare, "--server",
+                                               "127.0.0.1", "--user", kUser, "--plain",
+                                               "--password-file", password_file_, "--to", back});
+                              }};
+        Contestant pull = {empty, [&] {
+                               return Bare(
+                                   {kQuick, "-rlptgoD", "--modify-window=-1", "-A", "-X",
+                                    "--numeric-ids", "--whole-file", "--timeout=600", kOurs},
+                                   {Server("plain/"), back + "/"});
+                           }};
+        Measure({&restore, &pull}, kCopyRuns);
+        Print("100,000 restored", restore, "rsync, the same options", pull, 1.1);
+        Must(StartShare());
+        EmptyCopy();
+        empty();
+    }
+
+    void Encrypted() {
+        if (!test::SshServer::Available()) {
+            std::puts("1 GB over TLS: this machine cannot run an ssh server to compare with");
+            return;
+        }
+        using namespace TARQ::Backup;
+        const test::SshServer ssh;
+        root_.Write("usr/tarq/etc/tarqrsync.conf",
+                    "[rsync]\nport=\"" + std::to_string(port_) + "\"\nssh_options=\"-F none -l " +
+                        ssh.User() + " -i " + ssh.ClientKey() + "\"\n");
+        const SshHostKey key = FetchHostKey("127.0.0.1", ssh.Port(), "", 10);
+        TrustServer({kSsh, ServerTransport::SSH, ssh.Port(), key.fingerprint}, key);
+        const std::string source = root_.Path("encrypted");
+        Fill(source, 8, 128 << 20);
+        const auto empty = [this] { EmptyCopy(); };
+        Contestant tls = {empty, [&] { return WrapperCopy(source, kTls); }};
+        Contestant over_ssh = {empty, [&] { return WrapperCopy(source, kSsh); }};
+        Measure({&tls, &over_ssh}, kCopyRuns);
+        Print("1 GB over TLS", tls, "the same over ssh", over_ssh, 1.0);
+        fs::remove_all(source);
     }
 
 private:
+    void EmptyCopy() const {
+        for (const auto& entry : fs::directory_iterator(copy_)) {
+            fs::remove_all(entry);
+        }
+        sync();
+    }
+
     void Copy(const char* what, const std::string& name, int count, size_t size) {
         const std::string source = root_.Path(name);
         Fill(source, count, size);
-        const auto empty = [this] {
-            fs::remove_all(copy_);
-            fs::create_directories(copy_);
-            sync();
-        };
+        const auto empty = [this] { EmptyCopy(); };
         Contestant wrapper = {empty, [&] { return WrapperCopy(source); }};
         Contestant quick = {empty, [&] { return BareCopy(source, {"--sockopts=TCP_NODELAY"}); }};
         Measure({&wrapper, &quick}, kCopyRuns);
@@ -208,6 +339,18 @@ private:
         Must(result.start_error == 0 && result.wait_status == 0);
     }
 
+    /// One of ours, as the client.
+    bool RunProgram(const char* program, Words arguments) const {
+        arguments.insert(arguments.begin(), program);
+        base::ChildSetup setup;
+        setup.program = program;
+        setup.arguments = std::move(arguments);
+        setup.environment = {"LC_ALL=C", "PATH=/usr/local/bin:/usr/bin:/bin",
+                             "TARQ_ROOT=" + root_.Path("")};
+        const auto result = base::RunChild(setup, nullptr, nullptr, nullptr);
+        return result.start_error == 0 && result.wait_status == 0;
+    }
+
     static void Prepare(TARQ::Backup::RsyncWrapper& wrapper, const std::string& module) {
         wrapper.setDelete(true);
         wrapper.setNumericIds(true);
@@ -217,21 +360,74 @@ private:
         wrapper.setDestPath(kUser, "127.0.0.1", kPassword, module, "");
     }
 
-    static bool Command(const std::list<std::string>& lines) {
+    // A second registry and second records, for Have(): those that are there and `count` more like
+    // kShare's.
+    void RegisterShares(int count) const {
+        const std::string registry = test::ReadFile(etc_ + "tarqZEL.info");
+        const std::string section = registry.substr(registry.find("[SHARE_data]"));
+        const std::string record = test::ReadFile(etc_ + "zel_server/shares/data");
+        fs::create_directories(etc_ + "zel_server/shares.other");
+        fs::copy(etc_ + "zel_server/shares/data", etc_ + "zel_server/shares.other/data");
+        std::ofstream more(etc_ + "tarqZEL.info.other");
+        more << registry;
+        for (int i = 0; i < count; ++i) {
+            const std::string name = "data" + std::to_string(i);
+            more << Renamed(section.substr(0, section.find("\n[") + 1), name);
+            std::ofstream(etc_ + "zel_server/shares.other/" + name) << Renamed(record, name);
+        }
+    }
+
+    // Puts the crowd of shares, or the one, in its place.
+    void Have(bool crowd) {
+        if (crowd == has_crowd_) {
+            return;
+        }
+        has_crowd_ = crowd;
+        for (const std::string& path : {etc_ + "tarqZEL.info", etc_ + "zel_server/shares"}) {
+            fs::rename(path, path + ".aside");
+            fs::rename(path + ".other", path);
+            fs::rename(path + ".aside", path + ".other");
+        }
+    }
+
+    static std::string Renamed(std::string text, const std::string& name) {
+        const std::string old = kShare;
+        for (size_t at = 0; (at = text.find(old, at)) != std::string::npos; at += name.size()) {
+            text.replace(at, old.size(), name);
+        }
+        return text;
+    }
+
+    static bool StartShare() {
+        return Command({"command=\"ZEL_SyncStart\"", "clientID=\"BENCH\"", "volumeName=\"\"",
+                        "shareName=\"data\""});
+    }
+
+    static void Name(TARQ::Backup::RsyncWrapper& wrapper, const char* server) {
+        TARQ::Backup::RunOptions options;
+        options.server = server;
+        options.keep_versions = true;  // the server takes no push without
+        wrapper.setRunOptions(options);
+    }
+
+    static bool Command(const std::list<std::string>& lines, const char* server = kPlain) {
         TARQ::Backup::RsyncWrapper wrapper;
         Prepare(wrapper, "");
+        Name(wrapper, server);
         wrapper.setTarqCustCmdRule(lines);
         return wrapper.execute([] { return false; }) == 0;
     }
 
-    bool WrapperCommand() const {
+    bool WrapperCommand(const char* server = kPlain) const {
         return Command({"command=\"ZEL_GetProtocolVer\"", "clientID=\"BENCH\"",
-                        "outfile=\"" + root_.Path("tmp/ZEL/out") + "\""});
+                        "outfile=\"" + root_.Path("tmp/ZEL/out") + "\""},
+                       server);
     }
 
-    bool WrapperCopy(const std::string& source) const {
+    bool WrapperCopy(const std::string& source, const char* server = kPlain) const {
         TARQ::Backup::RsyncWrapper wrapper;
         Prepare(wrapper, kShare);
+        Name(wrapper, server);
         wrapper.setTarqAcl(true);
         wrapper.setSrcPath(source + "/");
         return wrapper.execute([] { return false; }) == 0;
@@ -255,7 +451,7 @@ private:
     bool Bare(const Words& options, const Words& paths) const {
         base::ChildSetup setup;
         setup.program = base::FindProgram("rsync", "/usr/local/bin:/usr/bin:/bin");
-        setup.arguments = {"rsync", "--port=" + std::to_string(port_),
+        setup.arguments = {"rsync", "--port=" + std::to_string(peer_port_),
                            "--password-file=" + password_file_};
         setup.arguments.insert(setup.arguments.end(), options.begin(), options.end());
         setup.arguments.insert(setup.arguments.end(), paths.begin(), paths.end());
@@ -266,8 +462,13 @@ private:
 
     test::TempRoot root_;
     const std::string copy_ = root_.Path("storage/data");
+    const std::string etc_ = root_.Path("server/usr/tarq/etc/");
+    bool has_crowd_ = false;
     int port_;
-    test::ServerProcess daemon_;
+    int tls_port_;
+    int peer_port_;
+    test::ServerProcess server_;
+    test::ServerProcess peer_;
     std::string password_file_;
 };
 
@@ -275,9 +476,18 @@ private:
 
 int main(int argc, char** argv) {
     Bench bench;
+    if (argc > 1 && std::strcmp(argv[1], "--encrypted") == 0) {
+        bench.Encrypted();
+        return 0;
+    }
+    if (argc > 1 && std::strcmp(argv[1], "--versions") == 0) {
+        bench.Versions();
+        return 0;
+    }
     bench.Commands();
     bench.Unchanged();
     if (argc > 1 && std::strcmp(argv[1], "--copies") == 0) {
         bench.Copies();
     }
+    bench.Crowd();
 }

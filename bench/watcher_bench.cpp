@@ -110,6 +110,7 @@ void Search(int folders) {
         malloc_trim(0);                 // else what was freed before is used again
         const size_t before = ResidentBytes();
         Watcher watcher([](const std::string&, const std::string&) {},
+                        [](const std::string&, const std::string&, const std::string&) {},
                         [](const std::string&, const WatchLoss&) {});
         const Found found = WatchAll(watcher, root.Path("tree"), static_cast<size_t>(folders));
         bytes = i < 0 ? ResidentBytes() - before : bytes;

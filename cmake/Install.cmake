@@ -10,6 +10,10 @@ if(NOT ZEL_SYSTEM_PLATFORM)
 endif()
 install(TARGETS ${exported} EXPORT ZELTargets
     LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT libzel NAMELINK_COMPONENT libzel-dev)
+if(TARGET tarqrsync_connect)
+    install(TARGETS tarqrsync_connect tarqrsync_askpass
+        RUNTIME DESTINATION ${CMAKE_INSTALL_LIBDIR}/tarqrsync COMPONENT libzel)
+endif()
 install(EXPORT ZELTargets NAMESPACE ZEL:: DESTINATION ${CMAKE_INSTALL_LIBDIR}/cmake/ZEL COMPONENT libzel-dev)
 install(DIRECTORY ZEL DESTINATION ${CMAKE_INSTALL_INCLUDEDIR}
     COMPONENT libzel-dev FILES_MATCHING PATTERN "*.h" PATTERN "internal" EXCLUDE)
@@ -34,7 +38,7 @@ function(compress file to)
     execute_process(COMMAND ${GZIP} -9nc ${PROJECT_SOURCE_DIR}/${file} OUTPUT_FILE ${to} COMMAND_ERROR_IS_FATAL ANY)
 endfunction()
 
-# install_program(target component section [unit]): with its manual page, completion and unit.
+# install_program(target component section [unit...]): with its manual page, completion and units.
 function(install_program target component section)
     install(TARGETS ${target} RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR} COMPONENT ${component})
     compress(packaging/man/${target}.${section} ${CMAKE_BINARY_DIR}/packaging/${target}.${section}.gz)
@@ -44,14 +48,14 @@ function(install_program target component section)
         DESTINATION ${CMAKE_INSTALL_DATADIR}/bash-completion/completions COMPONENT ${component})
     list(APPEND ZEL_INSTALLED_${component} ${target})
     set(ZEL_INSTALLED_${component} ${ZEL_INSTALLED_${component}} PARENT_SCOPE)
-    if(ARGC GREATER 3)
+    foreach(unit IN LISTS ARGN)
         # The program's folder is known only now, when the prefix is.
         install(CODE "
             set(bindir \"\${CMAKE_INSTALL_PREFIX}/${CMAKE_INSTALL_BINDIR}\")
-            configure_file(\"${PROJECT_SOURCE_DIR}/packaging/${ARGV3}.in\" \"${CMAKE_BINARY_DIR}/${ARGV3}\" @ONLY)"
+            configure_file(\"${PROJECT_SOURCE_DIR}/packaging/${unit}.in\" \"${CMAKE_BINARY_DIR}/${unit}\" @ONLY)"
             COMPONENT ${component})
-        install(FILES ${CMAKE_BINARY_DIR}/${ARGV3} DESTINATION lib/systemd/system COMPONENT ${component})
-    endif()
+        install(FILES ${CMAKE_BINARY_DIR}/${unit} DESTINATION lib/systemd/system COMPONENT ${component})
+    endforeach()
 endfunction()
 
 if(ZEL_BUILD_PROGRAMS)
@@ -61,11 +65,11 @@ if(ZEL_BUILD_PROGRAMS)
     install_program(zelctl zel-client 1)
     # Parts of programs, which load them from where their libraries are.
     install(TARGETS zelctl_commands LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT zel-client)
-    install(TARGETS zel_server_commands LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT zel-server)
+    install(TARGETS zel_server_commands zel_versions_guard LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT zel-server)
     if(TARGET zel_daemon)
         install_program(zel_daemon zel-client 8 zel_daemon.service)
     endif()
-    install_program(zel_server zel-server 8 zel_rsyncd.service)
+    install_program(zel_server zel-server 8 zel_rsyncd.service zel_front.service)
 endif()
 
 # The loader finds what lies under /usr by itself; elsewhere libraries and programs find each other by their own path.

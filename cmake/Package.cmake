@@ -87,9 +87,9 @@ debian_package(zel-client admin "Shared-folder synchronisation between two NAS: 
 whenever something changes, or at once. zelctl keeps shares and tasks and
 shows what goes on; zel_daemon runs the tasks.")
 debian_package(zel-server admin "Shared-folder synchronisation between two NAS: server"
-"Receives the shared folders that paired clients push, over an rsync daemon of
-its own. zel_server sets it up, keeps its accounts and shows its clients and
-shares.")
+"Receives the shared folders that paired clients push, over TLS. zel_server
+sets it up, keeps its accounts and shows its clients and shares; HAProxy
+takes the connections, and rsync daemons of its own serve them.")
 
 # What packages of programs with these libraries depend on.
 file(WRITE ${papers}/libzel/shlibs "")
@@ -103,7 +103,7 @@ set(CPACK_DEBIAN_ZEL-CLIENT_PACKAGE_DEPENDS "rsync (>= 3.2.1)")
 set(CPACK_DEBIAN_ZEL-CLIENT_PACKAGE_RECOMMENDS "openssh-client")
 # Asks a server for its NetBIOS name; lists the shares of Samba.
 set(CPACK_DEBIAN_ZEL-CLIENT_PACKAGE_SUGGESTS "samba-common-bin")
-set(CPACK_DEBIAN_ZEL-SERVER_PACKAGE_DEPENDS "rsync (>= 3.2.1), passwd")
+set(CPACK_DEBIAN_ZEL-SERVER_PACKAGE_DEPENDS "haproxy (>= 2.2), rsync (>= 3.2.1), passwd")
 if(TARGET zel_daemon)
     package_unit(zel-client zel_daemon.service)
 endif()

@@ -1,22 +1,12 @@
 // A server's answer, and rsync's own output, as any server could make them.
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
 #include <string_view>
 
+#include "fuzz/require.h"
 #include "platform/tarqrsync/answer_file.h"
 #include "platform/tarqrsync/message_keeper.h"
 #include "platform/tarqrsync/output_parser.h"
-
-namespace {
-
-void Require(bool holds) {
-    if (!holds) {
-        std::abort();
-    }
-}
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     using namespace TARQ::Backup;

@@ -1,18 +1,12 @@
 // A certificate's name and a host name, a line each: what one covers of the other.
 #include <algorithm>
 #include <cstdint>
-#include <cstdlib>
 #include <string>
 
 #include "ZEL/internal/cert_name.h"
+#include "fuzz/require.h"
 
 namespace {
-
-void Require(bool holds) {
-    if (!holds) {
-        abort();
-    }
-}
 
 std::string Upper(std::string text) {
     std::transform(text.begin(), text.end(), text.begin(),

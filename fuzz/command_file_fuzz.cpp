@@ -1,19 +1,13 @@
 // The text of a server command: whatever is taken for one keeps the rules, and written down again
 // means the same.
 #include <cstdint>
-#include <cstdlib>
 #include <string>
 
+#include "fuzz/require.h"
 #include "programs/zel_server/command.h"
 #include "programs/zel_server/names.h"
 
 namespace {
-
-void Require(bool holds) {
-    if (!holds) {
-        abort();
-    }
-}
 
 std::string Line(const std::string& key, const std::string& value) {
     Require(value.find_first_of(std::string("\"\n\r\0", 4)) == std::string::npos);

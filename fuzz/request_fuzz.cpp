@@ -4,22 +4,16 @@
 #include <unistd.h>
 
 #include <cstdint>
-#include <cstdlib>
 
 #include "ZEL/log.h"
 #include "ZEL/stream.h"
+#include "fuzz/require.h"
 #include "programs/common/failure.h"
 #include "programs/zel_daemon/task_map.h"
 
 namespace {
 
 constexpr size_t kMaxInput = 32768;  // what a socket pair holds without a reader
-
-void Require(bool holds) {
-    if (!holds) {
-        abort();
-    }
-}
 
 bool Receive(const uint8_t* data, size_t size, ZEL::PObject& value) {
     int fds[2];

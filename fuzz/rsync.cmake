@@ -1,1 +1,2 @@
 fuzz_target(answer_file_fuzz answer_file_fuzz.cpp LIBRARIES tarqrsync_parts)
+fuzz_target(servers_file_fuzz servers_file_fuzz.cpp LIBRARIES tarqrsync_parts)

@@ -3,12 +3,12 @@
 //
 //   build/fuzz/bin/section_file_fuzz fuzz/corpus/section_file
 #include <cstdint>
-#include <cstdlib>
 #include <cstring>
 #include <map>
 #include <memory>
 
 #include "base/section_view.h"
+#include "fuzz/require.h"
 #include "platform/tarqcore/section_edit.h"
 #include "platform/tarqcore/section_image.h"
 #include "tests/support/string_hash.h"
@@ -22,12 +22,6 @@ using tarqcore::SectionImage;
 constexpr size_t kSectionsWritten = 16;
 
 using Values = std::map<std::string, std::string>;
-
-void Require(bool holds) {
-    if (!holds) {
-        abort();
-    }
-}
 
 std::unique_ptr<SectionImage> MakeImage(std::string_view text) {
     std::unique_ptr<char[]> copy(new char[text.size()]);

@@ -1,12 +1,26 @@
 #include <linux/filter.h>
 #include <linux/seccomp.h>
+#include <sys/file.h>
 #include <sys/prctl.h>
 #include <sys/syscall.h>
 
+#include "base/file_lock.h"
 #include "base/open_beneath.h"
 #include "base/replace_file.h"
 #include "base/whole_file.h"
 #include "tests/support/testing.h"
+
+namespace {
+
+bool slow_lock = false;
+
+}  // namespace
+
+/// In front of the C library's: time for somebody else to come between a new file and its lock.
+extern "C" int flock(int fd, int operation) {
+    usleep(slow_lock ? 3000 : 0);
+    return static_cast<int>(syscall(SYS_flock, fd, operation));
+}
 
 namespace {
 
@@ -156,6 +170,68 @@ TEST(ReplaceFileTest, TakesTheModeThatIsGivenAndLeavesDevicesAndLinksTargetsAlon
     EXPECT_TRUE(fs::is_fifo(files.Path("to_pipe")));
     // Nothing is left beside them.
     EXPECT_EQ(std::distance(fs::directory_iterator(files.Path("")), fs::directory_iterator()), 4);
+}
+
+TEST(ReplaceFileTest, NobodyElseCanLockTheNewFileAndKeepItsName) {
+    const test::TempFolder files;
+    const std::string path = files.Path("file");
+    ASSERT_EQ(chmod(files.Path().c_str(), 0755), 0);
+    const pid_t stranger = fork();
+    if (stranger == 0) {
+        const bool other = setuid(65534) == 0;
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        for (int fd = -1; other;) {
+            for (int name = 0; name < 16; ++name) {
+                fd = open((files.Path(".file.tmp") + std::to_string(name)).c_str(), O_RDONLY);
+                fd >= 0 && flock(fd, LOCK_EX | LOCK_NB) != 0 && close(fd) == 0;
+            }
+        }
+        _exit(1);
+    }
+    slow_lock = true;
+    for (int i = 0; i < 40; ++i) {
+        unlink(path.c_str());
+        EXPECT_TRUE(base::ReplaceFile(path, {"new"}, nullptr)) << strerror(errno);
+    }
+    slow_lock = false;
+    EXPECT_EQ(test::ModeOf(path), 0644U);
+    kill(stranger, SIGKILL);
+    waitpid(stranger, nullptr, 0);
+}
+
+TEST(FileLockTest, EndsAWaitInTimeAndTakesNoStrangersFile) {
+    using std::chrono::milliseconds;
+    const test::TempFolder files;
+    const std::string path = files.Path("lock");
+    base::FileLock first(path, milliseconds(0));
+    ASSERT_TRUE(first);
+    EXPECT_FALSE(base::FileLock(path, milliseconds(30)));
+    EXPECT_EQ(errno, EWOULDBLOCK);
+    EXPECT_EQ(base::FileLock(path, milliseconds(0)).Problem(),
+              path + " is not free: process " + std::to_string(getpid()) + " (base_test) holds it");
+    // Who waits gets it, and not one that holds a file which has gone.
+    std::thread waits([&] { EXPECT_TRUE(base::FileLock(path, std::chrono::seconds(20))); });
+    usleep(20'000);
+    fs::rename(path, files.Path("gone"));
+    base::FileLock second(path, milliseconds(0));
+    EXPECT_TRUE(second);
+    first.Release();
+    usleep(20'000);
+    EXPECT_FALSE(base::FileLock(path, milliseconds(0)));
+    second.Release();
+    waits.join();
+
+    ASSERT_EQ(chmod(path.c_str(), 0644), 0) << "anybody may open it, and so lock it";
+    fs::create_symlink("gone", files.Path("link"));
+    ASSERT_EQ(mkfifo(files.Path("pipe").c_str(), 0600), 0);
+    files.Write("strangers", "");
+    EXPECT_EQ(chmod(files.Path("strangers").c_str(), 0600), 0);
+    ASSERT_EQ(geteuid() == 0 ? chown(files.Path("strangers").c_str(), 65534, 65534) : 0, 0);
+    for (const char* name : {"lock", "link", "pipe", "", "missing/lock"}) {
+        EXPECT_FALSE(base::FileLock(files.Path() + "/" + name, milliseconds(0))) << name;
+    }
+    EXPECT_EQ(base::FileLock(files.Path("strangers"), milliseconds(0)).operator bool(),
+              geteuid() != 0);
 }
 
 }  // namespace

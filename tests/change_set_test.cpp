@@ -52,24 +52,6 @@ TEST(ChangeSet, KeepsOnlyWhatNothingElseCovers) {
     }
 }
 
-TEST(ChangeSet, TakesNoMoreThanSixteenAndJoinsTheDeepestFirst) {
-    const Paths kSixteen = Many("/a/b", 16);
-    EXPECT_EQ(Folded(kSixteen).size(), 16u);
-    EXPECT_THAT(Folded(kSixteen + Paths{"/a/b/x"}), ElementsAre("/a/b"));
-    // The deep folder goes; what lies wider apart stays.
-    EXPECT_THAT(Folded(Many("/a/b/c", 8) + Paths{"/a/b2", "/x/1", "/x/2"} + Many("/y", 6)),
-                ElementsAre("/a/b/c", "/a/b2", "/x/1", "/x/2", "/y/0", "/y/1", "/y/2", "/y/3",
-                            "/y/4", "/y/5"));
-    // Of equally deep ones the fullest, and no more than are needed.
-    EXPECT_THAT(Folded(Many("/a", 3) + Many("/b", 12) + Many("/c", 2)),
-                ElementsAre("/a/0", "/a/1", "/a/2", "/b", "/c/0", "/c/1"));
-    // A joint within a joint: the inner one is not enough.
-    EXPECT_THAT(Folded(Many("/a/b", 16) + Many("/a/b/c/d", 2) + Paths{"/a/c"}),
-                ElementsAre("/a/b", "/a/c"));
-    // Neighbours below names that begin alike share no folder but the whole.
-    EXPECT_THAT(Folded(Many("/ab", 1) + Many("/a", 1) + Many("", 20)), ElementsAre("/"));
-}
-
 TEST(ChangeSet, AFloodCostsOnlyTheFolderThatItIsIn) {
     ChangeSet set;
     for (const std::string& path :
@@ -84,9 +66,9 @@ TEST(ChangeSet, AFloodCostsOnlyTheFolderThatItIsIn) {
 TEST(ChangeSet, CoversAllThatWasAdded) {
     for (unsigned int seed = 0; seed < 30; ++seed) {
         std::mt19937 random(seed);
-        const unsigned int names = 2 + seed % 7;
+        const unsigned int names = 2 + seed % 11;
         Paths added;
-        for (int i = seed % 3 == 0 ? 20000 : 60; i > 0; --i) {
+        for (int i = seed % 3 == 0 ? 100000 : 60; i > 0; --i) {
             std::string path;
             for (auto depth = 1 + random() % 6; depth > 0; --depth) {
                 path += "/" + std::to_string(random() % names);
@@ -94,7 +76,7 @@ TEST(ChangeSet, CoversAllThatWasAdded) {
             added.push_back(path);
         }
         const Paths taken = Folded(added);
-        EXPECT_LE(taken.size(), ChangeSet::kMaxTaken);
+        EXPECT_LE(taken.size(), ChangeSet::kMaxHeld);
         EXPECT_TRUE(std::is_sorted(taken.begin(), taken.end()));
         const auto covers = [](const std::string& folder, const std::string& path) {
             return folder == "/" || path == folder || path.rfind(folder + "/", 0) == 0;
@@ -117,12 +99,22 @@ TEST(ChangeSet, DeepPathsAndHostileOrderDoNoHarm) {
     set.Add(deep + "/x");
     set.Add(deep + "/y");
     EXPECT_THAT(set.Take(), ElementsAre(deep + "/x", deep + "/y"));
-    // One path in each of many folders, the last first, again and again beyond what is held.
+    // One path in each of many folders, the last first, beyond what is held; the deepest and the
+    // closest are joined, and no more than need be.
     Paths folders;
-    for (int i = 50000; i > 0; --i) {
+    for (int i = 70000; i > 0; --i) {
         folders.push_back("/" + std::to_string(i % 20) + "/" + std::to_string(i) + "/x");
     }
-    EXPECT_EQ(Folded(folders + Paths{"/other"}).size(), 1u);
+    const Paths taken = Folded(folders + Paths{"/other"});
+    EXPECT_THAT(taken, AllOf(Contains("/other"), Contains("/0"), SizeIs(Lt(65536u))));
+    // Long names fill a set as well as many.
+    const std::string long_name(200, 'n');
+    Paths names;
+    for (int i = 0; i < 60000; ++i) {
+        names.push_back("/" + std::to_string(i % 3) + "/" + long_name + "/" + long_name +
+                        std::to_string(i));
+    }
+    EXPECT_LT(Folded(names).size(), 50000u);
 }
 
 }  // namespace

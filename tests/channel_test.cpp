@@ -255,29 +255,3 @@ TEST(Channel, TlsFilesHaveTheirDefaultsBelowTheRoot) {
     EXPECT_EQ(Channel::GetCAPath(), root.Path("certs.pem"));
     EXPECT_TRUE(Channel(16).IsAllowingUntrust());
 }
-
-TEST(Patience, LooksForAMomentAndLessOftenAfterEachTimeInVain) {
-    ZEL::Patience patience;
-    int asked = 0;
-    const auto looks = [&](const int* flag, bool comes) {
-        asked = 0;
-        patience.LookForAMoment(flag, [&] {
-            ++asked;
-            return comes;
-        });
-        return asked > 0;
-    };
-    EXPECT_TRUE(looks(nullptr, true));
-    EXPECT_EQ(asked, 1);
-    for (const int skipped : {1, 3, 7, 15, 31, 63, 127, 255, 255}) {
-        EXPECT_TRUE(looks(nullptr, false));
-        for (int i = 0; i < skipped; ++i) {
-            EXPECT_FALSE(looks(nullptr, true)) << skipped;
-        }
-    }
-    EXPECT_TRUE(looks(nullptr, true));
-    EXPECT_TRUE(looks(nullptr, true)) << "no longer in vain";
-    const int flag = 1;
-    EXPECT_TRUE(looks(&flag, false));
-    EXPECT_EQ(asked, 1);
-}

@@ -1,6 +1,6 @@
 # The daemon's parts, and the daemon as a whole.
 if(ZEL_BUILD_PROGRAMS)
-    foreach(part IN ITEMS change_set store task_machine watcher)
+    foreach(part IN ITEMS change_set store task_machine verify_slice watcher)
         zel_test(${part}_test ${part}_test.cpp LIBRARIES daemon_parts)
     endforeach()
 
@@ -12,5 +12,9 @@ if(ZEL_BUILD_PROGRAMS)
     zel_test(service_test service_test.cpp LIBRARIES test_whole daemon_parts LABELS threads)
     # ZEL_STRESS_SECONDS says how large the bursts of changes are.
     zel_test(daemon_test integration/daemon_test.cpp
-        LIBRARIES test_daemon test_whole daemon_parts TIMEOUT 600 LABELS integration)
+        LIBRARIES test_daemon test_whole daemon_parts TIMEOUT 600 SHARDS 3 LABELS integration)
+    zel_test(recover_test integration/recover_test.cpp
+        LIBRARIES test_daemon test_whole TIMEOUT 300 LABELS integration)
+    zel_test(brake_test integration/brake_test.cpp
+        LIBRARIES test_daemon test_whole TIMEOUT 300 LABELS integration)
 endif()

@@ -9,33 +9,8 @@
 using namespace testing;
 using ZEL::IPCListener;
 using ZEL::IPCSender;
-using ZEL::PObject;
 
-namespace {
-
-// The listener's side answers one request with {"echo": request} and closes.
-void ExpectEcho(IPCListener& listener, IPCSender& sender) {
-    std::thread server([&listener] {
-        IPCSender peer;
-        PObject request, reply;
-        EXPECT_TRUE(listener.isReady());
-        EXPECT_EQ(peer.assign(listener.accept()), 0);
-        EXPECT_EQ(peer.recv(request), 0);
-        reply["echo"] = request;
-        peer.send(reply);
-    });
-    PObject request, reply;
-    request["n"] = 7;
-    EXPECT_EQ(sender.send(request, true, reply), 0);
-    EXPECT_EQ(reply.toString(), "{\"echo\": {\"n\": 7}}");
-    server.join();
-    EXPECT_EQ(sender.send(request, true, reply), -1) << "the peer has closed";
-    sender.close();
-}
-
-}  // namespace
-
-TEST(Ipc, RequestsAreAnsweredOverAPathAndOverAPort) {
+TEST(Ipc, ListensAtAPathOrOnAPort) {
     const test::TempFolder folder;
     IPCListener listener;
     EXPECT_FALSE(listener.isReady());
@@ -48,14 +23,15 @@ TEST(Ipc, RequestsAreAnsweredOverAPathAndOverAPort) {
     EXPECT_EQ(sender.connect(folder.Path("none")), -1);
     EXPECT_EQ(sender.assign(-1), -1);
     ASSERT_EQ(sender.connect(path), 0);
-    ExpectEcho(listener, sender);
+    EXPECT_TRUE(listener.isReady());
+    sender.close();
 
     const int port = listener.prepare(0);
     ASSERT_GT(port, 0);
     EXPECT_NE(access(path.c_str(), F_OK), 0) << "the old socket file is gone";
     EXPECT_EQ(sender.connect(-1), -1);
-    ASSERT_EQ(sender.connect(port), 0);
-    ExpectEcho(listener, sender);
+    EXPECT_EQ(sender.connect(port), 0);
+    close(listener.accept());
     listener.setTimeout({0, 0});
     EXPECT_FALSE(listener.isReady());
     listener.close();

@@ -115,6 +115,9 @@ TEST_F(Log, KeepsOneRotatedFileFewerThanTheCount) {
             WriteLine(0x100001, fill);
         }
         EXPECT_EQ(FirstLetters(), letters) << rotate_count;
+        for (const auto& file : fs::directory_iterator(folder_.Path())) {
+            EXPECT_EQ(fs::status(file).permissions() & fs::perms(0037), fs::perms(0)) << file;
+        }
     }
 }
 

@@ -4,6 +4,7 @@
 #include <sys/resource.h>
 
 #include "ZEL/is_syncedshare.h"
+#include "tarq/owners.h"
 #include "tests/support/string_hash.h"
 #include "tests/support/testing.h"
 
@@ -68,6 +69,28 @@ TEST_F(Crash, AWriterKilledAtAnySystemCallLeavesTheOldFileOrTheNewOne) {
         EXPECT_THAT(Entries(), testing::ElementsAre("tarqZEL.info")) << "what was left is gone";
     }
     EXPECT_TRUE(saw_old && saw_new && saw_left_over);
+}
+
+TEST_F(Crash, WritersInManyProcessesLoseNothing) {
+    constexpr int kWriters = 6;
+    constexpr int kWrites = 50;
+    std::vector<pid_t> writers(kWriters);
+    for (pid_t& writer : writers) {
+        writer = fork();
+        for (int i = 0; writer == 0; ++i) {
+            const std::string share = std::to_string(getpid()) + "." + std::to_string(i);
+            const bool written = ZELServerUpdateShare(share.c_str(), Hash{{"k", "v"}}) == 0;
+            if (!written || i + 1 == kWrites) {
+                _exit(written ? 0 : 1);
+            }
+        }
+    }
+    for (const pid_t writer : writers) {
+        int status = 0;
+        EXPECT_TRUE(waitpid(writer, &status, 0) == writer && status == 0);
+    }
+    const TARQ::ListOwner sections(KAPICSzListAlloc(0));
+    EXPECT_EQ(KAPICFileEnumSection(path_.c_str(), sections.get()), kWriters * kWrites);
 }
 
 /// Makes the folder a file system of 64 KiB, where that is allowed; otherwise no file may grow

@@ -6,3 +6,5 @@ if(TARGET tarqrsync_parts)
 endif()
 zel_test(rsync_wrapper_test integration/rsync_wrapper_test.cpp
     LIBRARIES test_syslog test_servers tarqrsync TIMEOUT 300 LABELS integration)
+target_compile_definitions(rsync_wrapper_test PRIVATE
+    CONNECT="$<TARGET_FILE_DIR:tarqrsync>/tarqrsync/connect")

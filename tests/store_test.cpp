@@ -283,33 +283,6 @@ TEST_F(StoreTest, AStoreThatWasLostIsNoFreshStart) {
     EXPECT_EQ(fault(), "none");
 }
 
-TEST_F(StoreTest, DamageFurtherInIsToldWhenItIsMet) {
-    const uint64_t task = store_->AddTask(Task("a"));
-    for (int i = 0; i < 3000; ++i) {
-        store_->AddEvents(task, "s", {"/" + std::to_string(i) + std::string(500, 'x')});
-    }
-    store_.reset();
-    const std::string sound = test::ReadFile(path_);
-    std::mt19937 random(1);
-    int faults = 0;
-    for (int i = 0; i < 60; ++i) {
-        std::string content = sound;
-        const size_t page = random() % (sound.size() / 4096 - 12) + 12;
-        for (int j = 0; j < 400; ++j) {
-            content[page * 4096 + random() % 4096] = static_cast<char>(random());
-        }
-        folder_.Write("daemon/tasks.db", content);
-        const std::string fault = Fault([&] {
-            Store store(path_);
-            store.PendingEvents(task);
-            store.RemoveTask(task);
-        });
-        faults += fault != "none";
-        EXPECT_THAT(fault, testing::AnyOf("none", HasSubstr("the file is damaged")));
-    }
-    EXPECT_GT(faults, 10);
-}
-
 TEST_F(StoreTest, AListThatSomebodyBrokeIsTold) {
     store_->AddTask(Task("a"));
     for (const char* list : {"[\"a\"", "{}", "[1]", "[[\"a\"]]", "\"a\""}) {

@@ -1,5 +1,7 @@
 #include "ZEL/stream.h"
 
+#include <malloc.h>
+
 #include <new>
 
 #include "ZEL/log.h"
@@ -17,6 +19,8 @@ using ZEL::PStream;
 namespace {
 
 std::atomic<int> allocations{0};
+std::atomic<size_t> memory_held{0};
+std::atomic<size_t> most_memory_held{0};
 
 }  // namespace
 
@@ -24,16 +28,19 @@ std::atomic<int> allocations{0};
 __attribute__((visibility("default"), noinline)) void* operator new(size_t size) {
     ++allocations;
     if (void* memory = malloc(size)) {
+        most_memory_held =
+            std::max(most_memory_held.load(), memory_held += malloc_usable_size(memory));
         return memory;
     }
     throw std::bad_alloc();
 }
 __attribute__((visibility("default"), noinline)) void operator delete(void* memory) noexcept {
+    memory_held -= malloc_usable_size(memory);
     free(memory);
 }
 __attribute__((visibility("default"), noinline)) void operator delete(void* memory,
                                                                       size_t) noexcept {
-    free(memory);
+    operator delete(memory);
 }
 
 namespace {
@@ -199,13 +206,51 @@ TEST(PStream, DeepNestingIsSentInFullAndReceivedTo512Levels) {
     }
 }
 
-TEST(PStream, TheTraceIsIndentedToElevenLevels) {
+TEST(PStream, APeerCannotMakeItHoldManyTimesOfWhatHeSends) {
+    const auto receive = [](const std::string& element, size_t bytes) {
+        std::string wire = "\x41";
+        while (wire.size() < bytes) {
+            wire += element;
+        }
+        wire += "\x40";
+        RawPeer peer;
+        std::thread sender([&] { send(peer.fd, wire.data(), wire.size(), MSG_NOSIGNAL); });
+        most_memory_held = memory_held.load();
+        PObject value;
+        const size_t before = memory_held;
+        const int result = PStream().Recv(peer.channel, value);
+        EXPECT_LT(most_memory_held - before, PStream::kFreeMemory + 9 * wire.size())
+            << Hex(element);
+        peer.channel.Close();
+        sender.join();
+        return result;
+    };
+    for (const char* element : {"41 40", "42 40", "41 41 40 40", "42 10 00 00 42 40 40", "00 00",
+                                "10 00 00", "41 01 00 40"}) {
+        EXPECT_EQ(receive(Unhex(element), 6 << 20), ZEL::RESULT_PROTOCOL) << element;
+    }
+    const std::string task =
+        Unhex("42 10 00 02 69 64 01 01 07 10 00 04 6e 61 6d 65 10 00 02 6e 61 40");
+    EXPECT_EQ(receive(task, 2 << 20), 0);
+    EXPECT_EQ(receive(Unhex("10 00 20 " + Repeat("61 ", 32)), 20 << 20), 0);
+}
+
+TEST(PStream, TheTraceIsIndentedToElevenLevelsAndShowsNoPassword) {
     const test::LogCapture log;
     PObject value;
     ASSERT_EQ(Receive(Unhex(Repeat("41 ", 13) + "01 01 07" + Repeat(" 40", 13)), value), 0);
     RawPeer peer;
     ASSERT_EQ(PStream().Send(peer.channel, value), 0);
+    const PObject secret = Map({{"pswd", Map({{"nested", "top secret"}})}, {"told", "not secret"}});
+    RawPeer second;
+    ASSERT_EQ(PStream().Send(second.channel, secret), 0);
+    second.channel.Close();
+    PObject received;
+    ASSERT_EQ(Receive(second.Take(0), received), 0);
+    EXPECT_EQ(received.toString(), secret.toString());
+    EXPECT_THAT(log.Text(), Not(HasSubstr("top secret")));
     const std::string tag = "[DEBUG] ZEL/stream(N): ";
+    EXPECT_THAT(log.Lines(), Contains(tag + "  \"not secret\"").Times(2));
     EXPECT_THAT(log.Lines(), Contains(tag + "  [").Times(2)) << "once received, once sent";
     EXPECT_THAT(log.Lines(), Contains(tag + std::string(22, ' ') + "[").Times(4));
     EXPECT_THAT(log.Lines(), Contains(tag + std::string(22, ' ') + "7").Times(2));

@@ -40,7 +40,7 @@ TEST(TaskMap, IsFlatAndBringsEveryFieldBack) {
     EXPECT_EQ(
         obj.toString(),
         R"({"block": 0, "compress": 1, "id": 18446744073709551615, "max_bandwidth": 4294967295, )"
-        R"("name": "nightly", "period_hour": 1, "period_minute": 30, "pswd": "secret", )"
+        R"("name": "nightly", "period_hour": 1, "period_minute": 30, "pswd": "secret words", )"
         R"("repeat_times_in_day": 3, "rsync_timeout": 900, "schedule_begin_day": 29, )"
         R"("schedule_begin_hour": 8, "schedule_begin_min": 30, "schedule_begin_month": 2, )"
         R"("schedule_begin_year": 2016, "schedule_mode": 4, "server_ip": "10.0.0.5", )"
@@ -59,7 +59,7 @@ TEST(TaskMap, MissingKeysGiveDefaultsButKeepTheId) {
     PObject user;
     user["user"] = "max";
     ZEL::PObj2SyncInfo(user, info);
-    EXPECT_EQ(info.GetUser() + info.GetPassword(), "maxsecret");
+    EXPECT_EQ(info.GetUser() + info.GetPassword(), "maxsecret words");
 
     ZEL::TASK_STATUS status = ZEL::TASK_STATUS_PAUSED;
     ZEL::TASK_RESULT result = ZEL::TASK_RESULT_FAILED;

@@ -131,7 +131,9 @@ TEST(Explanation, ComesFromTheWordsAndTheKindOfRun) {
               "nas closed the connection"},
              {copy, 77, "", 77, "rsync failed with exit code 77"},
          }) {
-        const Verdict verdict = Judge({settings, base::RsyncConfig(), exit_code, messages});
+        const Route route = {"nas", settings.ssh ? Transport::DAEMON_OVER_SSH : Transport::DAEMON,
+                             settings.ssh ? 22 : 873, "", false};
+        const Verdict verdict = Judge({settings, route, base::RsyncConfig(), exit_code, messages});
         EXPECT_EQ(verdict.status, status) << messages;
         EXPECT_THAT(verdict.first_line, StartsWith(first_line));
     }
@@ -142,11 +144,13 @@ TEST(Explanation, ComesFromTheWordsAndTheKindOfRun) {
                              "Too many levels of symbolic links (40)\n" +
                              "ERROR: z failed verification -- update discarded.\n\n" +
                              "rsync error: some files/attrs were not transferred (see above)\n";
-    EXPECT_EQ(Judge({copy, base::RsyncConfig(), 23, busy}).cause, RunCause::BUSY_SOURCE);
+    const Route route;
+    EXPECT_EQ(Judge({copy, route, base::RsyncConfig(), 23, busy}).cause, RunCause::BUSY_SOURCE);
     EXPECT_EQ(
-        Judge({copy, base::RsyncConfig(), 23, busy + open + "Permission denied (13)\n"}).cause,
+        Judge({copy, route, base::RsyncConfig(), 23, busy + open + "Permission denied (13)\n"})
+            .cause,
         RunCause::UNREADABLE_SOURCE);
-    EXPECT_EQ(Judge({copy, base::RsyncConfig(), 23, denied}).cause, RunCause::NONE);
+    EXPECT_EQ(Judge({copy, route, base::RsyncConfig(), 23, denied}).cause, RunCause::NONE);
 }
 
 /// What only odd names and addresses show: plain ones are seen to work against real servers.
@@ -163,20 +167,22 @@ TEST(Arguments, OddNamesAndAddressesComeThrough) {
     settings.module = "data";
     settings.source = "rel:ative";
     const auto build = [&] {
-        return CopyInvocation({settings, config, {}, false, false, ""}, &folder);
+        const RunOptions options;
+        const Route route = RouteOf(settings, options, config);
+        return CopyInvocation({settings, route, config, options, false, false, ""}, &folder);
     };
     Invocation made = build();
     EXPECT_THAT(std::vector<std::string>(made.arguments.end() - 3, made.arguments.end()),
                 ElementsAre("--", "./rel:ative", "bob@[fe80::1%eth0]::data/"));
 
     settings.ssh = true;
+    settings.password.clear();
     made = build();
     EXPECT_THAT(made.environment,
-                Contains(AllOf(StartsWith("RSYNC_CONNECT_PROG='ssh' '-J' 'it'\\''s'"),
+                Contains(AllOf(StartsWith("RSYNC_CONNECT_PROG=exec 'ssh' '-J' 'it'\\''s'"),
                                EndsWith("'-W' '127.0.0.1:873' '--' 'fe80::1%%eth0'"))));
 
     settings.module = "/a dir";
-    settings.password.clear();
     made = build();
     EXPECT_THAT(made.arguments, Contains(AllOf(StartsWith("--rsh='ssh' '-J' 'it''s'"),
                                                HasSubstr("BatchMode=yes"))));
@@ -248,7 +254,7 @@ TEST(ChildProcess, EndsWithItsWholeGroupHoweverTheRunEnds) {
     EXPECT_TRUE(gone(pid));
 
     int asked = 0;
-    pid = Shell("sleep 100 & echo $!; wait", &result, {}, [&asked] { return ++asked > 2; });
+    pid = Shell("sleep 100 & echo $!; wait", &result, {}, [&asked] { return ++asked > 10; });
     EXPECT_TRUE(result.cancelled);
     EXPECT_TRUE(gone(pid));
     Shell("exit 0", &result, {}, [] { return true; });

@@ -23,6 +23,8 @@ const programs::RunFailure kAway = {FailureKind::kLocal, 0, "not mounted", Reach
 const programs::RunFailure kBusy = {FailureKind::kBusy, 23, "busy", Reach::kPaths};
 const programs::RunFailure kUnreadable = {FailureKind::kFailed, 23, "unreadable", Reach::kPaths};
 const programs::RunFailure kDown = {FailureKind::kFailed, 10, "refused", Reach::kRun};
+const programs::RunFailure kTalkative = {FailureKind::kRefused, 212, std::string(70000, 'x'),
+                                         Reach::kRun, std::string(70000, 'y')};
 
 class TaskMachineTest : public testing::Test {
 protected:
@@ -68,6 +70,7 @@ protected:
     std::string Pass(int64_t seconds) {
         const int64_t end = clock_.elapsed + seconds * 1000;
         for (int i = 0; i < 20000; ++i) {
+            Search();
             const Step step = machine_->NextStep();
             if (step.kind != Step::Kind::kWait && (step.kind != Step::Kind::kRun || !no_room_)) {
                 Do(step);
@@ -79,6 +82,13 @@ protected:
             }
         }
         throw std::runtime_error("it goes round and round");
+    }
+    /// What is to be searched, is, unless a run is under way.
+    void Search() {
+        const std::map<std::string, uint64_t> shares = machine_->ToSearch();
+        for (const auto& [share, number] : machine_->Running() ? decltype(shares)() : shares) {
+            machine_->Searched(share, number, indexed_);
+        }
     }
     /// How many runs Pass() has told.
     static size_t Count(const std::string& sent) {
@@ -97,7 +107,8 @@ protected:
     bool hold_ = false;       // a run lasts until End()
     bool disk_full_ = false;  // nothing can be stored
     int rescans_ = 0;
-    std::optional<programs::RunFailure> down_;                        // no run comes further
+    std::optional<int64_t> indexed_;            // a search finds all there is, see Searched()
+    std::optional<programs::RunFailure> down_;  // no run comes further
     std::map<std::string, programs::RunFailure> bad_;                 // "share", or "share/path"
     std::map<std::pair<std::string, std::string>, uint64_t> stored_;  // changes, and their numbers
 
@@ -137,18 +148,21 @@ private:
         machine_->ChangesStored();
     }
     std::optional<RunPlan> Begin(const Step& step) {
-        return machine_->Begin(step, [&](const std::string& share, uint64_t after) {
-            std::vector<ZEL::Event> events;
-            for (const auto& [what, id] : stored_) {
-                if (what.first == share && id > after) {
-                    ZEL::Event& event = events.emplace_back();
-                    event.SetID(id);
-                    event.SetShareName(share);
-                    event.SetRelativePath(what.second);
+        return machine_->Begin(
+            step,
+            [&](const std::string& share, uint64_t after) {
+                std::vector<ZEL::Event> events;
+                for (const auto& [what, id] : stored_) {
+                    if (what.first == share && id > after) {
+                        ZEL::Event& event = events.emplace_back();
+                        event.SetID(id);
+                        event.SetShareName(share);
+                        event.SetRelativePath(what.second);
+                    }
                 }
-            }
-            return events;
-        });
+                return events;
+            },
+            [](const std::string&) { return std::vector<zel_daemon::StoredMove>(); });
     }
     void Start(std::optional<RunPlan> plan) {
         if (!plan) {
@@ -379,9 +393,11 @@ TEST_F(TaskMachineTest, WhatAPersonCancelsIsOver) {
     End();
     EXPECT_EQ(machine_->Last()->result, ZEL::TASK_RESULT_CANCELLED);
     EXPECT_EQ(Pass(3600), "");
-    for (const programs::RunFailure& failure : {kDown, kRefused}) {  // one that waits for its retry
+    for (const programs::RunFailure& failure :
+         {kDown, kTalkative}) {  // one that waits for its retry
         down_ = failure;
         EXPECT_EQ(Ask(), "request a/");
+        EXPECT_LE(machine_->Last()->error.size() + machine_->Last()->details.size(), 50000U);
         EXPECT_TRUE(machine_->Cancelled());
         EXPECT_FALSE(machine_->UntilRetry());
         EXPECT_EQ(Pass(3600), "");
@@ -438,6 +454,7 @@ TEST_F(TaskMachineTest, ChangesAreSentOnceItIsQuietAndAFloodAllTheSame) {
 TEST_F(TaskMachineTest, ALossOfTheWatchOrAFailedResyncLeadsToAResync) {
     HaveRealtime({"a", "b"});
     machine_->Lost("a", false);
+    Search();
     EXPECT_EQ(State("a"), ShareState::kUnknown);
     EXPECT_EQ(State("b"), ShareState::kTracked);
     EXPECT_EQ(Change("b", "/x"), "change a/ b/x");
@@ -493,6 +510,26 @@ TEST_F(TaskMachineTest, WhatIsNotWatchedIsResyncedNowAndThen) {
     EXPECT_EQ(Pass(kDay), "change a/ b/");
 }
 
+TEST_F(TaskMachineTest, WhatIsWatchedIsComparedWholeEveryWeekUnlessSet) {
+    HaveRealtime({"a", "b"});
+    const int64_t first = machine_->Record().compared;
+    EXPECT_GT(first, 0);
+    Pass(kDay);
+    machine_->Lost("b", false);
+    EXPECT_EQ(Pass(0), "change b/");
+    EXPECT_EQ(machine_->Record().compared, first) << "not all of it";
+    bad_ = {{"a", kRefused}};
+    EXPECT_EQ(Pass(6 * kDay), "change a/");
+    bad_.clear();
+    EXPECT_EQ(Pass(kDay), "retry a/, change b/");
+    EXPECT_GE(machine_->Record().compared, first + 7 * kDay);
+    zel_daemon::TaskRecord never = machine_->Record();
+    never.own["compare_days"] = 0;
+    machine_->Edited(never);
+    EXPECT_EQ(Pass(0), "change a/ b/");
+    EXPECT_EQ(Pass(100 * kDay), "");
+}
+
 TEST_F(TaskMachineTest, AfterARestartAllIsResyncedAndWhatWasCutOffMadeUpFor) {
     HaveRealtime();
     down_ = kDown;
@@ -511,6 +548,31 @@ TEST_F(TaskMachineTest, AfterARestartAllIsResyncedAndWhatWasCutOffMadeUpFor) {
     EXPECT_EQ(Pass(15), "retry a/");
     machine_->Edited(machine_->Record());
     EXPECT_EQ(Pass(kDay), "");
+
+    // What the index of a share tells is all that is sent, and until it is due, nothing is
+    // compared.
+    indexed_ = clock_.Now() - 3 * kDay;
+    Have(Make("realtime", "", 0), {"a", "b"});
+    machine_->Restored(true, failed);
+    stored_ = {{{"a", "/stored"}, 1}};
+    EXPECT_FALSE(machine_->IsAtRest("b"));
+    const uint64_t before = machine_->ToSearch().at("b");
+    machine_->Lost("b", false);  // while it is searched
+    machine_->Searched("b", before, indexed_);
+    EXPECT_EQ(machine_->ToSearch().count("b"), 1u) << "that search came too early";
+    machine_->Changed("b", "/found");
+    EXPECT_EQ(Pass(15), "retry a/stored b/found");
+    EXPECT_EQ(Pass(4 * kDay), "change a/ b/");
+    machine_->Lost("a", false);
+    machine_->Differs("a");
+    EXPECT_EQ(Pass(0), "change a/");
+    Pause(true);
+    Pause(false);
+    EXPECT_EQ(Pass(1), "");
+    // A run that failed has nothing left to do.
+    machine_->Restored(false, failed);
+    EXPECT_EQ(Pass(0), "");
+    EXPECT_FALSE(machine_->UntilRetry());
 }
 
 // ---- The store ----

@@ -256,6 +256,13 @@ TEST_F(Zel, TempFilesAreNewEmptyAndPrivate) {
     EXPECT_EQ(fs::file_size(path), 0U);
     ZEL::PutTempFile(path);
     EXPECT_FALSE(fs::exists(path));
+    // A folder in which somebody else can replace the file.
+    fs::permissions(root_.Path("tmp/ZEL"), fs::perms::all);
+    EXPECT_EQ(ZEL::GetTempFile(), "");
+    fs::permissions(root_.Path("tmp/ZEL"), fs::perms::owner_all);
+    if (chown(root_.Path("tmp/ZEL").c_str(), 65534, 65534) == 0) {
+        EXPECT_EQ(ZEL::GetTempFile(), "");
+    }
     fs::remove_all(root_.Path("tmp"));
     EXPECT_EQ(ZEL::GetTempFile(), "");
 }

@@ -7,6 +7,8 @@
 
 #include "ZEL/ipc.h"
 #include "ZEL/stream.h"
+#include "programs/common/configuration.h"
+#include "programs/common/json_text.h"
 #include "programs/common/run_progress.h"
 #include "programs/common/schedule_words.h"
 #include "programs/common/task_fields.h"
@@ -17,7 +19,6 @@
 #include "programs/zelctl/base/live_block.h"
 #include "programs/zelctl/doctor/checks.h"
 #include "programs/zelctl/share/samba.h"
-#include "programs/zelctl/task/file.h"
 #include "tests/integration/client_and_server.h"
 #include "tests/support/schedules.h"
 #include "tests/support/testing.h"
@@ -184,9 +185,17 @@ TEST(TaskRow, AListFitsItsTerminal) {
 }
 
 TEST(Text, WhatATerminalObeysIsShownInstead) {
-    EXPECT_EQ(programs::Printable("a\033[2J\xc2\x9b\x7f"), "a\\033[2J\\302\x9b\\177");
-    const std::string plain = "\xc3\xa4 \xe2\x82\xac \xc2\xa0";
+    // Two forms of U+009B, an overlong one, what turns a line around, half a character.
+    const std::string hostile = "a\033[2J\xc2\x9b\x9b\xc0\x9b\x7f\xe2\x80\xae\xc3";
+    EXPECT_EQ(programs::Printable(hostile),
+              "a\\033[2J\\302\\233\\233\\300\\233\\177\\342\\200\\256\\303");
+    EXPECT_EQ(programs::PrintableLines("a\x9b\nb\n"), "a\\233\nb\n");
+    const std::string plain = "\xc3\xa4 \xe2\x82\xac \xc2\xa0 \xf0\x9f\x98\x80";
     EXPECT_EQ(programs::Printable(plain), plain);
+    EXPECT_EQ(programs::JsonText({plain, "\x1b\xc2\x9b\x7f"}),
+              "[\n  \"" + plain + "\",\n  \"\\u001b\\u009b\\u007f\"\n]");
+    EXPECT_EQ(programs::Shortened(plain + plain, plain.size() + 4),
+              plain.substr(0, plain.size() - 4) + " [...]");
     EXPECT_EQ(zelctl::CutToColumns("a\xc3\xa4z", 2), "a\xc3\xa4");
 }
 
@@ -203,8 +212,8 @@ PObject SomeTask(const std::string& name, const std::string& share = "b") {
 
 TEST(TaskFile, EachFaultHasItsPlace) {
     const auto faults = [](const std::string& tasks) {
-        return zelctl::ReadTaskFile(R"({"format":"zelctl tasks","version":1,"tasks":)" + tasks +
-                                    "}")
+        return programs::ReadConfiguration(R"({"format":"zelctl tasks","version":1,"tasks":)" +
+                                           tasks + "}")
             .faults;
     };
     const std::string good = R"("name":"a","share_list":["x"],"user":"u","server_ip":"1.2.3.4")";
@@ -230,8 +239,8 @@ TEST(TaskFile, EachFaultHasItsPlace) {
     for (const auto& [tasks, fault] : cases) {
         EXPECT_THAT(faults(tasks), ElementsAre(HasSubstr(fault))) << tasks.substr(0, 100);
     }
-    EXPECT_THAT(zelctl::ReadTaskFile("[]").faults, ElementsAre(HasSubstr("format")));
-    EXPECT_THAT(zelctl::ReadTaskFile(R"({"format":"zelctl tasks","version":2})").faults,
+    EXPECT_THAT(programs::ReadConfiguration("[]").faults, ElementsAre(HasSubstr("format")));
+    EXPECT_THAT(programs::ReadConfiguration(R"({"format":"zelctl tasks","version":2})").faults,
                 ElementsAre(HasSubstr("version")));
 }
 
@@ -409,8 +418,8 @@ TEST_F(Zelctl, WithoutADaemonEveryCommandSaysWhatToDo) {
 TEST_F(Zelctl, HelpIsForPeopleAndFitsATerminal) {
     for (const char* command :
          {"", "task", "task add", "task edit", "task log", "task next", "task run", "share",
-          "share import", "push", "pair check", "next", "export", "import", "doctor", "server",
-          "server setup", "server account add"}) {
+          "share import", "trust", "push", "pair check", "next", "export", "import", "doctor",
+          "server", "server setup", "server account add"}) {
         const Outcome help = Run(std::string("help ") + command);
         EXPECT_THAT(help, Ended(0, "Usage:")) << command;
         EXPECT_THAT(help.output, Not(testing::ContainsRegex("[{}]|TEXT|INT|REQUIRED|[^\n]{81}")));
@@ -433,7 +442,7 @@ TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
     FakeDaemon daemon(root_.Path(), [](const PObject& request) {
         return Success({{"task", request}});
     });
-    EXPECT_THAT(Add("--weekly daily --at 08:00 --every 2h --times 3 --ssh --ssh-port 2222 "
+    EXPECT_THAT(Add("--weekly daily --at 08:00 --every 2h --times 3 --plain "
                     "--exclude '*.tmp' --exclude 'a b'")
                     .output,
                 AllOf(HasSubstr("'nightly' is added: daily 08:00, 3 more every 2h"),
@@ -442,7 +451,7 @@ TEST_F(Zelctl, AddSendsAWholeTaskAndShowsItsRunsButNeverThePassword) {
     EXPECT_THAT(
         daemon.Requests(),
         ElementsAre(AllOf(HasSubstr("\"exclude\": [\"*.tmp\", \"a b\"]"), Not(HasSubstr("\"id\"")),
-                          HasSubstr("\"pswd\": \"top secret\""), HasSubstr("\"ssh_port\": 2222"),
+                          HasSubstr("\"pswd\": \"top secret\""), Not(HasSubstr("\"ssh\"")),
                           HasSubstr("\"week_schd\": \"1111111\""))));
     EXPECT_THAT(Run("task add a --share docs -s nas2 -u alice").output,
                 HasSubstr("no password: give --password-file"));
@@ -465,13 +474,14 @@ TEST_F(Zelctl, EditSendsOnlyWhatIsSaid) {
     FakeDaemon daemon(root_.Path(), [&](const PObject&) {
         return Success({{"task", SomeTask("nightly")}, {"changed", changed}});
     });
-    EXPECT_THAT(Run("task edit nightly --at 09:00 --no-ssh --server 10.0.0.1 --rename daily "
-                    "--user lena --no-exclude"),
-                Ended(0));
-    // The password is asked for with what the task is otherwise.
     EXPECT_THAT(
-        Run("task edit nightly --no-check --bwlimit 7 --password-file " + root_.Path("password")),
+        Run("task edit nightly --at 09:00 --no-ssh --plain --server 10.0.0.1 --rename daily "
+            "--user lena --no-exclude"),
         Ended(0));
+    // The password is asked for with what the task is otherwise.
+    EXPECT_THAT(Run("task edit nightly --no-check --bwlimit else=7,22:00-06:00=0 --password-file " +
+                    root_.Path("password")),
+                Ended(0));
     changed = false;
     EXPECT_THAT(Run("task edit nightly --on-change").output, HasSubstr("already"));
     EXPECT_THAT(Run("task edit nightly --once 2001-01-01").output, HasSubstr("lies in the past"));
@@ -482,8 +492,8 @@ TEST_F(Zelctl, EditSendsOnlyWhatIsSaid) {
                     "\"10.0.0.1\", \"server_name\": \"\", \"ssh\": 0, \"task\": \"nightly\", "
                     "\"user\": \"lena\"}",
                     HasSubstr("task_show"),
-                    "{\"command\": \"task_edit\", \"max_bandwidth\": 7, \"pswd\": \"top secret\", "
-                    "\"task\": \"nightly\"}",
+                    "{\"bandwidth_windows\": \"22:00-06:00=0\", \"command\": \"task_edit\", "
+                    "\"max_bandwidth\": 7, \"pswd\": \"top secret\", \"task\": \"nightly\"}",
                     HasSubstr("\"schedule_mode\": 1"), HasSubstr("task_show")));
 }
 
@@ -520,8 +530,8 @@ TEST_F(Zelctl, NothingInAListReachesTheTerminal) {
                                          : TasksReply({Brief("bad\033]0;x\007", 0, 2, 4)});
     });
     for (const char* list : {"task list", "-v task list"}) {
-        EXPECT_THAT(Run(list).output, AllOf(HasSubstr("NAME"), HasSubstr("bad\\302\x9b]0;x  "),
-                                            HasSubstr("\n  ! no disk\n  ! disk\\302\x9b full\n")));
+        EXPECT_THAT(Run(list).output, AllOf(HasSubstr("NAME"), HasSubstr("bad\\302\\233]0;x  "),
+                                            HasSubstr("\n  ! no disk\n  ! disk\\302\\233 full\n")));
     }
     EXPECT_EQ(nlohmann::json::parse(Run("task list --json").output)[0]["name"], "bad\033]0;x\007");
     rows.asArray().emplace_back("no row");
@@ -674,32 +684,26 @@ TEST_F(RealServer, TheServerIsAskedBeforeATaskIsAddedAndByTheDoctor) {
         "task add t --share docs -u alice --manual --password-file - -s 127.0.0.1";
     EXPECT_THAT(Client(add, "wrong\n"), Ended(4, "refused the login"));
     EXPECT_THAT(daemon.Requests(), testing::IsEmpty());
-    EXPECT_THAT(Client(add, "secret\n"), Ended(0, "takes the account and the shares"));
+    EXPECT_THAT(Client(add, "secret words\n"), Ended(0, "takes the account and the shares"));
     const Outcome doctor = Client("doctor");
     EXPECT_THAT(doctor.output,
                 AllOf(testing::ContainsRegex("ok +task t: .*the server takes it"),
+                      HasSubstr("answers: plain, within this machine"),
                       testing::ContainsRegex("failed +task wrong: .*refused the login")));
     EXPECT_THAT(Client("push docs -s 127.0.0.1 -u alice --password-file -", "wrong\n"), Ended(4));
+    const std::string other = "SHA256:" + std::string(43, 'A');
+    const std::string servers = "client/usr/tarq/etc/tarqrsync_servers";
+    folder_.Write(servers, "[127.0.0.1]\ntransport=\"tls\"\nport=\"" + std::to_string(tls_port_) +
+                               "\"\nfingerprint=\"" + other + "\"\n");
+    EXPECT_THAT(Client("doctor").output,
+                AllOf(testing::ContainsRegex("failed +server .*and " + other + " is trusted"),
+                      HasSubstr("-> somebody may be in between")));
+    folder_.Write(servers, "[127.0.0.1\n");
+    EXPECT_THAT(Client("doctor").output,
+                testing::ContainsRegex("failed +trusted servers: .*line 1"));
+    fs::remove(folder_.Path(servers));
     StopServer();
-    EXPECT_THAT(Client(add, "secret\n"), Ended(0, "the task is added all the same"));
-}
-
-TEST_F(RealServer, ListsWhatTheTaskWouldSend) {
-    test::Must(Client("push docs -s 127.0.0.1 -u alice --password-file - -q", "secret\n"));
-    Write("new", "n");
-    Write("left.tmp", "n");
-    FakeDaemon daemon(folder_.Path("client"), [](const PObject& request) {
-        PObject task = SomeTask("t", "docs");
-        task["server_name"] = "";
-        task["server_ip"] = "127.0.0.1";
-        task["user"] = "alice";
-        task["ssh"] = 0;
-        EXPECT_EQ(request["secrets"].asInt32(), 1);
-        return Success({{"task", task}});
-    });
-    EXPECT_THAT(Client("task run t --dry-run").output,
-                AllOf(HasSubstr("send    new"), HasSubstr("1 file (1 B) would be"),
-                      Not(HasSubstr("left.tmp"))));
+    EXPECT_THAT(Client(add, "secret words\n"), Ended(0, "the task is added all the same"));
 }
 
 TEST_F(Zelctl, ExportAndImportTakeAllAlongAndFaultsAddNothing) {
@@ -707,8 +711,13 @@ TEST_F(Zelctl, ExportAndImportTakeAllAlongAndFaultsAddNothing) {
     PObject added = there[0];
     added["command"] = "task_add";
     added["block"] = 0;
+    added["compare_days"] = 7;
+    added["verify_days"] = 30;
+    added["bandwidth_windows"] = "";
+    added["brake"] = 50;
     there[0]["id"] = 5;
     there[0]["last_error"] = "not part of it";
+    test::Must(Run("trust cellar --plain"));
     FakeDaemon daemon(root_.Path(), [&](const PObject& request) {
         return request["command"].asString() == "task_list" ? TasksReply(there) : Success();
     });
@@ -719,19 +728,19 @@ TEST_F(Zelctl, ExportAndImportTakeAllAlongAndFaultsAddNothing) {
     EXPECT_THAT(Run("import " + file).output, HasSubstr("--replace"));
     EXPECT_EQ(Run("import --replace " + file).exit_code, 0);
     EXPECT_THAT(daemon.Requests().back(),
-                AllOf(HasSubstr("task_edit"), HasSubstr("\"pswd\": \"secret\"")));
+                AllOf(HasSubstr("task_edit"), HasSubstr("\"pswd\": \"secret words\"")));
     there.clear();
     EXPECT_EQ(Run("import " + file).exit_code, 0);
     EXPECT_EQ(daemon.Requests().back(), added.toString());
     // The second task cannot be: the first is not added either.
     const PObject bad = SomeTask("b", "none");
     const PObject good = SomeTask("c", "docs");
-    root_.Write("tasks.json", zelctl::WriteTaskFile({good, bad}, true));
+    root_.Write("tasks.json", programs::WriteConfiguration({good, bad}, {}, true));
     EXPECT_THAT(Run("import " + file).output,
                 AllOf(HasSubstr("share 'none'"), HasSubstr("nothing was imported")));
     EXPECT_THAT(daemon.Requests().back(), HasSubstr("task_list"));
     // Passwords that are missing come from elsewhere, or nothing happens.
-    root_.Write("tasks.json", zelctl::WriteTaskFile({good}, false));
+    root_.Write("tasks.json", programs::WriteConfiguration({good}, {}, false));
     EXPECT_THAT(test::ReadFile(file), Not(HasSubstr("secret")));
     EXPECT_EQ(Run("import " + file).exit_code, 2);
     EXPECT_EQ(Run("import --password-file - " + file, "pw\n").exit_code, 0);

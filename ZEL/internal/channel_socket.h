@@ -1,5 +1,4 @@
-// What a channel's plain mode and its TLS mode do alike with the socket below them: wait for it,
-// tell what was moved, close it.
+// What plain and TLS channels have in common: waiting for the socket, logging transfers, closing.
 //
 // Descriptors of any number: the waits are made with poll(2), whose answers are read as select(2)
 // would report them (its three sets are named "read", "write" and "exception").
@@ -27,13 +26,13 @@ inline bool Aborted(const int* flag) {
     return flag != nullptr && __atomic_load_n(flag, __ATOMIC_RELAXED) != 0;
 }
 
-/// Lets a reader go on looking for a moment before it sleeps. A peer that answers at once then
-/// costs neither a sleep nor a wake-up, which take many times longer than a short answer. When
-/// nothing came in that moment the next reads sleep at once: twice as many each time.
+/// Adaptive polling before a read blocks. A peer that answers at once then costs neither a sleep
+/// nor a wake-up, which take many times longer than a short answer. After each attempt in vain,
+/// twice as many of the following reads block at once.
 class Patience {
 public:
-    /// Calls `came` again and again, and lets others run meanwhile, until it gives true or the
-    /// moment is over, or the flag (may be null) is set; not even once when it is not the time.
+    /// Calls `came` repeatedly, yielding the processor in between, until it returns true, the time
+    /// for polling is over or the flag (may be null) is set. Does nothing while polling is skipped.
     template <typename Came>
     void LookForAMoment(const int* flag, Came came) {
         if (to_skip_ > 0) {
@@ -51,7 +50,7 @@ public:
     }
 
 private:
-    // What a machine takes to wake a sleeper, and more.
+    // Somewhat longer than it takes to wake a sleeping thread.
     static constexpr std::chrono::microseconds kMoment{100};
     static constexpr unsigned int kMostSkipped = 255;
     unsigned int skipped_ = 0;  // after the last look in vain
@@ -83,8 +82,8 @@ constexpr timeval kSlice = {1, 0};
 /// A wait in the milliseconds that poll(2) takes, rounded up; at least 0.
 int PollMilliseconds(int64_t seconds, int64_t microseconds);
 
-/// Waits for one interval, after a moment's patience where there is any (may be null). 0: something
-/// is in `readiness`; -1: the flag is set; -9: nothing happened; -3.
+/// Waits for one interval, after polling with `patience` (may be null). 0: something is in
+/// `readiness`; -1: the flag is set; -9: nothing happened; -3.
 int WaitFd(int fd, Watch watch, const timeval& interval, const int* flag, Patience* patience,
            Readiness& readiness);
 

@@ -41,7 +41,7 @@ inline bool IsEmpty(const char* text) {
     return text == nullptr || *text == '\0';
 }
 
-/// How much of a share's name counts when letter case does not.
+/// How many bytes of a share's name are compared when letter case is ignored.
 inline constexpr int kNameCharacters = 32;
 
 /// Holds the semaphore that all writers of the registry take.

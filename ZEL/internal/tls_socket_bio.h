@@ -12,7 +12,7 @@ namespace ZEL {
 /// descriptor.
 BIO* NewTlsSocketBio(int fd);
 
-/// The patience of those who read from such a BIO; the BIO's.
+/// The polling state of the BIO's readers; owned by the BIO.
 Patience& PatienceOf(BIO* bio);
 
 }  // namespace ZEL

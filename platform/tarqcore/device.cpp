@@ -12,7 +12,7 @@ int KAPICIsMiniUnit(void) {
         const int before = KAPICErrGet();
         if (KAPICFileGetSectionValue(path.c_str(), "device", "mini_unit", value, sizeof value) !=
             0) {
-            KAPICErrSetEx(before, __FILE__, __LINE__);  // no configuration is no failure
+            KAPICErrSetEx(before, __FILE__, __LINE__);  // a missing configuration is not a failure
         }
         return strcmp(value, "yes") == 0 ? 1 : 0;
     });

@@ -36,7 +36,7 @@ const char* KAPICErrText(int code) {
         case TARQ_ERR_BAD_PARAMETER:
             return "an argument is missing or not allowed";
         case TARQ_ERR_SEMAPHORE:
-            return "semaphore failure";
+            return "a lock between processes cannot be taken; the system log says why";
         case TARQ_ERR_NO_SHARE:
             return "no such share";
         case TARQ_ERR_SHARE_VOLUME:

@@ -42,8 +42,7 @@ pid_t ParsePid(std::string_view text) {
     return static_cast<pid_t>(base::ParseNumber(line, INT_MAX).value_or(0));
 }
 
-/// Whether the process has ended and only waits for its parent to notice. No when that cannot be
-/// told.
+/// Whether the process is a zombie. False when that cannot be determined.
 bool IsZombie(pid_t pid) {
     char buffer[kStatBytes];
     const auto stat = ReadStart(("/proc/" + std::to_string(pid) + "/stat").c_str(), buffer);
@@ -68,7 +67,7 @@ int KAPICProcAliveByPidFile(const char* path) {
         char buffer[kPidFileBytes];
         const auto text = ReadStart(path, buffer);
         const pid_t pid = text ? ParsePid(*text) : 0;
-        // Not being allowed to send it a signal shows as well that it is there.
+        // EPERM also proves that the process exists.
         const bool exists = pid > 0 && (kill(pid, 0) == 0 || errno == EPERM);
         return exists && !IsZombie(pid) ? 1 : 0;
     });

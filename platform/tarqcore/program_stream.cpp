@@ -36,7 +36,7 @@ Programs& Running() {
     return programs;
 }
 
-/// What posix_spawn is told, released in any case.
+/// Owner of posix_spawn's attributes and file actions.
 struct SpawnSetup {
     posix_spawn_file_actions_t actions;
     posix_spawnattr_t attributes;
@@ -77,7 +77,8 @@ FILE* FailStart(int error) {
     return nullptr;
 }
 
-// The maker's own programs, and where others have them; what answers for a missing one.
+// Where the maker's systems and others have the same programs, and what stands in for a missing
+// one.
 constexpr char kMakersFolder[] = "/usr/local/bin/";
 constexpr char kHostFolder[] = "/usr/bin/";
 constexpr char kNoProgram[] = "/bin/false";

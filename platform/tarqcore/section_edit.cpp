@@ -44,8 +44,8 @@ size_t OwnEnd(const SectionImage& image, const Section& section) {
     return end;
 }
 
-/// Whether `text` is one line that reads as that key and value: the whole rule about what keys,
-/// values and line formats may hold, but for the carriage return.
+/// Whether `text` is one line that is read back as that key and value. This is the only check of
+/// keys, values and line formats, except for carriage returns.
 bool ReadsBack(std::string_view text, std::string_view key, std::string_view value) {
     if (text.empty() || text.find('\n') != text.size() - 1) {
         return false;

@@ -8,6 +8,7 @@
 
 #include "base/text.h"
 #include "platform/tarqrsync/message_keeper.h"
+#include "platform/tarqrsync/output_parser.h"
 #include "tarq/rsync_wrapper.h"
 
 namespace TARQ {
@@ -29,17 +30,23 @@ constexpr int kExitSsh = 255;
 constexpr int kKeepStatus = -1;
 
 constexpr std::string_view kUnknownModule = "@ERROR: Unknown module";
+constexpr std::string_view kEarlyExecFailed = "@ERROR: early exec failed";
+// In a copy that ran to its end every complaint of the sending half is about the source.
+constexpr std::string_view kSourceComplaint = "[sender] ";
 
 enum Where : unsigned int {
     DAEMON = 1U,
     COMMAND = 2U,  // a server command
     COPY = 4U,
     SSH = 8U,  // either of the runs over ssh
-    ANYWHERE = DAEMON | COMMAND | COPY | SSH
+    TLS = 16U,
+    PULL = 32U,  // a copy that comes from the server
+    ANYWHERE = DAEMON | COMMAND | COPY | SSH | TLS | PULL
 };
 
-// Words of rsync's or ssh's, and what they mean to a person. {host}, {user}, {module}, {port},
-// {daemon_port}, {ssh}, and {line} (all of the line that the words were found in) are filled in.
+// Words of rsync's, ssh's or our connecting program's, and what they mean to a person. {host},
+// {user}, {module}, {port}, {daemon_port}, {ssh}, and {line} (all of the line that the words were
+// found in) are filled in.
 struct Clue {
     std::string_view words;
     unsigned int where;
@@ -69,6 +76,15 @@ constexpr Clue kClues[] = {
     {"Failed to exec", SSH, kExitIpc, "the program {ssh} cannot be started"},
     {"rsync: command not found", SSH, kKeepStatus, "{host} has no rsync program"},
     {"rsync: not found", SSH, kKeepStatus, "{host} has no rsync program"},
+    {"connect: cannot find", TLS, STATUS_SOCKET, "the host name {host} is unknown"},
+    {"connect: timed out", TLS, kExitConnectTimeout,
+     "{host} did not answer on TLS port {port} in time"},
+    {"Connection timed out", TLS, kExitConnectTimeout,
+     "{host} did not answer on TLS port {port} in time"},
+    {"Connection refused", TLS, STATUS_SOCKET,
+     "{host} refuses connections on TLS port {port}: is its server running?"},
+    {"connect: no TLS", TLS, STATUS_SOCKET,
+     "what answers at {host} on port {port} is no server with TLS 1.3: {line}"},
     {"getaddrinfo:", DAEMON, kKeepStatus, "the host name {host} is unknown"},
     {"Connection refused", DAEMON, kKeepStatus,
      "{host} refuses connections on port {port}: is its rsync daemon running?"},
@@ -85,14 +101,15 @@ constexpr Clue kClues[] = {
      "{host} serves as many connections as it takes: try again later"},
     {kUnknownModule, COMMAND, STATUS_UNKNOWN_COMMAND,
      "{host} takes no server commands: its rsync daemon has no module for them"},
-    {kUnknownModule, COPY, kKeepStatus, "{host} has no module '{module}'"},
-    {"@ERROR: early exec failed", ANYWHERE, kKeepStatus,
-     "the program that takes commands at {host} failed"},
+    {kUnknownModule, COPY | PULL, kKeepStatus, "{host} has no module '{module}'"},
+    {kEarlyExecFailed, COPY, kKeepStatus, "{host} does not start this push in one connection"},
+    {kEarlyExecFailed, ANYWHERE, kKeepStatus, "the program that takes commands at {host} failed"},
     {"@ERROR: Unknown command", COMMAND, STATUS_UNKNOWN_COMMAND,
      "the rsync daemon at {host} is older than 3.2.1 and takes no commands"},
     {"configured to refuse", ANYWHERE, kKeepStatus,
      "the rsync daemon at {host} is configured to refuse an option of this run"},
     {"module is read only", ANYWHERE, kKeepStatus, "the module {module} at {host} is read-only"},
+    {"Refused: this server keeps", COPY, kKeepStatus, "{line}"},
     {"@ERROR:", ANYWHERE, kKeepStatus, "{host} refused the run: {line}"},
     {"connection unexpectedly closed", ANYWHERE, kKeepStatus,
      "{host} closed the connection in the middle of the run: its rsync, or all of it, was stopped"},
@@ -102,7 +119,12 @@ constexpr Clue kClues[] = {
     {"Disk quota exceeded", COPY, kKeepStatus,
      "the disk quota of the account at {host} is used up"},
     {"Read-only file system", COPY, kKeepStatus, "the file system at {host} is read-only"},
-    {"No space left on device", COMMAND, kKeepStatus, "the local disk is full"},
+    {"No space left on device", COMMAND | PULL, kKeepStatus, "the local disk is full"},
+    {"Disk quota exceeded", PULL, kKeepStatus, "your disk quota on this machine is used up"},
+    {"Read-only file system", PULL, kKeepStatus,
+     "the file system to restore into is read-only: {line}"},
+    {"[sender] link_stat", PULL, kKeepStatus, "the copy has no such path: {line}"},
+    {kSourceComplaint, PULL, kKeepStatus, "{host} cannot read all of the copy: {line}"},
     {"[sender] link_stat", COMMAND, kKeepStatus,
      "{host} took the command and left no answer to it"},
 };
@@ -132,7 +154,7 @@ constexpr ExitMeaning kExitMeanings[] = {
     {kExitConnectTimeout, "{host} did not answer in time"},
 };
 
-// What a line of the far end's may take of a sentence.
+// The most bytes of a far end's line that are quoted in a sentence.
 constexpr size_t kMaxQuoted = 400;
 
 std::string LineAt(std::string_view text, size_t position) {
@@ -143,7 +165,7 @@ std::string LineAt(std::string_view text, size_t position) {
                                      : std::string(line.substr(0, kMaxQuoted)) + "...";
 }
 
-// What rsync says of one file begins so, behind it stands which of its halves speaks.
+// rsync's message about one file begins like this; the name of the half that reports it follows.
 constexpr std::string_view kComplaint = "rsync: [";
 
 // ": WORDS OF THE FIRST, and 12 more" for the lines of `messages` that begin with `head`; empty
@@ -176,18 +198,13 @@ bool Contains(std::string_view text, std::string_view words) {
 }
 
 std::string PortOf(const RunFacts& facts) {
-    if (facts.settings.port != 0) {
-        return std::to_string(facts.settings.port);
-    }
-    return TransportOf(facts.settings) == Transport::DAEMON
-               ? std::to_string(facts.config.daemon_port)
-               : "22";
+    return facts.route.port != 0 ? std::to_string(facts.route.port) : "22";
 }
 
 std::string Fill(std::string_view meaning, const RunFacts& facts, std::string_view line) {
     const Settings& settings = facts.settings;
     const std::initializer_list<std::pair<std::string_view, std::string>> fields = {
-        {"{host}", settings.host},
+        {"{host}", facts.route.name},
         {"{user}", settings.user},
         {"{module}", settings.module},
         {"{port}", PortOf(facts)},
@@ -221,10 +238,34 @@ bool IsRefusedSshLogin(std::string_view text) {
     return false;
 }
 
+// What mends it when the key of a server that was trusted has changed.
+std::string TrustAnew(const RunFacts& facts) {
+    return ". Somebody may be in between; if the server was set up anew: zelctl trust " +
+           facts.route.name;
+}
+
+// The connecting program: "connect: key SHA256:... is not SHA256:..."
+constexpr std::string_view kOtherKey = "connect: key ";
+
+std::string ChangedTlsKey(const RunFacts& facts) {
+    const size_t begin = facts.messages.find(kOtherKey) + kOtherKey.size();
+    const std::string shown = facts.messages.substr(begin, facts.messages.find(' ', begin) - begin);
+    return "the server's key is not the one that was trusted: " + facts.route.name + " shows " +
+           shown + ", trusted was " + facts.route.fingerprint + TrustAnew(facts);
+}
+
 // "Offending ED25519 key in /path/known_hosts:7" tells where the old key stands.
 std::string ChangedHostKey(const RunFacts& facts) {
+    if (facts.route.is_known) {
+        return Contains(facts.messages, "IDENTIFICATION HAS CHANGED")
+                   ? "the server's host key is not the one that was trusted for " +
+                         facts.route.name + TrustAnew(facts) + " --ssh"
+                   : "no host key of " + facts.route.name +
+                         " is trusted, or none of the kind that it shows: zelctl trust " +
+                         facts.route.name + " --ssh";
+    }
     std::string result =
-        "the host key of " + facts.settings.host +
+        "the host key of " + facts.route.name +
         " has changed: either it was set up anew or another machine answers in its place";
     constexpr std::string_view kPlace = " key in ";
     const size_t offending = facts.messages.find("Offending ");
@@ -242,9 +283,11 @@ std::string ChangedHostKey(const RunFacts& facts) {
     return result;
 }
 
-unsigned int WhereOf(const Settings& settings) {
-    const bool daemon = TransportOf(settings) == Transport::DAEMON;
-    return (daemon ? DAEMON : SSH) | (settings.is_command ? COMMAND : COPY);
+unsigned int WhereOf(const RunFacts& facts) {
+    const Where transport = facts.route.transport == Transport::DAEMON            ? DAEMON
+                            : facts.route.transport == Transport::DAEMON_OVER_TLS ? TLS
+                                                                                  : SSH;
+    return transport | (facts.settings.is_command ? COMMAND : facts.settings.pull ? PULL : COPY);
 }
 
 // Runs that came so far that names of files stand in the words: a file may be called "Connection
@@ -253,11 +296,26 @@ bool CameToFiles(int exit_code) {
     return exit_code == kExitFileIo || exit_code == kExitPartial || exit_code == kExitVanished;
 }
 
-// In a copy that ran to its end every complaint of the sending half is about the source.
-constexpr std::string_view kSourceComplaint = "[sender] ";
+// A server's own refusal of an argument that an earlier version does not know, and what a receiver
+// says that takes the entry of a missing path for a broken one.
+constexpr std::string_view kUnknownArguments[] = {
+    "Refused: rsync's argument '--delete-missing-args'", "Refused: rsync's argument '--no-r'"};
+constexpr std::string_view kNoSuchMode = "invalid file mode 00 for ";
+
+RunCause RefusedForm(const RunFacts& facts) {
+    const bool unknown =
+        std::any_of(std::begin(kUnknownArguments), std::end(kUnknownArguments),
+                    [&](std::string_view words) { return Contains(facts.messages, words); });
+    if (unknown && !CameToFiles(facts.exit_code)) {
+        return RunCause::NO_LISTED_CHANGES;
+    }
+    return facts.exit_code == kExitProtocol && Contains(facts.messages, kNoSuchMode)
+               ? RunCause::NO_NAMED_DELETIONS
+               : RunCause::NONE;
+}
 
 bool IsUnreadableSource(const RunFacts& facts) {
-    return facts.exit_code == kExitPartial && !facts.settings.is_command &&
+    return facts.exit_code == kExitPartial && !facts.settings.is_command && !facts.settings.pull &&
            !facts.settings.list_only && Contains(facts.messages, kSourceComplaint);
 }
 
@@ -278,6 +336,20 @@ bool EndsWith(std::string_view text, std::string_view words) {
     return text.size() >= words.size() && text.substr(text.size() - words.size()) == words;
 }
 
+// The entry that a complaint is about, as rsync writes it: [sender] opendir "/share/a" failed, or
+// ERROR: a failed verification -- update discarded. Empty: the line does not tell.
+std::string_view EntryIn(std::string_view line) {
+    constexpr std::string_view kError = "ERROR: ";
+    const size_t changed = line.find(kChangedWhileSent);
+    if (StartsWith(line, kError) && changed != std::string_view::npos) {
+        return line.substr(kError.size(), changed - kError.size());
+    }
+    const size_t begin = line.find('"');
+    const size_t end = line.rfind('"');
+    return Contains(line, kSourceComplaint) && end > begin ? line.substr(begin + 1, end - begin - 1)
+                                                           : std::string_view();
+}
+
 bool IsFleeting(std::string_view line) {
     if (Contains(line, kSourceComplaint)) {
         return std::any_of(std::begin(kFleetingErrors), std::end(kFleetingErrors),
@@ -292,7 +364,7 @@ bool IsFleeting(std::string_view line) {
 // other kind, and it does not.
 bool IsBusySource(const RunFacts& facts) {
     std::string_view rest = facts.messages;
-    if (facts.exit_code != kExitPartial || facts.settings.is_command ||
+    if (facts.exit_code != kExitPartial || facts.settings.is_command || facts.settings.pull ||
         !(Contains(rest, kSourceComplaint) || Contains(rest, kChangedWhileSent))) {
         return false;
     }
@@ -313,16 +385,19 @@ Verdict IncompleteSource(const RunFacts& facts, RunCause cause) {
         (cause == RunCause::BUSY_SOURCE ? "the source changed while it was read"
                                         : "the source cannot be read in full") +
         (!which.empty() ? which : ": " + LineAt(messages, messages.find(kChangedWhileSent)));
-    if (facts.settings.delete_missing) {
+    if (facts.settings.delete_missing && !facts.settings.deletes_changes) {
         line += "; nothing was deleted at the destination";
     }
     return {facts.exit_code, cause, line};
 }
 
 Verdict FromWords(const RunFacts& facts, int status) {
-    const unsigned int where = WhereOf(facts.settings);
+    const unsigned int where = WhereOf(facts);
     const std::string_view messages = facts.messages;
     const bool connected = CameToFiles(status);
+    if ((where & TLS) != 0 && Contains(messages, kOtherKey)) {
+        return {STATUS_AUTHENTICATION, RunCause::NONE, ChangedTlsKey(facts)};
+    }
     if ((where & SSH) != 0 && !connected) {
         if (Contains(messages, "Host key verification failed") ||
             Contains(messages, "HOST IDENTIFICATION HAS CHANGED")) {
@@ -337,11 +412,13 @@ Verdict FromWords(const RunFacts& facts, int status) {
     }
     for (const Clue& clue : kClues) {
         const size_t position = messages.find(clue.words);
-        const bool about_connection = (clue.where & (DAEMON | SSH)) != 0;
+        const bool about_connection = (clue.where & (DAEMON | SSH | TLS)) != 0;
         if ((clue.where & where) != 0 && position != std::string_view::npos &&
             !(connected && about_connection)) {
             return {clue.status == kKeepStatus ? status : clue.status,
-                    clue.words == kUnknownModule ? RunCause::UNKNOWN_MODULE : RunCause::NONE,
+                    clue.words == kUnknownModule ? RunCause::UNKNOWN_MODULE
+                    : clue.words == kEarlyExecFailed && clue.where == COPY ? RunCause::NOT_STARTED
+                                                                           : RunCause::NONE,
                     Fill(clue.meaning, facts, LineAt(messages, position))};
         }
     }
@@ -363,14 +440,39 @@ bool WasEndedHere(const RunFacts& facts) {
     const size_t said = messages.find("(code 20)");
     const std::string line = said == std::string_view::npos ? "" : LineAt(messages, said);
     const bool sender = Contains(line, "[sender") || Contains(line, "[Sender");
+    const bool receives_here = facts.settings.is_command || facts.settings.pull;
     const bool started_up = Contains(line, "[client") || Contains(line, "[server");
-    return line.empty() ||
-           (started_up ? Contains(line, "[client") : sender != facts.settings.is_command);
+    return line.empty() || (started_up ? Contains(line, "[client") : sender != receives_here);
 }
 
 }  // namespace
 
+std::vector<std::string> IncompleteEntries(const RunFacts& facts, bool* all) {
+    std::vector<std::string> entries;
+    const std::string folder = facts.settings.source;
+    *all = true;
+    std::string_view rest = facts.messages;
+    while (!rest.empty()) {
+        const std::string_view line = rest.substr(0, rest.find('\n'));
+        rest.remove_prefix(std::min(line.size() + 1, rest.size()));
+        const std::string entry = UnescapeName(EntryIn(line));
+        if (entry.empty()) {
+            *all = *all && line != kLeftOut && !StartsWith(line, kComplaint);
+        } else if (entry[0] != '/') {
+            entries.push_back(entry);
+        } else if (StartsWith(entry, folder) && entry.size() > folder.size()) {
+            entries.push_back(entry.substr(folder.size()));
+        } else {
+            *all = false;
+        }
+    }
+    return entries;
+}
+
 Verdict Judge(const RunFacts& facts) {
+    if (const RunCause refused = RefusedForm(facts); refused != RunCause::NONE) {
+        return {facts.exit_code, refused, "the server cannot take the changes in this form"};
+    }
     if (IsBusySource(facts)) {
         return IncompleteSource(facts, RunCause::BUSY_SOURCE);
     }
@@ -379,12 +481,13 @@ Verdict Judge(const RunFacts& facts) {
     }
     if (facts.exit_code == STATUS_CANCELLED && !WasEndedHere(facts)) {
         return {STATUS_PROTOCOL_STREAM, RunCause::NONE,
-                facts.settings.host + " ended the run: its rsync was stopped"};
+                facts.route.name + " ended the run: its rsync was stopped"};
     }
-    // These two say all by their number: what else was written has no part in it.
+    // The codes of these two are explanation enough: other messages are not about the cause.
     const bool plain = facts.exit_code == kExitVanished || facts.exit_code == STATUS_TIMEOUT;
-    return FromWords(plain ? RunFacts{facts.settings, facts.config, facts.exit_code, ""} : facts,
-                     facts.exit_code == kExitSsh ? STATUS_SOCKET : facts.exit_code);
+    return FromWords(
+        plain ? RunFacts{facts.settings, facts.route, facts.config, facts.exit_code, ""} : facts,
+        facts.exit_code == kExitSsh ? STATUS_SOCKET : facts.exit_code);
 }
 
 RefusedAttributes FindRefusedAttributes(const RunFacts& facts) {

@@ -22,6 +22,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <utility>
 
 namespace TARQ {
 namespace Backup {
@@ -111,7 +112,7 @@ bool AskKernel(int kernel, const inet_diag_req_v2& query, bool all,
                             header.nlmsg_len >= sizeof header && header.nlmsg_len <= size - at;
              at += Aligned(header.nlmsg_len)) {
             if (header.nlmsg_seq != request.header.nlmsg_seq) {
-                continue;  // what is left of a question that was given up
+                continue;  // left over from an abandoned request
             }
             if (header.nlmsg_type == NLMSG_DONE || header.nlmsg_type == NLMSG_ERROR) {
                 return header.nlmsg_type == NLMSG_DONE;
@@ -192,6 +193,12 @@ void ProbeWhenIdle(const Holder& holder) {
 #endif
 }
 
+bool AreEndsOfOne(const inet_diag_sockid& one, const inet_diag_sockid& other) {
+    return one.idiag_sport == other.idiag_dport && one.idiag_dport == other.idiag_sport &&
+           memcmp(one.idiag_src, other.idiag_dst, sizeof one.idiag_src) == 0 &&
+           memcmp(one.idiag_dst, other.idiag_src, sizeof one.idiag_dst) == 0;
+}
+
 }  // namespace
 
 LinkState LinkWatch::Look(pid_t program) {
@@ -228,13 +235,24 @@ void LinkWatch::Find(pid_t program) {
         if (sockets.empty()) {
             return;
         }
+        std::vector<std::pair<inet_diag_sockid, Holder>> found;
         AskKernel(kernel_.Get(), Query(family), true, [&](const inet_diag_msg& message, auto&) {
             const auto own = sockets.find(message.idiag_inode);
             if (own != sockets.end()) {
-                connections_.push_back({message.id, family, Clock::now()});
-                ProbeWhenIdle(own->second);
+                found.emplace_back(message.id, own->second);
             }
         });
+        for (const auto& [id, holder] : found) {
+            // rsync speaks to the program that connects it over a pair of which both ends are here:
+            // that is no way to a far end.
+            const bool paired = std::any_of(
+                found.begin(), found.end(),
+                [&id = id](const auto& other) { return AreEndsOfOne(id, other.first); });
+            if (!paired) {
+                connections_.push_back({id, family, Clock::now()});
+                ProbeWhenIdle(holder);
+            }
+        }
     }
 }
 

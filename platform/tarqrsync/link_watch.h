@@ -20,8 +20,9 @@ struct LinkState {
     std::chrono::seconds unanswered{0};  ///< since when what was sent has met no answer at all
 };
 
-/// Looks at the connections of a program and its children from outside, so that a peer that is dead
-/// can be told from one that works and is silent: the kernel of the second still answers.
+/// Looks at the connections of a program and its children to others, from outside, so that a peer
+/// that is dead can be told from one that works and is silent: the kernel of the second still
+/// answers.
 ///
 /// Where the kernel does not tell (no inet_diag, a process that may not be looked at) there is
 /// never a connection.

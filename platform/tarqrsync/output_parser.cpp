@@ -11,8 +11,8 @@ namespace Backup {
 
 namespace {
 
-// Progress comes with each file: a listener hears of it no more often than the first, and when
-// nothing comes no less often than about the second.
+// Intervals of progress reports: at most one in the first and, while nothing changes, about one in
+// the second.
 constexpr std::chrono::milliseconds kProgressInterval(200);
 constexpr std::chrono::milliseconds kSilentInterval(900);
 // A name of PATH_MAX bytes, each escaped as four, and the figures before it.
@@ -111,8 +111,21 @@ constexpr std::array<Figure, 6> kFigures = {{
 bool SaysBegun(std::string_view line) {
     constexpr std::string_view kFindingFirst = "building file list";
     constexpr std::string_view kFindingAsItGoes = "sending incremental file list";
+    constexpr std::string_view kReceiving = "receiving ";  // the same of what comes from the server
     return line.substr(0, kFindingFirst.size()) == kFindingFirst ||
-           line.substr(0, kFindingAsItGoes.size()) == kFindingAsItGoes;
+           line.substr(0, kFindingAsItGoes.size()) == kFindingAsItGoes ||
+           line.substr(0, kReceiving.size()) == kReceiving;
+}
+
+// " (reg: 10, dir: 2, link: 1)"
+uint64_t FoldersIn(std::string_view kinds) {
+    constexpr std::string_view kFolders = "dir: ";
+    const size_t begin = kinds.find(kFolders);
+    uint64_t folders = 0;
+    if (begin != std::string_view::npos) {
+        Scanner(kinds.substr(begin + kFolders.size())).Read(&folders);
+    }
+    return folders;
 }
 
 bool IsOctal(char c) {
@@ -168,9 +181,11 @@ void OutputParser::Tick(unsigned int seconds_still) {
 }
 
 void OutputParser::FillReport(RunReport* report) const {
+    report->folders_total = figures_.folders_total;
     for (const Figure& figure : kFigures) {
         report->*figure.member = figures_.*figure.member;
     }
+    report->files_regular = figures_.files_regular;
     report->files_deleted = std::max(report->files_deleted, deletions_told_);
 }
 
@@ -258,6 +273,8 @@ bool OutputParser::TakeEntry(std::string_view line) {
         ++deletions_told_;
     } else if (itemized[0] == '<' || itemized[0] == '>') {
         change.kind = RunChange::SEND;
+        // "<fc......": nothing but the checksum, where the size and the time have their place.
+        change.damaged = options_.by_content && itemized.substr(2, 3) == "c..";
     }
     if (change.kind != RunChange::SEND) {
         change.length = 0;
@@ -265,6 +282,7 @@ bool OutputParser::TakeEntry(std::string_view line) {
     const bool differs = itemized.find_first_not_of(' ', 2) != std::string_view::npos;
     if (differs) {
         change.path = UnescapeName(scanner.Rest());
+        change.is_new = itemized[kItemizeWidth - 1] == kNewEntry;
     }
     if (options_.on_progress && change.kind != RunChange::DELETE) {
         NoteEntry(itemized, change);
@@ -334,8 +352,12 @@ bool OutputParser::TakeListed(std::string_view line) {
     if (mode.size() < 10 || !scanner.SkipSpaces().Read(&entry.length)) {
         return false;
     }
-    scanner.SkipSpaces().Word();
-    scanner.SkipSpaces().Word();
+    for (const std::string_view word : {scanner.SkipSpaces().Word(), scanner.SkipSpaces().Word()}) {
+        for (const char c : word) {
+            entry.time = c >= '0' && c <= '9' ? entry.time * 10 + static_cast<uint64_t>(c - '0')
+                                              : entry.time;
+        }
+    }
     if (!scanner.Literal(" ")) {
         return false;
     }
@@ -363,6 +385,13 @@ bool OutputParser::TakeFigure(std::string_view line) {
         uint64_t value = 0;
         if (scanner.Literal(figure.label) && scanner.Read(&value)) {
             figures_.*figure.member = value;
+            if (figure.member == &RunReport::files_total) {
+                figures_.folders_total = FoldersIn(scanner.Rest());
+            }
+            // "Number of files: 6 (reg: 2, dir: 3, link: 1)"
+            if (figure.member == &RunReport::files_total && scanner.Literal(" (reg: ")) {
+                scanner.Read(&figures_.files_regular);
+            }
             return true;
         }
     }

@@ -49,11 +49,9 @@ std::string PrivateFolder::Path(const std::string& name) {
     return folder_ + "/" + name;
 }
 
-std::string PrivateFolder::Write(const std::string& name, const std::string& content,
-                                 bool executable) {
+std::string PrivateFolder::Write(const std::string& name, const std::string& content) {
     std::string path = Path(name);
-    const base::UniqueFd fd(
-        open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, executable ? 0700 : 0600));
+    const base::UniqueFd fd(open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
     if (!fd || !base::WriteAll(fd.Get(), content)) {
         throw PrivateFileError("cannot write " + path);
     }

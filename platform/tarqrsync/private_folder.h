@@ -15,7 +15,8 @@ public:
 
 /// A folder in the folder for temporary files (TMPDIR, else /tmp; below the root folder when there
 /// is one, its tmp) that only this user can enter, made when it is first needed and removed with
-/// all that is in it at the end. It holds what one run must not show to anybody else.
+/// all that is in it at the end. It holds what one run must not show to anybody else, but no
+/// secret: when this process is killed the folder stays. See SecretFile.
 class PrivateFolder {
 public:
     PrivateFolder() = default;
@@ -26,9 +27,8 @@ public:
     /// The path of `name` in the folder. Throws PrivateFileError.
     std::string Path(const std::string& name);
 
-    /// Writes a new file that only this user can read, and execute when `executable`. Returns its
-    /// path. Throws PrivateFileError.
-    std::string Write(const std::string& name, const std::string& content, bool executable = false);
+    /// Writes a new file that only this user can read. Returns its path. Throws PrivateFileError.
+    std::string Write(const std::string& name, const std::string& content);
 
 private:
     std::string folder_;

@@ -2,7 +2,10 @@
 
 #include <syslog.h>
 
+#include <algorithm>
+#include <filesystem>
 #include <sstream>
+#include <system_error>
 
 #include "platform/tarqrsync/run.h"
 #include "platform/tarqrsync/settings.h"
@@ -14,6 +17,17 @@ namespace {
 
 // The cause stands in the explanation; the system log is not the place for a line a file.
 constexpr int kMaxLoggedLines = 20;
+// Neither end says anything while it reads a file for its checksum. A far end that is gone is
+// noticed long before.
+constexpr int kReadingSeconds = 86400;
+
+// Where an open folder is, as rsync will call it when it runs in it; else `otherwise`.
+std::string PathNow(int folder, const std::string& otherwise) {
+    std::error_code error;
+    const std::filesystem::path now =
+        std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(folder), error);
+    return error ? otherwise : now.string();
+}
 
 }  // namespace
 
@@ -109,9 +123,30 @@ void RsyncWrapper::setRunOptions(const RunOptions& options) {
 }
 
 int RsyncWrapper::execute(const std::function<bool()>& cancelled) {
-    Run run(impl_->settings, impl_->options);
+    Settings settings = impl_->settings;
+    if (!impl_->options.module.empty()) {
+        settings.module = impl_->options.module;
+    }
+    const bool starts = !settings.is_command && !impl_->options.start.empty();
+    if (starts) {
+        settings.module = kPushModule;
+    }
+    settings.pull = impl_->options.pull;
+    settings.delete_missing =
+        settings.delete_missing && !impl_->options.keep_missing && impl_->options.files.empty();
+    if (impl_->options.by_content && settings.timeout != 0) {
+        settings.timeout = std::max(settings.timeout, kReadingSeconds);
+    }
+    if (impl_->options.source_folder >= 0) {
+        settings.source = PathNow(impl_->options.source_folder, settings.source) + "/";
+    }
+    settings.deletes_changes = settings.delete_missing && impl_->options.deletes_changes;
+    Run run(settings, impl_->options);
     const int status = run.Execute(cancelled);
-    impl_->explanation = run.Outcome().explanation;
+    const RunCause cause = run.Outcome().cause;
+    const bool is_expected =
+        starts && (cause == RunCause::NOT_STARTED || cause == RunCause::UNKNOWN_MODULE);
+    impl_->explanation = is_expected ? "" : run.Outcome().explanation;
     impl_->details = run.Outcome().details;
     if (impl_->options.report != nullptr) {
         *impl_->options.report = run.Outcome();

@@ -2,25 +2,30 @@
 
 #include <fcntl.h>
 #include <sys/inotify.h>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <charconv>
 #include <cstring>
+#include <mutex>
+#include <set>
 
+#include "base/background_priority.h"
 #include "base/child_process.h"
 #include "base/config_file.h"
+#include "base/random_digits.h"
 #include "base/unique_fd.h"
 #include "base/whole_file.h"
 #include "platform/tarqrsync/answer_file.h"
 #include "platform/tarqrsync/message_keeper.h"
 #include "tarq/root_path.h"
+#include "tarq/rsync_servers.h"
 
 namespace TARQ {
 namespace Backup {
@@ -58,27 +63,12 @@ std::string PrepareLog() {
     return usable ? path : "";
 }
 
-std::string RandomSession() {
-    std::array<unsigned char, 16> bytes;
-    // Up to 256 bytes come whole or not at all.
-    if (getrandom(bytes.data(), bytes.size(), 0) != static_cast<ssize_t>(bytes.size())) {
-        throw PrivateFileError("no random numbers for a session");
+std::string RandomId() {
+    std::string id = base::RandomDigits();
+    if (id.empty()) {
+        throw PrivateFileError("no random numbers for a run");
     }
-    std::string session;
-    for (const unsigned char byte : bytes) {
-        session += "0123456789abcdef"[byte >> 4];
-        session += "0123456789abcdef"[byte & 15];
-    }
-    return session;
-}
-
-std::string PathVariable(const std::vector<std::string>& environment) {
-    for (const std::string& variable : environment) {
-        if (variable.compare(0, 5, "PATH=") == 0) {
-            return variable.substr(5);
-        }
-    }
-    return "";
+    return id;
 }
 
 // The number in "rsync  version 3.2.7  protocol version 31"; empty when the program does not say.
@@ -117,7 +107,15 @@ bool IsMissing(const std::string& path) {
     return lstat(path.c_str(), &info) != 0 && (errno == ENOENT || errno == ENOTDIR);
 }
 
-// True when the process `pid` is known to lie in a sleep of a fixed time.
+std::string CommandText(const std::string& session, const std::list<std::string>& lines) {
+    std::string text = "session=\"" + session + "\"\n";
+    for (const std::string& line : lines) {
+        text += line + "\n";
+    }
+    return text;
+}
+
+// True when the process `pid` is known to be in a timed sleep.
 bool IsInTimedSleep(pid_t pid) {
     const auto text = base::ReadFile("/proc/" + std::to_string(pid) + "/syscall");
     long number = -1;  // of the system call; no number when the process runs
@@ -163,6 +161,38 @@ private:
     base::UniqueFd notify_;
 };
 
+// Servers of earlier versions, which refuse runs that keep versions, by name: each is asked once,
+// and the log speaks of it once.
+class ServersWithoutVersions {
+public:
+    bool Has(const std::string& server) {
+        const std::lock_guard<std::mutex> guard(mutex_);
+        return servers_.count(server) != 0;
+    }
+    void Add(const std::string& server) {
+        const std::lock_guard<std::mutex> guard(mutex_);
+        if (servers_.insert(server).second) {
+            syslog(LOG_NOTICE,
+                   "tarqrsync: %s is of an earlier version and keeps no versions of what is "
+                   "replaced or deleted: copying without until it is upgraded",
+                   server.c_str());
+        }
+    }
+    void Remove(const std::string& server) {
+        const std::lock_guard<std::mutex> guard(mutex_);
+        servers_.erase(server);
+    }
+
+private:
+    std::mutex mutex_;
+    std::set<std::string> servers_;
+};
+ServersWithoutVersions g_servers_without_versions;
+
+// An earlier server names the word of letters, in which "b" for --backup comes first.
+constexpr char kBackupRefused[] = "Refused: rsync's argument '-b";
+constexpr char kRefused[] = "Refused: ";
+
 }  // namespace
 
 int Run::Execute(const std::function<bool()>& cancelled) {
@@ -171,6 +201,8 @@ int Run::Execute(const std::function<bool()>& cancelled) {
     } catch (const PrivateFileError& error) {
         outcome_.status = Fail(kStatusFileIo, error.what());
     } catch (const base::ConfigError& error) {
+        outcome_.status = Fail(STATUS_SYNTAX, error.what());
+    } catch (const ServersError& error) {
         outcome_.status = Fail(STATUS_SYNTAX, error.what());
     }
     return outcome_.status;
@@ -182,7 +214,15 @@ int Run::Attempt(const std::function<bool()>& cancelled) {
         const bool lacks_account = settings_.user.empty() && settings_.account_required;
         return Fail(lacks_account ? STATUS_AUTHENTICATION : STATUS_SYNTAX, refusal);
     }
+    if (const std::string bad_path = RefusalOf(options_); !bad_path.empty()) {
+        return Fail(STATUS_SYNTAX, bad_path);
+    }
     config_ = base::ReadRsyncConfig(RootPath(base::kRsyncConfigPath));
+    if (settings_.is_command) {
+        config_.answer_seconds =
+            std::max(config_.answer_seconds, static_cast<int>(options_.answer_seconds));
+    }
+    route_ = RouteOf(settings_, options_, config_);
     if (settings_.debug_log) {
         log_file_ = PrepareLog();
     }
@@ -190,11 +230,8 @@ int Run::Attempt(const std::function<bool()>& cancelled) {
 }
 
 int Run::RunCommand(const std::function<bool()>& cancelled) {
-    const std::string session = RandomSession();
-    std::string text = "session=\"" + session + "\"\n";
-    for (const std::string& line : settings_.command) {
-        text += line + "\n";
-    }
+    const std::string session = RandomId();
+    const std::string text = CommandText(session, settings_.command);
     if (text.size() > kMaxCommandBytes) {
         return Fail(STATUS_COMMAND_TOO_LONG,
                     "the command has " + std::to_string(text.size()) +
@@ -205,13 +242,14 @@ int Run::RunCommand(const std::function<bool()>& cancelled) {
     const RunOptions no_options;
     OutputParser parser(no_options, /*listing=*/false);
     const std::string answer_file = folder_.Path("answer");
-    const InvocationContext context = {settings_, config_, no_options, false, false, log_file_};
+    const InvocationContext context = {settings_, route_, config_,  no_options,
+                                       false,     false,  log_file_};
     const Invocation invocation =
-        CommandInvocation(context, folder_.Write("command", text), session, answer_file, &folder_);
+        CommandInvocation(context, folder_.Write("command", text), session, answer_file);
     const AnswerWatch watch(folder_.Path(""), answer_file);
     ChildLimits limits = {kMaxCommandFileBytes, {}};
     // With ssh the last words are written to it, and not yet to the connection.
-    if (TransportOf(settings_) == Transport::DAEMON) {
+    if (route_.transport != Transport::DAEMON_OVER_SSH) {
         limits.early_end = watch.End();
     }
     const int status = RunRsync(cancelled, invocation, &parser, limits);
@@ -221,7 +259,7 @@ int Run::RunCommand(const std::function<bool()>& cancelled) {
 }
 
 int Run::TakeAnswer(const std::string& answer_file) {
-    const std::string& host = settings_.host;
+    const std::string& host = route_.name;
     std::string text;
     Answer answer;
     if (!ReadAnswerFile(answer_file, &text)) {
@@ -246,26 +284,55 @@ int Run::TakeAnswer(const std::string& answer_file) {
 }
 
 int Run::RunCopy(const std::function<bool()>& cancelled) {
-    if (!settings_.list_only && IsMissing(settings_.source)) {
-        return Fail(STATUS_FILE_SELECT, "the source " + settings_.source + " does not exist");
+    if (!settings_.list_only && !(settings_.pull && options_.dry_run) &&
+        options_.source_folder < 0 && IsMissing(settings_.source)) {
+        return Fail(STATUS_FILE_SELECT, (settings_.pull ? "the folder " : "the source ") +
+                                            settings_.source + " does not exist");
     }
-    InvocationContext context = {settings_,     config_,       options_,
+    InvocationContext context = {settings_,     route_,        config_,  options_,
                                  settings_.acl, settings_.acl, log_file_};
+    const bool may_keep = options_.keep_versions && !options_.dry_run && !settings_.list_only &&
+                          route_.transport != Transport::DIRECTORY_OVER_SSH;
+    // A run that is a whole push is what it is, or fails.
+    const bool starts = !options_.start.empty();
+    bool keeps = may_keep && (starts || !g_servers_without_versions.Has(route_.name));
+    bool turned = starts;  // between the two once: a server that refuses both has another reason
+    const std::string start = starts ? CommandText(RandomId(), options_.start) : "";
+    if (start.size() > kMaxCommandBytes) {
+        return Fail(STATUS_COMMAND_TOO_LONG, "the start has " + std::to_string(start.size()) +
+                                                 " bytes and rsync carries no more than " +
+                                                 std::to_string(kMaxCommandBytes));
+    }
     while (true) {
         OutputParser parser(options_, settings_.list_only);
         PrivateFolder files;
+        context.versions = keeps ? RandomId() : "";
+        context.start_file = starts ? files.Write("start", start) : "";
         const int status = RunRsync(cancelled, CopyInvocation(context, &files), &parser, {});
         parser.Finish();
         parser.FillReport(&outcome_);
+        outcome_.begun = parser.Begun();
+        if (may_keep && !turned && status != STATUS_DONE &&
+            outcome_.cause != RunCause::NO_LISTED_CHANGES &&
+            messages_.find(keeps ? kBackupRefused : kRefused) != std::string::npos) {
+            turned = true;
+            keeps = !keeps;
+            if (keeps) {
+                g_servers_without_versions.Remove(route_.name);  // it has been upgraded
+            } else {
+                g_servers_without_versions.Add(route_.name);
+            }
+            continue;
+        }
         const RefusedAttributes refused = FindRefusedAttributes(Facts(status));
         const bool less = (context.acls && refused.acls) || (context.xattrs && refused.xattrs);
-        if (status == STATUS_DONE || !less) {
+        if (status == STATUS_DONE || !less || starts) {
             return status;
         }
         context.acls = context.acls && !refused.acls;
         context.xattrs = context.xattrs && !refused.xattrs;
         syslog(LOG_NOTICE, "tarqrsync: %s cannot keep %s of %s: copying without",
-               settings_.host.c_str(),
+               settings_.pull ? "this machine" : route_.name.c_str(),
                refused.acls ? "the access control lists" : "the extended attributes",
                settings_.source.c_str());
     }
@@ -276,14 +343,17 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
                   OutputParser* parser, const ChildLimits& limits) {
     outcome_.explanation.clear();
     outcome_.details.clear();
+    outcome_.cause = RunCause::NONE;
+    outcome_.incomplete.clear();
     messages_.clear();
     ChildSetup setup;
-    setup.program = base::FindProgram(config_.rsync, PathVariable(invocation.environment));
+    setup.program = base::FindProgram(config_.rsync, SearchPath());
     setup.arguments = invocation.arguments;
     setup.arguments.insert(setup.arguments.begin(), config_.rsync);
     setup.environment = invocation.environment;
     setup.input = invocation.input;
     setup.max_file_bytes = limits.max_file_bytes;
+    setup.folder = settings_.is_command ? -1 : options_.source_folder;
     if (setup.program.empty()) {
         return Fail(STATUS_RSYNC_MISSING, "the program " + config_.rsync + " is not installed");
     }
@@ -291,11 +361,17 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     MessageKeeper keeper;
     RunWatch watch(PatienceOfRun());
     RunWatch::Fault fault = RunWatch::Fault::NONE;
-    setup.on_start = [&](pid_t rsync) { watch.Started(rsync); };
+    setup.on_start = [&](pid_t rsync) {
+        watch.Started(rsync);
+        if (options_.background) {
+            base::GiveWay(rsync);
+        }
+    };
     const ChildResult result = base::RunChild(
         setup,
         [&] {
-            fault = watch.Look(parser->Begun());
+            // What a server says before its answer does not extend a command's time.
+            fault = watch.Look(!settings_.is_command && parser->Begun());
             parser->Tick(watch.SecondsStill());
             return fault != RunWatch::Fault::NONE || (cancelled && cancelled());
         },
@@ -343,6 +419,9 @@ int Run::RunRsync(const std::function<bool()>& cancelled, const Invocation& invo
     }
     const Verdict verdict = Judge(Facts(exit_code));
     outcome_.cause = verdict.cause;
+    if (verdict.cause == RunCause::UNREADABLE_SOURCE || verdict.cause == RunCause::BUSY_SOURCE) {
+        outcome_.incomplete = IncompleteEntries(Facts(exit_code), &outcome_.all_incomplete);
+    }
     return Fail(verdict.status, verdict.first_line);
 }
 
@@ -355,7 +434,7 @@ Patience Run::PatienceOfRun() const {
 }
 
 int Run::FailByWatch(RunWatch::Fault fault) {
-    const std::string& host = settings_.host;
+    const std::string& host = route_.name;
     const std::string patience = SecondsText(config_.answer_seconds);
     switch (fault) {
         case RunWatch::Fault::SILENT:

@@ -10,6 +10,7 @@
 #include "platform/tarqrsync/explain.h"
 #include "platform/tarqrsync/output_parser.h"
 #include "platform/tarqrsync/private_folder.h"
+#include "platform/tarqrsync/route.h"
 #include "platform/tarqrsync/run_watch.h"
 #include "platform/tarqrsync/settings.h"
 #include "tarq/rsync_wrapper.h"
@@ -48,11 +49,14 @@ private:
     int RunRsync(const std::function<bool()>& cancelled, const Invocation& invocation,
                  OutputParser* parser, const ChildLimits& limits);
     int Fail(int status, const std::string& first_line);
-    RunFacts Facts(int exit_code) const { return {settings_, config_, exit_code, messages_}; }
+    RunFacts Facts(int exit_code) const {
+        return {settings_, route_, config_, exit_code, messages_};
+    }
 
     const Settings& settings_;
     const RunOptions& options_;
     base::RsyncConfig config_;
+    Route route_;
     PrivateFolder folder_;
     std::string log_file_;
     std::string messages_;  // what rsync and ssh wrote

@@ -6,7 +6,7 @@ namespace Backup {
 namespace {
 
 constexpr std::chrono::seconds kLookEvery(1);
-// What ssh and rsync say between looks to show that they live is less.
+// The keep-alive traffic of ssh and rsync between two checks is less than this.
 constexpr uint64_t kLeastMovement = 256;
 
 }  // namespace

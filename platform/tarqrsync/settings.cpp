@@ -24,14 +24,17 @@ bool HasAny(const std::string& text, const char* unwanted) {
     return text.find_first_of(unwanted) != std::string::npos;
 }
 
+bool HasNul(const std::string& text) {
+    return text.find('\0') != std::string::npos;
+}
+
 bool HasParentStep(const std::string& path) {
     return ("/" + path + "/").find("/../") != std::string::npos;
 }
 
-bool IsHost(const std::string& host) {
-    return !host.empty() && host[0] != '-' && std::all_of(host.begin(), host.end(), [](char c) {
-        return base::IsLetterOrDigit(c) || c == '.' || c == '-' || c == '_' || c == ':' || c == '%';
-    });
+// Relative, and nowhere else than below the folder that it is relative to.
+bool IsPathWithin(const std::string& path) {
+    return path.compare(0, 1, "/") != 0 && !HasNul(path) && !HasParentStep(path);
 }
 
 std::string RefusalOfAccount(const Settings& settings) {
@@ -77,23 +80,24 @@ std::string RefusalOfCopy(const Settings& settings) {
     if (!settings.list_only && settings.source.empty()) {
         return "no source is given to copy from";
     }
-    const auto holds_nul = [](const std::string& text) {
-        return text.find('\0') != std::string::npos;
-    };
-    if (holds_nul(settings.source) ||
-        std::any_of(settings.exclude_rules.begin(), settings.exclude_rules.end(), holds_nul)) {
+    if (HasNul(settings.source) ||
+        std::any_of(settings.exclude_rules.begin(), settings.exclude_rules.end(), HasNul)) {
         return "the source or an exclude rule holds a NUL byte";
+    }
+    for (const std::string& path : settings.pull.value_or(PullOptions()).paths) {
+        if (path.empty() || !IsPathWithin(path)) {
+            return "a path to bring back is empty, begins with '/', or holds '..' or a NUL byte";
+        }
     }
     return "";
 }
 
 }  // namespace
 
-Transport TransportOf(const Settings& settings) {
-    if (!settings.is_command && settings.module.compare(0, 1, "/") == 0) {
-        return Transport::DIRECTORY_OVER_SSH;
-    }
-    return settings.ssh ? Transport::DAEMON_OVER_SSH : Transport::DAEMON;
+bool IsHost(const std::string& host) {
+    return !host.empty() && host[0] != '-' && std::all_of(host.begin(), host.end(), [](char c) {
+        return base::IsLetterOrDigit(c) || c == '.' || c == '-' || c == '_' || c == ':' || c == '%';
+    });
 }
 
 std::string RefusalOf(const Settings& settings) {
@@ -111,6 +115,18 @@ std::string RefusalOf(const Settings& settings) {
         return refusal;
     }
     return settings.is_command ? RefusalOfCommand(settings) : RefusalOfCopy(settings);
+}
+
+std::string RefusalOf(const RunOptions& options) {
+    for (const auto* const paths : {&options.changes, &options.files}) {
+        if (!std::all_of(paths->begin(), paths->end(), IsPathWithin)) {
+            return "a path of the source begins with '/', or holds '..' or a NUL byte";
+        }
+    }
+    if (std::any_of(options.start.begin(), options.start.end(), HasControl)) {
+        return "a line of the start holds a line break or another control character";
+    }
+    return "";
 }
 
 std::string OutfileOf(const std::list<std::string>& command) {

@@ -1,7 +1,10 @@
 #pragma once
 
 #include <list>
+#include <optional>
 #include <string>
+
+#include "tarq/rsync_wrapper.h"
 
 namespace TARQ {
 namespace Backup {
@@ -9,6 +12,7 @@ namespace Backup {
 /// What the setters of a wrapper have said. The meanings and defaults are theirs.
 struct Settings {
     bool delete_missing = false;
+    bool deletes_changes = false;  ///< RunOptions::deletes_changes, as far as anything is deleted
     bool numeric_ids = false;
     bool account = false;
     bool account_required = false;
@@ -33,21 +37,18 @@ struct Settings {
     std::string password;
     std::string module;
     std::string sub_path;
+    std::optional<PullOptions> pull;
 };
 
-/// The way to the server.
-enum class Transport {
-    DAEMON,             ///< straight to the rsync daemon
-    DAEMON_OVER_SSH,    ///< to the same daemon, through a connection that ssh forwards
-    DIRECTORY_OVER_SSH  ///< to an rsync that ssh starts: a directory, no module
-};
-
-/// A module that begins with "/" is a directory; a command always goes to the daemon.
-Transport TransportOf(const Settings& settings);
+/// Whether `host` is a name or an address, and safe to put in an argument list.
+bool IsHost(const std::string& host);
 
 /// Why these settings cannot be run, for a person; empty when they can. Whatever is let through is
 /// safe to put in an argument list.
 std::string RefusalOf(const Settings& settings);
+
+/// The same of the paths in the options.
+std::string RefusalOf(const RunOptions& options);
 
 /// The value of the line outfile="..." of a command; empty when it has none.
 std::string OutfileOf(const std::list<std::string>& command);

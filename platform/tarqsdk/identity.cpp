@@ -16,8 +16,8 @@
 namespace tarq_sdk {
 namespace {
 
-// The board's number comes second: a mainboard that is replaced takes it along, the case's label
-// stays.
+// The board's number comes second: it changes when the mainboard is replaced, that of the case does
+// not.
 constexpr const char* kSources[] = {
     "/class/dmi/id/product_serial",
     "/class/dmi/id/board_serial",

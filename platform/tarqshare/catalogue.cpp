@@ -1,8 +1,7 @@
 #include "platform/tarqshare/catalogue.h"
 
-#include <fcntl.h>
 #include <strings.h>
-#include <sys/file.h>
+#include <syslog.h>
 #include <tarq/core.h>
 #include <tarq/owners.h>
 #include <tarq/root_path.h>
@@ -12,6 +11,7 @@
 #include <array>
 #include <cerrno>
 #include <charconv>
+#include <chrono>
 #include <cstdio>
 
 #include "base/utf8.h"
@@ -28,6 +28,7 @@ using tarq_internal::ValueOf;
 
 constexpr char kCatalogue[] = "/usr/tarq/etc/tarqshare.conf";
 constexpr char kLockFile[] = "/usr/tarq/etc/tarqshare.conf.lock";
+constexpr std::chrono::seconds kLongestWait(20);  // writers hold it for milliseconds
 constexpr char kKeyFolder[] = "/usr/tarq/etc/.encrypt/";
 
 constexpr size_t kMaxNameBytes = 80;
@@ -258,18 +259,16 @@ bool EraseShare(const std::string& name) {
 
 CatalogueLock::CatalogueLock(Patience patience)
     // Beside the catalogue, which every write replaces by another file.
-    : file_(open(TARQ::RootPath(kLockFile).c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW,
-                 0600)) {
-    if (!file_) {
-        Refuse(TARQ_ERR_OPEN_FILE);
-        return;
+    : lock_(TARQ::RootPath(kLockFile),
+            patience == Patience::kWait ? kLongestWait : std::chrono::seconds(0)) {
+    if (!lock_) {
+        const int reason = errno;
+        if (patience == Patience::kWait) {
+            syslog(LOG_ERR, "tarqshare: %s", lock_.Problem().c_str());
+        }
+        errno = reason;
+        Refuse(reason == EWOULDBLOCK ? TARQ_ERR_SEMAPHORE : TARQ_ERR_OPEN_FILE);
     }
-    const int wish = patience == Patience::kWait ? LOCK_EX : LOCK_EX | LOCK_NB;
-    int result = 0;
-    do {
-        result = flock(file_.Get(), wish);
-    } while (result != 0 && errno == EINTR);
-    locked_ = result == 0 || Refuse(TARQ_ERR_OPEN_FILE);
 }
 
 }  // namespace tarq_share

@@ -8,8 +8,8 @@
 #include <utility>
 #include <vector>
 
-#include "base/unique_fd.h"
-#include "platform/tarqshare/identity.h"
+#include "base/file_lock.h"
+#include "base/folder_identity.h"
 #include "platform/tarqshare/volume.h"
 
 namespace tarq_share {
@@ -17,23 +17,21 @@ namespace tarq_share {
 /// A share as its section describes it.
 struct Share {
     std::string name;
-    std::string path;            ///< absolute; empty when the section names none
-    unsigned int flags = 0;      ///< TARQShareFlag bits and whatever other bits the section has
-    int key_length = 0;          ///< bits
-    std::string encrypted_path;  ///< the folder of the encrypted form, set or by default; for
-                                 ///< encrypted shares alone
-    std::string key_file;        ///< exported key, set or by default
-    std::string auto_key_file;   ///< key for opening at start-up, set or by default
-    Volume volume;      ///< what was recorded when the share was added; no mount point: nothing was
-    Identity identity;  ///< recorded, of the folder whose files travel; no kind of file system:
-                        ///< nothing was
+    std::string path;               ///< absolute; empty when the section names none
+    unsigned int flags = 0;         ///< TARQShareFlag bits and any other bits that the section has
+    int key_length = 0;             ///< bits
+    std::string encrypted_path;     ///< encrypted shares: the folder of the encrypted form
+    std::string key_file;           ///< exported key, set or by default
+    std::string auto_key_file;      ///< key for opening at start-up, set or by default
+    Volume volume;                  ///< as recorded; nothing was when the mount point is empty
+    base::FolderIdentity identity;  ///< as recorded; nothing was when the file system is empty
 
     bool IsEncrypted() const;
     /// The folder whose files travel: the encrypted form's, where there is one.
     const std::string& DataFolder() const { return IsEncrypted() ? encrypted_path : path; }
 };
 
-/// What `share` is known again by, and how the catalogue calls it.
+/// The facts by which `share` is recognised, with their keys in the catalogue.
 std::vector<std::pair<const char*, std::string>> FactsOf(const Share& share);
 
 /// Sets each of them in `into`. False with the error code set.
@@ -42,7 +40,7 @@ bool AddFacts(const Share& share, KAPICSzHash into);
 /// Whether a share may be given this name: see TARQShareAdd.
 bool IsShareName(const std::string& name);
 
-/// Flag words as text: "encrypted|acl", "0x82", "130", also mixed; blanks, commas and "|" part
+/// Flag words as text: "encrypted|acl", "0x82", "130", also mixed; blanks, commas and "|" separate
 /// them. Nothing when a word is not known: an encrypted share must not be taken for a plain one.
 std::optional<unsigned int> ParseFlags(const std::string& text);
 std::string FormatFlags(unsigned int flags);
@@ -69,11 +67,10 @@ public:
     enum class Patience { kWait, kNone };
     explicit CatalogueLock(Patience patience = Patience::kWait);
     /// False, with the error code set, when the lock cannot be had.
-    explicit operator bool() const { return locked_; }
+    explicit operator bool() const { return static_cast<bool>(lock_); }
 
 private:
-    base::UniqueFd file_;
-    bool locked_ = false;
+    base::FileLock lock_;
 };
 
 }  // namespace tarq_share

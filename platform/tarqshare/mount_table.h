@@ -13,15 +13,13 @@ struct Mount {
     uint64_t parent_id;  ///< the mount that this one lies on
     unsigned int major;  ///< the file system's device; major 0: no single block device behind it
     unsigned int minor;
-    std::string
-        root;  ///< what of the file system is mounted; "/" except for bind mounts and subvolumes
+    std::string root;  ///< which part of it is mounted: "/", but for bind mounts and subvolumes
     std::string mount_point;
     std::string type;    ///< "ext4", "nfs4", "fuse.sshfs"
-    std::string source;  ///< "/dev/sda1", "nas:/export", "tmpfs": the file system's own word
+    std::string source;  ///< "/dev/sda1", "nas:/export", "tmpfs": as the file system says it
 };
 
-/// Parses the table, in the order of the lines. Lines that are not of the table's form are passed
-/// over.
+/// Parses the table, in the order of the lines. Malformed lines are skipped.
 std::vector<Mount> ParseMountTable(const std::string& text);
 
 /// The mount that `real_path` (absolute, no links, no "..") lies on: the one with the kernel's

@@ -19,7 +19,6 @@
 #include "platform/internal/config.h"
 #include "platform/internal/error.h"
 #include "platform/tarqshare/catalogue.h"
-#include "platform/tarqshare/identity.h"
 #include "platform/tarqshare/mount_table.h"
 #include "platform/tarqshare/volume.h"
 
@@ -27,6 +26,8 @@ static_assert(sizeof(TARQVolumePath) == 132, "callers know the record by its siz
 
 namespace {
 
+using base::FolderIdentity;
+using base::IdentityOf;
 using base::UniqueFd;
 using tarq_internal::CopyOut;
 using tarq_internal::Fail;
@@ -35,8 +36,6 @@ using tarq_share::AddFacts;
 using tarq_share::CatalogueLock;
 using tarq_share::FactsOf;
 using tarq_share::FindVolume;
-using tarq_share::Identity;
-using tarq_share::IdentityOf;
 using tarq_share::IsWithin;
 using tarq_share::ReadShare;
 using tarq_share::ReadShareNames;
@@ -69,7 +68,7 @@ UniqueFd OpenFolder(const std::string& path) {
 int LookAt(Share* share) {
     const std::string& path = share->DataFolder();
     const UniqueFd folder = OpenFolder(path);
-    const std::optional<Identity> identity = folder ? IdentityOf(folder.Get()) : std::nullopt;
+    const std::optional<FolderIdentity> identity = folder ? IdentityOf(folder.Get()) : std::nullopt;
     if (!identity) {
         return Fail(TARQ_ERR_SHARE_FOLDER);
     }
@@ -136,7 +135,7 @@ int CheckData(const Share& share) {
         errno = reason;
         return Fail(TARQ_ERR_SHARE_FOLDER);
     }
-    const std::optional<Identity> now = IdentityOf(folder.Get());
+    const std::optional<FolderIdentity> now = IdentityOf(folder.Get());
     if (!now) {
         return Fail(TARQ_ERR_SHARE_FOLDER);
     }

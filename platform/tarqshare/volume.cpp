@@ -22,7 +22,7 @@ namespace {
 
 namespace fs = std::filesystem;
 
-// Deeper stacks of device mappings or of file systems on file systems are not built by people.
+// Nobody stacks device mappings or file systems deeper than this.
 constexpr int kMaxDepth = 16;
 
 constexpr const char* kRemoteTypes[] = {
@@ -53,7 +53,7 @@ constexpr const char* kRemoteTypes[] = {
     "smbfs",
     "virtiofs",
 };
-// Unions of this machine's disks. What another file system in user space stands on is not known.
+// File systems in user space that combine local disks. Where others keep their data is not known.
 constexpr const char* kLocalUserSpaceTypes[] = {"fuse.mergerfs", "fuse.mhddfs", "fuse.unionfs",
                                                 "fuse.zfs", "fuseblk"};
 
@@ -176,7 +176,7 @@ private:
         if (std::regex_search(position, outside_bus)) {
             return true;
         }
-        // Memory of this kind that is soldered to the board calls itself "MMC", a card "SD".
+        // Of these devices, soldered memory reports the type "MMC", a removable card "SD".
         if (position.find("mmc_host/") != std::string::npos &&
             base::Trimmed(base::ReadFile(disk / "device/type").value_or("")) != "MMC") {
             return true;

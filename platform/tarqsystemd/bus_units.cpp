@@ -55,7 +55,7 @@ Outcome BusUnits::Stop(const std::string& unit) {
     if (outcome == Outcome::kDone) {
         return outcome;
     }
-    // The manager refuses to stop a unit that it has not loaded, and that is stopped well enough.
+    // The manager refuses to stop a unit that is not loaded; such a unit is stopped already.
     const int reason = errno;
     UnitState state;
     if (GetState(unit, &state) && (state.active == "inactive" || state.active == "failed")) {

@@ -49,8 +49,8 @@ private:
     sd_bus_error error_ = SD_BUS_ERROR_NULL;
 };
 
-/// A queued job that is waited for. The end may be announced before the answer that names the job
-/// is looked at, so all ends that arrive are looked at only once the job is known.
+/// A queued job to wait for. Its end may be announced before the reply that names the job is
+/// processed, so announced ends are collected, and compared once the name is known.
 struct JobEnds {
     std::string job;
     std::string result;

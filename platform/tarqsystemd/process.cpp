@@ -66,7 +66,7 @@ bool Send(int fd, const Value& value) {
     }
     closefrom(kLinkFd + 1);
 
-    // The caller's ignored and blocked signals are no business of the command's.
+    // The command must not inherit the caller's ignored and blocked signals.
     base::ResetSignals();
 
     const pid_t self = getpid();
@@ -118,7 +118,7 @@ std::optional<Process> Process::Open(const ProcessId& id) {
     if (id.pid <= 0) {
         return std::nullopt;
     }
-    // The handle first: the process that has the number after that has kept it since.
+    // The handle comes first: a process that still has the number afterwards is the handle's.
     UniqueFd handle(pidfd_open(id.pid, 0));
     const std::optional<ProcessId> now = LookUpProcess(id.pid);
     if (!handle || !now || now->start_time != id.start_time) {
@@ -132,8 +132,8 @@ bool Process::Signal(int number) const {
 }
 
 bool Process::KillGroup() const {
-    // The group is reached by number alone. Stopped, the process cannot end meanwhile, and its
-    // number stays its own.
+    // A group can only be signalled by its number. While the process is stopped it cannot end, so
+    // that the number cannot be reused.
     if (!Signal(SIGSTOP)) {
         return false;
     }
@@ -202,7 +202,7 @@ std::optional<BackgroundLaunch> BackgroundLaunch::Prepare(const std::vector<std:
     UniqueFd other(ends[1]);
     const std::vector<char*> arguments = base::ArgumentVector(words);
 
-    // The process in between ends at once, so that the command is nobody's child here.
+    // The intermediate process ends at once, so that the command is not a child of the caller.
     const pid_t between = fork();
     if (between == 0) {
         setsid();

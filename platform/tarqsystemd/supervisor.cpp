@@ -1,8 +1,7 @@
 #include "platform/tarqsystemd/supervisor.h"
 
-#include <fcntl.h>
 #include <signal.h>
-#include <sys/file.h>
+#include <syslog.h>
 #include <tarq/core.h>
 #include <tarq/root_path.h>
 #include <unistd.h>
@@ -13,9 +12,9 @@
 #include <sstream>
 #include <vector>
 
+#include "base/file_lock.h"
 #include "base/replace_file.h"
 #include "base/text.h"
-#include "base/unique_fd.h"
 #include "base/whole_file.h"
 #include "platform/internal/config.h"
 #include "platform/tarqsystemd/process.h"
@@ -23,7 +22,6 @@
 namespace tarq_systemd {
 namespace {
 
-using base::UniqueFd;
 using std::chrono::seconds;
 using tarq_internal::ReadResult;
 
@@ -31,31 +29,11 @@ constexpr char kConfiguration[] = "/usr/tarq/etc/tarqsystemd.conf";
 constexpr char kRunFolder[] = "/var/run/";
 constexpr seconds kStopLimit(30);
 constexpr uint64_t kLongestStopLimit = 86400;
-constexpr seconds kKillLimit(10);  // for the kernel to take down what no longer has a say in it
+constexpr seconds kKillLimit(10);  // for a process to disappear after SIGKILL
 
 std::string PidFile(const std::string& unit) {
     return TARQ::RootPath(kRunFolder + unit + ".pid");
 }
-
-/// The right to change a unit's state, among all processes; waits for it.
-class UnitLock {
-public:
-    explicit UnitLock(const std::string& unit)
-        : file_(open(TARQ::RootPath(kRunFolder + unit + ".lock").c_str(),
-                     O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600)) {
-        while (file_ && !locked_) {
-            locked_ = flock(file_.Get(), LOCK_EX) == 0;
-            if (!locked_ && errno != EINTR) {
-                break;
-            }
-        }
-    }
-    explicit operator bool() const { return locked_; }
-
-private:
-    UniqueFd file_;
-    bool locked_ = false;
-};
 
 /// The unit's process when it runs. False, with errno set, when that cannot be found out.
 bool FindProcess(const std::string& unit, std::optional<Process>* process) {
@@ -119,6 +97,23 @@ bool ReadStopLimit(const std::string& unit, seconds* limit) {
     return true;
 }
 
+/// The right to change a unit's state, among all processes. Waits for as long as a stop may take.
+/// An empty lock, with the error code set, when it cannot be had.
+base::FileLock LockUnit(const std::string& unit) {
+    seconds stop;
+    if (!ReadStopLimit(unit, &stop)) {
+        return {};
+    }
+    base::FileLock lock(TARQ::RootPath(kRunFolder + unit + ".lock"), stop + 2 * kKillLimit);
+    if (!lock) {
+        const int reason = errno;
+        syslog(LOG_ERR, "tarqsystemd: %s", lock.Problem().c_str());
+        errno = reason;
+        Failed(TARQ_ERR_SERVICE);
+    }
+    return lock;
+}
+
 }  // namespace
 
 Status Supervisor::StatusOf(const std::string& unit) {
@@ -131,9 +126,12 @@ Status Supervisor::StatusOf(const std::string& unit) {
 }
 
 Outcome Supervisor::Start(const std::string& unit) {
-    const UnitLock lock(unit);
+    const base::FileLock lock = LockUnit(unit);
+    if (!lock) {
+        return Outcome::kFailed;
+    }
     std::optional<Process> process;
-    if (!lock || !FindProcess(unit, &process)) {
+    if (!FindProcess(unit, &process)) {
         return Failed(TARQ_ERR_SERVICE);
     }
     if (process) {
@@ -159,9 +157,12 @@ Outcome Supervisor::Start(const std::string& unit) {
 }
 
 Outcome Supervisor::Stop(const std::string& unit) {
-    const UnitLock lock(unit);
+    const base::FileLock lock = LockUnit(unit);
+    if (!lock) {
+        return Outcome::kFailed;
+    }
     std::optional<Process> process;
-    if (!lock || !FindProcess(unit, &process)) {
+    if (!FindProcess(unit, &process)) {
         return Failed(TARQ_ERR_SERVICE);
     }
     if (process) {

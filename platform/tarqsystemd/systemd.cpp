@@ -20,7 +20,7 @@ using tarq_systemd::Outcome;
 using tarq_systemd::Status;
 using tarq_systemd::UnitManager;
 
-constexpr size_t kMaxUnitName = 200;  // with a suffix of ours it still is a file's name
+constexpr size_t kMaxUnitName = 200;  // still a valid file name with our suffix
 
 std::unique_ptr<UnitManager> Manager() {
     if (TARQ::RootFolder().empty() && sd_booted() > 0) {

@@ -1,11 +1,13 @@
 #include "programs/common/beacon.h"
 
 #include <chrono>
+#include <list>
 #include <system_error>
 #include <utility>
 
 #include "ZEL/log.h"
 #include "ZEL/rsyncer.h"
+#include "programs/common/task_fields.h"
 
 namespace programs {
 
@@ -26,6 +28,11 @@ Beacon::Beacon(const ZEL::SyncInfo& info, std::string task) : info_(info), task_
     }
 }
 
+void Beacon::SetShare(const std::string& share) {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    share_ = share;
+}
+
 bool Beacon::Stop() {
     if (thread_.joinable()) {
         {
@@ -42,16 +49,25 @@ void Beacon::Run() {
     ZEL::Rsyncer rsyncer;
     rsyncer.SetTaskSetup([this](ZEL::Rsyncer::RsyncTask& task) {
         task.SetCanceller([this] { return stop_.load(); });
+        TARQ::Backup::RunOptions options;
+        options.server = ServerOf(info_);
+        task.setRunOptions(options);
     });
     bool ready = false;
     std::unique_lock<std::mutex> lock(mutex_);
     while (!wake_.wait_for(lock, kEvery, [this] { return stop_.load(); })) {
+        const std::string share = share_;
         lock.unlock();
         ready = ready || rsyncer.Initialize(info_) == 0;
-        int status = 0;
-        if (ready) {
+        std::list<std::string> lines;
+        if (ready && rsyncer.GenSendBeaconCmd(task_, lines) == 0) {
+            if (!share.empty()) {
+                lines.push_back("shareName=\"" + share + "\"");
+            }
             sent_ = true;
-            rsyncer.SendBeacon(task_, status);
+            ZEL::Rsyncer::RsyncTask beacon;
+            rsyncer.InitRsyncTask(beacon, false);
+            beacon.ExecuteCmd(lines, nullptr);
         }
         lock.lock();
     }

@@ -1,4 +1,4 @@
-// The sign of life of a run that lasts.
+// The heartbeat of a long run.
 #pragma once
 
 #include <atomic>
@@ -11,9 +11,8 @@
 
 namespace programs {
 
-/// Tells the server once a minute that a task is alive, from a thread and a connection of its own:
-/// a server that hears nothing for two takes the task for dead. A beacon that fails is no reason to
-/// end the run.
+/// Reports once a minute, from its own thread and connection, that a task is alive: a server that
+/// hears nothing for two minutes considers the task dead. A failed report does not end the run.
 class Beacon {
 public:
     Beacon(const ZEL::SyncInfo& info, std::string task);
@@ -21,7 +20,10 @@ public:
     Beacon(const Beacon&) = delete;
     Beacon& operator=(const Beacon&) = delete;
 
-    /// Ends the thread. Whether the server was told anything.
+    /// The share that is being pushed, which the server then keeps open. Empty: none.
+    void SetShare(const std::string& share);
+
+    /// Ends the thread. Returns whether any report was sent.
     bool Stop();
 
 private:
@@ -30,9 +32,10 @@ private:
     ZEL::SyncInfo info_;
     std::string task_;
     std::mutex mutex_;
+    std::string share_;  // guarded by the mutex
     std::condition_variable wake_;
     std::atomic<bool> stop_{false};
-    bool sent_ = false;  // the thread's until it was joined
+    bool sent_ = false;  // written by the thread; read after it was joined
     std::thread thread_;
 };
 

@@ -1,14 +1,14 @@
-// A program that does by itself what must be quick, and loads the rest, with all that stands below
-// it, when it is asked for more: loading the whole takes longer than a short command.
+// For programs that implement only quick commands themselves, and load a library with all others on
+// demand: loading everything would take longer than running a short command.
 #pragma once
 
-/// All of a program's command line; gives its exit code. In the library that the program loads.
+/// The whole command line of a program; returns its exit code. Defined in the loaded library.
 extern "C" __attribute__((visibility("default"))) int RunCommandLine(int argc, char** argv);
 
 namespace programs {
 
-/// Loads `library`, which lies beside the program's libraries, and gives what its RunCommandLine()
-/// gives. Without it, says so as `program` and gives `missing`.
+/// Loads `library` from the folder of the program's libraries and returns the result of its
+/// RunCommandLine(). If it is missing, prints an error as `program` and returns `missing`.
 int RunFromLibrary(const char* program, const char* library, int missing, int argc, char** argv);
 
 }  // namespace programs

@@ -4,6 +4,8 @@
 #include <cstdio>
 #include <cstring>
 
+#include "programs/common/text.h"
+
 namespace programs {
 
 Failure SystemFailure(const std::string& what, FailureKind kind) {
@@ -16,7 +18,7 @@ Failure ReportedFailure(FailureKind kind) {
 
 void Report(const char* program, const std::string& text) {
     if (!text.empty()) {
-        fprintf(stderr, "%s: %s\n", program, text.c_str());
+        fprintf(stderr, "%s: %s\n", program, PrintableLines(text).c_str());
     }
 }
 

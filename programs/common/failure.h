@@ -1,5 +1,5 @@
-// The one way in which the programs fail: thrown where something cannot be done, caught at each
-// program's edge, which makes an exit status or a reply of it.
+// The one error type of the programs: thrown where something fails, and turned into an exit status
+// or a reply at the outermost level of each program.
 #pragma once
 
 #include <functional>
@@ -8,27 +8,27 @@
 
 namespace programs {
 
-/// What went wrong, as far as callers act on it.
+/// What kind of problem it was, as far as callers need to know.
 enum class FailureKind {
-    kNone,       ///< nothing: a run that went well
-    kFailed,     ///< the connection, rsync or the server failed: worth another try
-    kUsage,      ///< what was asked for is wrong or not there
-    kLocal,      ///< something on this machine: a share, its volume, a file, a daemon that is not
-                 ///< running
+    kNone,       ///< no failure
+    kFailed,     ///< the connection, rsync or the server failed: a retry may help
+    kUsage,      ///< the request is wrong, or what it names does not exist
+    kLocal,      ///< a problem on this machine: share, volume, file, a daemon that is not running
     kRefused,    ///< the server refuses: conflict, account, password, switch
     kCancelled,  ///< ended by a person
-    kBusy        ///< what was copied changed at the same time: worth another try soon
+    kConfirm,    ///< it waits until a person allows it
+    kBusy        ///< files changed while they were copied: an early retry may help
 };
 
-/// What a program that fails so exits with; the manual pages list them.
+/// The exit status of a program for this kind of failure; the manual pages list them.
 constexpr int ExitStatusOf(FailureKind kind) {
     return static_cast<int>(kind == FailureKind::kBusy ? FailureKind::kFailed : kind);
 }
 
 class Failure : public std::runtime_error {
 public:
-    /// `text`: what failed, where and what to do. `status`: the code that a protocol has for it (a
-    /// ZEL::ResultCode in the daemon, a server's or rsync's status in a run); 0 where there is
+    /// `text`: what failed, where, and what to do. `status`: the code for it in a protocol (a
+    /// ZEL::ResultCode in the daemon, a status of the server or of rsync in a run); 0 if there is
     /// none.
     Failure(FailureKind kind, const std::string& text, int status = 0)
         : std::runtime_error(text), kind_(kind), status_(status) {}
@@ -42,16 +42,17 @@ private:
     int status_;
 };
 
-/// A call of the system has failed: `what`, with the reason of errno behind it.
+/// A failed system call: `what`, followed by the error text of errno.
 Failure SystemFailure(const std::string& what, FailureKind kind = FailureKind::kFailed);
 
-/// A failure that the person has read about already: only its exit status is left. Has no text.
+/// A failure whose text was already printed: only the exit status is left. Its text is empty.
 Failure ReportedFailure(FailureKind kind);
 
-/// Writes "program: text" to standard error; nothing when there is no text.
+/// Writes "program: text", made printable, to standard error; nothing when the text is empty.
 void Report(const char* program, const std::string& text);
 
-/// The edge of a program: runs `command`, reports what it fails with, and gives the exit status.
+/// The outermost level of a program: runs `command`, reports its failure and returns the exit
+/// status.
 int RunReporting(const char* program, const std::function<void()>& command);
 
 }  // namespace programs

@@ -16,7 +16,7 @@ namespace programs {
 namespace {
 
 constexpr size_t kWidth = 80;
-constexpr size_t kColumn = 26;  // where the descriptions begin
+constexpr size_t kColumn = 26;  // where descriptions begin
 
 std::string Upper(std::string text) {
     std::transform(text.begin(), text.end(), text.begin(),
@@ -24,7 +24,7 @@ std::string Upper(std::string text) {
     return text;
 }
 
-// "  name     about", about in a column of its own, wrapped between words.
+// "  name     about", with `about` wrapped in a column of its own.
 std::string Entry(const std::string& name, const std::string& about) {
     std::string text = "  " + name;
     size_t column = text.size();
@@ -53,7 +53,7 @@ std::string Entry(const std::string& name, const std::string& about) {
     return text + "\n";
 }
 
-/// Writes a command's help without the forms in which the parser keeps it.
+/// Writes a command's help without the parser's internal notation.
 class PlainFormatter : public CLI::Formatter {
 public:
     PlainFormatter() {
@@ -65,7 +65,7 @@ public:
         if (positional) {
             return Upper(option->get_name(true, false));
         }
-        // A name that says "no" carries its value along: --no-ssh{false}.
+        // The name of a negated option includes its value: --no-ssh{false}.
         std::string name;
         bool inside = false;
         for (const char c : option->get_name(false, true)) {
@@ -94,7 +94,7 @@ public:
         if (option->nonpositional() && option->get_required()) {
             add("required");
         }
-        // The bounds stand behind the type's name.
+        // The bounds follow the type's name.
         const std::string type = option->get_type_name();
         const size_t colon = type.find(':');
         if (colon != std::string::npos) {
@@ -143,7 +143,7 @@ private:
     }
 };
 
-// "zelctl task add", as far as `app` has understood what it was given.
+// "zelctl task add": the commands that `app` has recognised.
 std::string CommandPath(const CLI::App* app, const CLI::App*& last) {
     std::string path = app->get_name();
     for (last = app; !last->get_subcommands().empty();) {
@@ -157,12 +157,12 @@ bool Has(const std::string& text, const char* part) {
     return text.find(part) != std::string::npos;
 }
 
-// What is wrong, where the parser would tell of its own types and counts.
+// The error text, reworded where the parser's own mentions its types and counts.
 std::string Complaint(const CLI::ParseError& error, const CLI::App& app) {
     std::string text = error.what();
     const auto kind = static_cast<CLI::ExitCodes>(error.get_exit_code());
     const std::vector<std::string> unknown = app.remaining(true);
-    // A word that nobody knows comes before what its absence leaves open.
+    // An unknown word is reported first: what seems to be missing may only be misspelled.
     if (!unknown.empty() &&
         (kind == CLI::ExitCodes::RequiredError || kind == CLI::ExitCodes::ExtrasError)) {
         const std::string& word = unknown.front();
@@ -215,7 +215,7 @@ void Parse(CLI::App& app, const std::vector<std::string>& words) {
         }
         const CLI::App* last = nullptr;
         const std::string path = CommandPath(&app, last);
-        // Nothing but options in front of commands: there is one wanted.
+        // Only options were given where a command is required.
         if (last->get_require_subcommand_min() > 0 &&
             error.get_exit_code() == static_cast<int>(CLI::ExitCodes::RequiredError)) {
             std::cerr << app.help();

@@ -7,9 +7,12 @@
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
+#include <vector>
 
 #include "ZEL/log.h"
 #include "ZEL/zel.h"
+#include "base/own_folder.h"
+#include "base/unique_fd.h"
 #include "programs/common/host.h"
 #include "programs/common/text.h"
 #include "tarq/owners.h"
@@ -21,21 +24,15 @@ namespace {
 
 constexpr int kAttempts = 3;
 
-// Whether nobody but us and root can put another file in the place of one of ours.
+// Whether only we and root can replace a file in that folder.
 bool IsOurs(const std::string& folder) {
-    struct stat info = {};
-    if (lstat(folder.c_str(), &info) != 0 || !S_ISDIR(info.st_mode) ||
-        access(folder.c_str(), W_OK | X_OK) != 0) {
-        return false;
-    }
-    const bool others_may_write = (info.st_mode & (S_IWGRP | S_IWOTH)) != 0;
-    return (info.st_uid == geteuid() || info.st_uid == 0) &&
-           (!others_may_write || (info.st_mode & S_ISVTX) != 0);
+    return base::IsOwnFolder(folder) && access(folder.c_str(), W_OK | X_OK) == 0;
 }
 
-// Puts a folder of ours in the place of what somebody else has put there, in one step, so that he
-// cannot be first once more. What was there lies beside it then, under a name that is told. Only
-// who may rename what lies in the folder above can do that: root, in /tmp. False with errno.
+// Atomically exchanges a folder of another user for one of ours, so that the other user cannot
+// create it again in between. The old one is kept under a name that is logged. It takes the right
+// to rename entries of the parent folder: in /tmp, only root has it. False, with errno set, on
+// failure.
 bool PutAside(const std::string& path) {
     std::string aside = path + ".XXXXXX";
     if (mkdtemp(aside.data()) == nullptr) {
@@ -66,7 +63,7 @@ std::string PrepareHost() {
                    "; run it as root, or set TARQ_ROOT to a folder of yours";
         }
     }
-    // What is in the way may go at any moment.
+    // The obstacle may disappear at any time, so there are several attempts.
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
         if (mkdir(scratch.c_str(), 0700) == 0) {
             return "";
@@ -82,6 +79,17 @@ std::string PrepareHost() {
     return scratch + " belongs to somebody else: remove it, or set TARQ_ROOT to a folder of yours";
 }
 
+int LackOfDescriptors(unsigned int count) {
+    std::vector<base::UniqueFd> held(count);
+    for (base::UniqueFd& fd : held) {
+        fd = base::UniqueFd(open("/", O_PATH | O_CLOEXEC));
+        if (!fd) {
+            return errno;
+        }
+    }
+    return 0;
+}
+
 std::string ShareProblem(const std::string& name) {
     const std::string shown = "share '" + Printable(name) + "'";
     TARQShare record = nullptr;
@@ -89,6 +97,10 @@ std::string ShareProblem(const std::string& name) {
     const TARQ::ShareOwner share(record);
     if (found < 0 || !share || share->path == nullptr) {
         const int error = KAPICErrGet();
+        // Who could open nothing has seen nothing of the share.
+        if (const int lack = LackOfDescriptors(kLookUpDescriptors)) {
+            return shown + " cannot be looked up: " + strerror(lack);
+        }
         const std::string remedy =
             error == TARQ_ERR_SHARE_IDENTITY
                 ? "if it is the right one: zelctl share confirm " + Printable(name)

@@ -4,54 +4,110 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <utility>
 
 #include "base/open_beneath.h"
 #include "base/unique_fd.h"
+#include "programs/common/mounts_below.h"
+#include "programs/common/share_path.h"
 
 namespace programs {
 
 namespace {
 
-bool IsBelow(const std::string& path, const std::string& folder) {
-    return folder == "/" || (path.size() > folder.size() && path[folder.size()] == '/' &&
-                             path.compare(0, folder.size(), folder) == 0);
+using Kind = PresentPath::Kind;
+
+constexpr char kTop[] = "/";
+
+/// What stands at a path.
+enum class Found {
+    kFolder,
+    kOther,  // a file or a link, with nothing below it
+    kNothing,
+    kUnknown  // it cannot be looked at, or only through something that is no folder
+};
+
+Found LookAt(int top, const std::string& path) {
+    const size_t begin = path.find_first_not_of('/');
+    const base::UniqueFd entry =
+        base::OpenBeneath(top, begin == std::string::npos ? "" : path.substr(begin), O_PATH);
+    struct stat info = {};
+    if (!entry) {
+        return errno == ENOENT ? Found::kNothing : Found::kUnknown;
+    }
+    return fstat(entry.Get(), &info) != 0 ? Found::kUnknown
+           : S_ISDIR(info.st_mode)        ? Found::kFolder
+                                          : Found::kOther;
 }
 
-// Whether `path` can be sent by itself: a file or folder below the share's folder (open as
-// `folder`) that no link on the way leads to, so that nothing outside the share is ever sent. A
-// link is sent with the folder that it is in.
-bool IsPresent(int folder, const std::string& path) {
-    const base::UniqueFd entry =
-        base::OpenBeneath(folder, path.substr(path.find_first_not_of('/')), O_PATH);
-    struct stat info = {};
-    return entry && fstat(entry.Get(), &info) == 0 && !S_ISLNK(info.st_mode);
+// Goes up from `wanted` to what is there.
+PresentPath Resolved(int top, const std::string& wanted, Deletions deletions) {
+    std::string path = wanted;
+    std::string below;  // where it has come from
+    Found below_it = Found::kUnknown;
+    Found found = LookAt(top, path);
+    while (path.size() > 1 && (found == Found::kNothing || found == Found::kUnknown)) {
+        below_it = found;
+        below = std::exchange(path, FolderAbove(path));
+        found = LookAt(top, path);
+    }
+    if (below.empty() || found == Found::kOther || below_it == Found::kUnknown ||
+        deletions == Deletions::kByTree) {
+        return {path, {wanted}, Kind::kWhole, found != Found::kOther};
+    }
+    return deletions == Deletions::kNamed ? PresentPath{below, {wanted}, Kind::kGone}
+                                          : PresentPath{path, {wanted}, Kind::kEntries, true};
+}
+
+// Folders come right before all that is below them; of one path, what covers more comes first.
+bool ComesBefore(const PresentPath& one, const PresentPath& other) {
+    const auto rank = [](char c) { return c == '/' ? 0 : static_cast<unsigned char>(c) + 1; };
+    const auto [mine, its] =
+        std::mismatch(one.path.begin(), one.path.end(), other.path.begin(), other.path.end());
+    if (mine == one.path.end() || its == other.path.end()) {
+        return one.path.size() != other.path.size() ? one.path.size() < other.path.size()
+                                                    : one.kind < other.kind;
+    }
+    return rank(*mine) < rank(*its);
+}
+
+bool Covers(const PresentPath& above, const PresentPath& path) {
+    return above.kind == Kind::kEntries ? path.kind == Kind::kEntries && path.path == above.path
+                                        : IsAtOrBelow(path.path, above.path);
 }
 
 }  // namespace
 
 std::vector<PresentPath> PresentPaths(const std::string& folder,
-                                      const std::vector<std::string>& ordered) {
-    const base::UniqueFd root(open(folder.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+                                      const std::vector<std::string>& ordered,
+                                      Deletions deletions) {
+    const base::UniqueFd top(open(folder.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
     std::vector<PresentPath> present;
+    present.reserve(ordered.size());
     for (const std::string& wanted : ordered) {
-        std::string path = wanted;
-        while (path.find_first_not_of('/') != std::string::npos && !IsPresent(root.Get(), path)) {
-            path.resize(std::max<size_t>(path.rfind('/'), 1));
+        if (!IsReservedInShare(wanted)) {
+            present.push_back(wanted == kTop ? PresentPath{wanted, {wanted}, Kind::kWhole, true}
+                                             : Resolved(top.Get(), wanted, deletions));
         }
-        present.push_back({path, {wanted}});
     }
-    std::sort(present.begin(), present.end(),
-              [](const auto& one, const auto& other) { return one.path < other.path; });
+    std::sort(present.begin(), present.end(), ComesBefore);
     std::vector<PresentPath> fewest;
+    size_t covering = 0;  // the last that may cover more than itself
     for (PresentPath& item : present) {
-        const auto above = std::find_if(fewest.begin(), fewest.end(), [&](const auto& kept) {
-            return item.path == kept.path || IsBelow(item.path, kept.path);
-        });
-        if (above == fewest.end()) {
-            fewest.push_back(std::move(item));
-        } else {
+        PresentPath* above = nullptr;
+        if (!fewest.empty() && Covers(fewest[covering], item)) {
+            above = &fewest[covering];
+        } else if (!fewest.empty() && Covers(fewest.back(), item)) {
+            above = &fewest.back();
+        }
+        if (above != nullptr) {
             above->ordered.push_back(std::move(item.ordered.front()));
+            continue;
+        }
+        fewest.push_back(std::move(item));
+        if (fewest.back().kind != Kind::kEntries) {
+            covering = fewest.size() - 1;
         }
     }
     return fewest;

@@ -1,4 +1,4 @@
-// Which paths of a share can be sent: what was there when a change was noted may have gone since.
+// How changed paths of a share are sent: some may have gone since they were reported.
 #pragma once
 
 #include <string>
@@ -6,16 +6,35 @@
 
 namespace programs {
 
-/// A path to send, and those of the order that are taken with it.
-struct PresentPath {
-    std::string path;
-    std::vector<std::string> ordered;
+/// How the server is told of what is gone.
+enum class Deletions {
+    kNamed,      ///< by its name
+    kByEntries,  ///< by the entries of the folder that it was in
+    kByTree      ///< by all that is below that folder
 };
 
-/// The fewest paths with which all of `ordered` is sent; "/" is the share's `folder` itself, others
-/// begin with "/". One that has gone stands for the nearest folder above that is there, where the
-/// deletion is seen. None is below another, and none leads out of the share over a link.
+/// A path to send, and the ordered paths that it covers.
+struct PresentPath {
+    enum class Kind {
+        kWhole,   ///< as it is, with all that is below it
+        kGone,    ///< to be deleted
+        kEntries  ///< a folder, by its own entries
+    };
+    std::string path;
+    std::vector<std::string> ordered;
+    Kind kind = Kind::kWhole;
+    bool is_folder = false;  ///< deletions may be made in it
+};
+
+/// The fewest paths that cover all of `ordered`, folders before what is in them. "/" is the share's
+/// `folder` itself; others begin with "/". What is gone is the highest path that is, however deep
+/// below it the ordered one lies. Names that are reserved in a share are left out. No path is below
+/// another one that is kWhole or kGone, and none leads through a symbolic link: what an ordered
+/// path would reach through one, or through a file, is covered by that link or file.
+///
+/// Costs: n log n, and a look-up or two for each path.
 std::vector<PresentPath> PresentPaths(const std::string& folder,
-                                      const std::vector<std::string>& ordered);
+                                      const std::vector<std::string>& ordered,
+                                      Deletions deletions = Deletions::kByTree);
 
 }  // namespace programs

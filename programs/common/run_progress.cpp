@@ -28,9 +28,9 @@ constexpr char kStill[] = "progress_still";
 constexpr char kOfBytes[] = "bytes";
 constexpr char kOfFiles[] = "files";
 
-// A busy disk is silent for some seconds; a person looks again after a minute.
+// A busy disk can pause for some seconds; a person looks again after a minute.
 constexpr unsigned int kStalledAfter = 60;
-// A file that is through sooner than that would only flicker by.
+// A file that takes less than this would only flicker on the display.
 constexpr uint64_t kLargeFileSeconds = 3;
 
 constexpr size_t kBarWidth = 24;
@@ -56,7 +56,7 @@ std::string Rate(const RunProgress& progress) {
 
 std::string FilesText(const RunProgress& progress) {
     if (!progress.totals_final) {
-        // Without a last count, what is checked is said as soon as something is.
+        // The total is not final: show the number of checked files as soon as there are any.
         return progress.files_checked == 0
                    ? (progress.files_total == 0
                           ? "looking for files"
@@ -71,7 +71,7 @@ std::string SentText(const RunProgress& progress) {
     return progress.bytes_done == 0 ? "" : ", " + HumanBytes(progress.bytes_done) + " sent";
 }
 
-// What is said of a run that moves, without the file that is being sent.
+// The text for a run that makes progress, without the current file.
 std::string MovingText(const RunProgress& progress) {
     if (progress.percent_of != RunProgress::BYTES) {
         return FilesText(progress) + SentText(progress) +
@@ -90,7 +90,7 @@ std::string StalledText(const RunProgress& progress) {
     return "nothing has moved for " + HumanDuration(progress.seconds_still);
 }
 
-// How far the one file is that takes a while; empty when none does. The name is left to the caller.
+// The progress of a large file, without its name; empty when the current file is not large.
 std::string LargeFileText(const RunProgress& progress) {
     const bool large =
         !progress.file.empty() &&
@@ -98,16 +98,16 @@ std::string LargeFileText(const RunProgress& progress) {
     if (!large || progress.percent_of == RunProgress::BYTES) {
         return "";
     }
-    // In floating point: a file may have more bytes than a hundredth of the largest number.
+    // In floating point, as a multiplication by 100 could overflow.
     const double part = static_cast<double>(std::min(progress.file_bytes, progress.file_length)) *
                         100 / static_cast<double>(progress.file_length);
     return PercentText(static_cast<unsigned int>(part)) + " of " + HumanBytes(progress.file_length);
 }
 
-// The end of a name that is too long says more than its start.
+// Shortens a long name to its end, which says more than the beginning.
 std::string LastColumns(const std::string& text, size_t columns) {
     constexpr std::string_view kCut = "...";
-    std::vector<size_t> characters;  // where each begins
+    std::vector<size_t> characters;  // byte offset of each
     for (size_t i = 0; i < text.size(); ++i) {
         if ((static_cast<unsigned char>(text[i]) & 0xc0) != 0x80) {
             characters.push_back(i);

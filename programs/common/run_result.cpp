@@ -11,13 +11,16 @@ namespace programs {
 
 namespace {
 
-// Failures are told up to here: messages and rows of the history have a limit.
+// Longer failure texts are cut, as messages and rows of the history are limited.
 constexpr size_t kMaxToldBytes = size_t{6} * 1024;
 constexpr size_t kMaxDetailBytes = size_t{16} * 1024;
 
 }  // namespace
 
 FailureKind KindOf(int status) {
+    if (status == kNotConfirmed) {
+        return FailureKind::kConfirm;
+    }
     if (status == kNothingSent || status == kKeyFileFailed) {
         return FailureKind::kLocal;
     }
@@ -25,6 +28,11 @@ FailureKind KindOf(int status) {
                ? FailureKind::kFailed
                : FailureKind::kRefused;
 }
+
+RunFailure::RunFailure(const Question& asked)
+    : Failure(FailureKind::kConfirm, asked.text, kNotConfirmed),
+      reach(Reach::kShare),
+      question(asked) {}
 
 void LeaveUndone(const ShareOrders& shares, const RunFailure& failure, bool is_first,
                  std::vector<Undone>& undone) {
@@ -69,7 +77,9 @@ std::optional<RunFailure> Sum(const std::vector<Undone>& undone) {
         }
         details += (details.empty() ? "" : "\n") + failures[i]->details;
     }
-    return RunFailure(first.Kind(), first.Status(), text, first.reach, std::move(details));
+    RunFailure sum(first.Kind(), first.Status(), text, first.reach, std::move(details));
+    sum.question = first.question;
+    return sum;
 }
 
 RunResult NothingDone(const RunOrder& order, const RunFailure& failure) {

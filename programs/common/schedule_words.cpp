@@ -27,13 +27,13 @@ struct NamedWeek {
 constexpr NamedWeek kNamedWeeks[] = {
     {"daily", "1111111"}, {"weekdays", "0111110"}, {"weekends", "1000001"}};
 
-// A year with a 29th of February, and its first month with all 31 days: what a schedule without a
-// year, or without a month, counts from.
+// A leap year, and its first month with 31 days: placeholders for the year or month of a schedule
+// that has none.
 constexpr int kLeapYear = 2016;
 constexpr int kJanuary = 1;
 
 constexpr int kLastMinuteOfDay = 24 * 60 - 1;
-constexpr long kMaxTimes = 95;  // the library's bound: a run each quarter of an hour
+constexpr long kMaxTimes = 95;  // limit of the library: a run every quarter of an hour
 
 constexpr char kTimesNeedDays[] =
     "--at, --every and --times go with --weekly, --monthly, --yearly or --once";
@@ -43,8 +43,8 @@ std::string Quoted(const std::string& text) {
     return "'" + Printable(text) + "'";
 }
 
-// The decimal numbers between `separator`s, as many as there are entries in `digits`, each of one
-// digit up to that many. Empty for any other text.
+// The decimal numbers between `separator`s; `digits` has the maximum number of digits of each.
+// Empty for any other text.
 std::vector<int> Numbers(const std::string& text, char separator,
                          const std::vector<size_t>& digits) {
     std::vector<std::string> pieces;
@@ -69,7 +69,7 @@ bool IsDate(int year, int month, int day) {
     return day <= kDaysOfMonth[month - 1] + (leap && month == 2 ? 1 : 0);
 }
 
-// "90m", "2h", "1h30m" as minutes; nothing for any other text, 0 and a day or more.
+// Converts "90m", "2h", "1h30m" into minutes; nothing for any other text, 0, or a day or more.
 std::optional<int> ParsePeriod(const std::string& text) {
     const size_t h = text.find('h');
     const std::string hours = h == std::string::npos ? "0" : text.substr(0, h);
@@ -150,7 +150,7 @@ void SayMode(ZEL::SCHD_MODE mode, PObject& settings) {
     settings["schedule_mode"] = static_cast<int>(mode);
 }
 
-// The mode with its days.
+// Sets the mode and its days.
 void SayDays(const ScheduleWords& words, PObject& settings) {
     const int modes = int{words.manual} + int{words.on_change} + int{words.weekly.has_value()} +
                       int{words.monthly.has_value()} + int{words.yearly.has_value()} +
@@ -232,7 +232,7 @@ std::string DescribeDays(const ZEL::Schedule& schedule) {
             }
             std::string days;
             for (size_t i = 0; i < std::size(kDays) && i < week.size(); ++i) {
-                // From Monday on, as people say it.
+                // Weeks start on Monday here, as people expect.
                 const size_t day = (i + 1) % std::size(kDays);
                 if (week[day] != '0') {
                     days += (days.empty() ? "" : ",") + std::string(kDays[day], kShortDay);
@@ -286,7 +286,7 @@ std::string SettleSchedule(const PObject& said, PObject& settings) {
 }
 
 std::string FaultOfTimes(const ZEL::Schedule& schedule) {
-    // A schedule that came from elsewhere may hold any numbers; these bounds keep the sum small.
+    // A schedule from elsewhere may contain any numbers; the bounds prevent an overflow.
     const long period = std::clamp(schedule.GetPeriodSeconds() / 60, 0L, kLastMinuteOfDay + 1L);
     const long times = std::clamp(schedule.GetRepeatTimesInDay(), 0L, kMaxTimes + 1L);
     const long start = std::clamp(schedule.GetStartHour(), 0, 24) * 60L +
@@ -319,7 +319,7 @@ std::string DescribeSchedule(const ZEL::Schedule& schedule) {
 std::string DescribeMissingDay(const ZEL::Schedule& schedule) {
     const long day = schedule.GetBeginDay();
     if (schedule.GetMode() == ZEL::SCHD_MODE_YEARLY && schedule.GetBeginMonth() == 2 && day == 29) {
-        // Each run is reckoned from the one before, which was in March.
+        // Each run is calculated from the one before, which was on March 1.
         return "It runs on March 1; on February 29 only in a leap year in which it was set before "
                "that day.";
     }

@@ -1,4 +1,4 @@
-// Schedules in people's words: "weekly mon,thu 02:30, 3 more every 1h30m".
+// Schedules in plain words: "weekly mon,thu 02:30, 3 more every 1h30m".
 #pragma once
 
 #include <optional>
@@ -9,7 +9,7 @@
 
 namespace programs {
 
-/// What a person says of a schedule. What is not said stays unset.
+/// A schedule as given on the command line. Options that were not given are unset.
 struct ScheduleWords {
     bool manual = false;
     bool on_change = false;
@@ -22,22 +22,22 @@ struct ScheduleWords {
     std::optional<unsigned int> times;   ///< runs of a day after the first
 };
 
-/// Adds the keys of a task's settings that say the same; what is not said has none. Throws Failure
-/// (kUsage), in terms of the options that carry the words.
+/// Adds the settings of a task that mean the same; unset words add none. Throws Failure (kUsage),
+/// with a text that refers to the options.
 void SayWords(const ScheduleWords& words, ZEL::PObject& settings);
 
-// What belongs together in a schedule, whoever says it: each gives what is wrong, or nothing.
+// Consistency of a schedule, however it was given: each function returns what is wrong, or nothing.
 
-/// `settings` are a task's after `said` has been put into them. A day's repeats need a count and a
-/// period: one that is said alone has to find the other there. A count of 0 takes the period away.
+/// `settings` are a task's after `said` was merged into them. Repeated runs need both a count and a
+/// period: if only one was given, the other must be there already. A count of 0 removes the period.
 std::string SettleSchedule(const ZEL::PObject& said, ZEL::PObject& settings);
-/// Whether all runs of a day fall on that day.
+/// Checks that all runs of a day are before midnight.
 std::string FaultOfTimes(const ZEL::Schedule& schedule);
 
 /// A schedule in a person's words.
 std::string DescribeSchedule(const ZEL::Schedule& schedule);
 
-/// When it runs in a month or year without its day; empty when each has it.
+/// What happens in a month or year that lacks the schedule's day; empty when none does.
 std::string DescribeMissingDay(const ZEL::Schedule& schedule);
 
 struct CalendarDate {
@@ -51,7 +51,7 @@ struct TimeOfDay {
     int minutes;
 };
 
-/// "YYYY-MM-DD", a date of the calendar since 1970; nothing for any other text.
+/// "YYYY-MM-DD", a valid date since 1970; nothing for any other text.
 std::optional<CalendarDate> ParseDate(const std::string& text);
 
 /// "HH:MM", from 00:00 to 23:59; nothing for any other text.

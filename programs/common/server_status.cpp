@@ -40,8 +40,8 @@ std::string ServerStatusText(int status) {
         case kNoEncryption:
             return "the server is set up without encrypted shares";
         case kStorage:
-            return "the server's storage folder is not there, not on the disk it was set up on, or "
-                   "not writable";
+            return "the server's storage folder is not there, not on the disk it was set up on, "
+                   "not writable, or open to others: 'zel_server status' there says which";
         case kNameTaken:
             return "the server holds a share whose name differs only in letter case or blanks";
         case kNotRunning:
@@ -49,6 +49,40 @@ std::string ServerStatusText(int status) {
         case kServerFault:
             return "the server's program failed: its system log says why (journalctl -t zel_server "
                    "there)";
+        case kTooManyShares:
+            return "the account has as many shares as one may have: use another account for more, "
+                   "or "
+                   "run 'zel_server shares --release NAME' there";
+        case kTooManyTasks:
+            return "the account has as many tasks as one may have at the server";
+        case kTooManyClients:
+            return "the account has paired as many clients as one may pair: use another account";
+        case kCopyWentOn:
+            return "the copy was changed by another machine since this one last pushed it. Either "
+                   "this machine was cloned: then give the clone a serial number of its own, in "
+                   "/usr/tarq/etc/tarqsdk.conf. Or this machine was put back to an older state: "
+                   "then look at its files first. When they are the ones to keep, say 'zelctl "
+                   "share confirm NAME': the copy becomes like them";
+        case kNobodysCopy:
+            return "the server has files under this share's name and no record of whose they are: "
+                   "'zel_server shares --release NAME' there lets the next client have them";
+        case kNoSuchShare:
+            return "the server holds no copy of the share";
+        case kNoBirthTimes:
+            return "the file system of the server's storage does not tell when a file was made: "
+                   "what "
+                   "stood at a time cannot be known";
+        case kNothingThen:
+            return "nothing stood there at that time: 'zelctl versions' lists when it changed";
+        case kNoSuchDeposit:
+            return "the server does not keep that configuration any more";
+        case kTooManyDeposits:
+            return "the server keeps the configurations of as many clients as one account may "
+                   "have: run 'zel_server deposits' there, and remove those of clients that are "
+                   "gone";
+        case kTooManyConnections:
+            return "the account has as many connections to the server as it may: wait until a push "
+                   "has ended, or give this client an account of its own";
         default:
             return "";
     }

@@ -21,21 +21,35 @@ enum ServerStatus : int {
     kNameTaken = 217,
     kNotRunning = 218,
     kServerFault = 219,
+    kNoSuchShare = 220,
+    kTooManyShares = 221,
+    kTooManyTasks = 222,
+    kTooManyConnections = 223,
+    kTooManyClients = 224,
+    kCopyWentOn = 225,       ///< others have pushed into the copy that the client knows
+    kNobodysCopy = 226,      ///< there are files of this name, and nothing tells whose
+    kNoBirthTimes = 230,     ///< the file system of the copies does not tell when a file was made
+    kNothingThen = 231,      ///< nothing stood there at that time
+    kNoSuchDeposit = 232,    ///< the client has not deposited that
+    kTooManyDeposits = 233,  ///< of other clients of the account
 
-    // Of other servers.
+    // From other servers.
     kUnsupportedCommand = 51,
     kAccepted = 207,       ///< the command was taken
     kPassedThrough = 208,  ///< and passed on
 
-    // Of the library, which has asked nobody.
+    // From the library itself; no server was asked.
     kLookupFailed = 42,
     kNothingSent = 213,
-    kKeyFileFailed = 300
-};
-constexpr int kFirstServerStatus = kNoMemory;  ///< what is less is rsync's, but for the few above
+    kKeyFileFailed = 300,
 
-/// What a status of a server command means and what to do about it, for a person; empty for one
-/// that says nothing by itself.
+    // The programs' own; the server was not asked.
+    kNotConfirmed = 301  ///< a share waits until a person allows what its push would do
+};
+constexpr int kFirstServerStatus = kNoMemory;  ///< smaller ones are rsync's, except for a few above
+
+/// The meaning of a status and what to do about it, for a person; empty for a status without a
+/// specific meaning.
 std::string ServerStatusText(int status);
 
 }  // namespace programs

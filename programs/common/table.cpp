@@ -9,6 +9,7 @@
 #include <string_view>
 
 #include "base/text.h"
+#include "programs/common/json_text.h"
 #include "programs/common/text.h"
 
 namespace programs {
@@ -25,7 +26,7 @@ std::string JsonKey(std::string heading) {
     return heading;
 }
 
-// Columns that a terminal shows: bytes that continue a UTF-8 character take none.
+// Columns on a terminal: continuation bytes of UTF-8 take none.
 size_t Width(const std::string& text) {
     return static_cast<size_t>(std::count_if(text.begin(), text.end(), [](char c) {
         return (static_cast<unsigned char>(c) & 0xc0) != 0x80;
@@ -67,7 +68,7 @@ void Table::Add(std::vector<std::string> cells) {
     rows_.push_back(std::move(cells));
 }
 
-// Makes the widest of the columns that may be cut narrower, and then leaves columns out (0).
+// Narrows the widest of the columns that may be cut; then, if needed, drops columns (width 0).
 void Table::Fit(size_t width, std::vector<size_t>& widths) const {
     std::vector<size_t> whole = widths;
     const auto total = [&] {
@@ -101,7 +102,7 @@ void Table::Fit(size_t width, std::vector<size_t>& widths) const {
         if (over == 0 || spare == columns_.size()) {
             return;
         }
-        // What it leaves free is the others' again.
+        // The remaining columns get its space, so start again from their full widths.
         whole[spare] = 0;
         widths = whole;
     }
@@ -113,7 +114,7 @@ void Table::Format(size_t width, Take take) const {
     for (const Column& column : columns_) {
         headings.push_back(column.heading);
     }
-    // Hardly any cell needs escapes: the others are taken as they stand.
+    // Cells rarely need escaping, so rows without special characters are not copied.
     std::vector<std::vector<std::string>> escaped;
     std::vector<const std::vector<std::string>*> lines = {&headings};
     lines.reserve(rows_.size() + 1);
@@ -141,7 +142,7 @@ void Table::Format(size_t width, Take take) const {
     std::string text;
     for (const auto* line : lines) {
         text.clear();
-        size_t blanks = 0;  // wanted before the next cell
+        size_t blanks = 0;  // padding before the next cell
         for (size_t i = 0; i < line->size(); ++i) {
             if (widths[i] > 0) {
                 const size_t shown = Width((*line)[i]);
@@ -170,8 +171,7 @@ void Table::Print(bool as_json) const {
             }
             array.push_back(std::move(object));
         }
-        // Bytes that are not UTF-8 are replaced rather than refused.
-        puts(array.dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace).c_str());
+        puts(JsonText(array).c_str());
         return;
     }
     std::string text;

@@ -12,11 +12,11 @@ struct Column {
         : heading(its_heading), narrowest(may_shrink_to), rank(leave_out_rank) {}
 
     std::string heading;
-    size_t narrowest;  ///< where there is no room its cells are cut to this; 0: never
-    int rank;          ///< where that is not enough, the highest is left out first; 0: never
+    size_t narrowest;  ///< the width to which cells may be cut to save space; 0: never
+    int rank;  ///< if that is not enough, columns are dropped from the highest rank down; 0: never
 };
 
-/// How many columns the standard output has when it is a terminal; 0: no limit.
+/// The width of standard output when it is a terminal; 0: no limit.
 size_t OutputWidth();
 
 /// The text, ending in ".." where it has more than `width` characters.
@@ -25,22 +25,22 @@ std::string CutTo(const std::string& text, size_t width);
 /// Rows of text for a person (aligned columns) or for a program (JSON: an array of objects).
 class Table {
 public:
-    /// Their headings, lower-cased, with "_" for blanks, are the JSON keys.
+    /// The JSON keys are the headings in lower case, with "_" for blanks.
     explicit Table(std::vector<Column> columns);
 
-    /// Makes room for so many rows.
+    /// Reserves memory for this number of rows.
     void Reserve(size_t rows);
-    /// As many cells as there are columns.
+    /// Adds a row; it must have a cell for each column.
     void Add(std::vector<std::string> cells);
 
-    /// Writes all to standard output.
+    /// Writes the table to standard output.
     void Print(bool as_json) const;
-    /// What a person sees, headings first, without line ends, in `width` columns as far as the
-    /// columns allow (0: no limit).
+    /// The lines of the aligned form, headings first, without line ends, in `width` columns (0: no
+    /// limit) as far as the columns can be cut or dropped.
     std::vector<std::string> Lines(size_t width = 0) const;
 
 private:
-    // Hands the lines a person sees to `take`, one after the other.
+    // Calls `take` for each line of the aligned form.
     template <typename Take>
     void Format(size_t width, Take take) const;
     void Fit(size_t width, std::vector<size_t>& widths) const;

@@ -7,7 +7,11 @@
 #include <utility>
 
 #include "ZEL/sync_obj.h"
+#include "base/text.h"
+#include "programs/common/bandwidth.h"
 #include "programs/common/text.h"
+#include "programs/common/transport_words.h"
+#include "programs/common/wire_text.h"
 
 namespace programs {
 
@@ -15,9 +19,7 @@ namespace {
 
 using ZEL::PObject;
 
-constexpr size_t kMaxText = 65535;  // bytes; what a request can carry
-
-// ---- What else a value must be ----
+// ---- Further checks of values ----
 
 std::string CheckName(const PObject& name) {
     return IsTaskName(name.asString())
@@ -53,29 +55,92 @@ std::string CheckWeek(const PObject& week) {
                : "must be seven digits 0 or 1, Sunday first, at least one 1";
 }
 
-// ---- What people say, and are shown ----
+// ---- Conversion from and to what people read ----
 
-void TakeServer(const std::string& server, PObject& settings) {
+std::string TakeServer(const TaskField&, const std::string& server, PObject& settings) {
     unsigned char address[16];
     const bool is_address = inet_pton(AF_INET, server.c_str(), address) == 1 ||
                             inet_pton(AF_INET6, server.c_str(), address) == 1;
     settings["server_ip"] = is_address ? server : "";
     settings["server_name"] = is_address ? "" : server;
+    return "";
 }
 
-std::string SshWords(const PObject& task) {
-    const std::string port =
-        task["ssh_port"].asBool() ? ", port " + task["ssh_port"].asString() : "";
-    return task["ssh"].asBool() ? "yes" + port : "no";
+// "30d" or "30", and "off" for 0.
+std::string TakeDays(const TaskField& field, const std::string& word, PObject& settings) {
+    const bool has_unit = word.size() > 1 && word.back() == 'd';
+    const auto days =
+        word == "off"
+            ? std::optional<uint64_t>(0)
+            : base::ParseNumber(word.substr(0, word.size() - (has_unit ? 1 : 0)), field.max);
+    if (!days) {
+        return "must be days, 0 to " + std::to_string(field.max) + ", or off";
+    }
+    settings[field.key] = static_cast<unsigned long long>(*days);
+    return "";
+}
+
+std::string TakeBandwidth(const TaskField& field, const std::string& word, PObject& settings) {
+    const BandwidthWords said = ReadBandwidth(word);
+    if (said.fault.empty()) {
+        settings[field.key] = said.otherwise;
+        settings["bandwidth_windows"] = said.windows;
+    }
+    return said.fault;
+}
+
+std::string TransportOf(const PObject& task) {
+    return TransportWords(ServerOf(task), task["ssh"].asBool(), task["ssh_port"].asUInt32());
 }
 
 std::string TimeoutWords(const PObject& task) {
     return Count(task["rsync_timeout"].asUInt64(), "second");
 }
 
-std::string BandwidthWords(const PObject& task) {
-    const uint64_t limit = task["max_bandwidth"].asUInt64();
-    return limit == 0 ? "none" : std::to_string(limit) + " KiB/s";
+// "08:00-18:00 1024 KiB/s, else none; now 1024 KiB/s, until 18:00"
+std::string LimitWords(const PObject& task) {
+    const std::string windows = task["bandwidth_windows"].asString();
+    std::string otherwise = RateWords(task["max_bandwidth"].asUInt32());
+    if (windows.empty()) {
+        return otherwise;
+    }
+    std::string words;
+    for (size_t begin = 0; begin < windows.size();) {
+        const size_t end = std::min(windows.find(',', begin), windows.size());
+        const size_t equals = windows.find('=', begin);
+        words += windows.substr(begin, equals - begin) + " " +
+                 RateWords(Bandwidth::RateOf(windows.substr(equals + 1, end - equals - 1))) + ", ";
+        begin = end + 1;
+    }
+    words += "else " + otherwise;
+    if (task["bandwidth_now"].isInteger()) {
+        words += "; now " + RateWords(task["bandwidth_now"].asUInt32());
+        if (task["bandwidth_until"].isInteger()) {
+            words += ", until " + HumanTime(task["bandwidth_until"].asInt64());
+        }
+    }
+    return words;
+}
+
+std::string CheckWindows(const PObject& windows) {
+    return FaultOfWindows(windows.asString());
+}
+
+std::string CompareWords(const PObject& task) {
+    const uint64_t days = task["compare_days"].asUInt64();
+    return days == 0 ? "never" : "every " + Count(days, "day");
+}
+
+std::string VerifyWords(const PObject& task) {
+    const uint64_t days = task["verify_days"].asUInt64();
+    return days == 0 ? "never" : "within " + Count(days, "day");
+}
+
+std::string BrakeWords(const PObject& task) {
+    const uint64_t percent = task["brake"].asUInt64();
+    return percent == 0 ? "off"
+                        : "asks before more than " + std::to_string(percent) +
+                              " % of a copy's files are lost";
 }
 
 std::string ScheduleWordsOf(const PObject& task) {
@@ -103,15 +168,15 @@ std::vector<TaskField> MakeTable() {
         Text("name", "The task's name").Required().Listed().Checked(CheckName),
         Texts("share_list", "The shares, in the order in which they are sent").Required().Listed()
             .Checked(CheckShareNames).Option("--share").Shown("shares"),
-        Text("server_name", "The server's name or address").Listed()
-            .Option("-s,--server").Taken(TakeServer).Shown("server", ServerOf),
-        Text("server_ip", "The server's address, in place of its name").Listed(),
-        Text("user", "Account on the server").Required().Listed()
+        Text("server_name", "The server's name or address").Listed().Leads()
+            .Option("-s,--server").Taken(TakeServer).MustBeSaid().Shown("server", ServerOf),
+        Text("server_ip", "The server's address, in place of its name").Listed().Leads(),
+        Text("user", "Account on the server").Required().Listed().Leads()
             .Option("-u,--user").Shown("user"),
         Text("pswd", "The account's password").Secret(),
-        Switch("ssh", "Carry everything through ssh")
-            .Option("--ssh").Shown("ssh", SshWords),
-        Number("ssh_port", 1, 65535, "Port of the ssh server")
+        Switch("ssh", "Through an ssh login; counts for a server that is not trusted yet").Leads()
+            .Option("--ssh").Shown("transport", TransportOf),
+        Number("ssh_port", 1, 65535, "Port of the ssh server; counts with ssh").Leads()
             .Option("--ssh-port", "PORT", "22"),
         Switch("compress", "Compress on the way")
             .Option("--compress").Shown("compress"),
@@ -119,14 +184,23 @@ std::vector<TaskField> MakeTable() {
             .Option("--delta").Shown("delta"),
         Number("rsync_timeout", 600, 86400, "Give up when nothing moves for so many seconds")
             .Option("--timeout", "SECONDS", "600").Shown("time-out", TimeoutWords),
-        Number("max_bandwidth", 0, kAnyNumber, "Limit in KiB a second (0: none)")
-            .Option("--bwlimit", "KIB").Shown("bandwidth limit", BandwidthWords),
+        Number("max_bandwidth", 0, kAnyNumber, "Limit in KiB a second (0: none); --bwlimit takes 08:00-18:00=1M,else=0, too")
+            .Option("--bwlimit", "RATE").Taken(TakeBandwidth).Shown("bandwidth limit", LimitWords),
+        Text("bandwidth_windows", "Other limits at times of the day, 08:00-18:00=1024,20:00-06:00=0")
+            .Checked(CheckWindows).Since(8),
         Texts("exclude", "rsync patterns of files that stay behind").Checked(CheckPatterns)
             .Option("--exclude", "PATTERN").Shown("exclude"),
+        Number("brake", 0, 99, "Ask before a run loses more percent of a copy's files (0: never ask)")
+            .Default(50).Since(4).Option("--brake", "PERCENT", "50").Shown("brake", BrakeWords),
 
-        // The schedule, for which people have words of their own (schedule_words.h).
+        Number("verify_days", 0, 3650, "Read all files at both ends within so many days (0: never)")
+            .Default(30).Since(7).Option("--verify", "DAYS", "30").Taken(TakeDays).Shown("verified", VerifyWords),
+
+        // The schedule; the options for it are in schedule_words.h.
         Number("schedule_mode", 0, 5, "0 manual, 1 on change, 2 weekly, 3 monthly, 4 yearly, 5 once")
             .Listed().Shown("schedule", ScheduleWordsOf),
+        Number("compare_days", 0, 3650, "With on change: compare all again after so many days (0: never)")
+            .Default(7).Since(5).Option("--compare-every", "DAYS", "7").Taken(TakeDays).Shown("compared", CompareWords),
         Text("week_schd", "Days of the week, Sunday first, 1 for a run day").Checked(CheckWeek),
         Number("schedule_begin_year", 1970, 9999, "Year of its only run"),
         Number("schedule_begin_month", 1, 12, "Month of its yearly or only run"),
@@ -146,7 +220,7 @@ std::string FaultOfText(const PObject& text) {
     if (!text.isString()) {
         return "must be a text";
     }
-    if (text.asString().size() > kMaxText) {
+    if (text.asString().size() > kMaxWireText) {
         return "is too long: a text has at most 65535 bytes";
     }
     return text.asString().find('\0') == std::string::npos ? "" : "must not hold a zero byte";
@@ -210,9 +284,21 @@ TaskField TaskField::Listed() const {
     return field;
 }
 
+TaskField TaskField::Leads() const {
+    TaskField field = *this;
+    field.leads = true;
+    return field;
+}
+
 TaskField TaskField::Since(int store_layout) const {
     TaskField field = *this;
     field.layout = store_layout;
+    return field;
+}
+
+TaskField TaskField::Default(uint64_t number) const {
+    TaskField field = *this;
+    field.fallback = number;
     return field;
 }
 
@@ -230,9 +316,15 @@ TaskField TaskField::Option(const char* names, const char* value_word, const cha
     return field;
 }
 
-TaskField TaskField::Taken(void (*by)(const std::string& word, PObject& settings)) const {
+TaskField TaskField::Taken(Take by) const {
     TaskField field = *this;
     field.take = by;
+    return field;
+}
+
+TaskField TaskField::MustBeSaid() const {
+    TaskField field = *this;
+    field.must_be_said = true;
     return field;
 }
 
@@ -279,7 +371,7 @@ const PObject& OwnDefaults() {
             } else if (field.kind == FieldKind::kText) {
                 own[field.key] = "";
             } else {
-                own[field.key] = 0;
+                own[field.key] = static_cast<unsigned long long>(field.fallback);
             }
         }
         return own;
@@ -331,6 +423,19 @@ std::string WordsOf(const TaskField& field, const PObject& task) {
 std::string ServerOf(const PObject& task) {
     const std::string name = task["server_name"].asString();
     return name.empty() ? task["server_ip"].asString() : name;
+}
+
+std::string ServerOf(const ZEL::SyncInfo& info) {
+    const std::string name = info.GetServerName();
+    return name.empty() ? info.GetServerIP() : name;
+}
+
+bool SameAccount(const PObject& task, const PObject& other) {
+    return std::all_of(TaskFields().begin(), TaskFields().end(), [&](const TaskField& field) {
+        const PObject& a = task[field.key];
+        const PObject& b = other[field.key];
+        return !field.leads || (a.asUInt64() == b.asUInt64() && a.asString() == b.asString());
+    });
 }
 
 std::vector<std::string> TextsOf(const PObject& array) {

@@ -5,6 +5,7 @@
 #include <iterator>
 #include <utility>
 
+#include "base/utf8.h"
 #include "programs/common/table.h"
 #include "programs/common/text.h"
 
@@ -13,20 +14,22 @@ namespace programs {
 namespace {
 
 constexpr char kSeparator = '\x1f';
-// Texts are cut so that the whole stays below what a string may have on the wire; the numbers take
-// less than 200 bytes.
+// Texts are cut so that the packed row stays below the maximum length of a string in a message; the
+// numbers take less than 200 bytes.
 constexpr size_t kMaxText = 9000;
 
 // ZEL::TASK_STATUS and ZEL::TASK_RESULT, by number.
-constexpr const char* kStatusWords[] = {"idle", "waiting", "running", "paused"};
+constexpr const char* kStatusWords[] = {"idle", "waiting", "running", "paused", "confirm"};
 constexpr const char* kResultWords[] = {"not yet", "done", "failed", "cancelled"};
 constexpr int kRunning = 2;
+constexpr int kConfirm = 4;
 
-const char* WordOf(const char* const (&words)[4], int number) {
-    return words[number >= 0 && number < 4 ? number : 0];
+template <int N>
+const char* WordOf(const char* const (&words)[N], int number) {
+    return words[number >= 0 && number < N ? number : 0];
 }
 
-// The fields in the order that they are packed in.
+// The fields, in the order in which they are packed.
 template <typename Row, typename Visit>
 void EachField(Row& row, Visit& visit) {
     visit(row.name);
@@ -44,14 +47,14 @@ void EachField(Row& row, Visit& visit) {
     visit(row.error);
 }
 
-/// Puts a row together, field after field.
+/// Packs a row, field by field.
 class Packer {
 public:
     Packer() { packed_.reserve(256); }
 
     void operator()(const std::string& text) {
         const size_t begin = packed_.size();
-        packed_.append(text, 0, kMaxText);
+        packed_ += base::Utf8Head(text, kMaxText);
         for (size_t i = begin; i < packed_.size(); ++i) {
             if (static_cast<unsigned char>(packed_[i]) < 0x20) {
                 packed_[i] = '?';
@@ -73,7 +76,7 @@ private:
     std::string packed_;
 };
 
-/// Takes a packed row apart, field after field.
+/// Unpacks a row, field by field.
 class Unpacker {
 public:
     explicit Unpacker(std::string_view packed) : rest_(packed) {}
@@ -93,7 +96,7 @@ public:
             number = value;
         }
     }
-    /// Whether all were there, in their form, and nothing else.
+    /// Whether all fields were there and valid, and nothing followed.
     bool Good() const { return good_ && rest_.empty(); }
 
 private:
@@ -144,7 +147,8 @@ std::string TaskStateWords(const TaskRow& row) {
     if (row.status == kRunning) {
         return row.progress.empty() ? "running" : row.progress;
     }
-    return row.retry_in ? "retry in " + HumanDuration(*row.retry_in) : TaskStatusWord(row.status);
+    return row.retry_in && row.status != kConfirm ? "retry in " + HumanDuration(*row.retry_in)
+                                                  : TaskStatusWord(row.status);
 }
 
 std::string TaskLastRunWords(const TaskRow& row) {

@@ -1,14 +1,21 @@
 #include "programs/common/task_run.h"
 
+#include <algorithm>
 #include <chrono>
+#include <map>
+#include <optional>
 #include <utility>
 
-#include "ZEL/rsyncer.h"
-#include "ZEL/zel.h"
 #include "programs/common/beacon.h"
+#include "programs/common/copy_push.h"
+#include "programs/common/copy_reading.h"
 #include "programs/common/host.h"
-#include "programs/common/present_paths.h"
+#include "programs/common/open_share.h"
+#include "programs/common/server_session.h"
 #include "programs/common/server_status.h"
+#include "programs/common/share_notes.h"
+#include "programs/common/share_sender.h"
+#include "programs/common/share_start.h"
 #include "programs/common/text.h"
 
 namespace programs {
@@ -16,67 +23,9 @@ namespace programs {
 namespace {
 
 using std::chrono::steady_clock;
-using TARQ::Backup::RunCause;
-using TARQ::Backup::RunChange;
-using TARQ::Backup::RunOptions;
-using TARQ::Backup::RunProgress;
 using TARQ::Backup::RunReport;
 
-constexpr std::chrono::seconds kLastWord(1);
-constexpr int kVanishedFiles = 24;  // rsync: some files were gone before it came to them
-
-// A share that changes while it is copied is copied so often in one run.
-constexpr int kBusyTries = 3;
-// The names of the shares in one pairing command: a command carries 5 KiB.
-constexpr size_t kMaxPairedBytes = size_t{3} * 1024;
-
-std::list<std::string> ToList(const std::vector<std::string>& items) {
-    return {items.begin(), items.end()};
-}
-
-std::string Explain(int status, const RunReport& report) {
-    std::string server_text = ServerStatusText(status);
-    if (!server_text.empty() && (status >= kFirstServerStatus || report.explanation.empty())) {
-        return server_text;
-    }
-    return !report.explanation.empty()
-               ? report.explanation
-               : "status " + std::to_string(status) + " (see the system log)";
-}
-
-bool IsAtTheTop(const std::string& path) {
-    return path.size() > 1 && path.rfind('/') == 0;
-}
-
-std::string Quoted(const std::string& share) {
-    return "share '" + Printable(share) + "'";
-}
-
-// What the failure of a command for one share says of the others.
-Reach ReachOfCommand(int status) {
-    switch (status) {
-        case kDone:  // something here, of the share's
-        case kBadArgument:
-        case kOtherAccount:
-        case kConflicts:
-        case kNoEncryption:
-        case kStorage:
-        case kNameTaken:
-        case kNotRunning:
-            return Reach::kShare;
-        default:
-            return Reach::kRun;
-    }
-}
-
-void CheckShare(const std::string& share) {
-    const std::string problem = ShareProblem(share);
-    if (!problem.empty()) {
-        throw RunFailure(FailureKind::kLocal, 0, problem, Reach::kShare);
-    }
-}
-
-// Whether `step` succeeds; one that fails leaves all of the share's order undone.
+// Whether `step` succeeds; otherwise the whole order of the share is added to `undone`.
 template <typename Step>
 bool Succeeds(const ShareOrder& share, std::vector<Undone>& undone, Step step) {
     try {
@@ -90,131 +39,12 @@ bool Succeeds(const ShareOrder& share, std::vector<Undone>& undone, Step step) {
 
 }  // namespace
 
-struct TaskRun::Impl {
+struct TaskRun::Impl : ServerSession {
     Impl(const ZEL::SyncInfo& sync_info, const std::atomic<bool>& cancel_flag, RunListener told)
-        : info(sync_info), cancel(cancel_flag), listener(std::move(told)) {
-        rsyncer.SetTaskSetup([this](ZEL::Rsyncer::RsyncTask& task) {
-            task.SetCanceller([this] { return cancel && steady_clock::now() >= patient_until; });
-            task.setRunOptions(options);
-        });
-    }
+        : ServerSession(sync_info, cancel_flag), listener(std::move(told)) {}
 
-    // The driver for one operation: what that runs has these options, and leaves its report.
-    ZEL::Rsyncer& With(RunOptions wanted = {}) {
-        options = std::move(wanted);
-        report = RunReport();
-        options.report = &report;
-        return rsyncer;
-    }
-
-    // This is said even when a person has had enough, unless the server takes too long to listen.
-    int LastWord(const std::string& type, const std::string& name, int& status) {
-        patient_until = steady_clock::now() + kLastWord;
-        const int sent = With().FinishSync(type, name, status);
-        patient_until = {};
-        return sent;
-    }
-
-    RunFailure Failed(const std::string& what, int status, Reach reach = Reach::kRun) const {
-        if (cancel) {
-            return {FailureKind::kCancelled, 0,
-                    "ended by the user; the next run completes the copy"};
-        }
-        const std::string why = status == 0 ? "see the system log" : Explain(status, report);
-        return {status == 0 ? FailureKind::kLocal : KindOf(status), status, what + ": " + why,
-                reach, report.details};
-    }
-
-    bool Silent() const { return report.status == TARQ::Backup::STATUS_TIMEOUT; }
-
-    // Finds the server. One that answers the probe, and then not the question for its version, is
-    // not a server without versions: what comes next would be put to it in the wrong form.
-    void Find() {
-        int status = With().Initialize(info);
-        const bool version_failed = report.status > kDone && report.status != kUnknownCommand &&
-                                    report.status != kUnsupportedCommand;
-        if (status == 0 && (version_failed || cancel)) {
-            status = report.status;
-        }
-        connected = status == 0;
-        if (!connected) {
-            const std::string& name = info.GetServerName();
-            throw Failed("cannot use server " + (name.empty() ? info.GetServerIP() : name), status);
-        }
-    }
-
-    // One command pairs as many shares as it carries.
-    void Pair(bool dry_run, const std::vector<std::string>& shares) {
-        for (size_t begin = 0; begin < shares.size();) {
-            size_t end = begin;
-            for (size_t bytes = 0; end < shares.size(); ++end) {
-                bytes += shares[end].size() + 1;
-                if (end > begin && bytes > kMaxPairedBytes) {
-                    break;
-                }
-            }
-            PairTogether(dry_run, {&shares[begin], &shares[begin] + (end - begin)});
-            begin = end;
-        }
-    }
-
-    void PairTogether(bool dry_run, const std::list<std::string>& shares) {
-        std::list<std::string> conflicts;
-        int status = 0;
-        const int asked = With().DoPairing(dry_run, shares, conflicts, status);
-        // A server that pairs no shares by name may say that it has merely taken the command.
-        if (asked == 0 && (status == kDone || status == kAccepted || status == kPassedThrough)) {
-            return;
-        }
-        const Reach reach = ReachOfCommand(status);
-        if (cancel || asked != 0 || status != kConflicts || conflicts.empty()) {
-            throw Failed(
-                "the server does not take " +
-                    (shares.size() == 1 ? Quoted(shares.front()) : std::string("these shares")),
-                status, reach);
-        }
-        std::string taken;
-        for (const std::string& share : conflicts) {
-            taken += (taken.empty() ? "" : ", ") + Quoted(share);
-        }
-        throw RunFailure(FailureKind::kRefused, status,
-                         taken + (conflicts.size() == 1 ? " belongs" : " belong") +
-                             " to another client or account at the server",
-                         reach);
-    }
-
-    // Announces a share, and pairs first when the server does not know this client. For this share
-    // alone: one that the server refuses must not stand in the way of the others.
-    void Start(const std::string& share) {
-        int status = 0;
-        for (const bool may_pair : {true, false}) {
-            if (With().StartSyncShare(share, status) != 0) {
-                throw Failed(Quoted(share) + " cannot be announced", 0, Reach::kShare);
-            }
-            if (status != kNotPaired || !may_pair) {
-                break;
-            }
-            Pair(false, {share});
-            if (listener.on_paired) {
-                listener.on_paired(rsyncer.GetLatestIP());
-            }
-        }
-        if (status != kDone) {
-            throw Failed("the server does not take " + Quoted(share), status,
-                         ReachOfCommand(status));
-        }
-    }
-
-    void SendKey(const std::string& share) {
-        const int status = With().SyncEncryptKey(share);
-        if (status != 0) {
-            throw Failed("the key of encrypted " + Quoted(share) + " cannot be sent", status,
-                         Reach::kShare);
-        }
-    }
-
-    // The server's answer is no reason to end the run; that there is none is: each of the commands
-    // and copies that follow would wait as long for its own.
+    // A refusal of the report does not end the run, but a missing answer does: each of the
+    // following commands and copies would run into the same time-out.
     void Announce(const std::string& task) {
         int status = 0;
         With().SendBeacon(task, status);
@@ -223,7 +53,7 @@ struct TaskRun::Impl {
         }
     }
 
-    // Throws only before any of them is begun.
+    // Throws only before the first share is started.
     void PushShares(const RunOrder& order, const ShareOrders& shares, RunTotals& totals,
                     std::vector<Undone>& undone) {
         if (!connected) {
@@ -235,6 +65,7 @@ struct TaskRun::Impl {
         Beacon beacon(rsyncer.GetSyncInfo(), order.task);
         for (auto share = shares.begin(); share != shares.end();) {
             const size_t before = undone.size();
+            beacon.SetShare((*share)->share);
             PushShare(order, **share, totals, undone);
             ++share;
             if (undone.size() == before) {
@@ -248,130 +79,101 @@ struct TaskRun::Impl {
             }
         }
         const bool announced = beacon.Stop() || order.announce;
-        totals.rsync_runs += rsync_runs;
+        totals.rsync_runs += sender.RsyncRuns();
         if (announced && heard) {
             int ignored = 0;
             LastWord("task", order.task, ignored);
         }
     }
 
-    // Adds to `undone` what the server has not taken.
-    void PushShare(const RunOrder& order, const ShareOrder& share, RunTotals& totals,
+    // Adds to `undone` what the server has not accepted.
+    void PushShare(const RunOrder& order, const ShareOrder& asked, RunTotals& totals,
                    std::vector<Undone>& undone) {
-        if (!Succeeds(share, undone, [&] { Start(share.share); })) {
+        // Starting a push makes the copy's folder, after which nobody could tell that there was
+        // none.
+        const bool may_lose =
+            asked.brake.MustLook() && (asked.brake.files || MayHaveCopy(asked.share));
+        std::optional<CopyPush> copy;
+        RunReport sent;
+        auto begin = steady_clock::now();
+        bool at_once = false;  // start, data and end in one connection
+        const auto start = [&] {
+            Noted([&] { copy.emplace(asked.share, asked.paths); });
+            pushes[asked.share] = copy->Mark();
+            at_once =
+                sender.SendAtOnce(order, asked, identities[asked.share], may_lose, *copy, sent);
+            if (!at_once) {
+                StartShare(*this, asked.share, *copy, listener.on_paired);
+                identities[asked.share] = copy->Identity();
+                begin = steady_clock::now();
+            }
+        };
+        if (!Succeeds(asked, undone, start)) {
             heard = !Silent();
+            if (copy && copy->HasEntered()) {
+                AddTo(totals, sent);
+                copy->Ended(false, false);
+            }
             return;
         }
-        const auto begin = steady_clock::now();
+        if (at_once) {
+            AddTo(totals, sent);
+            copy->Ended(true, false);
+            Done(asked.share, sent, begin);
+            return;
+        }
+        ShareOrder share = asked;
+        if (copy->MustCompare() && order.may_widen) {
+            share.paths = {kWholeShare};
+            share.rest_waits = false;
+        }
+        share.brake.is_known = !copy->MustCompare();
+        if (!share.brake.is_known) {  // it may hold anything
+            share.brake.files.reset();
+            share.brake.at_most.reset();
+        }
         const size_t undone_before = undone.size();
-        RunReport sent;
         Succeeds(share, undone, [&] {
-            SendKey(share.share);
-            // Once more, right before files are compared: an unmounted volume must not look like
-            // an emptied share.
-            CheckShare(share.share);
-            SendPaths(order, share, sent, undone);
+            SendShareKey(*this, share.share);
+            sender.Send(order, share, may_lose || (asked.brake.files && share.brake.MustLook()),
+                        *copy, sent, undone);
         });
+        AddTo(totals, sent);
+        const bool completed = undone.size() == undone_before;
+        heard = completed || !Silent();
+        const bool confirmed =
+            heard &&
+            Succeeds(share, undone, [&] { Finish(share.share, completed, share.rest_waits); }) &&
+            completed;
+        const bool whole =
+            std::find(share.paths.begin(), share.paths.end(), kWholeShare) != share.paths.end();
+        copy->Ended(confirmed && !share.rest_waits, whole);
+        if (confirmed) {
+            Done(share.share, sent, begin);
+        }
+    }
+
+    static void AddTo(RunTotals& totals, const RunReport& sent) {
         totals.files_sent += sent.files_sent;
         totals.files_deleted += sent.files_deleted;
         totals.bytes_sent += sent.bytes_sent + sent.bytes_received;
-        const std::chrono::duration<double> elapsed = steady_clock::now() - begin;
-        const bool completed = undone.size() == undone_before;
-        heard = completed || !Silent();
-        if (heard &&
-            Succeeds(share, undone, [&] { Finish(share.share, completed, share.rest_waits); }) &&
-            completed && listener.on_share_done) {
-            listener.on_share_done(share.share, sent, elapsed.count());
+    }
+
+    void Done(const std::string& share, const RunReport& sent,
+              steady_clock::time_point begin) const {
+        if (listener.on_share_done) {
+            const std::chrono::duration<double> elapsed = steady_clock::now() - begin;
+            listener.on_share_done(share, sent, elapsed.count());
         }
     }
 
-    void SendPaths(const RunOrder& order, const ShareOrder& share, RunReport& sent,
-                   std::vector<Undone>& undone) {
-        ZEL::ShareInfo facts;
-        if (rsyncer.GetShareInfo(share.share, facts) != 0) {
-            throw Failed(Quoted(share.share) + " cannot be looked up", 0, Reach::kShare);
+    // Whether the server may have a copy of the share.
+    bool MayHaveCopy(const std::string& share) {
+        try {
+            return !ReadShareNotes(share).copies.empty() || OpenForReading(*this, share, "compare");
+        } catch (const Failure&) {
+            return true;  // what comes next fails as well, or tells
         }
-        std::vector<PresentPath> paths = PresentPaths(facts.GetModulePath(), share.paths);
-        bool touched_folder = false;
-        for (auto path = paths.begin(); path != paths.end(); ++path) {
-            touched_folder = touched_folder || IsAtTheTop(path->path);
-            try {
-                SendFiles(order, share.share, path->path, sent);
-            } catch (const RunFailure& failure) {
-                undone.push_back({share.share, std::move(path->ordered), failure});
-                if (failure.reach == Reach::kPaths) {
-                    continue;
-                }
-                std::vector<std::string>& left = undone.back().paths;
-                while (++path != paths.end()) {
-                    left.insert(left.end(), path->ordered.begin(), path->ordered.end());
-                }
-                return;
-            }
-        }
-        if (touched_folder) {
-            SendFolderItself(order, share.share, sent);
-        }
-    }
-
-    // A path is sent with the folders above it, but not with the share's own, whose time the
-    // server's changes with what is sent straight into it. That is no part of any path: what is
-    // excluded is neither sent nor deleted.
-    void SendFolderItself(const RunOrder& order, const std::string& share, RunReport& sent) {
-        int status = 0;
-        With().RunSync(order.task_id, share, "/", {"/*"}, status);
-        sent.bytes_sent += report.bytes_sent;
-        sent.bytes_received += report.bytes_received;
-    }
-
-    void SendFiles(const RunOrder& order, const std::string& share, const std::string& path,
-                   RunReport& sent) {
-        RunOptions wishes;
-        wishes.bandwidth_limit = info.GetMaxBandwidth();
-        if (listener.on_progress) {
-            wishes.on_progress = [&](const RunProgress& progress) {
-                listener.on_progress(share, progress);
-            };
-        }
-        int status = 0;
-        int ran = 0;
-        for (int i = 0; i < kBusyTries; ++i) {
-            ran = With(wishes).RunSync(order.task_id, share, path, ToList(order.excludes), status);
-            if (ran == 0 && status == 0 && report.status < 0) {
-                // Nothing was there to run for. A path that has gone meanwhile is a change that
-                // will be told, of the folder above it; a share that has gone is a fault.
-                if (path == "/") {
-                    throw RunFailure(FailureKind::kLocal, 0, Quoted(share) + ": its folder is gone",
-                                     Reach::kShare);
-                }
-                return;
-            }
-            ++rsync_runs;
-            sent.files_sent += report.files_sent;
-            sent.files_deleted += report.files_deleted;
-            sent.files_total += report.files_total;
-            sent.bytes_total += report.bytes_total;
-            sent.bytes_sent += report.bytes_sent;
-            sent.bytes_received += report.bytes_received;
-            if (report.cause != RunCause::BUSY_SOURCE || cancel) {
-                break;
-            }
-        }
-        // Files that vanished under rsync's hands are changes that will be told, too.
-        if (ran == 0 && (status == 0 || status == kVanishedFiles)) {
-            return;
-        }
-        const bool busy = report.cause == RunCause::BUSY_SOURCE;
-        const bool part = busy || report.cause == RunCause::UNREADABLE_SOURCE;
-        const std::string what =
-            path == "/" ? " is not complete" : ": " + Printable(path) + " is not complete";
-        const RunFailure failed =
-            Failed(Quoted(share) + what, status, part ? Reach::kPaths : Reach::kShare);
-        if (busy && failed.Kind() == FailureKind::kFailed) {
-            throw RunFailure(FailureKind::kBusy, status, failed.what(), failed.reach,
-                             failed.details);
-        }
-        throw failed;
     }
 
     void Finish(const std::string& share, bool completed, bool rest_waits) {
@@ -380,40 +182,16 @@ struct TaskRun::Impl {
         const bool confirmed = sent == 0 && status == kDone;
         heard = (!cancel || confirmed) && !Silent();
         if (completed && !confirmed) {
-            throw Failed("the server does not confirm " + Quoted(share), status,
+            throw Failed("the server does not confirm " + QuotedShare(share), status,
                          ReachOfCommand(status));
         }
     }
 
-    void ListShare(const RunOrder& order, const ShareOrder& share, const ChangeHandler& on_change,
-                   const std::function<void(const std::string&)>& on_missing) {
-        for (const std::string& path : share.paths) {
-            RunOptions wishes;
-            wishes.dry_run = true;
-            wishes.on_change = [&](const RunChange& change) { on_change(share.share, change); };
-            int status = 0;
-            const int ran = With(wishes).RunSync(order.task_id, share.share, path,
-                                                 ToList(order.excludes), status);
-            if (ran == 0 && status != 0 && report.cause == TARQ::Backup::RunCause::UNKNOWN_MODULE) {
-                on_missing(share.share);
-                return;
-            }
-            if (ran != 0 || (status != 0 && status != kVanishedFiles)) {
-                throw Failed(Quoted(share.share) + " cannot be compared", status);
-            }
-        }
-    }
-
-    ZEL::SyncInfo info;
-    const std::atomic<bool>& cancel;
     RunListener listener;
-    RunOptions options;                      // of the operation under way
-    RunReport report;                        // of the last thing that was run
-    steady_clock::time_point patient_until;  // whatever is wanted
-    bool connected = false;                  // an address of the server has answered
-    uint64_t rsync_runs = 0;                 // copies made
-    bool heard = true;  // false: an answer to a last word would be waited for in vain
-    ZEL::Rsyncer rsyncer;
+    ShareSender sender{*this, listener};
+    std::map<std::string, std::string> pushes;      // their marks, by share
+    std::map<std::string, std::string> identities;  // of the copies, as the server told them
+    bool heard = true;  // false: the server did not answer, so no final report is sent
 };
 
 TaskRun::TaskRun(const ZEL::SyncInfo& info, const std::atomic<bool>& cancel, RunListener listener)
@@ -426,12 +204,13 @@ void TaskRun::Connect() {
 }
 
 void TaskRun::CheckPairing(const std::vector<std::string>& shares) {
-    impl_->Pair(true, shares);
+    PairShares(*impl_, true, shares);
 }
 
 RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
-    impl_->rsync_runs = 0;
+    impl_->sender.TakeSums();
     impl_->heard = true;
+    impl_->pushes.clear();
     RunResult result;
     ShareOrders ready;
     for (const ShareOrder& share : order.shares) {
@@ -439,7 +218,7 @@ RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
             ready.push_back(&share);
         }
     }
-    // A share that is away is no reason to speak to the server.
+    // The server is not contacted when no share can be pushed.
     if (!ready.empty()) {
         try {
             impl_->PushShares(order, ready, totals, result.undone);
@@ -448,13 +227,17 @@ RunResult TaskRun::Push(const RunOrder& order, RunTotals& totals) {
         }
     }
     result.failure = Sum(result.undone);
+    ShareSender::Sums sums = impl_->sender.TakeSums();
+    result.copies = std::move(sums.copies);
+    result.moved = std::move(sums.moved);
+    result.pushes = std::move(impl_->pushes);
     return result;
 }
 
 void TaskRun::List(const RunOrder& order, const ChangeHandler& on_change,
                    const std::function<void(const std::string& share)>& on_missing) {
     for (const ShareOrder& share : order.shares) {
-        impl_->ListShare(order, share, on_change, on_missing);
+        ListShare(*impl_, order, share, on_change, on_missing);
     }
 }
 

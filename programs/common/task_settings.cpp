@@ -17,7 +17,7 @@ using ZEL::PObject;
     throw Failure(FailureKind::kUsage, text, ZEL::RESULT_INVALID_ARGUMENT);
 }
 
-// Puts `said` into `settings`, each value checked, and what belongs together in a schedule too.
+// Merges `said` into `settings`, and checks each value and the consistency of the schedule.
 void Merge(const PObject& said, PObject& settings) {
     for (const TaskField& field : TaskFields()) {
         if (said.hasMember(field.key)) {
@@ -52,6 +52,10 @@ TaskSettings::TaskSettings() : own(OwnDefaults()) {}
 
 std::vector<std::string> TaskSettings::Texts(const std::string& key) const {
     return TextsOf(own.asMap().at(key));
+}
+
+Bandwidth TaskSettings::Limits() const {
+    return Bandwidth::Of(Info().GetSyncInfo().GetMaxBandwidth(), Text("bandwidth_windows"));
 }
 
 std::vector<std::string> TaskSettings::ExcludeRules() const {

@@ -1,4 +1,4 @@
-// A task's settings in one piece: what the library knows of them, and what is the programs' own.
+// All settings of a task: those that the library knows, and those that only the programs know.
 #pragma once
 
 #include <string>
@@ -6,12 +6,13 @@
 
 #include "ZEL/pobject.h"
 #include "ZEL/sync_obj.h"
+#include "programs/common/bandwidth.h"
 
 namespace programs {
 
 struct TaskSettings {
     ZEL::SyncTask task;
-    ZEL::PObject own;  ///< by key; all that OwnDefaults() has
+    ZEL::PObject own;  ///< by key; has all keys of OwnDefaults()
 
     TaskSettings();
 
@@ -19,28 +20,30 @@ struct TaskSettings {
     std::string Name() const { return task.GetInfo().GetName(); }
     const ZEL::TaskInfo& Info() const { return task.GetInfo(); }
 
-    // A setting of ours. Throws std::out_of_range for a key that is not in the table.
+    // One of the programs' own settings. Throws std::out_of_range for an unknown key.
     uint64_t Number(const std::string& key) const { return own.asMap().at(key).asUInt64(); }
     std::string Text(const std::string& key) const { return own.asMap().at(key).asString(); }
     std::vector<std::string> Texts(const std::string& key) const;
 
-    /// rsync patterns of all that stays behind.
+    /// What its runs may use of the network.
+    Bandwidth Limits() const;
+    /// rsync patterns of all files that are not sent.
     std::vector<std::string> ExcludeRules() const;
 
     /// The settings by key, and the id.
     ZEL::PObject ToMap() const;
-    /// The reverse; nothing is checked, and what the map lacks has its default.
+    /// The reverse; nothing is checked, and missing keys get their defaults.
     void SetMap(const ZEL::PObject& map);
 
     bool SameAs(const TaskSettings& other) const;
 
-    /// Changes what `said` has keys for; other keys of it are not looked at. Throws Failure
-    /// (kUsage, -4), and has changed nothing, when a value does not pass, or the task would not.
-    /// Shares are not looked up.
+    /// Changes the settings in `said`; unknown keys are ignored. Throws Failure (kUsage, -4),
+    /// without any change, when a value or the resulting task is invalid. It does not check whether
+    /// the shares exist.
     void Apply(const ZEL::PObject& said);
 };
 
-/// The schedule of a task of which only this has been said. Throws as Apply() does.
+/// The schedule of a task with only these settings. Throws as Apply() does.
 ZEL::Schedule ScheduleFrom(const ZEL::PObject& said);
 
 }  // namespace programs

@@ -15,7 +15,7 @@ namespace {
 
 constexpr size_t kMaxPassword = 255;
 
-// Switches a terminal's echo off while it lives.
+// Switches off the terminal's echo during its lifetime.
 class NoEcho {
 public:
     explicit NoEcho(int fd) : fd_(fd) {
@@ -106,10 +106,15 @@ std::string ReadNewPassword(const std::string& file, const std::string& prompt) 
     }
 }
 
-bool Confirm(const std::string& question) {
-    std::fprintf(stderr, "%s [y/N] ", question.c_str());
+std::string Ask(const std::string& question) {
+    std::fprintf(stderr, "%s ", question.c_str());
     std::string answer;
-    return ReadLine(std::cin, answer) && (answer == "y" || answer == "Y" || answer == "yes");
+    return ReadLine(std::cin, answer) ? answer : "";
+}
+
+bool Confirm(const std::string& question) {
+    const std::string answer = Ask(question + " [y/N]");
+    return answer == "y" || answer == "Y" || answer == "yes";
 }
 
 }  // namespace programs

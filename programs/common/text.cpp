@@ -3,19 +3,33 @@
 #include <algorithm>
 #include <cstdio>
 #include <ctime>
+#include <string_view>
+
+#include "base/utf8.h"
 
 namespace programs {
 
 namespace {
 
-// Whether byte `i` is a control character, or the first byte of one of U+0080 to U+009F, which
-// some terminals obey as well.
-bool IsControl(const std::string& text, size_t i) {
-    const unsigned char byte = static_cast<unsigned char>(text[i]);
-    if (byte == 0xc2 && i + 1 < text.size()) {
-        return (static_cast<unsigned char>(text[i + 1]) & 0xe0) == 0x80;
+// Characters that a terminal acts on or hides: control characters (including the 8-bit ones), line
+// separators, marks that change the text direction, and invisible characters.
+bool IsControl(uint32_t code) {
+    return code < 0x20 || (code >= 0x7f && code <= 0x9f) || code == 0x061c || code == 0x200b ||
+           code == 0x200e || code == 0x200f || (code >= 0x2028 && code <= 0x202e) ||
+           (code >= 0x2060 && code <= 0x206f) || code == 0xfeff;
+}
+
+// Calls `take` for each character of `text`, or for a single byte where it is not valid UTF-8, with
+// whether it can be shown as it is, and its code.
+template <typename Take>
+void EachCharacter(const std::string& text, Take take) {
+    for (size_t i = 0; i < text.size();) {
+        uint32_t code = 0;
+        const size_t length = base::Utf8Character(text, i, &code);
+        const bool stands = length > 0 && !IsControl(code);
+        take(std::string_view(text).substr(i, std::max<size_t>(length, 1)), stands, code);
+        i += std::max<size_t>(length, 1);
     }
-    return byte < 0x20 || byte == 0x7f;
 }
 
 }  // namespace
@@ -87,12 +101,14 @@ std::string BriefTime(int64_t seconds_since_epoch, int64_t now) {
 }
 
 bool IsPrintable(const std::string& text) {
-    for (size_t i = 0; i < text.size(); ++i) {
-        if (IsControl(text, i)) {
-            return false;
-        }
+    // Fast path for plain ASCII, which nearly all texts are.
+    if (std::all_of(text.begin(), text.end(), [](char c) { return c >= 0x20 && c < 0x7f; })) {
+        return true;
     }
-    return true;
+    bool printable = true;
+    EachCharacter(
+        text, [&](std::string_view, bool stands, uint32_t) { printable = printable && stands; });
+    return printable;
 }
 
 std::string Printable(const std::string& text) {
@@ -100,17 +116,54 @@ std::string Printable(const std::string& text) {
         return text;
     }
     std::string printable;
-    for (size_t i = 0; i < text.size(); ++i) {
-        if (IsControl(text, i)) {
+    EachCharacter(text, [&](std::string_view piece, bool stands, uint32_t) {
+        if (stands) {
+            printable += piece;
+            return;
+        }
+        for (const char c : piece) {
             char escaped[8];
             snprintf(escaped, sizeof escaped, "\\%03o",
-                     static_cast<unsigned int>(static_cast<unsigned char>(text[i])));
+                     static_cast<unsigned int>(static_cast<unsigned char>(c)));
             printable += escaped;
-        } else {
-            printable += text[i];
         }
-    }
+    });
     return printable;
+}
+
+std::string PrintableLines(const std::string& text) {
+    std::string lines;
+    for (size_t begin = 0; begin <= text.size();) {
+        const size_t end = std::min(text.find('\n', begin), text.size());
+        lines += (begin == 0 ? "" : "\n") + Printable(text.substr(begin, end - begin));
+        begin = end + 1;
+    }
+    return lines;
+}
+
+std::string SafeJson(const std::string& json) {
+    if (IsPrintable(json)) {
+        return json;
+    }
+    std::string safe;
+    EachCharacter(json, [&](std::string_view piece, bool stands, uint32_t code) {
+        if (stands || code < 0x20) {  // line ends between values; texts have theirs escaped already
+            safe += piece;
+            return;
+        }
+        char escaped[12];
+        snprintf(escaped, sizeof escaped, "\\u%04x", code);
+        safe += escaped;
+    });
+    return safe;
+}
+
+std::string Shortened(const std::string& text, size_t bytes) {
+    constexpr std::string_view kMark = " [...]";
+    if (text.size() <= bytes) {
+        return text;
+    }
+    return std::string(base::Utf8Head(text, bytes - std::min(bytes, kMark.size()))).append(kMark);
 }
 
 std::string OneLine(const std::string& text) {

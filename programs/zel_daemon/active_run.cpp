@@ -12,10 +12,9 @@ namespace zel_daemon {
 namespace {
 
 using programs::RunResult;
-using programs::RunTotals;
 using TARQ::Backup::RunProgress;
 
-// A server may have moved to another address by then.
+// A server that has not answered for so long may have moved to another address.
 constexpr std::chrono::minutes kOld(10);
 // What a run needs: the ends of pipes to two rsyncs, and files that are read on the way.
 constexpr unsigned int kDescriptors = 16;
@@ -49,14 +48,22 @@ programs::TaskRun& Connection::For(const programs::RunOrder& order) {
     return *run_;
 }
 
+void Connection::Answered() {
+    since_ = std::chrono::steady_clock::now();
+}
+
 ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection,
-                     programs::RunOrder order, const OnProgress& on_progress, const OnEnd& on_end)
-    : connection_(std::move(connection)), order_(std::move(order)) {
+                     programs::RunOrder order, IndexPlace indexes, int64_t moment,
+                     const OnProgress& on_progress, const OnEnd& on_end)
+    : connection_(std::move(connection)),
+      order_(std::move(order)),
+      indexes_(std::move(indexes)),
+      moment_(moment) {
     try {
         thread_ =
             std::thread([this, &loop, on_progress, on_end] { Work(loop, on_progress, on_end); });
     } catch (const std::system_error& error) {
-        End(loop, on_end, NothingDone(ReasonOf(error.code().value())), {});
+        End(loop, on_end, {NothingDone(ReasonOf(error.code().value()))});
     }
 }
 
@@ -78,32 +85,39 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
             }
         });
     };
-    RunResult result;
-    RunTotals totals;
+    Outcome outcome;
     try {
         // In the middle of a run their lack would look like a volume that is not mounted, or worse.
         const int lack = LackOfDescriptors(kDescriptors);
         // What lies in /tmp may have been cleaned away since the start.
         const std::string unprepared = lack != 0 ? ReasonOf(lack) : programs::PrepareHost();
-        result = unprepared.empty() ? connection_->For(order_).Push(order_, totals)
-                                    : NothingDone(unprepared);
+        if (unprepared.empty()) {
+            RunIndexes indexes(indexes_, order_, moment_,
+                               [this] { return connection_->cancel.load(); });
+            outcome.result = connection_->For(order_).Push(order_, outcome.totals);
+            if (!outcome.result.failure) {
+                connection_->Answered();
+            }
+            outcome.linked = indexes.Ended(outcome.result);
+        } else {
+            outcome.result = NothingDone(unprepared);
+        }
     } catch (const std::exception& error) {
-        result = NothingDone(error.what());
+        outcome.result = NothingDone(error.what());
     }
     connection_->on_progress = nullptr;
-    End(loop, on_end, result, totals);
+    End(loop, on_end, outcome);
 }
 
 RunResult ActiveRun::NothingDone(const std::string& why) const {
     return programs::NothingDone(order_, {programs::FailureKind::kLocal, 0, why});
 }
 
-void ActiveRun::End(EventLoop& loop, const OnEnd& on_end, const RunResult& result,
-                    const RunTotals& totals) {
-    loop.Post([this, alive = alive_, on_end, result, totals] {
+void ActiveRun::End(EventLoop& loop, const OnEnd& on_end, const Outcome& outcome) {
+    loop.Post([this, alive = alive_, on_end, outcome] {
         if (*alive) {
             ended_ = true;
-            on_end(result, totals);
+            on_end(outcome);
         }
     });
 }

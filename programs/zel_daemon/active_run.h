@@ -11,6 +11,7 @@
 
 #include "programs/common/task_run.h"
 #include "programs/zel_daemon/event_loop.h"
+#include "programs/zel_daemon/run_index.h"
 
 namespace zel_daemon {
 
@@ -23,6 +24,9 @@ public:
     /// What to push with. It starts anew when it is old, or when one of these shares lies elsewhere
     /// than it did.
     programs::TaskRun& For(const programs::RunOrder& order);
+
+    /// The server has just taken all of a run: it is where it was.
+    void Answered();
 
     std::atomic<bool> cancel{false};  ///< for good: the next run needs another connection
     std::function<void(const std::string& share, const TARQ::Backup::RunProgress&)> on_progress;
@@ -41,12 +45,19 @@ class ActiveRun {
 public:
     using OnProgress =
         std::function<void(const std::string& share, const TARQ::Backup::RunProgress&)>;
-    using OnEnd = std::function<void(const programs::RunResult&, const programs::RunTotals&)>;
+    struct Outcome {
+        programs::RunResult result;
+        programs::RunTotals totals = {};
+        RunIndexes::Linked linked = {};
+    };
+    using OnEnd = std::function<void(const Outcome&)>;
 
     /// Starts it; without a thread to be had it ends as failed. Both functions are called on the
-    /// loop's thread, after this; nothing is, once this object is gone.
+    /// loop's thread, after this; nothing is, once this object is gone. `moment`: now, in seconds
+    /// since the epoch.
     ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection, programs::RunOrder order,
-              const OnProgress& on_progress, const OnEnd& on_end);
+              IndexPlace indexes, int64_t moment, const OnProgress& on_progress,
+              const OnEnd& on_end);
     /// Cancels and waits for the end.
     ~ActiveRun();
     ActiveRun(const ActiveRun&) = delete;
@@ -60,11 +71,12 @@ public:
 private:
     void Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd& on_end);
     programs::RunResult NothingDone(const std::string& why) const;
-    void End(EventLoop& loop, const OnEnd& on_end, const programs::RunResult& result,
-             const programs::RunTotals& totals);
+    void End(EventLoop& loop, const OnEnd& on_end, const Outcome& outcome);
 
     std::shared_ptr<Connection> connection_;
-    const programs::RunOrder order_;
+    programs::RunOrder order_;  // the thread's
+    const IndexPlace indexes_;
+    const int64_t moment_;
     std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);  // the loop's thread alone
     bool ended_ = false;                                          // the loop's thread alone
     std::thread thread_;

@@ -6,6 +6,8 @@
 #include <string_view>
 #include <utility>
 
+#include "programs/zel_daemon/path_key.h"
+
 namespace zel_daemon {
 
 namespace {
@@ -13,36 +15,7 @@ namespace {
 constexpr char kSeparator = '\0';
 
 /// Folding to half leaves as many calls free of it as it costs.
-constexpr size_t kHeldAfterFolding = ChangeSet::kMaxHeld / 2;
-
-std::string KeyOf(const std::string& path) {
-    std::string key;
-    key.reserve(path.size());
-    for (size_t begin = 0; begin < path.size();) {
-        const size_t end = std::min(path.find('/', begin), path.size());
-        if (end > begin) {
-            key += kSeparator;
-            key.append(path, begin, end - begin);
-        }
-        begin = end + 1;
-    }
-    return key;
-}
-
-std::string PathOf(std::string key) {
-    std::replace(key.begin(), key.end(), kSeparator, '/');
-    return key.empty() ? "/" : key;
-}
-
-/// True for the folder's own key as well.
-bool IsWithin(std::string_view key, std::string_view folder) {
-    return key.size() >= folder.size() && key.substr(0, folder.size()) == folder &&
-           (key.size() == folder.size() || key[folder.size()] == kSeparator);
-}
-
-std::string_view ParentOf(std::string_view key) {
-    return key.substr(0, key.rfind(kSeparator));
-}
+constexpr size_t kHalf = 2;
 
 /// The deepest folder that both are within. Neither is within the other.
 std::string_view CommonFolder(std::string_view one, std::string_view other) {
@@ -110,26 +83,33 @@ std::vector<std::string> Join(const std::vector<std::string>& keys, size_t wante
 
 }  // namespace
 
-bool ChangeSet::Covers(const std::string& above, const std::string& path) {
-    return IsWithin(KeyOf(path), KeyOf(above));
-}
-
 void ChangeSet::Add(const std::string& path) {
     Hold(KeyOf(path));
-    if (held_.size() > kMaxHeld) {
+    if (IsFull(1)) {
         FoldFullest();
     }
 }
 
+bool ChangeSet::Holds(const std::string& path) const {
+    return IsHeld(KeyOf(path));
+}
+
+// Nothing that is held lies between a folder and what is within it.
+bool ChangeSet::IsHeld(const std::string& key) const {
+    const auto next = held_.upper_bound(key);
+    return next != held_.begin() && IsWithin(key, *std::prev(next));
+}
+
 void ChangeSet::Hold(std::string key) {
-    // Nothing that is held lies between a folder and what is within it.
-    auto next = held_.upper_bound(key);
-    if (next != held_.begin() && IsWithin(key, *std::prev(next))) {
+    if (IsHeld(key)) {
         return;
     }
+    auto next = held_.upper_bound(key);
     while (next != held_.end() && IsWithin(*next, key)) {
+        bytes_ -= next->size();
         next = held_.erase(next);
     }
+    bytes_ += key.size();
     held_.insert(next, std::move(key));
 }
 
@@ -145,22 +125,27 @@ void ChangeSet::FoldFullest() {
     }
     std::sort(fullest.rbegin(), fullest.rend());
     for (const auto& [count, folder] : fullest) {
-        if (held_.size() <= kHeldAfterFolding || count < 2) {
+        if (!IsFull(kHalf) || count < 2) {
             break;
         }
         Hold(folder);
     }
-    if (held_.size() > kHeldAfterFolding) {  // folders with a path or two each
+    if (IsFull(kHalf)) {  // folders with a path or two each
         const std::vector<std::string> keys(held_.begin(), held_.end());
-        const std::vector<std::string> joined = Join(keys, kHeldAfterFolding);
-        held_ = {joined.begin(), joined.end()};
+        held_.clear();
+        bytes_ = 0;
+        for (std::string& key : Join(keys, std::min(keys.size(), kMaxHeld) / kHalf)) {
+            Hold(std::move(key));
+        }
     }
 }
 
 std::vector<std::string> ChangeSet::Take() {
-    std::vector<std::string> paths = Join({held_.begin(), held_.end()}, kMaxTaken);
+    std::vector<std::string> paths;
+    paths.reserve(held_.size());
+    std::transform(held_.begin(), held_.end(), std::back_inserter(paths), PathOf);
     held_.clear();
-    std::transform(paths.begin(), paths.end(), paths.begin(), PathOf);
+    bytes_ = 0;
     std::sort(paths.begin(), paths.end());
     return paths;
 }

@@ -11,35 +11,38 @@ namespace zel_daemon {
 /// Paths begin with "/" and name what changed below the share's folder; "/" is all of it. Each
 /// stands for the whole tree below it, so a path below another one that is held adds nothing.
 ///
-/// However many changes come, memory stays bounded: a set never holds more than kMaxHeld paths.
-/// When it would, the paths of the fullest folders are replaced by their folder.
+/// However many changes come, memory stays bounded: a set never holds more than kMaxHeld paths, nor
+/// much more than kMaxBytes of them. When it would, the paths of the fullest folders are replaced
+/// by their folder.
 ///
 /// Costs: Add() is logarithmic in what is held and linear in the path's length, whatever the order
-/// of the paths; Take() is n log n.
+/// of the paths.
 ///
 /// Threads: one thread.
 class ChangeSet {
 public:
-    static constexpr size_t kMaxHeld = 4096;
-    /// What Take() gives at most: each path costs a run of rsync.
-    static constexpr size_t kMaxTaken = 16;
-
-    /// Whether `path` is `above` or below it.
-    static bool Covers(const std::string& above, const std::string& path);
+    static constexpr size_t kMaxHeld = 65536;
+    static constexpr size_t kMaxBytes = size_t{16} << 20;
 
     void Add(const std::string& path);
+    /// Whether the path, or a folder above it, is held.
+    bool Holds(const std::string& path) const;
     bool Empty() const { return held_.empty(); }
-    /// The folded paths, in byte order; the set is empty afterwards. Folding to kMaxTaken joins
-    /// the paths that lie closest together, deepest first, so that the least is sent needlessly.
+    /// The paths, in byte order; the set is empty afterwards.
     std::vector<std::string> Take();
 
 private:
+    bool IsHeld(const std::string& key) const;
     void Hold(std::string key);
+    bool IsFull(size_t part) const {
+        return held_.size() > kMaxHeld / part || bytes_ > kMaxBytes / part;
+    }
     void FoldFullest();
 
     // Each path with NUL for "/", and nothing for the whole share: no name holds a NUL, and as the
     // lowest byte it makes what is below a path follow it directly. No path is below another.
     std::set<std::string> held_;
+    size_t bytes_ = 0;  // of these
 };
 
 }  // namespace zel_daemon

@@ -16,6 +16,10 @@ struct DaemonConfig {
     std::chrono::seconds poll{900};  ///< how often what cannot be watched has a full resync
     std::chrono::milliseconds retry_first{10000};  ///< a run that failed is tried again after ...
     std::chrono::milliseconds retry_max{3600000};  ///< ... which doubles with each try, up to this
+    /// Verification by itself reads so much in a second, on average over all tasks, ...
+    unsigned int verify_rate = 16;                ///< in MiB
+    unsigned int verify_files = 10000;            ///< ... in slices of so many files at most ...
+    std::chrono::milliseconds verify_gap{10000};  ///< ... which begin at least so long apart
     std::string group;  ///< whose members may use the socket; empty: nobody's
 };
 

@@ -3,7 +3,7 @@
 #include <string>
 #include <vector>
 
-#include "base/unique_fd.h"
+#include "programs/zel_daemon/inotify.h"
 
 namespace zel_daemon {
 
@@ -14,13 +14,14 @@ public:
     FileWatch(const std::string& folder, std::vector<std::string> names);
 
     /// Readable when something has happened in the folder; -1: never.
-    int Fd() const { return fd_.Get(); }
+    int Fd() const { return watched_ ? inotify_.Fd() : -1; }
     /// Takes that in. Whether it may have been one of the files.
     bool Changed();
 
 private:
     const std::vector<std::string> names_;
-    base::UniqueFd fd_;
+    Inotify inotify_;
+    bool watched_ = false;
 };
 
 }  // namespace zel_daemon

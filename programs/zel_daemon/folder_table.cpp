@@ -1,6 +1,5 @@
 #include "programs/zel_daemon/folder_table.h"
 
-#include <algorithm>
 #include <cstring>
 #include <utility>
 
@@ -8,9 +7,7 @@ namespace zel_daemon {
 
 namespace {
 
-constexpr size_t kFirstBuckets = 64;
-
-/// The kernel counts watches up, so that neighbours never share a bucket.
+/// The kernel counts watches up, which spreads them best.
 uint64_t WatchHash(int watch) {
     return static_cast<uint64_t>(watch);
 }
@@ -26,14 +23,13 @@ void FolderTable::Index<kNext>::Insert(std::deque<Folder>& folders, FolderId id,
         folders[which].*kNext = std::exchange(head, which);
     };
     if (count_ == heads_.size()) {
-        const std::vector<FolderId> old = std::exchange(
-            heads_, std::vector<FolderId>(std::max(kFirstBuckets, count_ * 2), kNoFolder));
-        for (const FolderId head : old) {
-            for (FolderId at = head; at != kNoFolder;) {
-                const FolderId next = folders[at].*kNext;
-                link(at);
-                at = next;
-            }
+        mask_ = count_ > mask_ ? mask_ * 2 + 1 : mask_;
+        heads_.push_back(kNoFolder);
+        FolderId& divided = heads_[count_ & (mask_ / 2)];
+        for (FolderId at = std::exchange(divided, kNoFolder); at != kNoFolder;) {
+            const FolderId next = folders[at].*kNext;
+            link(at);
+            at = next;
         }
     }
     link(id);

@@ -69,7 +69,9 @@ public:
     FolderId Locate(FolderId id, std::string* path) const;
 
 private:
-    /// Chains of folders that share a bucket, linked through one member of theirs.
+    /// Chains of folders that share a bucket, linked through one member of theirs. With a folder
+    /// more comes a bucket more, which takes its part of one other's: buckets are never dealt out
+    /// anew all at once, for which a large tree would hold up everything else.
     template <FolderId Folder::*kNext>
     class Index {
     public:
@@ -82,10 +84,12 @@ private:
 
     private:
         size_t Bucket(uint64_t hash) const {
-            return static_cast<size_t>(hash & (heads_.size() - 1));
+            const auto bucket = static_cast<size_t>(hash & mask_);
+            return bucket < heads_.size() ? bucket : bucket & (mask_ / 2);
         }
 
-        std::vector<FolderId> heads_;  // as many as a power of two
+        std::vector<FolderId> heads_;
+        size_t mask_ = 0;  // of as many bits as the last bucket's number has
         size_t count_ = 0;
     };
 

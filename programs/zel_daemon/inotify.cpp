@@ -1,5 +1,6 @@
 #include "programs/zel_daemon/inotify.h"
 
+#include <poll.h>
 #include <sys/inotify.h>
 
 #include <cerrno>
@@ -37,13 +38,20 @@ int Inotify::Open() {
 }
 
 int Inotify::Watch(int folder) {
-    char path[32];
-    std::snprintf(path, sizeof(path), "/proc/self/fd/%d", folder);
-    return inotify_add_watch(fd_.Get(), path, kMask);
+    return WatchPath("/proc/self/fd/" + std::to_string(folder), kMask);
+}
+
+int Inotify::WatchPath(const std::string& path, uint32_t mask) {
+    return inotify_add_watch(fd_.Get(), path.c_str(), mask);
 }
 
 void Inotify::Unwatch(int watch) {
     inotify_rm_watch(fd_.Get(), watch);
+}
+
+bool Inotify::Await(std::chrono::milliseconds time) const {
+    pollfd waits = {fd_.Get(), POLLIN, 0};
+    return Buffered() || poll(&waits, 1, static_cast<int>(time.count())) == 1;
 }
 
 std::optional<Inotify::Event> Inotify::Next() {

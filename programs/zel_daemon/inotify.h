@@ -1,10 +1,12 @@
 // The kernel's change notices for folders.
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <string>
 #include <string_view>
 
 #include "base/unique_fd.h"
@@ -36,10 +38,14 @@ public:
     /// path. Returns the watch, the same one for a folder that is watched already; -1 with errno.
     /// REQUIRES an instance.
     int Watch(int folder);
+    /// Watches what the path leads to, for these events alone. As Watch() otherwise.
+    int WatchPath(const std::string& path, uint32_t mask);
     void Unwatch(int watch);
 
     /// The next event; nothing when none waits.
     std::optional<Event> Next();
+    /// Waits until Next() has one, so long at most. REQUIRES an instance.
+    bool Await(std::chrono::milliseconds time) const;
     /// True when events have been read from the kernel that Next() has not returned.
     bool Buffered() const { return at_ < size_; }
 

@@ -21,6 +21,8 @@
 #include "ZEL/channel.h"
 #include "ZEL/log.h"
 #include "ZEL/stream.h"
+#include "base/unix_socket.h"
+#include "programs/common/wire_text.h"
 #include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {
@@ -41,6 +43,8 @@ constexpr std::chrono::seconds kWatchAtLeast(30);  // ... and no less
 constexpr std::chrono::seconds kPeerCheck(1);      // how soon a watcher that has gone is noticed
 
 constexpr std::chrono::minutes kTellEvery(1);  // of a shortage
+constexpr size_t kRefusedKept = 16;
+constexpr unsigned int kRefusalBytes = 4096;
 
 bool IsShortage(int error) {
     return error == EMFILE || error == ENFILE || error == ENOMEM || error == ENOBUFS;
@@ -134,7 +138,34 @@ bool HasGroup(int fd, const ucred& peer, gid_t group) {
     }
 }
 
+PObject ErrorReply(int code, const std::string& error) {
+    PObject reply;
+    reply["result"] = code;
+    reply["error"] = error;
+    return reply;
+}
+
 }  // namespace
+
+/// A connection for which there is no place: it is told, without a thread, and kept open for a
+/// while, because closing over a request that nobody reads would take away what it is told.
+class IpcServer::Refusal {
+public:
+    Refusal(int fd, const std::string& why) : channel_(kRefusalBytes) {
+        if (channel_.Open(fd, true) != ZEL::RESULT_SUCCESS) {
+            close(fd);
+            return;
+        }
+        // What is new has room for so little: this does not wait.
+        ZEL::PStream().Send(channel_, ErrorReply(ZEL::RESULT_QUOTA, why));
+    }
+    ~Refusal() { channel_.Close(); }
+    Refusal(const Refusal&) = delete;
+    Refusal& operator=(const Refusal&) = delete;
+
+private:
+    ZEL::Channel channel_;
+};
 
 /// One connection, on a thread of its own.
 class IpcServer::Session {
@@ -159,6 +190,10 @@ public:
     bool Stopped() const { return __atomic_load_n(&stop_, __ATOMIC_RELAXED) != 0; }
     bool Ended() const { return ended_; }
     bool HasPeer() const { return !Stopped() && IsPeerThere(fd_); }
+    const Peer& Who() const { return peer_; }
+
+    /// Whether it has a place among those that stay; the loop's thread alone.
+    bool stays = false;
 
     /// Since when the other side is to send a request; nothing while it is answered.
     std::optional<steady_clock::time_point> WaitingSince() {
@@ -218,15 +253,14 @@ private:
     }
 
     bool SendLast(int code, const std::string& error) {
-        PObject refusal;
-        refusal["result"] = code;
-        refusal["error"] = error;
+        PObject refusal = ErrorReply(code, error);
         Send(refusal);
         Drain(fd_);
         return false;
     }
 
-    bool Send(const PObject& reply) {
+    bool Send(PObject& reply) {
+        programs::CutTooLong(reply);
         return ZEL::PStream().Send(channel_, reply) == ZEL::RESULT_SUCCESS;
     }
 
@@ -236,9 +270,13 @@ private:
             const std::lock_guard<std::mutex> lock(server_.mutex_);
             seen = server_.version_;
         }
-        PObject reply = Ask(request);
+        zel_daemon::Answer answer = Ask(request);
+        PObject& reply = answer.reply;
         if (!Send(reply)) {
-            return false;
+            return answer.rest ? Leave(*answer.rest) : false;
+        }
+        if (answer.rest) {
+            return Forward(*answer.rest);
         }
         if (!Requests::IsWatch(request)) {
             return true;
@@ -249,7 +287,7 @@ private:
             if (!HasPeer()) {
                 return false;
             }
-            reply = Ask(request);
+            reply = Ask(request).reply;
             std::string now = reply.toString();
             if (!changed || now != shown) {
                 shown = std::move(now);
@@ -261,22 +299,34 @@ private:
         return true;
     }
 
+    // The replies that come as they are found, until the last, or until nobody listens any more.
+    bool Forward(PreviewFeed& feed) {
+        for (bool last = false; !last;) {
+            PObject reply = feed.Next(&last);
+            if (!HasPeer() || !Send(reply)) {
+                return Leave(feed);
+            }
+        }
+        return true;
+    }
+    static bool Leave(PreviewFeed& feed) {
+        feed.Leave();
+        return false;
+    }
+
     // Has the loop's thread answer.
-    PObject Ask(const PObject& request) {
-        auto answer = std::make_shared<std::promise<PObject>>();
-        std::future<PObject> future = answer->get_future();
+    zel_daemon::Answer Ask(const PObject& request) {
+        auto answer = std::make_shared<std::promise<zel_daemon::Answer>>();
+        std::future<zel_daemon::Answer> future = answer->get_future();
         server_.loop_.Post([this, answer, &request] {
             if (!Stopped()) {
-                answer->set_value(server_.handler_(peer_, request));
+                answer->set_value(server_.AnswerOf(*this, request));
             }
         });
         // The loop may end before it comes to this.
         while (future.wait_for(milliseconds(100)) == std::future_status::timeout) {
             if (Stopped()) {
-                PObject stopped;
-                stopped["result"] = static_cast<int>(ZEL::RESULT_INTERRUPTED);
-                stopped["error"] = "the daemon is being stopped";
-                return stopped;
+                return ErrorReply(ZEL::RESULT_INTERRUPTED, "the daemon is being stopped");
             }
         }
         return future.get();
@@ -332,13 +382,13 @@ void IpcServer::Changed() {
 }
 
 bool IpcServer::MayAsk(int fd, Peer& peer) const {
-    ucred who = {};
-    socklen_t size = sizeof who;
-    if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &who, &size) != 0) {
+    const std::optional<ucred> who = base::PeerOf(fd);
+    if (!who) {
         return false;
     }
-    peer.trusted = who.uid == 0 || who.uid == own_user_;
-    return peer.trusted || (group_ != static_cast<gid_t>(-1) && HasGroup(fd, who, group_));
+    peer.user = who->uid;
+    peer.trusted = who->uid == 0 || who->uid == own_user_;
+    return peer.trusted || (group_ != static_cast<gid_t>(-1) && HasGroup(fd, *who, group_));
 }
 
 void IpcServer::TellShortage(int error) {
@@ -357,7 +407,8 @@ int IpcServer::AcceptOne() {
         return fd;
     }
     TellShortage(errno);
-    EndLongestWaiting();
+    refused_.clear();
+    EndLongestWaiting([](const Session&) { return true; });
     fd = listener_.accept();
     if (fd < 0 && IsShortage(errno)) {
         // One that waited on would have the loop called again at once, for ever.
@@ -374,18 +425,16 @@ void IpcServer::Accept() {
     if (fd < 0) {
         return;
     }
-    if (sessions_.size() >= kMaxConnections) {
-        EndLongestWaiting();
-    }
-    if (sessions_.size() >= kMaxConnections) {
-        Logger::LogMsg(Logger::LEVEL_WARNING,
-                       "[WARNING] zel_daemon(%d): more than %zu connections: one is refused\n",
-                       __LINE__, kMaxConnections);
-        close(fd);
-        return;
-    }
     Peer peer;
     const bool allowed = MayAsk(fd, peer);
+    if (!MakePlace(peer)) {
+        if (refused_.size() >= kRefusedKept) {
+            refused_.pop_front();
+        }
+        refused_.emplace_back(fd, "the daemon has no place for another connection of user " +
+                                      std::to_string(peer.user) + " now: try again soon");
+        return;
+    }
     try {
         sessions_.push_back(std::make_unique<Session>(*this, fd, allowed, peer));
     } catch (const std::system_error& error) {
@@ -398,23 +447,78 @@ void IpcServer::SweepEnded() {
     sessions_.remove_if([](const std::unique_ptr<Session>& session) { return session->Ended(); });
 }
 
-// Connections that ask nothing keep nobody out.
-void IpcServer::EndLongestWaiting() {
+// Connections that ask nothing keep nobody out. False when there is none of these.
+bool IpcServer::EndLongestWaiting(const std::function<bool(const Session&)>& may) {
     Session* longest = nullptr;
     std::optional<steady_clock::time_point> since;
     for (const auto& session : sessions_) {
-        const auto waiting = session->WaitingSince();
+        const auto waiting = may(*session) ? session->WaitingSince() : std::nullopt;
         if (waiting && (!since || *waiting < *since)) {
             since = waiting;
             longest = session.get();
         }
     }
+    const size_t before = sessions_.size();
     if (longest != nullptr) {
         longest->StopWaiting();
         sessions_.remove_if([&](const std::unique_ptr<Session>& session) {
             return session.get() == longest && session->Stopped();
         });
     }
+    return sessions_.size() < before;
+}
+
+// Whether one more connection of this peer has a place, after one that asks nothing was closed
+// where that helps.
+bool IpcServer::MakePlace(const Peer& peer) {
+    const auto same_user = [&](const Session& other) {
+        return other.Who().trusted == peer.trusted && other.Who().user == peer.user;
+    };
+    const auto same_people = [&](const Session& other) {
+        return other.Who().trusted == peer.trusted;
+    };
+    const auto count = [&](const auto& test) {
+        return static_cast<size_t>(
+            std::count_if(sessions_.begin(), sessions_.end(),
+                          [&](const std::unique_ptr<Session>& session) { return test(*session); }));
+    };
+    const Places& places = PlacesOf(peer);
+    return (count(same_user) < places.of_user || EndLongestWaiting(same_user)) &&
+           (count(same_people) < places.all || EndLongestWaiting(same_people));
+}
+
+// Why one more of the peer's connections cannot stay; empty when it can.
+std::string IpcServer::WhyNotStay(const Peer& peer) const {
+    size_t all = 0;
+    size_t of_user = 0;
+    for (const auto& session : sessions_) {
+        const bool counts =
+            session->stays && !session->WaitingSince() && session->Who().trusted == peer.trusted;
+        all += counts ? 1 : 0;
+        of_user += counts && session->Who().user == peer.user ? 1 : 0;
+    }
+    const Places& places = PlacesOf(peer);
+    if (of_user < places.staying_of_user && all < places.staying) {
+        return "";
+    }
+    return (of_user < places.staying_of_user
+                ? "the members of the daemon's group have "
+                : "you (user " + std::to_string(peer.user) + ") have ") +
+           std::to_string(of_user < places.staying_of_user ? all : of_user) +
+           " connections that watch, wait for runs or preview, and there may be no more: end one";
+}
+
+// On the loop's thread.
+Answer IpcServer::AnswerOf(Session& session, const PObject& request) {
+    const bool stays = Requests::Stays(request);
+    if (stays && !session.stays) {
+        const std::string why = WhyNotStay(session.Who());
+        if (!why.empty()) {
+            return ErrorReply(ZEL::RESULT_QUOTA, why);
+        }
+    }
+    session.stays = stays;
+    return handler_(session.Who(), request);
 }
 
 // Waits until what watchers see has changed since `seen`, or it is time to show that the daemon is

@@ -30,11 +30,23 @@ namespace zel_daemon {
 class IpcServer {
 public:
     /// Answers one request, on the loop's thread.
-    using Handler = std::function<ZEL::PObject(const Peer&, const ZEL::PObject&)>;
+    using Handler = std::function<Answer(const Peer&, const ZEL::PObject&)>;
 
-    /// Connections at the same time. For one more, that is closed which has been asking nothing for
-    /// the longest time; when there is none such, the new one. Likewise when descriptors run out.
-    static constexpr size_t kMaxConnections = 64;
+    /// Connections at the same time. Root and the daemon's own user have places of their own, so
+    /// that nobody can keep them out, and of the others each user has some. A connection that stays
+    /// (a watcher's, a preview's) may have all of them but some that are left for short requests.
+    ///
+    /// For one more, that of the same people is closed which has been asking nothing for the
+    /// longest time; when there is none such, the new one, after it was told why. Likewise when
+    /// descriptors run out.
+    struct Places {
+        size_t all;
+        size_t of_user;
+        size_t staying;
+        size_t staying_of_user;
+    };
+    static constexpr Places kMembers = {64, 24, 48, 16};
+    static constexpr Places kOwners = {32, 32, 24, 24};
 
     /// Listens at `path`, mode 0660 and of the group when one is named. Throws std::runtime_error.
     IpcServer(EventLoop& loop, const std::string& path, const std::string& group, Handler handler);
@@ -48,12 +60,19 @@ public:
 
 private:
     class Session;
+    class Refusal;
+
+    /// Those who share places.
+    static const Places& PlacesOf(const Peer& peer) { return peer.trusted ? kOwners : kMembers; }
 
     int AcceptOne();
     void Accept();
     void TellShortage(int error);
     void SweepEnded();
-    void EndLongestWaiting();
+    bool EndLongestWaiting(const std::function<bool(const Session&)>& may);
+    bool MakePlace(const Peer& peer);
+    std::string WhyNotStay(const Peer& peer) const;
+    Answer AnswerOf(Session& session, const ZEL::PObject& request);
     bool MayAsk(int fd, Peer& peer) const;
     bool WaitForChange(const Session& session, uint64_t& seen);
 
@@ -68,6 +87,7 @@ private:
     std::condition_variable changed_;
     uint64_t version_ = 1;  // under the mutex: counts changes
     std::list<std::unique_ptr<Session>> sessions_;
+    std::list<Refusal> refused_;  // the last ones, which may still be reading why
 };
 
 }  // namespace zel_daemon

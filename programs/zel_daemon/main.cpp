@@ -8,8 +8,11 @@
 #include <cerrno>
 #include <chrono>
 #include <cstring>
+#include <functional>
 #include <optional>
+#include <set>
 #include <thread>
+#include <utility>
 
 #include "ZEL/ipc.h"
 #include "ZEL/log.h"
@@ -17,9 +20,12 @@
 #include "programs/common/failure.h"
 #include "programs/common/help.h"
 #include "programs/common/host.h"
+#include "programs/common/recovery_notes.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/background.h"
 #include "programs/zel_daemon/daemon_config.h"
+#include "programs/zel_daemon/depositor.h"
 #include "programs/zel_daemon/event_loop.h"
 #include "programs/zel_daemon/file_watch.h"
 #include "programs/zel_daemon/ipc_server.h"
@@ -121,6 +127,25 @@ void RenewStore() {
            aside.empty() ? "" : "; what was there is now ", aside.c_str());
 }
 
+// What the configuration of this machine is made of, and the accounts that it goes to.
+DepositOrder CollectDeposit(const Service& service, Store& store) {
+    DepositOrder order;
+    order.taken = store.Deposits();
+    const programs::RecoveryNotes recovery;
+    std::set<std::pair<std::string, std::string>> accounts;
+    for (const TaskRecord* const record : service.Tasks()) {
+        order.tasks.push_back(TaskToMap(*record, TaskDetail::kAll));
+        const ZEL::SyncInfo& info = record->Info().GetSyncInfo();
+        const bool waits = record->paused && recovery.Tasks().count(record->Info().GetName()) != 0;
+        order.waits = order.waits || waits;
+        if (!info.GetPassword().empty() &&
+            accounts.insert({programs::ServerOf(info), info.GetUser()}).second) {
+            order.accounts.push_back(info);
+        }
+    }
+    return order;
+}
+
 void Serve(const Options& options) {
     std::optional<Background> background;
     if (!options.foreground) {
@@ -132,6 +157,15 @@ void Serve(const Options& options) {
     const DaemonConfig config = ReadDaemonConfig();
 
     EventLoop loop;
+    std::function<std::string()> reload;  // what was wrong
+    // Before a thread begins: one that does not block them would take them, and end all.
+    loop.OnSignal(SIGHUP, [&] {
+        const std::string error = reload();
+        if (!error.empty()) {
+            Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__,
+                           error.c_str());
+        }
+    });
     loop.OnSignal(SIGTERM, [&] { loop.Stop(); });
     loop.OnSignal(SIGINT, [&] { loop.Stop(); });
     const std::string store_path = TARQ::RootPath(kStorePath);
@@ -143,7 +177,10 @@ void Serve(const Options& options) {
             server->Changed();
         }
     });
-    const auto reload = [&] {
+    Depositor depositor(
+        loop, [&] { return CollectDeposit(service, store); },
+        [&](const DepositNote& note) { store.NoteDeposit(note); });
+    reload = [&] {
         std::string error;
         try {
             service.SetConfig(ReadDaemonConfig());
@@ -154,16 +191,10 @@ void Serve(const Options& options) {
         }
         service.Refresh();
         service.MayHaveRecovered(Recovery::kSettings);
+        depositor.Changed();
         return error;
     };
     Requests requests(service, reload, store_path);
-    loop.OnSignal(SIGHUP, [&] {
-        const std::string error = reload();
-        if (!error.empty()) {
-            Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): %s\n", __LINE__,
-                           error.c_str());
-        }
-    });
     loop.OnClockSet([&] { service.Refresh(); });
     FileWatch zone("/etc", {"localtime"});
     loop.OnReadable(zone.Fd(), [&] {
@@ -176,17 +207,23 @@ void Serve(const Options& options) {
     loop.OnReadable(recovery.NetworkFd(), [&] {
         if (recovery.NetworkChanged()) {
             service.MayHaveRecovered(Recovery::kNetwork);
+            depositor.Changed();
         }
     });
     loop.OnReadable(recovery.SettingsFd(), [&] {
         if (recovery.SettingsChanged()) {
             service.MayHaveRecovered(Recovery::kSettings);
+            depositor.Changed();
         }
     });
     service.Start();
+    depositor.Changed();
     server.emplace(loop, TARQ::RootPath(kSocketPath), config.group,
                    [&](const Peer& peer, const ZEL::PObject& request) {
-                       return requests.Answer(peer, request);
+                       if (Requests::Configures(request)) {
+                           depositor.Changed();
+                       }
+                       return requests.Reply(peer, request);
                    });
     if (background) {
         background->Ready();

@@ -7,6 +7,7 @@
 #include <initializer_list>
 #include <iterator>
 #include <set>
+#include <utility>
 
 #include "ZEL/channel.h"
 #include "ZEL/log.h"
@@ -14,6 +15,7 @@
 #include "programs/common/run_progress.h"
 #include "programs/common/schedule_words.h"
 #include "programs/common/seen_folder.h"
+#include "programs/common/share_path.h"
 #include "programs/common/task_fields.h"
 #include "programs/common/task_row.h"
 #include "programs/common/text.h"
@@ -40,10 +42,19 @@ const std::set<std::string>& StateKeys() {
                                      "retry_in",
                                      "pending",
                                      "note",
+                                     "confirm",
                                      "run",
                                      "last_run",
                                      "last_start",
                                      "last_end",
+                                     "last_compared",
+                                     "bandwidth_now",
+                                     "bandwidth_until",
+                                     "last_verified",
+                                     "verify_place",
+                                     "verify_problem",
+                                     "damaged",
+                                     "damage",
                                      "last_status",
                                      "last_error",
                                      "watched_folders",
@@ -106,6 +117,42 @@ bool FlagOf(const PObject& request, const char* key) {
     return NumberOf(request, key, 0, 1) == 1;
 }
 
+// "2024/march" as runs have it: "/2024/march".
+std::string PathOfRun(const std::string& text) {
+    const auto path = programs::PathInShare(text);
+    if (text.empty() || !path) {
+        Refuse("'" + programs::Printable(text) + "' is no path of a share");
+    }
+    return "/" + *path;
+}
+
+// Of which part of a task a request wants to know; empty: of all.
+std::vector<programs::ShareOrder> PartOf(const TaskRecord& record, const PObject& request) {
+    const auto& shares = record.Info().GetShareList();
+    const bool named = request.hasMember("share");
+    std::vector<std::string> paths;
+    if (request.hasMember("paths")) {
+        for (const PObject& path : request["paths"].asArray()) {
+            paths.push_back(PathOfRun(path.asString()));
+        }
+    }
+    if (!named && paths.empty()) {
+        return {};
+    }
+    if (!named && shares.size() > 1) {
+        Refuse("the task has several shares: say whose paths are meant");
+    }
+    programs::ShareOrder part;
+    part.share = named ? TextOf(request, "share") : shares.front();
+    if (std::find(shares.begin(), shares.end(), part.share) == shares.end()) {
+        Refuse("the task has no share '" + programs::Printable(part.share) + "'");
+    }
+    if (!paths.empty()) {
+        part.paths = paths;
+    }
+    return {part};
+}
+
 // The task as a list shows it.
 std::string RowOf(const TaskRecord& record, const TaskState& state) {
     const ZEL::TaskInfo& info = record.Info();
@@ -137,15 +184,6 @@ std::string RowOf(const TaskRecord& record, const TaskState& state) {
     return programs::PackTaskRow(row);
 }
 
-bool AsksForSecrets(const Peer& peer, const PObject& request) {
-    const bool secrets = FlagOf(request, "secrets");
-    if (secrets && !peer.trusted) {
-        throw RequestError(ZEL::RESULT_NO_PERMISSION,
-                           "only root and the daemon's own user may see passwords");
-    }
-    return secrets;
-}
-
 }  // namespace
 
 /// What a command is called, which keys it knows beside "command", and who answers it.
@@ -153,7 +191,10 @@ struct Requests::Command {
     const char* name;
     std::set<std::string> keys;
     bool takes_task;  // the keys of a task, too
-    PObject (Requests::*answer)(const Peer&, const PObject&);
+    // What it does to tasks when only root and the daemon's own user may; null: members of the
+    // group may, too.
+    const char* owners_may;
+    Answer (Requests::*answer)(const Peer&, const PObject&);
 };
 
 Requests::Requests(Service& service, std::function<std::string()> reload, std::string store_path)
@@ -166,7 +207,17 @@ bool Requests::IsWatch(const PObject& request) {
     return request["command"].asString() == "watch";
 }
 
-PObject Requests::Answer(const Peer& peer, const PObject& request) {
+bool Requests::Stays(const PObject& request) {
+    const std::string& command = request["command"].asString();
+    return command == "watch" || command == "task_preview" || command == "task_verify";
+}
+
+bool Requests::Configures(const PObject& request) {
+    const std::string& command = request["command"].asString();
+    return command == "task_add" || command == "task_edit" || command == "task_remove";
+}
+
+Answer Requests::Reply(const Peer& peer, const PObject& request) {
     try {
         return Dispatch(peer, request);
     } catch (const programs::Failure& failure) {
@@ -182,28 +233,55 @@ PObject Requests::Answer(const Peer& peer, const PObject& request) {
     }
 }
 
-PObject Requests::Dispatch(const Peer& peer, const PObject& request) {
+Answer Requests::Dispatch(const Peer& peer, const PObject& request) {
+    static const std::set<std::string> add_keys = [] {
+        std::set<std::string> keys = StateKeys();
+        keys.insert("paused");
+        return keys;
+    }();
     static const Command commands[] = {
-        {"task_add", StateKeys(), true, &Requests::TaskAdd},
-        {"task_edit", {"task"}, true, &Requests::TaskEdit},
-        {"task_list", {"secrets", "brief", "rows"}, false, &Requests::TaskList},
-        {"task_show", {"task", "secrets"}, false, &Requests::TaskShow},
-        {"task_remove", {"task"}, false, &Requests::TaskRemove},
-        {"task_run", {"task"}, false, &Requests::TaskRun},
-        {"task_cancel", {"task"}, false, &Requests::TaskCancel},
-        {"task_pause", {"task"}, false, &Requests::TaskPause},
-        {"task_resume", {"task"}, false, &Requests::TaskResume},
-        {"task_log", {"task", "limit", "details"}, false, &Requests::TaskLog},
-        {"share_check", {"path", "device", "inode", "volume"}, false, &Requests::ShareCheck},
-        {"watch", {"task"}, false, &Requests::Watch},
-        {"daemon_status", {}, false, &Requests::DaemonStatus},
-        {"reload", {}, false, &Requests::Reload},
+        {"task_add", add_keys, true, "add tasks", &Requests::TaskAdd},
+        {"task_edit", {"task"}, true, "edit tasks", &Requests::TaskEdit},
+        {"task_remove", {"task"}, false, "remove tasks", &Requests::TaskRemove},
+        {"task_confirm",
+         {"task"},
+         false,
+         "allow what a task asks, as files can be lost by it",
+         &Requests::TaskConfirm},
+        {"share_check",
+         {"path", "device", "inode", "volume"},
+         false,
+         "ask what the daemon sees",
+         &Requests::ShareCheck},
+        {"reload", {}, false, "have the configuration read again", &Requests::Reload},
+        // An export, and what shows passwords, is for the owners as well: see below.
+        {"task_list", {"secrets", "export", "brief", "rows"}, false, nullptr, &Requests::TaskList},
+        {"task_show", {"task", "secrets"}, false, nullptr, &Requests::TaskShow},
+        {"task_run", {"task"}, false, nullptr, &Requests::TaskRun},
+        {"task_preview", {"task"}, false, nullptr, &Requests::TaskPreview},
+        {"task_verify", {"task", "share", "paths"}, false, nullptr, &Requests::TaskVerify},
+        {"task_cancel", {"task"}, false, nullptr, &Requests::TaskCancel},
+        {"task_pause", {"task"}, false, nullptr, &Requests::TaskPause},
+        {"task_resume", {"task"}, false, nullptr, &Requests::TaskResume},
+        {"task_log", {"task", "limit", "details"}, false, nullptr, &Requests::TaskLog},
+        {"watch", {"task"}, false, nullptr, &Requests::Watch},
+        {"daemon_status", {}, false, nullptr, &Requests::DaemonStatus},
     };
     const std::string name = TextOf(request, "command");
     const auto command = std::find_if(std::begin(commands), std::end(commands),
                                       [&](const Command& known) { return name == known.name; });
     if (command == std::end(commands)) {
         Refuse("there is no command '" + programs::Printable(name) + "'");
+    }
+    const char* const owners_may = command->owners_may != nullptr ? command->owners_may
+                                   : FlagOf(request, "secrets")   ? "see passwords"
+                                   : FlagOf(request, "export")    ? "export tasks"
+                                                                  : nullptr;
+    if (owners_may != nullptr && !peer.trusted) {
+        throw RequestError(ZEL::RESULT_NO_PERMISSION,
+                           std::string("only root and the daemon's own user may ") + owners_may +
+                               "; members of its group may look at tasks, run, preview, pause, "
+                               "resume and cancel them");
     }
     for (const auto& [key, value] : request.asMap()) {
         if (key != "command" && command->keys.count(key) == 0 &&
@@ -214,21 +292,30 @@ PObject Requests::Dispatch(const Peer& peer, const PObject& request) {
     return (this->*command->answer)(peer, request);
 }
 
-PObject Requests::TaskAdd(const Peer&, const PObject& request) {
+Answer Requests::TaskAdd(const Peer&, const PObject& request) {
     TaskRecord record;
-    ApplyRequest(request, record);
+    record.paused = FlagOf(request, "paused");
+    ApplyRequest(request, record, record.paused ? LookUp::kLater : LookUp::kNow);
     PObject reply = Success();
     reply["task"] = ShownTask(service_.Add(std::move(record)), TaskDetail::kAll);
     return reply;
 }
 
-PObject Requests::TaskEdit(const Peer&, const PObject& request) {
+Answer Requests::TaskEdit(const Peer&, const PObject& request) {
     const std::string name = TextOf(request, "task");
     const TaskRecord& before = service_.Find(name);
     TaskRecord record = before;
     ApplyRequest(request, record);
-    const bool changed = !record.SameAs(before);
     PObject reply = Success();
+    // Whoever has a task lead elsewhere does not get there the password that was given for here.
+    if (!request.hasMember("pswd") && !before.Info().GetSyncInfo().GetPassword().empty() &&
+        !programs::SameAccount(before.ToMap(), record.ToMap())) {
+        PObject forgotten;
+        forgotten["pswd"] = "";
+        record.Apply(forgotten);
+        reply["password_forgotten"] = 1;
+    }
+    const bool changed = !record.SameAs(before);
     reply["changed"] = changed;
     // What is so already does not begin anew.
     reply["task"] =
@@ -236,8 +323,8 @@ PObject Requests::TaskEdit(const Peer&, const PObject& request) {
     return reply;
 }
 
-PObject Requests::TaskList(const Peer& peer, const PObject& request) {
-    const bool secrets = AsksForSecrets(peer, request);
+Answer Requests::TaskList(const Peer&, const PObject& request) {
+    const bool secrets = FlagOf(request, "secrets");
     const bool brief = FlagOf(request, "brief");
     PObject reply = Success();
     if (FlagOf(request, "rows")) {
@@ -256,41 +343,80 @@ PObject Requests::TaskList(const Peer& peer, const PObject& request) {
     return reply;
 }
 
-PObject Requests::TaskShow(const Peer& peer, const PObject& request) {
-    const bool secrets = AsksForSecrets(peer, request);
+Answer Requests::TaskShow(const Peer&, const PObject& request) {
+    const bool secrets = FlagOf(request, "secrets");
     PObject reply = Success();
-    reply["task"] = ShownTask(service_.Find(TextOf(request, "task")),
-                              secrets ? TaskDetail::kWithSecrets : TaskDetail::kAll);
+    const TaskRecord& record = service_.Find(TextOf(request, "task"));
+    reply["task"] = ShownTask(record, secrets ? TaskDetail::kWithSecrets : TaskDetail::kAll);
+    if (const programs::Bandwidth limits = record.Limits(); limits.Changes()) {
+        const int64_t now = time(nullptr);
+        reply["task"]["bandwidth_now"] = limits.At(now);
+        if (const auto until = limits.Until(now)) {
+            reply["task"]["bandwidth_until"] = Number(static_cast<uint64_t>(*until));
+        }
+    }
+    const TaskState state = service_.StateOf(record);
+    for (const auto& [share, question] : *state.asking) {
+        reply["task"]["confirm"].asArray().push_back(QuestionToMap(share, question));
+    }
+    for (const auto& [name, share] : state.verified->All()) {
+        for (const auto& [path, length] : share.damaged) {
+            PObject file;
+            file["share"] = name;
+            file["path"] = path;
+            file["length"] = Number(length);
+            reply["task"]["damage"].asArray().push_back(std::move(file));
+        }
+    }
     return reply;
 }
 
-PObject Requests::TaskRemove(const Peer&, const PObject& request) {
+Answer Requests::TaskRemove(const Peer&, const PObject& request) {
     service_.Remove(TextOf(request, "task"));
     return Success();
 }
 
-PObject Requests::TaskRun(const Peer&, const PObject& request) {
+Answer Requests::TaskRun(const Peer&, const PObject& request) {
     PObject reply = Success();
     reply["after"] = Number(service_.RequestRun(TextOf(request, "task")));
     return reply;
 }
 
-PObject Requests::TaskCancel(const Peer&, const PObject& request) {
+Answer Requests::TaskPreview(const Peer&, const PObject& request) {
+    PObject reply = Success();
+    reply["waiting"] = 1;
+    return {std::move(reply), service_.Preview(TextOf(request, "task"))};
+}
+
+Answer Requests::TaskVerify(const Peer&, const PObject& request) {
+    PObject reply = Success();
+    reply["waiting"] = 1;
+    const std::string name = TextOf(request, "task");
+    return {std::move(reply), service_.Preview(name, PartOf(service_.Find(name), request))};
+}
+
+Answer Requests::TaskConfirm(const Peer&, const PObject& request) {
+    PObject reply = Success();
+    reply["after"] = Number(service_.Confirm(TextOf(request, "task")));
+    return reply;
+}
+
+Answer Requests::TaskCancel(const Peer&, const PObject& request) {
     service_.Cancel(TextOf(request, "task"));
     return Success();
 }
 
-PObject Requests::TaskPause(const Peer&, const PObject& request) {
+Answer Requests::TaskPause(const Peer&, const PObject& request) {
     service_.SetPaused(TextOf(request, "task"), true);
     return Success();
 }
 
-PObject Requests::TaskResume(const Peer&, const PObject& request) {
+Answer Requests::TaskResume(const Peer&, const PObject& request) {
     service_.SetPaused(TextOf(request, "task"), false);
     return Success();
 }
 
-PObject Requests::TaskLog(const Peer&, const PObject& request) {
+Answer Requests::TaskLog(const Peer&, const PObject& request) {
     const unsigned int limit = NumberOf(request, "limit", kLogLimit, Store::kRunsKept);
     PObject reply = Success();
     PObject::Array& runs = reply["runs"].asArray();
@@ -301,11 +427,7 @@ PObject Requests::TaskLog(const Peer&, const PObject& request) {
     return reply;
 }
 
-PObject Requests::ShareCheck(const Peer& peer, const PObject& request) {
-    if (!peer.trusted) {
-        throw RequestError(ZEL::RESULT_NO_PERMISSION,
-                           "only root and the daemon's own user may ask what the daemon sees");
-    }
+Answer Requests::ShareCheck(const Peer&, const PObject& request) {
     programs::SeenFolder seen;
     seen.device = BigNumberOf(request, "device");
     seen.inode = BigNumberOf(request, "inode");
@@ -318,7 +440,7 @@ PObject Requests::ShareCheck(const Peer& peer, const PObject& request) {
     return reply;
 }
 
-PObject Requests::Watch(const Peer&, const PObject& request) {
+Answer Requests::Watch(const Peer&, const PObject& request) {
     PObject reply = Success();
     PObject::Array& tasks = reply["tasks"].asArray();
     if (request.hasMember("task")) {
@@ -331,7 +453,7 @@ PObject Requests::Watch(const Peer&, const PObject& request) {
     return reply;
 }
 
-PObject Requests::DaemonStatus(const Peer&, const PObject&) {
+Answer Requests::DaemonStatus(const Peer&, const PObject&) {
     const ServiceStats stats = service_.Stats();
     PObject reply = Success();
     reply["version"] = ZEL_VERSION;
@@ -341,13 +463,14 @@ PObject Requests::DaemonStatus(const Peer&, const PObject&) {
     reply["tasks"] = Number(stats.tasks);
     reply["running"] = Number(stats.running);
     reply["workers"] = stats.workers;
+    reply["damaged"] = Number(stats.damaged);
     reply["folders"] = Number(stats.watched.folders);
     reply["searching"] = stats.watched.scanning;
     reply["store"] = store_path_;
     return reply;
 }
 
-PObject Requests::Reload(const Peer&, const PObject&) {
+Answer Requests::Reload(const Peer&, const PObject&) {
     const std::string problem = reload_();
     if (!problem.empty()) {
         Refuse(problem);
@@ -385,6 +508,23 @@ void Requests::AddState(const TaskRecord& record, PObject& map) const {
     }
     if (!state.note.empty()) {
         map["note"] = state.note;
+    }
+    if (record.compared != 0) {
+        map["last_compared"] = Number(static_cast<uint64_t>(record.compared));
+    }
+    if (const auto verified = state.verified->LastVerified()) {
+        map["last_verified"] = Number(static_cast<uint64_t>(*verified));
+    }
+    for (const auto& [name, share] : state.verified->All()) {
+        if (share.round.goes_on) {
+            map["verify_place"] = name + ": " + share.round.place;
+        }
+    }
+    if (!state.verify_problem.empty()) {
+        map["verify_problem"] = state.verify_problem;
+    }
+    if (const size_t damaged = state.verified->Damaged()) {
+        map["damaged"] = Number(damaged);
     }
     if (state.last != nullptr) {
         map["last_run"] = Number(state.last->id);

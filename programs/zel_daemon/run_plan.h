@@ -1,6 +1,8 @@
 // One run of a task: what it is to send.
 #pragma once
 
+#include <map>
+#include <string>
 #include <vector>
 
 #include "programs/common/run_result.h"
@@ -12,6 +14,7 @@ struct RunPlan {
     programs::RunOrder order;
     RunRecord record;
     std::vector<ZEL::Event> events;  ///< the stored changes that it sends
+    std::map<std::string, std::vector<StoredMove>> moves = {};  ///< and the moves, by share
 };
 
 }  // namespace zel_daemon

@@ -3,13 +3,17 @@
 #include <utility>
 
 #include "ZEL/log.h"
+#include "base/text.h"
 #include "programs/common/host.h"
+#include "programs/common/task_fields.h"
+#include "programs/common/text.h"
 #include "programs/zel_daemon/service.h"
 
 namespace zel_daemon {
 
 namespace {
 
+using programs::Printable;
 using ZEL::Logger;
 
 // After a sign that something has come back.
@@ -19,6 +23,11 @@ void TakeSooner(std::optional<int64_t>& soonest, std::optional<int64_t> wait) {
     if (wait && (!soonest || *wait < *soonest)) {
         soonest = wait;
     }
+}
+
+// People write a name in any case.
+std::string ServerKey(const ZEL::SyncInfo& info) {
+    return base::Lower(programs::ServerOf(info));
 }
 
 std::vector<uint64_t> IdsOf(const std::vector<ZEL::Event>& events) {
@@ -41,29 +50,49 @@ void Service::Advance() {
     } else if (!recovered_.empty()) {
         wait = look_at_ - now;
     }
-    std::vector<std::pair<Task*, Step>> due;
+    SearchSome();
+    previews_.remove_if([](const PreviewJob& job) { return !job.run && job.feed->Cancelled(); });
+    std::vector<Due> due;
     Room room;
+    for (PreviewJob& job : previews_) {
+        if (job.run) {
+            TakeWorker(job.info, room);
+        } else {
+            due.push_back({job.since, nullptr, {}, &job});
+        }
+    }
     for (auto& [id, task] : tasks_) {
         const Step step = DoChores(task);
         TakeRoom(task, room);
         if (step.kind == Step::Kind::kRun) {
-            due.emplace_back(&task, step);
+            due.push_back({task.machine.DueSince(), &task, step, nullptr});
         } else {
             TakeSooner(wait, step.wait);
         }
     }
-    std::stable_sort(due.begin(), due.end(), [](const auto& a, const auto& b) {
-        return a.first->machine.DueSince() < b.first->machine.DueSince();
-    });
-    for (auto& [task, step] : due) {
+    std::stable_sort(due.begin(), due.end(),
+                     [](const Due& a, const Due& b) { return a.since < b.since; });
+    bool others_wait = false;
+    for (auto& [since, task, step, preview] : due) {
+        if (preview != nullptr) {
+            if (HasWorker(preview->info, room)) {
+                TakeWorker(preview->info, room);
+                StartPreview(*preview);
+            } else {
+                others_wait = true;
+            }
+            continue;
+        }
         WatchAgain(*task);
         while (step.kind == Step::Kind::kRun && MayStart(*task, step, room)) {
             StartRun(*task, step);
             TakeRoom(*task, room);
             step = DoChores(*task);
         }
+        others_wait = others_wait || step.kind == Step::Kind::kRun;
         TakeSooner(wait, step.wait);
     }
+    VerifySome(others_wait, wait);
     if (wait) {
         loop_.SetTimer(std::chrono::milliseconds(*wait), [this] { Advance(); });
     } else {
@@ -113,7 +142,7 @@ void Service::StoreChanges(Task& task) {
     if (task.machine.HasDebounced()) {
         const uint64_t id = task.machine.Record().ID();
         for (const auto& [share, paths] : task.machine.DebouncedChanges()) {
-            store_.AddEvents(id, share, paths);
+            store_.AddEvents(id, share, paths, task.machine.DebouncedMoves(share));
         }
         task.machine.ChangesStored();
         task.pending = store_.CountEvents(id);
@@ -122,7 +151,7 @@ void Service::StoreChanges(Task& task) {
 
 void Service::StoreFailed(Task& task, const programs::Failure& failure) {
     Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s': %s\n", __LINE__,
-                   task.machine.Record().Name().c_str(), failure.what());
+                   Printable(task.machine.Record().Name()).c_str(), failure.what());
     task.machine.StoreFailed(failure.what());
 }
 
@@ -130,17 +159,28 @@ void Service::StoreFailed(Task& task, const programs::Failure& failure) {
 
 void Service::TakeRoom(const Task& task, Room& room) const {
     if (const std::optional<RunPlan>& plan = task.machine.Running()) {
-        ++room.running;
+        TakeWorker(task.machine.Record().Info().GetSyncInfo(), room);
         for (const programs::ShareOrder& share : plan->order.shares) {
             room.in_use.insert(share.share);
         }
     }
 }
 
+void Service::TakeWorker(const ZEL::SyncInfo& info, Room& room) {
+    ++room.running;
+    room.servers.insert(ServerKey(info));
+}
+
+bool Service::HasWorker(const ZEL::SyncInfo& info, const Room& room) const {
+    return room.running < config_.workers ||
+           (room.running == config_.workers && room.servers.size() == 1 &&
+            room.servers.count(ServerKey(info)) == 0);
+}
+
 // Whether a worker is free, no other run has one of the shares, and their folders have been found,
 // so that no change falls between the resync and the watch.
 bool Service::MayStart(const Task& task, const Step& step, const Room& room) const {
-    return room.running < config_.workers &&
+    return HasWorker(task.machine.Record().Info().GetSyncInfo(), room) &&
            !task.machine.AnyShare(step, [&](const std::string& share) {
                return room.in_use.count(share) != 0 ||
                       (task.machine.Watches() && watcher_.Stats(share).scanning);
@@ -152,9 +192,12 @@ void Service::StartRun(Task& task, const Step& step) {
     std::optional<RunPlan> plan;
     try {
         StoreChanges(task);
-        plan = task.machine.Begin(step, [&](const std::string& share, uint64_t after) {
-            return store_.PendingEvents(record.ID(), share, after);
-        });
+        plan = task.machine.Begin(
+            step,
+            [&](const std::string& share, uint64_t after) {
+                return store_.PendingEvents(record.ID(), share, after);
+            },
+            [&](const std::string& share) { return store_.Moves(record.ID(), share); });
         if (!plan) {
             return;
         }
@@ -171,33 +214,61 @@ void Service::StartRun(Task& task, const Step& step) {
         task.connection = std::make_shared<Connection>(record.Info().GetSyncInfo());
     }
     Logger::LogMsg(Logger::LEVEL_INFO, "[INFO] zel_daemon(%d): task '%s': run %llu starts\n",
-                   __LINE__, record.Name().c_str(),
+                   __LINE__, Printable(record.Name()).c_str(),
                    static_cast<unsigned long long>(plan->record.id));
+    GiveWay(task);
     task.machine.Started(std::move(*plan));
     task.active = std::make_unique<ActiveRun>(
-        loop_, task.connection, task.machine.Running()->order,
+        loop_, task.connection, task.machine.Running()->order, IndexesOf(record), clock_.Now(),
         [this, &task](const std::string& share, const TARQ::Backup::RunProgress& progress) {
             task.active->progress_share = share;
             task.active->progress = progress;
             on_change_();
         },
-        [this, &task](const programs::RunResult& result, const programs::RunTotals& totals) {
-            EndRun(task, result, totals);
-        });
+        [this, &task](const ActiveRun::Outcome& outcome) { EndRun(task, outcome); });
 }
 
-void Service::EndRun(Task& task, const programs::RunResult& result,
-                     const programs::RunTotals& totals) {
+void Service::EndRun(Task& task, const ActiveRun::Outcome& outcome) {
+    const programs::RunResult& result = outcome.result;
     task.active.reset();
-    const RunRecord& run = task.machine.Ended(result, totals);
+    ForgetReplaced(task, result);
+    const std::list<std::string>& shares = task.machine.Record().Info().GetShareList();
+    if (task.machine.Watches() &&
+        std::any_of(shares.begin(), shares.end(), [this](const std::string& share) {
+            return !shares_.at(share).folder.empty() && !IsAtItsPlace(share);
+        })) {
+        WatchShares();
+    }
+    const RunRecord& run = task.machine.Ended(result, outcome.totals);
+    for (const auto& [share, path] : outcome.linked) {
+        task.machine.Changed(share, path);
+    }
     if (run.result == ZEL::TASK_RESULT_FAILED) {
         Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s': %s\n", __LINE__,
-                       task.machine.Record().Name().c_str(), run.error.c_str());
+                       Printable(task.machine.Record().Name()).c_str(),
+                       Printable(programs::OneLine(run.error)).c_str());
     }
     if (result.failure && result.failure->reach == programs::Reach::kRun) {
         task.connection.reset();
     }
     Advance();
+}
+
+void Service::StartPreview(PreviewJob& job) {
+    job.run = std::make_unique<PreviewRun>(
+        loop_, job.feed, job.info, job.order,
+        PreviewListener{
+            job.order.by_content ? SendDifferences(job)
+                                 : [](const std::string&, const TARQ::Backup::RunChange&) {},
+            [this, &job] {
+                if (job.order.by_content) {
+                    NoteVerified(job.order, job.damaged);
+                }
+            },
+            [this, &job] {
+                previews_.remove_if([&](const PreviewJob& other) { return &other == &job; });
+                Advance();
+            }});
 }
 
 // ---- What has come back ----

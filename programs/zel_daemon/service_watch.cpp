@@ -6,6 +6,7 @@
 #include "ZEL/log.h"
 #include "ZEL/zel.h"
 #include "programs/common/host.h"
+#include "programs/common/mounts_below.h"
 #include "programs/common/text.h"
 #include "programs/zel_daemon/service.h"
 #include "programs/zel_daemon/shortage.h"
@@ -80,9 +81,18 @@ void Service::WatchShares() {
         ++at;
         ZEL::ShareInfo facts;
         const bool known = ZEL::GetShareInfo(name, facts) == 0;
-        if (known && facts.GetModulePath() != share.folder) {
+        const bool is_elsewhere = !share.folder.empty() && !IsAtItsPlace(name);
+        if (is_elsewhere && !known) {  // another folder, or none
+            watcher_.Remove(name);
+            share.folder.clear();
+        }
+        if (known && (facts.GetModulePath() != share.folder || is_elsewhere)) {
             share.folder = facts.GetModulePath();
+            share.path = share.folder;
+            share.place = {};
+            stat(share.path.c_str(), &share.place);
             share.problem.clear();
+            share.mounts.reset();
             watcher_.Add(name, share.folder);
             for (Task* const task : share.tasks) {
                 task->machine.Watched(name);
@@ -97,7 +107,47 @@ void Service::WatchShares() {
             LoseForLong(name, WhyUnknown(name));
         }
     }
+    LookAtMounts();
+    std::set<std::string> paths;
+    for (const auto& [name, share] : shares_) {
+        if (!share.path.empty()) {
+            paths.insert(share.path);
+        }
+    }
+    places_.Set(paths);
     PostWatcher();
+}
+
+// Whether the path of a share still leads to the folder that is watched.
+bool Service::IsAtItsPlace(const std::string& share) const {
+    const WatchedShare& watched = shares_.at(share);
+    struct stat now = {};
+    return stat(watched.folder.c_str(), &now) == 0 && now.st_dev == watched.place.st_dev &&
+           now.st_ino == watched.place.st_ino;
+}
+
+// A disk that is mounted or unmounted below a share changes what is to be seen there, and not a
+// single file: the kernel notifies of nothing.
+void Service::LookAtMounts() {
+    try {
+        const programs::MountTable table;
+        for (auto& [name, share] : shares_) {
+            if (share.folder.empty()) {
+                continue;
+            }
+            std::vector<std::string> mounts = table.Below(share.folder);
+            if (share.mounts && *share.mounts != mounts) {
+                watcher_.Rescan(name);
+                for (Task* const task : share.tasks) {
+                    task->machine.Lost(name, false);
+                }
+            }
+            share.mounts = std::move(mounts);
+        }
+    } catch (const programs::Failure& failure) {
+        Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] zel_daemon(%d): %s\n", __LINE__,
+                       failure.what());
+    }
 }
 
 // A share that could not be watched, because its folder was away, may be there again.
@@ -133,14 +183,20 @@ void Service::OnChange(const std::string& share, const std::string& path) {
     }
 }
 
+void Service::OnMove(const std::string& share, const std::string& from, const std::string& to) {
+    for (Task* const task : shares_.at(share).tasks) {
+        task->machine.Moved(share, from, to);
+    }
+}
+
 void Service::OnLoss(const std::string& share, const WatchLoss& loss) {
     const std::string shown = ShownShare(share);
-    const std::string often = "; it is compared whole every " +
+    const std::string often = "; what changes there is looked for every " +
                               programs::HumanDuration(static_cast<uint64_t>(config_.poll.count()));
     switch (loss.kind) {
         case WatchLoss::kOverflow:  // scanned anew by the watcher itself
             Logger::LogMsg(Logger::LEVEL_WARNING, "[WARNING] zel_daemon(%d): %s\n", __LINE__,
-                           (shown + "too many changes at once; it is compared whole").c_str());
+                           (shown + "too many changes at once; they are looked for").c_str());
             for (Task* const task : shares_.at(share).tasks) {
                 task->machine.Lost(share, false);
             }

@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <limits>
 
+#include "tarq/rsync_wrapper.h"
+
 namespace zel_daemon {
 
 namespace {
@@ -21,6 +23,13 @@ void TakeEarlier(std::optional<int64_t>& soonest, std::optional<int64_t> moment)
 }
 
 }  // namespace
+
+bool BrokeOff(const programs::RunFailure& failure) {
+    return failure.reach == Reach::kShare &&
+           (failure.Status() == TARQ::Backup::STATUS_SOCKET ||
+            failure.Status() == TARQ::Backup::STATUS_PROTOCOL_STREAM ||
+            failure.Status() == TARQ::Backup::STATUS_TIMEOUT);
+}
 
 std::optional<int64_t> ShareDebts::Share::Next() const {
     if (!Owes()) {
@@ -190,6 +199,8 @@ void ShareDebts::Settle(int64_t now, const std::map<std::string, Outcome>& outco
                 RetryDelays waits = delays;
                 if (outcome.kind == FailureKind::kBusy) {
                     waits.longest = std::min(waits.longest, kLongestBusyMs);
+                } else if (outcome.kind == FailureKind::kConfirm) {
+                    waits.first = waits.longest;  // only now and then: each look costs a dry run
                 }
                 share->retry.Failed(now, waits, chance);
             }

@@ -14,6 +14,9 @@
 
 namespace zel_daemon {
 
+/// Whether the receiver may have died in the midst of a copy, and left what it had of a file.
+bool BrokeOff(const programs::RunFailure& failure);
+
 /// What is known of what changed in a share since its last full resync.
 enum class ShareState {
     kTracked,  ///< all of it, as stored changes: they are all that is owed
@@ -63,6 +66,8 @@ public:
     /// Forgets what is owed, and begins with these.
     void SetShares(const std::list<std::string>& shares);
     bool Has(const std::string& share) const { return shares_.count(share) != 0; }
+    /// REQUIRES Has().
+    bool Owes(const std::string& share) const { return shares_.at(share).Owes(); }
     /// REQUIRES Has(). While a run sends the share it counts as sent.
     ShareState StateOf(const std::string& share) const { return shares_.at(share).state; }
 

@@ -1,23 +1,11 @@
 #include "programs/zel_daemon/shortage.h"
 
-#include <fcntl.h>
-
 #include <cerrno>
 #include <cstring>
-#include <vector>
 
-#include "base/unique_fd.h"
-#include "programs/common/host.h"
 #include "programs/common/text.h"
 
 namespace zel_daemon {
-
-namespace {
-
-// That a look-up of a share needs.
-constexpr unsigned int kLookUpDescriptors = 4;
-
-}  // namespace
 
 std::string ReasonOf(int error) {
     switch (error) {
@@ -35,22 +23,14 @@ std::string ReasonOf(int error) {
     }
 }
 
-int LackOfDescriptors(unsigned int count) {
-    std::vector<base::UniqueFd> held(count);
-    for (base::UniqueFd& fd : held) {
-        fd = base::UniqueFd(open("/", O_PATH | O_CLOEXEC));
-        if (!fd) {
-            return errno;
-        }
-    }
-    return 0;
-}
-
 std::string ShareProblem(const std::string& share) {
-    if (const int error = LackOfDescriptors(kLookUpDescriptors)) {
-        return "share '" + programs::Printable(share) + "' cannot be looked up: " + ReasonOf(error);
-    }
-    return programs::ShareProblem(share);
+    int lack = LackOfDescriptors(programs::kLookUpDescriptors);
+    const std::string problem = lack == 0 ? programs::ShareProblem(share) : "";
+    // Others may have taken them meanwhile.
+    lack = problem.empty() ? lack : LackOfDescriptors(programs::kLookUpDescriptors);
+    return lack != 0
+               ? "share '" + programs::Printable(share) + "' cannot be looked up: " + ReasonOf(lack)
+               : problem;
 }
 
 }  // namespace zel_daemon

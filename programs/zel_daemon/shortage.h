@@ -3,14 +3,15 @@
 
 #include <string>
 
+#include "programs/common/host.h"
+
 namespace zel_daemon {
 
 /// What the error number `error` says, with the limit to raise when it is one that the daemon has
 /// reached. EAGAIN is that of a thread or process that could not be started.
 std::string ReasonOf(int error);
 
-/// 0 when so many descriptors can be had now, else why not.
-int LackOfDescriptors(unsigned int count);
+using programs::LackOfDescriptors;
 
 /// What programs::ShareProblem() says, unless the look-up itself lacks descriptors: that says
 /// nothing of the share, and must not be taken for a volume that is away.

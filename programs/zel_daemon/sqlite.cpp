@@ -74,6 +74,12 @@ void Query::Bind(const std::string& value) {
                                                         value.size(), SQLITE_TRANSIENT));
 }
 
+void Query::Bind(const Bytes& bytes) {
+    const std::string_view value = bytes.value;
+    database_.Check(sqlite3_bind_blob64(statement_, ++bound_, value.empty() ? "" : value.data(),
+                                        value.size(), SQLITE_TRANSIENT));
+}
+
 void Query::BindNumber(int64_t value) {
     database_.Check(sqlite3_bind_int64(statement_, ++bound_, value));
 }

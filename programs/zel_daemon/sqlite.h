@@ -8,6 +8,7 @@
 #include <optional>
 #include <stdexcept>
 #include <string>
+#include <string_view>
 #include <type_traits>
 #include <unordered_map>
 
@@ -67,6 +68,11 @@ private:
     std::unordered_map<std::string, std::unique_ptr<sqlite3_stmt, Finalize>> prepared_;
 };
 
+/// Bytes that are stored as such, text or not: they compare byte by byte.
+struct Bytes {
+    std::string_view value;
+};
+
 /// One use of a statement, which is prepared once and kept by its database. The same text must not
 /// be in use twice at a time.
 ///
@@ -90,6 +96,7 @@ public:
         BindNumber(static_cast<int64_t>(value));
     }
     void Bind(const std::string& value);
+    void Bind(const Bytes& bytes);
 
     /// Goes on to the next row; false when there is none.
     bool Next();

@@ -1,9 +1,11 @@
 #include "programs/zel_daemon/store.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <system_error>
 
 #include "programs/common/failure.h"
+#include "programs/zel_daemon/change_set.h"
 #include "programs/zel_daemon/shortage.h"
 #include "programs/zel_daemon/store_file.h"
 #include "programs/zel_daemon/store_schema.h"
@@ -92,6 +94,23 @@ ZEL::Event ReadEvent(Query& query) {
     return event;
 }
 
+StoredMove ReadMove(Query& query) {
+    StoredMove stored;
+    stored.id = static_cast<uint64_t>(query.Number());
+    stored.move.from = query.Text();
+    stored.move.to = query.Text();
+    return stored;
+}
+
+DepositNote ReadDeposit(Query& query) {
+    DepositNote deposit;
+    deposit.server = query.Text();
+    deposit.user = query.Text();
+    deposit.digest = query.Text();
+    deposit.time = query.Number();
+    return deposit;
+}
+
 template <typename Record>
 std::vector<Record> ReadAll(Query&& query, Record (*read)(Query&)) {
     std::vector<Record> records;
@@ -149,6 +168,24 @@ struct Store::Impl {
         }
     }
 
+    void SetQuestion(uint64_t task, const std::string& share,
+                     const std::optional<programs::Question>& question) {
+        if (!question) {
+            Query(*database, "DELETE FROM questions WHERE task = ? AND share = ?", task, share)
+                .Run();
+            return;
+        }
+        std::string list;
+        for (const std::string& line : question->list) {
+            list += line + "\n";
+        }
+        Query(*database,
+              "INSERT OR REPLACE INTO questions (task, share, reason, text, amount, list) "
+              "VALUES (?, ?, ?, ?, ?, ?)",
+              task, share, question->reason, question->text, question->amount, list)
+            .Run();
+    }
+
     // `statement` has one parameter, the ids as a JSON array: one statement costs half of many.
     void ForIds(const std::vector<uint64_t>& ids, const char* statement) {
         std::string list;
@@ -158,6 +195,38 @@ struct Store::Impl {
         if (!ids.empty()) {
             Query(*database, statement, list + "]").Run();
         }
+    }
+
+    void AddEvents(uint64_t task, const std::string& share, const std::vector<std::string>& paths) {
+        for (const std::string& added : paths) {
+            Query(*database,
+                  "INSERT INTO events (task, status, share, path) VALUES (?, 0, ?, ?) "
+                  "ON CONFLICT DO NOTHING",
+                  task, share, added)
+                .Run();
+        }
+    }
+
+    // Of a server that is away for long, with a share that changes much.
+    void FoldEvents(uint64_t task, const std::string& share) {
+        Query count(*database,
+                    "SELECT count(*) FROM events WHERE task = ? AND status = 0 AND share = ?", task,
+                    share);
+        count.Next();
+        if (static_cast<uint64_t>(count.Number()) <= Store::kMaxWaiting) {
+            return;
+        }
+        ChangeSet changes;
+        Query waiting(*database,
+                      "SELECT path FROM events WHERE task = ? AND status = 0 AND share = ?", task,
+                      share);
+        while (waiting.Next()) {
+            changes.Add(waiting.Text());
+        }
+        Query(*database, "DELETE FROM events WHERE task = ? AND status = 0 AND share = ?", task,
+              share)
+            .Run();
+        AddEvents(task, share, changes.Take());
     }
 
     const std::string path;
@@ -195,6 +264,10 @@ Store::Store(const std::string& path) : impl_(std::make_unique<Impl>(path)) {
 
 Store::~Store() = default;
 
+const std::string& Store::Path() const {
+    return impl_->path;
+}
+
 std::string Store::Renew(const std::string& path) {
     std::string aside = Impl(path).Do("begin anew", [&] { return PutStoreAside(path); });
     const Store fresh(path);
@@ -223,10 +296,20 @@ void Store::UpdateTask(const TaskRecord& record) {
     impl_->Change("store task '" + record.Name() + "'", [&] { impl_->Update(record); });
 }
 
-void Store::ResetTask(const TaskRecord& record) {
+void Store::ResetTask(const TaskRecord& record, bool other_copies) {
     impl_->Change("store task '" + record.Name() + "'", [&] {
         impl_->Update(record);
         Query(*impl_->database, "DELETE FROM events WHERE task = ?", record.ID()).Run();
+        Query(*impl_->database, "DELETE FROM moves WHERE task = ?", record.ID()).Run();
+        Query(*impl_->database, "DELETE FROM questions WHERE task = ?", record.ID()).Run();
+        for (const char* const table : {"copies", "verified", "damaged"}) {
+            Query(*impl_->database,
+                  std::string("DELETE FROM ") + table +
+                      " WHERE task = ?1 AND (?2 OR share NOT IN (SELECT value FROM tasks, "
+                      "json_each(share_list) WHERE tasks.id = ?1))",
+                  record.ID(), other_copies)
+                .Run();
+        }
     });
 }
 
@@ -236,15 +319,24 @@ void Store::RemoveTask(uint64_t id) {
 }
 
 void Store::AddEvents(uint64_t task_id, const std::string& share,
-                      const std::vector<std::string>& paths) {
+                      const std::vector<std::string>& paths,
+                      const std::vector<programs::ShareMove>& moves) {
     impl_->Change("store changes", [&] {
-        for (const std::string& path : paths) {
+        for (const programs::ShareMove& move : moves) {
             Query(*impl_->database,
-                  "INSERT INTO events (task, status, share, path) VALUES (?, 0, ?, ?) "
-                  "ON CONFLICT DO NOTHING",
-                  task_id, share, path)
+                  "INSERT INTO moves (task, share, source, target) VALUES (?, ?, ?, ?)", task_id,
+                  share, move.from, move.to)
                 .Run();
         }
+        if (!moves.empty()) {
+            Query(*impl_->database,
+                  "DELETE FROM moves WHERE task = ?1 AND share = ?2 AND id <= (SELECT id FROM "
+                  "moves WHERE task = ?1 AND share = ?2 ORDER BY id DESC LIMIT 1 OFFSET ?3)",
+                  task_id, share, kMovesKept)
+                .Run();
+        }
+        impl_->AddEvents(task_id, share, paths);
+        impl_->FoldEvents(task_id, share);
     });
 }
 
@@ -266,6 +358,16 @@ std::vector<ZEL::Event> Store::PendingEvents(uint64_t task_id, const std::string
                              "AND share = ? AND id > ? ORDER BY id",
                              task_id, share, after),
                        ReadEvent);
+    });
+}
+
+std::vector<StoredMove> Store::Moves(uint64_t task_id, const std::string& share) {
+    return impl_->Do("read what was moved", [&] {
+        return ReadAll(Query(*impl_->database,
+                             "SELECT id, source, target FROM moves WHERE task = ? AND share = ? "
+                             "ORDER BY id",
+                             task_id, share),
+                       ReadMove);
     });
 }
 
@@ -300,6 +402,7 @@ uint64_t Store::BeginRun(uint64_t task_id, RunReason reason, int64_t start,
 void Store::EndRun(const RunRecord& run, const RunEnd& end) {
     impl_->Change("note the end of a run", [&] {
         impl_->ForIds(end.sent, "DELETE FROM events WHERE id IN (SELECT value FROM json_each(?))");
+        impl_->ForIds(end.moved, "DELETE FROM moves WHERE id IN (SELECT value FROM json_each(?))");
         impl_->ForIds(end.unsent,
                       "UPDATE OR REPLACE events SET status = 0 "
                       "WHERE id IN (SELECT value FROM json_each(?))");
@@ -309,6 +412,105 @@ void Store::EndRun(const RunRecord& run, const RunEnd& end) {
               run.end, static_cast<int>(run.result), run.status, run.error, run.details,
               run.files_sent, run.files_deleted, run.bytes_sent, run.rsync_runs, run.id)
             .Run();
+        if (impl_->database->Changes() == 0) {
+            return;  // the task is gone
+        }
+        for (const auto& [share, files] : end.files) {
+            Query(*impl_->database,
+                  "INSERT OR REPLACE INTO copies (task, share, files) VALUES (?, ?, ?)",
+                  run.task_id, share, files)
+                .Run();
+        }
+        for (const auto& [share, question] : end.questions) {
+            impl_->SetQuestion(run.task_id, share, question);
+        }
+    });
+}
+
+std::map<uint64_t, std::map<std::string, uint64_t>> Store::FilesOfCopies() {
+    return impl_->Do("read what is known of the copies", [&] {
+        std::map<uint64_t, std::map<std::string, uint64_t>> all;
+        Query query(*impl_->database, "SELECT task, share, files FROM copies");
+        while (query.Next()) {
+            std::map<std::string, uint64_t>& copies = all[static_cast<uint64_t>(query.Number())];
+            uint64_t& files = copies[query.Text()];
+            files = static_cast<uint64_t>(query.Number());
+        }
+        return all;
+    });
+}
+
+std::map<uint64_t, Questions> Store::AllQuestions() {
+    return impl_->Do("read what waits for a person", [&] {
+        std::map<uint64_t, Questions> all;
+        Query query(*impl_->database,
+                    "SELECT task, share, reason, text, amount, list FROM questions");
+        while (query.Next()) {
+            Questions& questions = all[static_cast<uint64_t>(query.Number())];
+            programs::Question& question = questions[query.Text()];
+            question.reason = query.Text();
+            question.text = query.Text();
+            question.amount = static_cast<uint64_t>(query.Number());
+            const std::string list = query.Text();
+            for (size_t begin = 0; begin < list.size();) {
+                const size_t end = std::min(list.find('\n', begin), list.size());
+                question.list.push_back(list.substr(begin, end - begin));
+                begin = end + 1;
+            }
+        }
+        return all;
+    });
+}
+
+std::map<uint64_t, Verification::Shares> Store::AllVerifications() {
+    return impl_->Do("read how far the copies are verified", [&] {
+        std::map<uint64_t, Verification::Shares> all;
+        Query rounds(*impl_->database,
+                     "SELECT task, share, begun, ended, goes_on, place, files, bytes, all_files, "
+                     "all_bytes FROM verified");
+        while (rounds.Next()) {
+            Verification::Shares& shares = all[static_cast<uint64_t>(rounds.Number())];
+            VerifyRound& round = shares[rounds.Text()].round;
+            round.begun = rounds.Number();
+            round.ended = rounds.Number();
+            round.goes_on = rounds.Number() != 0;
+            round.place = rounds.Text();
+            round.files = static_cast<uint64_t>(rounds.Number());
+            round.bytes = static_cast<uint64_t>(rounds.Number());
+            round.all_files = static_cast<uint64_t>(rounds.Number());
+            round.all_bytes = static_cast<uint64_t>(rounds.Number());
+        }
+        Query damaged(*impl_->database, "SELECT task, share, path, length FROM damaged");
+        while (damaged.Next()) {
+            Verification::Shares& shares = all[static_cast<uint64_t>(damaged.Number())];
+            Verification::Share& share = shares[damaged.Text()];
+            const std::string path = damaged.Text();
+            share.damaged[path] = static_cast<uint64_t>(damaged.Number());
+        }
+        return all;
+    });
+}
+
+void Store::EndSlice(uint64_t task_id, const std::string& share, const VerifiedSlice& slice) {
+    impl_->Change("note how far a copy is verified", [&] {
+        const VerifyRound& round = slice.round;
+        Query(*impl_->database,
+              "INSERT OR REPLACE INTO verified (task, share, begun, ended, goes_on, place, files, "
+              "bytes, all_files, all_bytes) VALUES (?, ?, ?, ?, ?, ?, ?, ?, ?, ?)",
+              task_id, share, round.begun, round.ended, round.goes_on, round.place, round.files,
+              round.bytes, round.all_files, round.all_bytes)
+            .Run();
+        for (const std::string& path : slice.well) {
+            Query(*impl_->database, "DELETE FROM damaged WHERE task = ? AND share = ? AND path = ?",
+                  task_id, share, path)
+                .Run();
+        }
+        for (const auto& [path, length] : slice.damaged) {
+            Query(*impl_->database,
+                  "INSERT OR REPLACE INTO damaged (task, share, path, length) VALUES (?, ?, ?, ?)",
+                  task_id, share, path, length)
+                .Run();
+        }
     });
 }
 
@@ -329,6 +531,22 @@ std::vector<RunRecord> Store::LastRuns() {
                                  " FROM runs WHERE id IN (SELECT (SELECT max(id) FROM runs WHERE "
                                  "task = tasks.id) FROM tasks) ORDER BY task"),
                        ReadRun);
+    });
+}
+
+std::vector<DepositNote> Store::Deposits() {
+    return impl_->Do("read what servers have of the configuration", [&] {
+        return ReadAll(Query(*impl_->database, "SELECT server, user, digest, time FROM deposits"),
+                       ReadDeposit);
+    });
+}
+
+void Store::NoteDeposit(const DepositNote& deposit) {
+    impl_->Change("note what a server has of the configuration", [&] {
+        Query(*impl_->database,
+              "INSERT OR REPLACE INTO deposits (server, user, digest, time) VALUES (?, ?, ?, ?)",
+              deposit.server, deposit.user, deposit.digest, deposit.time)
+            .Run();
     });
 }
 

@@ -81,12 +81,87 @@ ALTER TABLE runs ADD COLUMN details TEXT NOT NULL DEFAULT '';  -- what rsync and
 // Each share's state begins anew with the daemon.
 constexpr char kNoWholeDue[] = "ALTER TABLE tasks DROP COLUMN whole_due";
 
+// How many files the copy of a share has, as its last push has left it; and what waits for a
+// person, where `list` has a line for each of the first things that would be lost.
+constexpr char kCopies[] = R"(
+CREATE TABLE copies (
+    task INTEGER NOT NULL REFERENCES tasks (id) ON DELETE CASCADE,
+    share TEXT NOT NULL,
+    files INTEGER NOT NULL,
+    PRIMARY KEY (task, share)
+) WITHOUT ROWID;
+CREATE TABLE questions (
+    task INTEGER NOT NULL REFERENCES tasks (id) ON DELETE CASCADE,
+    share TEXT NOT NULL,
+    reason TEXT NOT NULL,
+    text TEXT NOT NULL,
+    amount INTEGER NOT NULL,
+    list TEXT NOT NULL,
+    PRIMARY KEY (task, share)
+) WITHOUT ROWID;
+)";
+
+// When all shares of the task were last compared whole, in seconds since the epoch; 0: never.
+constexpr size_t kComparedLayout = 5;
+constexpr char kCompared[] = "ALTER TABLE tasks ADD COLUMN compared INTEGER NOT NULL DEFAULT 0;\n";
+
+// What the accounts of servers have last taken as this machine's configuration.
+constexpr size_t kDepositsLayout = 6;
+constexpr char kDeposits[] = R"(
+CREATE TABLE deposits (
+    server TEXT NOT NULL,
+    user TEXT NOT NULL,
+    digest TEXT NOT NULL,
+    time INTEGER NOT NULL,                 -- seconds since the epoch
+    PRIMARY KEY (server, user)
+) WITHOUT ROWID;
+)";
+
+// How far each share's copy is verified, see VerifyRound, and which of its files have other bytes
+// at the two ends.
+constexpr size_t kVerifiedLayout = 7;
+constexpr char kVerified[] = R"(
+CREATE TABLE verified (
+    task INTEGER NOT NULL REFERENCES tasks (id) ON DELETE CASCADE,
+    share TEXT NOT NULL,
+    begun INTEGER NOT NULL,                -- seconds since the epoch, like the next
+    ended INTEGER NOT NULL,
+    goes_on INTEGER NOT NULL,
+    place TEXT NOT NULL,
+    files INTEGER NOT NULL,
+    bytes INTEGER NOT NULL,
+    all_files INTEGER NOT NULL,
+    all_bytes INTEGER NOT NULL,
+    PRIMARY KEY (task, share)
+) WITHOUT ROWID;
+CREATE TABLE damaged (
+    task INTEGER NOT NULL REFERENCES tasks (id) ON DELETE CASCADE,
+    share TEXT NOT NULL,
+    path TEXT NOT NULL,
+    length INTEGER NOT NULL,
+    PRIMARY KEY (task, share, path)
+) WITHOUT ROWID;
+)";
+
+// What was moved within a share, until its server was told.
+constexpr size_t kMovesLayout = 8;
+constexpr char kMoves[] = R"(
+CREATE TABLE moves (
+    id INTEGER PRIMARY KEY AUTOINCREMENT,
+    task INTEGER NOT NULL REFERENCES tasks (id) ON DELETE CASCADE,
+    share TEXT NOT NULL,
+    source TEXT NOT NULL,
+    target TEXT NOT NULL
+);
+CREATE INDEX moves_of_share ON moves (task, share, id);
+)";
+
 // A setting that tasks have not always had: nobody has said anything of it yet.
 std::string NewColumn(const programs::TaskField& field) {
-    const char* const type = field.kind == programs::FieldKind::kText ? " TEXT NOT NULL DEFAULT ''"
+    const std::string type = field.kind == programs::FieldKind::kText ? " TEXT NOT NULL DEFAULT ''"
                              : field.kind == programs::FieldKind::kTexts
                                  ? " TEXT NOT NULL DEFAULT '[]'"
-                                 : " INTEGER NOT NULL DEFAULT 0";
+                                 : " INTEGER NOT NULL DEFAULT " + std::to_string(field.fallback);
     return std::string("ALTER TABLE tasks ADD COLUMN ") + field.key + type + ";\n";
 }
 
@@ -94,7 +169,7 @@ std::string NewColumn(const programs::TaskField& field) {
 
 const SchemaSteps& StoreSchema() {
     static const SchemaSteps steps = [] {
-        SchemaSteps all = {kFirst, kDetails, kNoWholeDue};
+        SchemaSteps all = {kFirst, kDetails, kNoWholeDue, kCopies};
         for (const programs::TaskField& field : programs::TaskFields()) {
             if (field.layout > 1) {
                 const auto layout = static_cast<size_t>(field.layout);
@@ -102,6 +177,11 @@ const SchemaSteps& StoreSchema() {
                 all[layout - 1] += NewColumn(field);
             }
         }
+        all.resize(std::max(all.size(), kMovesLayout));
+        all[kComparedLayout - 1] += kCompared;
+        all[kDepositsLayout - 1] += kDeposits;
+        all[kVerifiedLayout - 1] += kVerified;
+        all[kMovesLayout - 1] += kMoves;
         return all;
     }();
     return steps;

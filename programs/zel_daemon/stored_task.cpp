@@ -16,7 +16,7 @@ using ZEL::PObject;
 using Bytes = std::vector<unsigned char>;
 
 // Columns beside those of the settings, which are named like the settings' keys.
-constexpr const char* kOwnColumns[] = {"paused", "checked_until"};
+constexpr const char* kOwnColumns[] = {"paused", "checked_until", "compared"};
 
 // A list as a JSON array. An element that is no text, which JSON cannot hold, is an array of its
 // bytes.
@@ -78,6 +78,7 @@ void BindTask(Query& query, const TaskRecord& record) {
     }
     query.Bind(record.paused);
     query.Bind(record.checked_until);
+    query.Bind(record.compared);
 }
 
 TaskRecord ReadTask(Query& query) {
@@ -103,6 +104,7 @@ TaskRecord ReadTask(Query& query) {
     record.task.SetID(id);
     record.paused = query.Number() != 0;
     record.checked_until = query.Number();
+    record.compared = query.Number();
     return record;
 }
 

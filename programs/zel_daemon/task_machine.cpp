@@ -1,10 +1,13 @@
 #include "programs/zel_daemon/task_machine.h"
 
 #include <algorithm>
+#include <unordered_set>
 #include <utility>
 
+#include "programs/common/mounts_below.h"
+#include "programs/common/share_path.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/text.h"
-#include "tarq/rsync_wrapper.h"
 
 namespace zel_daemon {
 
@@ -12,21 +15,33 @@ namespace {
 
 using programs::FailureKind;
 using programs::Reach;
-using programs::RunFailure;
 
+// Of what a failed run leaves in the history.
+constexpr size_t kMaxErrorBytes = size_t{8} * 1024;
+constexpr size_t kMaxDetailBytes = size_t{32} * 1024;
 // A store that could not be written is tried again after so long.
 constexpr int64_t kStoreRetryMs = 10000;
 // What is far off is looked at again now and then.
-constexpr int64_t kLongestWaitMs = int64_t{24} * 3600 * 1000;
+constexpr int64_t kDayMs = int64_t{24} * 3600 * 1000;
+constexpr int64_t kLongestWaitMs = kDayMs;
 // What failed and changes again is tried so often at most.
 constexpr int64_t kChangedAgainMs = 60000;
+// So many moves of a share are kept until they are stored; what else was moved is sent.
+constexpr size_t kMaxMoves = 1024;
 
-// A receiver that died in a copy has left what it had of a file beside it, under another name.
-bool BrokeOff(const RunFailure& failure) {
-    return failure.reach == Reach::kShare &&
-           (failure.Status() == TARQ::Backup::STATUS_SOCKET ||
-            failure.Status() == TARQ::Backup::STATUS_PROTOCOL_STREAM ||
-            failure.Status() == TARQ::Backup::STATUS_TIMEOUT);
+// Whether the path or a folder above it is among `paths`.
+bool IsCovered(std::string path, const std::unordered_set<std::string>& paths) {
+    while (path.size() > 1 && paths.count(path) == 0) {
+        path = programs::FolderAbove(path);
+    }
+    return paths.count(path) != 0;
+}
+
+// Whether what is at the path has come there, or a folder above it, by one of these.
+bool WasMovedTo(const std::vector<programs::ShareMove>& moves, const std::string& path) {
+    return std::any_of(moves.begin(), moves.end(), [&path](const programs::ShareMove& move) {
+        return programs::IsAtOrBelow(path, move.to);
+    });
 }
 
 }  // namespace
@@ -41,6 +56,7 @@ void TaskMachine::MakePlan() {
     plan_.emplace(clock_, record_.Info().GetSchedule(), record_.checked_until, random_);
     held_ = false;
     unwatched_.clear();
+    to_search_.clear();
 }
 
 // ---- The question ----
@@ -72,6 +88,12 @@ Step TaskMachine::NextStep() {
     }
     if (step.kind != Kind::kWait) {
         return step;
+    }
+    if (compare_at_ && *compare_at_ <= now && !running_ && !ended_) {
+        OweComparisons();
+    }
+    if (compare_at_ && *compare_at_ > now) {
+        add(Kind::kWait, std::min(*compare_at_, now + kLongestWaitMs));
     }
     const std::optional<int64_t> run = NextRunAt(step);
     if (run && std::max(*run, writable) <= now) {
@@ -115,26 +137,99 @@ std::optional<int64_t> TaskMachine::NextRunAt(Step& step) {
     return run;
 }
 
-// ---- What happens ----
+// The shares of a realtime task are compared whole now and then: the watch may have missed
+// something, and the copy may have been changed at the server.
+void TaskMachine::PlanComparison() {
+    const auto days = static_cast<int64_t>(record_.Number("compare_days"));
+    compare_at_.reset();
+    if (days == 0 || !record_.IsRealtime()) {
+        return;
+    }
+    for (const auto& [share, comparison] : compared_) {
+        const int64_t due = comparison.elapsed + days * kDayMs;
+        compare_at_ = std::min(compare_at_.value_or(due), due);
+    }
+}
 
-void TaskMachine::Restored(bool has_changes, std::optional<RunRecord> last) {
-    if (has_changes && record_.IsRealtime()) {
-        for (const std::string& share : record_.Info().GetShareList()) {
-            debts_.OweChanges(share);
+void TaskMachine::OweComparisons() {
+    const int64_t due =
+        clock_.Elapsed() - static_cast<int64_t>(record_.Number("compare_days")) * kDayMs;
+    for (auto at = compared_.begin(); at != compared_.end();) {
+        if (at->second.elapsed <= due) {
+            debts_.OweResync(at->first);
+            at = compared_.erase(at);
+        } else {
+            ++at;
         }
     }
+    PlanComparison();
+}
+
+// ---- What happens ----
+
+void TaskMachine::Restored(bool has_changes, std::optional<RunRecord> last, Questions questions,
+                           const CopyLedger::Files& files) {
+    copies_.Restore(files);
+    questions_ = std::move(questions);
     last_ = std::move(last);
-    if (last_ && last_->result == ZEL::TASK_RESULT_FAILED) {
+    const bool failed = last_ && last_->result == ZEL::TASK_RESULT_FAILED;
+    if (failed) {
         plan_->Failed(Delays());
+    }
+    if (record_.IsRealtime()) {
+        debts_.Forgive();
+        for (const std::string& share : record_.Info().GetShareList()) {
+            if (has_changes) {
+                debts_.OweChanges(share);
+                copies_.ChangedBefore(share);
+            }
+            OweSearch(share);
+        }
+    } else if (failed) {
         debts_.OweResyncs();
     }
 }
 
+// Something may have changed without a word. What is compared whole anyhow need not be searched.
+void TaskMachine::OweSearch(const std::string& share) {
+    if (record_.IsRealtime() && debts_.Has(share) &&
+        debts_.StateOf(share) == ShareState::kTracked) {
+        to_search_[share] = ++last_search_;
+    }
+}
+
+void TaskMachine::Searched(const std::string& share, uint64_t number,
+                           std::optional<int64_t> compared) {
+    const auto found = to_search_.find(share);
+    if (found == to_search_.end() || found->second != number) {
+        return;
+    }
+    to_search_.erase(found);
+    if (!compared) {
+        debts_.OweResync(share);
+    } else if (compared_.count(share) == 0) {
+        const int64_t age = std::max<int64_t>(clock_.Now() - *compared, 0) * 1000;
+        compared_[share] = {clock_.Elapsed() - age, *compared};
+        PlanComparison();
+    }
+    // Nothing is left of what the last run failed at.
+    if (to_search_.empty() && !debts_.Next() && !HasDebounced()) {
+        plan_->Settled();
+    }
+}
+
 void TaskMachine::Edited(TaskRecord record) {
+    copies_.SetShares(record.Info().GetShareList(),
+                      !programs::SameAccount(record_.ToMap(), record.ToMap()));
     record_ = std::move(record);
     MakePlan();
     debounced_.clear();
+    moved_.clear();
     first_change_.reset();
+    compared_.clear();
+    PlanComparison();
+    questions_.clear();
+    consents_.clear();
     debts_.SetShares(record_.Info().GetShareList());
     if (record_.IsRealtime()) {
         debts_.OweResyncs();
@@ -143,10 +238,13 @@ void TaskMachine::Edited(TaskRecord record) {
 
 void TaskMachine::PauseSet(TaskRecord record) {
     record_ = std::move(record);
+    consents_.clear();
     MakePlan();
     if (record_.IsRealtime()) {
         debts_.Release();
-        debts_.OweResyncs();
+        for (const std::string& share : record_.Info().GetShareList()) {
+            OweSearch(share);
+        }
     } else {
         debts_.Forgive();
     }
@@ -154,13 +252,32 @@ void TaskMachine::PauseSet(TaskRecord record) {
 
 void TaskMachine::Changed(const std::string& share, const std::string& path) {
     debounced_[share].Add(path);
+    copies_.Changed(share, path);
     last_change_ = clock_.Elapsed();
     first_change_ = first_change_.value_or(last_change_);
     held_ = false;
 }
 
+void TaskMachine::Moved(const std::string& share, const std::string& from, const std::string& to) {
+    std::vector<programs::ShareMove>& moves = moved_[share];
+    const std::string name = from.substr(0, from.find_last_not_of('/') + 1);
+    const bool goes_on = !moves.empty() && moves.back().to == name;
+    if (goes_on && moves.back().from == to) {
+        moves.pop_back();
+    } else if (goes_on) {
+        moves.back().to = to;
+    } else if (!debounced_[share].Holds(name) || WasMovedTo(moves, name)) {
+        moves.push_back({name, to});
+    }  // else it is new, and not at the server yet
+    if (moves.size() > kMaxMoves) {
+        moves.erase(moves.begin());
+    }
+    Changed(share, from);
+    Changed(share, to);
+}
+
 void TaskMachine::Lost(const std::string& share, bool lasting) {
-    debts_.OweResync(share);
+    OweSearch(share);
     held_ = false;
     if (lasting) {
         unwatched_.insert(share);
@@ -169,7 +286,7 @@ void TaskMachine::Lost(const std::string& share, bool lasting) {
 }
 
 void TaskMachine::Watched(const std::string& share) {
-    debts_.OweResync(share);
+    OweSearch(share);
     unwatched_.erase(share);
 }
 
@@ -185,8 +302,14 @@ void TaskMachine::Recovered(const std::set<Recovery>& what,
         plan_->Hasten(gap);
     }
     debts_.Hasten(clock_.Elapsed(), gap, [&](const std::string& share, FailureKind kind) {
-        return kind == FailureKind::kLocal ? (volume || settings) && is_there(share)
-                                           : settings || (network && kind == FailureKind::kFailed);
+        switch (kind) {
+            case FailureKind::kLocal:
+                return (volume || settings) && is_there(share);
+            case FailureKind::kConfirm:  // what was missing may be there again
+                return volume || settings;
+            default:
+                return settings || (network && kind == FailureKind::kFailed);
+        }
     });
 }
 
@@ -197,11 +320,21 @@ void TaskMachine::Asked() {
     }
 }
 
+bool TaskMachine::Confirmed() {
+    for (const auto& [share, question] : questions_) {
+        consents_[share] = {question.reason, question.amount};
+        requested_ = true;
+        held_ = false;
+    }
+    return !questions_.empty();
+}
+
 bool TaskMachine::Cancelled() {
     if (!running_ && due_since_ == 0 && !UntilRetry()) {
         return false;
     }
     requested_ = false;
+    consents_.clear();
     by_person_ = running_.has_value();
     held_ = record_.IsRealtime();
     plan_->Settled();
@@ -254,11 +387,16 @@ std::map<std::string, std::vector<std::string>> TaskMachine::DebouncedChanges() 
     return folded;
 }
 
+const std::vector<programs::ShareMove>& TaskMachine::DebouncedMoves(const std::string& share) {
+    return moved_[share];
+}
+
 void TaskMachine::ChangesStored() {
     for (const auto& [share, changes] : debounced_) {
         debts_.OweChanges(share);
     }
     debounced_.clear();
+    moved_.clear();
     first_change_.reset();
     store_problem_.clear();
 }
@@ -266,11 +404,12 @@ void TaskMachine::ChangesStored() {
 void TaskMachine::Rescanned() {
     poll_at_ = NextPoll();
     for (const std::string& share : unwatched_) {
-        debts_.OweResync(share);
+        OweSearch(share);
     }
 }
 
-std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& read) {
+std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& read,
+                                          const ReadMoves& read_moves) {
     const int64_t now = clock_.Elapsed();
     if (step.all) {
         debts_.Release();
@@ -280,6 +419,7 @@ std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& r
     plan.order.task = record_.Name();
     plan.order.task_id = record_.ID();
     plan.order.excludes = record_.ExcludeRules();
+    plan.order.bandwidth = record_.Limits();
     plan.order.announce = false;
     plan.record.task_id = record_.ID();
     plan.record.reason = step.reason;
@@ -293,10 +433,12 @@ std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& r
             }
         }
         if (due.resync) {
+            to_search_.erase(due.share);
             plan.order.shares.push_back({due.share, {"/"}, false});
             plan.order.announce = true;
         } else if (!changes.Empty()) {
-            plan.order.shares.push_back({due.share, changes.Take(), due.rest_waits});
+            const bool rest_waits = due.rest_waits || to_search_.count(due.share) != 0;
+            plan.order.shares.push_back({due.share, changes.Take(), rest_waits});
         } else if (due.rest_waits) {
             // What changed is what has failed before: that may have mended it.
             debts_.Hasten(now, kChangedAgainMs, [&](const std::string& share, FailureKind) {
@@ -305,6 +447,17 @@ std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& r
         }
         if (due.again && step.reason == RunReason::kChange) {
             plan.record.reason = RunReason::kRetry;
+        }
+    }
+    const auto brake = static_cast<unsigned int>(record_.Number("brake"));
+    for (programs::ShareOrder& order : plan.order.shares) {
+        plan.moves[order.share] = read_moves(order.share);
+        for (const StoredMove& stored : plan.moves[order.share]) {
+            order.moves.push_back(stored.move);
+        }
+        order.brake = copies_.Take(order, brake);
+        if (const auto consent = consents_.find(order.share); consent != consents_.end()) {
+            order.consent = consent->second;
         }
     }
     if (plan.order.shares.empty()) {
@@ -317,6 +470,7 @@ std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& r
 
 // A run that could not begin: all that was taken for it is owed as it was.
 void TaskMachine::PutBack() {
+    copies_.PutBack();
     std::map<std::string, ShareDebts::Outcome> outcomes;
     for (const std::string& share : record_.Info().GetShareList()) {
         outcomes[share].tried = false;
@@ -344,8 +498,9 @@ const RunRecord& TaskMachine::Ended(const programs::RunResult& result,
     record.end = clock_.Now();
     if (failure) {
         record.status = failure->Status();
-        record.error = failure->what();
-        record.details = failure->details;
+        // A server may complain at any length; what it says goes into the store and into replies.
+        record.error = programs::Shortened(failure->what(), kMaxErrorBytes);
+        record.details = programs::Shortened(failure->details, kMaxDetailBytes);
     }
     record.files_sent = totals.files_sent;
     record.files_deleted = totals.files_deleted;
@@ -363,9 +518,64 @@ const RunRecord& TaskMachine::Ended(const programs::RunResult& result,
     return record;
 }
 
+// The shares that were sent whole, and nothing of which failed, have been compared.
+void TaskMachine::NoteCompared(const RunPlan& plan, const programs::RunResult& result) {
+    std::set<std::string> failed;
+    for (const programs::Undone& undone : result.undone) {
+        failed.insert(undone.share);
+    }
+    for (const programs::ShareOrder& order : plan.order.shares) {
+        if (order.paths == std::vector<std::string>{"/"} && failed.count(order.share) == 0) {
+            compared_[order.share] = {clock_.Elapsed(), clock_.Now()};
+        }
+    }
+    PlanComparison();
+    int64_t oldest = clock_.Now();
+    for (const std::string& share : record_.Info().GetShareList()) {
+        const auto found = compared_.find(share);
+        if (found == compared_.end()) {
+            return;
+        }
+        oldest = std::min(oldest, found->second.moment);
+    }
+    // What is known from an index is when that comparison began, not when it had ended.
+    const bool is_later = record_.compared <= clock_.Now() && oldest < record_.compared;
+    record_changed_ = record_changed_ || (oldest != record_.compared && !is_later);
+    record_.compared = is_later ? record_.compared : oldest;
+}
+
+// A share that was pushed has nothing left to ask; one that failed for another reason is asked
+// about again at its next try. A consent that was given while the run was under way holds for the
+// next.
+void TaskMachine::SettleQuestions(const RunPlan& plan, const programs::RunResult& result) {
+    std::map<std::string, std::optional<programs::Question>>& settled = ended_->questions;
+    std::set<std::string> failed;
+    for (const programs::Undone& undone : result.undone) {
+        failed.insert(undone.share);
+        if (undone.failure.question) {
+            settled[undone.share] = undone.failure.question;
+        }
+    }
+    for (const programs::ShareOrder& order : plan.order.shares) {
+        if (failed.count(order.share) == 0 && questions_.count(order.share) != 0) {
+            settled[order.share] = std::nullopt;
+        }
+        if (order.consent && (failed.count(order.share) == 0 || settled.count(order.share) != 0)) {
+            consents_.erase(order.share);
+        }
+    }
+    for (const auto& [share, question] : settled) {
+        if (question) {
+            questions_[share] = *question;
+        } else {
+            questions_.erase(share);
+        }
+    }
+}
+
 // What the run has sent is forgotten, what it has not is owed.
 void TaskMachine::Settle(const RunPlan& plan, const programs::RunResult& result) {
-    std::map<std::string, std::vector<const std::string*>> unsent_paths;
+    std::map<std::string, std::unordered_set<std::string>> unsent_paths;  // by share
     std::map<std::string, ShareDebts::Outcome> outcomes;
     for (const programs::Undone& undone : result.undone) {
         ShareDebts::Outcome& outcome = outcomes[undone.share];
@@ -376,22 +586,27 @@ void TaskMachine::Settle(const RunPlan& plan, const programs::RunResult& result)
         outcome.failed = true;
         outcome.tried = outcome.tried && undone.failure.reach != Reach::kRun;
         outcome.broke_off = outcome.broke_off || BrokeOff(undone.failure);
-        for (const std::string& path : undone.paths) {
-            unsent_paths[undone.share].push_back(&path);
-        }
+        unsent_paths[undone.share].insert(undone.paths.begin(), undone.paths.end());
     }
+    NoteCompared(plan, result);
     RunEnd& end = ended_.emplace();
+    SettleQuestions(plan, result);
+    end.files = copies_.Settle(plan.order, result, clock_.Elapsed() / 1000);
     for (const ZEL::Event& event : plan.events) {
         const auto unsent = unsent_paths.find(event.GetShareName());
         const bool sent =
-            unsent == unsent_paths.end() ||
-            std::none_of(unsent->second.begin(), unsent->second.end(), [&](const auto* path) {
-                return ChangeSet::Covers(*path, event.GetRelativePath());
-            });
+            unsent == unsent_paths.end() || !IsCovered(event.GetRelativePath(), unsent->second);
         (sent ? end.sent : end.unsent).push_back(event.GetID());
         if (!sent) {
             uint64_t& last = outcomes[event.GetShareName()].last_change;
             last = std::max(last, event.GetID());
+        }
+    }
+    for (const auto& [share, moves] : plan.moves) {
+        if (outcomes.count(share) == 0 || result.moved.count(share) != 0) {
+            for (const StoredMove& stored : moves) {
+                end.moved.push_back(stored.id);
+            }
         }
     }
     debts_.Settle(clock_.Elapsed(), outcomes, Delays(), plan_->Chance());
@@ -407,6 +622,12 @@ bool TaskMachine::AnyShare(const Step& step,
     const std::list<std::string>& shares = record_.Info().GetShareList();
     return step.all ? std::any_of(shares.begin(), shares.end(), test)
                     : debts_.AnyDue(clock_.Elapsed(), test);
+}
+
+bool TaskMachine::IsAtRest() const {
+    return !record_.paused && !running_ && !ended_ && !requested_ && due_since_ == 0 &&
+           !HasDebounced() && to_search_.empty() && !plan_->RetryAt() && questions_.empty() &&
+           store_problem_.empty() && last_.has_value();
 }
 
 std::optional<int64_t> TaskMachine::NextRun() const {
@@ -437,6 +658,8 @@ std::string TaskMachine::WaitsFor() const {
             return words + " for the volume or folder; tried at once when it is there";
         case FailureKind::kRefused:
             return words + " for the server to take it";
+        case FailureKind::kConfirm:
+            return "";  // the question says it
         case FailureKind::kBusy:
             return words + " until fewer files change while they are read";
         default:

@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "programs/zel_daemon/change_set.h"
+#include "programs/zel_daemon/copy_ledger.h"
 #include "programs/zel_daemon/daemon_config.h"
 #include "programs/zel_daemon/recovery_watch.h"
 #include "programs/zel_daemon/run_plan.h"
@@ -40,9 +41,11 @@ struct Step {
 ///
 /// A realtime task lives so: its shares' folders are scanned and watched, and each share begins as
 /// kUnknown (see ShareState). A full resync makes it kTracked; from then on changes are debounced,
-/// folded, stored, sent, and forgotten only when the server has taken them. A loss of the watch
-/// makes a share kUnknown again, and so does a full resync that failed; what cannot be watched is
-/// resynced every so often, after another try to watch it.
+/// folded, stored, sent, and forgotten only when the server has taken them. A full resync that
+/// failed makes a share kUnknown again. After a start of the daemon and after a loss of the watch,
+/// what changed meanwhile is to be searched here (ToSearch()), and only where that cannot tell is
+/// the share kUnknown; what cannot be watched is searched every so often, after another try to
+/// watch it.
 ///
 /// Any task's run may come by its schedule or be asked for by a person: then all shares are
 /// resynced. What of it fails is tried again, see ShareDebts and TaskPlan.
@@ -53,6 +56,8 @@ public:
     /// Reads the stored changes of a share whose number is larger than `after`.
     using ReadChanges =
         std::function<std::vector<ZEL::Event>(const std::string& share, uint64_t after)>;
+    /// Reads the stored moves of a share.
+    using ReadMoves = std::function<std::vector<StoredMove>(const std::string& share)>;
 
     /// `clock` and `config`, which may change, outlive it. For `random` see TaskPlan.
     TaskMachine(TaskRecord record, const Clock& clock, const DaemonConfig& config,
@@ -66,8 +71,10 @@ public:
     // ---- What happens ----
 
     /// After the daemon's start: whether stored changes wait, and the last run, which is made up
-    /// for when it failed or was cut off.
-    void Restored(bool has_changes, std::optional<RunRecord> last);
+    /// for when it failed or was cut off; `questions` wait for a person; `files`
+    /// are known of the copies.
+    void Restored(bool has_changes, std::optional<RunRecord> last, Questions questions = {},
+                  const CopyLedger::Files& files = {});
     /// The task has other settings, which are stored. REQUIRES that no run is under way. Its stored
     /// changes are void: everything is resynced.
     void Edited(TaskRecord record);
@@ -78,11 +85,19 @@ public:
 
     /// Something changed at `path` below the folder of a share.
     void Changed(const std::string& share, const std::string& path);
+    /// What was at `from` is at `to` now, both of them as Watcher::OnMove has them.
+    void Moved(const std::string& share, const std::string& from, const std::string& to);
     /// Changes of a share may have been missed; `lasting`: and will be, as some of it is not
     /// watched.
     void Lost(const std::string& share, bool lasting);
+    /// The copy of a share has much otherwise, whatever is known of it: it is resynced.
+    void Differs(const std::string& share) { debts_.OweResync(share); }
     /// A share's folder is watched from now on: all that changed before may have been missed.
     void Watched(const std::string& share);
+    /// What changed unnoticed in a share was searched: the search with this number of ToSearch(),
+    /// else it counts for nothing. `compared`: all of it was told to Changed(), and all of the
+    /// share was last compared with its copy then; nothing: that cannot be known here.
+    void Searched(const std::string& share, uint64_t number, std::optional<int64_t> compared);
     /// All of a share is watched again, and nothing was missed since the last rescan.
     void Covered(const std::string& share) { unwatched_.erase(share); }
     /// What was away may be there again; `is_there` is asked about the shares that wait for theirs.
@@ -91,6 +106,10 @@ public:
 
     /// A person wants a run. Nothing, when one is under way.
     void Asked();
+    /// A person allows what was asked, for one push of each share: all are pushed, and as much is
+    /// let go as was told. It holds until a share's push has succeeded. False when nothing is
+    /// asked.
+    bool Confirmed();
     /// A person wants the run under way, or the one that waits, to end for good. A realtime task's
     /// changes wait for the next change then. False when there is none.
     bool Cancelled();
@@ -109,6 +128,8 @@ public:
     bool HasDebounced() const { return first_change_.has_value(); }
     /// By share, folded. REQUIRES that ChangesStored() comes before the next Changed().
     std::map<std::string, std::vector<std::string>> DebouncedChanges();
+    /// What was moved meanwhile in that share, in order.
+    const std::vector<programs::ShareMove>& DebouncedMoves(const std::string& share);
     void ChangesStored();
 
     void Rescanned();
@@ -116,7 +137,8 @@ public:
     /// What a run sends that begins now, without its number; nothing when that is nothing.
     /// REQUIRES that debounced changes were stored. What `read` throws comes out; StoreFailed() is
     /// due then.
-    std::optional<RunPlan> Begin(const Step& step, const ReadChanges& read);
+    std::optional<RunPlan> Begin(const Step& step, const ReadChanges& read,
+                                 const ReadMoves& read_moves);
     /// The run that Begin() gave, with its number, is under way.
     void Started(RunPlan plan);
     /// It has ended: its record, which is Last() from now on.
@@ -128,6 +150,9 @@ public:
     /// Whether its shares' folders are to be watched.
     bool Watches() const { return record_.IsRealtime() && !record_.paused; }
     const std::set<std::string>& Unwatched() const { return unwatched_; }
+    /// The shares in which something may have changed that nobody has told, each with a number that
+    /// is another once more may have.
+    const std::map<std::string, uint64_t>& ToSearch() const { return to_search_; }
     ShareState StateOf(const std::string& share) const { return debts_.StateOf(share); }
     /// Whether `test` holds for one of the shares of a run that is due.
     bool AnyShare(const Step& step,
@@ -141,17 +166,29 @@ public:
     std::optional<int64_t> NextRun() const;
     /// Milliseconds until something that failed is tried again.
     std::optional<int64_t> UntilRetry() const;
+    /// Whether nothing is due, under way or owed, nobody is asked, and the last run has brought the
+    /// shares' copies into step.
+    bool IsAtRest() const;
+    /// The same of one share: others of the task may wait for their next try.
+    bool IsAtRest(const std::string& share) const { return IsAtRest() && !debts_.Owes(share); }
     /// Why nothing can be stored; empty when it can.
     const std::string& StoreProblem() const { return store_problem_; }
+    /// What waits until a person allows it.
+    const Questions& Asking() const { return questions_; }
     /// What the next try of something that failed waits for, for people; empty when none waits.
     std::string WaitsFor() const;
 
 private:
     void MakePlan();
+    void OweSearch(const std::string& share);
     std::optional<int64_t> NextRunAt(Step& step);
     void TakeSchedule();
     void PutBack();
     void Settle(const RunPlan& plan, const programs::RunResult& result);
+    void NoteCompared(const RunPlan& plan, const programs::RunResult& result);
+    void PlanComparison();
+    void OweComparisons();
+    void SettleQuestions(const RunPlan& plan, const programs::RunResult& result);
     int64_t NextPoll() const { return clock_.Elapsed() + config_.poll.count() * 1000; }
     RetryDelays Delays() const { return {config_.retry_first.count(), config_.retry_max.count()}; }
 
@@ -162,6 +199,14 @@ private:
     bool record_changed_ = false;   // and the store does not know
     std::optional<TaskPlan> plan_;  // always there
     ShareDebts debts_;
+    /// When a share was last compared whole, on the clock that never jumps and on the wall's.
+    struct Comparison {
+        int64_t elapsed = 0;
+        int64_t moment = 0;
+    };
+    std::map<std::string, Comparison> compared_;  // since the start; without those that are due
+    std::optional<int64_t> compare_at_;           // when the first of these is due
+    CopyLedger copies_;
 
     // Runs.
     bool requested_ = false;
@@ -171,15 +216,20 @@ private:
     bool held_ = false;       // a person cancelled: a realtime task waits for a new change
     std::optional<RunRecord> last_;
     std::optional<RunEnd> ended_;
+    Questions questions_;
+    std::map<std::string, programs::Consent> consents_;  // by share
     int64_t store_retry_at_ = 0;
     std::string store_problem_;
 
     // The watch.
-    std::map<std::string, ChangeSet> debounced_;  // by share
-    std::optional<int64_t> first_change_;         // of these; nothing: there are none
+    std::map<std::string, ChangeSet> debounced_;                     // by share
+    std::map<std::string, std::vector<programs::ShareMove>> moved_;  // by share, meanwhile
+    std::optional<int64_t> first_change_;  // of these; nothing: there are none
     int64_t last_change_ = 0;
     std::set<std::string> unwatched_;  // shares of which something is not watched
-    int64_t poll_at_ = 0;              // when these are scanned again
+    std::map<std::string, uint64_t> to_search_;
+    uint64_t last_search_ = 0;
+    int64_t poll_at_ = 0;  // when these are scanned again
 };
 
 }  // namespace zel_daemon

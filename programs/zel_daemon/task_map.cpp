@@ -10,15 +10,20 @@ namespace zel_daemon {
 
 using ZEL::PObject;
 
-void ApplyRequest(const PObject& request, TaskRecord& record) {
+void ApplyRequest(const PObject& request, TaskRecord& record, LookUp shares) {
     TaskRecord changed = record;
     changed.Apply(request);
     // The last look, because it asks the disk: a task whose volume is away can still be edited.
     for (const std::string& share : programs::TextsOf(request["share_list"])) {
-        const std::string problem = ShareProblem(share);
+        const std::string problem = shares == LookUp::kNow ? ShareProblem(share) : "";
         if (!problem.empty()) {
             throw RequestError(ZEL::RESULT_FOLDER_MISSING, problem);
         }
+    }
+    // Other copies, or more of them, have not been compared yet.
+    if (changed.Info().GetShareList() != record.Info().GetShareList() ||
+        !programs::SameAccount(record.ToMap(), changed.ToMap())) {
+        changed.compared = 0;
     }
     record = std::move(changed);
 }
@@ -53,6 +58,16 @@ PObject RunToMap(const RunRecord& run, bool with_details) {
     map["files_deleted"] = static_cast<unsigned long long>(run.files_deleted);
     map["bytes_sent"] = static_cast<unsigned long long>(run.bytes_sent);
     map["rsync_runs"] = static_cast<unsigned long long>(run.rsync_runs);
+    return map;
+}
+
+PObject QuestionToMap(const std::string& share, const programs::Question& question) {
+    PObject map;
+    map["share"] = share;
+    map["reason"] = question.reason;
+    map["text"] = question.text;
+    map["amount"] = static_cast<unsigned long long>(question.amount);
+    map["list"].asArray().assign(question.list.begin(), question.list.end());
     return map;
 }
 

@@ -2,9 +2,14 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
+#include <optional>
 #include <string>
+#include <vector>
 
 #include "ZEL/sync_obj.h"
+#include "programs/common/question.h"
+#include "programs/common/run_result.h"
 #include "programs/common/task_settings.h"
 
 namespace zel_daemon {
@@ -13,6 +18,9 @@ struct TaskRecord : programs::TaskSettings {
     bool paused = false;  ///< started by nobody but a person
     /// Runs of the schedule up to this moment (seconds since the epoch) have been made or given up.
     int64_t checked_until = 0;
+    /// All shares were compared whole with their copies at this moment or later (seconds since the
+    /// epoch); 0: not yet.
+    int64_t compared = 0;
 
     bool IsRealtime() const { return Info().GetSchedule().GetMode() == ZEL::SCHD_MODE_REALTIME; }
 };
@@ -43,10 +51,24 @@ struct RunRecord {
     uint64_t rsync_runs = 0;  ///< copies made, without the server commands around them
 };
 
-/// The numbers of a run's stored changes, after its end.
+/// What a person is asked, by share.
+using Questions = std::map<std::string, programs::Question>;
+
+/// A move that the server has not been told of yet.
+struct StoredMove {
+    uint64_t id = 0;
+    programs::ShareMove move;
+};
+
+/// What a run leaves behind, beside its record.
 struct RunEnd {
-    std::vector<uint64_t> sent;    ///< the server has taken these
-    std::vector<uint64_t> unsent;  ///< and these not
+    std::vector<uint64_t> sent;        ///< numbers of the stored changes that the server has taken
+    std::vector<uint64_t> unsent;      ///< and of those that it has not
+    std::vector<uint64_t> moved = {};  ///< of the stored moves that it was told of
+    /// By share: what a person is to be asked from now on; nothing: no more. Of all other shares
+    /// it stays as it is.
+    std::map<std::string, std::optional<programs::Question>> questions = {};
+    std::map<std::string, uint64_t> files = {};  ///< of the shares' copies, where that has changed
 };
 
 }  // namespace zel_daemon

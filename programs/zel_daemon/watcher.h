@@ -49,12 +49,19 @@ struct WatchStats {
 class Watcher {
 public:
     /// `path` begins with "/", relative to the share's folder, and names the entry that changed,
-    /// appeared or went; "/" is the whole share.
+    /// appeared or went; "/" is the whole share. It ends in "/" when a folder went with all that
+    /// was below it, of which nothing else is told.
     using OnChange = std::function<void(const std::string& share, const std::string& path)>;
     using OnLoss = std::function<void(const std::string& share, const WatchLoss& loss)>;
+    /// What was at `from` is at `to` now: a change of both paths, which are not notified of
+    /// otherwise. `from` ends in "/" when it is a folder. All paths are those of the moment, as the
+    /// moves before have left them.
+    /// Two that have changed places at once are three moves, by way of a path where nothing was.
+    using OnMove = std::function<void(const std::string& share, const std::string& from,
+                                      const std::string& to)>;
 
-    /// Both are called from Work() alone, may call Add() and Remove(), and may not throw.
-    Watcher(OnChange on_change, OnLoss on_loss);
+    /// All are called from Work() alone, may call Add() and Remove(), and may not throw.
+    Watcher(OnChange on_change, OnMove on_move, OnLoss on_loss);
     ~Watcher();
     Watcher(const Watcher&) = delete;
     Watcher& operator=(const Watcher&) = delete;

@@ -9,6 +9,7 @@
 #include <ctime>
 #include <memory>
 
+#include "base/make_folder.h"
 #include "base/unique_fd.h"
 #include "base/whole_file.h"
 #include "programs/zel_server/server_config.h"
@@ -19,7 +20,7 @@ namespace {
 
 using base::UniqueFd;
 
-// Long after any client has taken its answer; a connection that died before leaves one behind.
+// Much later than any client fetches its answer. Connections that die before that leave one behind.
 constexpr time_t kStaleAfter = 600;
 
 struct FolderClose {
@@ -30,13 +31,24 @@ std::string FolderOf(const std::string& account) {
     return AnswerFolder() + "/" + account;
 }
 
-// A link named by the connection tells which answer is its own.
+// The daemon's user can open an answer whose name it knows, but cannot list, change or remove any.
+constexpr mode_t kAccountFolderMode = 0710;
+constexpr mode_t kAnswerMode = 0640;
+
+bool IsRoot() {
+    return geteuid() == 0;
+}
+
+// A link named after the connection, which points to that connection's answer.
 std::string LinkOf(const std::string& account, const std::string& connection) {
     return FolderOf(account) + "/." + connection;
 }
 
-bool MakeFolder(const std::string& path) {
-    return mkdir(path.c_str(), 0700) == 0 || errno == EEXIST;
+// Makes the folder of an account.
+bool MakeAccountFolder(const std::string& path) {
+    return base::MakeFolder(path, 0700) &&
+           (!IsRoot() || (lchown(path.c_str(), 0, kAnswerUser) == 0 &&
+                          chmod(path.c_str(), kAccountFolderMode) == 0));
 }
 
 void RemoveStale(const std::string& folder) {
@@ -54,7 +66,7 @@ void RemoveStale(const std::string& folder) {
 }  // namespace
 
 bool PrepareAnswers(const std::string& account) {
-    if (!MakeFolder(AnswerFolder()) || !MakeFolder(FolderOf(account))) {
+    if (!base::MakeFolder(AnswerFolder(), 0700) || !MakeAccountFolder(FolderOf(account))) {
         return false;
     }
     RemoveStale(FolderOf(account));
@@ -65,10 +77,12 @@ bool WriteAnswer(const std::string& account, const std::string& session,
                  const std::string& connection, const Answer& answer) {
     const std::string path = FolderOf(account) + "/" + session;
     const std::string content = "status=\"" + std::to_string(answer.status) + "\"\n" + answer.body;
-    // A session is used once: a file that is there already is somebody's mischief.
+    // A session is used only once: a file that already exists was planted by somebody.
     const UniqueFd file(
         open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0600));
-    return file && base::WriteAll(file.Get(), content) &&
+    const bool readable = file && (!IsRoot() || (fchown(file.Get(), 0, kAnswerUser) == 0 &&
+                                                 fchmod(file.Get(), kAnswerMode) == 0));
+    return readable && base::WriteAll(file.Get(), content) &&
            symlink(session.c_str(), LinkOf(account, connection).c_str()) == 0;
 }
 

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <string_view>
 
+#include "base/random_digits.h"
 #include "base/text.h"
 #include "programs/zel_server/names.h"
 #include "tarq/rsync_wrapper.h"
@@ -10,8 +11,6 @@
 namespace zel_server {
 
 namespace {
-
-constexpr size_t kSessionDigits = 32;
 
 struct KeyValue {
     std::string_view key;
@@ -32,7 +31,7 @@ bool IsValue(std::string_view value) {
     return true;
 }
 
-// Takes the next line off `rest`; nothing when it is not key="value".
+// Removes the next line from `rest`; nothing when it is not key="value".
 std::optional<KeyValue> NextLine(std::string_view& rest) {
     const size_t end = rest.find('\n');
     const std::string_view line = rest.substr(0, end);
@@ -52,8 +51,7 @@ std::optional<KeyValue> NextLine(std::string_view& rest) {
 
 std::optional<KeyValue> SessionLine(std::string_view& rest) {
     const std::optional<KeyValue> line = NextLine(rest);
-    if (!line || line->key != "session" || line->value.size() != kSessionDigits ||
-        line->value.find_first_not_of("0123456789abcdef") != std::string_view::npos) {
+    if (!line || line->key != "session" || !base::AreRandomDigits(line->value)) {
         return std::nullopt;
     }
     return line;

@@ -8,19 +8,29 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <ctime>
 #include <exception>
 #include <new>
 #include <vector>
 
 #include "ZEL/is_syncedshare.h"
 #include "ZEL/rsyncer.h"
+#include "base/random_digits.h"
 #include "base/text.h"
 #include "programs/common/server_status.h"
 #include "programs/common/text.h"
+#include "programs/zel_server/admission.h"
+#include "programs/zel_server/clients.h"
+#include "programs/zel_server/connections.h"
+#include "programs/zel_server/deposit_commands.h"
+#include "programs/zel_server/move_command.h"
 #include "programs/zel_server/names.h"
+#include "programs/zel_server/reading_commands.h"
 #include "programs/zel_server/registry.h"
+#include "programs/zel_server/request.h"
 #include "programs/zel_server/share_module.h"
+#include "programs/zel_server/share_push.h"
+#include "programs/zel_server/share_record.h"
+#include "programs/zel_server/tasks.h"
 #include "tarq/owners.h"
 
 namespace zel_server {
@@ -30,15 +40,6 @@ namespace {
 using namespace programs;
 
 constexpr char kProtocolVersion[] = "1\n";
-constexpr size_t kMaxShares = 256;
-
-struct Request {
-    const ServerConfig& config;
-    const std::string& account;
-    const Command& command;
-
-    const std::string& Client() const { return command.client_id; }
-};
 
 std::optional<bool> YesNo(const std::string* value) {
     if (value == nullptr || (*value != "yes" && *value != "no")) {
@@ -47,61 +48,9 @@ std::optional<bool> YesNo(const std::string* value) {
     return *value == "yes";
 }
 
-// Why `account` of `client` may not have the share; kDone when it may.
-int RefusalOf(const std::string& share, const std::string& client, const std::string& account) {
-    ShareState state;
-    const ReadResult read = ReadShare(share, state);
-    if (read == ReadResult::kFailed || read == ReadResult::kDamaged) {
-        return kRegistryRead;
-    }
-    if (!state.Owner().empty() && state.Owner() != client) {
-        return kConflicts;
-    }
-    return state.account.empty() || state.account == account ? kDone : kOtherAccount;
-}
-
-// Asks the registry which of `shares` other clients push into now, under names of any letter case.
-int AskRegistry(const std::vector<std::string>& shares, const std::string& client,
-                std::list<std::string>& refused) {
-    const TARQ::ListOwner asked(KAPICSzListAlloc(static_cast<int>(shares.size())));
-    TARQ::ListOwner answer(KAPICSzListAlloc(static_cast<int>(shares.size())));
-    if (!asked || !answer) {
-        return kNoMemory;
-    }
-    for (const std::string& share : shares) {
-        if (KAPICSzListPush(asked.get(), share.c_str()) != 0) {
-            return kNoMemory;
-        }
-    }
-    KAPICSzList list = answer.get();
-    const int status = ZELCheckIfSharePaired(asked.get(), client.c_str(), &list);
-    if (list != answer.get()) {
-        static_cast<void>(answer.release());
-        answer.reset(list);
-    }
-    for (int i = 0; i < KAPICSzListCount(list); ++i) {
-        refused.emplace_back(KAPICSzListGet(list, i));
-    }
-    return status;
-}
-
-// A client that was paired alone keeps its pairing when the server begins to serve several.
-int KeepSinglePairing(const std::string& new_client) {
-    const int single = ZELServerIfOldClientPaired();
-    if (single <= 0) {
-        return single == 0 ? kDone : kRegistryRead;
-    }
-    Section pairing;
-    if (ReadSection("PairedClientInfo", pairing) == ReadResult::kFailed) {
-        return kRegistryRead;
-    }
-    return pairing["clientID"] == new_client || zel_svr_reset_pair() == 0 ? kDone : kRegistryWrite;
-}
-
-Answer RecordPairing(const Request& request, const std::string& server_name) {
-    const int kept = KeepSinglePairing(request.Client());
-    return {kept != kDone ? kept
-                          : ZELServerUpdatePairInfo(request.Client().c_str(), server_name.c_str()),
+Answer Pair(const Request& request, const std::string& server_name, bool dry_run) {
+    return {dry_run ? PairingRefusal(request.Client(), request.account)
+                    : RecordPairing(request.Client(), request.account, server_name),
             ""};
 }
 
@@ -116,9 +65,10 @@ Answer PairSingleSource(const Request& request) {
     if (!dry_run || server_name == nullptr || !IsServerName(*server_name)) {
         return {kBadArgument, ""};
     }
-    return *dry_run ? Answer{kDone, ""} : RecordPairing(request, *server_name);
+    return Pair(request, *server_name, *dry_run);
 }
 
+// Refuses in advance what the start of a push would refuse.
 Answer PairMultiSource(const Request& request) {
     const std::optional<bool> dry_run = YesNo(request.command.Find("dryRun"));
     const std::optional<bool> encryption =
@@ -132,7 +82,7 @@ Answer PairMultiSource(const Request& request) {
     }
     std::vector<std::string> shares;
     ZEL::SplitStringByChars(*joined, ":", shares);
-    if (shares.size() > kMaxShares) {
+    if (shares.size() > kMaxAccountShares) {
         return {kBadArgument, ""};
     }
     for (const std::string& share : shares) {
@@ -143,130 +93,17 @@ Answer PairMultiSource(const Request& request) {
     if (*encryption && !request.config.encryption) {
         return {kNoEncryption, ""};
     }
-    std::list<std::string> running;
-    const int asked = AskRegistry(shares, request.Client(), running);
-    if (asked != kDone && asked != kConflicts) {
-        return {asked, ""};
+    const Refusal refusal = RefusalOf(shares, request.Client(), request.account);
+    std::string refused;
+    for (const std::string& share : refusal.shares) {
+        refused += (refused.empty() ? "" : ":") + share;
     }
-    std::string conflicts;
-    for (const std::string& share : shares) {
-        const int refusal = RefusalOf(share, request.Client(), request.account);
-        if (refusal == kRegistryRead) {
-            return {refusal, ""};
-        }
-        if (refusal != kDone || std::find(running.begin(), running.end(), share) != running.end()) {
-            conflicts += (conflicts.empty() ? "" : ":") + share;
-        }
+    if (refusal.status != kDone) {
+        // One status for all cases, whoever owns the share.
+        return {refusal.status == kOtherAccount ? kConflicts : refusal.status,
+                refused.empty() ? "" : refused + "\n"};
     }
-    if (!conflicts.empty()) {
-        return {kConflicts, conflicts + "\n"};
-    }
-    return *dry_run ? Answer{kDone, ""} : RecordPairing(request, *server_name);
-}
-
-// What a start command says of the share. Nothing when a value is missing or not what it must be.
-struct StartRequest {
-    std::string share;
-    std::string volume;
-    bool encrypted = false;
-};
-
-std::optional<StartRequest> ParseStart(const Command& command) {
-    const std::string* const share = command.Find("shareName");
-    const std::string* const volume = command.Find("volumeName");
-    if (share == nullptr || volume == nullptr || !IsShareName(*share) ||
-        !IsHarmlessVolumeName(*volume)) {
-        return std::nullopt;
-    }
-    for (const char* key : {"isEncrypt", "isAutomount", "isEnableACL", "isWinShare"}) {
-        const std::string* const value = command.Find(key);
-        if (value != nullptr && *value != "0" && *value != "1") {
-            return std::nullopt;
-        }
-    }
-    const std::string* const key_length = command.Find("lenEncKey");
-    if (key_length != nullptr && !base::ParseNumber(*key_length, 65536)) {
-        return std::nullopt;
-    }
-    const std::string* const encrypted = command.Find("isEncrypt");
-    return StartRequest{*share, *volume, encrypted != nullptr && *encrypted == "1"};
-}
-
-// Another share whose name the rsync daemon, or a file system that folds case, would take for this
-// one.
-bool IsNameTaken(const std::string& share, const std::vector<std::string>& sections) {
-    const std::string prefix = "SHARE_";
-    for (const std::string& section : sections) {
-        if (section.compare(0, prefix.size(), prefix) == 0) {
-            const std::string other = section.substr(prefix.size());
-            if (other != share && ModuleKey(other) == ModuleKey(share)) {
-                return true;
-            }
-        }
-    }
-    return false;
-}
-
-int RequirePaired(const std::string& client) {
-    switch (IsPaired(client)) {
-        case Paired::kYes:
-            return kDone;
-        case Paired::kNo:
-            return kNotPaired;
-        default:
-            return kRegistryRead;
-    }
-}
-
-Answer StartSync(const Request& request) {
-    const std::optional<StartRequest> start = ParseStart(request.command);
-    if (!start) {
-        return {kBadArgument, ""};
-    }
-    const std::string* const told_account = request.command.Find("connAccount");
-    if (told_account != nullptr && *told_account != request.account) {
-        return {kOtherAccount, ""};
-    }
-    if (start->encrypted && !request.config.encryption) {
-        return {kNoEncryption, ""};
-    }
-    const int paired = RequirePaired(request.Client());
-    const int refusal =
-        paired != kDone ? paired : RefusalOf(start->share, request.Client(), request.account);
-    if (refusal != kDone) {
-        return {refusal, ""};
-    }
-    std::list<std::string> running;
-    const int asked = AskRegistry({start->share}, request.Client(), running);
-    if (asked != kDone) {
-        return {asked, ""};
-    }
-    const auto sections = SectionNames();
-    if (!sections) {
-        return {kRegistryRead, ""};
-    }
-    if (IsNameTaken(start->share, *sections)) {
-        return {kNameTaken, ""};
-    }
-
-    ShareState state;
-    ReadShare(start->share, state);
-    state.module = start->encrypted ? "@" + start->share + "@" : start->share;
-    // A share stays where its copy is, whatever volume the client names today.
-    if (state.path.empty() || state.path.substr(state.path.rfind('/') + 1) != state.module) {
-        state.path = StorageFor(request.config, start->volume) + "/" + state.module;
-    }
-    if (CheckStorage(state.path.substr(0, state.path.rfind('/'))) != StorageState::kReady ||
-        !MakeShareFolder(request.config, state.path)) {
-        return {kStorage, ""};
-    }
-    state.running_id = request.Client();
-    state.account = request.account;
-    state.last_result.clear();
-    if (!WriteShare(start->share, state)) {
-        return {kRegistryWrite, ""};
-    }
-    return {WriteShareModule(request.config, start->share, state) ? kDone : kStorage, ""};
+    return Pair(request, *server_name, *dry_run);
 }
 
 Answer UpdateTaskStatus(const Request& request) {
@@ -274,34 +111,17 @@ Answer UpdateTaskStatus(const Request& request) {
     if (task == nullptr || !programs::IsTaskName(*task)) {
         return {kBadArgument, ""};
     }
-    const int paired = RequirePaired(request.Client());
+    const int paired = RequirePaired(request);
     if (paired != kDone) {
         return {paired, ""};
     }
-    return {WriteTaskStatus(*task, std::to_string(time(nullptr))) ? kDone : kRegistryWrite, ""};
-}
-
-Answer FinishShare(const Request& request, const std::string& share, bool completed) {
-    if (!IsShareName(share)) {
-        return {kBadArgument, ""};
+    // The share that the task is pushing now. Other shares of the client are not kept open, in case
+    // an earlier run died and left them open.
+    if (const std::string* const share = request.command.Find("shareName");
+        share != nullptr && IsShareName(*share)) {
+        KeepOpen(*share, request.Client(), request.account);
     }
-    ShareState state;
-    const ReadResult read = ReadShare(share, state);
-    if (read == ReadResult::kFailed || read == ReadResult::kDamaged) {
-        return {kRegistryRead, ""};
-    }
-    if (state.running_id != request.Client() || state.account != request.account) {
-        return {kNotRunning, ""};
-    }
-    if (completed) {
-        state.complete_id = state.running_id;
-        state.last_result = "0";
-    } else if (state.last_result.empty()) {
-        state.last_result = kEndedByClient;
-    }
-    state.last_time = std::to_string(time(nullptr));
-    state.running_id.clear();
-    return {WriteShare(share, state) ? kDone : kRegistryWrite, ""};
+    return {RecordTask(request.Client(), request.account, *task, true), ""};
 }
 
 Answer FinishSync(const Request& request) {
@@ -310,7 +130,7 @@ Answer FinishSync(const Request& request) {
     if (type == nullptr || name == nullptr) {
         return {kBadArgument, ""};
     }
-    const int paired = RequirePaired(request.Client());
+    const int paired = RequirePaired(request);
     if (paired != kDone) {
         return {paired, ""};
     }
@@ -318,20 +138,35 @@ Answer FinishSync(const Request& request) {
         return FinishShare(request, *name, *type == "share");
     }
     if (*type == "task" && programs::IsTaskName(*name)) {
-        return {WriteTaskStatus(*name, "idle") ? kDone : kRegistryWrite, ""};
+        return {RecordTask(request.Client(), request.account, *name, false), ""};
     }
     return {kBadArgument, ""};
 }
 
+constexpr char kStartCommand[] = "ZEL_SyncStart";
+
 struct CommandEntry {
     const char* name;
     Answer (*execute)(const Request&);
-    bool changes;  // takes the registry's lock
+    bool changes;                              // needs the registry's lock
+    void (*before)(const Request&) = nullptr;  // called without it
 };
 constexpr CommandEntry kCommands[] = {
-    {"ZEL_GetProtocolVer", TellProtocolVersion, false}, {"ZEL_Pairing", PairSingleSource, true},
-    {"ZEL_PairingMultiSrc", PairMultiSource, true},     {"ZEL_SyncStart", StartSync, true},
-    {"ZEL_UpdateTaskStatus", UpdateTaskStatus, true},   {"ZEL_SyncFinish", FinishSync, true},
+    {"ZEL_GetProtocolVer", TellProtocolVersion, false},
+    {"ZEL_Pairing", PairSingleSource, true},
+    {"ZEL_PairingMultiSrc", PairMultiSource, true},
+    {kStartCommand, StartSync, true, AwaitEarlierPushes},
+    {"ZEL_UpdateTaskStatus", UpdateTaskStatus, true},
+    {"ZEL_SyncFinish", FinishSync, true},
+    {"ZEL_Move", MoveInShare, true},
+    {"ZEL_OpenShare", OpenShare, true},
+    {"ZEL_DepositConfig", DepositConfig, true},
+    {"ZEL_ListDeposits", ListDeposits, false},
+    {"ZEL_FetchDeposit", FetchDeposit, false},
+    // These take the lock for a moment alone.
+    {"ZEL_OpenShareAt", OpenShareAt, false},
+    {"ZEL_CloseShareAt", CloseShareAt, false},
+    {"ZEL_ListVersions", ListShareVersions, false},
 };
 
 std::string Environment(const char* name) {
@@ -339,7 +174,7 @@ std::string Environment(const char* name) {
     return value != nullptr ? value : "";
 }
 
-// One byte more than a command may have tells a command that is too long.
+// Reads one byte more than a command may have, so that a longer one is detected.
 std::string ReadStandardInput() {
     std::string text(TARQ::Backup::kMaxCommandBytes + 1, '\0');
     size_t length = 0;
@@ -357,14 +192,34 @@ std::string ReadStandardInput() {
     return text;
 }
 
-// Whatever goes wrong on the way, the client is told by a status.
-Answer AnswerTo(const std::string& text, const std::string& account) {
+// Commands that change something have the registry to themselves. `before`: called without that.
+template <typename Step>
+Answer ExecuteLocked(const Request& request, Step step, void (*before)(const Request&)) {
+    if (before != nullptr) {
+        before(request);
+    }
+    const RegistryLock lock;
+    if (!lock.Held() || !TakeOverOldModules()) {
+        return {kRegistryWrite, ""};
+    }
+    CloseSilentModules();
+    return step(request);
+}
+
+int SwitchRefusal() {
+    const Switch on = ReadSwitch();
+    return on == Switch::kOn ? kDone : on == Switch::kOff ? kSwitchedOff : kRegistryRead;
+}
+
+// Every failure becomes a status for the client. `execute`: with the configuration and the command.
+template <typename Step>
+Answer AnswerTo(const std::string& text, const std::string& account, Step execute) {
     try {
         const std::optional<ServerConfig> config = LoadServerConfig();
         const std::optional<Command> command = ParseCommand(text);
         return !config    ? Answer{kStorage, ""}
                : !command ? Answer{kBadArgument, ""}
-                          : Execute(*config, account, *command);
+                          : execute(*config, *command);
     } catch (const std::bad_alloc&) {
         return {kNoMemory, ""};
     } catch (const std::exception& error) {
@@ -377,21 +232,47 @@ Answer AnswerTo(const std::string& text, const std::string& account) {
 }  // namespace
 
 Answer Execute(const ServerConfig& config, const std::string& account, const Command& command) {
-    const Switch on = ReadSwitch();
-    if (on != Switch::kOn) {
-        return {on == Switch::kOff ? kSwitchedOff : kRegistryRead, ""};
+    const int refusal = SwitchRefusal();
+    if (refusal != kDone) {
+        return {refusal, ""};
     }
     for (const CommandEntry& entry : kCommands) {
         if (command.name == entry.name) {
             const Request request{config, account, command};
-            if (!entry.changes) {
-                return entry.execute(request);
-            }
-            const RegistryLock lock;
-            return lock.Held() ? entry.execute(request) : Answer{kRegistryWrite, ""};
+            return entry.changes ? ExecuteLocked(request, entry.execute, entry.before)
+                                 : entry.execute(request);
         }
     }
     return {kUnknownCommand, ""};
+}
+
+int BeginPush() {
+    const std::string text = ReadStandardInput();
+    const std::string account = Environment("RSYNC_USER_NAME");
+    const std::string connection = Environment("RSYNC_PID");
+    if (!IsAccountName(account) || !base::ParseNumber(connection, INT32_MAX)) {
+        return 1;
+    }
+    // Left by a process of the same number.
+    if (unlink(LinkOfPush(connection).c_str()) != 0 && errno != ENOENT) {
+        return 1;
+    }
+    if (AdmitConnection() != Admission::kAdmitted) {
+        return 1;
+    }
+    const auto begin = [&](const ServerConfig& config, const Command& command) -> Answer {
+        const int refusal = command.name == kStartCommand ? SwitchRefusal() : kUnknownCommand;
+        if (refusal != kDone) {
+            return {refusal, ""};
+        }
+        return ExecuteLocked(
+            {config, account, command},
+            [&](const Request& request) -> Answer {
+                return {BeginInConnection(request, connection), ""};
+            },
+            AwaitEarlierPushes);
+    };
+    return AnswerTo(text, account, begin).status == kDone ? 0 : 1;
 }
 
 int HandleCommand() {
@@ -399,12 +280,20 @@ int HandleCommand() {
     const std::string account = Environment("RSYNC_USER_NAME");
     const std::string connection = Environment("RSYNC_PID");
     const std::optional<std::string> session = ParseSession(text);
-    if (!session || !IsAccountName(account) || !base::ParseNumber(connection, UINT32_MAX)) {
-        // Shown to the client by the daemon.
+    if (!session || !IsAccountName(account) || !base::ParseNumber(connection, INT32_MAX)) {
+        // The daemon shows this to the client.
         puts("This module takes commands of the synchronisation service only.");
         return 1;
     }
-    const Answer answer = AnswerTo(text, account);
+    const Admission admission = AdmitConnection();
+    if (admission == Admission::kNotServed) {
+        return 1;
+    }
+    const auto execute = [&account](const ServerConfig& config, const Command& command) {
+        return Execute(config, account, command);
+    };
+    const Answer answer = admission == Admission::kTooMany ? Answer{kTooManyConnections, ""}
+                                                           : AnswerTo(text, account, execute);
     if (!PrepareAnswers(account) || !WriteAnswer(account, *session, connection, answer)) {
         printf("The server cannot write its answer: %s\n", strerror(errno));
         return 1;

@@ -8,14 +8,14 @@
 #include <algorithm>
 #include <cerrno>
 #include <filesystem>
+#include <map>
 
-#include "base/text.h"
-#include "base/whole_file.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/accounts.h"
+#include "programs/zel_server/connections.h"
 #include "programs/zel_server/registry_repair.h"
-#include "programs/zel_server/serve.h"
-#include "programs/zel_server/share_module.h"
+#include "programs/zel_server/share_copy.h"
+#include "programs/zel_server/share_record.h"
 #include "tarq/core.h"
 #include "tarq/root_path.h"
 
@@ -27,42 +27,12 @@ namespace fs = std::filesystem;
 using programs::Count;
 using programs::Printable;
 
-// A push needs more than this for its own bookkeeping.
+// Space that a push needs for its own bookkeeping.
 constexpr uint64_t kFullBelow = 1048576;
-constexpr size_t kNamed = 3;  // so many are named before the rest is counted
-constexpr size_t kMaxPidFile = 64;
+constexpr size_t kNamed = 3;  // further names are only counted
 
 std::string InQuotes(const std::string& text) {
     return "'" + Printable(text) + "'";
-}
-
-// "'a', 'b', 'c' and 4 more".
-std::string Listed(const std::vector<std::string>& names) {
-    std::string text;
-    for (size_t i = 0; i < std::min(names.size(), kNamed); ++i) {
-        text += (i == 0 ? "" : ", ") + InQuotes(names[i]);
-    }
-    return names.size() <= kNamed
-               ? text
-               : text + " and " + std::to_string(names.size() - kNamed) + " more";
-}
-
-struct timespec ChangeOf(const std::string& path) {
-    struct stat info = {};
-    return stat(path.c_str(), &info) == 0 ? info.st_mtim : timespec{};
-}
-
-bool IsNewer(const struct timespec& a, const struct timespec& b) {
-    return a.tv_sec != b.tv_sec ? a.tv_sec > b.tv_sec : a.tv_nsec > b.tv_nsec;
-}
-
-std::optional<pid_t> PidInFile() {
-    if (KAPICProcAliveByPidFile(PidFile().c_str()) == 0) {
-        return std::nullopt;
-    }
-    const std::string text = base::ReadFile(PidFile(), kMaxPidFile).value_or("");
-    const auto pid = base::ParseNumber(text.substr(0, text.find('\n')), INT32_MAX);
-    return pid && IsOurDaemon(static_cast<pid_t>(*pid)) ? std::optional<pid_t>(*pid) : std::nullopt;
 }
 
 class Examination {
@@ -71,8 +41,8 @@ public:
 
     Health Run() {
         LookAtRegistry();
-        LookAtConfiguration();
         LookAtDaemon();
+        LookAtConfiguration();
         LookAtAccounts();
         for (const std::string& folder : config_.Folders()) {
             LookAtStorage(folder);
@@ -90,7 +60,7 @@ private:
         const auto damage = FindDamage();
         if (!damage) {
             health_.registry = "unreadable";
-            Found("the registry " + RegistryFile() + " or the folder " + ShareModules() +
+            Found("the registry " + RegistryFile() + " or the folder " + ShareRecords() +
                       " cannot be read: " + KAPICErrText(KAPICErrGet()),
                   geteuid() == 0 ? "if the file is no longer one, move it away and run "
                                    "'zel_server repair'"
@@ -122,67 +92,77 @@ private:
         health_.shares = shares_.size();
     }
 
-    // Without one of these the rsync daemon refuses everybody.
+    // Without these the daemon refuses every connection. The folder exists only while `serve` runs.
     void LookAtConfiguration() {
-        for (const std::string& path : {RsyncdConfig(), ShareModules(), AdminModules()}) {
+        for (const std::string& path : {RsyncdConfig(), OpenModules()}) {
             struct stat info = {};
-            if (stat(path.c_str(), &info) != 0 && errno == ENOENT) {
-                Found(path + ", which the rsync daemon reads, is not there",
-                      "zel_server setup, which makes it again");
+            if (stat(path.c_str(), &info) != 0 && errno == ENOENT &&
+                (path != OpenModules() || ServingProcess())) {
+                Found(path + " is not there", "zel_server setup, which makes it again");
             }
         }
     }
 
-    // The unit's state, what listens, and whether that is what is configured.
+    // Checks the units, what listens, and whether that is what is configured.
     void LookAtDaemon() {
         Health& now = health_;
         now.unit = AskUnit();
-        now.listeners = ListenersOn(config_.port);
+        now.listeners = Listeners(config_);
         now.other_holder = OtherHolder(config_, now.listeners);
-        now.daemon = PidInFile();
+        now.daemon = ServingProcess();
         for (const Listener& listener : now.listeners) {
-            if (!now.daemon && IsOurDaemon(listener.pid)) {
-                now.daemon = listener.pid;
+            if (!now.front && IsOurFront(listener.pid)) {
+                now.front = listener.pid;
             }
         }
-        // Whose sockets those are is not for everybody to see.
-        const bool blind = geteuid() != 0 && now.daemon && !now.listeners.empty();
-        now.listens = blind || ServesAll(config_, now.listeners);
-        now.configuration_newer =
-            now.daemon && IsNewer(ChangeOf(RsyncdConfig()), ChangeOf(PidFile()));
+        now.fingerprint = Fingerprint();
+        // Other users see neither the owners of these sockets nor what root's daemon answers.
+        const bool blind = geteuid() != 0 && now.unit.active == "active";
+        now.listens = blind || (now.daemon && ServesAll(config_, now.listeners));
+        now.configuration_newer = now.front && IsOutdated(config_, *now.front);
         const std::string restart = now.unit.managed ? "systemctl restart zel_rsyncd"
                                                      : "end it, and run 'zel_server serve'";
         if (!now.listens) {
             FoundSilent(restart);
         } else if (now.configuration_newer) {
-            Found("the rsync daemon runs with an older configuration", restart, false);
+            Found("the front runs with an older configuration", restart, false);
         }
         if (now.unit.managed && !now.unit.enabled && !now.unit.masked) {
-            Found("the rsync daemon will not start with the machine", "systemctl enable zel_rsyncd",
+            Found("the server will not start with the machine", "systemctl enable zel_rsyncd",
                   false);
         }
         if (now.unit.managed && now.listens && now.unit.active != "active") {
-            Found("the rsync daemon was started by hand, the unit zel_rsyncd is " + now.unit.active,
+            Found("the server was started by hand, the unit zel_rsyncd is " + now.unit.active,
                   "end process " + std::to_string(now.daemon.value_or(0)) +
                       ", then systemctl start zel_rsyncd",
                   false);
         }
+        if (config_.plain) {
+            Found("port " + std::to_string(config_.plain_port) +
+                      " serves the network without encryption: what travels there is unprotected",
+                  "when all clients use TLS: zel_server setup --no-plain", false);
+        }
     }
 
-    // Why nothing of ours answers where clients ask.
+    // Why the server does not answer where clients connect.
     void FoundSilent(const std::string& restart) {
         const Health& now = health_;
-        const std::string port = "port " + std::to_string(config_.port);
         if (now.unit.masked) {
             Found("the unit zel_rsyncd is masked",
                   "systemctl unmask zel_rsyncd, then systemctl enable --now zel_rsyncd");
         } else if (now.other_holder) {
-            Found(port + " is held by " + NameOf(*now.other_holder),
-                  "end that, or choose another --port with 'zel_server setup'");
+            Found("port " + std::to_string(now.other_holder->port) + " is held by " +
+                      NameOf(*now.other_holder),
+                  "end that, or choose another port with 'zel_server setup'");
+        } else if (now.daemon && now.front) {
+            Found("the front runs, but does not listen on all that is configured", restart);
         } else if (now.daemon) {
-            Found("the rsync daemon runs, but does not listen on all of " + port +
-                      " that is configured",
-                  restart);
+            Found("the front, HAProxy, is not running" +
+                      (now.unit.managed ? ": the unit zel_front is " + AskUnit(kFrontUnit).active
+                                        : std::string()),
+                  now.unit.managed ? "systemctl restart zel_rsyncd; journalctl -u zel_front says "
+                                     "why it ended"
+                                   : restart);
         } else if (now.unit.managed) {
             Found("the rsync daemon is not running: the unit zel_rsyncd is " + now.unit.active +
                       (now.unit.active == "failed" ? " (" + now.unit.result + ")" : ""),
@@ -194,18 +174,29 @@ private:
 
     void LookAtAccounts() {
         struct stat info = {};
-        const auto names = Accounts();
-        if (names) {
-            health_.accounts = names->size();
+        const auto accounts = Accounts();
+        const int error = errno;
+        std::vector<std::string> weak;
+        if (accounts) {
+            health_.accounts = 0;
+            for (const Account& account : *accounts) {
+                *health_.accounts += account.enabled ? 1 : 0;
+                if (account.enabled && account.weak) {
+                    weak.push_back(account.name);
+                }
+            }
         }
-        if (!names && errno == EACCES && geteuid() != 0) {
+        if (!accounts && error == EACCES && geteuid() != 0) {
             return;
         }
-        if (!names) {
+        if (!accounts) {
             Found("the accounts in " + SecretsFile() + " cannot be read",
                   "zel_server account list says why");
-        } else if (names->empty()) {
-            Found("no account may log in", "zel_server account add NAME");
+        } else if (*health_.accounts == 0) {
+            Found("no account may log in", accounts->empty()
+                                               ? "zel_server account add NAME"
+                                               : "zel_server account enable NAME; 'zel_server "
+                                                 "account list' shows those that are disabled");
         } else if (stat(SecretsFile().c_str(), &info) == 0 &&
                    ((info.st_mode & (S_IROTH | S_IWOTH)) != 0 ||
                     (geteuid() == 0 && info.st_uid != 0))) {
@@ -213,13 +204,19 @@ private:
                   "chmod 600 " + SecretsFile() + " && chown " +
                       (geteuid() == 0 ? "root" : std::to_string(geteuid())) + " " + SecretsFile());
         }
+        if (!weak.empty()) {
+            Found("the password of " + Listed(weak) + " is shorter than a new one may be",
+                  "zel_server account add NAME --reset makes another; at its client, 'zelctl task "
+                  "edit TASK --password'",
+                  false);
+        }
     }
 
     void LookAtStorage(const std::string& folder) {
         StorageHealth storage;
         storage.folder = folder;
-        storage.state = CheckStorage(folder);
-        // The daemon may what the one who asks may not.
+        storage.state = CheckStorage(config_, folder);
+        // The daemon may have access where the calling user has not.
         if (storage.state == StorageState::kNotPermitted && geteuid() != 0 &&
             !config_.user.empty()) {
             storage.state = StorageState::kReady;
@@ -257,6 +254,15 @@ private:
             case StorageState::kNotPermitted:
                 return Found(named + " may not be written by this user",
                              "look at its owner and mode: ls -ld " + storage.folder);
+            case StorageState::kOpen:
+                return Found(named + " " + WhyOpen(config_, storage.folder) +
+                                 ", so others could get at the copies; pushes are refused",
+                             "zel_server setup, which closes it, or says what to do");
+            case StorageState::kNoAttributes:
+                return Found(named +
+                                 " is on a file system that keeps no user attributes: owners "
+                                 "and special files would be lost",
+                             "mount it with user_xattr, or 'zel_server setup --no-attributes'");
             case StorageState::kReady:
                 break;
         }
@@ -268,7 +274,7 @@ private:
         }
     }
 
-    // Where the copies of known shares lie, and whether the daemon will be able to change them.
+    // Where the copies of known shares are, and whether the daemon will be able to change them.
     void LookAtCopies() {
         if (!config_.user.empty() && getpwnam(config_.user.c_str()) == nullptr) {
             Found("there is no user '" + config_.user + "', to whom the copies belong",
@@ -277,22 +283,46 @@ private:
         }
         std::vector<std::string> copies;
         std::vector<std::string> lost;
+        std::vector<std::string> other;
+        std::vector<std::string> open;
+        std::map<std::string, StorageState> folders;
         for (const std::string& share : shares_) {
             ShareState state;
-            struct stat info = {};
             if (ReadShare(share, state) != ReadResult::kRead || state.path.empty()) {
                 continue;
             }
             copies.push_back(state.path);
-            const std::string folder = state.path.substr(0, state.path.rfind('/'));
-            if (lstat(state.path.c_str(), &info) != 0 && errno == ENOENT &&
-                CheckStorage(folder) == StorageState::kReady) {
-                lost.push_back(share);
+            const std::string folder = FolderAbove(state.path);
+            auto known = folders.find(folder);
+            if (known == folders.end()) {
+                known = folders.emplace(folder, CheckStorage(config_, folder)).first;
+            }
+            const StorageState storage = known->second;
+            if (storage == StorageState::kOpen) {
+                open.push_back(share);
+            } else if (storage == StorageState::kReady) {
+                const CopyFolder copy = LookAtCopy(RecordedCopy(share), state.path);
+                if (copy == CopyFolder::kGone) {
+                    lost.push_back(share);
+                } else if (copy == CopyFolder::kAnother) {
+                    other.push_back(share);
+                }
             }
         }
         if (!lost.empty()) {
             Found("there is no copy of " + Listed(lost) + " any more: is another disk mounted?",
                   "nothing, if that is meant: the next push sends all of it", false);
+        }
+        if (!other.empty()) {
+            Found("the copy of " + Listed(other) +
+                      " is in another folder than it was: is another disk mounted there?",
+                  "nothing, if that is meant: the next push compares all of it", false);
+        }
+        if (!open.empty()) {
+            Found("the copy of " + Listed(open) +
+                      " lies where others could get at it; pushes into "
+                      "it are refused",
+                  "zel_server setup, which moves or closes it, or says what to do");
         }
         const std::vector<std::string> foreign = ForeignFolders(config_, copies);
         if (!foreign.empty()) {
@@ -316,21 +346,14 @@ Health Examine(const ServerConfig& config) {
     return Examination(config).Run();
 }
 
-std::optional<Listener> OtherHolder(const ServerConfig& config,
-                                    const std::vector<Listener>& listeners) {
-    for (const std::string& address : ServedAddresses(config)) {
-        const std::vector<std::string> numbers = NumericAddresses(address);
-        for (const Listener& listener : listeners) {
-            const bool same =
-                address.empty() || listener.IsEverywhere() ||
-                std::find(numbers.begin(), numbers.end(), listener.address) != numbers.end();
-            const bool seen = listener.pid != 0 || geteuid() == 0;
-            if (same && seen && !IsOurDaemon(listener.pid)) {
-                return listener;
-            }
-        }
+std::string Listed(const std::vector<std::string>& names) {
+    std::string text;
+    for (size_t i = 0; i < std::min(names.size(), kNamed); ++i) {
+        text += (i == 0 ? "" : ", ") + InQuotes(names[i]);
     }
-    return std::nullopt;
+    return names.size() <= kNamed
+               ? text
+               : text + " and " + std::to_string(names.size() - kNamed) + " more";
 }
 
 std::string NameOf(const Listener& listener) {
@@ -380,6 +403,10 @@ const char* Word(StorageState state) {
             return "read_only";
         case StorageState::kNotPermitted:
             return "not_permitted";
+        case StorageState::kOpen:
+            return "open";
+        case StorageState::kNoAttributes:
+            return "no_attributes";
     }
     return "";
 }

@@ -18,7 +18,7 @@ bool IsControl(char c) {
     return byte < 0x20 || byte == 0x7f;
 }
 
-// 1 to `max` bytes, none of them a control character or one of `refused`.
+// 1 to `max` bytes, without control characters and characters of `refused`.
 bool IsPlain(const std::string& text, size_t max, const char* refused) {
     if (text.empty() || text.size() > max || text.find_first_of(refused) != std::string::npos) {
         return false;
@@ -39,8 +39,10 @@ bool IsShareName(const std::string& name) {
         return false;
     }
     const std::string key = ModuleKey(name);
-    // A leading "@" marks the module of an encrypted share.
-    return key != ModuleKey(TARQ::Backup::kCommandModule) && key != "global" && name.front() != '@';
+    // A leading "@" marks the module of an encrypted share; "#" has a meaning in the daemon's
+    // configuration, and repeated blanks are merged into one.
+    return key != ModuleKey(TARQ::Backup::kCommandModule) && key != "global" &&
+           name.front() != '@' && name.front() != '#' && name.find("  ") == std::string::npos;
 }
 
 bool IsAccountName(const std::string& name) {
@@ -56,7 +58,7 @@ bool IsAccountName(const std::string& name) {
 }
 
 bool IsClientId(const std::string& id) {
-    if (!IsPlain(id, kMaxClientId, " \"'[]=/\\")) {
+    if (!IsPlain(id, kMaxClientId, " \"'[]=/\\") || id == kMultiSourceMarker) {
         return false;
     }
     for (const char c : id) {
@@ -75,7 +77,7 @@ bool IsHarmlessVolumeName(const std::string& name) {
     if (name.empty()) {
         return true;
     }
-    // Every step between slashes must be an ordinary name.
+    // Each component between slashes must be an ordinary name.
     return IsPlain(name, kMaxVolumeName, "\"") && name.front() != '.' &&
            name.find("/.") == std::string::npos;
 }

@@ -26,14 +26,14 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr unsigned int kListening = 0x0a;  // TCP_LISTEN, as the kernel's tables have it
+constexpr unsigned int kListening = 0x0a;  // TCP_LISTEN in the kernel's tables
 
 struct AddressesFree {
     void operator()(addrinfo* list) const { freeaddrinfo(list); }
 };
 using Addresses = std::unique_ptr<addrinfo, AddressesFree>;
 
-// What a daemon that is told to listen there would bind to.
+// The addresses that a daemon would bind to if it were configured with this one.
 Addresses Resolve(const std::string& address, int port) {
     addrinfo hints = {};
     hints.ai_flags = AI_PASSIVE;
@@ -49,8 +49,8 @@ std::string Numeric(int family, const void* address) {
     return inet_ntop(family, address, text, sizeof text) != nullptr ? text : "";
 }
 
-// An address in the kernel's tables: words of 32 bits in hexadecimal digits, each as it lies in
-// memory.
+// Converts an address of the kernel's tables: 32-bit words in hexadecimal, in the byte order of the
+// machine.
 std::string NumericFromTable(const std::string& digits) {
     uint32_t words[4] = {};
     const size_t count = digits.size() / 8;
@@ -82,7 +82,7 @@ void ReadTable(const char* table, int port, std::vector<Socket>& sockets) {
     }
 }
 
-// Calls `take` with the pid of each process that has a descriptor of a socket of these, and its
+// Calls `take` for each process that has one of these sockets open, with its pid and the socket's
 // inode.
 template <typename Take>
 void ForEachHolder(const Take& take) {
@@ -118,7 +118,7 @@ std::vector<Listener> ListenersOn(int port) {
     std::vector<Socket> sockets;
     ReadTable("/proc/net/tcp", port, sockets);
     ReadTable("/proc/net/tcp6", port, sockets);
-    std::map<unsigned long long, pid_t> holders;  // the oldest, where there are several
+    std::map<unsigned long long, pid_t> holders;  // the oldest where several share one
     for (const Socket& socket : sockets) {
         holders[socket.inode] = 0;
     }
@@ -133,7 +133,7 @@ std::vector<Listener> ListenersOn(int port) {
     std::vector<Listener> listeners;
     for (const Socket& socket : sockets) {
         const pid_t pid = holders[socket.inode];
-        listeners.push_back({socket.address, pid, pid == 0 ? "" : ProgramOf(pid)});
+        listeners.push_back({socket.address, port, pid, pid == 0 ? "" : ProgramOf(pid)});
     }
     return listeners;
 }
@@ -161,7 +161,7 @@ int TryToListen(const std::string& address, int port) {
         const base::UniqueFd fd(
             socket(entry->ai_family, entry->ai_socktype | SOCK_CLOEXEC, entry->ai_protocol));
         if (!fd) {
-            continue;  // a machine without that kind of network
+            continue;  // IPv4 or IPv6 is not available
         }
         const int on = 1;
         setsockopt(fd.Get(), SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);

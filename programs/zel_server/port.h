@@ -1,4 +1,4 @@
-// The port that the rsync daemon listens on, as the kernel sees it.
+// The ports that the server listens on, as the kernel sees them.
 #pragma once
 
 #include <sys/types.h>
@@ -8,11 +8,12 @@
 
 namespace zel_server {
 
-/// A socket that listens, and the process that holds it.
+/// A listening socket, and the process that owns it.
 struct Listener {
     std::string address;  ///< numeric; "0.0.0.0" and "::" are all addresses
-    pid_t pid = 0;        ///< 0: it cannot be seen, being another user's
-    std::string program;  ///< its name
+    int port = 0;
+    pid_t pid = 0;        ///< 0: unknown, as it belongs to another user
+    std::string program;  ///< name of the process
 
     bool IsEverywhere() const { return address == "0.0.0.0" || address == "::"; }
 };
@@ -20,12 +21,12 @@ struct Listener {
 /// Who listens on a TCP port of this machine.
 std::vector<Listener> ListenersOn(int port);
 
-/// `address` (a name, a number; empty: everywhere) as numbers. Empty when nothing of the kind is
-/// known.
+/// The numeric addresses of `address` (a name or a number; empty: all). Empty when it cannot be
+/// resolved.
 std::vector<std::string> NumericAddresses(const std::string& address);
 
-/// Whether the port of that address, of all addresses when it is empty, can be listened on: 0, or
-/// the errno of the first address that cannot.
+/// Tests whether a server could listen on that port of the address (empty: of all addresses).
+/// Returns 0, or the errno of the first address that fails.
 int TryToListen(const std::string& address, int port);
 
 }  // namespace zel_server

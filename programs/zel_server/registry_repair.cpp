@@ -7,7 +7,7 @@
 #include "base/whole_file.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/registry.h"
-#include "programs/zel_server/share_module.h"
+#include "programs/zel_server/share_record.h"
 
 namespace zel_server {
 
@@ -21,16 +21,16 @@ bool KeepDamagedCopy() {
 }
 
 bool PutBack(const std::string& share) {
-    const auto module = ReadShareModule(share);
-    if (!module || !module->names_owner) {
+    const auto record = ReadShareRecord(share);
+    if (!record || !record->names_owner) {
         return false;
     }
     ShareState state;
-    // It belongs to the client whose push was the last to be known, complete or not.
-    state.complete_id = module->client;
-    state.account = module->account;
-    state.module = module->module;
-    state.path = module->path;
+    // The owner is the client of the last known push, complete or not.
+    state.complete_id = record->client;
+    state.account = record->account;
+    state.module = record->module;
+    state.path = record->path;
     state.last_result = kMended;
     return WriteShare(share, state);
 }
@@ -39,8 +39,8 @@ bool PutBack(const std::string& share) {
 
 std::optional<std::vector<std::string>> KnownShares() {
     const auto sections = SectionNames();
-    const auto modules = SharesWithModule();
-    if (!sections || !modules) {
+    const auto recorded = RecordedShares();
+    if (!sections || !recorded) {
         return std::nullopt;
     }
     std::vector<std::string> shares;
@@ -52,7 +52,7 @@ std::optional<std::vector<std::string>> KnownShares() {
             shares.push_back(section.substr(prefix.size()));
         }
     }
-    for (const std::string& share : *modules) {
+    for (const std::string& share : *recorded) {
         if (seen.insert(share).second) {
             shares.push_back(share);
         }
@@ -73,8 +73,8 @@ std::optional<RegistryDamage> FindDamage() {
             case ReadResult::kFailed:
                 return std::nullopt;
             case ReadResult::kDamaged: {
-                const auto module = ReadShareModule(share);
-                (module && module->names_owner ? damage.shares : damage.ownerless).push_back(share);
+                const auto record = ReadShareRecord(share);
+                (record && record->names_owner ? damage.shares : damage.ownerless).push_back(share);
                 break;
             }
             default:

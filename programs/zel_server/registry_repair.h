@@ -1,4 +1,4 @@
-// A registry that has lost something: what that is, and putting it back.
+// Finds what a damaged registry has lost, and restores it.
 #pragma once
 
 #include <optional>
@@ -9,25 +9,25 @@
 
 namespace zel_server {
 
-/// All shares that the registry names, in its order, and then those that only have a module.
-/// Nothing when either cannot be read.
+/// All shares of the registry, in its order, followed by those that only have a record. Nothing
+/// when either cannot be read.
 std::optional<std::vector<std::string>> KnownShares();
 
 struct RegistryDamage {
-    bool switch_lost = false;            ///< nobody is let in
-    std::vector<std::string> shares;     ///< lost; their modules name whom they belong to
-    std::vector<std::string> ownerless;  ///< lost, and nothing names whom they belong to
+    bool switch_lost = false;            ///< nobody is admitted
+    std::vector<std::string> shares;     ///< lost; their records name the owners
+    std::vector<std::string> ownerless;  ///< lost, and the owner is not known
 
     bool None() const { return !switch_lost && shares.empty() && ownerless.empty(); }
 };
 
-/// Nothing when the registry or the folder of the modules cannot be read.
+/// Nothing when the registry or the folder of the records cannot be read.
 std::optional<RegistryDamage> FindDamage();
 
-/// Puts back what can be known: of each of `damage.shares` its owner, module and folder, and the
-/// switch as the admin last turned it. An owner that nothing names is never made up: such a share
-/// stays closed until it is released. The damaged file is kept at DamagedCopy(). Under the
-/// registry's lock; false, with errno set, when something cannot be written.
+/// Restores what is known: the owner, module and folder of each of `damage.shares`, and the switch
+/// as the admin last set it. An unknown owner is never guessed: such a share stays closed until it
+/// is released. A copy of the damaged file is kept at DamagedCopy(). Called with the registry's
+/// lock held; false, with errno set, when something cannot be written.
 bool MendRegistry(const RegistryDamage& damage, const ServerConfig& config);
 
 /// Where the damaged file is kept.

@@ -1,135 +1,148 @@
 #include "programs/zel_server/serve.h"
 
-#include <sys/prctl.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <csignal>
 #include <cstdio>
-#include <cstring>
+#include <cstdlib>
+#include <string>
 
 #include "base/child_process.h"
-#include "base/whole_file.h"
+#include "base/file_lock.h"
 #include "programs/common/failure.h"
-#include "programs/common/text.h"
+#include "programs/zel_server/acceptor.h"
+#include "programs/zel_server/front.h"
+#include "programs/zel_server/registry.h"
 #include "programs/zel_server/rsyncd_config.h"
+#include "programs/zel_server/share_record.h"
+#include "programs/zel_server/take_storage.h"
 
 namespace zel_server {
 
 namespace {
 
-constexpr char kLoopback[] = "127.0.0.1";
-constexpr size_t kMaxCommandLine = 4096;
+using programs::Failure;
+using programs::SystemFailure;
 
-// The daemon's configuration names one address and one pid file: the second daemon has its own.
-std::vector<std::string> DaemonCommand(const std::string& address, bool first) {
-    std::vector<std::string> command = {"rsync", "--daemon", "--no-detach",
-                                        "--config=" + RsyncdConfig()};
-    if (!first) {
-        command.push_back("--address=" + address);
-        command.push_back("--dparam=pidfile=" + AnswerFolder() + "/.second.pid");
+// Files that the daemon writes are readable by its own user and group only.
+constexpr mode_t kUmask = 0027;
+
+// Creates a folder, or corrects its owner, its group and its mode.
+void HaveFolder(const std::string& path, mode_t mode, gid_t group) {
+    struct stat info = {};
+    if (mkdir(path.c_str(), 0700) != 0 && errno != EEXIST) {
+        throw SystemFailure("cannot make " + path);
     }
-    return command;
+    if (lstat(path.c_str(), &info) != 0 || !S_ISDIR(info.st_mode) || info.st_uid != geteuid()) {
+        throw Failure(path + " is not this user's own folder: remove it");
+    }
+    if (chown(path.c_str(), geteuid(), group) != 0 || chmod(path.c_str(), mode) != 0) {
+        throw SystemFailure("cannot set owner and mode of " + path);
+    }
 }
 
-// Becomes the daemon; comes back, with errno set, only when it cannot.
-void Become(const std::vector<std::string>& command) {
+// Takes the lock that only one server per configuration can hold, until the process ends. Throws
+// Failure when another one runs.
+base::FileLock TakeTurn() {
+    base::FileLock lock(AnswerFolder() + "/.serving", std::chrono::milliseconds(0));
+    if (!lock) {
+        throw Failure(errno == EWOULDBLOCK
+                          ? "this server is served already: 'zel_server status' says by which "
+                            "process"
+                          : lock.Problem());
+    }
+    return lock;
+}
+
+pid_t StartFront(const ServerConfig& config) {
+    const std::vector<std::string> command = PrepareFront(config);
     const std::vector<char*> arguments = base::ArgumentVector(command);
-    execvp(arguments[0], arguments.data());
-}
-
-// The daemon ends with this process, however that ends.
-pid_t StartDaemon(const std::vector<std::string>& command) {
     const pid_t parent = getpid();
     const pid_t child = fork();
-    if (child != 0) {
-        return child;
+    if (child < 0) {
+        throw SystemFailure("cannot start the front");
     }
-    if (prctl(PR_SET_PDEATHSIG, SIGTERM) == 0 && getppid() == parent) {
-        Become(command);
-        perror("zel_server: rsync cannot be run");
+    if (child == 0) {
+        base::ResetSignals();
+        // The front receives SIGTERM when this process ends for whatever reason.
+        if (base::EndWithParent(parent)) {
+            execv(arguments[0], arguments.data());
+            perror("zel_server: haproxy cannot be run");
+        }
+        _exit(127);
     }
-    _exit(127);
+    return child;
 }
 
-[[noreturn]] void WaitForFirstEnd(const std::vector<pid_t>& daemons) {
-    int status = 0;
-    pid_t ended = 0;
-    do {
-        ended = waitpid(-1, &status, 0);
-    } while (ended < 0 && errno == EINTR);
-    for (const pid_t daemon : daemons) {
-        if (daemon != ended) {
-            kill(daemon, SIGTERM);
-            waitpid(daemon, nullptr, 0);
-        }
+// Acceptor reads these signals from a signalfd.
+void BlockSignals() {
+    sigset_t signals;
+    sigemptyset(&signals);
+    for (const int number : {SIGCHLD, SIGTERM, SIGINT}) {
+        sigaddset(&signals, number);
     }
-    // Nobody has told this process to end: that is a failure whatever the daemon says.
-    throw programs::Failure("the rsync daemon has ended" +
-                            (WIFSIGNALED(status)
-                                 ? " by signal " + std::to_string(WTERMSIG(status))
-                                 : " with status " + std::to_string(WEXITSTATUS(status))));
+    sigprocmask(SIG_BLOCK, &signals, nullptr);
+    signal(SIGPIPE, SIG_IGN);
+}
+
+// Migrates the module files of earlier versions. Their folder is removed later, once rsyncd.conf no
+// longer refers to it.
+void TakeOverShares() {
+    const RegistryLock lock;
+    if (!lock.Held() || !TakeOverOldModules()) {
+        throw SystemFailure("cannot write the records of shares in " + ShareRecords());
+    }
 }
 
 }  // namespace
 
-std::vector<std::string> ServedAddresses(const ServerConfig& config) {
-    std::vector<std::string> served = {config.address};
-    const std::vector<std::string> numbers = NumericAddresses(config.address);
-    const auto has = [&](const char* number) {
-        return std::find(numbers.begin(), numbers.end(), number) != numbers.end();
-    };
-    if (!has("0.0.0.0") && !has(kLoopback)) {
-        served.emplace_back(kLoopback);
+void Serve(bool with_front) {
+    // Reported as kUsage, so that the service manager does not restart it in vain.
+    ServerConfig config = RequireServerConfig(programs::FailureKind::kUsage);
+    RequireClosedStorage(config);
+    const uid_t front_user = FrontUser();
+    umask(kUmask);
+    HaveFolder(AnswerFolder(), 0700, getegid());
+    HaveFolder(OpenModules(), 0700, getegid());
+    HaveFolder(FrontFolder(), 0750, FrontGroup());
+    const base::FileLock turn = TakeTurn();
+    TakeOverShares();
+    if (!WriteRsyncdConfig(config)) {
+        throw SystemFailure("cannot write the configuration in " + ConfigFolder());
     }
-    return served;
+    rmdir(OldShareModules().c_str());
+    // rsync treats module names as equal when they differ only in letter case or blanks, by the
+    // rules of the locale. A fixed locale keeps ModuleKey() in agreement with it.
+    setenv("LC_ALL", "C", 1);
+    BlockSignals();
+    Acceptor acceptor(front_user);
+    const pid_t front = with_front ? StartFront(config) : 0;
+    sd_notify(0, "READY=1");
+    const std::optional<int> status = acceptor.Run(front);
+    sd_notify(0, "STOPPING=1");
+    if (status) {
+        throw Failure("the front has ended " +
+                      (WIFSIGNALED(*status)
+                           ? "by signal " + std::to_string(WTERMSIG(*status))
+                           : "with status " + std::to_string(WEXITSTATUS(*status))));
+    }
+    if (front != 0) {
+        kill(front, SIGTERM);
+        waitpid(front, nullptr, 0);
+    }
 }
 
-bool IsOurDaemon(pid_t pid) {
-    const auto words = base::ReadFile("/proc/" + std::to_string(pid) + "/cmdline", kMaxCommandLine);
-    if (!words) {
-        return false;
-    }
-    // As one word, or as two.
-    const std::string file = RsyncdConfig() + '\0';
-    return words->find('\0' + ("--config=" + file)) != std::string::npos ||
-           words->find('\0' + (("--config" + std::string(1, '\0')) + file)) != std::string::npos;
-}
-
-bool ServesAll(const ServerConfig& config, const std::vector<Listener>& listeners) {
-    for (const std::string& address : ServedAddresses(config)) {
-        const std::vector<std::string> numbers = NumericAddresses(address);
-        const bool served =
-            std::any_of(listeners.begin(), listeners.end(), [&](const Listener& listener) {
-                return IsOurDaemon(listener.pid) &&
-                       std::find(numbers.begin(), numbers.end(), listener.address) != numbers.end();
-            });
-        if (!served) {
-            return false;
-        }
-    }
-    return true;
-}
-
-void Serve() {
-    // Of another kind: starting it again does not help.
-    const ServerConfig config = RequireServerConfig(programs::FailureKind::kUsage);
-    const std::vector<std::string> addresses = ServedAddresses(config);
-    if (addresses.size() == 1) {
-        Become(DaemonCommand(addresses[0], true));
-        throw programs::SystemFailure("rsync cannot be run");
-    }
-    std::vector<pid_t> daemons;
-    for (const std::string& address : addresses) {
-        const pid_t daemon = StartDaemon(DaemonCommand(address, daemons.empty()));
-        if (daemon < 0) {
-            throw programs::SystemFailure("cannot start the rsync daemon");
-        }
-        daemons.push_back(daemon);
-    }
-    WaitForFirstEnd(daemons);
+void RunFront() {
+    const std::vector<std::string> command =
+        PrepareFront(RequireServerConfig(programs::FailureKind::kUsage));
+    const std::vector<char*> arguments = base::ArgumentVector(command);
+    execv(arguments[0], arguments.data());
+    throw SystemFailure("cannot run " + command[0]);
 }
 
 }  // namespace zel_server

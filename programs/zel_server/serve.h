@@ -1,27 +1,14 @@
-// Where the rsync daemon listens, and running it.
+// The long-running processes of the server.
 #pragma once
-
-#include <string>
-#include <vector>
-
-#include "programs/zel_server/port.h"
-#include "programs/zel_server/server_config.h"
 
 namespace zel_server {
 
-/// The addresses that the daemon listens on; an empty one is all of them. One that was chosen has
-/// the loopback address beside it: clients that come through ssh arrive there.
-std::vector<std::string> ServedAddresses(const ServerConfig& config);
+/// `zel_server serve`: rewrites the rsync daemon's configuration from the server's own, and serves
+/// connections until SIGTERM or SIGINT. `with_front`: runs the front as a child process, and fails
+/// when that ends; otherwise the front has a unit of its own. Throws Failure.
+void Serve(bool with_front);
 
-/// Whether the process is a daemon of this server.
-bool IsOurDaemon(pid_t pid);
-
-/// Whether daemons of this server listen on all addresses that are to be served. `listeners`: those
-/// of the port.
-bool ServesAll(const ServerConfig& config, const std::vector<Listener>& listeners);
-
-/// `zel_server serve`: runs the rsync daemon in the foreground, two where two addresses are served
-/// (stock rsync listens on one), until one has ended, which is a failure: it ends the other then.
-void Serve();
+/// `zel_server front`: replaces this process by the front. Throws Failure when it cannot.
+void RunFront();
 
 }  // namespace zel_server

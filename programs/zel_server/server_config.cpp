@@ -1,10 +1,6 @@
 #include "programs/zel_server/server_config.h"
 
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
-#include <cerrno>
 
 #include "base/rsync_config.h"
 #include "base/text.h"
@@ -19,12 +15,13 @@ namespace zel_server {
 namespace {
 
 constexpr char kServerSection[] = "server";
+constexpr int kUnprivileged = 8000;  // added to the usual ports below a root folder
 constexpr char kVolumesSection[] = "volumes";
-constexpr char kDisksSection[] = "disks";  // folder to mount path, as they were at set-up
+constexpr char kDisksSection[] = "disks";  // folder to mount path, recorded at set-up
 
 using Entries = std::map<std::string, std::string>;
 
-// None without a section.
+// Empty when there is no such section.
 Entries GetSection(const char* section) {
     const TARQ::HashOwner values(KAPICSzHashAlloc(16));
     const bool read =
@@ -55,6 +52,13 @@ std::vector<std::string> ServerConfig::Folders() const {
     return folders;
 }
 
+int UsualTlsPort() {
+    return TARQ::RootFolder().empty() ? base::kRsyncTlsPort : kUnprivileged + base::kRsyncTlsPort;
+}
+int UsualPlainPort() {
+    return TARQ::RootFolder().empty() ? base::kRsyncPort : kUnprivileged + base::kRsyncPort;
+}
+
 std::string ConfigFolder() {
     return TARQ::RootPath("/usr/tarq/etc/zel_server");
 }
@@ -64,11 +68,12 @@ std::string ConfigFile() {
 std::string RsyncdConfig() {
     return ConfigFolder() + "/rsyncd.conf";
 }
-std::string ShareModules() {
-    return ConfigFolder() + "/shares.d";
+std::string DepositFolder() {
+    return ConfigFolder() + "/deposits";
 }
-std::string AdminModules() {
-    return ConfigFolder() + "/admin.d";
+
+std::string ShareRecords() {
+    return ConfigFolder() + "/shares";
 }
 std::string SecretsFile() {
     return ConfigFolder() + "/rsyncd.secrets";
@@ -76,8 +81,24 @@ std::string SecretsFile() {
 std::string AnswerFolder() {
     return TARQ::RootPath("/var/run/zel_server");
 }
-std::string PidFile() {
-    return TARQ::RootPath("/var/run/rsyncd.pid");
+std::string OpenModules() {
+    return AnswerFolder() + "/.open";  // no account name begins with a dot
+}
+
+std::string PushLinks() {
+    return AnswerFolder() + "/.pushes";
+}
+std::string FrontConfig() {
+    return ConfigFolder() + "/front.cfg";
+}
+std::string FrontKey() {
+    return ConfigFolder() + "/front.pem";
+}
+std::string FrontFolder() {
+    return TARQ::RootPath("/var/run/zel_front");
+}
+std::string RsyncdLog() {
+    return TARQ::RootPath("/var/log/rsyncd.log");
 }
 std::string RegistryFile() {
     return TARQ::RootPath("/usr/tarq/etc/tarqZEL.info");
@@ -85,21 +106,36 @@ std::string RegistryFile() {
 std::string LockFile() {
     return ConfigFolder() + "/lock";
 }
+std::string OldShareModules() {
+    return ConfigFolder() + "/shares.d";
+}
+std::string OldAdminModules() {
+    return ConfigFolder() + "/admin.d";
+}
 
 std::optional<ServerConfig> LoadServerConfig() {
     Entries values = GetSection(kServerSection);
     ServerConfig config;
-    const auto port = base::ParseNumber(values["port"], base::kMaxPort);
+    const auto plain_port = base::ParseNumber(values["port"], base::kMaxPort);
+    // A server that was set up before TLS was supported stays as it was until its admin changes it.
+    const bool is_old = values["tls_port"].empty();
+    const auto tls_port = base::ParseNumber(
+        is_old ? std::to_string(UsualTlsPort()) : values["tls_port"], base::kMaxPort);
+    config.plain = is_old || values["plain"] == "yes";
     config.address = values["address"];
     config.storage = values["storage"];
     config.encryption = values["encryption"] != "no";
+    config.closed = values["closed"] == "yes";
+    config.without_attributes = values["without_attributes"] == "yes";
     config.user = values["user"];
     config.program = values["program"];
     config.switched_off = values["switch"] == "off";
-    if (!port || *port == 0 || config.storage.empty() || config.program.empty()) {
+    if (plain_port.value_or(0) == 0 || tls_port.value_or(0) == 0 || config.storage.empty() ||
+        config.program.empty()) {
         return std::nullopt;
     }
-    config.port = static_cast<int>(*port);
+    config.plain_port = static_cast<int>(*plain_port);
+    config.tls_port = static_cast<int>(*tls_port);
     config.volumes = GetSection(kVolumesSection);
     return config;
 }
@@ -113,13 +149,18 @@ ServerConfig RequireServerConfig(programs::FailureKind otherwise) {
 }
 
 bool SaveServerConfig(const ServerConfig& config) {
-    return SetSection(kServerSection, {{"port", std::to_string(config.port)},
-                                       {"address", config.address},
-                                       {"storage", config.storage},
-                                       {"encryption", config.encryption ? "yes" : "no"},
-                                       {"user", config.user},
-                                       {"program", config.program},
-                                       {"switch", config.switched_off ? "off" : "on"}}) &&
+    return SetSection(kServerSection,
+                      {{"port", std::to_string(config.plain_port)},
+                       {"tls_port", std::to_string(config.tls_port)},
+                       {"plain", config.plain ? "yes" : "no"},
+                       {"address", config.address},
+                       {"storage", config.storage},
+                       {"encryption", config.encryption ? "yes" : "no"},
+                       {"closed", config.closed ? "yes" : "no"},
+                       {"without_attributes", config.without_attributes ? "yes" : "no"},
+                       {"user", config.user},
+                       {"program", config.program},
+                       {"switch", config.switched_off ? "off" : "on"}}) &&
            SetSection(kVolumesSection, config.volumes);
 }
 
@@ -128,24 +169,9 @@ std::string StorageFor(const ServerConfig& config, const std::string& volume_nam
     return volume != config.volumes.end() ? volume->second : config.storage;
 }
 
-StorageState CheckStorage(const std::string& folder) {
-    struct stat info = {};
-    if (stat(folder.c_str(), &info) != 0) {
-        return errno == EACCES ? StorageState::kNotPermitted : StorageState::kAbsent;
-    }
-    // A storage disk that is not mounted leaves an empty folder on another disk: nothing may be put
-    // there.
+bool IsOnRecordedDisk(const std::string& folder) {
     const std::string disk = RecordedDiskOf(folder);
-    if (disk.empty() || disk != MountPathOf(folder)) {
-        return StorageState::kOtherDisk;
-    }
-    if (!S_ISDIR(info.st_mode)) {
-        return StorageState::kAbsent;
-    }
-    if (access(folder.c_str(), W_OK | X_OK) == 0) {
-        return StorageState::kReady;
-    }
-    return errno == EROFS ? StorageState::kReadOnly : StorageState::kNotPermitted;
+    return !disk.empty() && disk == MountPathOf(folder);
 }
 
 std::string RecordedDiskOf(const std::string& folder) {

@@ -1,4 +1,4 @@
-// What `zel_server setup` has decided, kept in the section file
+// The choices made by `zel_server setup`, stored in the section file
 // /usr/tarq/etc/zel_server/server.conf.
 #pragma once
 
@@ -12,51 +12,67 @@
 namespace zel_server {
 
 struct ServerConfig {
-    int port = 0;         ///< the rsync daemon's
-    std::string address;  ///< it listens there; empty: everywhere
+    int tls_port = 0;     ///< with TLS, for the network
+    int plain_port = 0;   ///< without TLS: for this machine, where ssh tunnels end
+    bool plain = false;   ///< the port without TLS also serves the network
+    std::string address;  ///< to listen on; empty: all addresses of this machine
     std::string storage;  ///< folder that receives the shares
     std::map<std::string, std::string>
-        volumes;             ///< further folders, by the volume name that a client tells
+        volumes;             ///< additional folders, by the client's volume name
     bool encryption = true;  ///< encrypted shares are accepted
-    std::string user;        ///< system user that owns the copies; empty: who runs the daemon
-    std::string program;     ///< path of zel_server, for the daemon's exec lines
+    bool closed = false;     ///< storage was once closed to others; earlier versions did not
+    bool without_attributes =
+        false;            ///< accept storage without extended attributes for owners and modes
+    std::string user;     ///< system user that owns the copies; empty: whoever runs the daemon
+    std::string program;  ///< path of zel_server, for the daemon's exec lines
     bool switched_off =
-        false;  ///< the registry's switch as the admin last turned it, should that be lost
+        false;  ///< the admin's last setting of the switch, in case the registry is lost
 
-    /// All folders that receive shares, the common one first, each once.
+    /// All storage folders without duplicates, the default one first.
     std::vector<std::string> Folders() const;
 };
 
-/// The fixed places, below the root folder.
-std::string ConfigFolder();  ///< all of the following but the answers
-std::string ConfigFile();    ///< server.conf
-std::string RsyncdConfig();  ///< rsyncd.conf, written by setup
-std::string ShareModules();  ///< folder of the shares' modules, one file each
-std::string AdminModules();  ///< folder of the admin's own modules
-std::string SecretsFile();   ///< accounts and passwords, 0600
-std::string AnswerFolder();  ///< one folder per account, of command answers
-std::string PidFile();       ///< the rsync daemon's
-std::string RegistryFile();  ///< the pairing registry
-std::string LockFile();      ///< held by every command and outcome that changes the registry
+/// The default ports. Below a root folder they are higher ones, which need no privileges.
+int UsualTlsPort();
+int UsualPlainPort();
 
-/// Reads server.conf; nothing when the server is not set up or the file is damaged.
+/// The fixed paths, relative to the root folder.
+std::string ConfigFolder();   ///< contains all of the following but the answers
+std::string ConfigFile();     ///< server.conf
+std::string RsyncdConfig();   ///< rsyncd.conf, written by setup
+std::string ShareRecords();   ///< one file for each share
+std::string DepositFolder();  ///< configurations of clients, a folder for each account
+std::string SecretsFile();    ///< accounts and passwords, 0600
+std::string AnswerFolder();   ///< command answers, a folder for each account; gone after a reboot
+std::string OpenModules();    ///< folder of the open modules, in AnswerFolder()
+std::string PushLinks();      ///< folder of the links of LinkOfPush(), in AnswerFolder()
+std::string RsyncdLog();      ///< the rsync daemon's
+std::string FrontConfig();    ///< front.cfg, HAProxy's configuration, written at each start
+std::string FrontKey();       ///< the server's key and certificate, 0600
+std::string FrontFolder();    ///< folder of the socket on which the front reaches the daemon
+std::string RegistryFile();   ///< the pairing registry
+std::string LockFile();       ///< held by every command that changes the registry
+
+/// Where earlier versions permanently kept a module for every share, and the admin's own modules.
+std::string OldShareModules();
+std::string OldAdminModules();
+
+/// Reads server.conf; nothing when the server is not set up, or the file is damaged.
 std::optional<ServerConfig> LoadServerConfig();
-/// The same; throws Failure of that kind when there is none.
+/// The same, but throws Failure of the given kind instead.
 ServerConfig RequireServerConfig(programs::FailureKind otherwise = programs::FailureKind::kFailed);
 /// Writes it. False, with errno set, on failure.
 bool SaveServerConfig(const ServerConfig& config);
 
-/// The folder for shares of the volume that a client names: that volume's, or the common one.
+/// The storage folder for a client's volume name: the volume's own, or the default one.
 std::string StorageFor(const ServerConfig& config, const std::string& volume_name);
 
-/// How a storage folder is. kOtherDisk: not on the disk that it was on at set-up.
-enum class StorageState { kReady, kAbsent, kOtherDisk, kReadOnly, kNotPermitted };
-StorageState CheckStorage(const std::string& folder);
-
-/// Remembers which disk `folder` is on, for CheckStorage; its mount path, empty when that cannot be
-/// told or written.
+/// Records which disk `folder` is on. Returns its mount path, or "" when that cannot be determined
+/// or written.
 std::string RecordDiskOf(const std::string& folder);
-/// The mount path that was remembered; empty when none was.
+/// The recorded mount path; empty when there is none.
 std::string RecordedDiskOf(const std::string& folder);
+/// Whether the folder is still on that mount.
+bool IsOnRecordedDisk(const std::string& folder);
 
 }  // namespace zel_server

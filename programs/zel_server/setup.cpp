@@ -2,27 +2,29 @@
 
 #include <pwd.h>
 #include <sys/stat.h>
-#include <sys/statfs.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <chrono>
-#include <cstdint>
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
 #include <thread>
 
 #include "ZEL/is_syncedshare.h"
-#include "base/rsync_config.h"
+#include "base/make_folder.h"
 #include "programs/common/failure.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/accounts.h"
+#include "programs/zel_server/connections.h"
+#include "programs/zel_server/front.h"
 #include "programs/zel_server/health.h"
 #include "programs/zel_server/names.h"
 #include "programs/zel_server/registry_repair.h"
 #include "programs/zel_server/rsyncd_config.h"
-#include "programs/zel_server/serve.h"
+#include "programs/zel_server/share_record.h"
+#include "programs/zel_server/take_storage.h"
+#include "programs/zel_server/version_retention.h"
 #include "tarq/core.h"
 #include "tarq/root_path.h"
 
@@ -34,10 +36,10 @@ namespace fs = std::filesystem;
 using programs::Failure;
 using programs::FailureKind;
 
-constexpr int kUnprivilegedPort = 8873;
 constexpr char kStorageUser[] = "zel";
+constexpr mode_t kOthersRights = S_IWGRP | S_IRWXO;
 constexpr char kEverywhere[] = "all";
-// How long a daemon may take until it listens.
+// Time that a daemon may take until it listens.
 constexpr std::chrono::seconds kStartLimit(10);
 constexpr std::chrono::milliseconds kStep(50);
 
@@ -53,10 +55,11 @@ std::string Normal(const std::string& folder) {
     return normal;
 }
 
-// What holds when nothing is said: what was said before, or else what is usual.
+// The current configuration, or the defaults for a new server.
 ServerConfig ConfigBefore() {
     ServerConfig usual;
-    usual.port = IsSystem() ? base::kRsyncPort : kUnprivilegedPort;
+    usual.tls_port = UsualTlsPort();
+    usual.plain_port = UsualPlainPort();
     usual.user = IsSystem() ? kStorageUser : "";
     return LoadServerConfig().value_or(usual);
 }
@@ -81,13 +84,21 @@ void ConfigFrom(const SetupOptions& options, ServerConfig& config) {
         throw Failure(FailureKind::kUsage,
                       "a new server needs --storage FOLDER, the folder that receives the shares");
     }
-    if (options.port != 0) {
-        config.port = options.port;
+    if (options.tls_port != 0) {
+        config.tls_port = options.tls_port;
     }
+    if (options.plain_port != 0) {
+        config.plain_port = options.plain_port;
+    }
+    if (config.tls_port == config.plain_port) {
+        throw Failure(FailureKind::kUsage, "--port and --plain-port cannot be the same");
+    }
+    config.plain = options.plain.value_or(config.plain);
     if (!options.address.empty()) {
         config.address = options.address == kEverywhere ? "" : options.address;
     }
     config.encryption = options.encryption.value_or(config.encryption);
+    config.without_attributes = options.without_attributes.value_or(config.without_attributes);
     for (const std::string& volume : options.volumes) {
         const size_t equals = volume.find('=');
         const std::string name = volume.substr(0, equals);
@@ -101,13 +112,13 @@ void ConfigFrom(const SetupOptions& options, ServerConfig& config) {
             config.volumes[name] = Normal(volume.substr(equals + 1));
         }
     }
-    // A server in a folder of its own leaves the machine's users alone.
+    // A server below a root folder does not create system users.
     if (IsSystem() && !options.user.empty()) {
         config.user = options.user;
     }
 }
 
-// ---- Whether everything can be had; nothing is changed yet ----
+// ---- Checks before anything is changed ----
 
 void LookAtFolder(const std::string& folder, const UnitState& unit) {
     if (!IsPlainPath(folder)) {
@@ -115,7 +126,7 @@ void LookAtFolder(const std::string& folder, const UnitState& unit) {
             "'" + folder +
             "' cannot be a storage folder: give an absolute path without quotes, '%' or '\\'");
     }
-    // A link is no way out: where it leads to counts.
+    // For a symbolic link, its target counts.
     std::error_code error;
     const std::string real = fs::weakly_canonical(folder, error);
     const std::string why = unit.confinement.Forbids(error ? folder : real);
@@ -125,32 +136,31 @@ void LookAtFolder(const std::string& folder, const UnitState& unit) {
     }
 }
 
-void LookAtPort(const ServerConfig& config) {
-    const std::vector<Listener> listeners = ListenersOn(config.port);
+void LookAtPorts(const ServerConfig& config) {
+    const std::vector<Listener> listeners = Listeners(config);
     if (const auto holder = OtherHolder(config, listeners)) {
-        throw Failure("port " + std::to_string(config.port) + " is held by " + NameOf(*holder) +
-                      ": end that, or choose another --port" +
-                      (holder->program == "rsync"
-                           ? "; modules of an rsync daemon of yours can move into " + AdminModules()
-                           : ""));
+        const bool is_plain = holder->port == config.plain_port;
+        throw Failure("port " + std::to_string(holder->port) + " is held by " + NameOf(*holder) +
+                      ": end that, or choose another " + (is_plain ? "--plain-port" : "--port"));
     }
     if (ServesAll(config, listeners)) {
         return;
     }
-    for (const std::string& address : ServedAddresses(config)) {
-        const int error = TryToListen(address, config.port);
+    for (const Endpoint& endpoint : Endpoints(config)) {
+        const int error = TryToListen(endpoint.address, endpoint.port);
+        const std::string port = std::to_string(endpoint.port);
         if (error == EADDRNOTAVAIL) {
-            throw Failure("this machine has no address '" + programs::Printable(address) + "'");
+            throw Failure("this machine has no address '" + programs::Printable(endpoint.address) +
+                          "'");
         }
-        // Our own daemon may hold an address of several; it is started again.
+        // Not an error if it is our own front, which is restarted later.
         if (error != 0 && error != EADDRINUSE) {
-            throw Failure("cannot listen on port " + std::to_string(config.port) + ": " +
-                          strerror(error));
+            throw Failure("cannot listen on port " + port + ": " + strerror(error));
         }
         if (error == EADDRINUSE && listeners.empty()) {
-            throw Failure("port " + std::to_string(config.port) +
-                          " is held by somebody who does not listen there yet: choose another "
-                          "--port, or try again");
+            throw Failure("port " + port +
+                          " is held by somebody who does not listen there yet: choose another one, "
+                          "or try again");
         }
     }
 }
@@ -162,12 +172,13 @@ void LookAtEverything(const ServerConfig& config, const UnitState& unit) {
     if (unit.masked) {
         throw Failure(std::string("the unit ") + kUnit + " is masked: systemctl unmask " + kUnit);
     }
-    LookAtPort(config);
+    FrontUser();
+    LookAtPorts(config);
 }
 
-// ---- Taking it ----
+// ---- Making the changes ----
 
-// The system user that owns the copies when the daemon runs as root, made when it is missing.
+// Creates the system user that owns the copies when the daemon runs as root, if it is missing.
 void HaveStorageUser(const std::string& user) {
     if (user.empty() || getpwnam(user.c_str()) != nullptr) {
         return;
@@ -180,80 +191,60 @@ void HaveStorageUser(const std::string& user) {
     }
 }
 
+// These folders are only for root, or for whoever runs the server.
 void MakeFolders() {
-    for (const std::string& folder : {ConfigFolder(), ShareModules(), AdminModules(),
-                                      AnswerFolder(), TARQ::RootPath("/var/log")}) {
+    const std::pair<std::string, mode_t> folders[] = {{ConfigFolder(), 0750},
+                                                      {AnswerFolder(), 0700},
+                                                      {OpenModules(), 0700},
+                                                      {TARQ::RootPath("/var/log"), 0755}};
+    for (const auto& [folder, mode] : folders) {
+        if (!base::MakeFolder(folder, mode)) {
+            throw programs::SystemFailure("cannot make " + folder);
+        }
+    }
+}
+
+void TakeRights(const std::string& path) {
+    struct stat info = {};
+    if (lstat(path.c_str(), &info) == 0 && !S_ISLNK(info.st_mode) &&
+        (info.st_mode & kOthersRights) != 0) {
+        chmod(path.c_str(), info.st_mode & ~kOthersRights & 07777);
+    }
+}
+
+// Removes read access for others, which an earlier version or a umask may have left.
+void CloseFiles() {
+    for (const std::string& path : {ConfigFolder(), RegistryFile(), DamagedCopy(), RsyncdLog()}) {
+        TakeRights(path);
+    }
+    for (const std::string& folder : {ConfigFolder(), ShareRecords()}) {
         std::error_code error;
-        fs::create_directories(folder, error);
-        if (error) {
-            throw Failure("cannot make " + folder + ": " + error.message());
+        fs::directory_iterator entry(folder, error);
+        for (; !error && entry != fs::directory_iterator(); entry.increment(error)) {
+            TakeRights(entry->path());
         }
     }
 }
 
-bool IsInMemory(const std::string& folder) {
-    constexpr uint32_t kTmpfs = 0x01021994;
-    constexpr uint32_t kRamfs = 0x858458f6;
-    struct statfs info = {};
-    if (statfs(folder.c_str(), &info) != 0) {
-        return false;
-    }
-    const auto type = static_cast<uint32_t>(info.f_type);
-    return type == kTmpfs || type == kRamfs;
-}
-
-// What lies in a storage folder already and could be shares' copies.
-std::vector<std::string> CopiesIn(const std::string& storage) {
-    std::vector<std::string> copies;
+// Earlier versions also served modules that the admin had written.
+void TellOfOldAdminModules() {
     std::error_code error;
-    for (fs::directory_iterator entry(storage, error), end; !error && entry != end;
-         entry.increment(error)) {
-        std::error_code gone;
-        const std::string name = entry->path().filename();
-        if (fs::is_directory(entry->symlink_status(gone)) && name != "lost+found" &&
-            (IsShareName(name) || IsShareName(ShareOfModule(name)))) {
-            copies.push_back(entry->path());
-        }
-    }
-    return copies;
-}
-
-// Makes a storage folder and says which disk it is on, and what is odd about it.
-void TakeFolder(const ServerConfig& config, const std::string& folder) {
-    std::error_code error;
-    fs::create_directories(folder, error);
-    if (error) {
-        throw Failure("cannot make the storage folder '" + folder + "': " + error.message());
-    }
-    const std::string disk = RecordDiskOf(folder);
-    if (disk.empty()) {
-        throw Failure("cannot tell which disk '" + folder +
-                      "' is on: " + KAPICErrText(KAPICErrGet()));
-    }
-    const StorageState state = CheckStorage(folder);
-    if (state == StorageState::kReadOnly) {
-        throw Failure("the storage folder " + folder + " is on a disk that is mounted read-only");
-    }
-    if (state != StorageState::kReady) {
-        throw Failure("the storage folder " + folder +
-                      " cannot be used: it is no folder, or may not be written");
-    }
-    printf("Storage: %s, on the disk mounted at %s\n", folder.c_str(), disk.c_str());
-    if (IsSystem() && IsInMemory(folder)) {
-        printf("         NOTE: that is in memory: the copies are gone when the machine starts\n");
-    }
-    const std::vector<std::string> foreign = ForeignFolders(config, CopiesIn(folder));
-    if (!foreign.empty()) {
-        const Problem problem = ForeignCopies(config, foreign);
-        printf("         NOTE: %s\n         %s\n", problem.what.c_str(), problem.mend.c_str());
+    if (!fs::is_empty(OldAdminModules(), error) && !error) {
+        printf(
+            "         NOTE: the modules in %s are served no more: they belong to the\n"
+            "         system's own rsync daemon (/etc/rsyncd.conf), on another port\n",
+            OldAdminModules().c_str());
     }
 }
 
-// The switch of a new server is on; the admin's word for one that was set up before stays.
+// A new server is switched on; an existing one keeps the admin's setting.
 void TakeRegistry(bool is_new) {
     const RegistryLock lock;
+    if (!lock.Held() || !TakeOverOldModules()) {
+        throw programs::SystemFailure("cannot write the records of shares in " + ShareRecords());
+    }
     if (is_new && ReadSwitch() == Switch::kUnknown) {
-        if (!lock.Held() || TARQUISetZEL(1, nullptr, nullptr) != 0) {
+        if (TARQUISetZEL(1, nullptr, nullptr) != 0) {
             throw Failure("cannot write the registry " + RegistryFile() + ": " +
                           KAPICErrText(KAPICErrGet()));
         }
@@ -270,7 +261,7 @@ void TakeRegistry(bool is_new) {
 
 bool WaitUntilServed(const ServerConfig& config) {
     const auto limit = std::chrono::steady_clock::now() + kStartLimit;
-    while (!ServesAll(config, ListenersOn(config.port))) {
+    while (!ServingProcess() || !ServesAll(config, Listeners(config))) {
         if (std::chrono::steady_clock::now() > limit) {
             return false;
         }
@@ -280,30 +271,25 @@ bool WaitUntilServed(const ServerConfig& config) {
 }
 
 std::string Where(const ServerConfig& config) {
-    std::string where = "port " + std::to_string(config.port);
-    if (!config.address.empty()) {
-        where += " of " + config.address;
-    }
-    const std::vector<std::string> addresses = ServedAddresses(config);
-    return addresses.size() == 1 ? where
-                                 : where + ", and of " + addresses.back() + " for ssh clients";
+    return "port " + std::to_string(config.tls_port) +
+           (config.address.empty() ? "" : " of " + config.address);
 }
 
-// Without a manager that knows the unit, the admin starts the daemon.
+// Where no service manager knows the units, the admin has to start the server.
 void TellHowToStart(const Health& now, const ServerConfig& config) {
     if (now.listens && !now.configuration_newer) {
-        printf("Running: the rsync daemon, on %s\n", Where(config).c_str());
+        printf("Running: on %s\n", Where(config).c_str());
         return;
     }
     const std::string root = IsSystem() ? "" : "TARQ_ROOT='" + TARQ::RootFolder() + "' ";
     if (now.daemon) {
         printf(
-            "Old:     the rsync daemon that runs does not know this configuration: end process "
-            "%ld first\n",
+            "Old:     the server that runs does not know this configuration: end process %ld "
+            "first\n",
             static_cast<long>(*now.daemon));
     }
     printf(
-        "To do:   no system manager that knows %s runs here; start the rsync daemon by hand:\n"
+        "To do:   no system manager that knows %s runs here; start the server by hand:\n"
         "             %szel_server serve\n"
         "         It then listens on %s, until it is ended.\n",
         kUnit, root.c_str(), Where(config).c_str());
@@ -317,7 +303,7 @@ void HaveDaemon(const ServerConfig& config) {
     }
     const bool runs = now.unit.active == "active";
     if (!runs && now.daemon) {
-        throw Failure("an rsync daemon of this server was started by hand: end process " +
+        throw Failure("this server was started by hand: end process " +
                       std::to_string(*now.daemon) + ", then run 'zel_server setup' again");
     }
     const bool as_configured = runs && now.listens && !now.configuration_newer;
@@ -325,8 +311,8 @@ void HaveDaemon(const ServerConfig& config) {
         throw Failure(std::string("cannot enable the unit ") + kUnit);
     }
     if (!as_configured && (!(runs ? RestartUnit() : StartUnit()) || !WaitUntilServed(config))) {
-        throw Failure(std::string("the rsync daemon does not start: 'journalctl -u ") + kUnit +
-                      "' and 'zel_server status' say why");
+        throw Failure(std::string("the server does not start: 'journalctl -u ") + kUnit + " -u " +
+                      kFrontUnit + "' and 'zel_server status' say why");
     }
     const char* const done = as_configured ? "Running: " : runs ? "Restarted: " : "Started: ";
     printf("%s%s, on %s%s%s\n", done, kUnit, Where(config).c_str(),
@@ -334,32 +320,90 @@ void HaveDaemon(const ServerConfig& config) {
            runs && !as_configured ? "; pushes that were under way are tried again" : "");
 }
 
+// Prints what the admin needs to configure clients.
+void TellAccess(const ServerConfig& config) {
+    const std::string plain = std::to_string(config.plain_port);
+    printf("Key:     %s\n         (clients ask whether it is this one when they first connect)\n",
+           Fingerprint().value_or("?").c_str());
+    if (config.plain) {
+        printf(
+            "NOTE:    port %s serves the network without encryption: anybody on the way can read "
+            "and\n         change what travels there; 'zel_server setup --no-plain' ends that\n",
+            plain.c_str());
+    }
+}
+
+// Nothing when they stay as they are.
+std::optional<KeepSettings> KeepSettingsFrom(const SetupOptions& options) {
+    if (options.keep.empty() && options.keep_at_least.empty() && !options.reserve) {
+        return std::nullopt;
+    }
+    KeepSettings settings = ReadKeepSettings().value_or(KeepSettings());
+    if (!options.keep.empty()) {
+        const auto keep = ParseRetention(options.keep);
+        if (!keep) {
+            throw Failure(FailureKind::kUsage,
+                          "--keep takes all=, daily= and weekly=, each a number of days (d), weeks "
+                          "(w) or years (y) and none shorter than the one before, as in "
+                          "all=1d,daily=30d,weekly=1y; not '" +
+                              programs::Printable(options.keep) + "'");
+        }
+        settings.retention = *keep;
+    }
+    if (!options.keep_at_least.empty()) {
+        const auto age = ParseAge(options.keep_at_least);
+        if (!age) {
+            throw Failure(FailureKind::kUsage,
+                          "--keep-at-least takes a number of days (d), weeks (w) or years (y), as "
+                          "in 7d; not '" +
+                              programs::Printable(options.keep_at_least) + "'");
+        }
+        settings.at_least = *age;
+    }
+    settings.reserve = options.reserve.value_or(settings.reserve);
+    return settings;
+}
+
 }  // namespace
 
 void Setup(const SetupOptions& options) {
     ServerConfig config = ConfigBefore();
     ConfigFrom(options, config);
+    const auto keep = KeepSettingsFrom(options);
     LookAtEverything(config, AskUnit());
     const bool is_new = !LoadServerConfig();
     HaveStorageUser(config.user);
     MakeFolders();
-    for (const std::string& folder : config.Folders()) {
-        TakeFolder(config, folder);
-    }
-    // The registry before the configuration: a new server is one without configuration.
+    TakeStorage(config);
+    config.closed = true;
+    // The registry before the configuration, whose absence is the mark of a new server.
     TakeRegistry(is_new);
-    if (!SaveServerConfig(config) || !WriteRsyncdConfig(config)) {
+    if (options.certificate.empty()) {
+        HaveFrontKey();
+    } else {
+        TakeFrontKey(options.certificate);
+    }
+    if (!SaveServerConfig(config) || (keep && !WriteKeepSettings(*keep)) ||
+        !WriteRsyncdConfig(config)) {
         throw programs::SystemFailure("cannot write the configuration in " + ConfigFolder());
     }
-    printf("Written: %s\n         (your own modules go into %s)\n", RsyncdConfig().c_str(),
-           AdminModules().c_str());
+    printf("Written: %s\n", RsyncdConfig().c_str());
+    TellOfOldAdminModules();
+    {
+        const RegistryLock lock;
+        if (lock.Held()) {
+            MoveOpenCopies(config);
+        }
+    }
+    CloseFiles();
+    TellAccess(config);
     HaveDaemon(config);
     if (ReadSwitch() == Switch::kOff) {
         puts("Off:     clients are refused, as before: 'zel_server enable' lets them in");
     }
     const auto accounts = Accounts();
     if (accounts && accounts->empty()) {
-        puts("Next:    zel_server account add NAME, for each client");
+        puts("Next:    zel_server account add NAME, for each client; it prints a password");
     }
 }
 

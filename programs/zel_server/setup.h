@@ -1,24 +1,32 @@
-// `zel_server setup`: from nothing to a server that runs.
+// `zel_server setup`: creates or changes a server, and gets it running.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <vector>
 
 namespace zel_server {
 
-/// What is empty stays as it was, or is as usual at a new server.
+/// Empty values keep the current setting, or the default of a new server.
 struct SetupOptions {
-    std::string storage;               ///< a new server needs it
-    std::vector<std::string> volumes;  ///< NAME=FOLDER; NAME= alone takes the volume out
-    std::string address;               ///< "all": everywhere
+    std::string storage;               ///< required for a new server
+    std::vector<std::string> volumes;  ///< NAME=FOLDER; NAME= alone removes the volume
+    std::string address;               ///< "all": every address
     std::string user;
-    int port = 0;
+    std::string keep;                 ///< how long versions are kept, see ParseRetention()
+    std::string keep_at_least;        ///< what is younger is not given up for space, see ParseAge()
+    std::string certificate;          ///< PEM file with the admin's own key and certificate
+    std::optional<uint64_t> reserve;  ///< percent of a disk, at most kMaxReserve
+    int tls_port = 0;
+    int plain_port = 0;
+    std::optional<bool> plain;
     std::optional<bool> encryption;
+    std::optional<bool> without_attributes;
 };
 
-/// Looks whether everything can be had, writes the configuration, and sees to it that the rsync
-/// daemon runs with it, or says how to. Says what it did.
+/// Checks that all of it is possible, writes the configuration, and restarts the server with it, or
+/// prints how to. Prints what it did.
 void Setup(const SetupOptions& options);
 
 }  // namespace zel_server

@@ -5,8 +5,10 @@
 
 #include "ZEL/is_syncedshare.h"
 #include "programs/common/failure.h"
+#include "programs/common/json_text.h"
 #include "programs/common/text.h"
 #include "programs/zel_server/health.h"
+#include "programs/zel_server/names.h"
 
 namespace zel_server {
 
@@ -15,9 +17,7 @@ namespace {
 using Json = nlohmann::ordered_json;
 using programs::Printable;
 
-constexpr char kMultiSourceMarker[] = "ZELMULTI-SRC-SUPPORT";
-
-// What the library makes of the registry.
+// The registry as the library reads it.
 class Report {
 public:
     Report() : read_(zel_svr_get_status(&status_) == 0) {}
@@ -84,7 +84,11 @@ void PrintJson(const ServerConfig& config, const Report& report, const Health& h
         {"daemon_pid", OrNull(health.daemon)},
         {"listening", health.listens},
         {"configuration_newer", health.configuration_newer},
-        {"port", config.port},
+        {"front_pid", OrNull(health.front)},
+        {"fingerprint", OrNull(health.fingerprint)},
+        {"port", config.tls_port},
+        {"plain_port", config.plain_port},
+        {"plain_for_network", config.plain},
         {"address", config.address.empty() ? Json(nullptr) : Json(config.address)},
         {"port_holder", other ? Json(other->program) : Json(nullptr)},
         {"port_holder_pid", other ? Json(other->pid) : Json(nullptr)},
@@ -95,7 +99,7 @@ void PrintJson(const ServerConfig& config, const Report& report, const Health& h
         {"free_bytes", OrNull(storage.free_bytes)},
         {"folders", folders},
         {"problems", problems}};
-    puts(object.dump(2, ' ', false, Json::error_handler_t::replace).c_str());
+    puts(programs::JsonText(object).c_str());
 }
 
 std::string StorageText(const StorageHealth& storage) {
@@ -108,6 +112,10 @@ std::string StorageText(const StorageHealth& storage) {
             return "READ-ONLY";
         case StorageState::kNotPermitted:
             return "MAY NOT BE WRITTEN";
+        case StorageState::kOpen:
+            return "OPEN TO OTHERS";
+        case StorageState::kNoAttributes:
+            return "KEEPS NO ATTRIBUTES";
         case StorageState::kReady:
             break;
     }
@@ -122,8 +130,8 @@ void PrintLine(const char* label, const std::string& text) {
     printf("%-9s %s\n", label, text.c_str());
 }
 
-std::string PortText(const ServerConfig& config) {
-    return std::to_string(config.port) + (config.address.empty() ? "" : " of " + config.address);
+std::string Where(const ServerConfig& config) {
+    return config.address.empty() ? "" : " of " + config.address;
 }
 
 void PrintText(const ServerConfig& config, const Report& report, const Health& health) {
@@ -137,7 +145,11 @@ void PrintText(const ServerConfig& config, const Report& report, const Health& h
     }
     PrintLine("Daemon:", health.daemon ? "running, process " + std::to_string(*health.daemon)
                                        : std::string("not running"));
-    PrintLine("Port:", PortText(config));
+    PrintLine("Port:", std::to_string(config.tls_port) + Where(config) + ", TLS");
+    PrintLine(
+        "", std::to_string(config.plain_port) +
+                (config.plain ? Where(config) + ", UNPROTECTED" : " for this machine and for ssh"));
+    PrintLine("Key:", health.fingerprint.value_or("not to be read"));
     PrintLine("Busy:", report.Busy() ? "yes" : "no");
     PrintLine("Paired:", report.Several()          ? "several clients"
                          : report.Client().empty() ? "none"

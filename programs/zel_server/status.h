@@ -3,7 +3,7 @@
 
 namespace zel_server {
 
-/// Writes how the server is; fails when pushes cannot succeed, all or some.
+/// Prints the state of the server; fails when some or all pushes cannot succeed.
 void ShowStatus(bool as_json);
 
 }  // namespace zel_server

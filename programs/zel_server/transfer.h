@@ -1,15 +1,15 @@
-// The rsync daemon asks here before a connection may touch a share, and tells here how it ended.
+// Checks that the rsync daemon runs before and after a connection uses a share.
 #pragma once
 
 namespace zel_server {
 
-/// `zel_server admit-transfer` (pre-xfer exec): exit code 0 lets the connection go on. Only the
-/// account that the share belongs to gets in: to write while a push is running, to read, or to ask
-/// what a push would change, at any time.
+/// `zel_server admit-transfer` (pre-xfer exec): exit code 0 admits the connection. Only the account
+/// that owns the share is admitted: to write while a push is running, to read, or to do a dry run
+/// at any time.
 int AdmitTransfer();
 
-/// `zel_server end-transfer` (post-xfer exec): records the outcome of a data run, or removes a
-/// command's answer.
+/// `zel_server end-transfer` (post-xfer exec): records the outcome of a transfer, or removes the
+/// answer to a command.
 int EndTransfer();
 
 }  // namespace zel_server

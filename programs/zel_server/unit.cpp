@@ -15,7 +15,7 @@ namespace {
 
 constexpr char kSystemctl[] = "/usr/bin/systemctl";
 constexpr char kManagerRuns[] = "/run/systemd/system";
-// All that Confinement and UnitState look at.
+// All properties that Confinement and UnitState read.
 constexpr char kProperties[] =
     "--property=LoadState,ActiveState,UnitFileState,Result,ProtectSystem,ProtectHome,PrivateTmp,"
     "PrivateDevices,ProtectKernelTunables,ReadWritePaths,ReadOnlyPaths,InaccessiblePaths,"
@@ -27,7 +27,7 @@ struct Rule {
     std::vector<const char*> folders;
 };
 
-// What the manager makes of its settings, as systemd.exec(5) has it.
+// The meaning of the manager's settings, see systemd.exec(5).
 const std::vector<Rule>& Rules() {
     static const std::vector<Rule> rules = {
         {"ProtectSystem", "yes", {"/usr", "/boot", "/efi"}},
@@ -63,9 +63,9 @@ bool IsThere(const char* path) {
     return stat(path, &info) == 0;
 }
 
-std::string OutputOf(const char* verb, const char* option) {
+std::string OutputOf(const char* verb, const char* option, const char* unit) {
     FILE* const stream =
-        KAPICPopen(kSystemctl, "r", verb, option, kUnit, static_cast<const char*>(nullptr));
+        KAPICPopen(kSystemctl, "r", verb, option, unit, static_cast<const char*>(nullptr));
     std::string output;
     for (int c; stream != nullptr && (c = fgetc(stream)) != EOF;) {
         output += static_cast<char>(c);
@@ -116,8 +116,8 @@ void Confinement::Add(const std::string& path, const std::string& why) {
     rules_.emplace(path, why);
 }
 
-// Paths with blanks between them; "-": none the worse when it is missing, "+": below the root
-// folder, ":": options follow.
+// Paths separated by blanks, with prefixes and suffixes of systemd: "-" ignores a missing path, "+"
+// makes it relative to the root folder, and options follow a ":".
 void Confinement::AddListed(const std::string& paths, const std::string& why) {
     std::istringstream words(paths);
     for (std::string word; words >> word;) {
@@ -129,7 +129,7 @@ void Confinement::AddListed(const std::string& paths, const std::string& why) {
 }
 
 std::string Confinement::Forbids(const std::string& folder) const {
-    // The longest folder that matches counts, whatever holds for those around it.
+    // The longest matching folder decides, whatever applies to its parents.
     const std::pair<const std::string, std::string>* nearest = nullptr;
     for (const auto& rule : rules_) {
         if (IsWithin(folder, rule.first) &&
@@ -140,13 +140,13 @@ std::string Confinement::Forbids(const std::string& folder) const {
     return nearest == nullptr ? "" : nearest->second;
 }
 
-UnitState AskUnit() {
+UnitState AskUnit(const char* unit) {
     UnitState state;
     if (!TARQ::RootFolder().empty()) {
         return state;
     }
     state.confinement = Confinement(kShippedUnit);
-    const std::string shown = IsThere(kManagerRuns) ? OutputOf("show", kProperties) : "";
+    const std::string shown = IsThere(kManagerRuns) ? OutputOf("show", kProperties, unit) : "";
     const std::string load = ValueOf(shown, "LoadState");
     if (shown.empty() || load == "not-found") {
         return state;

@@ -23,16 +23,21 @@ constexpr Command kCommands[] = {
     {"status", "What the daemon is doing", DeclareStatus},
     {"reload", "Let the daemon read its configuration again", DeclareReload},
     {"doctor", "Look at all that a push needs, and say how to mend what is wrong", DeclareDoctor},
-    {"export", "Write all tasks to a file", DeclareExport},
+    {"export", "Write all tasks and shares to a file", DeclareExport},
     {"import", "Add the tasks of a file", DeclareImport},
+    {"trust", "The servers that are trusted, and how each is reached", DeclareTrust},
     {"pair", "Pairing with a server", DeclarePair},
     {"push", "Push shares to a server now, without the daemon", DeclarePush},
+    {"restore", "Bring files back from the server", DeclareRestore},
+    {"recover", "Take a machine that was lost back from its server", DeclareRecover},
+    {"versions", "When a share has changed at the server", DeclareVersions},
+    {"verify", "Compare a task's shares and their copies byte by byte", DeclareVerify},
     {"next", "Show the next runs of a schedule", DeclareNext},
     {"server", "The server on this machine: all that zel_server does", nullptr},
 };
 
-// The first word from `words[index]` on that is no option, and the place after it; empty when there
-// is none.
+// The first word from `words[index]` on that is not an option, and the position after it; empty
+// when there is none.
 std::string NextWord(const std::vector<std::string>& words, size_t& index) {
     while (index < words.size()) {
         const std::string& word = words[index++];
@@ -43,7 +48,7 @@ std::string NextWord(const std::vector<std::string>& words, size_t& index) {
     return "";
 }
 
-// `below`: the word after a command that others are below; empty: `word` itself is none.
+// `below`: the unknown word after the command group `word`; empty: `word` itself is unknown.
 programs::Failure NoSuchCommand(const std::string& word, const std::string& below) {
     const std::string group = below.empty() ? "" : word + " ";
     return {programs::FailureKind::kUsage,
@@ -69,7 +74,7 @@ void Run(const std::vector<std::string>& words) {
     bool known = wanted.empty();
     for (const Command& command : kCommands) {
         CLI::App* const declared = app.add_subcommand(command.name, command.about);
-        // What another command takes need not be known to run this one.
+        // Only the wanted command declares its options; the others would cost time.
         if (wanted == command.name) {
             command.declare(*declared);
             known = true;

@@ -1,6 +1,7 @@
 #include "programs/zelctl/declare.h"
 #include "programs/zelctl/doctor/doctor.h"
 #include "programs/zelctl/task/edit.h"
+#include "programs/zelctl/task/run.h"
 #include "programs/zelctl/task/transfer.h"
 
 namespace zelctl {
@@ -44,8 +45,25 @@ void DeclareImport(CLI::App& importing) {
     importing.add_option("--password-file", password_file,
                          "File with the password of all accounts whose password the file does not "
                          "have; else each is asked for");
-    importing.footer("Nothing is imported unless every task of the file is possible here.");
+    importing.footer(
+        "Nothing is imported unless every task of the file is possible here. Shares that\n"
+        "they need and this machine has not are added, where their folders are there.");
     importing.callback([] { ImportTasks(path, replace, password_file); });
+}
+
+void DeclareVerify(CLI::App& verify) {
+    static std::string task;
+    static std::string share;
+    static std::vector<std::string> paths;
+    verify.add_option("task", task, "The task")->required();
+    verify.add_option("paths", paths, "Only these, as they are called in the share");
+    verify.add_option("--share", share, "Only this share of the task")->option_text("NAME");
+    verify.footer(
+        "Every file is read at both ends, which takes as long as the disks do, and nothing is\n"
+        "changed. DAMAGED: size and time are the same, the bytes are not; one of the two is\n"
+        "damaged. What differs otherwise is sent with the task's next run. Exit code 1: something\n"
+        "differs.");
+    verify.callback([] { VerifyTask(task, share, paths); });
 }
 
 }  // namespace zelctl

@@ -10,9 +10,9 @@ Outcome Zelctl(const std::string& root, const std::string& arguments, const std:
     return RunProgram(root, {"sh", "-c", before + "exec " ZELCTL " " + arguments}, input);
 }
 
-ClientAndServer::ClientAndServer() : port_(FreePort()) {
+ClientAndServer::ClientAndServer() : port_(FreePort()), tls_port_(FreePort()) {
     SetUpServer();
-    Must(Server("account add alice --password-file -", "secret\n"));
+    Must(Server("account add alice --password-file -", "secret words\n"));
     StartServer();
     Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\n");
     folder_.Write("client/usr/tarq/etc/tarqsdk.conf", "[device]\nserial=\"CLIENT-1\"\n");
@@ -27,8 +27,8 @@ ClientAndServer::~ClientAndServer() {
 }
 
 void ClientAndServer::SetUpServer(const std::string& address) const {
-    Must(Server("setup --address " + address + " --storage " + storage_ + " --port " +
-                std::to_string(port_)));
+    Must(Server("setup --address " + address + " --storage " + storage_ + " --plain-port " +
+                std::to_string(port_) + " --port " + std::to_string(tls_port_)));
 }
 
 bool ClientAndServer::PutStorageOnDisk(const std::string& size) {
@@ -64,7 +64,8 @@ Outcome ClientAndServer::Client(const std::string& arguments, const std::string&
 }
 
 void ClientAndServer::ExpectCopyIsComplete() const {
-    EXPECT_EQ(RunProgram("", {"diff", "-r", source_, storage_ + "/docs"}).output, "");
+    EXPECT_EQ(RunProgram("", {"diff", "-r", "-x", ".zel_*", source_, storage_ + "/docs"}).output,
+              "");
 }
 
 }  // namespace test

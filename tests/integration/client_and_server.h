@@ -22,8 +22,8 @@ inline testing::Matcher<Outcome> Ended(int exit_code, const std::string& text = 
 Outcome Zelctl(const std::string& root, const std::string& arguments, const std::string& input = "",
                const std::string& before = "");
 
-/// A server with the account "alice" (password "secret"), and a client "CLIENT-1" that knows how to
-/// find it and has the share "docs" with three files.
+/// A server with the account "alice" (password "secret words"), and a client "CLIENT-1" that knows
+/// how to find it and has the share "docs" with three files.
 class ClientAndServer {
 public:
     ClientAndServer();
@@ -57,6 +57,7 @@ protected:
     const std::string source_ = folder_.Path("source");
     const std::string storage_ = folder_.Path("server/storage");
     int port_;
+    int tls_port_;
     ServerProcess daemon_;
 };
 

@@ -48,6 +48,7 @@ expect '<my\ photos>' zelctl task edit --server nas my
 expect '<Übungen>' zelctl push --server nas other ''
 expect '<--help><--limit><--json><--verbose>' zelctl task log x --
 expect '<--ssh><--ssh-port>' zelctl task add x --bwlimit 7 --ss
+expect '<--help><--fingerprint><--plain><--ssh><--list><--forget><--json>' zelctl trust nas --
 expect '<--no-exclude>' zelctl task edit x --no-e
 expect '<--monthly>' zelctl next --mo
 expect '<run><rm><resume>' zelctl help task r

@@ -18,17 +18,6 @@ namespace test {
 
 using ZEL::PObject;
 
-bool Await(const std::function<bool()>& condition, int seconds) {
-    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
-    while (!condition()) {
-        if (std::chrono::steady_clock::now() > end) {
-            return false;
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
-    return true;
-}
-
 PObject Request(const char* command, const std::string& task) {
     PObject request;
     request["command"] = command;

@@ -8,11 +8,9 @@
 #include <vector>
 
 #include "ZEL/pobject.h"
+#include "tests/integration/servers.h"
 
 namespace test {
-
-/// Whether `condition` became true within a time that even a busy machine needs not.
-bool Await(const std::function<bool()>& condition, int seconds = 60);
 
 /// A request without keys of its own; `task`: the one that it is about, if any.
 ZEL::PObject Request(const char* command, const std::string& task = "");

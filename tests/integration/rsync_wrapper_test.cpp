@@ -5,6 +5,7 @@
 #include <sys/socket.h>
 
 #include "base/unique_fd.h"
+#include "tarq/rsync_servers.h"
 #include "tests/integration/servers.h"
 #include "tests/support/syslog_capture.h"
 #include "tests/support/testing.h"
@@ -235,7 +236,14 @@ TEST_F(RsyncWrapperTest, AServerThatSaysNothingIsGivenUpAndASlowCopyIsNot) {
     ServeCommands("cat > /dev/null; sleep 20");
     EXPECT_EQ(Command({"command=\"X\""}), STATUS_TIMEOUT);
     EXPECT_THAT(report_.explanation, HasSubstr("did not answer the command"));
-    EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(10));
+    const int trickling_port = test::FreePort();
+    const test::TricklingServer trickling(trickling_port);
+    const auto to_trickling = [=](RsyncWrapper& w) {
+        w.setPort(trickling_port);
+        w.setTarqCustCmdRule({"command=\"X\""});
+    };
+    EXPECT_EQ(Copy(to_trickling), STATUS_TIMEOUT) << "each byte would be one more second";
+    EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(15));
 
     RunOptions slow;
     slow.bandwidth_limit = 800;
@@ -461,6 +469,172 @@ TEST_F(RsyncWrapperTest, TheDebugLogIsRotatedAndAFolderWithoutRightsIsNoFailure)
     EXPECT_EQ(Copy(logged), 0);
 }
 
+/// The same client and daemon, with a TLS proxy in front of the daemon.
+class RsyncWrapperTlsTest : public RsyncWrapperTest {
+protected:
+    RsyncWrapperTlsTest() { Trust(); }
+
+    void Trust(const std::string& host = "nas") {
+        TrustServer({host, ServerTransport::TLS, front_.Port(), front_.Fingerprint()});
+    }
+    /// Settings of a person's that the file of servers overrules.
+    int CopyTo(const std::string& address, RunOptions options = {},
+               const Cancelled& cancelled = nullptr) {
+        options.server = "NAS";
+        const auto set = [&](RsyncWrapper& wrapper) {
+            wrapper.setSsh(true);
+            wrapper.setPort(test::FreePort());
+            wrapper.setDestPath(test::RsyncDaemon::kUser, address, kPassword, "data", "");
+        };
+        return Copy(set, options, cancelled);
+    }
+
+    test::TlsFront front_{daemon_.Port()};
+};
+
+TEST_F(RsyncWrapperTlsTest, TheServerWithTheTrustedKeyIsPushedToAndNoOther) {
+    AddToSource("file", std::string(3000000, 'x'));
+    ASSERT_EQ(CopyTo("127.0.0.1"), 0) << report_.explanation << report_.details;
+    EXPECT_EQ(fs::file_size(module_ + "/file"), 3000000U);
+    AddToSource("second", "2");
+    EXPECT_EQ(CopyTo("::1"), 0) << report_.explanation;
+    EXPECT_EQ(ReadFile(module_ + "/second"), "2");
+
+    // What answers with another key gets not a byte of rsync's, neither there nor behind it.
+    const std::string trusted = front_.Fingerprint();
+    const size_t logged = daemon_.Log().size();
+    front_.ChangeKey();
+    EXPECT_EQ(CopyTo("127.0.0.1"), STATUS_AUTHENTICATION);
+    EXPECT_THAT(report_.explanation,
+                AllOf(HasSubstr("NAS shows " + front_.Fingerprint() + ", trusted was " + trusted),
+                      HasSubstr("zelctl trust NAS")));
+    EXPECT_THAT(daemon_.Log().substr(logged), Not(HasSubstr("allowed")));
+}
+
+TEST_F(RsyncWrapperTlsTest, WhatAnswersTooLateOrNotAtAllIsGivenUpAndACancelledRunLeavesNothing) {
+    AddToSource("file", "content");
+    Configure("answer_seconds=\"2\"\n");
+    const auto begin = std::chrono::steady_clock::now();
+    const auto command = [&](RsyncWrapper& wrapper) {
+        wrapper.setTarqCustCmdRule({"command=\"X\""});
+        wrapper.setDestPath("bob", "127.0.0.1", kPassword, "", "");
+        wrapper.setTimeout(3);
+    };
+    RunOptions options;
+    options.server = "nas";
+    ServeCommands("cat > /dev/null; sleep 20");
+    EXPECT_EQ(Copy(command, options), STATUS_TIMEOUT);
+    EXPECT_THAT(report_.explanation, HasSubstr("nas did not answer the command within 2 seconds"));
+
+    int asked = 0;
+    const auto enough = [&] { return ++asked > 5; };
+    EXPECT_EQ(Copy(command, options, enough), STATUS_CANCELLED);
+    const std::string helper = "connect" + std::string(1, '\0') + "127.0.0.1";
+    for (int i = 0; i < 20 && Has(OtherProcesses(), helper); ++i) {
+        usleep(100000);
+    }
+    EXPECT_FALSE(Has(OtherProcesses(), helper));
+
+    const int port = test::FreePort();
+    const auto trust_port = [&] {
+        TrustServer({"nas", ServerTransport::TLS, port, front_.Fingerprint()});
+    };
+    trust_port();
+    EXPECT_EQ(Copy(command, options), STATUS_SOCKET);
+    EXPECT_THAT(report_.explanation, HasSubstr("refuses connections on TLS port"));
+    {
+        Configure();
+        const test::TricklingServer trickling(port, "127.0.0.1", true);
+        EXPECT_EQ(Copy(command, options), 35);
+        EXPECT_THAT(report_.explanation, HasSubstr("did not answer on TLS port"));
+    }
+    TrustServer({"nas", ServerTransport::TLS, daemon_.Port(), front_.Fingerprint()});
+    EXPECT_EQ(Copy(command, options), STATUS_SOCKET);
+    EXPECT_THAT(report_.explanation, HasSubstr("is no server with TLS 1.3"));
+    EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(20));
+}
+
+TEST_F(RsyncWrapperTlsTest, ADamagedOrForeignFileOfServersFailsEveryRun) {
+    AddToSource("file", "content");
+    const std::string path = ServersPath();
+    const std::string good = ReadFile(path);
+    EXPECT_THAT(ListServers(), SizeIs(1));
+    for (const auto& [text, words] : std::initializer_list<std::pair<std::string, std::string>>{
+             {"[nas\n" + good, "line 1: '[nas' is no [server]"},
+             {good + "[other]\ntransport=\"tsl\"\n", "transport is 'tsl'"},
+             {good + "[other]\nport=\"1\"\n", "has no transport"},
+             {good + "[NAS]\ntransport=\"plain\"\n", "is there twice"},
+             {good + "[other]\ntransport=\"tls\"\nfingerprint=\"SHA256:x\"\n", "43 characters"},
+             {good + "transport=\"plain\"\n", "is there twice"},
+             {good + "fingerprnt=\"x\"\n", "is unknown"},
+             {good + "\x80\n", "is neither"},
+         }) {
+        std::ofstream(path) << text;
+        EXPECT_EQ(CopyTo("127.0.0.1"), STATUS_SYNTAX);
+        EXPECT_THAT(report_.explanation, HasSubstr(words));
+        EXPECT_THROW(TrustServer({"third", ServerTransport::PLAIN, 0, ""}), ServersError);
+        EXPECT_EQ(ReadFile(path), text);
+    }
+    std::ofstream(path) << "# kept\n" << good;
+    chmod(path.c_str(), 0666);
+    EXPECT_EQ(CopyTo("127.0.0.1"), STATUS_SYNTAX);
+    EXPECT_THAT(report_.explanation, HasSubstr("may be written by others"));
+    chmod(path.c_str(), 0644);
+
+    // Two who write at once lose nothing, and comments stay.
+    std::vector<std::thread> writers;
+    for (int i = 0; i < 4; ++i) {
+        writers.emplace_back([i] {
+            for (int j = 0; j < 5; ++j) {
+                TrustServer({"h" + std::to_string(10 * i + j), ServerTransport::PLAIN, 0, ""});
+            }
+        });
+    }
+    for (std::thread& writer : writers) {
+        writer.join();
+    }
+    EXPECT_THAT(ListServers(), SizeIs(21));
+    EXPECT_TRUE(ForgetServer("H12"));
+    EXPECT_FALSE(ForgetServer("h12"));
+    EXPECT_THAT(ReadFile(path), StartsWith("# kept\n"));
+    EXPECT_EQ(CopyTo("127.0.0.1"), 0) << report_.explanation;
+    EXPECT_EQ(ServerName("2001:DB8:0::1"), "2001:db8::1");
+    EXPECT_TRUE(IsLoopbackHost("127.1.2.3") && IsLoopbackHost("LocalHost") &&
+                IsLoopbackHost("::1"));
+    EXPECT_FALSE(IsLoopbackHost("128.0.0.1") || IsLoopbackHost("localhost.evil.example"));
+}
+
+TEST_F(RsyncWrapperTlsTest, EachHalfOfAConnectionIsClosedInItsOwnTime) {
+    // Says what it was told only when it has been told all.
+    test::ServerProcess late;
+    const int port = test::FreePort();
+    const std::string script =
+        "import socket\n"
+        "s = socket.create_server(('127.0.0.1', " +
+        std::to_string(port) +
+        "))\n"
+        "while True:\n"
+        "    c = s.accept()[0]\n"
+        "    t = b''.join(iter(lambda: c.recv(65536), b''))\n"
+        "    try: c.sendall(t[::-1])\n"
+        "    except OSError: pass\n"
+        "    c.close()\n";
+    late.Start({"python3", "-c", script}, root_.Path("log"), port);
+    const test::TlsFront front(port);
+    const std::string connect = "'" CONNECT "' ::1 " + std::to_string(front.Port()) + " 5 1 " +
+                                front.Fingerprint() + " nas rsync --server";
+    const auto run = [](const std::string& line) {
+        return test::RunProgram("", {"sh", "-c", line}).output;
+    };
+    EXPECT_EQ(
+        run("{ head -c 3000000 /dev/zero; echo abc; } | " + connect + " | { head -c 4; wc -c; }"),
+        "\ncba3000000\n");
+    // A server that says nothing more and closes nothing holds nobody who has nothing to say.
+    const std::string open = root_.Path("open");
+    EXPECT_EQ(run("mkfifo '" + open + "' && " + connect + " 2>&1 0<>'" + open + "'"),
+              "connect: nothing has moved for 1 s\n");
+}
+
 /// The same with ssh in between.
 class RsyncWrapperSshTest : public RsyncWrapperTest {
 protected:
@@ -520,6 +694,53 @@ TEST_F(RsyncWrapperSshTest, FailuresSayWhichEndRefusedAndWhatToDo) {
     EXPECT_EQ(Over(""), 10);
     EXPECT_THAT(report_.explanation, HasSubstr("no rsync daemon answers there on port " +
                                                std::to_string(daemon_.Port())));
+}
+
+TEST_F(RsyncWrapperSshTest, AKilledRunLeavesNoPasswordAndATrustedHostKeyIsTheOnlyOneTaken) {
+    UseKey(true);
+    AddToSource("file", "content");
+    const std::string module = daemon_.AddModule("open", "auth users =");
+    const pid_t run = fork();
+    if (run == 0) {
+        ServeCommands("cat > /dev/null; sleep 20");
+        Over(kPassphrase, command_);
+        _exit(0);
+    }
+    const std::string words = "UserKnownHostsFile=\"" + known_hosts_ + "\"" + '\0';
+    for (int i = 0; i < 100 && !Has(OtherProcesses(), words); ++i) {
+        usleep(50000);
+    }
+    usleep(300000);
+    kill(run, SIGKILL);
+    waitpid(run, nullptr, 0);
+    for (const auto& entry : fs::recursive_directory_iterator(root_.Path("tmp"))) {
+        EXPECT_FALSE(entry.is_regular_file() && Has(ReadFile(entry.path()), kPassphrase));
+    }
+
+    for (int i = 0; i < 100 && Has(OtherProcesses(), words); ++i) {
+        usleep(50000);
+    }
+    EXPECT_FALSE(Has(OtherProcesses(), words));
+
+    // Reached by a name, at a port that the file says.
+    fs::remove(known_hosts_);
+    const SshHostKey key = FetchHostKey("127.0.0.1", server_->Port(), "", 10);
+    EXPECT_EQ(FetchHostKey("127.0.0.1", server_->Port(), key.fingerprint, 10).key, key.key);
+    TrustServer({"nas", ServerTransport::SSH, server_->Port(), key.fingerprint}, key);
+    EXPECT_EQ(FindHostKey("NAS")->fingerprint, key.fingerprint);
+    EXPECT_FALSE(Has(ReadFile(known_hosts_), "127.0.0.1"));
+    RunOptions options;
+    options.server = "nas";
+    const auto to = [&](RsyncWrapper& wrapper) {
+        wrapper.setDestPath(server_->User(), "127.0.0.1", kPassphrase, "open", "");
+    };
+    EXPECT_EQ(Copy(to, options), 0) << report_.explanation << report_.details;
+    EXPECT_EQ(ReadFile(module + "/file"), "content");
+    server_->ChangeHostKey();
+    EXPECT_EQ(Copy(to, options), STATUS_AUTHENTICATION);
+    EXPECT_THAT(report_.explanation, HasSubstr("zelctl trust nas --ssh"));
+    EXPECT_TRUE(ForgetServer("nas"));
+    EXPECT_EQ(ReadFile(known_hosts_), "");
 }
 
 TEST_F(RsyncWrapperSshTest, APassphraseOpensADirectoryAndIsSeenNowhereAndACancelledRunLeavesNoSsh) {

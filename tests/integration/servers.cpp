@@ -71,6 +71,17 @@ Outcome RunProgram(const std::string& root, std::vector<std::string> command,
     return outcome;
 }
 
+bool Await(const std::function<bool()>& condition, int seconds) {
+    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
+    while (!condition()) {
+        if (std::chrono::steady_clock::now() > end) {
+            return false;
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    return true;
+}
+
 void Must(const Outcome& outcome) {
     if (outcome.exit_code != 0) {
         throw std::runtime_error(outcome.output);
@@ -117,6 +128,45 @@ int FreePort() {
     return ntohs(address.sin_port);
 }
 
+TricklingServer::TricklingServer(int port, const char* address, bool tls)
+    : listener_(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0)) {
+    sockaddr_in own = Loopback(port);
+    inet_pton(AF_INET, address, &own.sin_addr);
+    if (bind(listener_.Get(), reinterpret_cast<const sockaddr*>(&own), sizeof own) != 0 ||
+        listen(listener_.Get(), 64) != 0) {
+        throw std::runtime_error("cannot listen");
+    }
+    thread_ = std::thread([this, tls] {
+        // Lets everybody in, and has rsync print what it prints when a copy has begun.
+        const auto message = [](const std::string& text) {
+            return std::string{static_cast<char>(text.size()), 0, 0, 9} + text;
+        };
+        const std::string handshake("\x16\x03\x03\x40\0", 5);  // 16 KiB of it are to come
+        const std::string rsync_greeting = "@RSYNCD: 31.0 md5\n@RSYNCD: OK\n" +
+                                           std::string("\0seed", 5) +
+                                           message("sending incremental file list\n");
+        const std::string& greeting = tls ? handshake : rsync_greeting;
+        const std::string byte = message(".");
+        std::vector<base::UniqueFd> clients;
+        for (; !stop_; std::this_thread::sleep_for(milliseconds(50))) {
+            for (const base::UniqueFd& client : clients) {
+                send(client.Get(), byte.data(), byte.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
+            }
+            base::UniqueFd client(accept4(listener_.Get(), nullptr, nullptr, SOCK_CLOEXEC));
+            if (client) {
+                send(client.Get(), greeting.data(), greeting.size(), MSG_NOSIGNAL);
+                clients.push_back(std::move(client));
+                ++clients_;
+            }
+        }
+    });
+}
+
+TricklingServer::~TricklingServer() {
+    stop_ = true;
+    thread_.join();
+}
+
 RsyncDaemon::RsyncDaemon(const std::string& global_lines) : port_(FreePort()) {
     AddAccount(kUser, kPassword);
     const std::string configuration = folder_.Write(
@@ -149,6 +199,39 @@ void RsyncDaemon::AddCommandModule(const std::string& handler) {
     const std::string answers = folder_.Path("modules/zel_command");
     AddModule("zel_command",
               "read only = yes\nlist = no\nearly exec = ANSWERS='" + answers + "' exec " + handler);
+}
+
+TlsFront::TlsFront(int port_behind) : port_(FreePort()) {
+    const std::string tls =
+        ":" + std::to_string(port_) + " ssl crt " + folder_.Path("pem") + " ssl-min-ver TLSv1.3\n";
+    folder_.Write("front.conf",
+                  "defaults\n mode tcp\n timeout connect 5s\n timeout client 5s\n"
+                  " timeout server 1h\n timeout tunnel 1h\nlisten front\n bind 127.0.0.1" +
+                      tls + " bind ::1" + tls +
+                      " server behind 127.0.0.1:" + std::to_string(port_behind) + "\n");
+    Start();
+}
+
+void TlsFront::Start() {
+    const std::string key = folder_.Path("key");
+    const std::string certificate = folder_.Path("certificate");
+    Must(RunProgram(
+        "", {"openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt", "ec_paramgen_curve:P-256",
+             "-nodes", "-days", "1", "-subj", "/CN=front", "-keyout", key, "-out", certificate}));
+    folder_.Write("pem", ReadFile(key) + ReadFile(certificate));
+    const Outcome digest =
+        RunProgram("", {"sh", "-c",
+                        "openssl pkey -in '" + key +
+                            "' -pubout -outform der | openssl dgst -sha256 -binary | base64"});
+    Must(digest);
+    fingerprint_ = "SHA256:" + digest.output.substr(0, digest.output.find('='));
+    process_.Start({"haproxy", "-db", "-f", folder_.Path("front.conf")}, folder_.Path("log"),
+                   port_);
+}
+
+void TlsFront::ChangeKey() {
+    process_.Stop();
+    Start();
 }
 
 bool SshServer::Available() {

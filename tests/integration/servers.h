@@ -8,6 +8,7 @@
 #include <thread>
 #include <vector>
 
+#include "base/unique_fd.h"
 #include "tests/support/temp_root.h"
 
 namespace test {
@@ -23,6 +24,9 @@ constexpr char kSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bi
 Outcome RunProgram(const std::string& root, std::vector<std::string> command,
                    const std::string& input = "", const std::function<bool()>& cancelled = nullptr,
                    const std::string& path = kSearchPath);
+
+/// Whether `condition` became true within a time that even a busy machine needs not.
+bool Await(const std::function<bool()>& condition, int seconds = 60);
 
 /// Throws what the program said when it has failed.
 void Must(const Outcome& outcome);
@@ -49,6 +53,25 @@ private:
 
 /// A TCP port of 127.0.0.1 that nobody listens on.
 int FreePort();
+
+/// Looks like an rsync daemon, or like a server with TLS, and then sends a few bytes now and then
+/// for as long as somebody listens.
+class TricklingServer {
+public:
+    explicit TricklingServer(int port, const char* address = "127.0.0.1", bool tls = false);
+    ~TricklingServer();
+    TricklingServer(const TricklingServer&) = delete;
+    TricklingServer& operator=(const TricklingServer&) = delete;
+
+    /// How many it keeps waiting, or has.
+    int Clients() const { return clients_; }
+
+private:
+    base::UniqueFd listener_;
+    std::atomic<int> clients_{0};
+    std::atomic<bool> stop_{false};
+    std::thread thread_;
+};
 
 /// `rsync --daemon`. Configuration is read at each connection: modules may be added while it runs.
 class RsyncDaemon {
@@ -79,6 +102,28 @@ public:
 private:
     TempFolder folder_;
     int port_;
+    ServerProcess process_;
+};
+
+/// A TLS 1.3 proxy on 127.0.0.1 and ::1, in front of a port of loopback, with a key of its own.
+class TlsFront {
+public:
+    explicit TlsFront(int port_behind);
+
+    /// Makes another key and starts again on the same port: the server that answers is another one.
+    void ChangeKey();
+    void Stop() { process_.Stop(); }
+
+    int Port() const { return port_; }
+    /// Of its key, as openssl counts it.
+    std::string Fingerprint() const { return fingerprint_; }
+
+private:
+    void Start();
+
+    TempFolder folder_;
+    int port_;
+    std::string fingerprint_;
     ServerProcess process_;
 };
 

@@ -166,7 +166,7 @@ TEST_F(Tls, SetUpFailuresLeaveAPlainChannel) {
 
 TEST_F(Tls, HandshakesWithStrangersFail) {
     for (const bool server : {false, true}) {
-        test::RawPeer garbage, gone, silent;
+        test::RawPeer garbage, gone, silent, slow;
         garbage.Send("GET / HTTP/1.0\r\n\r\n");
         gone.Close();
         silent.channel.SetTimeout(1);
@@ -176,6 +176,18 @@ TEST_F(Tls, HandshakesWithStrangersFail) {
         EXPECT_EQ(garbage.channel.ConvertToSSLChannel(server), ZEL::RESULT_IO);
         EXPECT_EQ(gone.channel.ConvertToSSLChannel(server), ZEL::RESULT_IO);
         EXPECT_EQ(silent.channel.ConvertToSSLChannel(server), ZEL::RESULT_TIMEOUT);
+        slow.channel.SetTimeout(1);
+        std::thread trickle([&] {
+            slow.Send("\x16\x03\x01\x40");
+            // A byte of one long message from time to time.
+            for (int i = 0; i < 20 && send(slow.fd, "\x01", 1, MSG_NOSIGNAL) == 1; ++i) {
+                usleep(100'000);
+            }
+            slow.Close();
+        });
+        EXPECT_EQ(slow.channel.ConvertToSSLChannel(server), ZEL::RESULT_TIMEOUT);
+        slow.channel.Close();
+        trickle.join();
         EXPECT_THAT(log.Text(), AllOf(HasSubstr("SSLHandshake: SSL fatel error code: 1\n"),
                                       HasSubstr("timed out during connect (1 seconds), abort")));
     }

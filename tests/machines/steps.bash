@@ -56,11 +56,11 @@ commands_of() {
 
 # ---- Trees ----
 
-# tree MACHINE FOLDER: what is in it; files by their content.
+# tree MACHINE FOLDER: what is in it, but for the folder that the server has in each copy; files by their content.
 tree() {
     at "$1" bash -euo pipefail -c 'cd "$1"
         find . -type f -print0 | xargs -0 -r sha256sum -b
-        find . ! -type f -printf "%y %p %l\n"' -- "$2" | LC_ALL=C sort
+        find . ! -type f ! -path "./.zel_*" -printf "%y %p %l\n"' -- "$2" | LC_ALL=C sort
 }
 
 # same_tree CLIENT-FOLDER SERVER-FOLDER
@@ -92,7 +92,8 @@ active() { at "$1" systemctl is-active --quiet "$2"; }
 in_a_push() {
     until_true 30 at client zelctl task edit photos --bwlimit 4000  # when no run is under way
     random_file /srv/photos/large 24
-    until_true 20 at server bash -c 'du -m /srv/copies/photos/.large.* | grep -q "^[1-9]"'
+    until_true 20 at server bash -c 'find /proc/[0-9]*/fd -lname "/srv/copies/photos/.zel_partial/*/large.*" -printf "%l\n" |
+        xargs -r du -m | grep -q "^[1-9]"'
     fails in_step >/dev/null
 }
 

@@ -42,7 +42,7 @@ inline ZEL::PObject FullTask() {
                              {"name", "nightly"},
                              {"share_list", shares},
                              {"user", "lena"},
-                             {"pswd", "secret"},
+                             {"pswd", "secret words"},
                              {"server_ip", "10.0.0.5"},
                              {"server_name", "cellar"},
                              {"compress", true},

@@ -1,6 +1,5 @@
 #include "tests/support/temp_root.h"
 
-#include <sys/sem.h>
 #include <sys/stat.h>
 
 #include <cstdlib>
@@ -8,8 +7,6 @@
 #include <fstream>
 #include <sstream>
 #include <stdexcept>
-
-#include "tarq/root_path.h"
 
 namespace test {
 
@@ -47,11 +44,6 @@ TempRoot::TempRoot() {
 }
 
 TempRoot::~TempRoot() {
-    // Semaphores outlive their users; the registry's key is the root folder's own.
-    const int semaphore = semget(TARQ::RootSemaphoreKey(0x2980298), 0, 0);
-    if (semaphore >= 0) {
-        semctl(semaphore, 0, IPC_RMID);
-    }
     unsetenv("TARQ_ROOT");
 }
 

@@ -23,7 +23,7 @@ private:
 };
 
 /// A TempFolder that is the system's root (TARQ_ROOT) while it lives, with the folders that the
-/// system expects. Takes the registry's semaphore with it.
+/// system expects.
 class TempRoot : public TempFolder {
 public:
     TempRoot();

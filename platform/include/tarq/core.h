@@ -20,27 +20,24 @@ extern "C" {
 /* The error codes. What failed is in the code; where, in the position that is kept beside it. */
 enum TARQErrorCode {
     TARQ_ERR_NONE = 0,
-    TARQ_ERR_NO_MEMORY = 0x0200,  /* an allocation failed */
-    TARQ_ERR_OPEN_FILE = 0x0900,  /* a file cannot be opened; errno says why */
-    TARQ_ERR_READ_FILE = 0x0A00,  /* a file cannot be read; errno says why */
-    TARQ_ERR_WRITE_FILE = 0x0B00, /* a file cannot be written, flushed or renamed; errno says why */
-    TARQ_ERR_BAD_PARAMETER = 0x0D00, /* an argument is missing or could break a file's format */
-    TARQ_ERR_SEMAPHORE = 0x0E00,     /* a semaphore call failed; errno says why */
-    TARQ_ERR_NO_SHARE = 0x1400,      /* the catalogue has no share of that name */
-    TARQ_ERR_SHARE_VOLUME =
-        0x1A00, /* the share's volume is not mounted where it was when the share was added */
-    TARQ_ERR_SHARE_EXISTS = 0x1B00,  /* the catalogue has a share of that name already */
-    TARQ_ERR_SHARE_OVERLAP = 0x1C00, /* the folder holds, or lies in, another share's */
-    TARQ_ERR_SHARE_FOLDER =
-        0x1D00, /* the share's folder is not there or no folder; errno says why */
-    TARQ_ERR_SHARE_IDENTITY =
-        0x1E00, /* another folder, or one on another disk, stands where the share's was */
-    TARQ_ERR_NO_KEY = 0x2000,      /* the section has no such key */
-    TARQ_ERR_NO_SECTION = 0x2200,  /* the file has no such section */
-    TARQ_ERR_NO_VOLUME = 0x2300,   /* the path lies on no volume, or cannot be examined */
-    TARQ_ERR_LOOKUP = 0x3100,      /* the name service failed */
-    TARQ_ERR_SERVICE = 0xEA00,     /* the service manager refused or cannot be reached */
-    TARQ_ERR_SERVICE_BUSY = 0xEB00 /* the unit is being started already */
+    TARQ_ERR_NO_MEMORY = 0x0200,      /* an allocation failed */
+    TARQ_ERR_OPEN_FILE = 0x0900,      /* a file cannot be opened; see errno */
+    TARQ_ERR_READ_FILE = 0x0A00,      /* a file cannot be read; see errno */
+    TARQ_ERR_WRITE_FILE = 0x0B00,     /* a file cannot be written or renamed; see errno */
+    TARQ_ERR_BAD_PARAMETER = 0x0D00,  /* an argument is missing or could break a file's format */
+    TARQ_ERR_SEMAPHORE = 0x0E00,      /* a lock cannot be taken; see errno and the system log */
+    TARQ_ERR_NO_SHARE = 0x1400,       /* the catalogue has no share of that name */
+    TARQ_ERR_SHARE_VOLUME = 0x1A00,   /* the volume is not mounted where it was recorded */
+    TARQ_ERR_SHARE_EXISTS = 0x1B00,   /* the catalogue has a share of that name already */
+    TARQ_ERR_SHARE_OVERLAP = 0x1C00,  /* the folder contains, or is inside, another share's */
+    TARQ_ERR_SHARE_FOLDER = 0x1D00,   /* there is no such folder; see errno */
+    TARQ_ERR_SHARE_IDENTITY = 0x1E00, /* another folder is where the share's was recorded */
+    TARQ_ERR_NO_KEY = 0x2000,         /* the section has no such key */
+    TARQ_ERR_NO_SECTION = 0x2200,     /* the file has no such section */
+    TARQ_ERR_NO_VOLUME = 0x2300,      /* the path lies on no volume, or cannot be examined */
+    TARQ_ERR_LOOKUP = 0x3100,         /* the name service failed */
+    TARQ_ERR_SERVICE = 0xEA00,        /* the service manager refused or cannot be reached */
+    TARQ_ERR_SERVICE_BUSY = 0xEB00    /* the unit is being started already */
 };
 
 /* The calling thread's last error code; 0 when no operation has failed on it. A success leaves it
@@ -148,11 +145,13 @@ int KAPICFileEnumSection(const char* path, KAPICSzList into);
 
 /* ---- Semaphores: mutual exclusion between processes ---- */
 
-/* Opens, or makes, the machine's semaphore of that key. An id for the calls below, or negative on
- * failure. */
+/* Opens, or makes, the machine's semaphore of that key (1 or more): a lock file in /run/tarqcore,
+ * below the root folder, which only root or the root folder's owner can make, open and hold. An id
+ * for the calls below, or negative on failure. */
 int KAPICSemOpen(int key);
 /* Waits for the semaphore and takes it. The kernel gives it back when the holder dies. 0, or
- * negative on failure. */
+ * negative on failure: errno EWOULDBLOCK when it was not free within 20 seconds. The system log
+ * then names the file, and who holds it. */
 int KAPICSemLock(int id);
 /* Gives it back. 0, or negative on failure: errno EPERM when the process does not hold it. */
 int KAPICSemUnlock(int id);

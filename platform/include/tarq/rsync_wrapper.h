@@ -9,7 +9,9 @@
 #include <functional>
 #include <list>
 #include <memory>
+#include <optional>
 #include <string>
+#include <vector>
 
 namespace TARQ {
 namespace Backup {
@@ -45,6 +47,13 @@ struct RunChange {
     Kind kind = OTHER;
     std::string path;  ///< relative to the source, bytes as they are on disk; a folder ends in "/"
     uint64_t length = 0;  ///< size of the file in bytes, for SEND
+    /// With RunOptions::by_content, for SEND: size and time are the same at both ends, and the
+    /// bytes are not. One of the two is damaged.
+    bool damaged = false;
+    bool is_new = false;  ///< the destination has nothing of that name; not told in a listing
+    /// In a listing alone: the time of modification on this machine's clock, as the number
+    /// 20261231235959.
+    uint64_t time = 0;
 };
 
 /// Why a run failed, where callers act on it; the explanation is for people.
@@ -52,34 +61,105 @@ enum class RunCause {
     NONE,               ///< it did not fail, or for a reason of no name here
     UNKNOWN_MODULE,     ///< the server's daemon has no module of that name
     UNREADABLE_SOURCE,  ///< something of the source cannot be read; the rest was copied
-    BUSY_SOURCE  ///< only what changed while it was read is missing: another run may find it at
-                 ///< rest
+    BUSY_SOURCE,  ///< only what changed while it was read is missing: another run may find it at
+                  ///< rest
+    NO_NAMED_DELETIONS,  ///< the server's rsync cannot take RunOptions::deletes_changes: nothing
+                         ///< was done
+    NO_LISTED_CHANGES,   ///< the server is of an earlier version and takes neither that nor
+                         ///< RunOptions::shallow: nothing was done
+    NOT_STARTED  ///< the server does not start RunOptions::start as it stands there: nothing
+                 ///< was done
 };
 
 /// What a finished run came to.
 struct RunReport {
     int status = -1;  ///< what execute() returned; -1 until then
     RunCause cause = RunCause::NONE;
+    bool begun = false;        ///< the server has let a copy in: it may have changed something
     std::string explanation;   ///< why it failed, in one sentence for a person; empty after success
     std::string details;       ///< what rsync and ssh wrote about it, line by line; may be empty
     uint64_t files_total = 0;  ///< files, folders and links looked at
-    uint64_t files_sent = 0;   ///< regular files whose content travelled
+    uint64_t files_regular = 0;   ///< regular files among them
+    uint64_t folders_total = 0;   ///< folders among them
+    uint64_t files_sent = 0;      ///< regular files whose content travelled
     uint64_t files_deleted = 0;   ///< entries deleted at the destination
     uint64_t bytes_total = 0;     ///< size of all files looked at
     uint64_t bytes_sent = 0;      ///< bytes that this side wrote to the connection
     uint64_t bytes_received = 0;  ///< bytes that this side read from it
+    /// With UNREADABLE_SOURCE and BUSY_SOURCE: what could not be copied, relative to the source. Of
+    /// many complaints not all are kept, see `all_incomplete`.
+    std::vector<std::string> incomplete;
+    bool all_incomplete = false;  ///< `incomplete` names each of them
+};
+
+/// A copy the other way round: what setDestPath() names at the server comes into the folder of
+/// setSrcPath(), which has to be there. Nothing in it is deleted, whatever setDelete() says. As
+/// root owners and devices come back; another user's files are his own, without set-user-ID bits.
+struct PullOptions {
+    bool keep_existing = true;  ///< what is there under a name stays as it is
+    /// These alone, relative to the module, each with all that is below it, and the folders above
+    /// them. The attributes of the folder that they come into stay as they are then. Empty: all,
+    /// and the folder gets the attributes of the module's.
+    std::vector<std::string> paths;
 };
 
 /// What a run does beside its settings. Every member may stay as it is.
 struct RunOptions {
     unsigned int bandwidth_limit = 0;  ///< KiB a second; 0: no limit
+    bool keep_missing = false;         ///< copies only: delete nothing, whatever setDelete() says
     bool dry_run = false;              ///< copies only: change nothing at the destination
+    bool by_content = false;           ///< copies only: every file is read at both ends, and one
+                                       ///< is sent when its bytes differ. A large file is read
+                                       ///< in silence, so that the time-out is a day
+    /// Copies to the server only: the open folder whose content is copied, whatever the path of
+    /// setSrcPath() leads to by then; that path names it to people. -1: none, the path counts.
+    int source_folder = -1;
+    /// Copies to the server only: these files of the source alone, relative to it. Nothing is
+    /// deleted. Empty: all.
+    std::vector<std::string> files;
+    /// Copies to the server only: these paths of the source alone, relative to it; "" is its top. A
+    /// file or link is sent, a folder with all that is below it: what setDelete() says holds there
+    /// and nowhere else. The folders above them, the top included, get their attributes. None may
+    /// be below another. Empty: all.
+    std::vector<std::string> changes;
+    /// With `changes`: those that are not at the source are deleted at the destination, unless a
+    /// rule excludes them. Otherwise they are left out.
+    bool deletes_changes = false;
+    /// With `changes`, which are folders then: each is compared by its own entries. Of a folder in
+    /// it nothing below is sent, and nothing is deleted unless that folder itself is gone.
+    bool shallow = false;
+    /// rsync gives way to all else on this machine: idle priority of its reading, the least of the
+    /// processor. One that reads for `by_content` does so at the server, too.
+    bool background = false;
+    /// Commands only: for one that may take the server longer than `answer_seconds` of the
+    /// configuration. 0: that.
+    unsigned int answer_seconds = 0;
+    /// Copies into a module of a daemon that keeps versions: what the run replaces or deletes is
+    /// moved to a folder of its own below kVersionsFolder, from where the server takes it. An entry
+    /// of that name at the root of the copy is neither sent nor deleted. A server of an earlier
+    /// version, which refuses such runs, gets the copy without, and the system log says so once.
+    /// What a run that breaks has of a file stays below kPartialsFolder, another reserved name.
+    bool keep_versions = false;
+    /// With `keep_versions`: goes on with the half file that the server has offered.
+    bool resume = false;
+    /// With `keep_versions`: the lines of a command that starts a push and says exactly which copy
+    /// it expects. The run goes to kPushModule, where it is the whole push, with its start and its
+    /// end: or fails at once, with the cause NOT_STARTED or, at a server that has no such module,
+    /// UNKNOWN_MODULE, of which logError() says nothing. Empty: a run within a push.
+    std::list<std::string> start;
+    std::string module;  ///< copies only: this module of the daemon in the place of setDestPath's;
+                         ///< empty: that one
     std::function<void(const RunProgress&)>
         on_progress;  ///< called on the running thread, at least once a second and at most five
                       ///< times
     std::function<void(const RunChange&)>
         on_change;                ///< called on the running thread, in rsync's order
     RunReport* report = nullptr;  ///< filled when the run ends; the caller's
+    /// The server as a person wrote it, where setDestPath() has an address that the name was
+    /// resolved to: what is trusted, tarq/rsync_servers.h, is the server of that name. Empty: the
+    /// host of setDestPath().
+    std::string server;
+    std::optional<PullOptions> pull;  ///< copies only: the other way
 };
 
 /// Statuses that execute() returns by itself; all others are rsync's exit codes or the server's
@@ -103,6 +183,23 @@ enum WrapperStatus : int {
 
 /// The rsync daemon's module that takes server commands.
 constexpr const char kCommandModule[] = "zel_command";
+
+/// The rsync daemon's module in which a push starts, sends and ends on one connection: see
+/// RunOptions::start. Its name is no share's.
+constexpr const char kPushModule[] = ".zel_push";
+
+/// The reserved name at the root of each module below which copies leave versions.
+constexpr const char kVersionsFolder[] = ".zel_versions";
+
+/// The reserved name at the root of each module below which copies write files until they are
+/// complete.
+constexpr const char kPartialsFolder[] = ".zel_partial";
+
+/// The names at the root of each module that are the service's own. No run sends or deletes them.
+constexpr const char* kReservedNames[] = {kVersionsFolder, kPartialsFolder};
+
+/// In the folder of a file that a run goes on with, the folder of what there is of it already.
+constexpr const char kResumedFolder[] = ".tarqrsync-partial";
 
 /// The longest command, its session line included, that rsync carries to the server's handler, in
 /// bytes.

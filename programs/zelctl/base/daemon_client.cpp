@@ -2,15 +2,16 @@
 
 #include <sys/socket.h>
 #include <sys/time.h>
-#include <sys/un.h>
 
 #include <cerrno>
 #include <cstring>
 
 #include "ZEL/stream.h"
 #include "base/unique_fd.h"
+#include "base/unix_socket.h"
 #include "programs/common/failure.h"
 #include "programs/common/text.h"
+#include "programs/common/wire_text.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "tarq/root_path.h"
 
@@ -23,29 +24,8 @@ using programs::FailureKind;
 
 constexpr char kSocket[] = "/var/run/zel_daemon.sock";
 constexpr unsigned int kRingBytes = 81920;
-constexpr size_t kMaxString = 65535;  // a string's length has 16 bits on the wire
-// A daemon that hangs with a full queue of connections would keep connect() waiting for ever.
+// Without a limit, connect() blocks forever when the daemon hangs and its backlog is full.
 constexpr timeval kConnectLimit = {10, 0};
-
-// The key under which a string is too long for the wire; empty when none is.
-std::string TooLong(const ZEL::PObject& value, const std::string& key) {
-    if (value.isString() && value.asString().size() > kMaxString) {
-        return key;
-    }
-    for (const ZEL::PObject& element : value.asArray()) {
-        std::string found = TooLong(element, key);
-        if (!found.empty()) {
-            return found;
-        }
-    }
-    for (const auto& [name, element] : value.asMap()) {
-        std::string found = TooLong(element, name);
-        if (!found.empty()) {
-            return found;
-        }
-    }
-    return "";
-}
 
 }  // namespace
 
@@ -84,20 +64,18 @@ Failure DaemonConnection::CannotConnect(const std::string& path, int error) {
 
 void DaemonConnection::Connect() {
     const std::string path = DaemonSocket();
-    sockaddr_un address = {};
-    address.sun_family = AF_UNIX;
-    if (path.size() >= sizeof address.sun_path) {
+    const auto address = base::UnixAddress::Of(path);
+    if (!address) {
         throw CannotConnect(path, ENAMETOOLONG);
     }
-    memcpy(address.sun_path, path.data(), path.size());
     base::UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     if (!fd ||
         setsockopt(fd.Get(), SOL_SOCKET, SO_SNDTIMEO, &kConnectLimit, sizeof kConnectLimit) != 0 ||
-        connect(fd.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
+        connect(fd.Get(), address->Get(), address->Size()) != 0 ||
         channel_.Open(fd.Get(), true) != ZEL::RESULT_SUCCESS) {
         throw CannotConnect(path, errno);
     }
-    fd.Release();  // the channel's now
+    fd.Release();  // the channel owns it now
 }
 
 Failure DaemonConnection::Lost() {
@@ -110,7 +88,7 @@ Failure DaemonConnection::Lost() {
 }
 
 void DaemonConnection::Send(const ZEL::PObject& request) {
-    const std::string key = TooLong(request, "request");
+    const std::string key = programs::KeyOfTooLong(request, "request");
     if (!key.empty()) {
         throw Failure(FailureKind::kUsage,
                       programs::Printable("the value for '" + key +

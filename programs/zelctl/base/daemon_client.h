@@ -1,4 +1,4 @@
-// Talking to the daemon: requests and replies of docs/daemon-protocol.md.
+// Client of the daemon: requests and replies as in docs/daemon-protocol.md.
 #pragma once
 
 #include <optional>
@@ -12,25 +12,25 @@ namespace zelctl {
 
 /// Why the daemon cannot be asked.
 enum class DaemonFault {
-    kNone,          ///< it can, or it has refused a request
+    kNone,          ///< it can be asked, or it has refused the request
     kNotRunning,    ///< nobody listens
-    kNotPermitted,  ///< this user may not ask
-    kSilent,        ///< it listens, and does not answer or breaks off
+    kNotPermitted,  ///< this user has no access
+    kSilent,        ///< it listens, but does not answer or closes the connection
     kOther
 };
 
-/// A connection to the daemon. Once an operation has thrown Failure, it is only good for Fault().
-/// The text is printable, and empty when an interrupt, noted by WatchForInterrupt(), ended a wait
-/// (kCancelled).
+/// A connection to the daemon. After an operation has thrown Failure, only Fault() may be called.
+/// The text of the failure is printable; it is empty when a signal that WatchForInterrupt() noted
+/// ended the wait (kCancelled).
 ///
-/// Threads: one thread.
+/// Threads: for use by one thread.
 class DaemonConnection {
 public:
     DaemonConnection();
 
     void Connect();
     void Send(const ZEL::PObject& request);
-    /// The next reply. An error reply is a failure.
+    /// The next reply. Throws Failure for an error reply.
     ZEL::PObject Receive();
 
     DaemonFault Fault() const { return fault_; }
@@ -43,15 +43,15 @@ private:
     ZEL::Channel channel_;
 };
 
-/// One request and its reply, on a connection of its own. Throws Failure as that does.
+/// Sends one request on a connection of its own, and returns the reply. Throws Failure likewise.
 ZEL::PObject AskDaemon(const ZEL::PObject& request);
-/// The same of a daemon that need not be there: nothing when it cannot be asked, or refuses.
+/// The same for an optional daemon: nothing when it cannot be asked or refuses.
 std::optional<ZEL::PObject> TryToAskDaemon(const ZEL::PObject& request);
 
 /// A request about one task.
 ZEL::PObject TaskRequest(const char* command, const std::string& task);
 
-/// The daemon's socket, below the root folder when there is one.
+/// The daemon's socket, below the root folder if there is one.
 std::string DaemonSocket();
 
 }  // namespace zelctl

@@ -9,7 +9,7 @@ namespace zelctl {
 namespace {
 
 std::atomic<bool> interrupted{false};
-int interrupt_flag = 0;  // the same for those who take it as an abort flag; accessed atomically
+int interrupt_flag = 0;  // the same as an abort flag for channels; accessed atomically
 static_assert(std::atomic<bool>::is_always_lock_free, "set in a signal handler");
 
 extern "C" void Note(int) {
@@ -22,11 +22,17 @@ extern "C" void Note(int) {
 void WatchForInterrupt() {
     struct sigaction action = {};
     action.sa_handler = Note;
-    // The default comes back after the first: a person who insists is obeyed.
+    // The default action is restored after the first signal, so that a second one ends the program.
     action.sa_flags = static_cast<int>(SA_RESETHAND);
     sigemptyset(&action.sa_mask);
     for (const int number : {SIGINT, SIGTERM, SIGHUP}) {
         sigaction(number, &action, nullptr);
+    }
+}
+
+void StopWatchingForInterrupt() {
+    for (const int number : {SIGINT, SIGTERM, SIGHUP}) {
+        signal(number, SIG_DFL);
     }
 }
 

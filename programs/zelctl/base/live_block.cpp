@@ -26,8 +26,8 @@ WindowSize GetWindowSize() {
     return size;
 }
 
-// A line that is wider than it was counted (a terminal gives some characters two columns) must not
-// take a second row.
+// A line may be wider than calculated (some terminals show certain characters in two columns).
+// Without automatic wrapping it still takes only one row.
 constexpr char kNoWrap[] = "\033[?7l";
 constexpr char kWrap[] = "\033[?7h";
 constexpr char kHideCursor[] = "\033[?25l";
@@ -54,7 +54,7 @@ size_t LiveBlock::Columns() {
 
 void LiveBlock::Draw(const std::vector<std::string>& lines) {
     const WindowSize window = GetWindowSize();
-    const size_t room = window.rows - 1;  // the cursor's own row
+    const size_t room = window.rows - 1;  // one row is left for the cursor
     const size_t shown = lines.size() <= room ? lines.size() : room - (room > 0 ? 1 : 0);
     std::string text = hidden_ ? "" : kHideCursor;
     hidden_ = true;

@@ -6,10 +6,10 @@
 
 namespace zelctl {
 
-/// A block of lines at the bottom of what has been written to a terminal. It never grows taller
-/// than the window: what does not fit is counted in its last line.
+/// A block of lines at the end of the terminal output that is redrawn in place. It never gets
+/// taller than the window: lines that do not fit are counted in its last line.
 ///
-/// Only for a standard output that is a terminal. Destroyed, it leaves its last lines standing.
+/// Only for standard output on a terminal. The destructor leaves the last lines on the screen.
 class LiveBlock {
 public:
     LiveBlock() = default;
@@ -19,17 +19,17 @@ public:
 
     /// Whether standard output is a terminal.
     static bool Possible();
-    /// The width of its window.
+    /// The width of the terminal window.
     static size_t Columns();
 
-    /// Shows these lines, which must be printable, in place of those of before.
+    /// Replaces the lines shown before by these, which must be printable.
     void Draw(const std::vector<std::string>& lines);
-    /// Takes the lines away, before others are written.
+    /// Removes the lines, so that other output can be written.
     void Clear();
 
 private:
-    size_t drawn_ = 0;     // lines that stand
-    bool hidden_ = false;  // the cursor
+    size_t drawn_ = 0;     // lines on the screen
+    bool hidden_ = false;  // whether the cursor is hidden
 };
 
 /// The first columns of `text`.

@@ -2,8 +2,8 @@
 
 namespace zelctl {
 
-/// Makes the folders that the library expects of its host and no package may have made: for the
-/// configuration, and for scratch files, which must be nobody else's to change.
+/// Creates the folders that the library expects but a package may not have created: for the
+/// configuration, and for temporary files, which no other user may be able to change.
 void PrepareHost();
 
 }  // namespace zelctl

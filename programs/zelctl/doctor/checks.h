@@ -17,38 +17,38 @@ namespace zelctl {
 enum class Severity { kOk, kWarning, kFailed };
 
 struct Finding {
-    std::string name;  ///< of what was looked at
+    std::string name;  ///< of the checked item
     Severity severity;
     std::string finding;
-    std::string remedy;  ///< empty when all is well
+    std::string remedy;  ///< empty when there is no problem
 };
 
 using Findings = std::vector<Finding>;
 
-/// A task as the daemon tells it.
+/// A task as reported by the daemon.
 struct PatientTask {
     ZEL::SyncTask record;
     ZEL::PObject state;  ///< the daemon's map
 };
 
-/// What the checks look at, gathered once.
+/// Input of the checks, collected once.
 struct Patient {
     bool daemon_answers = false;
-    std::string daemon_error;  ///< why it does not
+    std::string daemon_error;  ///< why the daemon cannot be asked
     DaemonFault daemon_fault = DaemonFault::kNone;
     ZEL::PObject daemon;             ///< the reply to daemon_status
     std::vector<PatientTask> tasks;  ///< the daemon's; none when it does not answer
-    bool has_passwords = false;      ///< the tasks have them
+    bool has_passwords = false;      ///< whether the tasks include their passwords
     std::string no_passwords;        ///< why they do not
-    std::set<std::string> cut_off;   ///< tasks whose server CheckServers() has not reached
-    /// Shares of the catalogue, and those that tasks name, with the tasks' names.
+    std::set<std::string> cut_off;   ///< tasks whose server CheckServers() could not reach
+    /// Shares of the catalogue and shares that tasks refer to, with the names of these tasks.
     std::map<std::string, std::set<std::string>> shares;
     std::string catalogue_error;  ///< why the catalogue cannot be read; empty when it can
 
     bool UsesSSH() const;
 };
 
-// Each adds what it finds.
+// Each check appends its findings.
 
 void CheckRsync(const Patient& patient, Findings& findings);
 void CheckSSH(const Patient& patient, Findings& findings);
@@ -56,9 +56,9 @@ void CheckClock(const Patient& patient, Findings& findings);
 void CheckWatches(const Patient& patient, Findings& findings);
 void CheckSpace(const Patient& patient, Findings& findings);
 void CheckCatalogue(const Patient& patient, Findings& findings);
-/// Gives the tasks whose server is not reached.
+/// Returns the tasks whose server could not be reached.
 std::set<std::string> CheckServers(const Patient& patient, Findings& findings);
-/// After CheckServers(): servers that are not reached are not asked.
+/// Call it after CheckServers(): unreachable servers are not asked.
 void CheckTasks(const Patient& patient, Findings& findings);
 void CheckConfiguration(const Patient& patient, Findings& findings);
 void CheckStore(const Patient& patient, Findings& findings);
@@ -69,14 +69,14 @@ void CheckDaemon(const Patient& patient, Findings& findings);
 /// "task a", "tasks a, b", or how many they are
 std::string TasksInWords(const std::set<std::string>& names);
 
-/// How rsync and ssh are run here; as by default when the file that says so is faulty.
+/// The settings for rsync and ssh; the defaults when their configuration file is faulty.
 base::RsyncConfig RsyncSettings();
 
 /// Where the daemon keeps its tasks.
 std::string StorePath(const Patient& patient);
 
-/// Whether the text of `rsync --version` tells of one that can do what is asked of it; `version`:
-/// as it calls itself.
+/// Whether the output of `rsync --version` is that of a version with all required features.
+/// `version`: set to the version it reports.
 bool IsUsableRsync(const std::string& text, std::string& version);
 
 }  // namespace zelctl

@@ -25,8 +25,9 @@ constexpr char kUnit[] = "zel_daemon";
 constexpr char kStore[] = "/usr/tarq/etc/zel_daemon/tasks.db";
 constexpr int kProtocol = 1;
 
-// What is wrong with the database file, by its head and its size; empty when nothing is, or it is
-// not there. What is still beside it is not in it: then only the head counts.
+// What is wrong with the database file, judged by its header and size; empty when nothing is, or
+// when there is no file. With a write-ahead log beside it the size may differ, so only the header
+// is checked.
 std::string FaultOfStore(const std::string& path) {
     constexpr char kMagic[] = "SQLite format 3";
     constexpr size_t kHead = 100;
@@ -38,7 +39,7 @@ std::string FaultOfStore(const std::string& path) {
     unsigned char head[kHead] = {};
     file.read(reinterpret_cast<char*>(head), sizeof head);
     if (!file.is_open()) {
-        return "";  // the check of the files tells
+        return "";  // reported by the check of the files
     }
     if (info.st_size == 0) {
         return "is empty: its content is lost";
@@ -59,7 +60,7 @@ std::string FaultOfStore(const std::string& path) {
                : "";
 }
 
-// The last error that the daemon has logged since it was started last; empty when it is not known.
+// The last error that the daemon has logged since its last start; empty when unknown.
 std::string LastWordsOfDaemon(const Patient& patient) {
     if (!TARQ::RootFolder().empty() || patient.daemon_fault == DaemonFault::kNotPermitted) {
         return "";

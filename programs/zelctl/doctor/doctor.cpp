@@ -5,10 +5,12 @@
 
 #include "programs/common/failure.h"
 #include "programs/common/table.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
 #include "programs/zelctl/doctor/checks.h"
 #include "tarq/owners.h"
+#include "tarq/rsync_servers.h"
 
 namespace zelctl {
 
@@ -18,7 +20,7 @@ using programs::Printable;
 
 constexpr size_t kNamesShown = 3;
 
-// In the order of what depends on what.
+// In the order of their dependencies.
 constexpr void (*kChecks[])(const Patient&, Findings&) = {
     CheckRsync, CheckSSH,     CheckClock, CheckConfiguration, CheckCatalogue, CheckFiles,
     CheckSpace, CheckWatches, CheckStore, CheckUnit,          CheckDaemon};
@@ -34,7 +36,7 @@ const char* Word(Severity severity) {
     }
 }
 
-// The tasks, with their passwords when this user may see them.
+// The tasks, with their passwords when this user may read them.
 ZEL::PObject GetTasks(Patient& patient) {
     ZEL::PObject request;
     request["command"] = "task_list";
@@ -113,7 +115,13 @@ void PrintForPeople(const Findings& findings) {
 
 bool Patient::UsesSSH() const {
     return std::any_of(tasks.begin(), tasks.end(), [](const PatientTask& task) {
-        return task.record.GetInfo().GetSyncInfo().UseSSH();
+        const ZEL::SyncInfo& info = task.record.GetInfo().GetSyncInfo();
+        try {
+            const auto known = TARQ::Backup::FindServer(programs::ServerOf(info));
+            return known ? known->transport == TARQ::Backup::ServerTransport::SSH : info.UseSSH();
+        } catch (const TARQ::Backup::ServersError&) {
+            return info.UseSSH();  // reported by the check of the servers
+        }
     });
 }
 

@@ -1,9 +1,9 @@
-// Looks at all that a push needs, and says how to mend what is wrong.
+// Checks everything that a push needs, and says how to solve the problems found.
 #pragma once
 
 namespace zelctl {
 
-/// Prints what it finds; fails (kLocal) when anything of it has failed.
+/// Prints the findings; throws Failure (kLocal) when one of them is a failure.
 void Doctor(bool as_json);
 
 }  // namespace zelctl

@@ -26,8 +26,8 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr char kNeededRsync[] = "3.2.1";        // carries commands to the server's handler
-constexpr int64_t kFirstSaneTime = 1704067200;  // 2024: a clock before it has lost its battery
+constexpr char kNeededRsync[] = "3.2.1";        // needed to pass commands to the server's handler
+constexpr int64_t kFirstSaneTime = 1704067200;  // 2024: an earlier clock was reset
 constexpr uint64_t kLittleSpace = uint64_t{256} << 20;
 constexpr uint64_t kNoSpace = uint64_t{16} << 20;
 constexpr uint64_t kFewInodes = 1000;
@@ -37,13 +37,13 @@ void AddFact(Findings& findings, const std::string& name, const std::string& fin
     findings.push_back({name, Severity::kOk, finding, ""});
 }
 
-/// A number of /proc/sys; 0 when it cannot be read.
+/// A number from /proc/sys; 0 when it cannot be read.
 uint64_t KernelNumber(const std::string& path) {
     const auto text = base::ReadFile(path, 64);
     return text ? base::ParseNumber(text->substr(0, text->find('\n')), UINT64_MAX).value_or(0) : 0;
 }
 
-// Folders below `folder`, itself included, up to `limit`.
+// The number of folders in the tree of `folder`, itself included, but no more than `limit`.
 uint64_t CountFolders(const std::string& folder, uint64_t limit) {
     uint64_t count = 1;
     std::error_code error;
@@ -162,7 +162,7 @@ void CheckWatches(const Patient& patient, Findings& findings) {
     const std::string counted = programs::Count(folders, "folder") +
                                 (patient.daemon_answers ? " watched" : " in all shares") +
                                 ", at most " + std::to_string(limit);
-    // The kernel keeps some for others, and folders come faster than people look.
+    // Others use watches too, and new folders can appear quickly: warn at 90 %.
     if (folders >= limit - limit / 10) {
         findings.push_back(
             {"watches", folders >= limit ? Severity::kFailed : Severity::kWarning, counted,
@@ -185,7 +185,7 @@ void CheckSpace(const Patient& patient, Findings& findings) {
         const std::string name = "space in " + folder;
         struct statvfs info = {};
         if (statvfs(folder.c_str(), &info) != 0) {
-            // The daemon makes the store's folder when it starts first.
+            // The daemon creates the store's folder when it is first started.
             const bool missing = errno == ENOENT;
             findings.push_back({name, missing ? Severity::kWarning : Severity::kFailed,
                                 strerror(errno),
@@ -194,7 +194,7 @@ void CheckSpace(const Patient& patient, Findings& findings) {
             continue;
         }
         const uint64_t free = uint64_t{info.f_bavail} * info.f_frsize;
-        // A file system without a fixed number of inodes says 0.
+        // File systems without a fixed number of inodes report 0.
         const bool few_inodes = info.f_files != 0 && info.f_favail < kFewInodes;
         const std::string finding =
             programs::HumanBytes(free) + " free" +

@@ -44,7 +44,7 @@ std::string RemedyOfShare(const std::string& name) {
     }
 }
 
-// What is wrong with the owner and the mode of a file that is there; empty when nothing is.
+// What is wrong with a file's owner and mode; empty when nothing is.
 std::string FaultOfFile(const struct stat& info, mode_t forbidden) {
     if (info.st_uid != 0 && info.st_uid != geteuid()) {
         return "belongs to user " + std::to_string(info.st_uid);
@@ -57,7 +57,7 @@ std::string FaultOfFile(const struct stat& info, mode_t forbidden) {
     return "";
 }
 
-// A file that others must not write, or, when it is secret, not even read.
+// Checks a file that others must not write or, if it is secret, must not read either.
 void CheckFile(const std::string& path, bool secret, size_t& looked_at, Findings& findings) {
     struct stat info = {};
     if (stat(path.c_str(), &info) != 0) {
@@ -78,7 +78,7 @@ void CheckFile(const std::string& path, bool secret, size_t& looked_at, Findings
     }
 }
 
-// The files with keys of an encrypted share.
+// The key files of an encrypted share.
 std::vector<std::string> KeyFiles(const std::string& name) {
     TARQShare record = nullptr;
     const int found = TARQShareGet(name.c_str(), &record);
@@ -113,7 +113,7 @@ void CheckCatalogue(const Patient& patient, Findings& findings) {
         if (fault.empty()) {
             findings.push_back({"share " + name, Severity::kOk, "ready" + users, ""});
         } else {
-            // One that no task sends hurts nobody yet.
+            // A share that no task uses does no harm yet.
             findings.push_back({"share " + name,
                                 tasks.empty() ? Severity::kWarning : Severity::kFailed,
                                 fault + users, RemedyOfShare(name)});
@@ -133,7 +133,7 @@ void CheckFiles(const Patient& patient, Findings& findings) {
     }
     const std::string store = StorePath(patient);
     CheckFile(fs::path(store).parent_path(), true, looked_at, findings);
-    // SQLite keeps what is not yet in the file itself beside it.
+    // SQLite keeps recent changes in files beside the database.
     for (const char* suffix : {"", "-wal", "-shm"}) {
         CheckFile(store + suffix, true, looked_at, findings);
     }

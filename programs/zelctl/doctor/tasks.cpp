@@ -1,4 +1,4 @@
-// The doctor's checks of tasks: would the server take them, are their folders watched, did their
+// The doctor's checks of tasks: would the server accept them, are their folders watched, did their
 // last run fail.
 #include <algorithm>
 #include <atomic>
@@ -20,7 +20,7 @@ namespace zelctl {
 namespace {
 
 using ZEL::PObject;
-/// Why a server does not take a task's shares; none when it does.
+/// Why a server does not accept a task's shares; nothing when it does.
 using Refusal = std::optional<programs::RunFailure>;
 
 constexpr std::chrono::seconds kPatience(15);
@@ -31,8 +31,9 @@ std::string ServerKey(const ZEL::SyncInfo& info) {
            std::to_string(info.UseSSH() ? info.GetSSHPort() : 0);
 }
 
-/// Asks the servers of many tasks, some at a time. One that has let a task wait in vain is not
-/// asked for the others: a thousand tasks of a dead server take no longer than a few.
+/// Asks the servers of many tasks, several at the same time. When a server has timed out for one
+/// task, it is not asked for the others: so a thousand tasks of a dead server take no longer than a
+/// few.
 class ServerQuestions {
 public:
     explicit ServerQuestions(const std::vector<const PatientTask*>& tasks)
@@ -46,7 +47,7 @@ public:
                 askers.emplace_back([this] { Ask(); });
             }
         } catch (const std::system_error&) {
-            // Those that there are do it all.
+            // The threads that could be started do all the work.
         }
         if (askers.empty()) {
             Ask();
@@ -58,7 +59,7 @@ public:
 
     /// In the order of the tasks.
     const Refusal& Answer(size_t task) const { return answers_[task]; }
-    /// Its server was silent for another task.
+    /// Not asked, as its server has timed out for another task.
     bool Skipped(size_t task) const { return skipped_[task]; }
 
 private:
@@ -81,7 +82,7 @@ private:
     const std::vector<const PatientTask*>& tasks_;
     std::atomic<size_t> next_{0};
     std::vector<Refusal> answers_;
-    std::vector<char> skipped_;  // one byte each: threads write side by side
+    std::vector<char> skipped_;  // not vector<bool>: threads write neighbouring elements
     std::map<std::string, std::atomic<bool>> silent_;
 };
 
@@ -89,7 +90,7 @@ std::string Quoted(const std::string& name) {
     return "'" + name + "'";
 }
 
-// What to do about a server's refusal, where its own words do not say.
+// How to solve a refusal by the server, where its error text does not say it.
 std::string RemedyOfRefusal(int status, const PatientTask& task) {
     const ZEL::TaskInfo& info = task.record.GetInfo();
     switch (status) {
@@ -135,6 +136,13 @@ void CheckWatch(const PatientTask& task, Findings& found) {
 
 void CheckLastRun(const PatientTask& task, Findings& found) {
     const PObject& state = task.state;
+    if (state["last_status"].asInt32() == programs::kNotConfirmed) {
+        const std::string name = Quoted(task.record.GetInfo().GetName());
+        found.push_back({"", Severity::kFailed, programs::OneLine(state["last_error"].asString()),
+                         "zelctl task show " + name + " lists it; zelctl task confirm " + name +
+                             " lets it go once"});
+        return;
+    }
     if (state["sync_result"].asInt32() != ZEL::TASK_RESULT_FAILED) {
         return;
     }
@@ -149,10 +157,31 @@ void CheckLastRun(const PatientTask& task, Findings& found) {
                      retry});
 }
 
-// What else the daemon has to say, as far as the watch has not said it.
+void CheckVerification(const PatientTask& task, Findings& found) {
+    const std::string name = Quoted(task.record.GetInfo().GetName());
+    if (const uint64_t damaged = task.state["damaged"].asUInt64()) {
+        found.push_back({"", Severity::kFailed,
+                         programs::Count(damaged, "file") +
+                             " with other bytes at the two ends under the same size and time",
+                         "zelctl task show " + name +
+                             " lists them; where the server's is the right one: zelctl restore " +
+                             name});
+    }
+    const std::string problem = task.state["verify_problem"].asString();
+    if (!problem.empty()) {
+        found.push_back({"", Severity::kWarning,
+                         "its copies are not verified: " + programs::OneLine(problem),
+                         "it is tried again; --verify off does without"});
+    }
+}
+
+// The daemon's note about the task, unless it was reported already: a problem with the watch, or
+// what the last run asked.
 void CheckNote(const PatientTask& task, Findings& found) {
     const std::string note = task.state["note"].asString();
-    if (!note.empty() && note != task.state["watch_problem"].asString()) {
+    const bool asks = task.state["last_status"].asInt32() == programs::kNotConfirmed;
+    const bool damaged = task.state["damaged"].asUInt64() != 0;
+    if (!note.empty() && !asks && !damaged && note != task.state["watch_problem"].asString()) {
         found.push_back({"", Severity::kWarning, note, "see the daemon's log"});
     }
 }
@@ -176,7 +205,7 @@ std::string WellWords(const PatientTask& task, bool asked) {
 void CheckTasks(const Patient& patient, Findings& findings) {
     std::vector<const PatientTask*> asked;
     for (const PatientTask& task : patient.tasks) {
-        // Of one that is not reached at all the check of the servers tells.
+        // Unreachable servers are reported by the check of the servers.
         if (patient.has_passwords && patient.cut_off.count(task.record.GetInfo().GetName()) == 0) {
             asked.push_back(&task);
         }
@@ -188,7 +217,7 @@ void CheckTasks(const Patient& patient, Findings& findings) {
                             "run the doctor as root"});
     }
     const ServerQuestions questions(asked);
-    size_t next = 0;  // of those that were asked, which are in the same order
+    size_t next = 0;  // index into `asked`, which is in the same order
     for (const PatientTask& task : patient.tasks) {
         const bool was_asked = next < asked.size() && asked[next] == &task;
         Findings found;
@@ -198,6 +227,7 @@ void CheckTasks(const Patient& patient, Findings& findings) {
         }
         CheckWatch(task, found);
         CheckLastRun(task, found);
+        CheckVerification(task, found);
         CheckNote(task, found);
         if (found.empty()) {
             found.push_back({"", Severity::kOk, WellWords(task, was_asked), ""});

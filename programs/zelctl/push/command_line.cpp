@@ -1,3 +1,6 @@
+#include <utility>
+
+#include "programs/common/task_fields.h"
 #include "programs/zelctl/declare.h"
 #include "programs/zelctl/push/push.h"
 
@@ -17,22 +20,22 @@ void DeclarePair(CLI::App& pair) {
 void DeclarePush(CLI::App& push) {
     static PushOptions options;
     push.add_option("shares", options.shares, "The shares")->required();
-    options.connection.AddTo(&push);
+    options.connection.AddTo(&push, {"max_bandwidth", "exclude", "brake"});
     push.add_option("--path", options.path, "Only this path of the share, beginning with /")
         ->check([](const std::string& path) {
             return path.empty() || path.front() != '/'
                        ? std::string("a path of a share begins with /")
                        : "";
         });
-    push.add_option("--exclude", options.excludes,
-                    "rsync pattern of files that stay behind (may be repeated)")
-        ->option_text("PATTERN");
-    push.add_option("--bwlimit", options.bandwidth_limit, "Limit in KiB a second (0: none)")
-        ->option_text("KIB")
-        ->check(programs::WholeNumber());
     push.add_flag("-n,--dry-run", options.dry_run, "Only list what would be sent and deleted");
+    push.add_flag("--confirm", options.confirmed,
+                  "Go on however much is lost of a copy; else it is asked, or refused where nobody "
+                  "can be asked");
     push.add_flag("-q,--quiet", options.quiet, "Say nothing but errors");
-    push.callback([] { Push(options); });
+    push.callback([] {
+        options.excludes = programs::TextsOf(std::as_const(options.connection.said)["exclude"]);
+        Push(options);
+    });
 }
 
 }  // namespace zelctl

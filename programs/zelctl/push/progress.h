@@ -1,4 +1,4 @@
-// What a person sees while a share is pushed.
+// Progress output during a push.
 #pragma once
 
 #include <chrono>
@@ -9,14 +9,14 @@
 
 namespace zelctl {
 
-/// A line that is redrawn in place on a terminal; plain lines, now and then, otherwise. `quiet`:
-/// nothing at all.
+/// A line that is redrawn in place on a terminal; elsewhere a plain line from time to time.
+/// `quiet`: no output.
 class ProgressDisplay {
 public:
     explicit ProgressDisplay(bool quiet) : quiet_(quiet) {}
 
     void Show(const std::string& share, const TARQ::Backup::RunProgress& progress);
-    /// Takes the line away, before others are written.
+    /// Removes the line, so that other output can be written.
     void Clear() { block_.Clear(); }
 
 private:

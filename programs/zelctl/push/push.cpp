@@ -1,8 +1,16 @@
 #include "programs/zelctl/push/push.h"
 
+#include <unistd.h>
+
+#include <iterator>
+#include <utility>
+
 #include "ZEL/zel.h"
 #include "programs/common/failure.h"
+#include "programs/common/preview.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/task_run.h"
+#include "programs/common/terminal.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "programs/zelctl/base/prepare.h"
@@ -18,9 +26,8 @@ using programs::FailureKind;
 using programs::RunOrder;
 using programs::RunTotals;
 using programs::TaskRun;
-using TARQ::Backup::RunChange;
 
-// A path that a person names has to be there: it is a slip of the pen, not a deletion.
+// A path given on the command line must exist: otherwise it is a typing error, not a deletion.
 void CheckPath(const PushOptions& options) {
     for (const std::string& share : options.shares) {
         ZEL::ShareInfo facts;
@@ -32,74 +39,60 @@ void CheckPath(const PushOptions& options) {
     }
 }
 
-// What every command does before it speaks to the server.
+// Common preparation of all commands, before the server is contacted.
 ZEL::SyncInfo Prepare(const PushOptions& options) {
     PrepareHost();
-    // Of several shares to push those that are fit are pushed; a push of one asks for no password
-    // in vain.
+    // With several shares, problems of one do not keep the others from being pushed. For a single
+    // one they are found here, before anybody is asked for a password.
     if (options.dry_run || options.shares.size() == 1) {
         CheckShares(options.shares);
     }
     if (options.path != "/") {
         CheckPath(options);
     }
-    ZEL::SyncInfo info = options.info ? *options.info : options.connection.ToSyncInfo();
-    if (!options.info) {
-        info.SetMaxBandwidth(options.bandwidth_limit);
-    }
+    ZEL::SyncInfo info = options.connection.ToSyncInfo();
     WatchForInterrupt();
     return info;
 }
 
-void Connect(TaskRun& run, const std::vector<std::string>& shares) {
-    run.Connect();
-    run.CheckPairing(shares);
+// How much a push may lose without being asked. What the copy holds is not known here.
+programs::Brake BrakeOf(const PushOptions& options) {
+    const auto& said = std::as_const(options.connection.said);
+    const auto& settings = said.hasMember("brake") ? said : programs::DefaultSettings();
+    programs::Brake brake;
+    brake.percent = options.confirmed ? 0 : settings["brake"].asUInt32();
+    return brake;
 }
 
-/// Prints what a push would do, and a sum a share.
-class ChangeList {
-public:
-    void Add(const RunChange& change) {
-        const std::string path = programs::Printable(change.path);
-        if (change.kind == RunChange::SEND) {
-            printf("send    %s (%s)\n", path.c_str(), programs::HumanBytes(change.length).c_str());
-            ++sends_;
-            bytes_ += change.length;
-        } else if (change.kind == RunChange::DELETE) {
-            printf("delete  %s\n", path.c_str());
-            ++deletes_;
+// Asks about each share that waits for a person, and pushes those that may go on.
+programs::RunResult AskAndPush(TaskRun& run, RunOrder order, const programs::RunResult& first,
+                               RunTotals& totals) {
+    programs::RunResult result;
+    std::vector<programs::ShareOrder> allowed;
+    for (const programs::Undone& undone : first.undone) {
+        const std::optional<programs::Question>& question = undone.failure.question;
+        if (question && isatty(STDIN_FILENO) != 0 && !Interrupted()) {
+            for (const std::string& line : question->list) {
+                puts(line.c_str());
+            }
+            if (programs::Confirm(programs::Printable(question->text) + ". Go on?")) {
+                programs::ShareOrder& again = allowed.emplace_back();
+                again.share = undone.share;
+                again.paths = undone.paths;
+                again.brake = order.shares.front().brake;
+                again.consent = {question->reason, question->amount};
+                continue;
+            }
         }
+        result.undone.push_back(undone);
     }
-    void AddMissing(const std::string& share) {
-        printf("%s: the server holds no copy yet; all of it would be sent.\n",
-               programs::Printable(share).c_str());
-        missing_ = true;
+    if (!allowed.empty()) {
+        order.shares = std::move(allowed);
+        programs::RunResult second = run.Push(order, totals);
+        std::move(second.undone.begin(), second.undone.end(), std::back_inserter(result.undone));
     }
-    void Sum(const std::string& share) const {
-        if (!missing_) {
-            printf("%s: %s (%s) would be sent, %llu deleted.\n", programs::Printable(share).c_str(),
-                   programs::Count(sends_, "file").c_str(), programs::HumanBytes(bytes_).c_str(),
-                   static_cast<unsigned long long>(deletes_));
-        }
-    }
-
-private:
-    uint64_t sends_ = 0;
-    uint64_t bytes_ = 0;
-    uint64_t deletes_ = 0;
-    bool missing_ = false;
-};
-
-void ListChanges(TaskRun& run, const RunOrder& order) {
-    for (const programs::ShareOrder& share : order.shares) {
-        ChangeList list;
-        RunOrder alone = order;
-        alone.shares = {share};
-        run.List(
-            alone, [&](const std::string&, const RunChange& change) { list.Add(change); },
-            [&](const std::string& name) { list.AddMissing(name); });
-        list.Sum(share.share);
-    }
+    result.failure = programs::Sum(result.undone);
+    return result;
 }
 
 }  // namespace
@@ -127,17 +120,37 @@ void Push(const PushOptions& options) {
     RunOrder order;
     order.task = "push-" + ZEL::GetHostName(35);
     order.excludes = options.excludes;
+    const ZEL::PObject& said = options.connection.said;
+    order.bandwidth = programs::Bandwidth::Of(said["max_bandwidth"].asUInt32(),
+                                              said["bandwidth_windows"].asString());
+    order.may_widen = false;  // a person who names a path means that path alone
     for (const std::string& share : options.shares) {
         order.shares.push_back({share, {options.path}});
+        order.shares.back().brake = BrakeOf(options);
     }
     if (options.dry_run) {
-        Connect(run, options.shares);
-        ListChanges(run, order);
+        programs::Preview(run, order,
+                          {[](const std::string&, const TARQ::Backup::RunChange& change) {
+                               puts(programs::ChangeLine(change).c_str());
+                           },
+                           [](const std::string& share, const programs::PreviewSum& sum) {
+                               puts(programs::SumLine(share, sum).c_str());
+                           }});
         return;
     }
     RunTotals totals;
-    const programs::RunResult result = run.Push(order, totals);
+    programs::RunResult result = run.Push(order, totals);
     display.Clear();
+    if (result.failure) {
+        result = AskAndPush(run, order, result, totals);
+        display.Clear();
+    }
+    if (result.failure && result.failure->question) {
+        throw Failure(FailureKind::kConfirm,
+                      result.failure->what() + std::string("; nothing of it was done: "
+                                                           "--dry-run lists it, --confirm lets it "
+                                                           "go"));
+    }
     if (result.failure) {
         throw *result.failure;
     }
@@ -149,7 +162,8 @@ void CheckPairing(const ConnectionOptions& connection, const std::vector<std::st
     options.shares = shares;
     options.dry_run = true;
     TaskRun run(Prepare(options), Interrupted());
-    Connect(run, shares);
+    run.Connect();
+    run.CheckPairing(shares);
     puts("The server would take these shares from this client.");
 }
 

@@ -1,7 +1,6 @@
-// Pushing shares to the server, from the first probe to the last word.
+// Pushes shares to the server, from finding it to the final report.
 #pragma once
 
-#include <optional>
 #include <string>
 #include <vector>
 
@@ -11,20 +10,18 @@ namespace zelctl {
 
 struct PushOptions {
     ConnectionOptions connection;
-    std::optional<ZEL::SyncInfo> info;  ///< used in place of `connection` when it is there
     std::vector<std::string> shares;
     std::string path = "/";  ///< what of each share; "/" is all
     std::vector<std::string> excludes;
-    unsigned int bandwidth_limit = 0;  ///< KiB a second; 0: none
     bool dry_run = false;
+    bool confirmed = false;  ///< lose what has to be lost, without asking
     bool quiet = false;
 };
 
-/// Finds the server, pairs when needed, and pushes share after share. Stops at the first that
-/// fails.
+/// Finds the server, pairs if necessary, and pushes one share after the other. Throws Failure.
 void Push(const PushOptions& options);
 
-/// Asks whether the server would take these shares from this client. Changes nothing.
+/// Asks whether the server would accept these shares from this client. Changes nothing.
 void CheckPairing(const ConnectionOptions& connection, const std::vector<std::string>& shares);
 
 }  // namespace zelctl

@@ -6,6 +6,7 @@
 #include <thread>
 
 #include "programs/common/server_status.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/interrupt.h"
 
@@ -19,7 +20,7 @@ using std::chrono::steady_clock;
 
 constexpr std::chrono::milliseconds kLookForInterrupt(100);
 
-/// Sets a flag when the time is up, or the user has had enough.
+/// Sets a flag when the time is up, or when the user interrupts.
 class Patience {
 public:
     explicit Patience(std::chrono::seconds patience)
@@ -53,7 +54,7 @@ private:
     bool over_ = false;
     std::atomic<bool> ended_{false};
     steady_clock::time_point until_;
-    std::thread thread_;  // the last: it uses all the others
+    std::thread thread_;  // declared last, as it uses all other members
 };
 
 }  // namespace
@@ -72,10 +73,8 @@ std::optional<RunFailure> AskServer(const ZEL::SyncInfo& info,
             return failure;
         }
     }
-    const std::string& name = info.GetServerName();
     return RunFailure(FailureKind::kFailed, 0,
-                      "server " + (name.empty() ? info.GetServerIP() : name) +
-                          " gave no answer within " +
+                      "server " + programs::ServerOf(info) + " gave no answer within " +
                           programs::Count(static_cast<uint64_t>(patience.count()), "second"));
 }
 
@@ -92,6 +91,8 @@ bool IsRefusedForGood(const RunFailure& failure) {
         case programs::kConflicts:
         case programs::kNoEncryption:
         case programs::kNameTaken:
+        case programs::kTooManyShares:
+        case programs::kTooManyClients:
             return true;
         default:
             return false;

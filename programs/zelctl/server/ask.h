@@ -1,4 +1,4 @@
-// Asking a server what a push would ask it first.
+// Asks a server in advance what a push would ask it.
 #pragma once
 
 #include <chrono>
@@ -10,17 +10,17 @@
 
 namespace zelctl {
 
-/// Why the server does not take the shares from this client and account; none when it does. Changes
-/// nothing there. One that does not answer within `patience` has failed. Any thread.
+/// Why the server does not accept the shares from this client and account; nothing when it does.
+/// Changes nothing there. No answer within `patience` is a failure. Can be called from any thread.
 std::optional<programs::RunFailure> AskServer(const ZEL::SyncInfo& info,
                                               const std::vector<std::string>& shares,
                                               std::chrono::seconds patience);
 
-/// Whether that was the end of the patience.
+/// Whether the failure is such a time-out.
 bool IsSilence(const programs::RunFailure& failure);
 
-/// Whether no later push would fare better: the account, or the shares' owner, has to be another
-/// one, or it is no server of ours.
+/// Whether a retry is pointless: the account or the owner of the shares would have to be different,
+/// or the server is not one of this service.
 bool IsRefusedForGood(const programs::RunFailure& failure);
 
 }  // namespace zelctl

@@ -15,7 +15,7 @@ void BecomeServer(const std::vector<std::string>& arguments) {
     std::vector<std::string> command = {"zel_server"};
     command.insert(command.end(), arguments.begin(), arguments.end());
     const std::vector<char*> words = base::ArgumentVector(command);
-    // The one that was installed with this program, or else any.
+    // Prefers the zel_server installed beside this program over one in PATH.
     std::error_code error;
     const std::filesystem::path own = std::filesystem::read_symlink("/proc/self/exe", error);
     execv((own.parent_path() / command[0]).c_str(), words.data());

@@ -5,8 +5,8 @@
 
 namespace zelctl {
 
-/// Becomes zel_server, which keeps the copies on this machine, with these arguments. Throws
-/// Failure when it is not to be had.
+/// Replaces this process by zel_server, the program for the server side, with these arguments.
+/// Throws Failure when it is not installed.
 [[noreturn]] void BecomeServer(const std::vector<std::string>& arguments);
 
 }  // namespace zelctl

@@ -1,52 +1,55 @@
 #include "programs/zelctl/server/connection.h"
 
-#include <arpa/inet.h>
+#include <vector>
 
+#include "programs/common/bandwidth.h"
 #include "programs/common/failure.h"
-#include "programs/common/help.h"
+#include "programs/common/task_fields.h"
 #include "programs/common/terminal.h"
+#include "programs/zelctl/base/setting_option.h"
 
 namespace zelctl {
 
 namespace {
 
-bool IsAddress(const std::string& text) {
-    unsigned char address[16];
-    return inet_pton(AF_INET, text.c_str(), address) == 1 ||
-           inet_pton(AF_INET6, text.c_str(), address) == 1;
-}
+constexpr const char* kSettings[] = {"server_name",   "user",     "ssh",  "ssh_port",
+                                     "rsync_timeout", "compress", "block"};
 
 }  // namespace
 
-void ConnectionOptions::AddTo(CLI::App* command) {
-    command->add_option("-s,--server", server, "The server's name or address")->required();
-    command->add_option("-u,--user", user, "Account on the server")->required();
+void ConnectionOptions::AddTo(CLI::App* command,
+                              std::initializer_list<const char*> other_settings) {
+    said.asMap();
+    std::vector<const char*> keys(std::begin(kSettings), std::end(kSettings));
+    keys.insert(keys.end(), other_settings);
+    for (const char* key : keys) {
+        AddSetting(*command, *programs::FindTaskField(key), said, true);
+    }
+    AddTrustOptions(*command, trust);
     command->add_option(
         "--password-file", password_file,
         "File with the account's password ('-': standard input); else it is asked for");
-    command->add_flag("--ssh", ssh, "Carry everything through ssh");
-    command->add_option("--ssh-port", ssh_port, "Port of the ssh server")
-        ->check(programs::Between(1, 65535))
-        ->capture_default_str();
-    command->add_option("--timeout", timeout, "Give up when nothing moves for so many seconds")
-        ->option_text("SECONDS")
-        ->check(programs::Between(600, 86400))
-        ->capture_default_str();
-    command->add_flag("--compress", compress, "Compress on the way");
-    command->add_flag("--delta", delta, "Send only the changed blocks of files");
 }
 
 ZEL::SyncInfo ConnectionOptions::ToSyncInfo() const {
+    ZEL::PObject settings(programs::DefaultSettings());
+    for (const auto& [key, value] : said.asMap()) {
+        const programs::TaskField& field = *programs::FindTaskField(key);
+        const std::string fault = FaultOf(field, value);
+        if (!fault.empty()) {
+            throw programs::Failure(programs::FailureKind::kUsage, NameOf(field) + " " + fault);
+        }
+        settings[key] = value;
+    }
+    const std::string server = programs::ServerOf(settings);
+    MeetServer(server, WishOf(said, trust));
+    settings["pswd"] = programs::ReadPassword(
+        password_file, "Password of " + settings["user"].asString() + " on " + server + ": ");
     ZEL::SyncInfo info;
-    SetServer(server, info);
-    info.SetUser(user);
-    info.SetPassword(
-        programs::ReadPassword(password_file, "Password of " + user + " on " + server + ": "));
-    info.SetSSH(ssh);
-    info.SetSSHPort(ssh_port);
-    info.SetRsyncTimeout(timeout);
-    info.SetCompression(compress);
-    info.SetBlockLevelSync(delta);
+    ZEL::PObj2SyncInfo(settings, info);
+    info.SetMaxBandwidth(
+        programs::Bandwidth::Of(info.GetMaxBandwidth(), settings["bandwidth_windows"].asString())
+            .Now());
     if (!info.Validate()) {
         throw programs::Failure(programs::FailureKind::kUsage,
                                 "the server or the account is not given");
@@ -54,10 +57,14 @@ ZEL::SyncInfo ConnectionOptions::ToSyncInfo() const {
     return info;
 }
 
-void SetServer(const std::string& server, ZEL::SyncInfo& info) {
-    const bool is_address = IsAddress(server);
-    info.SetServerIP(is_address ? server : "");
-    info.SetServerName(is_address ? "" : server);
+TrustWish WishOf(const ZEL::PObject& said, TrustWish trust) {
+    if (said.hasMember("ssh")) {
+        trust.ssh = said["ssh"].asBool();
+    }
+    if (said.hasMember("ssh_port") && trust.ssh.value_or(false)) {
+        trust.port = static_cast<int>(said["ssh_port"].asUInt32());
+    }
+    return trust;
 }
 
 }  // namespace zelctl

@@ -1,33 +1,28 @@
-// How to reach the server: the options that several commands share.
+// The options for reaching a server, shared by several commands.
 #pragma once
 
+#include <initializer_list>
 #include <string>
 
+#include "ZEL/pobject.h"
 #include "ZEL/sync_obj.h"
-
-namespace CLI {
-class App;
-}
+#include "programs/zelctl/server/trust.h"
 
 namespace zelctl {
 
 struct ConnectionOptions {
-    std::string server;  ///< name or address
-    std::string user;
+    ZEL::PObject said;  ///< the task settings that were given, by key
+    TrustWish trust;
     std::string password_file;
-    bool ssh = false;
-    unsigned int ssh_port = 22;
-    unsigned int timeout = 600;  ///< seconds
-    bool compress = false;
-    bool delta = false;
 
-    void AddTo(CLI::App* command);
+    /// Declares these options, and those of the other settings given.
+    void AddTo(CLI::App* command, std::initializer_list<const char*> other_settings = {});
 
-    /// Asks for the password where needed.
+    /// Makes sure that the server is trusted, and asks for the password if necessary.
     ZEL::SyncInfo ToSyncInfo() const;
 };
 
-/// Enters `server` as the address or the name that it is, and forgets the other.
-void SetServer(const std::string& server, ZEL::SyncInfo& info);
+/// The part of the given settings that concerns how the server is reached.
+TrustWish WishOf(const ZEL::PObject& said, TrustWish trust);
 
 }  // namespace zelctl

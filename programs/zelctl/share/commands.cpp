@@ -6,6 +6,7 @@
 
 #include "programs/common/failure.h"
 #include "programs/common/host.h"
+#include "programs/common/share_notes.h"
 #include "programs/common/table.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
@@ -34,7 +35,7 @@ std::string LastError() {
     return KAPICErrText(KAPICErrGet());
 }
 
-// The tasks that send a share, as far as the daemon can be asked.
+// The tasks that send the share; empty when the daemon cannot be asked.
 std::set<std::string> TasksWith(const std::string& share) {
     ZEL::PObject request;
     request["command"] = "task_list";
@@ -95,6 +96,7 @@ void RemoveShare(const std::string& name, bool force) {
         throw Failure(FailureKind::kLocal,
                       "cannot remove '" + Printable(name) + "': " + LastError());
     }
+    programs::RemoveShareNotes(name);
     printf("Share '%s' is no longer in the catalogue; its files and its copy stay.\n",
            name.c_str());
 }

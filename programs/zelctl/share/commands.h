@@ -1,4 +1,4 @@
-// The commands about this machine's shares.
+// The commands for the shares of this machine.
 #pragma once
 
 #include <string>
@@ -7,17 +7,17 @@
 namespace zelctl {
 
 void AddShare(const std::string& name, const std::string& path, bool acl, bool windows);
-/// Shows what the share was known by and what its folder is now, and records that when a person (or
-/// `yes`) says that it is the right one.
+/// Shows the recorded identity of the share's folder and its present one, and records the latter
+/// when a person (or `yes`) confirms that it is the right folder.
 void ConfirmShare(const std::string& name, bool yes);
 void RemoveShare(const std::string& name, bool force);
 void ListShares(bool as_json);
 
-/// All shares of the catalogue, in its order.
+/// All shares of the catalogue, in the order of the catalogue.
 std::vector<std::string> ShareNames();
 
 /// Throws Failure for the first share that is not in the catalogue, whose folder cannot be read, or
-/// whose volume is not there or not fit for syncing.
+/// whose volume is missing or not suitable.
 void CheckShares(const std::vector<std::string>& names);
 
 }  // namespace zelctl

@@ -1,12 +1,12 @@
-// Whether everybody means the same folder: the person, the daemon, and the catalogue.
+// Whether a path means the same folder to the person, to the daemon and to the catalogue.
 #pragma once
 
 #include <string>
 
 namespace zelctl {
 
-/// What the daemon sees otherwise at `path`, and what to do about it; empty when it sees the same
-/// folder and can read it, or does not run.
+/// How the daemon's view of the folder at `path` differs, and what to do about it. Empty when it
+/// sees the same folder and can read it, or when it is not running.
 std::string DaemonsViewOf(const std::string& path);
 
 }  // namespace zelctl

@@ -34,7 +34,7 @@ constexpr char kCatalogue[] = "/usr/tarq/etc/tarqshare.conf";
 constexpr char kRoot[] = "TARQ_ROOT";
 constexpr const char* kOwnSections[] = {"global", "homes", "printers", "print$", "ipc$"};
 
-// Samba takes a value in double quotes for what is in them.
+// Samba removes double quotes around a value.
 std::string Unquoted(const std::string& value) {
     return value.size() >= 2 && value.front() == '"' && value.back() == '"'
                ? value.substr(1, value.size() - 2)
@@ -46,7 +46,7 @@ bool IsYes(const std::string& value) {
     return folded == "yes" || folded == "true" || folded == "1";
 }
 
-/// One section, as its lines come.
+/// One section, filled line by line.
 struct Section {
     std::string name;
     std::string path;
@@ -95,7 +95,8 @@ void ReportFailure(const std::string& text) {
     programs::Report("zelctl", text);
 }
 
-// The shares that are wanted, or all; names that Samba does not know are reported: false.
+// Selects the shares in `names`, or all. False, after a report, when Samba does not have one of
+// them.
 bool Choose(const std::vector<std::string>& names, std::vector<SambaShare>& shares) {
     if (names.empty()) {
         return true;
@@ -117,8 +118,8 @@ bool Choose(const std::vector<std::string>& names, std::vector<SambaShare>& shar
     return all;
 }
 
-/// A copy of the catalogue, which takes the place of the catalogue for as long as this lives: what
-/// an import would do is seen by doing it there.
+/// A copy of the catalogue that replaces the real one while this object exists: a dry run of an
+/// import is an import into the copy.
 class ScratchCatalogue {
 public:
     ScratchCatalogue() {
@@ -153,7 +154,7 @@ public:
     ScratchCatalogue(const ScratchCatalogue&) = delete;
     ScratchCatalogue& operator=(const ScratchCatalogue&) = delete;
 
-    /// Why it could not be made; none when it was.
+    /// Why the copy could not be made, if it could not.
     const std::error_code& Error() const { return error_; }
 
 private:

@@ -1,4 +1,4 @@
-// Taking over the shares of a Samba server.
+// Import of the shares of a Samba server.
 #pragma once
 
 #include <string>
@@ -8,16 +8,16 @@ namespace zelctl {
 
 struct SambaShare {
     std::string name;
-    std::string path;     ///< as Samba has it; empty when it names none
-    std::string refusal;  ///< why it cannot be taken over; empty when it can
+    std::string path;     ///< as configured in Samba; empty when there is none
+    std::string refusal;  ///< why it cannot be imported; empty when it can
 };
 
-/// The shares in what `testparm -s` writes, without those that are Samba's own ([global], [homes],
-/// printers). Any text is taken; lines that are of no known form are passed over.
+/// The shares in the output of `testparm -s`, without Samba's special ones ([global], [homes],
+/// printers). Accepts any text; unknown lines are ignored.
 std::vector<SambaShare> ParseSambaShares(const std::string& text);
 
-/// Adds the shares of the Samba configuration `config` (empty: the system's) to the catalogue, or
-/// only those of `names`. `dry_run`: only says which.
+/// Imports the shares of the Samba configuration `config` (empty: the system's), or only those in
+/// `names`, into the catalogue. `dry_run`: only lists them.
 void ImportSambaShares(const std::string& config, const std::vector<std::string>& names,
                        bool dry_run);
 

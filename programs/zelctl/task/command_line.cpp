@@ -1,6 +1,6 @@
-#include "base/text.h"
 #include "programs/common/schedule_words.h"
 #include "programs/common/task_fields.h"
+#include "programs/zelctl/base/setting_option.h"
 #include "programs/zelctl/declare.h"
 #include "programs/zelctl/task/edit.h"
 #include "programs/zelctl/task/list.h"
@@ -11,9 +11,7 @@ namespace zelctl {
 
 namespace {
 
-using programs::FieldKind;
 using programs::TaskField;
-using ZEL::PObject;
 
 constexpr char kScheduleHelp[] =
     "It runs by one of --manual, --on-change, --weekly, --monthly, --yearly, --once.\n"
@@ -21,7 +19,7 @@ constexpr char kScheduleHelp[] =
     "    --weekly weekdays --at 08:00 --every 2h --times 3\n"
     "runs at 08:00, 10:00, 12:00 and 14:00.";
 
-/// What `task add` and `task edit` are given.
+/// The arguments of `task add` and `task edit`.
 struct TaskArguments {
     std::string name;
     programs::ScheduleWords schedule;
@@ -32,52 +30,6 @@ struct TaskArguments {
         return options;
     }
 };
-
-// The option that says a setting. `is_new`: of a task that does not exist yet.
-void AddSetting(CLI::App& command, const TaskField& field, PObject& said, bool is_new) {
-    const std::string names = field.option;
-    PObject* const settings = &said;  // outlives the command
-    if (field.kind == FieldKind::kSwitch) {
-        command.add_flag_function(
-            names + ",!--no-" + names.substr(2),
-            [=](int64_t count) { (*settings)[field.key] = count > 0; }, field.about);
-        return;
-    }
-    CLI::Option* option = nullptr;
-    if (field.kind == FieldKind::kTexts) {
-        const auto take = [=](const std::vector<std::string>& texts) {
-            (*settings)[field.key].asArray().assign(texts.begin(), texts.end());
-        };
-        option = command.add_option_function<std::vector<std::string>>(names, take, field.about);
-    } else {
-        const auto take = [=](const std::string& word) {
-            if (field.take != nullptr) {
-                field.take(word, *settings);
-            } else if (field.kind == FieldKind::kNumber) {
-                (*settings)[field.key] = *base::ParseNumber(word, field.max);
-            } else {
-                (*settings)[field.key] = word;
-            }
-        };
-        option = command.add_option_function<std::string>(names, take, field.about);
-    }
-    if (field.kind == FieldKind::kNumber) {
-        const CLI::Validator bounds = programs::Between(field.min, field.max);
-        const bool any = field.min == 0 && field.max == programs::kAnyNumber;
-        option->check(any ? CLI::Validator(bounds).description("") : bounds);
-    }
-    const bool required = field.required || field.take != nullptr;
-    option->option_text(field.value)
-        ->default_str(is_new ? field.unless_given : "")
-        ->required(is_new && required);
-    if (!is_new && !required && field.kind == FieldKind::kTexts) {
-        command
-            .add_flag_callback(
-                "--no-" + names.substr(2), [=] { (*settings)[field.key].asArray().clear(); },
-                "No " + names + " any more")
-            ->excludes(option);
-    }
-}
 
 void AddScheduleOptions(CLI::App& command, programs::ScheduleWords& words, bool is_new) {
     const char* const group = "When it runs";
@@ -131,6 +83,7 @@ CLI::App* AddChanging(CLI::App& task, const char* command, const char* about,
             AddSetting(*added, field, options.said, is_new);
         }
     }
+    AddTrustOptions(*added, options.trust);
     added->add_option("--password-file", options.password_file,
                       "File with the account's password ('-': standard input)");
     added->add_flag("--no-check", options.no_check,
@@ -140,7 +93,7 @@ CLI::App* AddChanging(CLI::App& task, const char* command, const char* about,
     return added;
 }
 
-// A command that says no more than the task's name.
+// Declares a command whose only argument is the task's name.
 void DeclareTelling(CLI::App& task, std::string& name, const char* command, const char* about,
                     const char* request, const char* done) {
     AddNamed(task, command, about, name)->callback([&name, request, done] {
@@ -198,6 +151,10 @@ void DeclareTask(CLI::App& task) {
     DeclareRun(task);
     DeclareTelling(task, name, "rm", "Remove a task; shares and copies stay", "task_remove",
                    "is removed; its shares and their copies stay");
+    DeclareTelling(task, name, "confirm",
+                   "Let go once what a task waits with; 'task show' lists what would be lost",
+                   "task_confirm",
+                   "runs as soon as a worker is free, and may do once what it asked");
     DeclareTelling(task, name, "cancel", "End a task's run, or take it back", "task_cancel",
                    "does not run any more");
     DeclareTelling(task, name, "pause", "Run a task only when asked to, until resumed",

@@ -14,6 +14,7 @@
 #include "programs/zelctl/base/daemon_client.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "programs/zelctl/server/ask.h"
+#include "programs/zelctl/server/connection.h"
 #include "programs/zelctl/share/commands.h"
 #include "programs/zelctl/task/next.h"
 #include "programs/zelctl/task/view.h"
@@ -28,15 +29,15 @@ using programs::Printable;
 using ZEL::PObject;
 
 constexpr std::chrono::seconds kPatience(30);
-constexpr unsigned int kRunsShown = 3;  // after a task has been added or edited
+constexpr unsigned int kRunsShown = 3;  // upcoming runs, shown after a task was added or edited
 
 std::string AskPassword(const std::string& file, const PObject& task) {
     return programs::ReadNewPassword(
         file, "Password of " + task["user"].asString() + " on " + programs::ServerOf(task) + ": ");
 }
 
-// Asks the server, with a password that has just been given, what the first run would ask. A server
-// that cannot be asked now keeps nobody from adding a task; one that will never take it does.
+// Asks the server what the first run would ask it, with the new password. If the server cannot be
+// asked now, the task is still stored; if it refuses for good, it is not.
 void TryServer(const ZEL::TaskInfo& info, const std::string& done) {
     const std::string problem = programs::PrepareHost();
     if (!problem.empty()) {
@@ -61,7 +62,7 @@ void TryServer(const ZEL::TaskInfo& info, const std::string& done) {
     programs::Report("zelctl", "warning: " + error + "; the task is " + done + " all the same");
 }
 
-// A date in the past is no wish for a task.
+// Rejects a one-time schedule in the past.
 void CheckFuture(const PObject& said, const ZEL::Schedule& schedule) {
     if (said["schedule_mode"].asUInt32() == ZEL::SCHD_MODE_ONCE &&
         schedule.GetNextScheduledSeconds(time(nullptr)) == 0) {
@@ -99,7 +100,8 @@ void AddTask(const std::string& name, const EditOptions& options) {
     task.Apply(said);
     CheckShares(programs::TextsOf(said["share_list"]));
     CheckFuture(said, task.Info().GetSchedule());
-    DaemonConnection().Connect();  // nobody types a password for a daemon that is not there
+    DaemonConnection().Connect();  // fails before any prompt if the daemon is not running
+    MeetServer(programs::ServerOf(said), WishOf(said, options.trust));
     said["pswd"] = AskPassword(options.password_file, said);
     if (!options.no_check) {
         task.Apply(said);
@@ -109,12 +111,17 @@ void AddTask(const std::string& name, const EditOptions& options) {
     ShowStored(AskDaemon(said), "added");
 }
 
-// The request carries what was said alone; what the task is otherwise is looked at only where that
-// cannot be judged, or asked for, without it.
+// The request contains only the given settings. The task is looked up only when they cannot be
+// checked, or the password cannot be asked for, without the rest.
 void EditTask(const std::string& name, const EditOptions& options) {
     PObject said(options.said);
     CheckShares(programs::TextsOf(options.said["share_list"]));
     const bool has_password = options.new_password || !options.password_file.empty();
+    const TrustWish wish = WishOf(said, options.trust);
+    if (said.hasMember("server_name") || said.hasMember("server_ip") || !wish.IsEmpty()) {
+        const bool names_it = !programs::ServerOf(said).empty();
+        MeetServer(programs::ServerOf(names_it ? said : GetTask(name)), wish);
+    }
     if (has_password || options.said["schedule_mode"].asUInt32() == ZEL::SCHD_MODE_ONCE) {
         programs::TaskSettings task;
         task.SetMap(GetTask(name));
@@ -136,6 +143,12 @@ void EditTask(const std::string& name, const EditOptions& options) {
         return;
     }
     ShowStored(reply, "changed");
+    if (reply["password_forgotten"].asBool()) {
+        puts(("Its password is forgotten, because it was given for another server or account: "
+              "'zelctl task edit " +
+              Printable(reply["task"]["name"].asString()) + " --password' gives it one.")
+                 .c_str());
+    }
 }
 
 void ListTasksAsJson() {

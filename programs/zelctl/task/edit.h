@@ -1,29 +1,31 @@
-// The commands about tasks; the daemon keeps them.
+// The commands that change the tasks, which the daemon stores.
 #pragma once
 
 #include <string>
 
 #include "ZEL/pobject.h"
+#include "programs/zelctl/server/trust.h"
 
 namespace zelctl {
 
-/// What is said of a task.
+/// The options of `task add` and `task edit`.
 struct EditOptions {
-    ZEL::PObject said;          ///< its settings, by key; what is not said has none
-    std::string password_file;  ///< as programs::ReadPassword takes it
-    bool new_password = false;  ///< of an edit: ask for one
-    bool no_check = false;      ///< do not ask the server first
+    ZEL::PObject said;          ///< the given settings, by key
+    TrustWish trust;            ///< how to reach the server
+    std::string password_file;  ///< see programs::ReadPassword
+    bool new_password = false;  ///< for an edit: ask for a new one
+    bool no_check = false;      ///< do not ask the server in advance
 };
 
-/// A task that the server refuses for good is not added.
+/// Adds a task, unless the server refuses it for good.
 void AddTask(const std::string& name, const EditOptions& options);
-/// The password stays unless there is a file with one, or it is to be asked for; the server is
-/// asked only then.
+/// Changes a task. The password is kept unless `options` provide or request a new one; only then is
+/// the server asked in advance.
 void EditTask(const std::string& name, const EditOptions& options);
 void ListTasksAsJson();
 void ShowTask(const std::string& name, bool as_json);
-/// `command` is one that says no more than the task's name: "task_remove", "task_cancel",
-/// "task_pause" or "task_resume"; `done` what has happened then.
+/// Sends `command`, whose only argument is the task's name: "task_remove", "task_cancel",
+/// "task_confirm", "task_pause" or "task_resume". `done`: what is printed on success.
 void TellTask(const char* command, const std::string& name, const char* done);
 void ShowTaskLog(const std::string& name, unsigned int limit, bool details, bool as_json);
 void ShowTaskRuns(const std::string& name, unsigned int count, bool as_json);

@@ -1,5 +1,5 @@
-// The list of tasks, which people ask for often. It stands on the connection to the daemon alone:
-// what the other commands stand on takes longer to load than a thousand tasks take to print.
+// The list of tasks. As people often ask for it, it depends on nothing but the connection to the
+// daemon: loading what the other commands need takes longer than printing a thousand tasks.
 #pragma once
 
 namespace zelctl {

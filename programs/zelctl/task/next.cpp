@@ -9,6 +9,7 @@
 #include "programs/common/table.h"
 #include "programs/common/task_settings.h"
 #include "programs/common/text.h"
+#include "programs/zelctl/base/moment.h"
 
 namespace zelctl {
 
@@ -16,32 +17,8 @@ namespace {
 
 using programs::Failure;
 using programs::FailureKind;
-using programs::ParseDate;
-using programs::ParseTimeOfDay;
 
-bool ParseMoment(const std::string& text, long& moment) {
-    if (text.empty()) {
-        moment = time(nullptr);
-        return true;
-    }
-    const size_t blank = std::min(text.find(' '), text.size());
-    const auto date = ParseDate(text.substr(0, blank));
-    const auto clock = ParseTimeOfDay(text.substr(std::min(blank + 1, text.size())));
-    if (!date || !clock) {
-        return false;
-    }
-    struct tm local = {};
-    local.tm_year = date->year - 1900;
-    local.tm_mon = date->month - 1;
-    local.tm_mday = date->day;
-    local.tm_hour = clock->hours;
-    local.tm_min = clock->minutes;
-    local.tm_isdst = -1;
-    moment = mktime(&local);
-    return moment >= 0;
-}
-
-// What there is to do without a schedule's runs after a moment; empty when there are any.
+// What to say about a schedule without runs after the given moment; empty when it has some.
 std::string WithoutRuns(const ZEL::Schedule& schedule, const std::string& name, long after) {
     switch (schedule.GetMode()) {
         case ZEL::SCHD_MODE_MANUAL:
@@ -91,12 +68,13 @@ void ShowNextRuns(const NextOptions& options) {
         throw Failure(FailureKind::kUsage,
                       "say when it runs, as for 'zelctl task add': --weekly daily --at 02:00");
     }
-    long moment = 0;
-    if (!ParseMoment(options.from, moment)) {
+    const auto moment =
+        options.from.empty() ? std::optional<int64_t>(time(nullptr)) : ParseMoment(options.from);
+    if (!moment) {
         throw Failure(FailureKind::kUsage, "--from: '" + programs::Printable(options.from) +
                                                "' is not a moment 'YYYY-MM-DD HH:MM'");
     }
-    Show(schedule, "", moment, options.count, options.as_json);
+    Show(schedule, "", static_cast<long>(*moment), options.count, options.as_json);
 }
 
 void ShowNextRuns(const ZEL::Schedule& schedule, const std::string& name, unsigned int count,

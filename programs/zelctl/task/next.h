@@ -8,7 +8,7 @@
 namespace zelctl {
 
 struct NextOptions {
-    ZEL::PObject said;  ///< of a schedule, by the keys of a task's settings
+    ZEL::PObject said;  ///< settings of the schedule, by key
     unsigned int count = 5;
     std::string from;  ///< "YYYY-MM-DD HH:MM"; empty: now
     bool as_json = false;
@@ -17,7 +17,7 @@ struct NextOptions {
 /// Prints the next runs of the schedule.
 void ShowNextRuns(const NextOptions& options);
 
-/// Prints the next runs of a task, `count` at most, or what there is to say without any. `name` is
+/// Prints the next runs of a task, at most `count`, or why there are none. `name` must be
 /// printable.
 void ShowNextRuns(const ZEL::Schedule& schedule, const std::string& name, unsigned int count,
                   bool as_json);

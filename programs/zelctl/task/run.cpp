@@ -1,6 +1,7 @@
 #include "programs/zelctl/task/run.h"
 
 #include <algorithm>
+#include <charconv>
 #include <chrono>
 #include <cstdio>
 #include <map>
@@ -8,15 +9,13 @@
 
 #include "ZEL/sync_obj.h"
 #include "programs/common/failure.h"
+#include "programs/common/preview.h"
 #include "programs/common/run_progress.h"
-#include "programs/common/task_fields.h"
-#include "programs/common/task_run.h"
-#include "programs/common/task_settings.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
 #include "programs/zelctl/base/interrupt.h"
 #include "programs/zelctl/base/live_block.h"
-#include "programs/zelctl/push/push.h"
+#include "programs/zelctl/base/patient_output.h"
 #include "programs/zelctl/task/view.h"
 
 namespace zelctl {
@@ -27,14 +26,15 @@ using programs::Failure;
 using programs::FailureKind;
 using programs::Printable;
 using std::chrono::steady_clock;
+using TARQ::Backup::RunChange;
 using ZEL::PObject;
 
-constexpr std::chrono::seconds kLineEvery(10);  // where there is no terminal
+constexpr std::chrono::seconds kLineEvery(10);  // when not on a terminal
 
-/// The daemon's stream of what tasks are doing.
+/// The daemon's stream of updates about what tasks are doing.
 class TaskStream {
 public:
-    /// `name` is empty for all tasks.
+    /// An empty `name` means all tasks.
     void Open(const std::string& name) {
         PObject request;
         request["command"] = "watch";
@@ -44,9 +44,9 @@ public:
         connection_.Connect();
         connection_.Send(request);
     }
-    /// Waits for the next news.
+    /// Waits for the next update.
     void Next() { reply_ = connection_.Receive(); }
-    /// Puts the tasks that do something before those that do not.
+    /// Moves active tasks before idle ones.
     void PutBusyFirst() {
         PObject::Array& tasks = reply_["tasks"].asArray();
         std::stable_partition(tasks.begin(), tasks.end(), [](const PObject& task) {
@@ -82,20 +82,20 @@ std::string WaitingLine(const PObject& task) {
                                  : Printable(what) + ": " + programs::ProgressWords(progress);
 }
 
-/// The runs that a person waits for.
+/// The runs that the user waits for.
 class Waiting {
 public:
-    /// `after`: the run that had ended when this one was asked for.
+    /// `after`: the last run that had ended when this one was requested.
     void Add(const std::string& name, uint64_t after) { left_[name] = after; }
     bool Over() const { return left_.empty(); }
-    /// Throws what the worst of them comes to.
+    /// Throws the worst failure of the runs, if there is one.
     void RequireSuccess() const {
         if (worst_) {
             throw programs::ReportedFailure(*worst_);
         }
     }
 
-    /// Takes in what the tasks are doing.
+    /// Processes an update about the tasks.
     void See(const PObject::Array& tasks) {
         std::vector<std::string> lines;
         for (auto run = left_.begin(); run != left_.end();) {
@@ -122,7 +122,7 @@ public:
         }
     }
 
-    /// The user has had enough.
+    /// Called when the user interrupts.
     void Leave() {
         block_.Clear();
         for (const auto& [name, after] : left_) {
@@ -159,13 +159,13 @@ private:
         }
     }
 
-    std::map<std::string, uint64_t> left_;  // by task, the last run before
+    std::map<std::string, uint64_t> left_;  // by task: the last run that ended before
     std::optional<FailureKind> worst_;
     LiveBlock block_;
     steady_clock::time_point last_lines_ = steady_clock::now();
 };
 
-/// Where there is no terminal: a line for each task whose state is another than before.
+/// Output without a terminal: a line for each task whose state has changed.
 class ChangeLines {
 public:
     void See(const PObject::Array& tasks) {
@@ -187,6 +187,85 @@ public:
 private:
     std::map<std::string, std::string> lines_;
 };
+
+/// Prints the changes found by a preview, or by a verification.
+class ChangePrinter {
+public:
+    ChangePrinter(PatientOutput& output, bool verifies) : output_(output), verifies_(verifies) {}
+
+    void Print(const PObject& reply) {
+        const std::string share = reply["share"].asString();
+        std::string text;
+        for (const PObject& change : reply["changes"].asArray()) {
+            const RunChange found = ChangeOf(change.asString());
+            text +=
+                (verifies_ ? programs::DifferenceLine(found) : programs::ChangeLine(found)) + "\n";
+        }
+        if (reply.hasMember("files")) {
+            programs::PreviewSum sum;
+            sum.files = reply["files"].asUInt64();
+            sum.bytes = reply["bytes"].asUInt64();
+            sum.deletions = reply["deletions"].asUInt64();
+            sum.damaged = reply["damaged"].asUInt64();
+            sum.missing = reply["missing"].asBool();
+            text += (verifies_ ? programs::DifferencesLine(share, sum)
+                               : programs::SumLine(share, sum)) +
+                    "\n";
+            damaged_ += sum.damaged;
+            others_ += sum.files - sum.damaged + sum.deletions + (sum.missing ? 1 : 0);
+        }
+        output_.Write(text);
+    }
+
+    uint64_t Damaged() const { return damaged_; }
+    uint64_t Others() const { return others_; }
+
+private:
+    // Parses "s 1234 path", "x 1234 path" for what is damaged, or "d path".
+    static RunChange ChangeOf(const std::string& text) {
+        RunChange change;
+        change.kind = text[0] == 'd' ? RunChange::DELETE : RunChange::SEND;
+        change.damaged = text[0] == 'x';
+        size_t path = std::min<size_t>(2, text.size());
+        if (change.kind == RunChange::SEND) {
+            const char* const end = text.data() + text.size();
+            const auto [stopped, error] = std::from_chars(&text[path], end, change.length);
+            path = std::min(static_cast<size_t>(stopped - text.data()) + 1, text.size());
+        }
+        change.path = text.substr(path);
+        return change;
+    }
+
+    PatientOutput& output_;
+    const bool verifies_;
+    uint64_t damaged_ = 0;
+    uint64_t others_ = 0;
+};
+
+// Throws Failure when the preview has failed.
+void RequireSuccess(const PObject& reply) {
+    const int status = reply["sync_status"].asInt32();
+    if (reply.hasMember("error")) {
+        throw Failure(status == 0 ? FailureKind::kLocal : programs::KindOf(status),
+                      reply["error"].asString(), status);
+    }
+}
+
+// Sends the request, and prints what comes until the last reply. Throws Failure.
+void PrintReplies(const PObject& request, PatientOutput& output, ChangePrinter& printer) {
+    DaemonConnection connection;
+    connection.Connect();
+    connection.Send(request);
+    for (;;) {
+        const PObject reply = connection.Receive();
+        printer.Print(reply);
+        if (reply.hasMember("end")) {
+            output.Finish();
+            RequireSuccess(reply);
+            return;
+        }
+    }
+}
 
 }  // namespace
 
@@ -220,19 +299,36 @@ void RunTasks(const std::vector<std::string>& names, bool wait) {
 }
 
 void ListTaskChanges(const std::vector<std::string>& names) {
+    WatchForInterrupt();
     for (const std::string& name : names) {
-        PObject request = TaskRequest("task_show", name);
-        request["secrets"] = 1;
-        const PObject reply = AskDaemon(request);
-        programs::TaskSettings task;
-        task.SetMap(reply["task"]);
-        PushOptions options;
-        options.shares = programs::TextsOf(reply["task"]["share_list"]);
-        options.excludes = task.ExcludeRules();
-        options.connection.server = programs::ServerOf(reply["task"]);
-        options.info = task.Info().GetSyncInfo();
-        options.dry_run = true;
-        Push(options);
+        PatientOutput output;
+        ChangePrinter printer(output, false);
+        PrintReplies(TaskRequest("task_preview", name), output, printer);
+    }
+}
+
+void VerifyTask(const std::string& name, const std::string& share,
+                const std::vector<std::string>& paths) {
+    WatchForInterrupt();
+    PObject request = TaskRequest("task_verify", name);
+    if (!share.empty()) {
+        request["share"] = share;
+    }
+    for (const std::string& path : paths) {
+        request["paths"].asArray().emplace_back(path);
+    }
+    PatientOutput output;
+    ChangePrinter printer(output, true);
+    PrintReplies(request, output, printer);
+    if (printer.Damaged() != 0) {
+        throw Failure(FailureKind::kFailed,
+                      programs::Count(printer.Damaged(), "file") +
+                          " with other bytes under the same size and time: one of the two ends is "
+                          "damaged, and which is not known. Nothing was changed");
+    }
+    if (printer.Others() != 0) {
+        throw Failure(FailureKind::kFailed,
+                      "the copy is not the same; what differs goes with the task's next run");
     }
 }
 
@@ -245,14 +341,14 @@ void WatchTasks(const std::string& name) {
         for (stream.Open(name);;) {
             stream.Next();
             if (LiveBlock::Possible()) {
-                stream.PutBusyFirst();  // a window may not hold all
+                stream.PutBusyFirst();  // the window may be too small for all
                 block.Draw(TaskLines(stream.Tasks()));
             } else {
                 lines.See(stream.Tasks());
             }
         }
     } catch (const Failure& failure) {
-        // The user's own end is the only good one.
+        // Only an end by the user counts as success.
         if (failure.Kind() != FailureKind::kCancelled) {
             throw;
         }

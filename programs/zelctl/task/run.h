@@ -1,4 +1,4 @@
-// Running tasks, and looking on.
+// Running and watching tasks.
 #pragma once
 
 #include <string>
@@ -6,14 +6,20 @@
 
 namespace zelctl {
 
-/// Asks the daemon to run the tasks; `wait`: stays until each of these runs has ended, showing how
-/// far it is, and fails as the worst of them. An interrupt ends the looking on alone.
+/// Requests runs of the tasks from the daemon. `wait`: shows their progress until all have ended,
+/// and throws the worst failure. An interrupt ends the waiting, but not the runs.
 void RunTasks(const std::vector<std::string>& names, bool wait);
 
-/// Lists what runs of the tasks would send and delete, without the daemon doing anything.
+/// Lists what runs of the tasks would send and delete. The daemon finds that out, so the user needs
+/// no password.
 void ListTaskChanges(const std::vector<std::string>& names);
 
-/// Shows what a task, or all when the name is empty, is doing until the user has seen enough.
+/// Has files of a task read at both ends: of `share`, if that is named, and of these paths of it,
+/// if there are any. Lists what differs, and throws Failure when anything does.
+void VerifyTask(const std::string& name, const std::string& share,
+                const std::vector<std::string>& paths);
+
+/// Shows what a task, or all if `name` is empty, is doing, until the user interrupts.
 void WatchTasks(const std::string& name);
 
 }  // namespace zelctl

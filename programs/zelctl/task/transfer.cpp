@@ -3,19 +3,22 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 #include <map>
 #include <optional>
+#include <set>
 
 #include "ZEL/pobject.h"
 #include "base/replace_file.h"
 #include "base/whole_file.h"
+#include "programs/common/configuration.h"
 #include "programs/common/failure.h"
 #include "programs/common/task_fields.h"
 #include "programs/common/terminal.h"
 #include "programs/common/text.h"
 #include "programs/zelctl/base/daemon_client.h"
+#include "programs/zelctl/server/connection.h"
 #include "programs/zelctl/share/commands.h"
-#include "programs/zelctl/task/file.h"
 
 namespace zelctl {
 
@@ -26,27 +29,27 @@ using programs::FailureKind;
 using programs::Printable;
 using ZEL::PObject;
 
-constexpr size_t kMaxFileBytes = size_t{16} << 20;  // a thousand times what thousand tasks need
+constexpr size_t kMaxFileBytes = size_t{16} << 20;  // a thousand times what a thousand tasks need
 constexpr size_t kFaultsShown = 20;
 constexpr mode_t kSecretMode = 0600;
 constexpr mode_t kPlainMode = 0644;
 
-PObject GetTasks(bool secrets) {
+PObject GetTasks(const char* what_for = nullptr) {
     PObject request;
     request["command"] = "task_list";
-    if (secrets) {
-        request["secrets"] = 1;
+    if (what_for != nullptr) {
+        request[what_for] = 1;
     }
     return AskDaemon(request);
 }
 
-std::vector<PObject> ReadTasks(const std::string& path) {
+programs::Configuration ReadFileOf(const std::string& path) {
     const auto text = base::ReadFile(path == "-" ? "/dev/stdin" : path, kMaxFileBytes);
     const std::string shown = Printable(path);
     if (!text) {
         throw programs::SystemFailure("cannot read " + shown, FailureKind::kLocal);
     }
-    TaskFile file = ReadTaskFile(*text);
+    programs::Configuration file = programs::ReadConfiguration(*text);
     for (size_t i = 0; i < file.faults.size() && i < kFaultsShown; ++i) {
         programs::Report("zelctl", shown + ": " + file.faults[i]);
     }
@@ -55,28 +58,27 @@ std::vector<PObject> ReadTasks(const std::string& path) {
             FailureKind::kUsage,
             shown + ": " + programs::Count(file.faults.size(), "fault") + "; nothing was imported");
     }
-    return std::move(file.tasks);
+    return file;
 }
 
-void CheckPossible(const PObject& task) {
-    try {
-        CheckShares(programs::TextsOf(task["share_list"]));
-    } catch (const Failure& failure) {
-        programs::Report("zelctl", failure.what());
-        throw Failure(failure.Kind(),
-                      "task '" + Printable(task["name"].asString()) + "' is not possible");
-    }
-}
-
-/// The tasks of a file, on their way to the daemon.
+/// The tasks of a file that is being imported, and the shares that they need.
 class Import {
 public:
-    Import(std::vector<PObject> tasks, bool replace, std::string password_file)
-        : tasks_(std::move(tasks)), replace_(replace), password_file_(std::move(password_file)) {}
+    Import(programs::Configuration file, bool replace, std::string password_file)
+        : tasks_(std::move(file.tasks)),
+          replace_(replace),
+          password_file_(std::move(password_file)) {
+        for (programs::ListedShare& share : file.shares) {
+            new_shares_[share.name] = std::move(share);
+        }
+        for (const std::string& name : ShareNames()) {
+            new_shares_.erase(name);
+        }
+    }
 
-    /// Looks at the tasks, and tells what is wrong with them, up to a screenful.
+    /// Checks the tasks, and reports what is wrong, at most a screenful.
     void Check() {
-        PObject reply = GetTasks(false);
+        PObject reply = GetTasks();
         for (PObject& task : reply["tasks"].asArray()) {
             const std::string name = static_cast<const PObject&>(task)["name"].asString();
             there_[name].swap(task);
@@ -94,6 +96,27 @@ public:
         }
         if (first) {
             throw Failure(*first, "nothing was imported");
+        }
+    }
+
+    /// Shares that this machine has already stay as they are.
+    void AddShares() {
+        std::set<std::string> added;
+        for (const PObject& task : tasks_) {
+            for (const std::string& name : programs::TextsOf(task["share_list"])) {
+                const auto share = new_shares_.find(name);
+                if (share != new_shares_.end() && added.insert(name).second) {
+                    AddShare(name, share->second.folder, share->second.acl, share->second.windows);
+                }
+            }
+        }
+    }
+
+    void MeetServers() {
+        for (const PObject& task : tasks_) {
+            // The trust settings of this machine take precedence over the file.
+            const std::string server = programs::ServerOf(task);
+            MeetServer(server, IsTrusted(server) ? TrustWish() : WishOf(task, {}));
         }
     }
 
@@ -136,7 +159,32 @@ private:
                           "there is a task '" + Printable(name) +
                               "' already: --replace makes it that of the file");
         }
-        CheckPossible(task);
+        try {
+            for (const std::string& share : programs::TextsOf(task["share_list"])) {
+                CheckShare(share);
+            }
+        } catch (const Failure& failure) {
+            programs::Report("zelctl", failure.what());
+            throw Failure(failure.Kind(), "task '" + Printable(name) + "' is not possible");
+        }
+    }
+
+    void CheckShare(const std::string& name) const {
+        const auto found = new_shares_.find(name);
+        if (found == new_shares_.end()) {
+            CheckShares({name});
+            return;
+        }
+        const programs::ListedShare& share = found->second;
+        std::error_code error;
+        if (share.encrypted || !std::filesystem::is_directory(share.folder, error)) {
+            throw Failure(FailureKind::kLocal,
+                          "share '" + Printable(name) +
+                              "' is not in the catalogue, and the folder that it was, " +
+                              Printable(share.folder) +
+                              (share.encrypted ? ", was encrypted" : ", is not there") +
+                              ": 'zelctl share add' tells where it is now");
+        }
     }
 
     void GetPassword(PObject& task) {
@@ -145,10 +193,8 @@ private:
             return;
         }
         const auto before = there_.find(read["name"].asString());
-        if (before != there_.end() &&
-            programs::ServerOf(before->second) == programs::ServerOf(read) &&
-            before->second["user"].asString() == read["user"].asString()) {
-            return;  // the daemon has it, and for this very account
+        if (before != there_.end() && programs::SameAccount(before->second, read)) {
+            return;  // the daemon already has it for the same account
         }
         if (password_file_.empty() || !password_) {
             try {
@@ -165,13 +211,14 @@ private:
     }
 
     std::vector<PObject> tasks_;
+    std::map<std::string, programs::ListedShare> new_shares_;  // that this machine has not
     bool replace_;
     std::string password_file_;
-    std::optional<std::string> password_;   // the last one that was read
+    std::optional<std::string> password_;   // the last one read
     std::map<std::string, PObject> there_;  // the daemon's tasks by name
 };
 
-// A task of the file that replaces one is whole: what it does not say has its default.
+// A replaced task takes nothing over: settings missing from the file have their defaults.
 PObject Whole(const PObject& task) {
     PObject whole(programs::DefaultSettings());
     whole.asMap().erase("pswd");
@@ -189,9 +236,10 @@ void ExportTasks(const std::string& path, bool with_passwords) {
         throw Failure(FailureKind::kUsage,
                       "--with-passwords needs a file: passwords are never shown");
     }
-    const PObject reply = GetTasks(with_passwords);
+    const PObject reply = GetTasks(with_passwords ? "secrets" : "export");
     const PObject::Array& tasks = reply["tasks"].asArray();
-    const std::string text = WriteTaskFile(tasks, with_passwords);
+    const std::string text =
+        programs::WriteConfiguration(tasks, programs::ListedShares(), with_passwords);
     if (to_output) {
         fputs(text.c_str(), stdout);
         return;
@@ -204,13 +252,15 @@ void ExportTasks(const std::string& path, bool with_passwords) {
 }
 
 void ImportTasks(const std::string& path, bool replace, const std::string& password_file) {
-    std::vector<PObject> tasks = ReadTasks(path);
-    for (PObject& task : tasks) {
+    programs::Configuration file = ReadFileOf(path);
+    for (PObject& task : file.tasks) {
         task = Whole(task);
     }
-    Import import(std::move(tasks), replace, password_file);
+    Import import(std::move(file), replace, password_file);
     import.Check();
+    import.MeetServers();
     import.GetPasswords();
+    import.AddShares();
     import.Send();
 }
 

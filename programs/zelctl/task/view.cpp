@@ -5,6 +5,7 @@
 #include <iterator>
 #include <nlohmann/json.hpp>
 
+#include "programs/common/json_text.h"
 #include "programs/common/run_progress.h"
 #include "programs/common/table.h"
 #include "programs/common/task_fields.h"
@@ -23,7 +24,7 @@ std::string TimeOf(const PObject& moment, const char* otherwise) {
     return moment.isInteger() ? HumanTime(moment.asInt64()) : otherwise;
 }
 
-/// What there is to say of one thing: a line for each fact, or JSON.
+/// Output about one item: a line for each fact, or JSON.
 class Facts {
 public:
     void Add(const char* what, const std::string& value) {
@@ -46,11 +47,11 @@ private:
     std::vector<std::pair<std::string, std::string>> lines_;
 };
 
-// The daemon's keys as they are, with words beside its numbers.
+// The daemon's keys unchanged, with words added for its numbers.
 ordered_json TaskJson(const PObject& task) {
     ordered_json json = ToJson(task);
-    json.erase("pswd");  // never shown, whoever sends it
-    json.erase("row");   // the same in few characters
+    json.erase("pswd");  // never shown, even if the daemon sent it
+    json.erase("row");   // the same data in compact form
     json["state"] = programs::TaskStatusWord(task["status"].asInt32());
     json["result"] = programs::TaskResultWord(task["sync_result"].asInt32());
     return json;
@@ -64,12 +65,39 @@ ordered_json ListJson(const PObject::Array& list, ordered_json (*to_json)(const 
     return array;
 }
 
-// Each line by itself: what came from outside may hold anything else.
+// Line by line, as text from outside may contain anything else.
 void PrintIndented(const std::string& text) {
     for (size_t begin = 0; begin < text.size();) {
         const size_t end = std::min(text.find('\n', begin), text.size());
         printf("    %s\n", programs::Printable(text.substr(begin, end - begin)).c_str());
         begin = end + 1;
+    }
+}
+
+// What would be lost, of one share; the sentence about it is the task's note.
+void PrintQuestion(const PObject& question) {
+    const PObject::Array& list = question["list"].asArray();
+    const uint64_t amount = question["amount"].asUInt64();
+    if (!list.empty()) {
+        printf("\n%s:\n", programs::Printable(question["share"].asString()).c_str());
+    }
+    for (const PObject& line : list) {
+        printf("    %s\n", programs::Printable(line.asString()).c_str());
+    }
+    if (amount > list.size() && !list.empty()) {
+        printf("    ... and %llu more\n", static_cast<unsigned long long>(amount - list.size()));
+    }
+}
+
+// The files of a task with other bytes at the two ends.
+void PrintDamage(const PObject::Array& files) {
+    if (!files.empty()) {
+        printf("\nDamaged at one of the two ends:\n");
+    }
+    for (const PObject& file : files) {
+        printf("    %s: %s (%s)\n", programs::Printable(file["share"].asString()).c_str(),
+               programs::Printable(file["path"].asString()).c_str(),
+               programs::HumanBytes(file["length"].asUInt64()).c_str());
     }
 }
 
@@ -119,10 +147,18 @@ void PrintTask(const PObject& task, bool as_json) {
                                   programs::ProgressWords(programs::ProgressOf(task)));
     }
     facts.Add("last run", programs::TaskLastRunWords(RowOf(task)));
+    facts.Add("last compared", TimeOf(task["last_compared"], "not yet"));
+    facts.Add("last verified", TimeOf(task["last_verified"], "not yet"));
+    facts.Add("verified up to", task["verify_place"].asString());
+    facts.Add("not verified", programs::OneLine(task["verify_problem"].asString()));
     facts.Add("error", programs::OneLine(task["last_error"].asString()));
     facts.Add("pending changes", std::to_string(task["pending"].asUInt64()));
     facts.Add("note", task["note"].asString());
     facts.Print();
+    for (const PObject& question : task["confirm"].asArray()) {
+        PrintQuestion(question);
+    }
+    PrintDamage(task["damage"].asArray());
 }
 
 void PrintRuns(const PObject::Array& runs, bool as_json) {
@@ -166,6 +202,10 @@ void PrintDaemonStatus(const PObject& status, bool as_json) {
     facts.Add("tasks", std::to_string(status["tasks"].asUInt64()) + ", " +
                            std::to_string(status["running"].asUInt64()) + " running (" +
                            programs::Count(status["workers"].asUInt64(), "worker") + ")");
+    if (const uint64_t damaged = status["damaged"].asUInt64()) {
+        facts.Add("damaged", programs::Count(damaged, "file") +
+                                 " with other bytes at the two ends: zelctl task list says whose");
+    }
     facts.Add("watching", programs::Count(status["folders"].asUInt64(), "folder") +
                               (status["searching"].asBool() ? ", still searching" : ""));
     facts.Add("store", status["store"].asString());
@@ -190,7 +230,7 @@ ordered_json ToJson(const PObject& value) {
 }
 
 void PrintJson(const ordered_json& json) {
-    puts(json.dump(2, ' ', false, ordered_json::error_handler_t::replace).c_str());
+    puts(programs::JsonText(json).c_str());
 }
 
 }  // namespace zelctl

@@ -1,4 +1,4 @@
-// What a person, or a program, is shown of tasks and their runs.
+// Output about tasks and their runs, for people and for programs.
 #pragma once
 
 #include <nlohmann/json_fwd.hpp>
@@ -10,12 +10,12 @@
 
 namespace zelctl {
 
-// Of a task as the daemon tells it (docs/daemon-protocol.md). Texts are the daemon's bytes: tables
-// show them printable, other places have to.
+// Tasks are the daemon's maps (docs/daemon-protocol.md). Their texts are not escaped: tables print
+// them safely, other code has to call Printable().
 
 programs::TaskRow RowOf(const ZEL::PObject& task);
 
-/// The list of tasks as this terminal shows it.
+/// The list of tasks, fitted to this terminal.
 std::vector<std::string> TaskLines(const ZEL::PObject::Array& tasks);
 
 void PrintTasks(const ZEL::PObject::Array& tasks);  ///< as JSON

@@ -46,8 +46,8 @@ silent_server() {  # scenario
     at client bash -c 'printf "[rsync]\nanswer_seconds=\"4\"\ndead_seconds=\"8\"\n" >/usr/tarq/etc/tarqrsync.conf'
     at server systemctl stop zel_rsyncd
     at server systemd-run --quiet --unit=silent perl -MIO::Socket::INET -e \
-        'my $s = IO::Socket::INET->new(LocalPort => 873, Listen => 5, ReuseAddr => 1) or die; my @c; while (push @c, $s->accept) {}'
-    until_true 5 at server bash -c 'ss -ltn | grep -q :873'
+        'my $s = IO::Socket::INET->new(LocalPort => 874, Listen => 5, ReuseAddr => 1) or die; my @c; while (push @c, $s->accept) {}'
+    until_true 5 at server bash -c 'ss -ltn | grep -q :874'
     local begin=$SECONDS
     ends_with 1 at client zelctl task run photos --wait
     echo "$((SECONDS - begin)) s"
@@ -55,7 +55,8 @@ silent_server() {  # scenario
     ends_with 3 at client zelctl doctor
     at server systemctl stop silent
     at server systemctl start zel_rsyncd
-    until_true 60 in_step
+    until_true 60 at client zelctl task run photos --wait  # which waits for no next try
+    in_step
 
     in_a_push
     machine cable server pulled

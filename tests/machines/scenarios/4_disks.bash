@@ -63,3 +63,37 @@ client_disk_replaced() {  # scenario
         in_step
     done
 }
+
+# deposited TEXT: the last that a client has left.
+deposited() {
+    is "$(at server bash -c 'tail -n +4 "$(ls -t /usr/tarq/etc/zel_server/deposits/alice/*/[0-9]* | head -n 1)"')" "$1"
+}
+
+# A client whose disks are lost, that of its system as well, has all back with the packages and one command.
+client_lost() {  # scenario
+    local configuration before
+    configuration=$(at client zelctl export)
+    until_true 60 deposited "$configuration"
+    until_true 60 in_step
+    before=$(tree client /srv/photos)
+    machine down client kill
+    machine anew client
+    echo "10.77.0.2 nas2" >>"$MACHINES/root/client/etc/hosts"
+    find "$MACHINES/disk/photos" -mindepth 1 -delete
+    machine up client  # its disk is not there yet
+    give_packages client "$packages"
+    at client bash -c 'apt-get install -y /root/packages/libzel_*.deb /root/packages/zel-client_*.deb'
+    ends_with 1 typed client 'zelctl recover --server nas2 --user alice --from client'
+    is "$(of_task photos .status)" 3
+    is "$(at client ls -A /srv)" ""
+    sleep 5  # what it has by now is deposited as well
+    machine down client
+    machine up client --disk photos=/srv/photos
+    typed client 'zelctl recover --server nas2 --user alice'
+    is "$(tree client /srv/photos)" "$before"
+    is "$(at client zelctl export)" "$configuration"
+    at client bash -c 'date >/srv/photos/date'
+    until_true 60 in_step
+    at client zelctl doctor
+    until_true 60 deposited "$configuration"
+}

@@ -33,13 +33,15 @@ set_up_tells_the_truth() {  # scenario
     well
 }
 
-# Through ssh the server's own daemon is reached, at its loopback address.
+# Through ssh the same server is reached, at its loopback address; known by its host key under another of its names.
 through_ssh() {  # scenario
     at server useradd alice
     echo "alice:$password" | at server chpasswd
     at client bash -c 'mkdir /srv/letters && echo dear >/srv/letters/one'
     at client zelctl share add letters /srv/letters
-    typed client "zelctl task add letters --share letters --server nas2 --user alice --ssh --manual"
+    # The server is known by its TLS key already: no command goes another way in passing.
+    ends_with 2 typed client "zelctl task add letters --share letters --server nas2 --user alice --ssh --manual"
+    typed client "zelctl task add letters --share letters --server server --user alice --ssh --manual"
     at client zelctl task run letters --wait
     same_tree /srv/letters /srv/copies/letters
     at server zel_server setup --address 10.77.0.2
@@ -70,7 +72,7 @@ damaged_registry() {  # scenario
 }
 
 another_password() {  # scenario
-    echo other | at server zel_server account add alice --password-file - --reset
+    echo another one | at server zel_server account add alice --password-file - --reset
     ends_with 3 at client zelctl doctor
     ends_with 4 at client zelctl task run photos --wait
     echo "$password" | at server zel_server account add alice --password-file - --reset
@@ -121,6 +123,6 @@ one_bad_share() {  # scenario
     at client bash -c 'echo best >/srv/good/file'
     until_true 15 same_tree /srv/good /srv/copies/good  # not when the other one is tried again
     is "$(at server cat /srv/copies/lost/file)" lost
-    fails at client zelctl task run two --wait
+    until_true 20 fails at client zelctl task run two --wait  # at first it may be the run that sent the change
     at client zelctl task rm two
 }

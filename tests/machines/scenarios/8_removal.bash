@@ -22,6 +22,7 @@ removal_keeps_everything() {  # scenario
 
 # Of the client and the server nothing is left but what people have written and the user of the copies.
 purge_leaves_what_people_made() {  # scenario
+    at server mkdir -p /usr/tarq/etc/zel_server/admin.d
     at server bash -c 'echo "[mine]" >/usr/tarq/etc/zel_server/admin.d/mine.conf'
     at client bash -c 'printf "[device]\nserial=\"NAS\"\n" >/usr/tarq/etc/tarqsdk.conf'
     local name before

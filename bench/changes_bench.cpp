@@ -1,0 +1,295 @@
+// What changes cost that the daemon sends: one, many, what was moved, and none after a restart.
+//
+//     cmake --preset bench && cmake --build --preset bench --target changes_bench
+//     build/bench/bin/changes_bench [FILES]
+//
+// The daemon and the server are the real ones, on loopback. Makes a share of 200,000 files, unless
+// another number is given, below $TMPDIR, and its copy. Runs alternate with their peers', medians
+// are compared; each line ends in the ratio and what is wanted of it.
+#include <poll.h>
+#include <signal.h>
+#include <sys/inotify.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "base/unique_fd.h"
+#include "bench/client_and_server.h"
+#include "bench/compare.h"
+#include "bench/counting_relay.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using namespace bench;
+
+constexpr int kChanges = 41;
+constexpr int kScatteredRuns = 15;
+constexpr int kMoves = 15;
+constexpr int kFolders = 1000;
+constexpr int kFilesEach = 50;
+constexpr int kMovedFiles = 2000;
+constexpr int kFewFiles = 10000;
+
+class Bench : ClientAndServer {
+public:
+    void One() {
+        AddTask("one", ZEL::SCHD_MODE_REALTIME, "data");
+        const std::string copy = root_.Path("storage/data");
+        Must(test::Await([&] { return fs::exists(copy + "/first") && IsIdle("one"); }),
+             "the first copy was not made");
+        fs::create_directories(root_.Path("peer"));
+        int number = 0;
+        const auto ours = [&] {
+            return UntilThere(
+                copy, [&] { root_.Write("data/file", std::to_string(++number)); }, "one");
+        };
+        const auto theirs = [&] {
+            root_.Write("peer/file", std::to_string(++number));
+            return Milliseconds([&] {
+                BareByte();
+                BareByte();
+                Bare({"-rlptgo", "--modify-window=-1", "-D", "-A", "-X", "--numeric-ids",
+                      "--whole-file", "--delete-after", "--timeout=600", "--relative",
+                      root_.Path("peer") + "/./file", Server("plain/")});
+                BareByte();
+            });
+        };
+        Compare("a change, until it is there", ours, "rsync of it and three bare commands", theirs,
+                kChanges, "at most 1.3");
+        daemon_.Ask("task_remove", "one");
+    }
+
+    // Files of a share of 1,000 folders with 50 each, until the server has confirmed all of them.
+    void Scattered() {
+        for (int i = 0; i < kFolders * kFilesEach; ++i) {
+            root_.Write(ScatteredFile("scattered", i), "as it was");
+            root_.Write(ScatteredFile("peers", i), "as it was");
+        }
+        PushOnChange("scattered", 120);
+        Bare({"-r", "-t", root_.Path("peers") + "/", Server("plain/")});
+        for (const int count : {1, 10, 100, 1000}) {
+            int turn = 0;
+            const auto change = [&](const std::string& share) {
+                std::string last;
+                std::string names;
+                for (int i = 0; i < count; ++i) {
+                    const int file = i * (kFolders * kFilesEach / count) + turn % kFilesEach;
+                    last = ScatteredFile("", file);
+                    root_.Write(share + last,
+                                std::to_string(turn) + "th of " + std::to_string(count));
+                    names += last + '\n';
+                }
+                root_.Write("names", names);
+                return last;
+            };
+            const auto ours = [&] {
+                ++turn;
+                const std::string last = change("scattered");
+                const std::string content = test::ReadFile(root_.Path("scattered") + last);
+                return Milliseconds([&] {
+                           Until([&] {
+                               return test::ReadFile(root_.Path("storage/scattered") + last) ==
+                                          content &&
+                                      IsIdle("scattered");
+                           });
+                       }) -
+                       kGatherMs;
+            };
+            const auto theirs = [&] {
+                change("peers");
+                return Milliseconds([&] {
+                    BareByte();
+                    Bare({"-rlptgo", "--modify-window=-1", "-D", "-A", "-X", "--numeric-ids",
+                          "--whole-file", "--delete-after", "--timeout=600", "--backup",
+                          "--backup-dir=/replaced", "--files-from=" + root_.Path("names"),
+                          root_.Path("peers") + "/", Server("plain/")});
+                    BareByte();
+                });
+            };
+            const std::string what = std::to_string(count) + " scattered changes";
+            Compare(what.c_str(), ours, "rsync --backup of them, two commands", theirs,
+                    kScatteredRuns, "at most 1.3");
+        }
+        daemon_.Ask("task_remove", "scattered");
+    }
+
+    // A folder goes to and fro.
+    void Moved() {
+        for (int i = 0; i < kMovedFiles; ++i) {
+            root_.Write("moved/here/" + std::to_string(i % 20) + "/" + std::to_string(i), "file");
+        }
+        std::this_thread::sleep_for(std::chrono::seconds(1));  // none is so young as to be doubtful
+        PushOnChange("moved", 60);
+        const CountingRelay relay(Relayed());
+        const std::string share = root_.Path("moved");
+        const std::string copy = root_.Path("storage/moved");
+        bool there = false;
+        uint64_t most = 0;
+        uint64_t connections = 0;
+        const auto ours = [&] {
+            const uint64_t before = relay.Bytes();
+            const uint64_t connections_before = relay.Connections();
+            const std::string from = there ? "/there" : "/here";
+            const std::string to = there ? "/here" : "/there";
+            there = !there;
+            const double taken = Milliseconds([&] {
+                fs::rename(share + from, share + to);
+                Until([&] { return fs::exists(copy + to) && IsIdle("moved"); });
+            });
+            most = std::max(most, relay.Bytes() - before);
+            connections = std::max(connections, relay.Connections() - connections_before);
+            return taken - kGatherMs;
+        };
+        Compare(
+            "a folder of 2,000 files moved", ours, "a server command", [&] { return Command(); },
+            kMoves, "at most 1.5");
+        std::printf("%-34s %9llu bytes in %llu connections at most (wanted: less than 4096)\n",
+                    "of these, on the wire", static_cast<unsigned long long>(most),
+                    static_cast<unsigned long long>(connections));
+        std::fflush(stdout);
+        daemon_.Ask("task_remove", "moved");
+        ReachServerAt(port_);
+    }
+
+    // One change in a large share and one in a small one; then a restart with nothing changed.
+    void Large(int files) {
+        Fill("small", kFewFiles);
+        Fill("large", files);
+        std::this_thread::sleep_for(std::chrono::seconds(1));
+        PushOnChange("small", 600);
+        const size_t before = ResidentKilobytes();
+        const double first = Milliseconds([&] { PushOnChange("large", 3600); });
+        std::error_code none;
+        uint64_t bytes = 0;
+        for (const auto& index : fs::recursive_directory_iterator(
+                 root_.Path("client/usr/tarq/etc/zel_daemon/index"), none)) {
+            if (index.path().filename() == "large.index") {
+                bytes = index.file_size();
+            }
+        }
+        std::printf(
+            "%-34s %9.1f s for the first copy, %zu KiB more resident, %.1f bytes a file on disk "
+            "(wanted: at most 100)\n",
+            (std::to_string(files) + " files").c_str(), first / 1000,
+            ResidentKilobytes() - std::min(before, ResidentKilobytes()),
+            static_cast<double>(bytes) / files);
+        std::fflush(stdout);
+        int number = 0;
+        const auto change = [&](const std::string& share) {
+            return UntilThere(
+                root_.Path("storage/" + share) + "/7",
+                [&] { root_.Write(share + "/7/7", std::to_string(++number)); }, share);
+        };
+        Compare(
+            "a change in the large share", [&] { return change("large"); },
+            "one in a share of 10,000 files", [&] { return change("small"); }, kChanges,
+            "at most 1.2");
+
+        const CountingRelay relay(Relayed());
+        const uint64_t without = relay.Bytes();
+        Command();
+        const uint64_t command = relay.Bytes() - without;
+        Restart();  // what changed right before was sent so soon that it may have changed again
+        const uint64_t before_start = relay.Bytes();
+        const double taken = Milliseconds([&] { Restart(); });
+        std::this_thread::sleep_for(std::chrono::seconds(2));
+        std::printf(
+            "%-34s %9.2f s until all is known again, %llu bytes on the wire, a command has "
+            "%llu (wanted: no more)\n",
+            "a restart, nothing changed", taken / 1000,
+            static_cast<unsigned long long>(relay.Bytes() - before_start),
+            static_cast<unsigned long long>(command));
+    }
+
+private:
+    static std::string ScatteredFile(const std::string& share, int number) {
+        return share + "/" + std::to_string(number / kFilesEach) + "/" +
+               std::to_string(number % kFilesEach);
+    }
+    void Fill(const std::string& share, int files) {
+        for (int i = 0; i < files; ++i) {
+            root_.Write(share + "/" + std::to_string(i % kFolders) + "/" + std::to_string(i), "x");
+        }
+    }
+    void PushOnChange(const std::string& share, int seconds) {
+        AddShare(share);
+        AddTask(share, ZEL::SCHD_MODE_REALTIME, share);
+        Must(test::Await([&] { return IsIdle(share); }, seconds), "the first copy was not made");
+    }
+    // Until all that is to be searched and sent is.
+    void Restart() {
+        daemon_.End(SIGTERM);
+        daemon_.Start();
+        Until([&] { return IsSettled("large") && IsSettled("small"); });
+    }
+    bool IsSettled(const std::string& name) const {
+        const ZEL::PObject task = daemon_.Ask("task_show", name)["task"];
+        return task["watch_searching"].asInt32() == 0 && task["watch_complete"].asInt32() == 1 &&
+               IsIdle(name);
+    }
+    static void Until(const std::function<bool()>& condition) {
+        while (!condition()) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        }
+    }
+    // From a change until a file has come to the folder of a copy.
+    double UntilThere(const std::string& folder, const std::function<void()>& change,
+                      const std::string& task) const {
+        const base::UniqueFd watch(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+        Must(inotify_add_watch(watch.Get(), folder.c_str(), IN_MOVED_TO) >= 0, "inotify");
+        const double taken = Milliseconds([&] {
+            change();
+            pollfd waiting = {watch.Get(), POLLIN, 0};
+            Must(poll(&waiting, 1, 60000) == 1, "the change does not come");
+        });
+        Must(test::Await([&] { return IsIdle(task); }), "the run does not end");
+        return taken - kGatherMs;
+    }
+    // From now on the client goes through such a port.
+    std::pair<int, int> Relayed() {
+        relayed_ = test::FreePort();
+        ReachServerAt(relayed_);
+        return {relayed_, port_};
+    }
+    // A command that changes nothing, through the relay.
+    double Command() {
+        const std::string session(32, '0');
+        root_.Write("command", "session=\"" + session +
+                                   "\"\ncommand=\"ZEL_GetProtocolVer\"\nclientID=\"BENCH\"\n"
+                                   "outfile=\"/tmp/x\"\n");
+        return Milliseconds([&] {
+            Run("", {"rsync", "--port=" + std::to_string(relayed_), "--sockopts=TCP_NODELAY",
+                     "--password-file=" + password_file_, "--early-input=" + root_.Path("command"),
+                     Server("zel_command/" + session), root_.Path("answer")});
+        });
+    }
+
+    int relayed_ = 0;
+};
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    try {
+        Bench bench;
+        if (!getenv("X"))
+            bench.One();
+        if (!getenv("X"))
+            bench.Scattered();
+        bench.Moved();
+        bench.Large(argc > 1 ? std::atoi(argv[1]) : 200000);
+    } catch (const std::exception& error) {
+        Fail(error.what());
+    }
+}

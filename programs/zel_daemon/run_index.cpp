@@ -1,0 +1,402 @@
+#include "programs/zel_daemon/run_index.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <iterator>
+#include <optional>
+#include <set>
+
+#include "ZEL/log.h"
+#include "ZEL/zel.h"
+#include "base/percent.h"
+#include "programs/common/host.h"
+#include "programs/common/share_notes.h"
+#include "programs/common/task_fields.h"
+#include "programs/common/text.h"
+#include "programs/zel_daemon/index_walk.h"
+#include "programs/zel_daemon/path_key.h"
+#include "programs/zel_daemon/share_debts.h"
+#include "programs/zel_daemon/tree_list.h"
+
+namespace zel_daemon {
+
+namespace {
+
+namespace fs = std::filesystem;
+using programs::ShareOrder;
+using ZEL::Logger;
+
+// What a run of single paths may note: a million and a half entries.
+constexpr size_t kMostBytes = size_t{64} << 20;
+// Of the files with other names, so many are looked after in a run.
+constexpr size_t kMostLinked = 1000;
+// Of a folder that was moved, so many files are sent by name.
+constexpr size_t kMostInstead = 1000;
+
+bool IsWhole(const ShareOrder& order) {
+    return std::find(order.paths.begin(), order.paths.end(), programs::kWholeShare) !=
+           order.paths.end();
+}
+
+std::string FolderOf(const std::string& share) {
+    ZEL::ShareInfo facts;
+    return ZEL::GetShareInfo(share, facts) == 0 ? facts.GetModulePath() : "";
+}
+
+// The moves with which no other has to do, by their place among all: both their ends are what they
+// were before and after all of them.
+std::set<size_t> AloneIn(const std::vector<programs::ShareMove>& moves) {
+    struct End {
+        std::string key;
+        size_t move;
+    };
+    std::vector<End> ends;
+    std::set<size_t> alone;
+    for (size_t i = 0; i < moves.size(); ++i) {
+        ends.push_back({KeyOf(moves[i].from), i});
+        ends.push_back({KeyOf(moves[i].to), i});
+        alone.insert(alone.end(), i);
+    }
+    std::sort(ends.begin(), ends.end(),
+              [](const End& one, const End& other) { return one.key < other.key; });
+    std::vector<const End*> above;  // each within the one before
+    for (const End& end : ends) {
+        while (!above.empty() && !IsWithin(end.key, above.back()->key)) {
+            above.pop_back();
+        }
+        if (!above.empty()) {
+            alone.erase(end.move);
+            alone.erase(above.back()->move);
+        }
+        above.push_back(&end);
+    }
+    return alone;
+}
+
+// The files that are to be sent of a folder that was moved, so that the copy has it as it is, which
+// has it as the index has it at its old place: see ShareMove. None: all of it.
+std::vector<std::string> FilesInstead(FileIndex& index, const std::string& folder,
+                                      const programs::ShareMove& move,
+                                      const std::function<bool()>& cancelled) {
+    const std::string from = KeyOf(move.from);
+    const std::string to = KeyOf(move.to);
+    const auto was = index.Find(from);
+    TreeList list(folder, move.to, cancelled);
+    TreeList::Entry entry;
+    if (!was || !was->IsFolder() || list.Next(entry) != TreeList::Found::kEntry ||
+        !entry.facts.IsFolder() || entry.facts.inode != was->inode) {
+        return {};
+    }
+    std::vector<std::string> files;
+    std::string waits = to;  // the folder that a file in it is to bring along; empty: none
+    IndexWalk known(index, from);
+    auto found = list.Next(entry);
+    for (; found == TreeList::Found::kEntry; found = list.Next(entry)) {
+        const IndexEntry* const old = known.Entry();
+        const std::string key = KeyOf(entry.path);
+        if (old == nullptr || !IsWithin(old->key, from) ||
+            old->key.substr(from.size()) != key.substr(to.size()) ||
+            old->facts.IsFolder() != entry.facts.IsFolder() || files.size() == kMostInstead) {
+            return {};
+        }
+        const bool is_unchanged = IsUnchanged(old->facts, entry.facts);
+        if (entry.facts.IsFolder() && !is_unchanged) {
+            if (!waits.empty() && !IsWithin(key, waits)) {
+                return {};
+            }
+            waits = key;
+        } else if (!entry.facts.IsFolder() && (!is_unchanged || !waits.empty())) {
+            if (!waits.empty() && !IsWithin(key, waits)) {
+                return {};
+            }
+            files.push_back(entry.path);
+            waits.clear();
+        }
+        known.Next();
+    }
+    const bool is_more = known.Entry() != nullptr && IsWithin(known.Entry()->key, from);
+    const bool is_all = found == TreeList::Found::kEnd && !is_more && waits.empty();
+    return is_all && !cancelled() ? files : std::vector<std::string>();
+}
+
+struct LinkedFile {
+    struct stat status = {};
+    EntryFacts facts;
+};
+
+// Names of these files in a share that its copy has otherwise.
+void FindOtherNames(const std::string& file, const std::string& share, const std::string& folder,
+                    const std::vector<LinkedFile>& files, RunIndexes::Linked& found) {
+    try {
+        FileIndex index(file);
+        for (const LinkedFile& sent : files) {
+            for (const std::string& key : index.NamesOf(sent.facts.inode)) {
+                const std::string path = PathOf(key);
+                const auto known = index.Find(key);
+                struct stat other = {};
+                if (found.size() < kMostLinked && known && !IsUnchanged(*known, sent.facts) &&
+                    lstat((folder + path).c_str(), &other) == 0 &&
+                    other.st_dev == sent.status.st_dev && other.st_ino == sent.status.st_ino) {
+                    found.emplace_back(share, path);
+                }
+            }
+        }
+    } catch (const std::exception& error) {
+        // Whoever needs it next will say so and remove it.
+        Logger::LogMsg(Logger::LEVEL_INFO, "[INFO] zel_daemon(%d): %s: %s\n", __LINE__,
+                       file.c_str(), error.what());
+    }
+}
+
+}  // namespace
+
+std::string IndexPlace::FileOf(const std::string& share) const {
+    return folder + "/" + base::PercentEncoded(share, "-_") + ".index";
+}
+
+IndexPlace PlaceOf(const std::string& folder, uint64_t task_id, const ZEL::SyncInfo& info,
+                   const std::vector<std::string>& excludes) {
+    IndexPlace place{folder + "/" + std::to_string(task_id), programs::ServerOf(info)};
+    place.settings += '\0' + info.GetUser();
+    for (const std::string& rule : excludes) {
+        place.settings += '\0' + rule;
+    }
+    return place;
+}
+
+// One share's. Where something fails, the index is dropped.
+class RunIndexes::Share {
+public:
+    Share(const IndexPlace& place, ShareOrder& order, int64_t moment,
+          const std::function<bool()>& cancelled)
+        : file_(place.FileOf(order.share)),
+          settings_(place.settings),
+          order_(order),
+          whole_(IsWhole(order)),
+          folder_(FolderOf(order.share)) {
+        Try([&] {
+            if (!folder_.empty()) {
+                whole_ ? ListAll(moment, cancelled) : ListPaths(cancelled);
+            }
+        });
+    }
+
+    void Ended(const programs::RunResult& result) {
+        Try([&] { End(result); });
+    }
+
+    const std::string& Folder() const { return folder_; }
+    /// Files that have other names and were sent, by inode.
+    const std::map<uint64_t, std::string>& Linked() const { return linked_; }
+
+private:
+    template <typename Step>
+    void Try(Step step) {
+        try {
+            step();
+        } catch (const std::exception& error) {
+            Logger::LogMsg(Logger::LEVEL_WARNING,
+                           "[WARNING] zel_daemon(%d): share '%s': what its copy has cannot be "
+                           "noted in %s (%s); it is compared whole when the daemon starts again\n",
+                           __LINE__, programs::Printable(order_.share).c_str(), file_.c_str(),
+                           error.what());
+            is_kept_ = false;
+            linked_.clear();
+            index_.reset();
+            FileIndex::Remove(file_);
+        }
+    }
+
+    void ListAll(int64_t moment, const std::function<bool()>& cancelled) {
+        notes_ = programs::ReadShareNotes(order_.share);
+        index_.emplace(file_);
+        index_->Clear();
+        TreeList list(folder_, programs::kWholeShare, cancelled);
+        TreeList::Entry entry;
+        for (auto found = list.Next(entry); found != TreeList::Found::kEnd;
+             found = list.Next(entry)) {
+            if (found == TreeList::Found::kEntry) {  // what cannot be read will fail the run
+                index_->Append(KeyOf(entry.path), entry.facts);
+            }
+        }
+        index_->EndAppending();
+        stamp_.compared = moment;
+        is_kept_ = !cancelled();
+    }
+
+    void ListPaths(const std::function<bool()>& cancelled) {
+        if (!FileIndex::Exists(file_)) {
+            return;
+        }
+        notes_ = programs::ReadShareNotes(order_.share);
+        FileIndex index(file_);
+        const std::optional<IndexStamp> stamp = index.Stamp();
+        if (!stamp || !IsInStep(*stamp, notes_, settings_)) {
+            index.Forget();
+            return;
+        }
+        stamp_ = *stamp;
+        is_kept_ = true;
+        FindLittleChanged(index, cancelled);
+        std::vector<std::string> keys;
+        for (const std::string& path : order_.paths) {
+            keys.push_back(KeyOf(path));
+        }
+        std::sort(keys.begin(), keys.end());
+        // The share's own folder is sent along with what is right in it alone.
+        if (std::any_of(keys.begin(), keys.end(),
+                        [](const std::string& key) { return ParentOf(key).empty(); })) {
+            NoteFolder("");
+        }
+        std::string noted;  // the folder that was noted last
+        std::optional<std::string> done;
+        for (const std::string& key : keys) {
+            if (done && IsWithin(key, *done)) {
+                continue;
+            }
+            done = key;
+            NoteFolders(std::string(ParentOf(key)), noted);
+            changes_.Replace(key);
+            TreeList list(folder_, PathOf(key), cancelled);
+            TreeList::Entry entry;
+            for (auto found = list.Next(entry); found != TreeList::Found::kEnd;
+                 found = list.Next(entry)) {
+                if (found == TreeList::Found::kEntry) {
+                    changes_.Put(KeyOf(entry.path), entry.facts);
+                    if (entry.facts.linked && linked_.size() < kMostLinked) {
+                        linked_.emplace(entry.facts.inode, entry.path);
+                    }
+                }
+            }
+            if (changes_.Bytes() > kMostBytes) {
+                throw programs::Failure("too many changes at once");
+            }
+        }
+        is_kept_ = !cancelled();
+    }
+
+    void FindLittleChanged(FileIndex& index, const std::function<bool()>& cancelled) {
+        for (const size_t i : AloneIn(order_.moves)) {
+            programs::ShareMove& move = order_.moves[i];
+            move.instead = FilesInstead(index, folder_, move, cancelled);
+        }
+    }
+
+    // The folders on the way to this one are sent along, and it as well.
+    void NoteFolders(const std::string& folder, std::string& noted) {
+        for (size_t end = 1; end < folder.size(); ++end) {
+            end = std::min(folder.find('\0', end), folder.size());
+            const std::string above = folder.substr(0, end);
+            if (!IsWithin(noted, above)) {
+                NoteFolder(above);
+            }
+        }
+        noted = folder;
+    }
+
+    void NoteFolder(const std::string& key) {
+        TreeList list(folder_, PathOf(key), [] { return false; });
+        TreeList::Entry entry;
+        if (list.Next(entry) == TreeList::Found::kEntry) {
+            changes_.Put(key, entry.facts);
+        }
+    }
+
+    void End(const programs::RunResult& result) {
+        const auto pushed = result.pushes.find(order_.share);
+        if (!is_kept_ || pushed == result.pushes.end()) {
+            linked_.clear();  // nothing was begun: what was in step is so still
+            return;
+        }
+        bool broke_off = false;
+        std::vector<std::string> undone;
+        for (const programs::Undone& item : result.undone) {
+            if (item.share == order_.share) {
+                broke_off = broke_off || BrokeOff(item.failure);
+                std::transform(item.paths.begin(), item.paths.end(), std::back_inserter(undone),
+                               KeyOf);
+            }
+        }
+        const programs::ShareNotes now = programs::ReadShareNotes(order_.share);
+        const auto copy = CopyAfter(notes_, now, pushed->second,
+                                    whole_ ? std::nullopt : std::optional(stamp_.copy));
+        if (!whole_) {
+            index_.emplace(file_);
+        }
+        if (broke_off || !copy || (whole_ && !undone.empty())) {
+            linked_.clear();
+            index_->Forget();
+            return;
+        }
+        stamp_.settings = settings_;
+        stamp_.copy = *copy;
+        stamp_.begun = now.begun;
+        whole_ ? index_->SetStamp(stamp_) : index_->Change(changes_, undone, stamp_);
+        index_.reset();
+    }
+
+    const std::string file_;
+    const std::string settings_;
+    ShareOrder& order_;
+    const bool whole_;
+    const std::string folder_;
+    bool is_kept_ = false;        // what the run sends can go into the index
+    programs::ShareNotes notes_;  // before the run
+    IndexStamp stamp_;
+    IndexChanges changes_;
+    std::optional<FileIndex> index_;
+    std::map<uint64_t, std::string> linked_;
+};
+
+RunIndexes::RunIndexes(IndexPlace place, programs::RunOrder& order, int64_t moment,
+                       const std::function<bool()>& cancelled)
+    : place_(std::move(place)) {
+    if (place_.folder.empty()) {
+        return;
+    }
+    for (ShareOrder& share : order.shares) {
+        shares_.push_back(std::make_unique<Share>(place_, share, moment, cancelled));
+    }
+}
+
+RunIndexes::~RunIndexes() = default;
+
+RunIndexes::Linked RunIndexes::Ended(const programs::RunResult& result) {
+    for (const auto& share : shares_) {
+        share->Ended(result);
+    }
+    Linked linked;
+    FindLinked(linked);
+    return linked;
+}
+
+// Of all files that were sent and have other names, those names.
+void RunIndexes::FindLinked(Linked& linked) const {
+    std::vector<LinkedFile> files;
+    for (const auto& share : shares_) {
+        for (const auto& [inode, path] : share->Linked()) {
+            const std::string name = share->Folder() + path;
+            LinkedFile file;
+            const auto facts = FactsOf(AT_FDCWD, name.c_str(), LookTime());
+            if (facts && facts->inode == inode && lstat(name.c_str(), &file.status) == 0) {
+                file.facts = *facts;
+                files.push_back(file);
+            }
+        }
+    }
+    std::error_code ignored;
+    for (fs::directory_iterator at(place_.folder, ignored), end;
+         !files.empty() && !ignored && at != end; at.increment(ignored)) {
+        const std::string name = at->path().filename();
+        const auto share = base::PercentDecoded(name.substr(0, name.rfind('.')));
+        const std::string folder = share ? FolderOf(*share) : "";
+        if (!folder.empty() && at->path() == place_.FileOf(*share)) {
+            FindOtherNames(at->path(), *share, folder, files, linked);
+        }
+    }
+}
+
+}  // namespace zel_daemon
