@@ -40,6 +40,9 @@ using std::chrono::seconds;
 constexpr int kBacklog = 4096;
 // Time between SIGTERM and SIGKILL for a connection that is being ended.
 constexpr seconds kEndGrace(5);
+// How often processes are looked for that a connection has left behind. A process number is not
+// used again within such a time.
+constexpr milliseconds kBurialInterval(20);
 // Time between the turns in which versions are given up that are older than they are kept.
 constexpr std::chrono::hours kKeepInterval(1);
 constexpr int kLowestPriority = 19;
@@ -133,6 +136,7 @@ std::optional<int> Acceptor::Run(pid_t guarded) {
         Answer();
         Accept();
         EndLate();
+        ForgetBuried();
         KeepVersionsWhenDue();
     }
 }
@@ -289,22 +293,37 @@ void Acceptor::EndLate() {
 std::optional<int> Acceptor::Reap(pid_t guarded) {
     siginfo_t ended = {};
     while (waitid(P_ALL, 0, &ended, WEXITED | WNOHANG | WNOWAIT) == 0 && ended.si_pid != 0) {
-        // Ends what is left of the process group. The number cannot be reused before it is reaped.
-        if (connections_.erase(ended.si_pid) > 0) {
-            kill(-ended.si_pid, SIGTERM);
-            space_is_due_ = space_is_due_ || IsSpaceDue();
-        }
         if (ended.si_pid == keeper_) {
             keeper_ = 0;
         }
         int status = 0;
         waitpid(ended.si_pid, &status, 0);
+        const auto connection = connections_.find(ended.si_pid);
+        if (connection != connections_.end()) {
+            space_is_due_ = space_is_due_ || IsSpaceDue();
+            connection->second.leaderless = true;
+            // As long as there is one process in the group, nobody else gets its number.
+            if (kill(-ended.si_pid, 0) == 0) {
+                End(ended.si_pid, connection->second);
+            } else {
+                connections_.erase(connection);
+            }
+        }
         if (ended.si_pid == guarded) {
             return status;
         }
         ended = {};
     }
     return std::nullopt;
+}
+
+// A receiver of rsync's may outlive the process that has started it by ten minutes, SIGTERM or not,
+// and would go on writing.
+void Acceptor::ForgetBuried() {
+    for (auto next = connections_.begin(); next != connections_.end();) {
+        const bool buried = next->second.leaderless && kill(-next->first, 0) != 0;
+        next = buried ? connections_.erase(next) : std::next(next);
+    }
 }
 
 void Acceptor::EndAll() {
@@ -314,6 +333,7 @@ void Acceptor::EndAll() {
     const Clock::time_point limit = Clock::now() + kEndGrace;
     while (!connections_.empty() && Clock::now() < limit) {
         Reap(0);
+        ForgetBuried();
         usleep(10000);
     }
     for (const auto& connection : connections_) {
@@ -336,7 +356,10 @@ int Acceptor::MillisecondsToWait() const {
     }
     for (const auto& entry : connections_) {
         const Connection& connection = entry.second;
-        if (connection.ending || connection.account.empty()) {
+        if (connection.leaderless) {
+            const Clock::time_point again = Clock::now() + kBurialInterval;
+            first = first ? std::min(*first, again) : again;
+        } else if (connection.ending || connection.account.empty()) {
             const Clock::time_point late =
                 connection.since + (connection.ending ? kEndGrace : seconds(kLoginSeconds));
             first = first ? std::min(*first, late) : late;

@@ -38,8 +38,9 @@ private:
 
     struct Connection {
         Clock::time_point since;
-        std::string account;  // empty until it has logged in
-        bool ending = false;  // SIGTERM was sent at `since`; SIGKILL follows
+        std::string account;      // empty until it has logged in
+        bool ending = false;      // SIGTERM was sent at `since`; SIGKILL follows
+        bool leaderless = false;  // its first process has ended; others of its group have not
     };
 
     void KeepVersionsWhenDue();
@@ -52,6 +53,7 @@ private:
     void End(pid_t process, Connection& connection);
     void EndOldestWaiting();
     void EndLate();
+    void ForgetBuried();
     std::optional<int> Reap(pid_t guarded);
     void EndAll();
     size_t Waiting() const;
