@@ -1,4 +1,5 @@
-// What changes cost that the daemon sends: one, many, what was moved, and none after a restart.
+// What changes cost that the daemon sends: one, many, what was moved, and none after a restart; and
+// whether a slow server costs the tasks of others.
 //
 //     cmake --preset bench && cmake --build --preset bench --target changes_bench
 //     build/bench/bin/changes_bench [FILES]
@@ -18,6 +19,7 @@
 #include <filesystem>
 #include <fstream>
 #include <functional>
+#include <list>
 #include <optional>
 #include <string>
 #include <thread>
@@ -40,6 +42,8 @@ constexpr int kFolders = 1000;
 constexpr int kFilesEach = 50;
 constexpr int kMovedFiles = 2000;
 constexpr int kFewFiles = 10000;
+constexpr int kServers = 10;
+constexpr int kTasksEach = 100;
 
 class Bench : ClientAndServer {
 public:
@@ -212,7 +216,71 @@ public:
             static_cast<unsigned long long>(command));
     }
 
+    // 100 tasks each for ten servers, one of which answers a byte now and then: how long the
+    // others' take. They are one server under nine addresses, with as many accounts.
+    void Fair() {
+        const test::TricklingServer slow(port_, AddressOf(0).c_str());
+        std::list<CountingRelay> relays;
+        for (int server = 1; server < kServers; ++server) {
+            relays.emplace_back(std::pair(port_, port_), AddressOf(server));
+            Run(root_.Path("server"), {ZEL_SERVER, "account", "add", kUser + std::to_string(server),
+                                       "--password-file", password_file_});
+        }
+        for (int server = 0; server < kServers; ++server) {
+            for (int i = 0; i < kTasksEach; ++i) {
+                const std::string name = NameOf(server, i);
+                root_.Write(name + "/file", "x");
+                AddShare(name);
+                ZEL::PObject task = TaskOf(name, ZEL::SCHD_MODE_MANUAL, name);
+                task["server_ip"] = AddressOf(server);
+                task["user"] = kUser + std::to_string(server);
+                Must(daemon_.Ask(task)["result"].asInt32() == 0, "no task can be added");
+            }
+        }
+        const auto all_others = [&] {
+            return Milliseconds([&] {
+                for (int i = 0; i < kTasksEach; ++i) {
+                    for (int server = 1; server < kServers; ++server) {
+                        daemon_.Ask("task_run", NameOf(server, i));
+                    }
+                }
+                while (!AreOthersDone()) {  // which is no light question
+                    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+                }
+            });
+        };
+        const auto beside_slow = [&] {
+            for (int i = 0; i < kTasksEach; ++i) {
+                daemon_.Ask("task_run", NameOf(0, i));
+            }
+            Must(test::Await([&] { return slow.Clients() != 0; }), "the slow server is not asked");
+            const double taken = all_others();
+            for (int i = 0; i < kTasksEach; ++i) {
+                daemon_.Ask("task_cancel", NameOf(0, i));
+            }
+            return taken;
+        };
+        Compare("900 tasks, and 100 of a slow server", beside_slow, "the 900 alone", all_others, 3,
+                "at most 1.1");
+    }
+
 private:
+    static std::string AddressOf(int server) { return "127.0.0." + std::to_string(server + 2); }
+    static std::string NameOf(int server, int number) {
+        return "fair" + std::to_string(server) + "-" + std::to_string(number);
+    }
+    // Whether the tasks of all but the slow server are.
+    bool AreOthersDone() const {
+        for (const ZEL::PObject& task : daemon_.Ask("task_list")["tasks"].asArray()) {
+            if (task["name"].asString().find("fair") == 0 &&
+                task["server_ip"].asString() != AddressOf(0) &&
+                (task["status"].asInt32() != ZEL::TASK_STATUS_IDLE ||
+                 task["sync_result"].asInt32() != ZEL::TASK_RESULT_SUCCESS)) {
+                return false;
+            }
+        }
+        return true;
+    }
     static std::string ScatteredFile(const std::string& share, int number) {
         return share + "/" + std::to_string(number / kFilesEach) + "/" +
                std::to_string(number % kFilesEach);
@@ -283,11 +351,10 @@ private:
 int main(int argc, char** argv) {
     try {
         Bench bench;
-        if (!getenv("X"))
-            bench.One();
-        if (!getenv("X"))
-            bench.Scattered();
+        bench.One();
+        bench.Scattered();
         bench.Moved();
+        bench.Fair();
         bench.Large(argc > 1 ? std::atoi(argv[1]) : 200000);
     } catch (const std::exception& error) {
         Fail(error.what());

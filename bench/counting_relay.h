@@ -11,6 +11,7 @@
 #include <cstdint>
 #include <list>
 #include <stdexcept>
+#include <string>
 #include <thread>
 #include <utility>
 
@@ -21,13 +22,14 @@ namespace bench {
 /// Both directions, without the headers of the network.
 class CountingRelay {
 public:
-    /// From the first port to the second, on loopback.
-    explicit CountingRelay(std::pair<int, int> ports) : listener_(Socket()), to_(ports.second) {
+    /// From the first port of a loopback address to the second of 127.0.0.1.
+    explicit CountingRelay(std::pair<int, int> ports, const std::string& address = "127.0.0.1")
+        : listener_(Socket()), to_(ports.second) {
         const int on = 1;
         setsockopt(listener_.Get(), SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
-        const sockaddr_in address = Loopback(ports.first);
-        if (bind(listener_.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) !=
-                0 ||
+        sockaddr_in own = Loopback(ports.first);
+        inet_pton(AF_INET, address.c_str(), &own.sin_addr);
+        if (bind(listener_.Get(), reinterpret_cast<const sockaddr*>(&own), sizeof own) != 0 ||
             listen(listener_.Get(), 64) != 0) {
             throw std::runtime_error("no relay can listen");
         }

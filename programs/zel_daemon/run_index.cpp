@@ -8,6 +8,7 @@
 #include <iterator>
 #include <optional>
 #include <set>
+#include <string_view>
 
 #include "ZEL/log.h"
 #include "ZEL/zel.h"
@@ -76,11 +77,17 @@ std::set<size_t> AloneIn(const std::vector<programs::ShareMove>& moves) {
     return alone;
 }
 
-// The files that are to be sent of a folder that was moved, so that the copy has it as it is, which
-// has it as the index has it at its old place: see ShareMove. None: all of it.
-std::vector<std::string> FilesInstead(FileIndex& index, const std::string& folder,
-                                      const programs::ShareMove& move,
-                                      const std::function<bool()>& cancelled) {
+/// What was seen of a folder that was moved.
+struct MovedFolder {
+    std::vector<std::string>
+        files;            // to be sent, so that the copy has it as it is; none: all of it
+    std::string entries;  // the whole folder, as a ChunkWriter has put it together
+};
+
+// Compares a folder that was moved with what the index has at its old place, which the copy has,
+// too: see ShareMove.
+MovedFolder LookAtMoved(FileIndex& index, const std::string& folder,
+                        const programs::ShareMove& move, const std::function<bool()>& cancelled) {
     const std::string from = KeyOf(move.from);
     const std::string to = KeyOf(move.to);
     const auto was = index.Find(from);
@@ -91,17 +98,24 @@ std::vector<std::string> FilesInstead(FileIndex& index, const std::string& folde
         return {};
     }
     std::vector<std::string> files;
+    ChunkWriter entries;
+    entries.Add(to, entry.facts);
     std::string waits = to;  // the folder that a file in it is to bring along; empty: none
+    const auto below = [](const std::string& key, const std::string& top) {
+        return std::string_view(key).substr(top.size());
+    };
     IndexWalk known(index, from);
     auto found = list.Next(entry);
     for (; found == TreeList::Found::kEntry; found = list.Next(entry)) {
         const IndexEntry* const old = known.Entry();
         const std::string key = KeyOf(entry.path);
         if (old == nullptr || !IsWithin(old->key, from) ||
-            old->key.substr(from.size()) != key.substr(to.size()) ||
-            old->facts.IsFolder() != entry.facts.IsFolder() || files.size() == kMostInstead) {
+            below(old->key, from) != below(key, to) ||
+            old->facts.IsFolder() != entry.facts.IsFolder() || files.size() == kMostInstead ||
+            entries.Bytes().size() > kMostBytes) {
             return {};
         }
+        entries.Add(key, entry.facts);
         const bool is_unchanged = IsUnchanged(old->facts, entry.facts);
         if (entry.facts.IsFolder() && !is_unchanged) {
             if (!waits.empty() && !IsWithin(key, waits)) {
@@ -119,7 +133,7 @@ std::vector<std::string> FilesInstead(FileIndex& index, const std::string& folde
     }
     const bool is_more = known.Entry() != nullptr && IsWithin(known.Entry()->key, from);
     const bool is_all = found == TreeList::Found::kEnd && !is_more && waits.empty();
-    return is_all && !cancelled() ? files : std::vector<std::string>();
+    return is_all && !cancelled() ? MovedFolder{files, entries.Take()} : MovedFolder();
 }
 
 struct LinkedFile {
@@ -260,14 +274,19 @@ private:
             done = key;
             NoteFolders(std::string(ParentOf(key)), noted);
             changes_.Replace(key);
-            TreeList list(folder_, PathOf(key), cancelled);
-            TreeList::Entry entry;
-            for (auto found = list.Next(entry); found != TreeList::Found::kEnd;
-                 found = list.Next(entry)) {
-                if (found == TreeList::Found::kEntry) {
-                    changes_.Put(KeyOf(entry.path), entry.facts);
-                    if (entry.facts.linked && linked_.size() < kMostLinked) {
-                        linked_.emplace(entry.facts.inode, entry.path);
+            const auto moved = moved_.find(key);
+            if (moved != moved_.end()) {
+                ChunkReader entries(moved->second);
+                for (IndexEntry entry; entries.Next(entry);) {
+                    Note(entry);
+                }
+            } else {
+                TreeList list(folder_, PathOf(key), cancelled);
+                TreeList::Entry entry;
+                for (auto found = list.Next(entry); found != TreeList::Found::kEnd;
+                     found = list.Next(entry)) {
+                    if (found == TreeList::Found::kEntry) {
+                        Note({KeyOf(entry.path), entry.facts});
                     }
                 }
             }
@@ -275,13 +294,25 @@ private:
                 throw programs::Failure("too many changes at once");
             }
         }
+        moved_.clear();
         is_kept_ = !cancelled();
+    }
+
+    void Note(const IndexEntry& entry) {
+        changes_.Put(entry.key, entry.facts);
+        if (entry.facts.linked && linked_.size() < kMostLinked) {
+            linked_.emplace(entry.facts.inode, PathOf(entry.key));
+        }
     }
 
     void FindLittleChanged(FileIndex& index, const std::function<bool()>& cancelled) {
         for (const size_t i : AloneIn(order_.moves)) {
             programs::ShareMove& move = order_.moves[i];
-            move.instead = FilesInstead(index, folder_, move, cancelled);
+            MovedFolder seen = LookAtMoved(index, folder_, move, cancelled);
+            if (!seen.files.empty()) {
+                move.instead = std::move(seen.files);
+                moved_.emplace(KeyOf(move.to), std::move(seen.entries));
+            }
         }
     }
 
@@ -347,6 +378,7 @@ private:
     programs::ShareNotes notes_;  // before the run
     IndexStamp stamp_;
     IndexChanges changes_;
+    std::map<std::string, std::string> moved_;  // MovedFolder::entries, by the key of their place
     std::optional<FileIndex> index_;
     std::map<uint64_t, std::string> linked_;
 };

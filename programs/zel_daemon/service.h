@@ -61,8 +61,8 @@ struct ServiceStats {
 /// When a task does what, its TaskMachine knows. The service tells it what happens on disk, on this
 /// host and among people, does what it wants done, and picks the tasks that run: no more at a time
 /// than there are workers, no share in two runs at a time, who is due longest goes first. Where
-/// runs of one server have all workers, one more is there for a task of another server, so that a
-/// server which never comes to an end holds up its own tasks alone.
+/// all workers are taken, one more is there for each server that has none, so that a server which
+/// never comes to an end holds up its own tasks alone.
 ///
 /// Threads: the loop's. Operations that a person asks for throw RequestError() (task_map.h)
 /// or a failure of the store, and have changed nothing then.

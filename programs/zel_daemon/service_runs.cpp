@@ -18,6 +18,8 @@ using ZEL::Logger;
 
 // After a sign that something has come back.
 constexpr int64_t kSettleMs = 1000;
+// Servers that have a worker each though all others are taken.
+constexpr unsigned int kMoreServers = 32;
 
 void TakeSooner(std::optional<int64_t>& soonest, std::optional<int64_t> wait) {
     if (wait && (!soonest || *wait < *soonest)) {
@@ -173,7 +175,7 @@ void Service::TakeWorker(const ZEL::SyncInfo& info, Room& room) {
 
 bool Service::HasWorker(const ZEL::SyncInfo& info, const Room& room) const {
     return room.running < config_.workers ||
-           (room.running == config_.workers && room.servers.size() == 1 &&
+           (room.running < config_.workers + kMoreServers &&
             room.servers.count(ServerKey(info)) == 0);
 }
 

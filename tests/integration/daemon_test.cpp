@@ -1181,22 +1181,23 @@ TEST_F(DaemonTest, APasswordIsForgottenWhereItWasNotGivenFor) {
 TEST_F(DaemonTest, AServerThatTricklesHoldsUpItsOwnTasksAlone) {
     Configure("[rsync]\nport=\"" + std::to_string(port_) + "\"\nanswer_seconds=\"600\"\n");
     const test::TricklingServer trickling(port_, "127.0.0.2");
+    const test::TricklingServer another(port_, "127.0.0.3");
     zel_.Start();
-    for (const char* name : {"one", "two", "three"}) {
+    for (const std::string name : {"one", "two", "three", "alone"}) {
         PObject task = TaskOf(ZEL::SCHD_MODE_MANUAL);
         task["name"] = name;
-        task["server_ip"] = "127.0.0.2";
-        const std::string share = "share of " + std::string(name);
+        task["server_ip"] = name == "alone" ? "127.0.0.3" : "127.0.0.2";
+        const std::string share = "share of " + name;
         folder_.Write("shares/" + share + "/f", "x");
         Must(Client("share add '" + share + "' '" + folder_.Path("shares/" + share) + "'"));
         task["share_list"].asArray() = {share};
         ASSERT_EQ(Result(task), 0);
         zel_.Ask("task_run", name);
     }
-    ASSERT_TRUE(Await([&] { return trickling.Clients() >= 2; }));
+    ASSERT_TRUE(Await([&] { return trickling.Clients() >= 2 && another.Clients() >= 1; }));
     AddTask();
-    AwaitEqual("beside a server that trickles", 20);
-    EXPECT_EQ(zel_.Ask("daemon_status")["running"].asInt32(), 2);
+    AwaitEqual("beside servers that trickle", 20);
+    EXPECT_EQ(zel_.Ask("daemon_status")["running"].asInt32(), 3);
 
     // Nor does somebody who asks for a preview and does not read it.
     for (int i = 0; i < 5000; ++i) {
@@ -1207,9 +1208,9 @@ TEST_F(DaemonTest, AServerThatTricklesHoldsUpItsOwnTasksAlone) {
     {
         const RawPeer deaf(zel_.Socket());
         deaf.Send(Wire("task_preview"));
-        EXPECT_TRUE(Await([&] { return zel_.Ask("daemon_status")["running"].asInt32() == 3; }));
+        EXPECT_TRUE(Await([&] { return zel_.Ask("daemon_status")["running"].asInt32() == 4; }));
     }
-    EXPECT_TRUE(Await([&] { return zel_.Ask("daemon_status")["running"].asInt32() == 2; }, 20));
+    EXPECT_TRUE(Await([&] { return zel_.Ask("daemon_status")["running"].asInt32() == 3; }, 20));
 #if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)  // which keep what is freed
     EXPECT_LT(Resident(zel_.Pid()), resident + 2000);
 #endif

@@ -239,7 +239,11 @@ TEST_F(PushTest, APushThatIsCutOffLosesNothing) {
     // processes does not hear of it.
     auto push = std::async(std::launch::async, cut_off, "");
     pid_t deaf = 0;
-    EXPECT_TRUE(test::Await([&] { return (deaf = WriterOf(partial)) != 0; }));
+    EXPECT_TRUE(test::Await([&] {
+        const fs::path part = PartOf("large", 1);
+        deaf = WriterOf(part.empty() ? fs::path(partial) : part);
+        return deaf != 0;
+    }));
     const bool is_held = ptrace(PTRACE_SEIZE, deaf, nullptr, nullptr) == 0;  // stops at SIGTERM
     Must(Server("account disable alice"));
     EXPECT_EQ(push.wait_for(std::chrono::seconds(60)), std::future_status::ready);
