@@ -174,9 +174,8 @@ void Service::TakeWorker(const ZEL::SyncInfo& info, Room& room) {
 }
 
 bool Service::HasWorker(const ZEL::SyncInfo& info, const Room& room) const {
-    return room.running < config_.workers ||
-           (room.running < config_.workers + kMoreServers &&
-            room.servers.count(ServerKey(info)) == 0);
+    return room.running < config_.workers || (room.running < config_.workers + kMoreServers &&
+                                              room.servers.count(ServerKey(info)) == 0);
 }
 
 // Whether a worker is free, no other run has one of the shares, and their folders have been found,
