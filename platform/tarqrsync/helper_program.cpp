@@ -12,7 +12,7 @@ namespace TARQ {
 namespace Backup {
 
 std::string HelperProgram(const std::string& name) {
-    const std::string program =
+    std::string program =
         base::FolderOfCode(reinterpret_cast<const void*>(&HelperProgram)) + "/tarqrsync/" + name;
     if (access(program.c_str(), X_OK) != 0) {
         throw ServersError("the program " + program +
