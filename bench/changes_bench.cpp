@@ -205,6 +205,8 @@ public:
         Command();
         const uint64_t command = relay.Bytes() - without;
         Restart();  // what changed right before was sent so soon that it may have changed again
+        std::this_thread::sleep_for(std::chrono::seconds(1));
+        Until([&] { return IsSettled("large") && IsSettled("small"); });
         const uint64_t before_start = relay.Bytes();
         const double taken = Milliseconds([&] { Restart(); });
         std::this_thread::sleep_for(std::chrono::seconds(2));
