@@ -38,6 +38,11 @@ constexpr milliseconds kBurialGrace(200);
 constexpr milliseconds kEarlyEndWatch(100);
 constexpr microseconds kEarlyEndStep(200);
 
+// What a program writes line by line is not read line by line: it gathers for so long. A program
+// that fills its pipe sooner is read without a pause.
+constexpr milliseconds kGather(5);
+constexpr size_t kPipeBytes = 65536;
+
 constexpr int kFirstFreeFd = 3;
 
 struct Pipe {
@@ -207,21 +212,21 @@ struct Stream {
     UniqueFd fd;
     const OutputHandler* handler;
 
-    // Reads once; closes the stream at its end. True when there may be more at once.
-    bool ReadOnce() {
-        std::array<char, 16384> buffer;
-        const ssize_t count = read(fd.Get(), buffer.data(), buffer.size());
+    // Reads what is there; closes the stream at its end. How much it was.
+    size_t Read() {
+        std::array<char, kPipeBytes> buffer;
+        ssize_t count;
+        do {
+            count = read(fd.Get(), buffer.data(), buffer.size());
+        } while (count < 0 && errno == EINTR);
         if (count > 0) {
             (*handler)(buffer.data(), static_cast<size_t>(count));
-            return true;
-        }
-        if (count < 0 && errno == EINTR) {
-            return true;
+            return static_cast<size_t>(count);
         }
         if (count == 0 || errno != EAGAIN) {
             fd.Reset();
         }
-        return false;
+        return 0;
     }
 };
 
@@ -300,14 +305,15 @@ private:
     Clock::time_point until_;
 };
 
-// Waits until something happens or the time is up; without a time, for as long as it takes.
-void Wait(const ProcessGroup& group, const Stream& output, const Stream& error,
+// Waits until something happens or the time is up; without a time, for as long as it takes. While
+// output gathers, that it comes is not what is waited for.
+void Wait(const ProcessGroup& group, const Stream& output, const Stream& error, bool gathers,
           EarlyEndWatch* watch, std::optional<Clock::time_point> until) {
     // poll() skips descriptors of -1, which is what a closed stream and a kernel without pidfds
     // have.
     std::array<pollfd, 4> fds = {{{group.ExitFd(), POLLIN, 0},
-                                  {output.fd.Get(), POLLIN, 0},
-                                  {error.fd.Get(), POLLIN, 0},
+                                  {gathers ? -1 : output.fd.Get(), POLLIN, 0},
+                                  {gathers ? -1 : error.fd.Get(), POLLIN, 0},
                                   {watch->Fd(), POLLIN, 0}}};
     std::optional<microseconds> longest;
     if (watch->IsAsking()) {
@@ -317,6 +323,9 @@ void Wait(const ProcessGroup& group, const Stream& output, const Stream& error,
         longest = std::clamp<microseconds>(left, microseconds(0), kAskInterval);
     } else if (group.ExitFd() < 0) {
         longest = kAskInterval;
+    }
+    if (gathers) {
+        longest = std::min<microseconds>(longest.value_or(kGather), kGather);
     }
     timespec timeout = {};
     if (longest) {
@@ -381,13 +390,16 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
         next_step = Clock::now() + kAskInterval;
     }
     EarlyEndWatch watch(early_end);
+    bool gathers = false;
     while (!group->LeaderHasEnded()) {
-        Wait(*group, output, error, &watch, next_step);
+        Wait(*group, output, error, gathers, &watch, next_step);
+        size_t most = 0;
         for (Stream* stream : {&output, &error}) {
             if (stream->fd) {
-                stream->ReadOnce();
+                most = std::max(most, stream->Read());
             }
         }
+        gathers = most > 0 && most < kPipeBytes;
         if (!result.cancelled && watch.IsReached(group->Leader())) {
             result.ended_early = true;
             break;
@@ -412,7 +424,7 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
     }
     // The whole group has ended: what is left to read is already in the pipes.
     for (Stream* stream : {&output, &error}) {
-        while (stream->fd && stream->ReadOnce()) {
+        while (stream->fd && stream->Read() > 0) {
         }
     }
     return result;

@@ -41,8 +41,8 @@ struct EarlyEnd {
 
 using OutputHandler = std::function<void(const char* bytes, size_t size)>;
 
-/// Runs a program to its end and hands over what it writes, in pieces as they come. An empty
-/// handler: the output is thrown away.
+/// Runs a program to its end and hands over what it writes, in pieces, some milliseconds after it
+/// was written at the latest. An empty handler: the output is thrown away.
 ///
 /// `cancelled` (may be empty) is asked once before the start, where true means that nothing is
 /// started, and then several times a second. Once it says true the child's process group gets

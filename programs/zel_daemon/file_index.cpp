@@ -89,9 +89,7 @@ public:
 
     void Put(const IndexEntry& entry) {
         Hold(entry.key);
-        const auto at = std::lower_bound(
-            entries_.begin(), entries_.end(), entry.key,
-            [](const IndexEntry& held, const std::string& key) { return held.key < key; });
+        const auto at = Find(entry.key);
         const auto place = at - entries_.begin();
         if (at != entries_.end() && at->key == entry.key) {
             index_.Unlink(at->key, at->facts);
@@ -110,16 +108,12 @@ public:
         Hold(key);
         const std::string end = AfterAllBelow(key);
         for (;;) {
-            const auto removed = [&](const IndexEntry& entry) {
-                return entry.key >= key && entry.key < end;
-            };
-            for (const IndexEntry& entry : entries_) {
-                if (removed(entry)) {
-                    index_.Unlink(entry.key, entry.facts);
-                }
-            }
-            entries_.erase(std::remove_if(entries_.begin(), entries_.end(), removed),
-                           entries_.end());
+            const auto first = Find(key);
+            const auto last = Find(end);
+            std::for_each(first, last, [&](const IndexEntry& entry) {
+                index_.Unlink(entry.key, entry.facts);
+            });
+            entries_.erase(first, last);
             if (!limit_ || *limit_ >= end) {
                 return;
             }
@@ -132,6 +126,13 @@ public:
     void Write() { Write(static_cast<ptrdiff_t>(entries_.size())); }
 
 private:
+    // Of what is held, the first that does not come before the key.
+    std::vector<IndexEntry>::iterator Find(const std::string& key) {
+        return std::lower_bound(
+            entries_.begin(), entries_.end(), key,
+            [](const IndexEntry& held, const std::string& wanted) { return held.key < wanted; });
+    }
+
     // Has the chunk in which the key belongs.
     void Hold(const std::string& key) {
         if (held_ && (!limit_ || key < *limit_)) {
@@ -171,12 +172,14 @@ private:
 
     // Writes the first `count` entries that are held, in chunks of one size.
     void Write(ptrdiff_t count) {
-        size_t bytes = 0;
-        {
-            ChunkWriter all;
-            std::for_each(entries_.begin(), entries_.begin() + count,
-                          [&](const IndexEntry& entry) { all.Add(entry.key, entry.facts); });
-            bytes = all.Bytes().size();
+        ChunkWriter all;
+        std::for_each(entries_.begin(), entries_.begin() + count,
+                      [&](const IndexEntry& entry) { all.Add(entry.key, entry.facts); });
+        const size_t bytes = all.Bytes().size();
+        if (count > 0 && bytes < kChunkBytes) {
+            index_.Insert(entries_.front().key, all.Take());
+            entries_.erase(entries_.begin(), entries_.begin() + count);
+            return;
         }
         const size_t most = bytes / (bytes / kChunkBytes + 1) + 1;
         ChunkWriter chunk;

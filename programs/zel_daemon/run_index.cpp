@@ -20,6 +20,7 @@
 #include "programs/zel_daemon/index_walk.h"
 #include "programs/zel_daemon/path_key.h"
 #include "programs/zel_daemon/share_debts.h"
+#include "programs/zel_daemon/share_folder.h"
 #include "programs/zel_daemon/tree_list.h"
 
 namespace zel_daemon {
@@ -260,10 +261,11 @@ private:
             keys.push_back(KeyOf(path));
         }
         std::sort(keys.begin(), keys.end());
+        const base::UniqueFd share = OpenShareFolder(folder_);
         // The share's own folder is sent along with what is right in it alone.
         if (std::any_of(keys.begin(), keys.end(),
                         [](const std::string& key) { return ParentOf(key).empty(); })) {
-            NoteFolder("");
+            NoteFolder(share, "");
         }
         std::string noted;  // the folder that was noted last
         std::optional<std::string> done;
@@ -272,7 +274,7 @@ private:
                 continue;
             }
             done = key;
-            NoteFolders(std::string(ParentOf(key)), noted);
+            NoteFolders(share, std::string(ParentOf(key)), noted);
             changes_.Replace(key);
             const auto moved = moved_.find(key);
             if (moved != moved_.end()) {
@@ -281,13 +283,11 @@ private:
                     Note(entry);
                 }
             } else {
-                TreeList list(folder_, PathOf(key), cancelled);
-                TreeList::Entry entry;
-                for (auto found = list.Next(entry); found != TreeList::Found::kEnd;
-                     found = list.Next(entry)) {
-                    if (found == TreeList::Found::kEntry) {
-                        Note({KeyOf(entry.path), entry.facts});
-                    }
+                const auto facts = FactsAt(share, PathOf(key));
+                if (facts && facts->IsFolder()) {
+                    NoteTree(key, cancelled);
+                } else if (facts) {
+                    Note({key, *facts});
                 }
             }
             if (changes_.Bytes() > kMostBytes) {
@@ -305,6 +305,17 @@ private:
         }
     }
 
+    void NoteTree(const std::string& key, const std::function<bool()>& cancelled) {
+        TreeList list(folder_, PathOf(key), cancelled);
+        TreeList::Entry entry;
+        for (auto found = list.Next(entry); found != TreeList::Found::kEnd;
+             found = list.Next(entry)) {
+            if (found == TreeList::Found::kEntry) {
+                Note({KeyOf(entry.path), entry.facts});
+            }
+        }
+    }
+
     void FindLittleChanged(FileIndex& index, const std::function<bool()>& cancelled) {
         for (const size_t i : AloneIn(order_.moves)) {
             programs::ShareMove& move = order_.moves[i];
@@ -317,22 +328,20 @@ private:
     }
 
     // The folders on the way to this one are sent along, and it as well.
-    void NoteFolders(const std::string& folder, std::string& noted) {
+    void NoteFolders(const base::UniqueFd& share, const std::string& folder, std::string& noted) {
         for (size_t end = 1; end < folder.size(); ++end) {
             end = std::min(folder.find('\0', end), folder.size());
             const std::string above = folder.substr(0, end);
             if (!IsWithin(noted, above)) {
-                NoteFolder(above);
+                NoteFolder(share, above);
             }
         }
         noted = folder;
     }
 
-    void NoteFolder(const std::string& key) {
-        TreeList list(folder_, PathOf(key), [] { return false; });
-        TreeList::Entry entry;
-        if (list.Next(entry) == TreeList::Found::kEntry) {
-            changes_.Put(key, entry.facts);
+    void NoteFolder(const base::UniqueFd& share, const std::string& key) {
+        if (const auto facts = FactsAt(share, PathOf(key))) {
+            changes_.Put(key, *facts);
         }
     }
 

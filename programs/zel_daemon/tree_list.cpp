@@ -12,6 +12,7 @@
 #include "base/open_beneath.h"
 #include "programs/common/failure.h"
 #include "programs/common/share_path.h"
+#include "programs/zel_daemon/share_folder.h"
 #include "tarq/rsync_wrapper.h"
 
 namespace zel_daemon {
@@ -39,16 +40,13 @@ std::string Below(const std::string& folder, const std::string& name) {
 
 TreeList::TreeList(std::string folder, std::string start, std::function<bool()> cancelled)
     : folder_(std::move(folder)), start_(std::move(start)), cancelled_(std::move(cancelled)) {
-    const UniqueFd share(open(folder_.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (!share || fstat(share.Get(), &identity_) != 0) {
-        throw programs::SystemFailure("cannot open " + folder_, programs::FailureKind::kLocal);
-    }
+    fstat(OpenShareFolder(folder_).Get(), &identity_);
 }
 
 UniqueFd TreeList::OpenShare() {
-    UniqueFd share(open(folder_.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    UniqueFd share = OpenShareFolder(folder_);
     struct stat now = {};
-    if (!share || fstat(share.Get(), &now) != 0 || now.st_dev != identity_.st_dev ||
+    if (fstat(share.Get(), &now) != 0 || now.st_dev != identity_.st_dev ||
         now.st_ino != identity_.st_ino) {
         throw programs::Failure(programs::FailureKind::kLocal,
                                 folder_ + " is not the folder any more that it was");
@@ -128,11 +126,7 @@ int TreeList::Fill(Level& level) {
 
 TreeList::Found TreeList::Next(Entry& entry) {
     if (!std::exchange(begun_, true)) {
-        const UniqueFd share = OpenShare();
-        const LookTime look;
-        const UniqueFd start =
-            base::OpenBeneath(share.Get(), start_.substr(1), O_PATH | O_NOFOLLOW);
-        const auto facts = start ? FactsOf(start.Get(), "", look) : std::nullopt;
+        const auto facts = FactsAt(OpenShare(), start_);
         if (!facts) {
             return Found::kEnd;
         }
