@@ -1,13 +1,14 @@
 // What the wrapper costs beside bare rsync, over a daemon of its own on loopback.
 //
-//   rsync_bench [--copies | --encrypted | --versions]
+//   rsync_bench [--copies | --encrypted | --versions [restored | unchanged | replaced]]
 //
 // The server is a real one, `zel_server serve` with its front; the peers have a plain rsync daemon,
 // or an ssh server.
 // --copies: also the large copies, which write 2 GB below $TMPDIR; in memory (/dev/shm) a disk's
 // moods stay out of it. --encrypted: of those the ones over TLS and ssh, and nothing else.
-// --versions: what it costs to keep what is replaced, and a restore by `zelctl restore`. Runs
-// alternate, medians are compared; each line ends in the ratio and the ratio that is wanted.
+// --versions: what it costs to keep what is replaced, and a restore by `zelctl restore`; all of it
+// or one part. Runs alternate, medians are compared; each line ends in the ratio and the ratio that
+// is wanted.
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/time.h>
@@ -202,10 +203,16 @@ public:
 
     // Where nothing changed, and what is brought back, is a tree of such a size that the files cost
     // and not the commands around the run, which are measured by themselves.
-    void Versions() {
-        Restored(100000);
-        NothingChanged(200000);
-        Replaced(20000);
+    void Versions(const std::string& part) {
+        if (part.empty() || part == "restored") {
+            Restored(100000);
+        }
+        if (part.empty() || part == "unchanged") {
+            NothingChanged(200000);
+        }
+        if (part.empty() || part == "replaced") {
+            Replaced(20000);
+        }
     }
 
     void NothingChanged(int count) {
@@ -481,7 +488,7 @@ int main(int argc, char** argv) {
         return 0;
     }
     if (argc > 1 && std::strcmp(argv[1], "--versions") == 0) {
-        bench.Versions();
+        bench.Versions(argc > 2 ? argv[2] : "");
         return 0;
     }
     bench.Commands();

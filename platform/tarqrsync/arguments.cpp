@@ -369,7 +369,7 @@ void AddPullOptions(const InvocationContext& context, PrivateFolder* folder, Wor
 void AddVersions(const InvocationContext& context, Words* arguments) {
     if (!context.versions.empty()) {
         const auto own = [&](const char* folder) {
-            return std::string("=/") + folder + "/" + context.versions;
+            return std::string("=") + folder + "/" + context.versions;
         };
         Append(arguments, {"--backup", "--backup-dir" + own(kVersionsFolder),
                            "--temp-dir" + own(kPartialsFolder)});

@@ -84,9 +84,9 @@ bool IsLetterWord(const std::string& word) {
                        word.end(), base::IsLetter);
 }
 
-// The ID in "/ABOVE/ID"; empty for any other folder.
+// The ID in "ABOVE/ID"; empty for any other folder.
 std::string IdIn(const std::string& folder, const char* above) {
-    const std::string head = std::string("/") + above + "/";
+    const std::string head = std::string(above) + "/";
     const bool fits = folder.compare(0, head.size(), head) == 0;
     return fits && base::AreRandomDigits(folder.substr(head.size())) ? folder.substr(head.size())
                                                                      : "";

@@ -185,9 +185,10 @@ struct HeldFolder {
     bool is_kept = false;
 };
 
-// Of either end of what is moved those of the last absolute path and of the last relative one:
-// rsync goes through a folder file by file, and comes back to the one in which it writes them. One
-// that has another name by now is still the folder that was looked at; one that has gone is empty.
+// Of either end of what is moved those of the last path in a folder of the service and of the last
+// other one: rsync goes through a folder file by file, and comes back to the one in which it writes
+// them. One that has another name by now is still the folder that was looked at; one that has gone
+// is empty.
 HeldFolder held[2][2];
 
 void HoldNone() {
@@ -224,6 +225,11 @@ public:
     }
 
 private:
+    static bool IsOfTheService(const char* path) {
+        const char* const name = *path == '/' ? path + 1 : path;
+        return strncmp(name, kVersionsFolder, strlen(kVersionsFolder)) == 0 ||
+               strncmp(name, kPartialsFolder, strlen(kPartialsFolder)) == 0;
+    }
     // With the slashes that end the path, which mean something to the kernel.
     static const char* LastName(const char* path) {
         const char* name = path + strlen(path);
@@ -252,7 +258,7 @@ private:
             is_kept_ = own_ && IsAmongVersions(above_);
             return;
         }
-        HeldFolder& last = held[end][*path == '/' ? 1 : 0];
+        HeldFolder& last = held[end][IsOfTheService(path) ? 1 : 0];
         if (!last.folder || strcmp(last.path, folder) != 0) {
             last.folder = OpenFolder(above, folder);
             memcpy(last.path, folder, strlen(folder) + 1);
