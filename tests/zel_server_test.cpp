@@ -162,9 +162,9 @@ const Words kWrite = {"--server",
                       "-blWogDtpAXre.iLsfxCIvu",
                       "--log-format=%i",
                       "--backup-dir",
-                      "/.zel_versions/" + std::string(32, '1'),
+                      ".zel_versions/" + std::string(32, '1'),
                       "--temp-dir",
-                      "/.zel_partial/" + std::string(32, '1'),
+                      ".zel_partial/" + std::string(32, '1'),
                       "--timeout=600",
                       "--bwlimit=100",
                       "--delete-after",
@@ -178,7 +178,7 @@ const Words kDelta = {"--server",
                       "-blogDtprRze.LsfxCIvu",
                       "--log-format=%i%I",
                       "--backup-dir",
-                      "/.zel_versions/" + std::string(32, '2'),
+                      ".zel_versions/" + std::string(32, '2'),
                       ".",
                       "/"};
 const Words kDryRun = {"--server", "-nlogDtpre.iLsfxCIvu", ".", "sub/folder"};
@@ -386,7 +386,7 @@ TEST_F(ServerTest, ARunThatTheClientDoesNotMakeIsRefused) {
         EXPECT_NE(Admit("docs", "alice", words), 0) << word;
     }
     // Without versions, with the folder of another, in another place, twice, or away from the root.
-    const std::string folder = "/.zel_versions/" + std::string(32, '3');
+    const std::string folder = ".zel_versions/" + std::string(32, '3');
     const auto admit = [&](const std::string& letters, const Words& more,
                            const std::string& path = ".") {
         Words words = {"--server", letters};
@@ -399,20 +399,20 @@ TEST_F(ServerTest, ARunThatTheClientDoesNotMakeIsRefused) {
     EXPECT_NE(admit("-blre.i", {"--backup-dir", folder, "--backup-dir", folder}), 0);
     EXPECT_NE(admit("-blre.i", {"--backup-dir", folder}, "sub"), 0);
     EXPECT_NE(admit("-blre.i", {"--backup-dir", folder}, "/.zel_versions"), 0);
-    for (const std::string& other : {std::string("/.zel_versions"), folder + "/x", "/x" + folder,
-                                     folder.substr(1), std::string("/old"), std::string("..")}) {
+    for (const std::string& other : {std::string(".zel_versions"), folder + "/x", "x/" + folder,
+                                     "/" + folder, std::string("old"), std::string("..")}) {
         EXPECT_NE(admit("-blre.i", {"--backup-dir", other}), 0) << other;
     }
     // Beside a file there is a part of it only when one was offered; no run has another's folder.
     for (const std::string& other :
-         {std::string(".tarqrsync-partial"), std::string("/.zel_partial"),
-          "/.zel_partial/" + std::string(32, '4')}) {
+         {std::string(".tarqrsync-partial"), std::string(".zel_partial"),
+          ".zel_partial/" + std::string(32, '4')}) {
         EXPECT_NE(admit("-blre.i", {"--backup-dir", folder, "--partial-dir", other}), 0) << other;
     }
     EXPECT_EQ(admit("-blre.i", {"--backup-dir", folder}), 0);
     EXPECT_NE(admit("-blre.i", {"--backup-dir", folder}), 0);  // still in use
     // A list of changes, and folders by their entries.
-    EXPECT_EQ(admit("-bldRe.i", {"--backup-dir", "/.zel_versions/" + std::string(32, '5'),
+    EXPECT_EQ(admit("-bldRe.i", {"--backup-dir", ".zel_versions/" + std::string(32, '5'),
                                  "--delete-after", "--delete-missing-args", "--no-r"}),
               0);
     Words hidden = {"--server", "-re.i"};

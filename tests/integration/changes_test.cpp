@@ -398,8 +398,8 @@ TEST_F(AtOnceTest, NothingElseIsDoneThroughItsModule) {
     const std::string early = "--early-input=early ";
     const std::string as_ours =
         "-rlptgoD --whole-file --delete-after --modify-window=-1 "
-        "--numeric-ids --backup --backup-dir=/.zel_versions/" +
-        id + " --temp-dir=/.zel_partial/" + id + " ";
+        "--numeric-ids --backup --backup-dir=.zel_versions/" +
+        id + " --temp-dir=.zel_partial/" + id + " ";
     const std::string push = "bait/ $module";
     ASSERT_EQ(ConnectionsOfAChange(), 1u);
 

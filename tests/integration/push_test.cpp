@@ -64,7 +64,7 @@ protected:
 
     /// What a run that writes has to ask for. Each has an ID of its own.
     static std::string Kept(char digit) {
-        return " --backup --backup-dir=/.zel_versions/" + std::string(32, digit) + " ";
+        return " --backup --backup-dir=.zel_versions/" + std::string(32, digit) + " ";
     }
     /// The folders of the versions of "docs", the oldest first, once the server has taken them all.
     std::vector<std::string> Versions() const {
