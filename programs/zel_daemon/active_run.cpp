@@ -1,10 +1,8 @@
 #include "programs/zel_daemon/active_run.h"
 
-#include <system_error>
 #include <utility>
 
 #include "ZEL/zel.h"
-#include "programs/common/host.h"
 #include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {
@@ -16,8 +14,6 @@ using TARQ::Backup::RunProgress;
 
 // A server that has not answered for so long may have moved to another address.
 constexpr std::chrono::minutes kOld(10);
-// What a run needs: the ends of pipes to two rsyncs, and files that are read on the way.
-constexpr unsigned int kDescriptors = 16;
 
 std::string FolderOf(const std::string& share) {
     ZEL::ShareInfo facts;
@@ -58,40 +54,30 @@ ActiveRun::ActiveRun(EventLoop& loop, std::shared_ptr<Connection> connection,
     : connection_(std::move(connection)),
       order_(std::move(order)),
       indexes_(std::move(indexes)),
-      moment_(moment) {
-    try {
-        thread_ =
-            std::thread([this, &loop, on_progress, on_end] { Work(loop, on_progress, on_end); });
-    } catch (const std::system_error& error) {
-        End(loop, on_end, {NothingDone(ReasonOf(error.code().value()))});
-    }
+      moment_(moment),
+      worker_(loop) {
+    worker_.Start<Outcome>([this, on_progress] { return Work(on_progress); },
+                           [this](const std::string& why) { return Outcome{NothingDone(why)}; },
+                           [this, on_end](const Outcome& outcome) {
+                               ended_ = true;
+                               on_end(outcome);
+                           });
 }
 
 ActiveRun::~ActiveRun() {
-    *alive_ = false;
     if (!ended_) {
         Cancel();
     }
-    if (thread_.joinable()) {
-        thread_.join();
-    }
 }
 
-void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd& on_end) {
+ActiveRun::Outcome ActiveRun::Work(const OnProgress& on_progress) {
     connection_->on_progress = [&](const std::string& share, const RunProgress& made) {
-        loop.Post([alive = alive_, on_progress, share, made] {
-            if (*alive) {
-                on_progress(share, made);
-            }
-        });
+        worker_.Tell([on_progress, share, made] { on_progress(share, made); });
     };
     Outcome outcome;
     try {
-        // In the middle of a run their lack would look like a volume that is not mounted, or worse.
-        const int lack = LackOfDescriptors(kDescriptors);
-        // What lies in /tmp may have been cleaned away since the start.
-        const std::string unprepared = lack != 0 ? ReasonOf(lack) : programs::PrepareHost();
-        if (unprepared.empty()) {
+        const std::string problem = RunProblem();
+        if (problem.empty()) {
             RunIndexes indexes(indexes_, order_, moment_,
                                [this] { return connection_->cancel.load(); });
             outcome.result = connection_->For(order_).Push(order_, outcome.totals);
@@ -100,26 +86,17 @@ void ActiveRun::Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd
             }
             outcome.linked = indexes.Ended(outcome.result);
         } else {
-            outcome.result = NothingDone(unprepared);
+            outcome.result = NothingDone(problem);
         }
     } catch (const std::exception& error) {
         outcome.result = NothingDone(error.what());
     }
     connection_->on_progress = nullptr;
-    End(loop, on_end, outcome);
+    return outcome;
 }
 
 RunResult ActiveRun::NothingDone(const std::string& why) const {
     return programs::NothingDone(order_, {programs::FailureKind::kLocal, 0, why});
-}
-
-void ActiveRun::End(EventLoop& loop, const OnEnd& on_end, const Outcome& outcome) {
-    loop.Post([this, alive = alive_, on_end, outcome] {
-        if (*alive) {
-            ended_ = true;
-            on_end(outcome);
-        }
-    });
 }
 
 }  // namespace zel_daemon

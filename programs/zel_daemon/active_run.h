@@ -7,10 +7,9 @@
 #include <map>
 #include <memory>
 #include <string>
-#include <thread>
 
 #include "programs/common/task_run.h"
-#include "programs/zel_daemon/event_loop.h"
+#include "programs/zel_daemon/loop_worker.h"
 #include "programs/zel_daemon/run_index.h"
 
 namespace zel_daemon {
@@ -69,17 +68,15 @@ public:
     TARQ::Backup::RunProgress progress;
 
 private:
-    void Work(EventLoop& loop, const OnProgress& on_progress, const OnEnd& on_end);
+    Outcome Work(const OnProgress& on_progress);
     programs::RunResult NothingDone(const std::string& why) const;
-    void End(EventLoop& loop, const OnEnd& on_end, const Outcome& outcome);
 
     std::shared_ptr<Connection> connection_;
     programs::RunOrder order_;  // the thread's
     const IndexPlace indexes_;
     const int64_t moment_;
-    std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);  // the loop's thread alone
-    bool ended_ = false;                                          // the loop's thread alone
-    std::thread thread_;
+    bool ended_ = false;  // the loop's thread alone
+    LoopWorker worker_;
 };
 
 }  // namespace zel_daemon

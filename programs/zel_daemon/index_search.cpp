@@ -2,11 +2,10 @@
 
 #include <algorithm>
 #include <chrono>
-#include <system_error>
+#include <thread>
 #include <utility>
 
 #include "base/background_priority.h"
-#include "programs/common/host.h"
 #include "programs/zel_daemon/index_walk.h"
 #include "programs/zel_daemon/path_key.h"
 #include "programs/zel_daemon/shortage.h"
@@ -178,54 +177,29 @@ void FindChanges(FileIndex& index, const std::string& folder,
 
 IndexSearch::IndexSearch(EventLoop& loop, SearchOrder order, const OnChanges& on_changes,
                          const OnEnd& on_end)
-    : order_(std::move(order)) {
-    const auto end = [&loop, alive = alive_, on_end](const SearchOutcome& outcome) {
-        loop.Post([alive, on_end, outcome] {
-            if (*alive) {
-                on_end(outcome);
-            }
-        });
-    };
-    const auto waiting = std::make_shared<std::atomic<int>>(0);
-    const auto tell = [this, &loop, waiting, on_changes](std::vector<std::string> paths) {
-        while (*waiting >= kMostWaiting && !*cancel_) {
-            std::this_thread::sleep_for(kWait);
-        }
-        ++*waiting;
-        loop.Post([alive = alive_, waiting, on_changes, found = std::move(paths)] {
-            --*waiting;
-            if (*alive) {
-                on_changes(found);
-            }
-        });
-    };
-    try {
-        thread_ = std::thread([this, end, tell] {
-            base::GiveWay(0);
-            SearchOutcome outcome;
-            try {
-                outcome = Work(tell);
-            } catch (const std::exception& error) {
-                outcome.problem = error.what();
-            }
-            end(outcome);
-        });
-    } catch (const std::system_error& error) {
-        SearchOutcome outcome;
-        outcome.problem = ReasonOf(error.code().value());
-        end(outcome);
-    }
+    : order_(std::move(order)), worker_(loop) {
+    worker_.Start<SearchOutcome>([this, on_changes] { return Work(on_changes); },
+                                 [](const std::string& why) {
+                                     SearchOutcome outcome;
+                                     outcome.problem = why;
+                                     return outcome;
+                                 },
+                                 on_end);
 }
 
-IndexSearch::~IndexSearch() {
-    *alive_ = false;
-    Cancel();
-    if (thread_.joinable()) {
-        thread_.join();
+void IndexSearch::Tell(const OnChanges& on_changes, std::vector<std::string> paths) {
+    while (waiting_ >= kMostWaiting && !cancel_) {
+        std::this_thread::sleep_for(kWait);
     }
+    ++waiting_;
+    worker_.Tell([this, on_changes, found = std::move(paths)] {
+        --waiting_;
+        on_changes(found);
+    });
 }
 
-SearchOutcome IndexSearch::Work(const std::function<void(std::vector<std::string>)>& tell) const {
+SearchOutcome IndexSearch::Work(const OnChanges& on_changes) {
+    base::GiveWay(0);
     SearchOutcome outcome;
     outcome.problem = ShareProblem(order_.share);
     if (!outcome.problem.empty()) {
@@ -239,18 +213,18 @@ SearchOutcome IndexSearch::Work(const std::function<void(std::vector<std::string
     }
     std::vector<std::string> paths;
     FindChanges(
-        index, order_.folder, [this] { return cancel_->load(); },
+        index, order_.folder, [this] { return cancel_.load(); },
         [&](const std::string& path) {
             ++outcome.changes;
             paths.push_back(path);
             if (paths.size() == kTogether) {
-                tell(std::exchange(paths, {}));
+                Tell(on_changes, std::exchange(paths, {}));
             }
         });
     if (!paths.empty()) {
-        tell(std::move(paths));
+        Tell(on_changes, std::move(paths));
     }
-    if (*cancel_) {
+    if (cancel_) {
         outcome.problem = "it was ended";
     }
     outcome.compared = stamp->compared;

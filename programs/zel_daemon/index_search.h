@@ -4,14 +4,12 @@
 #include <atomic>
 #include <cstdint>
 #include <functional>
-#include <memory>
 #include <optional>
 #include <string>
-#include <thread>
 #include <vector>
 
-#include "programs/zel_daemon/event_loop.h"
 #include "programs/zel_daemon/file_index.h"
+#include "programs/zel_daemon/loop_worker.h"
 
 namespace zel_daemon {
 
@@ -53,21 +51,22 @@ public:
     IndexSearch(EventLoop& loop, SearchOrder order, const OnChanges& on_changes,
                 const OnEnd& on_end);
     /// Cancels and waits for the end.
-    ~IndexSearch();
+    ~IndexSearch() { Cancel(); }
     IndexSearch(const IndexSearch&) = delete;
     IndexSearch& operator=(const IndexSearch&) = delete;
 
     /// Ends it soon, with a problem.
-    void Cancel() { *cancel_ = true; }
+    void Cancel() { cancel_ = true; }
     const SearchOrder& Order() const { return order_; }
 
 private:
-    SearchOutcome Work(const std::function<void(std::vector<std::string>)>& tell) const;
+    SearchOutcome Work(const OnChanges& on_changes);
+    void Tell(const OnChanges& on_changes, std::vector<std::string> paths);
 
     const SearchOrder order_;
-    std::shared_ptr<std::atomic<bool>> cancel_ = std::make_shared<std::atomic<bool>>(false);
-    std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);  // the loop's thread alone
-    std::thread thread_;
+    std::atomic<bool> cancel_{false};
+    std::atomic<int> waiting_{0};  // for the loop: parts that were told
+    LoopWorker worker_;
 };
 
 }  // namespace zel_daemon

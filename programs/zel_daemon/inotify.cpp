@@ -7,7 +7,7 @@
 #include <cstdio>
 #include <cstring>
 
-#include "programs/zel_daemon/shortage.h"
+#include "programs/common/host.h"
 
 namespace zel_daemon {
 
@@ -34,7 +34,7 @@ int Inotify::Open() {
         return 0;
     }
     const int error = errno;
-    return error == EMFILE && LackOfDescriptors(1) == 0 ? EUSERS : error;
+    return error == EMFILE && programs::LackOfDescriptors(1) == 0 ? EUSERS : error;
 }
 
 int Inotify::Watch(int folder) {

@@ -1,9 +1,7 @@
 #include "programs/zel_daemon/preview_run.h"
 
-#include <system_error>
 #include <utility>
 
-#include "programs/common/host.h"
 #include "programs/zel_daemon/shortage.h"
 
 namespace zel_daemon {
@@ -18,7 +16,6 @@ using ZEL::PObject;
 
 constexpr size_t kMaxInBatch = 1000;
 constexpr std::chrono::milliseconds kGather(50);
-constexpr unsigned int kDescriptors = 16;  // as a run needs
 
 PObject Number(uint64_t value) {
     return PObject(static_cast<unsigned long long>(value));
@@ -146,46 +143,36 @@ void PreviewFeed::Cancel() {
 PreviewRun::PreviewRun(EventLoop& loop, std::shared_ptr<PreviewFeed> feed,
                        const ZEL::SyncInfo& info, programs::RunOrder order,
                        PreviewListener listener)
-    : feed_(std::move(feed)), listener_(std::move(listener)) {
-    const auto end = [this, &loop, alive = alive_](const std::optional<RunFailure>& failure) {
-        loop.Post([this, alive, failure] {
-            if (!*alive) {
-                return;
-            }
-            if (!failure) {
-                listener_.on_success();
-            }
-            feed_->End(failure);
-            const auto on_end = listener_.on_end;  // may end this object
-            on_end();
-        });
-    };
-    try {
-        thread_ =
-            std::thread([this, info, order = std::move(order), end] { end(Work(info, order)); });
-    } catch (const std::system_error& error) {
-        end(RunFailure(FailureKind::kLocal, 0, ReasonOf(error.code().value())));
-    }
+    : feed_(std::move(feed)), listener_(std::move(listener)), worker_(loop) {
+    worker_.Start<Failed>(
+        [this, info, order = std::move(order)] { return Work(info, order); },
+        [](const std::string& why) { return RunFailure(FailureKind::kLocal, 0, why); },
+        [this](const Failed& failure) { End(failure); });
 }
 
 PreviewRun::~PreviewRun() {
-    *alive_ = false;
     feed_->Cancel();
-    if (thread_.joinable()) {
-        thread_.join();
-    }
+    worker_.Stop();
     feed_->End(RunFailure(FailureKind::kCancelled, 0, "it was ended"));
 }
 
-std::optional<RunFailure> PreviewRun::Work(const ZEL::SyncInfo& info,
-                                           const programs::RunOrder& order) const {
+void PreviewRun::End(const Failed& failure) const {
+    if (!failure) {
+        listener_.on_success();
+    }
+    feed_->End(failure);
+    const auto on_end = listener_.on_end;  // may end this object
+    on_end();
+}
+
+PreviewRun::Failed PreviewRun::Work(const ZEL::SyncInfo& info,
+                                    const programs::RunOrder& order) const {
     feed_->Begin();
+    const std::string problem = RunProblem();
+    if (!problem.empty()) {
+        return RunFailure(FailureKind::kLocal, 0, problem);
+    }
     try {
-        const int lack = LackOfDescriptors(kDescriptors);
-        const std::string unprepared = lack != 0 ? ReasonOf(lack) : programs::PrepareHost();
-        if (!unprepared.empty()) {
-            throw RunFailure(FailureKind::kLocal, 0, unprepared);
-        }
         programs::TaskRun run(info, feed_->Cancelled());
         programs::Preview(run, order,
                           {[&](const std::string& share, const RunChange& change) {
@@ -198,8 +185,6 @@ std::optional<RunFailure> PreviewRun::Work(const ZEL::SyncInfo& info,
         return std::nullopt;
     } catch (const RunFailure& failure) {
         return failure;
-    } catch (const std::exception& error) {
-        return RunFailure(FailureKind::kLocal, 0, error.what());
     }
 }
 

@@ -11,11 +11,10 @@
 #include <mutex>
 #include <optional>
 #include <string>
-#include <thread>
 
 #include "ZEL/pobject.h"
 #include "programs/common/preview.h"
-#include "programs/zel_daemon/event_loop.h"
+#include "programs/zel_daemon/loop_worker.h"
 
 namespace zel_daemon {
 
@@ -97,13 +96,14 @@ public:
     PreviewRun& operator=(const PreviewRun&) = delete;
 
 private:
-    std::optional<programs::RunFailure> Work(const ZEL::SyncInfo& info,
-                                             const programs::RunOrder& order) const;
+    using Failed = std::optional<programs::RunFailure>;
+
+    Failed Work(const ZEL::SyncInfo& info, const programs::RunOrder& order) const;
+    void End(const Failed& failure) const;
 
     std::shared_ptr<PreviewFeed> feed_;
     const PreviewListener listener_;
-    std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);  // the loop's thread alone
-    std::thread thread_;
+    LoopWorker worker_;
 };
 
 }  // namespace zel_daemon

@@ -3,9 +3,19 @@
 #include <cerrno>
 #include <cstring>
 
+#include "programs/common/host.h"
 #include "programs/common/text.h"
 
 namespace zel_daemon {
+
+namespace {
+
+using programs::LackOfDescriptors;
+
+// What a run needs: the ends of pipes to two rsyncs, and files that are read on the way.
+constexpr unsigned int kRunDescriptors = 16;
+
+}  // namespace
 
 std::string ReasonOf(int error) {
     switch (error) {
@@ -21,6 +31,12 @@ std::string ReasonOf(int error) {
         default:
             return strerror(error);
     }
+}
+
+std::string RunProblem() {
+    const int lack = LackOfDescriptors(kRunDescriptors);
+    // What lies in /tmp may have been cleaned away since the start.
+    return lack != 0 ? ReasonOf(lack) : programs::PrepareHost();
 }
 
 std::string ShareProblem(const std::string& share) {

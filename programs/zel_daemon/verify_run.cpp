@@ -6,12 +6,10 @@
 #include <algorithm>
 #include <cerrno>
 #include <set>
-#include <system_error>
 #include <utility>
 
 #include "ZEL/zel.h"
 #include "base/unique_fd.h"
-#include "programs/common/host.h"
 #include "programs/common/task_run.h"
 #include "programs/zel_daemon/shortage.h"
 
@@ -21,8 +19,6 @@ namespace {
 
 using programs::RunOrder;
 using TARQ::Backup::RunChange;
-
-constexpr unsigned int kDescriptors = 16;  // as a run needs
 
 // No share has more than its volume, unless something else is mounted below it.
 void Estimate(const std::string& folder, VerifyRound& round) {
@@ -42,43 +38,19 @@ bool IsForbidden(const std::string& path) {
 }  // namespace
 
 VerifyRun::VerifyRun(EventLoop& loop, VerifyOrder order, const OnEnd& on_end)
-    : order_(std::move(order)) {
-    const auto end = [&loop, alive = alive_, on_end](const VerifyOutcome& outcome) {
-        loop.Post([alive, on_end, outcome] {
-            if (*alive) {
-                on_end(outcome);
-            }
-        });
-    };
-    try {
-        thread_ = std::thread([this, end] {
-            VerifyOutcome outcome;
-            try {
-                outcome = Work();
-            } catch (const std::exception& error) {
-                outcome.problem = error.what();
-            }
-            end(outcome);
-        });
-    } catch (const std::system_error& error) {
-        VerifyOutcome outcome;
-        outcome.problem = ReasonOf(error.code().value());
-        end(outcome);
-    }
-}
-
-VerifyRun::~VerifyRun() {
-    *alive_ = false;
-    Cancel();
-    if (thread_.joinable()) {
-        thread_.join();
-    }
+    : order_(std::move(order)), worker_(loop) {
+    worker_.Start<VerifyOutcome>([this] { return Work(); },
+                                 [](const std::string& why) {
+                                     VerifyOutcome outcome;
+                                     outcome.problem = why;
+                                     return outcome;
+                                 },
+                                 on_end);
 }
 
 VerifyOutcome VerifyRun::Work() const {
     VerifyOutcome outcome;
-    const int lack = LackOfDescriptors(kDescriptors);
-    outcome.problem = lack != 0 ? ReasonOf(lack) : programs::PrepareHost();
+    outcome.problem = RunProblem();
     if (outcome.problem.empty()) {
         outcome.problem = ShareProblem(order_.share);
     }

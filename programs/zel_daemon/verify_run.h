@@ -5,13 +5,11 @@
 #include <cstdint>
 #include <functional>
 #include <map>
-#include <memory>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "ZEL/sync_obj.h"
-#include "programs/zel_daemon/event_loop.h"
+#include "programs/zel_daemon/loop_worker.h"
 #include "programs/zel_daemon/verification.h"
 #include "programs/zel_daemon/verify_slice.h"
 
@@ -44,7 +42,7 @@ public:
     /// loop's thread, after this; never once this object is gone.
     VerifyRun(EventLoop& loop, VerifyOrder order, const OnEnd& on_end);
     /// Cancels and waits for the end.
-    ~VerifyRun();
+    ~VerifyRun() { Cancel(); }
     VerifyRun(const VerifyRun&) = delete;
     VerifyRun& operator=(const VerifyRun&) = delete;
 
@@ -59,8 +57,7 @@ private:
 
     const VerifyOrder order_;
     std::atomic<bool> cancel_{false};
-    std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);  // the loop's thread alone
-    std::thread thread_;
+    LoopWorker worker_;
 };
 
 }  // namespace zel_daemon
