@@ -1103,6 +1103,7 @@ TEST_F(DaemonGroupTest, NobodyKeepsOthersFromTheDaemon) {
     ASSERT_EQ(pipe(held), 0);
     const pid_t child = fork();
     if (child == 0) {
+        setpgid(0, 0);
         EXPECT_TRUE(AsUser(true, [&] {
             const bool some = watch_all() == 16;
             return write(held[1], some ? "y" : "n", 1) == 1 && pause() == 0;
@@ -1115,7 +1116,7 @@ TEST_F(DaemonGroupTest, NobodyKeepsOthersFromTheDaemon) {
     EXPECT_EQ(watch_all(), 24U);
     EXPECT_EQ(Result(Request("task_list")), 0) << "behind all of them";
     EXPECT_EQ(Result(Request("task_pause", "t")), 0);
-    kill(child, SIGKILL);
+    kill(-child, SIGKILL);  // and the user
     waitpid(child, nullptr, 0);
 }
 
