@@ -29,6 +29,7 @@
 #include "bench/client_and_server.h"
 #include "bench/compare.h"
 #include "bench/counting_relay.h"
+#include "bench/rsync_memory.h"
 
 namespace {
 
@@ -173,7 +174,9 @@ public:
         std::this_thread::sleep_for(std::chrono::seconds(1));
         PushOnChange("small", 600);
         const size_t before = ResidentKilobytes();
+        RsyncMemory memory;
         const double first = Milliseconds([&] { PushOnChange("large", 3600); });
+        memory.Stop();
         std::error_code none;
         uint64_t bytes = 0;
         for (const auto& index : fs::recursive_directory_iterator(
@@ -188,6 +191,10 @@ public:
             (std::to_string(files) + " files").c_str(), first / 1000,
             ResidentKilobytes() - std::min(before, ResidentKilobytes()),
             static_cast<double>(bytes) / files);
+        std::printf("%-34s %9llu MiB of the client's rsync, %llu MiB of the server's\n",
+                    "meanwhile, at most",
+                    static_cast<unsigned long long>(memory.MostOfClients() / 1024),
+                    static_cast<unsigned long long>(memory.MostOfServers() / 1024));
         std::fflush(stdout);
         int number = 0;
         const auto change = [&](const std::string& share) {
