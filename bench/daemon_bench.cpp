@@ -68,9 +68,14 @@ public:
                 kLists, "at most 1.5");
     }
 
-    /// Beside a program that does nothing at all.
+    /// Beside a program that does nothing at all. What was added is first left with the server.
     void Idle() {
-        std::this_thread::sleep_for(std::chrono::seconds(1));
+        const auto rests = [&] {
+            const uint64_t before = Switches();
+            std::this_thread::sleep_for(std::chrono::seconds(5));
+            return Switches() == before;
+        };
+        Must(test::Await(rests, 120), "the daemon does not come to rest");
         const uint64_t switches = Switches();
         const double cpu = CpuMilliseconds();
         std::this_thread::sleep_for(std::chrono::seconds(kIdleSeconds));

@@ -404,9 +404,8 @@ TEST_F(ServerTest, ARunThatTheClientDoesNotMakeIsRefused) {
         EXPECT_NE(admit("-blre.i", {"--backup-dir", other}), 0) << other;
     }
     // Beside a file there is a part of it only when one was offered; no run has another's folder.
-    for (const std::string& other :
-         {std::string(".tarqrsync-partial"), std::string(".zel_partial"),
-          ".zel_partial/" + std::string(32, '4')}) {
+    for (const std::string& other : {std::string(".tarqrsync-partial"), std::string(".zel_partial"),
+                                     ".zel_partial/" + std::string(32, '4')}) {
         EXPECT_NE(admit("-blre.i", {"--backup-dir", folder, "--partial-dir", other}), 0) << other;
     }
     EXPECT_EQ(admit("-blre.i", {"--backup-dir", folder}), 0);

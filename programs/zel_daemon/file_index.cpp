@@ -110,9 +110,8 @@ public:
         for (;;) {
             const auto first = Find(key);
             const auto last = Find(end);
-            std::for_each(first, last, [&](const IndexEntry& entry) {
-                index_.Unlink(entry.key, entry.facts);
-            });
+            std::for_each(first, last,
+                          [&](const IndexEntry& entry) { index_.Unlink(entry.key, entry.facts); });
             entries_.erase(first, last);
             if (!limit_ || *limit_ >= end) {
                 return;
