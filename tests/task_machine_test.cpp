@@ -131,6 +131,9 @@ private:
                 stored_.erase(std::find_if(stored_.begin(), stored_.end(),
                                            [&](const auto& entry) { return entry.second == id; }));
             }
+            if (!machine_->End()->moved.empty()) {
+                moves_.clear();
+            }
             machine_->EndStored();
         } else {
             if (machine_->HasDebounced()) {
@@ -143,6 +146,9 @@ private:
         for (const auto& [share, paths] : machine_->DebouncedChanges()) {
             for (const std::string& path : paths) {
                 stored_.emplace(std::pair(share, path), ++last_id_);
+            }
+            for (const programs::ShareMove& move : machine_->DebouncedMoves(share)) {
+                moves_.push_back({++last_id_, {move.from, move.to}});
             }
         }
         machine_->ChangesStored();
@@ -162,7 +168,7 @@ private:
                 }
                 return events;
             },
-            [](const std::string&) { return std::vector<zel_daemon::StoredMove>(); });
+            [this](const std::string&) { return moves_; });
     }
     void Start(std::optional<RunPlan> plan) {
         if (!plan) {
@@ -174,6 +180,9 @@ private:
         for (const programs::ShareOrder& share : plan->order.shares) {
             for (const std::string& path : share.paths) {
                 sent_ += " " + share.share + path;
+            }
+            for (const programs::ShareMove& move : share.moves) {
+                sent_ += " " + move.from + ">" + move.to + (move.is_settled ? "" : "?");
             }
         }
         plan->record.id = ++last_id_;
@@ -203,6 +212,7 @@ private:
     std::string times_;
     std::string sent_;
     uint64_t last_id_ = 0;
+    std::vector<zel_daemon::StoredMove> moves_;  // of share "a"
 };
 
 // ---- The schedule ----
@@ -449,6 +459,34 @@ TEST_F(TaskMachineTest, ChangesAreSentOnceItIsQuietAndAFloodAllTheSame) {
     Change("a", "/x");
     Change("b", "/x");
     EXPECT_EQ(stored_.size(), 2u);
+}
+
+// What a run has found at a path may have gone from there before it was sent: a folder that is
+// moved meanwhile is compared with the server's, and not with what is believed to be there.
+TEST_F(TaskMachineTest, WhatIsMovedDuringARunIsNotTakenForWhatTheServerHas) {
+    HaveRealtime();
+    const auto move = [&](const std::string& from, const std::string& to) {
+        machine_->Moved("a", from, to);
+        return Pass(1);
+    };
+    EXPECT_EQ(move("/b/", "/c"), "change a/b a/c /b>/c?") << "some of its time is not heard";
+    machine_->HeardAll();
+    EXPECT_EQ(move("/c/", "/d"), "change a/c a/d /c>/d");
+    machine_->HeardAll();
+    hold_ = true;
+    EXPECT_EQ(Change("a", "/d/x"), "change a/d/x");
+    machine_->HeardAll();
+    EXPECT_EQ(move("/d/", "/e"), "");
+    EXPECT_EQ(End() + Pass(1), "change a/d a/e /d>/e?");
+    // Nor one whose first step was.
+    machine_->HeardAll();
+    hold_ = true;
+    EXPECT_EQ(Change("a", "/e/x"), "change a/e/x");
+    machine_->Moved("a", "/e/", "/f");
+    hold_ = false;
+    machine_->Ended({}, {});
+    machine_->HeardAll();
+    EXPECT_EQ(move("/f/", "/g"), "change a/e a/f a/g /e>/g?");
 }
 
 TEST_F(TaskMachineTest, ALossOfTheWatchOrAFailedResyncLeadsToAResync) {

@@ -62,6 +62,9 @@ struct ShareMove {
     /// sent in its place, once the server has made the move; at least one, which brings the folders
     /// above it along. Empty: all of it is sent.
     std::vector<std::string> instead = {};
+    /// Nothing was on its way to the server while it was moved: what that has of it, and what the
+    /// client believes that it has, are the same.
+    bool is_settled = false;
 };
 
 /// One share of a run, and which of its paths: "/" is all of it, others begin with "/". A path that

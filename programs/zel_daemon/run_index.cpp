@@ -319,7 +319,8 @@ private:
     void FindLittleChanged(FileIndex& index, const std::function<bool()>& cancelled) {
         for (const size_t i : AloneIn(order_.moves)) {
             programs::ShareMove& move = order_.moves[i];
-            MovedFolder seen = LookAtMoved(index, folder_, move, cancelled);
+            MovedFolder seen =
+                move.is_settled ? LookAtMoved(index, folder_, move, cancelled) : MovedFolder();
             if (!seen.files.empty()) {
                 move.instead = std::move(seen.files);
                 moved_.emplace(KeyOf(move.to), std::move(seen.entries));

@@ -244,6 +244,7 @@ void Service::EndRun(Task& task, const ActiveRun::Outcome& outcome) {
     for (const auto& [share, path] : outcome.linked) {
         task.machine.Changed(share, path);
     }
+    PostWatcher();  // what was moved while the run was under way may still be unheard
     if (run.result == ZEL::TASK_RESULT_FAILED) {
         Logger::LogMsg(Logger::LEVEL_ERROR, "[ERROR] zel_daemon(%d): task '%s': %s\n", __LINE__,
                        Printable(task.machine.Record().Name()).c_str(),

@@ -173,6 +173,10 @@ void Service::PostWatcher() {
 void Service::RunWatcher() {
     if (watcher_.Work(kWatcherSlice)) {
         PostWatcher();
+    } else {
+        for (auto& [id, task] : tasks_) {
+            task.machine.HeardAll();
+        }
     }
     Advance();
 }

@@ -266,14 +266,19 @@ void TaskMachine::Moved(const std::string& share, const std::string& from, const
         moves.pop_back();
     } else if (goes_on) {
         moves.back().to = to;
+        moves.back().is_settled = moves.back().is_settled && may_settle_;
     } else if (!debounced_[share].Holds(name) || WasMovedTo(moves, name)) {
-        moves.push_back({name, to});
+        moves.push_back({name, to, {}, may_settle_});
     }  // else it is new, and not at the server yet
     if (moves.size() > kMaxMoves) {
         moves.erase(moves.begin());
     }
     Changed(share, from);
     Changed(share, to);
+}
+
+void TaskMachine::HeardAll() {
+    may_settle_ = !running_;
 }
 
 void TaskMachine::Lost(const std::string& share, bool lasting) {
@@ -395,6 +400,16 @@ void TaskMachine::ChangesStored() {
     for (const auto& [share, changes] : debounced_) {
         debts_.OweChanges(share);
     }
+    for (const auto& [share, moves] : moved_) {
+        auto& settled = settled_moves_[share];
+        for (const programs::ShareMove& move : moves) {
+            const std::pair ends(move.from, move.to);
+            settled.erase(ends);
+            if (move.is_settled && settled.size() < kMaxMoves) {
+                settled.insert(ends);
+            }
+        }
+    }
     debounced_.clear();
     moved_.clear();
     first_change_.reset();
@@ -454,6 +469,8 @@ std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& r
         plan.moves[order.share] = read_moves(order.share);
         for (const StoredMove& stored : plan.moves[order.share]) {
             order.moves.push_back(stored.move);
+            order.moves.back().is_settled =
+                settled_moves_[order.share].count({stored.move.from, stored.move.to}) != 0;
         }
         order.brake = copies_.Take(order, brake);
         if (const auto consent = consents_.find(order.share); consent != consents_.end()) {
@@ -488,6 +505,7 @@ void TaskMachine::Started(RunPlan plan) {
         poll_at_ = NextPoll();
     }
     running_ = std::move(plan);
+    may_settle_ = false;
 }
 
 const RunRecord& TaskMachine::Ended(const programs::RunResult& result,
@@ -605,6 +623,7 @@ void TaskMachine::Settle(const RunPlan& plan, const programs::RunResult& result)
     for (const auto& [share, moves] : plan.moves) {
         if (outcomes.count(share) == 0 || result.moved.count(share) != 0) {
             for (const StoredMove& stored : moves) {
+                settled_moves_[share].erase({stored.move.from, stored.move.to});
                 end.moved.push_back(stored.id);
             }
         }

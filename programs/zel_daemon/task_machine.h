@@ -87,6 +87,8 @@ public:
     void Changed(const std::string& share, const std::string& path);
     /// What was at `from` is at `to` now, both of them as Watcher::OnMove has them.
     void Moved(const std::string& share, const std::string& from, const std::string& to);
+    /// Nothing is left to hear of what has been changed and moved until now.
+    void HeardAll();
     /// Changes of a share may have been missed; `lasting`: and will be, as some of it is not
     /// watched.
     void Lost(const std::string& share, bool lasting);
@@ -224,6 +226,10 @@ private:
     // The watch.
     std::map<std::string, ChangeSet> debounced_;                     // by share
     std::map<std::string, std::vector<programs::ShareMove>> moved_;  // by share, meanwhile
+    // Of the stored ones those that are settled (ShareMove::is_settled), as far as this process
+    // knows: by share, from where to where.
+    std::map<std::string, std::set<std::pair<std::string, std::string>>> settled_moves_;
+    bool may_settle_ = true;  // what is moved now: no run is under way, nor of its time to be heard
     std::optional<int64_t> first_change_;  // of these; nothing: there are none
     int64_t last_change_ = 0;
     std::set<std::string> unwatched_;  // shares of which something is not watched
