@@ -249,9 +249,10 @@ TEST_F(PushTest, APushThatIsCutOffLosesNothing) {
     EXPECT_EQ(push.wait_for(std::chrono::seconds(60)), std::future_status::ready);
     if (is_held) {
         int status = 0;
-        while (waitpid(deaf, &status, __WALL) == deaf && WIFSTOPPED(status)) {
-        }
-        EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL);
+        EXPECT_TRUE(test::Await([&] {
+            return waitpid(deaf, &status, __WALL | WNOHANG) == deaf && WIFSIGNALED(status);
+        }));
+        EXPECT_EQ(WTERMSIG(status), SIGKILL);
     }
     EXPECT_NE(push.get().exit_code, 0);
     EXPECT_THAT(Push(), Ended(4, "password"));

@@ -283,7 +283,9 @@ TEST_F(RsyncWrapperTest, ProgressOfAnUpdateIsOfFilesAndOfAFirstCopyIsOfBytes) {
 TEST_F(RsyncWrapperTest, ARunShowsItsPasswordNowhereAndEndsWithinASecondOfItsCancel) {
     ServeCommands("cat > /dev/null; sleep 20");
     // A program that does not mind being asked to end, with a child of its own.
-    const std::string deaf = Script("deaf", "trap '' TERM\nsleep 54321 & sleep 54321\n");
+    const std::string asleep = "54321." + std::to_string(getpid());
+    const std::string deaf =
+        Script("deaf", "trap '' TERM\nsleep " + asleep + " & sleep " + asleep + "\n");
     for (const std::string& program : {deaf, std::string("rsync")}) {
         SCOPED_TRACE(program);
         Configure("rsync=\"" + program + "\"\n");
@@ -307,7 +309,7 @@ TEST_F(RsyncWrapperTest, ARunShowsItsPasswordNowhereAndEndsWithinASecondOfItsCan
         EXPECT_TRUE(Has(seen, "--early-input=" + root_.Path()) && Has(seen, "session="));
         EXPECT_FALSE(Has(seen, kPassword));
         ExpectNothingLeft();
-        EXPECT_FALSE(Has(OtherProcesses(), "54321"));
+        EXPECT_FALSE(Has(OtherProcesses(), asleep));
     }
 }
 
@@ -529,7 +531,9 @@ TEST_F(RsyncWrapperTlsTest, WhatAnswersTooLateOrNotAtAllIsGivenUpAndACancelledRu
     int asked = 0;
     const auto enough = [&] { return ++asked > 5; };
     EXPECT_EQ(Copy(command, options, enough), STATUS_CANCELLED);
-    const std::string helper = "connect" + std::string(1, '\0') + "127.0.0.1";
+    const char end = '\0';  // of each word
+    const std::string helper =
+        std::string("connect") + end + "127.0.0.1" + end + std::to_string(front_.Port()) + end;
     for (int i = 0; i < 20 && Has(OtherProcesses(), helper); ++i) {
         usleep(100000);
     }
@@ -642,8 +646,8 @@ protected:
         if (!test::SshServer::Available()) {
             GTEST_SKIP() << "this machine cannot run an ssh server for the test";
         }
-        server_ = std::make_unique<test::SshServer>();
-        daemon_.AddAccount(server_->User(), kPassphrase);
+        server_ = std::make_unique<test::SshServer>(passphrase_);
+        daemon_.AddAccount(server_->User(), passphrase_);
         UseKey(false);
     }
 
@@ -665,7 +669,8 @@ protected:
         return Copy(over, {}, cancelled);
     }
 
-    static constexpr const char* kPassphrase = test::SshServer::kPassphrase;
+    // Of this test alone: another one's server may show its own in a command line.
+    const std::string passphrase_ = "open 'sesame' $% " + std::to_string(getpid());
     const std::string known_hosts_ = root_.Path("usr/tarq/etc/tarqrsync_known_hosts");
     const Set command_ = [](RsyncWrapper& w) { w.setTarqCustCmdRule({"command=\"X\""}); };
     std::unique_ptr<test::SshServer> server_;
@@ -702,8 +707,9 @@ TEST_F(RsyncWrapperSshTest, AKilledRunLeavesNoPasswordAndATrustedHostKeyIsTheOnl
     const std::string module = daemon_.AddModule("open", "auth users =");
     const pid_t run = fork();
     if (run == 0) {
-        ServeCommands("cat > /dev/null; sleep 20");
-        Over(kPassphrase, command_);
+        // ssh stays for as long as the server works on what it was told.
+        ServeCommands("cat > /dev/null; sleep 3");
+        Over(passphrase_, command_);
         _exit(0);
     }
     const std::string words = "UserKnownHostsFile=\"" + known_hosts_ + "\"" + '\0';
@@ -714,10 +720,10 @@ TEST_F(RsyncWrapperSshTest, AKilledRunLeavesNoPasswordAndATrustedHostKeyIsTheOnl
     kill(run, SIGKILL);
     waitpid(run, nullptr, 0);
     for (const auto& entry : fs::recursive_directory_iterator(root_.Path("tmp"))) {
-        EXPECT_FALSE(entry.is_regular_file() && Has(ReadFile(entry.path()), kPassphrase));
+        EXPECT_FALSE(entry.is_regular_file() && Has(ReadFile(entry.path()), passphrase_));
     }
 
-    for (int i = 0; i < 100 && Has(OtherProcesses(), words); ++i) {
+    for (int i = 0; i < 400 && Has(OtherProcesses(), words); ++i) {
         usleep(50000);
     }
     EXPECT_FALSE(Has(OtherProcesses(), words));
@@ -732,7 +738,7 @@ TEST_F(RsyncWrapperSshTest, AKilledRunLeavesNoPasswordAndATrustedHostKeyIsTheOnl
     RunOptions options;
     options.server = "nas";
     const auto to = [&](RsyncWrapper& wrapper) {
-        wrapper.setDestPath(server_->User(), "127.0.0.1", kPassphrase, "open", "");
+        wrapper.setDestPath(server_->User(), "127.0.0.1", passphrase_, "open", "");
     };
     EXPECT_EQ(Copy(to, options), 0) << report_.explanation << report_.details;
     EXPECT_EQ(ReadFile(module + "/file"), "content");
@@ -749,11 +755,11 @@ TEST_F(RsyncWrapperSshTest, APassphraseOpensADirectoryAndIsSeenNowhereAndACancel
     const std::string directory = root_.Path("far away 'dir'");
     fs::create_directories(directory);
     const auto to_directory = [&](RsyncWrapper& w) {
-        w.setDestPath(server_->User(), "127.0.0.1", kPassphrase, directory, "sub");
+        w.setDestPath(server_->User(), "127.0.0.1", passphrase_, directory, "sub");
         w.setSrcPath(Source("file"));
         w.setTarqPseudoRoot(true);
     };
-    EXPECT_EQ(Over(kPassphrase, to_directory), 0) << report_.explanation;
+    EXPECT_EQ(Over(passphrase_, to_directory), 0) << report_.explanation;
     EXPECT_EQ(ReadFile(directory + "/sub"), "content");
 
     ServeCommands("cat > /dev/null; sleep 20");
@@ -763,8 +769,8 @@ TEST_F(RsyncWrapperSshTest, APassphraseOpensADirectoryAndIsSeenNowhereAndACancel
         seen += OtherProcesses();
         return ++asked > 5;
     };
-    EXPECT_EQ(Over(kPassphrase, command_, look), 20);
-    EXPECT_FALSE(Has(seen, kPassphrase));
+    EXPECT_EQ(Over(passphrase_, command_, look), 20);
+    EXPECT_FALSE(Has(seen, passphrase_));
     // In the words of ssh itself: rsync holds the same ones quoted.
     const std::string words = "UserKnownHostsFile=\"" + known_hosts_ + "\"" + '\0';
     EXPECT_TRUE(Has(seen, words));

@@ -26,6 +26,8 @@ using std::chrono::steady_clock;
 namespace {
 
 constexpr milliseconds kStartLimit(10000);
+// No program that a test runs to its end takes so long, on the busiest machine either.
+constexpr std::chrono::seconds kRunLimit(200);
 constexpr milliseconds kStep(5);
 
 sockaddr_in Loopback(int port) {
@@ -66,7 +68,16 @@ Outcome RunProgram(const std::string& root, std::vector<std::string> command,
     setup.input = input;
     Outcome outcome;
     const auto append = [&](const char* bytes, size_t size) { outcome.output.append(bytes, size); };
-    const base::ChildResult result = base::RunChild(setup, cancelled, append, append);
+    const auto limit = steady_clock::now() + kRunLimit;
+    const auto is_over = [&] { return (cancelled && cancelled()) || steady_clock::now() > limit; };
+    const base::ChildResult result = base::RunChild(setup, is_over, append, append);
+    if (result.cancelled && steady_clock::now() > limit) {
+        std::string words;
+        for (const std::string& word : command) {
+            words += word + " ";
+        }
+        throw std::runtime_error(words + "does not end: " + outcome.output);
+    }
     outcome.exit_code = WIFEXITED(result.wait_status) ? WEXITSTATUS(result.wait_status) : -1;
     return outcome;
 }
@@ -239,9 +250,9 @@ bool SshServer::Available() {
            (access("/run/sshd", X_OK) == 0 || mkdir("/run/sshd", 0755) == 0);
 }
 
-SshServer::SshServer() : port_(FreePort()) {
+SshServer::SshServer(const std::string& passphrase) : port_(FreePort()) {
     MakeKey(folder_.Path("client"), "");
-    MakeKey(folder_.Path("locked_client"), kPassphrase);
+    MakeKey(folder_.Path("locked_client"), passphrase);
     folder_.Write("authorized_keys", ReadFile(folder_.Path("client.pub")) +
                                          ReadFile(folder_.Path("locked_client.pub")));
     MakeKey(folder_.Path("host"), "");

@@ -130,12 +130,11 @@ private:
 /// `sshd` that lets the user who runs the test log in with ClientKey().
 class SshServer {
 public:
-    static constexpr char kPassphrase[] = "open 'sesame' $%";
-
     /// Whether this machine can run one for this user.
     static bool Available();
 
-    SshServer();
+    /// `passphrase`: of the key that has one.
+    explicit SshServer(const std::string& passphrase = "open 'sesame' $%");
 
     /// Makes a new host key and starts again on the same port: the server that answers is another
     /// one.
@@ -144,7 +143,7 @@ public:
     int Port() const { return port_; }
     /// The user that may log in.
     std::string User() const;
-    /// The file of a private key that the server takes; its passphrase is empty or kPassphrase.
+    /// The file of a private key that the server takes; it has no passphrase, or the one given.
     std::string ClientKey(bool with_passphrase = false) const;
     std::string Log() const { return ReadFile(folder_.Path("log")); }
 
