@@ -16,11 +16,10 @@ namespace {
 
 using base::UniqueFd;
 
-// Of the third version of the interface; an older header lacks it.
-constexpr uint64_t kTruncate = 1ULL << 14;
 constexpr long kHasRefer = 2;
-constexpr long kHasTruncate = 3;
 
+// Not LANDLOCK_ACCESS_FS_TRUNCATE: rsync truncates nothing by its name, and to look for that right
+// the kernel would walk up from each file and folder that is opened, for reading, too.
 constexpr uint64_t kChangeFile = LANDLOCK_ACCESS_FS_WRITE_FILE;
 constexpr uint64_t kChangeFolder = kChangeFile | LANDLOCK_ACCESS_FS_REMOVE_DIR |
                                    LANDLOCK_ACCESS_FS_REMOVE_FILE | LANDLOCK_ACCESS_FS_MAKE_CHAR |
@@ -37,8 +36,7 @@ public:
         if (version < 1) {
             return;
         }
-        files_ = kChangeFile | (version >= kHasTruncate ? kTruncate : 0);
-        folders_ = kChangeFolder | files_ | (version >= kHasRefer ? LANDLOCK_ACCESS_FS_REFER : 0);
+        folders_ = kChangeFolder | (version >= kHasRefer ? LANDLOCK_ACCESS_FS_REFER : 0);
         landlock_ruleset_attr handled = {};
         handled.handled_access_fs = folders_;
         rules_ = UniqueFd(static_cast<int>(
@@ -46,7 +44,7 @@ public:
     }
     // What is not there needs no rule.
     void AllowFolder(const std::string& path) { Allow(path, folders_); }
-    void AllowFile(const std::string& path) { Allow(path, files_); }
+    void AllowFile(const std::string& path) { Allow(path, kChangeFile); }
     void Enter() const {
         if (rules_ && prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0) {
             syscall(SYS_landlock_restrict_self, rules_.Get(), 0);
@@ -65,7 +63,6 @@ private:
     }
 
     UniqueFd rules_;
-    uint64_t files_ = 0;
     uint64_t folders_ = 0;
 };
 
