@@ -29,8 +29,10 @@ using std::chrono::milliseconds;
 
 // How often the caller is asked whether to go on.
 constexpr milliseconds kAskInterval(100);
-// The time between SIGTERM and SIGKILL, in which a program can clean up.
-constexpr milliseconds kTermGrace(300);
+// The time between SIGTERM and SIGKILL, in which a program can clean up. rsync begins that when
+// 400 ms have passed, and its receiver, a process of its own, ends last.
+constexpr milliseconds kTermGrace(500);
+constexpr milliseconds kHeirsGrace(150);
 // How long to wait for the kernel to end a killed group: it needs far less.
 constexpr milliseconds kBurialGrace(200);
 
@@ -154,9 +156,9 @@ class ProcessGroup {
 public:
     explicit ProcessGroup(pid_t leader) : leader_(leader), exit_fd_(OpenPidFd(leader)) {}
     ~ProcessGroup() {
-        if (!killed_) {
+        if (!reaped_) {
             Kill();
-            AwaitBurial();
+            AwaitBurial(kBurialGrace);
         }
     }
     ProcessGroup(const ProcessGroup&) = delete;
@@ -177,34 +179,48 @@ public:
         return result != 0 || info.si_pid == leader_;
     }
 
-    // Kills what is left and reaps the leader.
+    // Kills what is left and reaps the leader. Its wait status.
     int Kill() {
-        if (!killed_) {
-            killed_ = true;
+        Signal(SIGKILL);
+        return Reap();
+    }
+
+    // The same for a leader that has ended, whose children may clean up before.
+    int KillLate() {
+        const int status = Reap();
+        // As long as one of them is left, nobody else gets the group's number.
+        if (!AwaitBurial(kHeirsGrace)) {
             Signal(SIGKILL);
-            int status = 0;
-            pid_t reaped;
-            do {
-                reaped = waitpid(leader_, &status, 0);
-            } while (reaped < 0 && errno == EINTR);
-            wait_status_ = reaped == leader_ ? status : -1;
         }
-        return wait_status_;
+        return status;
     }
 
     // The leader's children are reaped by init, in its own time.
-    void AwaitBurial() const {
-        const Clock::time_point give_up = Clock::now() + kBurialGrace;
-        while (kill(-leader_, 0) == 0 && Clock::now() < give_up) {
+    bool AwaitBurial(milliseconds longest) const {
+        const Clock::time_point give_up = Clock::now() + longest;
+        while (kill(-leader_, 0) == 0) {
+            if (Clock::now() >= give_up) {
+                return false;
+            }
             usleep(1000);
         }
+        return true;
     }
 
 private:
+    int Reap() {
+        reaped_ = true;
+        int status = 0;
+        pid_t reaped;
+        do {
+            reaped = waitpid(leader_, &status, 0);
+        } while (reaped < 0 && errno == EINTR);
+        return reaped == leader_ ? status : -1;
+    }
+
     pid_t leader_;
     UniqueFd exit_fd_;
-    bool killed_ = false;
-    int wait_status_ = -1;
+    bool reaped_ = false;
 };
 
 // One stream of the child's.
@@ -418,9 +434,9 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
             next_step = Clock::now() + kAskInterval;
         }
     }
-    result.wait_status = group->Kill();
+    result.wait_status = result.cancelled ? group->KillLate() : group->Kill();
     if (!result.ended_early) {
-        group->AwaitBurial();
+        group->AwaitBurial(kBurialGrace);
     }
     // The whole group has ended: what is left to read is already in the pipes.
     for (Stream* stream : {&output, &error}) {
