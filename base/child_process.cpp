@@ -31,8 +31,8 @@ using std::chrono::milliseconds;
 constexpr milliseconds kAskInterval(100);
 // The time between SIGTERM and SIGKILL, in which a program can clean up. rsync begins that when
 // 400 ms have passed, and its receiver, a process of its own, ends last.
-constexpr milliseconds kTermGrace(500);
-constexpr milliseconds kHeirsGrace(150);
+constexpr milliseconds kTermGrace(450);
+constexpr milliseconds kHeirsGrace(100);
 // How long to wait for the kernel to end a killed group: it needs far less.
 constexpr milliseconds kBurialGrace(200);
 
@@ -407,6 +407,7 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
     }
     EarlyEndWatch watch(early_end);
     bool gathers = false;
+    bool was_killed = false;
     while (!group->LeaderHasEnded()) {
         Wait(*group, output, error, gathers, &watch, next_step);
         size_t most = 0;
@@ -425,6 +426,7 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
         }
         if (result.cancelled) {
             group->Signal(SIGKILL);
+            was_killed = true;
             next_step = Clock::now() + kTermGrace;
         } else if (cancelled()) {
             result.cancelled = true;
@@ -434,7 +436,8 @@ ChildResult RunChild(const ChildSetup& setup, const std::function<bool()>& cance
             next_step = Clock::now() + kAskInterval;
         }
     }
-    result.wait_status = result.cancelled ? group->KillLate() : group->Kill();
+    const bool may_clean_up = result.cancelled && !was_killed;
+    result.wait_status = may_clean_up ? group->KillLate() : group->Kill();
     if (!result.ended_early) {
         group->AwaitBurial(kBurialGrace);
     }
