@@ -272,6 +272,50 @@ TEST_F(DaemonTest, WhatIsMovedIsNotSentAgain) {
     AwaitEqual("in the way");
 }
 
+// Most of it happens while something is being sent.
+TEST_F(DaemonTest, WhateverIsMovedAndChangedAtRandomIsEqualInTheEnd) {
+    folder_.Write("client/usr/tarq/etc/zel_daemon.conf",
+                  "[daemon]\ngather_ms=\"20\"\ngather_max_ms=\"50\"\n");
+    zel_.Start();
+    PObject task = TaskOf();
+    task["brake"] = 0;
+    ASSERT_EQ(Result(task), 0);
+    AwaitEqual("first");
+    std::minstd_rand random(12);
+    const auto place = [&] {
+        std::string path;
+        for (auto depth = 1 + random() % 3; depth > 0; --depth) {
+            path += std::string(path.empty() ? "" : "/") + static_cast<char>('a' + random() % 3);
+        }
+        return path;
+    };
+    const auto file = [&] { return place() + "/file" + std::to_string(random() % 4); };
+    const auto in = [&](const std::string& name) { return source_ + "/" + name; };
+    std::error_code refused;
+    for (int round = 0; round < 8; ++round) {
+        for (int i = 0; i < 80; ++i) {
+            switch (random() % 8) {
+                case 0:
+                case 1:
+                case 2:
+                    fs::create_directories(in(place()), refused);
+                    std::ofstream(in(file())) << random();  // where there is such a folder
+                    break;
+                case 3:
+                    fs::rename(in(file()), in(file()), refused);
+                    break;
+                case 4:
+                    fs::remove(in(file()), refused);
+                    break;
+                default:
+                    fs::rename(in(place()), in(place()), refused);
+            }
+            std::this_thread::sleep_for(milliseconds(random() % 40));
+        }
+        AwaitEqual("round " + std::to_string(round));
+    }
+}
+
 TEST_F(DaemonTest, AFloodOfChangesCostsFewRuns) {
     StartRealtime();
     const char* const stress = getenv("ZEL_STRESS_SECONDS");
