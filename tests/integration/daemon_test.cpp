@@ -292,6 +292,7 @@ TEST_F(DaemonTest, WhateverIsMovedAndChangedAtRandomIsEqualInTheEnd) {
     const auto file = [&] { return place() + "/file" + std::to_string(random() % 4); };
     const auto in = [&](const std::string& name) { return source_ + "/" + name; };
     std::error_code refused;
+    size_t size = 0;
     for (int round = 0; round < 8; ++round) {
         for (int i = 0; i < 80; ++i) {
             switch (random() % 8) {
@@ -299,7 +300,8 @@ TEST_F(DaemonTest, WhateverIsMovedAndChangedAtRandomIsEqualInTheEnd) {
                 case 1:
                 case 2:
                     fs::create_directories(in(place()), refused);
-                    std::ofstream(in(file())) << random();  // where there is such a folder
+                    // Where there is such a folder. Of one size and time rsync takes files for one.
+                    std::ofstream(in(file())) << std::string(++size, 'x');
                     break;
                 case 3:
                     fs::rename(in(file()), in(file()), refused);
