@@ -19,11 +19,11 @@
 #include "base/unix_socket.h"
 #include "programs/common/failure.h"
 #include "programs/common/text.h"
+#include "programs/zel_server/connection_config.h"
 #include "programs/zel_server/connections.h"
 #include "programs/zel_server/control_messages.h"
 #include "programs/zel_server/names.h"
 #include "programs/zel_server/rsyncd_config.h"
-#include "programs/zel_server/server_config.h"
 #include "programs/zel_server/space_debts.h"
 #include "programs/zel_server/versions_guard.h"
 
@@ -77,14 +77,19 @@ void Refuse(const base::UniqueFd& client, const std::string& why) {
 }
 
 // Runs in the child process: like inetd, passes the connection to the daemon as standard input.
-[[noreturn]] void BecomeDaemon(const std::vector<char*>& command, const std::string& guard,
-                               int client, pid_t parent) {
+[[noreturn]] void BecomeDaemon(const base::UniqueFd& client, const std::string& guard,
+                               pid_t parent) {
     base::ResetSignals();
     setsid();  // a process group of its own, so that it can be ended as a whole
-    if (base::EndWithParent(parent) && dup2(client, STDIN_FILENO) >= 0 &&
-        dup2(client, STDOUT_FILENO) >= 0 && setenv("LD_PRELOAD", guard.c_str(), 1) == 0 &&
-        setenv(kConnectionVariable, std::to_string(getpid()).c_str(), 1) == 0) {
-        execvp(command[0], command.data());
+    const std::string config = ConnectionConfig::Write();
+    if (config.empty()) {
+        perror("zel_server: the configuration of a connection cannot be written");
+        Refuse(client, "the server cannot write its configuration");
+    } else if (base::EndWithParent(parent) && dup2(client.Get(), STDIN_FILENO) >= 0 &&
+               dup2(client.Get(), STDOUT_FILENO) >= 0 &&
+               setenv("LD_PRELOAD", guard.c_str(), 1) == 0 &&
+               setenv(kConnectionVariable, std::to_string(getpid()).c_str(), 1) == 0) {
+        execlp("rsync", "rsync", "--daemon", ("--config=" + config).c_str(), nullptr);
         perror("zel_server: rsync cannot be run");
     }
     _exit(127);
@@ -96,7 +101,6 @@ Acceptor::Acceptor(uid_t front_user)
     : front_user_(front_user),
       connections_fd_(ListenOn(FrontSocket(), SOCK_STREAM, 0666)),
       control_fd_(ListenOn(ControlSocket(), SOCK_SEQPACKET, 0600)),
-      command_({"rsync", "--daemon", "--config=" + RsyncdConfig()}),
       guard_(VersionsGuard()) {
     sigset_t signals;
     sigemptyset(&signals);
@@ -163,17 +167,18 @@ void Acceptor::Accept() {
 }
 
 void Acceptor::StartDaemon(base::UniqueFd client) {
-    const std::vector<char*> command = base::ArgumentVector(command_);
     const pid_t parent = getpid();
     const pid_t child = fork();
     if (child == 0) {
-        BecomeDaemon(command, guard_, client.Get(), parent);
+        BecomeDaemon(client, guard_, parent);
     }
     if (child < 0) {
         Refuse(client, "the server cannot start a process -- try again later");
         return;
     }
-    connections_[child].since = Clock::now();
+    Connection connection;
+    connection.config = ConnectionConfig(child);
+    connections_.insert_or_assign(child, std::move(connection));
 }
 
 // In a process of its own, behind everything else that the machine does.
@@ -302,6 +307,7 @@ std::optional<int> Acceptor::Reap(pid_t guarded) {
         if (connection != connections_.end()) {
             space_is_due_ = space_is_due_ || IsSpaceDue();
             connection->second.leaderless = true;
+            connection->second.config = ConnectionConfig();
             // As long as there is one process in the group, nobody else gets its number.
             if (kill(-ended.si_pid, 0) == 0) {
                 End(ended.si_pid, connection->second);

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "base/unique_fd.h"
+#include "programs/zel_server/connection_config.h"
 
 namespace zel_server {
 
@@ -37,7 +38,8 @@ private:
     using Clock = std::chrono::steady_clock;
 
     struct Connection {
-        Clock::time_point since;
+        Clock::time_point since = Clock::now();
+        ConnectionConfig config;
         std::string account;      // empty until it has logged in
         bool ending = false;      // SIGTERM was sent at `since`; SIGKILL follows
         bool leaderless = false;  // its first process has ended; others of its group have not
@@ -63,7 +65,6 @@ private:
     base::UniqueFd connections_fd_;
     base::UniqueFd control_fd_;
     base::UniqueFd signals_fd_;
-    std::vector<std::string> command_;
     std::string guard_;  // VersionsGuard()
     std::map<pid_t, Connection> connections_;
     pid_t keeper_ = 0;  // the process that keeps versions; 0: none runs

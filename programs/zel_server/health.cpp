@@ -92,14 +92,11 @@ private:
         health_.shares = shares_.size();
     }
 
-    // Without these the daemon refuses every connection. The folder exists only while `serve` runs.
+    // Without it nobody is served.
     void LookAtConfiguration() {
-        for (const std::string& path : {RsyncdConfig(), OpenModules()}) {
-            struct stat info = {};
-            if (stat(path.c_str(), &info) != 0 && errno == ENOENT &&
-                (path != OpenModules() || ServingProcess())) {
-                Found(path + " is not there", "zel_server setup, which makes it again");
-            }
+        struct stat info = {};
+        if (stat(RsyncdConfig().c_str(), &info) != 0 && errno == ENOENT) {
+            Found(RsyncdConfig() + " is not there", "zel_server setup, which makes it again");
         }
     }
 

@@ -102,7 +102,7 @@ bool WriteRsyncdConfig(const ServerConfig& config) {
     // No modules of others: rsync merges two modules of the same name, and would use the folder of
     // one for the other.
     text << "# Written by 'zel_server setup' and 'zel_server serve', which starts an rsync daemon "
-            "for each connection.\n"
+            "for each connection, with the modules that are open then.\n"
          << "# Modules of your own belong to the system's rsync daemon.\n"
          << "log file = " << RsyncdLog() << "\n"
          << "reverse lookup = no\n"
@@ -135,7 +135,6 @@ bool WriteRsyncdConfig(const ServerConfig& config) {
     } else {
         text << "    use chroot = no\n";
     }
-    text << "\n&include " << OpenModules() << "\n";
     // Not rewritten when it is up to date.
     return base::ReadFile(RsyncdConfig(), kMaxFile) == text.str() ||
            base::ReplaceFile(RsyncdConfig(), text.str(), 0640);

@@ -12,8 +12,8 @@ namespace zel_server {
 inline constexpr const char* kConnectionVariable = "ZEL_CONNECTION";
 
 /// Writes rsyncd.conf unless it is up to date: the global part, the module of commands and that of
-/// pushes in one connection, and the include of the folder of open modules. False, with errno set,
-/// on failure.
+/// pushes in one connection. Each connection's daemon gets it with the modules that are open then
+/// (connection_config.h). False, with errno set, on failure.
 bool WriteRsyncdConfig(const ServerConfig& config);
 
 /// What each module that leads to a copy has in common: who asks whether a run is taken, and how a

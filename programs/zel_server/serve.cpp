@@ -16,6 +16,7 @@
 #include "base/file_lock.h"
 #include "programs/common/failure.h"
 #include "programs/zel_server/acceptor.h"
+#include "programs/zel_server/connection_config.h"
 #include "programs/zel_server/front.h"
 #include "programs/zel_server/registry.h"
 #include "programs/zel_server/rsyncd_config.h"
@@ -112,6 +113,9 @@ void Serve(bool with_front) {
     HaveFolder(FrontFolder(), 0750, FrontGroup());
     const base::FileLock turn = TakeTurn();
     TakeOverShares();
+    if (!ConnectionConfig::MakeFolder()) {
+        throw SystemFailure("cannot make the folder of the connections in " + AnswerFolder());
+    }
     if (!WriteRsyncdConfig(config)) {
         throw SystemFailure("cannot write the configuration in " + ConfigFolder());
     }

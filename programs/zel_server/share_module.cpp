@@ -291,6 +291,18 @@ bool MakeModuleFolder() {
     return true;
 }
 
+std::optional<std::string> TextOfModules() {
+    std::string text;
+    for (const std::string& file : ModuleFiles()) {
+        const auto module = base::ReadFile(file, kMaxFile);
+        if (!module && errno != ENOENT) {
+            return std::nullopt;
+        }
+        text += module.value_or("");
+    }
+    return text;
+}
+
 bool OpenForWriting(const ServerConfig& config, const std::string& share, const ShareState& state) {
     return WriteModule(config, FileOfShare(share),
                        {state.module, Access::kWrite, share, state.account, state.running_id},

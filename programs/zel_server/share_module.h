@@ -6,8 +6,8 @@
 // next command or connection closes what has expired. The cost depends on the number of open
 // modules, never on the number of shares. The folder of the modules does not survive a reboot.
 //
-// All functions but FindModule, FindPushInto and IsBeingPushed are called with the registry's lock
-// held.
+// All functions but TextOfModules, FindModule, FindPushInto and IsBeingPushed are called with the
+// registry's lock held.
 #pragma once
 
 #include <sys/types.h>
@@ -47,6 +47,10 @@ struct OpenModule {
 /// Creates the folder of the modules, without which the rsync daemon refuses everybody. False, with
 /// errno set, on failure.
 bool MakeModuleFolder();
+
+/// All open modules, as the rsync daemon's configuration has them. Nothing, with errno set, on
+/// failure.
+std::optional<std::string> TextOfModules();
 
 /// Opens the module with the share's own name for the share's account and the client that pushes.
 /// False, with errno set, on failure.

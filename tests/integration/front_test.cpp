@@ -113,6 +113,24 @@ TEST_F(FrontTest, AnAccountHasSixteenConnectionsAndLosesThemWhenItGoes) {
     EXPECT_TRUE(test::Await([&] { return Daemons().size() <= 2; }, 20));
 }
 
+TEST_F(FrontTest, ModulesThatOthersCloseMeanwhileKeepNobodyOut) {
+    const std::string open = folder_.Path("server/var/run/zel_server/.open/other");
+    std::atomic<bool> over{false};
+    std::thread others([&] {
+        const auto name = [&](int i) { return open + std::to_string(i) + ".conf"; };
+        for (int i = 0; !over; ++i) {
+            std::ofstream(name(i)) << "[other" << i << "]\npath = /\n";
+            fs::remove(name(i - 200));
+        }
+    });
+    for (int i = 0; i < 100; ++i) {
+        char byte = 0;  // of the greeting
+        EXPECT_EQ(recv(ConnectByTcp().Get(), &byte, 1, 0), 1);
+    }
+    over = true;
+    others.join();
+}
+
 TEST_F(FrontTest, OnlyTheFrontReachesTheDaemonsBehindIt) {
     if (geteuid() != 0) {
         GTEST_SKIP() << "needs another user";

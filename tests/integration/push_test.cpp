@@ -781,7 +781,9 @@ TEST_F(PushTest, StatusNamesWhatKeepsPushesOut) {
     fs::remove_all(storage_ + "/docs");
     EXPECT_THAT(Server("status"), Ended(0, "no copy of 'docs' any more"));
     fs::remove_all(folder_.Path("server/var/run/zel_server/.open"));
-    expect(".open is not there", "zel_server setup");
+    ExpectNextPushCompletes();
+    fs::remove(folder_.Path("server/usr/tarq/etc/zel_server/rsyncd.conf"));
+    expect("rsyncd.conf is not there", "zel_server setup");
     Must(Server("setup"));
     ExpectNextPushCompletes();
 
