@@ -81,7 +81,7 @@ void Refuse(const base::UniqueFd& client, const std::string& why) {
                                pid_t parent) {
     base::ResetSignals();
     setsid();  // a process group of its own, so that it can be ended as a whole
-    const std::string config = ConnectionConfig::Write();
+    const std::string config = WriteConnectionConfig();
     if (config.empty()) {
         perror("zel_server: the configuration of a connection cannot be written");
         Refuse(client, "the server cannot write its configuration");
@@ -176,9 +176,7 @@ void Acceptor::StartDaemon(base::UniqueFd client) {
         Refuse(client, "the server cannot start a process -- try again later");
         return;
     }
-    Connection connection;
-    connection.config = ConnectionConfig(child);
-    connections_.insert_or_assign(child, std::move(connection));
+    connections_[child] = Connection();  // of that number, there may be one whose group has ended
 }
 
 // In a process of its own, behind everything else that the machine does.
@@ -307,7 +305,7 @@ std::optional<int> Acceptor::Reap(pid_t guarded) {
         if (connection != connections_.end()) {
             space_is_due_ = space_is_due_ || IsSpaceDue();
             connection->second.leaderless = true;
-            connection->second.config = ConnectionConfig();
+            RemoveConnectionConfig(ended.si_pid);
             // As long as there is one process in the group, nobody else gets its number.
             if (kill(-ended.si_pid, 0) == 0) {
                 End(ended.si_pid, connection->second);

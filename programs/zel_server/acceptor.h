@@ -11,7 +11,6 @@
 #include <vector>
 
 #include "base/unique_fd.h"
-#include "programs/zel_server/connection_config.h"
 
 namespace zel_server {
 
@@ -39,7 +38,6 @@ private:
 
     struct Connection {
         Clock::time_point since = Clock::now();
-        ConnectionConfig config;
         std::string account;      // empty until it has logged in
         bool ending = false;      // SIGTERM was sent at `since`; SIGKILL follows
         bool leaderless = false;  // its first process has ended; others of its group have not

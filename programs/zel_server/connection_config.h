@@ -11,22 +11,11 @@
 
 namespace zel_server {
 
-/// Owns the file for the daemon that is the process `process`, and removes it when destroyed.
-class ConnectionConfig {
-public:
-    ConnectionConfig() = default;
-    explicit ConnectionConfig(pid_t process);
-    ConnectionConfig(ConnectionConfig&& other) noexcept;
-    ConnectionConfig& operator=(ConnectionConfig&& other) noexcept;
-    ~ConnectionConfig();
+/// Writes the file of the calling process, which becomes the daemon: its path, or "" with errno set
+/// on failure.
+std::string WriteConnectionConfig();
 
-    /// Written by the process itself: the file's path, or "" with errno set on failure.
-    static std::string Write();
-    /// Makes the folder of the files, with none in it. False, with errno set, on failure.
-    static bool MakeFolder();
-
-private:
-    std::string path_;  // empty: owns none
-};
+/// Removes it when that process has ended.
+void RemoveConnectionConfig(pid_t process);
 
 }  // namespace zel_server

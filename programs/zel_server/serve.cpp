@@ -10,13 +10,13 @@
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 #include <string>
 
 #include "base/child_process.h"
 #include "base/file_lock.h"
 #include "programs/common/failure.h"
 #include "programs/zel_server/acceptor.h"
-#include "programs/zel_server/connection_config.h"
 #include "programs/zel_server/front.h"
 #include "programs/zel_server/registry.h"
 #include "programs/zel_server/rsyncd_config.h"
@@ -113,9 +113,9 @@ void Serve(bool with_front) {
     HaveFolder(FrontFolder(), 0750, FrontGroup());
     const base::FileLock turn = TakeTurn();
     TakeOverShares();
-    if (!ConnectionConfig::MakeFolder()) {
-        throw SystemFailure("cannot make the folder of the connections in " + AnswerFolder());
-    }
+    std::error_code ignored;
+    std::filesystem::remove_all(ConnectionConfigs(),
+                                ignored);  // a process that was killed left some
     if (!WriteRsyncdConfig(config)) {
         throw SystemFailure("cannot write the configuration in " + ConfigFolder());
     }

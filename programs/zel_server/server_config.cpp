@@ -2,6 +2,7 @@
 
 #include <algorithm>
 
+#include "base/make_folder.h"
 #include "base/rsync_config.h"
 #include "base/text.h"
 #include "programs/common/failure.h"
@@ -87,6 +88,12 @@ std::string OpenModules() {
 
 std::string PushLinks() {
     return AnswerFolder() + "/.pushes";
+}
+std::string ConnectionConfigs() {
+    return AnswerFolder() + "/.configs";
+}
+bool MakeInAnswers(const std::string& folder) {
+    return base::MakeFolder(AnswerFolder(), 0700) && base::MakeFolder(folder, 0700);
 }
 std::string FrontConfig() {
     return ConfigFolder() + "/front.cfg";

@@ -46,12 +46,17 @@ std::string SecretsFile();    ///< accounts and passwords, 0600
 std::string AnswerFolder();   ///< command answers, a folder for each account; gone after a reboot
 std::string OpenModules();    ///< folder of the open modules, in AnswerFolder()
 std::string PushLinks();      ///< folder of the links of LinkOfPush(), in AnswerFolder()
-std::string RsyncdLog();      ///< the rsync daemon's
-std::string FrontConfig();    ///< front.cfg, HAProxy's configuration, written at each start
-std::string FrontKey();       ///< the server's key and certificate, 0600
-std::string FrontFolder();    ///< folder of the socket on which the front reaches the daemon
-std::string RegistryFile();   ///< the pairing registry
-std::string LockFile();       ///< held by every command that changes the registry
+std::string ConnectionConfigs();  ///< folder of connection_config.h's files, in AnswerFolder()
+std::string RsyncdLog();          ///< the rsync daemon's
+std::string FrontConfig();        ///< front.cfg, HAProxy's configuration, written at each start
+std::string FrontKey();           ///< the server's key and certificate, 0600
+std::string FrontFolder();        ///< folder of the socket on which the front reaches the daemon
+std::string RegistryFile();       ///< the pairing registry
+std::string LockFile();           ///< held by every command that changes the registry
+
+/// Makes one of the folders in AnswerFolder(), and that, for this user alone. False, with errno
+/// set, on failure.
+bool MakeInAnswers(const std::string& folder);
 
 /// Where earlier versions permanently kept a module for every share, and the admin's own modules.
 std::string OldShareModules();

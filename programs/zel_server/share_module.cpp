@@ -15,7 +15,6 @@
 #include <string_view>
 #include <vector>
 
-#include "base/make_folder.h"
 #include "base/random_digits.h"
 #include "base/replace_file.h"
 #include "base/text.h"
@@ -73,10 +72,9 @@ bool EndsWith(const std::string& text, const std::string& end) {
     return text.size() > end.size() && text.compare(text.size() - end.size(), end.size(), end) == 0;
 }
 
-// Paths of the files of all open modules.
-std::vector<std::string> ModuleFiles() {
+// Paths of the files of all open modules; `error`: why these are not all.
+std::vector<std::string> ModuleFiles(std::error_code& error) {
     std::vector<std::string> files;
-    std::error_code error;
     for (fs::directory_iterator entry(OpenModules(), error), end; !error && entry != end;
          entry.increment(error)) {
         if (EndsWith(entry->path(), kSuffix)) {
@@ -84,6 +82,11 @@ std::vector<std::string> ModuleFiles() {
         }
     }
     return files;
+}
+
+std::vector<std::string> ModuleFiles() {
+    std::error_code ignored;
+    return ModuleFiles(ignored);
 }
 
 void SetTimeToNow(const std::string& file) {
@@ -240,7 +243,7 @@ std::optional<OpenModule> ReadModule(const std::string& file) {
 
 bool WriteModule(const ServerConfig& config, const std::string& file, const OpenModule& module,
                  const std::string& path) {
-    return MakeModuleFolder() &&
+    return MakeInAnswers(OpenModules()) &&
            base::ReplaceFile(file, TextOf(config, module, path), 0600);  // its time is now
 }
 
@@ -282,25 +285,19 @@ bool MakeShareFolder(const ServerConfig& config, const std::string& path) {
     return owner && chown(path.c_str(), owner->uid, owner->gid) == 0;
 }
 
-bool MakeModuleFolder() {
-    for (const std::string& folder : {AnswerFolder(), OpenModules()}) {
-        if (mkdir(folder.c_str(), 0700) != 0 && errno != EEXIST) {
-            return false;
-        }
-    }
-    return true;
-}
-
 std::optional<std::string> TextOfModules() {
     std::string text;
-    for (const std::string& file : ModuleFiles()) {
+    std::error_code error;
+    for (const std::string& file : ModuleFiles(error)) {
         const auto module = base::ReadFile(file, kMaxFile);
-        if (!module && errno != ENOENT) {
+        if (!module && errno != ENOENT) {  // else it was closed meanwhile
             return std::nullopt;
         }
         text += module.value_or("");
     }
-    return text;
+    errno = error.value();
+    return !error || error == std::errc::no_such_file_or_directory ? std::optional(text)
+                                                                   : std::nullopt;
 }
 
 bool OpenForWriting(const ServerConfig& config, const std::string& share, const ShareState& state) {
@@ -316,7 +313,7 @@ bool OpenForConnection(const ServerConfig& config, const std::string& share,
     module.process = process;
     module.mark = mark;
     return WriteModule(config, FileOfShare(share), module, state.path) &&
-           BeginTransferIn(module, process, "") && base::MakeFolder(PushLinks(), 0700) &&
+           BeginTransferIn(module, process, "") && MakeInAnswers(PushLinks()) &&
            symlink(state.path.c_str(), LinkOfPush(process).c_str()) == 0;
 }
 

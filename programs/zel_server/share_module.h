@@ -44,10 +44,6 @@ struct OpenModule {
     std::string mark = {};  ///< the client's mark of such a push
 };
 
-/// Creates the folder of the modules, without which the rsync daemon refuses everybody. False, with
-/// errno set, on failure.
-bool MakeModuleFolder();
-
 /// All open modules, as the rsync daemon's configuration has them. Nothing, with errno set, on
 /// failure.
 std::optional<std::string> TextOfModules();

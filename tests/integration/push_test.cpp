@@ -780,8 +780,10 @@ TEST_F(PushTest, StatusNamesWhatKeepsPushesOut) {
     ExpectNextPushCompletes();
     fs::remove_all(storage_ + "/docs");
     EXPECT_THAT(Server("status"), Ended(0, "no copy of 'docs' any more"));
-    fs::remove_all(folder_.Path("server/var/run/zel_server/.open"));
-    ExpectNextPushCompletes();
+    for (const char* folder : {".open", ".configs"}) {
+        fs::remove_all(folder_.Path("server/var/run/zel_server/") + folder);
+        ExpectNextPushCompletes();
+    }
     fs::remove(folder_.Path("server/usr/tarq/etc/zel_server/rsyncd.conf"));
     expect("rsyncd.conf is not there", "zel_server setup");
     Must(Server("setup"));

@@ -331,16 +331,18 @@ TEST(Confinement, NothingIsWrittenOutsideOfTheFolder) {
     const pid_t child = fork();
     if (child == 0) {
         zelctl::WriteOnlyBelow(inside);
-        const bool right = mkdir((inside + "/made").c_str(), 0700) == 0 &&
-                           mkdir((inside + "/link/made").c_str(), 0700) != 0 &&
-                           unlink((outside + "/file").c_str()) != 0 &&
-                           open((inside + "/link/file").c_str(), O_WRONLY | O_CLOEXEC) < 0 &&
-                           rename((inside + "/made").c_str(), (inside + "/moved").c_str()) == 0;
+        const bool right =
+            mkdir((inside + "/made").c_str(), 0700) == 0 &&
+            mkdir((inside + "/link/made").c_str(), 0700) != 0 &&
+            unlink((outside + "/file").c_str()) != 0 &&
+            open((inside + "/link/file").c_str(), O_WRONLY | O_TRUNC | O_CLOEXEC) < 0 &&
+            rename((inside + "/made").c_str(), (inside + "/moved").c_str()) == 0;
         _exit(right ? 0 : 1);
     }
     int status = -1;
     waitpid(child, &status, 0);
     EXPECT_EQ(status, 0);
+    EXPECT_EQ(test::ReadFile(outside + "/file"), "mine");
 }
 
 // What lies in a copy was written by whoever has the account's password.

@@ -280,7 +280,7 @@ TEST_F(RsyncWrapperTest, ProgressOfAnUpdateIsOfFilesAndOfAFirstCopyIsOfBytes) {
     }
 }
 
-TEST_F(RsyncWrapperTest, ARunShowsItsPasswordNowhereAndEndsSoonAfterItsCancel) {
+TEST_F(RsyncWrapperTest, ARunShowsItsPasswordNowhereAndEndsWithinASecondOfItsCancel) {
     ServeCommands("cat > /dev/null; sleep 20");
     // A program that does not mind being asked to end, with a child of its own.
     const std::string asleep = "54321." + std::to_string(getpid());
@@ -290,7 +290,7 @@ TEST_F(RsyncWrapperTest, ARunShowsItsPasswordNowhereAndEndsSoonAfterItsCancel) {
         SCOPED_TRACE(program);
         Configure("rsync=\"" + program + "\"\n");
         std::string seen;
-        const auto asked = std::chrono::steady_clock::now() + std::chrono::milliseconds(300);
+        std::chrono::steady_clock::time_point asked;
         const auto look = [&] {
             seen += OtherProcesses();
             for (const std::string& name : Tree(root_.Path("tmp"))) {
@@ -302,9 +302,12 @@ TEST_F(RsyncWrapperTest, ARunShowsItsPasswordNowhereAndEndsSoonAfterItsCancel) {
             }
             return std::chrono::steady_clock::now() > asked;
         };
-        EXPECT_EQ(Command({"command=\"X\""}, look), 20);
-        // Within a second, on a machine that is not busy with other tests besides.
-        EXPECT_LT(std::chrono::steady_clock::now() - asked, std::chrono::seconds(4));
+        const auto ends_soon = [&] {
+            asked = std::chrono::steady_clock::now() + std::chrono::milliseconds(300);
+            EXPECT_EQ(Command({"command=\"X\""}, look), 20);
+            return std::chrono::steady_clock::now() - asked < std::chrono::seconds(1);
+        };
+        EXPECT_TRUE(ends_soon() || ends_soon() || ends_soon()) << "on a busy machine one of three";
         EXPECT_EQ(report_.explanation, "the run was cancelled");
         seen += ReadFile(root_.Path("var/log/tarqrsync.log"));
         EXPECT_TRUE(Has(seen, "--early-input=" + root_.Path()) && Has(seen, "session="));
