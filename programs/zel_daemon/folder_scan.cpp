@@ -153,6 +153,7 @@ void FolderScan::Scan(FolderId id) {
         EndJob(number);
         return;
     }
+    tree_.is_ahead = true;
     bool is_new = false;
     UniqueFd fd;
     if (const int error = tree_.inotify.Open()) {
@@ -187,6 +188,7 @@ void FolderScan::ListSome() {
         EndListing();
         return;
     }
+    tree_.is_ahead = true;
     const ssize_t got = getdents64(listing_->fd.Get(), list_buffer_.get(), kListBufferSize);
     if (got < 0 && !IsGone(errno)) {
         const int error = errno;

@@ -149,13 +149,18 @@ void WatchEvents::FolderEntry(FolderId parent, const Inotify::Event& event) {
     FolderId id = tree_.table.Child(parent, event.name);
     if (event.mask & IN_MOVED_TO) {
         if (const auto moved = TakeMove(event.cookie, tree_.table[parent].owner)) {
+            // Two folders that change places are told as if each came in the place of the other.
+            const bool is_certain =
+                id == kNoFolder && !tree_.is_ahead && tree_.table[*moved].watch >= 0;
             if (id != kNoFolder) {
                 tree_.Drop(id);
             }
             tree_.table.Attach(*moved, parent, event.name);
             tree_.table[*moved].marks =
                 static_cast<uint8_t>((tree_.table[*moved].marks & ~kUnseen) | kNotified);
-            scan_.Enqueue(*moved, true);
+            if (!is_certain) {
+                scan_.Enqueue(*moved, true);
+            }
             return;
         }
     }
@@ -278,6 +283,7 @@ bool WatchEvents::HandleSome() {
         }
         if (!event) {
             DropMoves();
+            tree_.is_ahead = false;
             return false;
         }
         Handle(*event);

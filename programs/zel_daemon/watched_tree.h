@@ -35,6 +35,7 @@ constexpr uint8_t kMissing = 16;  // cannot be watched, or not all below it
 /// - A folder is watched before it is read: what appears in between comes as an event.
 /// - A path that leads nowhere now is dropped: what took it away is an event that still waits. If
 ///   that is the move of a folder above, all below that one is scanned again once it is in place.
+///   Where no scan can have come before the event, the folders move with what is known of them.
 /// - A folder that gets its watch later than its share's first scan is notified of then: what was
 ///   sent before may lack what changed in it unwatched.
 struct WatchedTree {
@@ -79,6 +80,7 @@ struct WatchedTree {
     std::map<uint32_t, Share> shares;  // by a number that is never used again
     std::vector<FolderId> dropped;     // roots of trees to be forgotten, the last first
     std::string path;                  // of the folder that Locate() was asked for last
+    bool is_ahead = false;             // scans have seen what events that still wait may tell
 };
 
 }  // namespace zel_daemon

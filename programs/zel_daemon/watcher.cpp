@@ -21,7 +21,7 @@ constexpr int kStepsPerIdleTurn = 256;
 
 struct Watcher::Impl {
     Impl(OnChange change, OnMove move, OnLoss loss)
-        : tree{std::move(change), std::move(move), std::move(loss), {}, {}, {}, {}, {}} {}
+        : tree{std::move(change), std::move(move), std::move(loss), {}, {}, {}, {}, {}, false} {}
 
     WatchedTree tree;
     FolderScan scan{tree};
