@@ -41,7 +41,7 @@ constexpr int kScatteredRuns = 15;
 constexpr int kMoves = 15;
 constexpr int kFolders = 1000;
 constexpr int kFilesEach = 50;
-constexpr int kMovedFiles = 2000;
+constexpr int kMovedFiles[] = {2000, 100000};
 constexpr int kFewFiles = 10000;
 constexpr int kServers = 10;
 constexpr int kTasksEach = 100;
@@ -130,15 +130,17 @@ public:
     }
 
     // A folder goes to and fro.
-    void Moved() {
-        for (int i = 0; i < kMovedFiles; ++i) {
-            root_.Write("moved/here/" + std::to_string(i % 20) + "/" + std::to_string(i), "file");
+    void Moved(int files) {
+        const std::string name = "moved" + std::to_string(files);
+        for (int i = 0; i < files; ++i) {
+            root_.Write(name + "/here/" + std::to_string(i / 100) + "/" + std::to_string(i),
+                        "file");
         }
         std::this_thread::sleep_for(std::chrono::seconds(1));  // none is so young as to be doubtful
-        PushOnChange("moved", 60);
+        PushOnChange(name, 600);
         const CountingRelay relay(Relayed());
-        const std::string share = root_.Path("moved");
-        const std::string copy = root_.Path("storage/moved");
+        const std::string share = root_.Path(name);
+        const std::string copy = root_.Path("storage/" + name);
         bool there = false;
         uint64_t most = 0;
         uint64_t connections = 0;
@@ -150,20 +152,21 @@ public:
             there = !there;
             const double taken = Milliseconds([&] {
                 fs::rename(share + from, share + to);
-                Until([&] { return fs::exists(copy + to) && IsIdle("moved"); });
+                Until([&] { return fs::exists(copy + to) && IsIdle(name); });
             });
             most = std::max(most, relay.Bytes() - before);
             connections = std::max(connections, relay.Connections() - connections_before);
             return taken - kGatherMs;
         };
+        const std::string what = "a folder of " + std::to_string(files) + " files moved";
         Compare(
-            "a folder of 2,000 files moved", ours, "a server command", [&] { return Command(); },
-            kMoves, "at most 1.5");
+            what.c_str(), ours, "a server command", [&] { return Command(); }, kMoves,
+            "at most 1.5");
         std::printf("%-34s %9llu bytes in %llu connections at most (wanted: less than 4096)\n",
                     "of these, on the wire", static_cast<unsigned long long>(most),
                     static_cast<unsigned long long>(connections));
         std::fflush(stdout);
-        daemon_.Ask("task_remove", "moved");
+        daemon_.Ask("task_remove", name);
         ReachServerAt(port_);
     }
 
@@ -369,7 +372,11 @@ int main(int argc, char** argv) {
         };
         part("one", [&] { bench.One(); });
         part("scattered", [&] { bench.Scattered(); });
-        part("moved", [&] { bench.Moved(); });
+        part("moved", [&] {
+            for (const int files : kMovedFiles) {
+                bench.Moved(files);
+            }
+        });
         part("fair", [&] { bench.Fair(); });
         part("large", [&] { bench.Large(argc > 1 ? std::atoi(argv[1]) : 200000); });
     } catch (const std::exception& error) {

@@ -1,6 +1,6 @@
 # The daemon's parts, and the daemon as a whole.
 if(ZEL_BUILD_PROGRAMS)
-    foreach(part IN ITEMS change_set store task_machine verify_slice watcher)
+    foreach(part IN ITEMS change_set file_index store task_machine verify_slice watcher)
         zel_test(${part}_test ${part}_test.cpp LIBRARIES daemon_parts)
     endforeach()
 

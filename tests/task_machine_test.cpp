@@ -182,7 +182,8 @@ private:
                 sent_ += " " + share.share + path;
             }
             for (const programs::ShareMove& move : share.moves) {
-                sent_ += " " + move.from + ">" + move.to + (move.is_settled ? "" : "?");
+                sent_ += " " + move.from + ">" + move.to + (move.is_settled ? "" : "?") +
+                         (move.is_untouched ? "!" : "");
             }
         }
         plan->record.id = ++last_id_;
@@ -471,7 +472,7 @@ TEST_F(TaskMachineTest, WhatIsMovedDuringARunIsNotTakenForWhatTheServerHas) {
     };
     EXPECT_EQ(move("/b/", "/c"), "change a/b a/c /b>/c?") << "some of its time is not heard";
     machine_->HeardAll();
-    EXPECT_EQ(move("/c/", "/d"), "change a/c a/d /c>/d");
+    EXPECT_EQ(move("/c/", "/d"), "change a/c a/d /c>/d!");
     machine_->HeardAll();
     hold_ = true;
     EXPECT_EQ(Change("a", "/d/x"), "change a/d/x");
@@ -487,6 +488,41 @@ TEST_F(TaskMachineTest, WhatIsMovedDuringARunIsNotTakenForWhatTheServerHas) {
     machine_->Ended({}, {});
     machine_->HeardAll();
     EXPECT_EQ(move("/f/", "/g"), "change a/e a/f a/g /e>/g?");
+}
+
+// What is moved need not be looked at as long as nothing was told of anything in it.
+TEST_F(TaskMachineTest, WhatIsTouchedBeforeOrAfterItIsMovedIsLookedAt) {
+    HaveRealtime();
+    const auto move = [&](const std::string& from, const std::string& to) {
+        machine_->HeardAll();
+        machine_->Moved("a", from, to);
+    };
+    const auto change = [&](const std::string& path) { machine_->Changed("a", path); };
+    const struct {
+        std::function<void()> what;
+        const char* sent;
+    } cases[] = {
+        {[&] { move("/f/", "/g/h"); }, "change a/f a/g/h /f>/g/h!"},
+        {[&] { move("/f/", "/g"), move("/g/", "/h"); }, "change a/f a/g a/h /f>/h!"},
+        {[&] { move("/f/", "/g"), move("/b/", "/c"); }, "change a/b a/c a/f a/g /f>/g! /b>/c!"},
+        {[&] { change("/e"), move("/f/", "/g"), change("/gg"); }, "change a/e a/f a/g a/gg /f>/g!"},
+        {[&] { change("/f/x/y"), move("/f/", "/g"); }, "change a/f a/g /f>/g"},
+        {[&] { move("/f/", "/g"), change("/g/x/y"); }, "change a/f a/g /f>/g"},
+        {[&] { move("/f/", "/g/h"), change("/g"); }, "change a/f a/g /f>/g/h"},
+        {[&] { move("/f/", "/g"), change("/g/x"), move("/g/", "/h"); }, "change a/f a/g a/h /f>/h"},
+        {[&] { move("/f/", "/g"), move("/g/x/", "/x"); }, "change a/f a/g a/x /f>/g /g/x>/x"},
+        {[&] { move("/f/", "/g"), machine_->Lost("a", false), Search(); }, "change a/ /f>/g"},
+    };
+    for (const auto& one : cases) {
+        one.what();
+        EXPECT_EQ(Pass(1), one.sent);
+    }
+    // What has failed, and waits, may be of it.
+    bad_ = {{"a/f/x", kRefused}};
+    EXPECT_EQ(Change("a", "/f/x"), "change a/f/x");
+    bad_.clear();
+    move("/f/", "/g");
+    EXPECT_EQ(Pass(15), "retry a/f a/g /f>/g");
 }
 
 TEST_F(TaskMachineTest, ALossOfTheWatchOrAFailedResyncLeadsToAResync) {

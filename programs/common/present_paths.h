@@ -16,9 +16,10 @@ enum class Deletions {
 /// A path to send, and the ordered paths that it covers.
 struct PresentPath {
     enum class Kind {
-        kWhole,   ///< as it is, with all that is below it
-        kGone,    ///< to be deleted
-        kEntries  ///< a folder, by its own entries
+        kWhole,    ///< as it is, with all that is below it
+        kGone,     ///< to be deleted
+        kEntries,  ///< a folder, by its own entries
+        kBytes  ///< a file, by its bytes, as its size and time tell nothing; none of PresentPaths'
     };
     std::string path;
     std::vector<std::string> ordered;

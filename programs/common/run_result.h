@@ -65,6 +65,14 @@ struct ShareMove {
     /// Nothing was on its way to the server while it was moved: what that has of it, and what the
     /// client believes that it has, are the same.
     bool is_settled = false;
+    /// It is settled, and nothing has changed in it since the last push but its place.
+    bool is_untouched = false;
+};
+
+/// A file in the place of another one of the same size and time, as which rsync would take it.
+struct DoubtfulFile {
+    std::string path;
+    std::string ordered;  ///< that of the order's paths which it is, or is below
 };
 
 /// One share of a run, and which of its paths: "/" is all of it, others begin with "/". A path that
@@ -80,6 +88,8 @@ struct ShareOrder {
     /// What was moved since the last push, in its order. Both ends are among `paths`, or below
     /// them: the server is told, so that less has to be sent.
     std::vector<ShareMove> moves = {};
+    /// These are compared by their bytes, besides.
+    std::vector<DoubtfulFile> doubtful = {};
     /// Of a comparison: these files alone, relative to the share; empty: `paths`.
     std::vector<std::string> files = {};
 };

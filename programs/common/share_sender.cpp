@@ -55,7 +55,7 @@ RunFailure MountAway(const std::string& share, const std::string& mount) {
                       Reach::kPaths);
 }
 
-/// What one run sends: folders by their entries, or anything else.
+/// What one run sends: folders by their entries, files by their bytes, or anything else.
 struct Piece {
     std::vector<PresentPath> paths;
     int busy = 0;  // how often it changed while it was sent
@@ -94,13 +94,18 @@ std::vector<std::string> OrderedOf(const std::vector<PresentPath>& paths) {
 // What is new is sent before what is gone is deleted, where these are two runs: a file that was
 // moved is in the copy at any time.
 std::list<Piece> PiecesOf(const std::vector<PresentPath>& paths) {
+    using Kind = PresentPath::Kind;
     Piece as_named;
     Piece by_entries;
+    Piece by_bytes;
     for (const PresentPath& path : paths) {
-        (path.kind == PresentPath::Kind::kEntries ? by_entries : as_named).paths.push_back(path);
+        Piece& piece = path.kind == Kind::kEntries ? by_entries
+                       : path.kind == Kind::kBytes ? by_bytes
+                                                   : as_named;
+        piece.paths.push_back(path);
     }
     std::list<Piece> pieces;
-    for (Piece* const piece : {&as_named, &by_entries}) {
+    for (Piece* const piece : {&as_named, &by_bytes, &by_entries}) {
         if (!piece->paths.empty()) {
             pieces.push_back(std::move(*piece));
         }
@@ -266,13 +271,23 @@ struct ShareSender::Impl {
         ForgetForms();
         for (bool taken = false; !taken;) {
             try {
-                SendPresent(work, PresentPaths(source.folder.Path(), share.paths, deletions),
-                            may_lose, copy, sent, undone);
+                SendPresent(work, PathsToSend(source, share), may_lose, copy, sent, undone);
                 taken = true;
             } catch (const OtherFormWanted& wanted) {
                 Learn(wanted);
             }
         }
+    }
+
+    // A server that takes no list of changes is older than the comparison by bytes, too.
+    std::vector<PresentPath> PathsToSend(const Source& source, const ShareOrder& share) const {
+        std::vector<PresentPath> paths = PresentPaths(source.folder.Path(), share.paths, deletions);
+        if (deletions != Deletions::kByTree) {
+            for (const DoubtfulFile& file : share.doubtful) {
+                paths.push_back({file.path, {file.ordered}, PresentPath::Kind::kBytes});
+            }
+        }
+        return paths;
     }
 
     void ForgetForms() {
@@ -316,8 +331,7 @@ struct ShareSender::Impl {
             lines.push_back("moves=\"" + told.front().paths + "\"");
         }
         ForgetForms();
-        const auto paths =
-            PathsAfter(PresentPaths(source.folder.Path(), share.paths, deletions), share, moved);
+        const auto paths = PathsAfter(PathsToSend(source, share), share, moved);
         const Brake brake = BrakeAfter(share, moved);
         if (told.size() > 1 || PiecesOf(paths).size() != 1 || IsWhole(paths) ||
             (may_lose && brake.MustLook() && !AreFewFiles(brake, source.folder.Path(), paths))) {
@@ -535,6 +549,7 @@ struct ShareSender::Impl {
         wishes.keep_versions = true;  // in a dry run, their folder at the server is no difference
         if (!IsWhole(paths)) {
             wishes.shallow = paths.front().kind == Kind::kEntries;
+            wishes.by_content = paths.front().kind == Kind::kBytes;
             wishes.changes.reserve(paths.size());
             for (const PresentPath& path : paths) {
                 wishes.changes.push_back(path.path.substr(1));

@@ -94,6 +94,12 @@ bool ChangeSet::Holds(const std::string& path) const {
     return IsHeld(KeyOf(path));
 }
 
+bool ChangeSet::Touches(const std::string& path) const {
+    const std::string key = KeyOf(path);
+    const auto next = held_.upper_bound(key);
+    return IsHeld(key) || (next != held_.end() && IsWithin(*next, key));
+}
+
 // Nothing that is held lies between a folder and what is within it.
 bool ChangeSet::IsHeld(const std::string& key) const {
     const auto next = held_.upper_bound(key);

@@ -27,6 +27,8 @@ public:
     void Add(const std::string& path);
     /// Whether the path, or a folder above it, is held.
     bool Holds(const std::string& path) const;
+    /// The same, or something below it.
+    bool Touches(const std::string& path) const;
     bool Empty() const { return held_.empty(); }
     /// The paths, in byte order; the set is empty afterwards.
     std::vector<std::string> Take();

@@ -10,13 +10,14 @@
 #include "base/make_folder.h"
 #include "base/unique_fd.h"
 #include "programs/common/failure.h"
+#include "programs/zel_daemon/index_walk.h"
 #include "programs/zel_daemon/path_key.h"
 
 namespace zel_daemon {
 
 namespace {
 
-constexpr int kLayout = 1;
+constexpr int kLayout = 2;
 // Two chunks fill a page.
 constexpr char kPages[] = "PRAGMA page_size = 8192; PRAGMA cache_size = -1024";
 constexpr size_t kChunkBytes = 4000;
@@ -24,12 +25,18 @@ constexpr size_t kChunkBytes = 4000;
 constexpr size_t kMostHeld = 8192;
 // Chunks that are appended in one transaction.
 constexpr size_t kChunksTogether = 1024;
+// A folder that fills more chunks is moved by them.
+constexpr int64_t kFewChunks = 8;
 // Of an entry that says that what was at and below its key is void: no entry has this mode.
 constexpr uint32_t kReplaced = 0;
 
 constexpr char kSchema[] = R"(
 CREATE TABLE chunks (
-    first BLOB NOT NULL UNIQUE,   -- the key of its first entry
+    first BLOB PRIMARY KEY,       -- the key of its first entry
+    content INTEGER NOT NULL
+) WITHOUT ROWID;
+CREATE TABLE contents (           -- of chunks: entries, which do not say where the first is
+    id INTEGER PRIMARY KEY,
     entries BLOB NOT NULL
 );
 CREATE TABLE links (              -- files that have several names
@@ -60,9 +67,9 @@ std::string MakeFile(const std::string& path) {
     return path;
 }
 
-std::vector<IndexEntry> EntriesOf(const std::string& chunk) {
+std::vector<IndexEntry> EntriesOf(const std::string& first, const std::string& chunk) {
     std::vector<IndexEntry> entries;
-    ChunkReader reader(chunk);
+    ChunkReader reader(chunk, first);
     for (IndexEntry entry; reader.Next(entry);) {
         entries.push_back(entry);
     }
@@ -103,8 +110,8 @@ public:
         }
     }
 
-    /// Removes the key and all below it.
-    void Remove(const std::string& key) {
+    /// Removes the key and all below it, which is added to `removed` unless that is null.
+    void Remove(const std::string& key, std::vector<IndexEntry>* removed = nullptr) {
         Hold(key);
         const std::string end = AfterAllBelow(key);
         for (;;) {
@@ -112,6 +119,9 @@ public:
             const auto last = Find(end);
             std::for_each(first, last,
                           [&](const IndexEntry& entry) { index_.Unlink(entry.key, entry.facts); });
+            if (removed != nullptr) {
+                std::move(first, last, std::back_inserter(*removed));
+            }
             entries_.erase(first, last);
             if (!limit_ || *limit_ >= end) {
                 return;
@@ -144,34 +154,23 @@ private:
         if (chunk.Next()) {
             entries_ = Take(chunk.Text());
         } else {
-            SetLimit(key);
+            limit_ = index_.ChunkAfter(key);
         }
         held_ = true;
     }
 
     // The entries of this chunk, which is no more.
     std::vector<IndexEntry> Take(const std::string& first) {
-        std::string bytes;
-        {
-            Query chunk(index_.database_, "SELECT entries FROM chunks WHERE first = ?",
-                        Bytes{first});
-            chunk.Next();
-            bytes = chunk.Text();
-        }
-        Query(index_.database_, "DELETE FROM chunks WHERE first = ?", Bytes{first}).Run();
-        SetLimit(first);
-        return EntriesOf(bytes);
-    }
-
-    void SetLimit(const std::string& key) {
-        Query next(index_.database_,
-                   "SELECT first FROM chunks WHERE first > ? ORDER BY first LIMIT 1", Bytes{key});
-        limit_ = next.Next() ? std::optional(next.Text()) : std::nullopt;
+        limit_ = index_.ChunkAfter(first);
+        return index_.Take(first);
     }
 
     // Writes the first `count` entries that are held, in chunks of one size.
     void Write(ptrdiff_t count) {
         ChunkWriter all;
+        if (count > 0) {
+            all.Begin(entries_.front().key);
+        }
         std::for_each(entries_.begin(), entries_.begin() + count,
                       [&](const IndexEntry& entry) { all.Add(entry.key, entry.facts); });
         const size_t bytes = all.Bytes().size();
@@ -185,7 +184,10 @@ private:
         const std::string* first = nullptr;
         for (ptrdiff_t i = 0; i < count; ++i) {
             const IndexEntry& entry = entries_[static_cast<size_t>(i)];
-            first = chunk.Empty() ? &entry.key : first;
+            if (chunk.Empty()) {
+                first = &entry.key;
+                chunk.Begin(*first);
+            }
             chunk.Add(entry.key, entry.facts);
             if (chunk.Bytes().size() >= most || i + 1 == count) {
                 index_.Insert(*first, chunk.Take());
@@ -205,7 +207,8 @@ FileIndex::FileIndex(const std::string& path) : database_(MakeFile(path)) {
     if (database_.Number("PRAGMA user_version") != kLayout) {
         Transaction transaction(database_);
         database_.Execute(
-            "DROP TABLE IF EXISTS chunks; DROP TABLE IF EXISTS links; DROP TABLE IF EXISTS stamp");
+            "DROP TABLE IF EXISTS chunks; DROP TABLE IF EXISTS contents; "
+            "DROP TABLE IF EXISTS links; DROP TABLE IF EXISTS stamp");
         database_.Execute(kSchema);
         database_.Execute(("PRAGMA user_version = " + std::to_string(kLayout)).c_str());
         transaction.Commit();
@@ -261,32 +264,47 @@ void FileIndex::Forget() {
 }
 
 std::vector<IndexEntry> FileIndex::After(const std::optional<std::string>& key) {
-    std::string bytes;
-    {
-        Query chunk(database_,
-                    key ? "SELECT entries FROM chunks WHERE first > ? ORDER BY first LIMIT 1"
-                        : "SELECT entries FROM chunks WHERE first >= ? ORDER BY first LIMIT 1",
-                    Bytes{key ? *key : std::string_view()});
-        if (!chunk.Next()) {
-            return {};
-        }
-        bytes = chunk.Text();
-    }
-    return EntriesOf(bytes);
+    return Chunk(key ? "first > ? ORDER BY first LIMIT 1" : "first >= ? ORDER BY first LIMIT 1",
+                 key ? *key : std::string_view());
 }
 
 std::vector<IndexEntry> FileIndex::Around(const std::string& key) {
+    return Chunk("first <= ? ORDER BY first DESC LIMIT 1", key);
+}
+
+// `which`: of the chunks, with one parameter, the key.
+std::vector<IndexEntry> FileIndex::Chunk(const char* which, std::string_view key) {
+    std::string first;
     std::string bytes;
     {
-        Query chunk(database_,
-                    "SELECT entries FROM chunks WHERE first <= ? ORDER BY first DESC LIMIT 1",
-                    Bytes{key});
+        Query chunk(
+            database_,
+            std::string("SELECT first, entries FROM chunks JOIN contents ON id = content WHERE ") +
+                which,
+            Bytes{key});
         if (!chunk.Next()) {
             return {};
         }
+        first = chunk.Text();
         bytes = chunk.Text();
     }
-    return EntriesOf(bytes);
+    return EntriesOf(first, bytes);
+}
+
+// The entries of this chunk, which is no more.
+std::vector<IndexEntry> FileIndex::Take(const std::string& first) {
+    std::vector<IndexEntry> entries = Chunk("first = ?", first);
+    Query(database_, "DELETE FROM contents WHERE id = (SELECT content FROM chunks WHERE first = ?)",
+          Bytes{first})
+        .Run();
+    Query(database_, "DELETE FROM chunks WHERE first = ?", Bytes{first}).Run();
+    return entries;
+}
+
+std::optional<std::string> FileIndex::ChunkAfter(const std::string& key) {
+    Query next(database_, "SELECT first FROM chunks WHERE first > ? ORDER BY first LIMIT 1",
+               Bytes{key});
+    return next.Next() ? std::optional(next.Text()) : std::nullopt;
 }
 
 std::optional<EntryFacts> FileIndex::Find(const std::string& key) {
@@ -323,8 +341,9 @@ void FileIndex::Unlink(const std::string& key, const EntryFacts& facts) {
 }
 
 void FileIndex::Insert(const std::string& first, const std::string& entries) {
-    Query(database_, "INSERT INTO chunks (first, entries) VALUES (?, ?)", Bytes{first},
-          Bytes{entries})
+    Query(database_, "INSERT INTO contents (entries) VALUES (?)", Bytes{entries}).Run();
+    Query(database_, "INSERT INTO chunks (first, content) VALUES (?, ?)", Bytes{first},
+          database_.LastId())
         .Run();
 }
 
@@ -333,7 +352,16 @@ void FileIndex::Change(const IndexChanges& changes, const std::vector<std::strin
     const auto any = [&](const auto& test) {
         return std::any_of(undone.begin(), undone.end(), test);
     };
+    const auto is_undone = [&](const std::string& key) {
+        return any(
+            [&](const std::string& path) { return IsWithin(key, path) || IsWithin(path, key); });
+    };
     Transaction transaction(database_);
+    for (const auto& [from, to] : changes.moves_) {
+        if (!is_undone(from) && !is_undone(to)) {
+            Move(from, to);
+        }
+    }
     ChunkEditor editor(*this);
     std::optional<std::string> replaced;
     bool left_out = false;
@@ -342,9 +370,7 @@ void FileIndex::Change(const IndexChanges& changes, const std::vector<std::strin
         const std::string& key = entry.key;
         if (entry.facts.mode == kReplaced) {
             replaced = key;
-            left_out = any([&](const std::string& path) {
-                return IsWithin(key, path) || IsWithin(path, key);
-            });
+            left_out = is_undone(key);
             if (!left_out) {
                 editor.Remove(key);
             }
@@ -359,12 +385,74 @@ void FileIndex::Change(const IndexChanges& changes, const std::vector<std::strin
     transaction.Commit();
 }
 
+// A folder of few chunks is put among what is at its new place, so that chunks are not small.
+void FileIndex::Move(const std::string& from, const std::string& to) {
+    const auto remove = [this](const std::string& key, std::vector<IndexEntry>* removed) {
+        ChunkEditor editor(*this);
+        editor.Remove(key, removed);
+        editor.Write();
+    };
+    remove(to, nullptr);
+    if (IsInFewChunks(from)) {
+        std::vector<IndexEntry> moved;
+        remove(from, &moved);
+        ChunkEditor editor(*this);
+        for (IndexEntry& entry : moved) {
+            entry.key.replace(0, from.size(), to);
+            editor.Put(entry);
+        }
+        editor.Write();
+        return;
+    }
+    const std::string end = AfterAllBelow(from);
+    for (const std::string& key : {from, end, to}) {
+        Split(key);
+    }
+    for (const char* update :
+         {"UPDATE chunks SET first = CAST(? || substr(first, ?) AS BLOB) WHERE first >= ? AND "
+          "first < ?",
+          "UPDATE links SET key = CAST(? || substr(key, ?) AS BLOB) WHERE key >= ? AND key < ?"}) {
+        Query(database_, update, Bytes{to}, from.size() + 1, Bytes{from}, Bytes{end}).Run();
+    }
+}
+
+bool FileIndex::IsInFewChunks(const std::string& folder) {
+    Query chunks(
+        database_,
+        "SELECT count(*) FROM (SELECT 1 FROM chunks WHERE first >= ? AND first < ? LIMIT ?)",
+        Bytes{folder}, Bytes{AfterAllBelow(folder)}, kFewChunks + 1);
+    chunks.Next();
+    return chunks.Number() <= kFewChunks;
+}
+
+// A chunk begins at the key, or none has it in its midst.
+void FileIndex::Split(const std::string& key) {
+    const std::vector<IndexEntry> around = Around(key);
+    if (around.empty() || around.front().key == key || around.back().key < key) {
+        return;
+    }
+    ChunkWriter before;
+    ChunkWriter after;
+    const std::string* first_after = nullptr;
+    before.Begin(around.front().key);
+    for (const IndexEntry& entry : around) {
+        if (entry.key >= key && first_after == nullptr) {
+            first_after = &entry.key;
+            after.Begin(entry.key);
+        }
+        (first_after == nullptr ? before : after).Add(entry.key, entry.facts);
+    }
+    Take(around.front().key);
+    Insert(around.front().key, before.Take());
+    Insert(*first_after, after.Take());
+}
+
 // What is appended before the stamp need not be on the disk: the stamp's own transaction brings it
 // there, or nothing is trusted.
 void FileIndex::Clear() {
     database_.Execute(
         "PRAGMA synchronous = FULL; DELETE FROM stamp; PRAGMA synchronous = OFF; "
-        "DELETE FROM chunks; DELETE FROM links; BEGIN IMMEDIATE");
+        "DELETE FROM chunks; DELETE FROM contents; DELETE FROM links; BEGIN IMMEDIATE");
     appended_.Take();
     chunks_appended_ = 0;
 }
@@ -372,6 +460,7 @@ void FileIndex::Clear() {
 void FileIndex::Append(std::string_view key, const EntryFacts& facts) {
     if (appended_.Empty()) {
         first_appended_ = key;
+        appended_.Begin(key);
     }
     appended_.Add(key, facts);
     if (facts.linked) {

@@ -2,13 +2,15 @@
 //
 // One SQLite file for each share of a task, beside the store. It is a note and no more: whatever it
 // has lost costs a comparison. Names that come one after the other are kept together in chunks, so
-// that a file takes some 40 bytes; a change writes one chunk anew.
+// that a file takes some 20 bytes; a change writes one chunk anew. A chunk does not say where it
+// is: a large folder is moved by the keys of its chunks alone.
 #pragma once
 
 #include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "programs/zel_daemon/index_chunk.h"
@@ -23,6 +25,9 @@ public:
     /// What the index has at the key and below it is void; what there is follows. Keys come in
     /// their order.
     void Replace(std::string_view key);
+    /// Before all others: what the index has at `from` and below it is at `to` now, and nothing
+    /// else. REQUIRES that none of both is within the other.
+    void Move(const std::string& from, const std::string& to) { moves_.emplace_back(from, to); }
     /// An entry is so: one of these, or a folder above what is replaced.
     void Put(std::string_view key, const EntryFacts& facts) { writer_.Add(key, facts); }
 
@@ -30,6 +35,7 @@ public:
 
 private:
     friend class FileIndex;
+    std::vector<std::pair<std::string, std::string>> moves_;
     ChunkWriter writer_;
 };
 
@@ -56,6 +62,8 @@ public:
     /// Entries that are kept together, and with the key's if that has one. What comes after the key
     /// is among them, or after the last of them; none: it is the first of all.
     std::vector<IndexEntry> Around(const std::string& key);
+    /// The first key of the entries that are kept together after the key's.
+    std::optional<std::string> ChunkAfter(const std::string& key);
     std::optional<EntryFacts> Find(const std::string& key);
     /// The keys of a file that has several names.
     std::vector<std::string> NamesOf(uint64_t inode);
@@ -74,6 +82,11 @@ public:
 private:
     friend class ChunkEditor;
 
+    std::vector<IndexEntry> Chunk(const char* which, std::string_view key);
+    std::vector<IndexEntry> Take(const std::string& first);
+    void Move(const std::string& from, const std::string& to);
+    bool IsInFewChunks(const std::string& folder);
+    void Split(const std::string& key);
     void Link(const std::string& key, const EntryFacts& facts);
     void Unlink(const std::string& key, const EntryFacts& facts);
     void Insert(const std::string& first, const std::string& entries);

@@ -40,7 +40,7 @@ void ChunkWriter::Add(std::string_view key, const EntryFacts& facts) {
         std::mismatch(key.begin(), key.end(), last_.key.begin(), last_.key.end()).first;
     const auto shared = static_cast<size_t>(differs - key.begin());
     const EntryFacts& last = last_.facts;
-    Number(shared);
+    Number(last_.key.size() - shared);
     Number(key.size() - shared);
     bytes_.append(key.substr(shared));
     Number(uint64_t{facts.mode} << kMarks | (facts.linked ? kLinked : 0) |
@@ -80,12 +80,12 @@ bool ChunkReader::Next(IndexEntry& entry) {
     if (bytes_.empty()) {
         return false;
     }
-    const uint64_t shared = Number();
+    const uint64_t dropped = Number();
     const uint64_t added = Number();
-    if (shared > last_.key.size() || added > bytes_.size()) {
+    if (dropped > last_.key.size() || added > bytes_.size()) {
         Damaged();
     }
-    last_.key.resize(static_cast<size_t>(shared));
+    last_.key.resize(last_.key.size() - static_cast<size_t>(dropped));
     last_.key.append(bytes_.substr(0, static_cast<size_t>(added)));
     bytes_.remove_prefix(static_cast<size_t>(added));
     EntryFacts& facts = last_.facts;

@@ -15,9 +15,12 @@ struct IndexEntry {
 };
 
 /// Puts entries together. Their order is that of their keys; one that says little more than the one
-/// before it takes little room.
+/// before it takes little room: of its key, how much of the end of that one's goes, and what comes
+/// instead. So the bytes are the same wherever a folder lies that all the entries are in.
 class ChunkWriter {
 public:
+    /// The first key is `first`, which is known to who will read it. Before any entry.
+    void Begin(std::string_view first) { last_.key = first; }
     void Add(std::string_view key, const EntryFacts& facts);
     const std::string& Bytes() const { return bytes_; }
     bool Empty() const { return bytes_.empty(); }
@@ -35,8 +38,10 @@ private:
 /// Takes them apart again.
 class ChunkReader {
 public:
-    /// `bytes` outlive it.
-    explicit ChunkReader(std::string_view bytes) : bytes_(bytes) {}
+    /// `bytes` outlive it. `first`: see ChunkWriter::Begin().
+    explicit ChunkReader(std::string_view bytes, std::string_view first = {}) : bytes_(bytes) {
+        last_.key = first;
+    }
     /// False: there is no other. Throws Failure when the bytes are none of a ChunkWriter's.
     bool Next(IndexEntry& entry);
 

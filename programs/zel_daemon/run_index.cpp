@@ -7,8 +7,6 @@
 #include <filesystem>
 #include <iterator>
 #include <optional>
-#include <set>
-#include <string_view>
 
 #include "ZEL/log.h"
 #include "ZEL/zel.h"
@@ -17,7 +15,8 @@
 #include "programs/common/share_notes.h"
 #include "programs/common/task_fields.h"
 #include "programs/common/text.h"
-#include "programs/zel_daemon/index_walk.h"
+#include "programs/zel_daemon/known_files.h"
+#include "programs/zel_daemon/moved_folder.h"
 #include "programs/zel_daemon/path_key.h"
 #include "programs/zel_daemon/share_debts.h"
 #include "programs/zel_daemon/share_folder.h"
@@ -35,8 +34,10 @@ using ZEL::Logger;
 constexpr size_t kMostBytes = size_t{64} << 20;
 // Of the files with other names, so many are looked after in a run.
 constexpr size_t kMostLinked = 1000;
-// Of a folder that was moved, so many files are sent by name.
-constexpr size_t kMostInstead = 1000;
+// So many files of a run, and so many bytes of them, are compared by their bytes. What is more is
+// left to the verification.
+constexpr size_t kMostDoubtful = 1000;
+constexpr uint64_t kMostDoubtfulBytes = uint64_t{1} << 30;
 
 bool IsWhole(const ShareOrder& order) {
     return std::find(order.paths.begin(), order.paths.end(), programs::kWholeShare) !=
@@ -46,95 +47,6 @@ bool IsWhole(const ShareOrder& order) {
 std::string FolderOf(const std::string& share) {
     ZEL::ShareInfo facts;
     return ZEL::GetShareInfo(share, facts) == 0 ? facts.GetModulePath() : "";
-}
-
-// The moves with which no other has to do, by their place among all: both their ends are what they
-// were before and after all of them.
-std::set<size_t> AloneIn(const std::vector<programs::ShareMove>& moves) {
-    struct End {
-        std::string key;
-        size_t move;
-    };
-    std::vector<End> ends;
-    std::set<size_t> alone;
-    for (size_t i = 0; i < moves.size(); ++i) {
-        ends.push_back({KeyOf(moves[i].from), i});
-        ends.push_back({KeyOf(moves[i].to), i});
-        alone.insert(alone.end(), i);
-    }
-    std::sort(ends.begin(), ends.end(),
-              [](const End& one, const End& other) { return one.key < other.key; });
-    std::vector<const End*> above;  // each within the one before
-    for (const End& end : ends) {
-        while (!above.empty() && !IsWithin(end.key, above.back()->key)) {
-            above.pop_back();
-        }
-        if (!above.empty()) {
-            alone.erase(end.move);
-            alone.erase(above.back()->move);
-        }
-        above.push_back(&end);
-    }
-    return alone;
-}
-
-/// What was seen of a folder that was moved.
-struct MovedFolder {
-    std::vector<std::string>
-        files;            // to be sent, so that the copy has it as it is; none: all of it
-    std::string entries;  // the whole folder, as a ChunkWriter has put it together
-};
-
-// Compares a folder that was moved with what the index has at its old place, which the copy has,
-// too: see ShareMove.
-MovedFolder LookAtMoved(FileIndex& index, const std::string& folder,
-                        const programs::ShareMove& move, const std::function<bool()>& cancelled) {
-    const std::string from = KeyOf(move.from);
-    const std::string to = KeyOf(move.to);
-    const auto was = index.Find(from);
-    TreeList list(folder, move.to, cancelled);
-    TreeList::Entry entry;
-    if (!was || !was->IsFolder() || list.Next(entry) != TreeList::Found::kEntry ||
-        !entry.facts.IsFolder() || entry.facts.inode != was->inode) {
-        return {};
-    }
-    std::vector<std::string> files;
-    ChunkWriter entries;
-    entries.Add(to, entry.facts);
-    std::string waits = to;  // the folder that a file in it is to bring along; empty: none
-    const auto below = [](const std::string& key, const std::string& top) {
-        return std::string_view(key).substr(top.size());
-    };
-    IndexWalk known(index, from);
-    auto found = list.Next(entry);
-    for (; found == TreeList::Found::kEntry; found = list.Next(entry)) {
-        const IndexEntry* const old = known.Entry();
-        const std::string key = KeyOf(entry.path);
-        if (old == nullptr || !IsWithin(old->key, from) ||
-            below(old->key, from) != below(key, to) ||
-            old->facts.IsFolder() != entry.facts.IsFolder() || files.size() == kMostInstead ||
-            entries.Bytes().size() > kMostBytes) {
-            return {};
-        }
-        entries.Add(key, entry.facts);
-        const bool is_unchanged = IsUnchanged(old->facts, entry.facts);
-        if (entry.facts.IsFolder() && !is_unchanged) {
-            if (!waits.empty() && !IsWithin(key, waits)) {
-                return {};
-            }
-            waits = key;
-        } else if (!entry.facts.IsFolder() && (!is_unchanged || !waits.empty())) {
-            if (!waits.empty() && !IsWithin(key, waits)) {
-                return {};
-            }
-            files.push_back(entry.path);
-            waits.clear();
-        }
-        known.Next();
-    }
-    const bool is_more = known.Entry() != nullptr && IsWithin(known.Entry()->key, from);
-    const bool is_all = found == TreeList::Found::kEnd && !is_more && waits.empty();
-    return is_all && !cancelled() ? MovedFolder{files, entries.Take()} : MovedFolder();
 }
 
 struct LinkedFile {
@@ -255,13 +167,14 @@ private:
         }
         stamp_ = *stamp;
         is_kept_ = true;
-        FindLittleChanged(index, cancelled);
+        KnownFiles known(index, order_.moves);
+        const base::UniqueFd share = OpenShareFolder(folder_);
+        FindLittleChanged(index, share, cancelled);
         std::vector<std::string> keys;
         for (const std::string& path : order_.paths) {
             keys.push_back(KeyOf(path));
         }
         std::sort(keys.begin(), keys.end());
-        const base::UniqueFd share = OpenShareFolder(folder_);
         // The share's own folder is sent along with what is right in it alone.
         if (std::any_of(keys.begin(), keys.end(),
                         [](const std::string& key) { return ParentOf(key).empty(); })) {
@@ -275,19 +188,24 @@ private:
             }
             done = key;
             NoteFolders(share, std::string(ParentOf(key)), noted);
+            if (const auto untouched = untouched_.find(key); untouched != untouched_.end()) {
+                changes_.Move(untouched->second, key);
+                NoteFolder(share, key);
+                continue;
+            }
             changes_.Replace(key);
             const auto moved = moved_.find(key);
             if (moved != moved_.end()) {
                 ChunkReader entries(moved->second);
                 for (IndexEntry entry; entries.Next(entry);) {
-                    Note(entry);
+                    Note(entry, known, key);
                 }
             } else {
                 const auto facts = FactsAt(share, PathOf(key));
                 if (facts && facts->IsFolder()) {
-                    NoteTree(key, cancelled);
+                    NoteTree(key, known, cancelled);
                 } else if (facts) {
-                    Note({key, *facts});
+                    Note({key, *facts}, known, key);
                 }
             }
             if (changes_.Bytes() > kMostBytes) {
@@ -298,29 +216,52 @@ private:
         is_kept_ = !cancelled();
     }
 
-    void Note(const IndexEntry& entry) {
+    // `ordered`: the key of the path that it belongs to.
+    void Note(const IndexEntry& entry, KnownFiles& known, const std::string& ordered) {
         changes_.Put(entry.key, entry.facts);
         if (entry.facts.linked && linked_.size() < kMostLinked) {
             linked_.emplace(entry.facts.inode, PathOf(entry.key));
         }
+        if (known.IsDoubtful(entry)) {
+            Doubt(entry, ordered);
+        }
     }
 
-    void NoteTree(const std::string& key, const std::function<bool()>& cancelled) {
+    void Doubt(const IndexEntry& file, const std::string& ordered) {
+        if (order_.doubtful.size() < kMostDoubtful &&
+            file.facts.size <= kMostDoubtfulBytes - doubtful_bytes_) {
+            doubtful_bytes_ += file.facts.size;
+            order_.doubtful.push_back({PathOf(file.key), PathOf(ordered)});
+        }
+    }
+
+    void NoteTree(const std::string& key, KnownFiles& known,
+                  const std::function<bool()>& cancelled) {
         TreeList list(folder_, PathOf(key), cancelled);
         TreeList::Entry entry;
         for (auto found = list.Next(entry); found != TreeList::Found::kEnd;
              found = list.Next(entry)) {
             if (found == TreeList::Found::kEntry) {
-                Note({KeyOf(entry.path), entry.facts});
+                Note({KeyOf(entry.path), entry.facts}, known, key);
             }
         }
     }
 
-    void FindLittleChanged(FileIndex& index, const std::function<bool()>& cancelled) {
+    void FindLittleChanged(FileIndex& index, const base::UniqueFd& share,
+                           const std::function<bool()>& cancelled) {
         for (const size_t i : AloneIn(order_.moves)) {
             programs::ShareMove& move = order_.moves[i];
-            MovedFolder seen =
-                move.is_settled ? LookAtMoved(index, folder_, move, cancelled) : MovedFolder();
+            if (!move.is_settled) {
+                continue;
+            }
+            const auto file =
+                move.is_untouched ? FileOfUntouched(index, share, move) : std::nullopt;
+            if (file) {
+                move.instead = {*file};
+                untouched_.emplace(KeyOf(move.to), KeyOf(move.from));
+                continue;
+            }
+            MovedFolder seen = LookAtMoved(index, folder_, move, kMostBytes, cancelled);
             if (!seen.files.empty()) {
                 move.instead = std::move(seen.files);
                 moved_.emplace(KeyOf(move.to), std::move(seen.entries));
@@ -388,7 +329,10 @@ private:
     programs::ShareNotes notes_;  // before the run
     IndexStamp stamp_;
     IndexChanges changes_;
+    uint64_t doubtful_bytes_ = 0;               // of ShareOrder::doubtful
     std::map<std::string, std::string> moved_;  // MovedFolder::entries, by the key of their place
+    // Of folders that were moved and not looked at, the key of the old place by the new one's.
+    std::map<std::string, std::string> untouched_;
     std::optional<FileIndex> index_;
     std::map<uint64_t, std::string> linked_;
 };

@@ -8,6 +8,7 @@
 #include "programs/common/share_path.h"
 #include "programs/common/task_fields.h"
 #include "programs/common/text.h"
+#include "programs/zel_daemon/path_key.h"
 
 namespace zel_daemon {
 
@@ -192,6 +193,7 @@ void TaskMachine::Restored(bool has_changes, std::optional<RunRecord> last, Ques
 
 // Something may have changed without a word. What is compared whole anyhow need not be searched.
 void TaskMachine::OweSearch(const std::string& share) {
+    untouched_.erase(share);
     if (record_.IsRealtime() && debts_.Has(share) &&
         debts_.StateOf(share) == ShareState::kTracked) {
         to_search_[share] = ++last_search_;
@@ -225,6 +227,7 @@ void TaskMachine::Edited(TaskRecord record) {
     MakePlan();
     debounced_.clear();
     moved_.clear();
+    untouched_.clear();
     first_change_.reset();
     compared_.clear();
     PlanComparison();
@@ -250,7 +253,36 @@ void TaskMachine::PauseSet(TaskRecord record) {
     }
 }
 
+// Something has changed at the path, which may be anything below it.
+void TaskMachine::Touch(const std::string& share, const std::string& path) {
+    const auto found = untouched_.find(share);
+    if (found == untouched_.end()) {
+        return;
+    }
+    std::set<std::string>& places = found->second;
+    const std::string key = KeyOf(path);
+    auto below = places.lower_bound(key);
+    while (below != places.end() && IsWithin(*below, key)) {
+        below = places.erase(below);
+    }
+    for (std::string_view above = key; !above.empty();) {
+        above = ParentOf(above);
+        places.erase(std::string(above));
+    }
+    if (places.empty()) {
+        untouched_.erase(found);
+    }
+}
+
+// Whether the copy has what is at the path, and nothing says otherwise.
+bool TaskMachine::IsInStep(const std::string& share, const std::string& path) {
+    return may_settle_ && debts_.Has(share) && !debts_.Owes(share) &&
+           to_search_.count(share) == 0 && unwatched_.count(share) == 0 &&
+           !debounced_[share].Touches(path);
+}
+
 void TaskMachine::Changed(const std::string& share, const std::string& path) {
+    Touch(share, path);
     debounced_[share].Add(path);
     copies_.Changed(share, path);
     last_change_ = clock_.Elapsed();
@@ -262,6 +294,8 @@ void TaskMachine::Moved(const std::string& share, const std::string& from, const
     std::vector<programs::ShareMove>& moves = moved_[share];
     const std::string name = from.substr(0, from.find_last_not_of('/') + 1);
     const bool goes_on = !moves.empty() && moves.back().to == name;
+    const bool is_untouched =
+        goes_on ? may_settle_ && untouched_[share].count(KeyOf(name)) != 0 : IsInStep(share, name);
     if (goes_on && moves.back().from == to) {
         moves.pop_back();
     } else if (goes_on) {
@@ -275,6 +309,9 @@ void TaskMachine::Moved(const std::string& share, const std::string& from, const
     }
     Changed(share, from);
     Changed(share, to);
+    if (is_untouched && untouched_[share].size() < kMaxMoves) {
+        untouched_[share].insert(KeyOf(to));
+    }
 }
 
 void TaskMachine::HeardAll() {
@@ -469,8 +506,10 @@ std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& r
         plan.moves[order.share] = read_moves(order.share);
         for (const StoredMove& stored : plan.moves[order.share]) {
             order.moves.push_back(stored.move);
-            order.moves.back().is_settled =
-                settled_moves_[order.share].count({stored.move.from, stored.move.to}) != 0;
+            programs::ShareMove& move = order.moves.back();
+            move.is_settled = settled_moves_[order.share].count({move.from, move.to}) != 0;
+            move.is_untouched =
+                move.is_settled && untouched_[order.share].count(KeyOf(move.to)) != 0;
         }
         order.brake = copies_.Take(order, brake);
         if (const auto consent = consents_.find(order.share); consent != consents_.end()) {
@@ -624,6 +663,7 @@ void TaskMachine::Settle(const RunPlan& plan, const programs::RunResult& result)
         if (outcomes.count(share) == 0 || result.moved.count(share) != 0) {
             for (const StoredMove& stored : moves) {
                 settled_moves_[share].erase({stored.move.from, stored.move.to});
+                untouched_[share].erase(KeyOf(stored.move.to));
                 end.moved.push_back(stored.id);
             }
         }

@@ -183,6 +183,8 @@ public:
 private:
     void MakePlan();
     void OweSearch(const std::string& share);
+    void Touch(const std::string& share, const std::string& path);
+    bool IsInStep(const std::string& share, const std::string& path);
     std::optional<int64_t> NextRunAt(Step& step);
     void TakeSchedule();
     void PutBack();
@@ -229,6 +231,9 @@ private:
     // Of the stored ones those that are settled (ShareMove::is_settled), as far as this process
     // knows: by share, from where to where.
     std::map<std::string, std::set<std::pair<std::string, std::string>>> settled_moves_;
+    // Of what was moved, that in which nothing has changed since the last push: the keys of its
+    // places, see path_key.h, by share.
+    std::map<std::string, std::set<std::string>> untouched_;
     bool may_settle_ = true;  // what is moved now: no run is under way, nor of its time to be heard
     std::optional<int64_t> first_change_;  // of these; nothing: there are none
     int64_t last_change_ = 0;
