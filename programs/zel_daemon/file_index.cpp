@@ -67,9 +67,9 @@ std::string MakeFile(const std::string& path) {
     return path;
 }
 
-std::vector<IndexEntry> EntriesOf(const std::string& first, const std::string& chunk) {
+std::vector<IndexEntry> EntriesOf(const IndexChunk& chunk) {
     std::vector<IndexEntry> entries;
-    ChunkReader reader(chunk, first);
+    ChunkReader reader(chunk.bytes, chunk.first);
     for (IndexEntry entry; reader.Next(entry);) {
         entries.push_back(entry);
     }
@@ -264,36 +264,37 @@ void FileIndex::Forget() {
 }
 
 std::vector<IndexEntry> FileIndex::After(const std::optional<std::string>& key) {
-    return Chunk(key ? "first > ? ORDER BY first LIMIT 1" : "first >= ? ORDER BY first LIMIT 1",
-                 key ? *key : std::string_view());
+    return EntriesOf(
+        Chunk(key ? "first > ? ORDER BY first LIMIT 1" : "first >= ? ORDER BY first LIMIT 1",
+              key ? *key : std::string_view()));
 }
 
 std::vector<IndexEntry> FileIndex::Around(const std::string& key) {
+    return EntriesOf(ChunkAround(key));
+}
+
+IndexChunk FileIndex::ChunkAround(const std::string& key) {
     return Chunk("first <= ? ORDER BY first DESC LIMIT 1", key);
 }
 
 // `which`: of the chunks, with one parameter, the key.
-std::vector<IndexEntry> FileIndex::Chunk(const char* which, std::string_view key) {
-    std::string first;
-    std::string bytes;
-    {
-        Query chunk(
-            database_,
-            std::string("SELECT first, entries FROM chunks JOIN contents ON id = content WHERE ") +
-                which,
-            Bytes{key});
-        if (!chunk.Next()) {
-            return {};
-        }
-        first = chunk.Text();
-        bytes = chunk.Text();
+IndexChunk FileIndex::Chunk(const char* which, std::string_view key) {
+    IndexChunk chunk;
+    Query query(
+        database_,
+        std::string("SELECT first, entries FROM chunks JOIN contents ON id = content WHERE ") +
+            which,
+        Bytes{key});
+    if (query.Next()) {
+        chunk.first = query.Text();
+        chunk.bytes = query.Text();
     }
-    return EntriesOf(first, bytes);
+    return chunk;
 }
 
 // The entries of this chunk, which is no more.
 std::vector<IndexEntry> FileIndex::Take(const std::string& first) {
-    std::vector<IndexEntry> entries = Chunk("first = ?", first);
+    std::vector<IndexEntry> entries = EntriesOf(Chunk("first = ?", first));
     Query(database_, "DELETE FROM contents WHERE id = (SELECT content FROM chunks WHERE first = ?)",
           Bytes{first})
         .Run();

@@ -39,6 +39,12 @@ private:
     ChunkWriter writer_;
 };
 
+/// Entries that are kept together, as a ChunkWriter has put them.
+struct IndexChunk {
+    std::string first;  ///< the key of the first, with which it began
+    std::string bytes;
+};
+
 /// Every operation may throw SqliteError or Failure.
 ///
 /// Threads: one thread; others may use the same file.
@@ -56,12 +62,16 @@ public:
     /// It is not in step with its copy any more.
     void Forget();
 
+    /// For many reads. Nobody changes the file while it lives.
+    ReadTransaction Reading() { return ReadTransaction(database_); }
     /// Entries that are kept together: those that come after `key`, which is the last of such
     /// entries; none: there are no more. Nothing for `key`: the first of all.
     std::vector<IndexEntry> After(const std::optional<std::string>& key);
     /// Entries that are kept together, and with the key's if that has one. What comes after the key
     /// is among them, or after the last of them; none: it is the first of all.
     std::vector<IndexEntry> Around(const std::string& key);
+    /// The same, not taken apart; no bytes: none.
+    IndexChunk ChunkAround(const std::string& key);
     /// The first key of the entries that are kept together after the key's.
     std::optional<std::string> ChunkAfter(const std::string& key);
     std::optional<EntryFacts> Find(const std::string& key);
@@ -82,7 +92,7 @@ public:
 private:
     friend class ChunkEditor;
 
-    std::vector<IndexEntry> Chunk(const char* which, std::string_view key);
+    IndexChunk Chunk(const char* which, std::string_view key);
     std::vector<IndexEntry> Take(const std::string& first);
     void Move(const std::string& from, const std::string& to);
     bool IsInFewChunks(const std::string& folder);

@@ -38,6 +38,7 @@ private:
 /// Takes them apart again.
 class ChunkReader {
 public:
+    ChunkReader() = default;
     /// `bytes` outlive it. `first`: see ChunkWriter::Begin().
     explicit ChunkReader(std::string_view bytes, std::string_view first = {}) : bytes_(bytes) {
         last_.key = first;

@@ -1,10 +1,8 @@
-// Single entries of an index, fast where their keys are near each other.
+// Single entries of an index, fast where one is asked for after those that come before it.
 #pragma once
 
-#include <algorithm>
 #include <optional>
 #include <string>
-#include <vector>
 
 #include "programs/zel_daemon/file_index.h"
 
@@ -14,35 +12,51 @@ namespace zel_daemon {
 class IndexLookup {
 public:
     explicit IndexLookup(FileIndex& index) : index_(index) {}
+    IndexLookup(const IndexLookup&) = delete;
+    IndexLookup& operator=(const IndexLookup&) = delete;
 
     /// Null: there is none. Valid until the next call.
     const EntryFacts* Find(const std::string& key) {
         if (!Covers(key)) {
-            chunk_ = index_.Around(key);
-            has_limit_ = false;
+            chunk_ = index_.ChunkAround(key);
+            knows_next_ = false;
+            Begin();
+        } else if (key < entry_.key || (!has_entry_ && key == entry_.key)) {
+            Begin();
         }
-        const auto found = std::lower_bound(
-            chunk_.begin(), chunk_.end(), key,
-            [](const IndexEntry& entry, const std::string& wanted) { return entry.key < wanted; });
-        return found != chunk_.end() && found->key == key ? &found->facts : nullptr;
+        while (has_entry_ && entry_.key < key) {
+            has_entry_ = reader_.Next(entry_);
+        }
+        return has_entry_ && entry_.key == key ? &entry_.facts : nullptr;
     }
 
 private:
     bool Covers(const std::string& key) {
-        if (chunk_.empty() || key < chunk_.front().key || key <= chunk_.back().key) {
-            return !chunk_.empty() && key >= chunk_.front().key;
+        if (chunk_.bytes.empty() || key < chunk_.first) {
+            return false;
         }
-        if (!has_limit_) {
-            limit_ = index_.ChunkAfter(chunk_.back().key);
-            has_limit_ = true;
+        if (has_entry_ && key <= entry_.key) {
+            return true;
         }
-        return !limit_ || key < *limit_;
+        if (!knows_next_) {
+            next_ = index_.ChunkAfter(chunk_.first);
+            knows_next_ = true;
+        }
+        return !next_ || key < *next_;
+    }
+
+    void Begin() {
+        reader_ = ChunkReader(chunk_.bytes, chunk_.first);
+        has_entry_ = reader_.Next(entry_);
     }
 
     FileIndex& index_;
-    std::vector<IndexEntry> chunk_;
-    bool has_limit_ = false;
-    std::optional<std::string> limit_;  // where the next chunk begins; nothing: there is none
+    IndexChunk chunk_;
+    ChunkReader reader_;
+    bool has_entry_ = false;
+    IndexEntry entry_;  // the reader's last, also at the end
+    bool knows_next_ = false;
+    std::optional<std::string> next_;  // where the next chunk begins; nothing: there is none
 };
 
 }  // namespace zel_daemon

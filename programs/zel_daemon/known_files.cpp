@@ -34,7 +34,7 @@ bool KnownFiles::IsDoubtful(const IndexEntry& file) {
     std::string before = file.key;
     for (const auto& [from, to] : moves_) {
         if (IsWithin(before, to)) {  // what the server does not move over something may stay
-            before = from + before.substr(to.size());
+            before.replace(0, to.size(), from);
             is_other = is_other || IsOther(before_.Find(before), file.facts);
         }
     }

@@ -167,6 +167,7 @@ private:
         }
         stamp_ = *stamp;
         is_kept_ = true;
+        const ReadTransaction reading = index.Reading();
         KnownFiles known(index, order_.moves);
         const base::UniqueFd share = OpenShareFolder(folder_);
         FindLittleChanged(index, share, cancelled);

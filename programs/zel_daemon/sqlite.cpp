@@ -13,6 +13,17 @@ bool IsText(const std::string& value) {
     return value.find('\0') == std::string::npos && base::IsUtf8(value);
 }
 
+void RollBack(Database& database) {
+    // SQLite has ended it itself after some errors.
+    if (database.InTransaction()) {
+        try {
+            database.Execute("ROLLBACK");
+        } catch (const SqliteError&) {
+            // The file is as it was: the next one who opens it takes back what is not committed.
+        }
+    }
+}
+
 }  // namespace
 
 Database::Database(const std::string& path) {
@@ -114,14 +125,15 @@ Transaction::Transaction(Database& database) : database_(database) {
 }
 
 Transaction::~Transaction() {
-    // SQLite has ended it itself after some errors.
-    if (database_.InTransaction()) {
-        try {
-            database_.Execute("ROLLBACK");
-        } catch (const SqliteError&) {
-            // The file is as it was: the next one who opens it takes back what is not committed.
-        }
-    }
+    RollBack(database_);
+}
+
+ReadTransaction::ReadTransaction(Database& database) : database_(database) {
+    database.Execute("BEGIN");
+}
+
+ReadTransaction::~ReadTransaction() {
+    RollBack(database_);
 }
 
 }  // namespace zel_daemon

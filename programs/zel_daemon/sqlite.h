@@ -131,4 +131,16 @@ private:
     Database& database_;
 };
 
+/// All that is read while it lives is of one moment, and costs one lock: nobody else can write.
+class ReadTransaction {
+public:
+    explicit ReadTransaction(Database& database);
+    ~ReadTransaction();
+    ReadTransaction(const ReadTransaction&) = delete;
+    ReadTransaction& operator=(const ReadTransaction&) = delete;
+
+private:
+    Database& database_;
+};
+
 }  // namespace zel_daemon
