@@ -281,6 +281,11 @@ TEST_F(WatcherTest, APathTooLongToBeSentIsUnreadable) {
     EXPECT_EQ(TakeLosses(), Unwatched(ENAMETOOLONG));
     EXPECT_FALSE(watcher_.Stats("s").complete);
     EXPECT_EQ(watcher_.Stats("s").folders, 1u + (PATH_MAX - 1) / 201);
+    fs::rename(Path("/" + name + "/" + name), Path("/m"));
+    Work();
+    EXPECT_EQ(watcher_.Stats("s").folders, 3u + (PATH_MAX - 3) / 201) << "the way is shorter";
+    EXPECT_EQ(TakeLosses(), Unwatched(ENAMETOOLONG));
+    fs::rename(Path("/m"), Outside("/m"));
     fs::rename(Path("/" + name), Outside("/" + name));
     Work();
     EXPECT_TRUE(watcher_.Stats("s").complete);

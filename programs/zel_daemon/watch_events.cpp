@@ -150,8 +150,10 @@ void WatchEvents::FolderEntry(FolderId parent, const Inotify::Event& event) {
     if (event.mask & IN_MOVED_TO) {
         if (const auto moved = TakeMove(event.cookie, tree_.table[parent].owner)) {
             // Two folders that change places are told as if each came in the place of the other.
-            const bool is_certain =
-                id == kNoFolder && !tree_.is_ahead && tree_.table[*moved].watch >= 0;
+            // What could not be watched where it was may be at its new place.
+            const WatchedTree::Share* const share = tree_.FindShare(tree_.table[parent].owner);
+            const bool is_certain = id == kNoFolder && !tree_.is_ahead && share->missing == 0 &&
+                                    tree_.table[*moved].watch >= 0;
             if (id != kNoFolder) {
                 tree_.Drop(id);
             }

@@ -83,7 +83,7 @@ bool Watcher::Work(std::chrono::milliseconds budget) {
     const auto end = std::chrono::steady_clock::now() + budget;
     bool more_events = true;
     bool in_time = true;
-    while (in_time && (more_events || impl_->scan.HasSteps())) {
+    while (in_time && (more_events || impl_->scan.HasSteps() || impl_->tree.is_ahead)) {
         more_events = impl_->events.HandleSome();
         const int steps = more_events ? kStepsPerBusyTurn : kStepsPerIdleTurn;
         for (int i = 0; in_time && i < steps && impl_->scan.HasSteps(); ++i) {
