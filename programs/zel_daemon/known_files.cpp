@@ -3,7 +3,8 @@
 #include <sys/stat.h>
 
 #include <algorithm>
-#include <iterator>
+#include <optional>
+#include <string_view>
 
 #include "programs/zel_daemon/path_key.h"
 
@@ -20,10 +21,35 @@ bool IsOther(const EntryFacts* was, const EntryFacts& is) {
 
 KnownFiles::KnownFiles(FileIndex& index, const std::vector<programs::ShareMove>& moves)
     : here_(index), before_(index) {
-    std::transform(moves.rbegin(), moves.rend(), std::back_inserter(moves_),
-                   [](const programs::ShareMove& move) {
-                       return std::make_pair(KeyOf(move.from), KeyOf(move.to));
-                   });
+    for (const programs::ShareMove& move : moves) {
+        by_place_[KeyOf(move.to)].push_back(froms_.size());
+        froms_.push_back(KeyOf(move.from));
+    }
+}
+
+// Takes the last of the first `count` moves back that has brought this key where it is; `count` are
+// those before it. False: there is none.
+bool KnownFiles::TakeBack(std::string& key, size_t& count) const {
+    std::optional<size_t> last;
+    size_t place = 0;
+    for (std::string_view above = key; !above.empty() && !by_place_.empty();
+         above = ParentOf(above)) {
+        const auto found = by_place_.find(std::string(above));
+        if (found == by_place_.end()) {
+            continue;
+        }
+        const std::vector<size_t>& moves = found->second;
+        const auto end = std::lower_bound(moves.begin(), moves.end(), count);
+        if (end != moves.begin() && (!last || *last < *(end - 1))) {
+            last = *(end - 1);
+            place = above.size();
+        }
+    }
+    if (last) {
+        key.replace(0, place, froms_[*last]);
+        count = *last;
+    }
+    return last.has_value();
 }
 
 bool KnownFiles::IsDoubtful(const IndexEntry& file) {
@@ -32,11 +58,9 @@ bool KnownFiles::IsDoubtful(const IndexEntry& file) {
     }
     bool is_other = IsOther(here_.Find(file.key), file.facts);
     std::string before = file.key;
-    for (const auto& [from, to] : moves_) {
-        if (IsWithin(before, to)) {  // what the server does not move over something may stay
-            before.replace(0, to.size(), from);
-            is_other = is_other || IsOther(before_.Find(before), file.facts);
-        }
+    // What the server does not move over something may stay.
+    for (size_t moves = froms_.size(); !is_other && TakeBack(before, moves);) {
+        is_other = IsOther(before_.Find(before), file.facts);
     }
     return is_other;
 }

@@ -1,8 +1,9 @@
 // Whether a file stands in the place of another one that rsync takes it for.
 #pragma once
 
+#include <cstddef>
 #include <string>
-#include <utility>
+#include <unordered_map>
 #include <vector>
 
 #include "programs/common/run_result.h"
@@ -21,9 +22,14 @@ public:
     bool IsDoubtful(const IndexEntry& file);
 
 private:
+    bool TakeBack(std::string& key, size_t& count) const;
+
     IndexLookup here_;
     IndexLookup before_;
-    std::vector<std::pair<std::string, std::string>> moves_;  // keys, the last one first
+    // Of all moves, in their order, the key of where it began; and by the key of where it went,
+    // which these are.
+    std::vector<std::string> froms_;
+    std::unordered_map<std::string, std::vector<size_t>> by_place_;
 };
 
 }  // namespace zel_daemon
