@@ -308,15 +308,6 @@ std::optional<std::string> FileIndex::ChunkAfter(const std::string& key) {
     return next.Next() ? std::optional(next.Text()) : std::nullopt;
 }
 
-std::optional<EntryFacts> FileIndex::Find(const std::string& key) {
-    for (const IndexEntry& entry : Around(key)) {
-        if (entry.key == key) {
-            return entry.facts;
-        }
-    }
-    return std::nullopt;
-}
-
 std::vector<std::string> FileIndex::NamesOf(uint64_t inode) {
     std::vector<std::string> keys;
     Query query(database_, "SELECT key FROM links WHERE inode = ?", inode);

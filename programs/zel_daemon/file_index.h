@@ -63,7 +63,7 @@ public:
     void Forget();
 
     /// For many reads. Nobody changes the file while it lives.
-    ReadTransaction Reading() { return ReadTransaction(database_); }
+    Transaction Reading() { return Transaction(database_, Transaction::Kind::kRead); }
     /// Entries that are kept together: those that come after `key`, which is the last of such
     /// entries; none: there are no more. Nothing for `key`: the first of all.
     std::vector<IndexEntry> After(const std::optional<std::string>& key);
@@ -74,7 +74,6 @@ public:
     IndexChunk ChunkAround(const std::string& key);
     /// The first key of the entries that are kept together after the key's.
     std::optional<std::string> ChunkAfter(const std::string& key);
-    std::optional<EntryFacts> Find(const std::string& key);
     /// The keys of a file that has several names.
     std::vector<std::string> NamesOf(uint64_t inode);
 

@@ -4,6 +4,7 @@
 #include <string_view>
 
 #include "programs/zel_daemon/index_chunk.h"
+#include "programs/zel_daemon/index_lookup.h"
 #include "programs/zel_daemon/index_walk.h"
 #include "programs/zel_daemon/path_key.h"
 #include "programs/zel_daemon/share_folder.h"
@@ -51,10 +52,11 @@ MovedFolder LookAtMoved(FileIndex& index, const std::string& folder,
                         const std::function<bool()>& cancelled) {
     const std::string from = KeyOf(move.from);
     const std::string to = KeyOf(move.to);
-    const auto was = index.Find(from);
+    IndexLookup lookup(index);
+    const EntryFacts* const was = lookup.Find(from);
     TreeList list(folder, move.to, cancelled);
     TreeList::Entry entry;
-    if (!was || !was->IsFolder() || list.Next(entry) != TreeList::Found::kEntry ||
+    if (was == nullptr || !was->IsFolder() || list.Next(entry) != TreeList::Found::kEntry ||
         !entry.facts.IsFolder() || entry.facts.inode != was->inode) {
         return {};
     }
@@ -100,9 +102,10 @@ MovedFolder LookAtMoved(FileIndex& index, const std::string& folder,
 std::optional<std::string> FileOfUntouched(FileIndex& index, const base::UniqueFd& share,
                                            const programs::ShareMove& move) {
     const std::string from = KeyOf(move.from);
-    const auto was = index.Find(from);
+    IndexLookup lookup(index);
+    const EntryFacts* const was = lookup.Find(from);
     const auto is = FactsAt(share, move.to);
-    if (!was || !was->IsFolder() || !is || is->inode != was->inode) {
+    if (was == nullptr || !was->IsFolder() || !is || is->inode != was->inode) {
         return std::nullopt;
     }
     IndexWalk known(index, from);

@@ -59,12 +59,14 @@ void FindOtherNames(const std::string& file, const std::string& share, const std
                     const std::vector<LinkedFile>& files, RunIndexes::Linked& found) {
     try {
         FileIndex index(file);
+        IndexLookup lookup(index);
         for (const LinkedFile& sent : files) {
             for (const std::string& key : index.NamesOf(sent.facts.inode)) {
                 const std::string path = PathOf(key);
-                const auto known = index.Find(key);
+                const EntryFacts* const known = lookup.Find(key);
                 struct stat other = {};
-                if (found.size() < kMostLinked && known && !IsUnchanged(*known, sent.facts) &&
+                if (found.size() < kMostLinked && known != nullptr &&
+                    !IsUnchanged(*known, sent.facts) &&
                     lstat((folder + path).c_str(), &other) == 0 &&
                     other.st_dev == sent.status.st_dev && other.st_ino == sent.status.st_ino) {
                     found.emplace_back(share, path);
@@ -167,7 +169,7 @@ private:
         }
         stamp_ = *stamp;
         is_kept_ = true;
-        const ReadTransaction reading = index.Reading();
+        const Transaction reading = index.Reading();
         KnownFiles known(index, order_.moves);
         const base::UniqueFd share = OpenShareFolder(folder_);
         FindLittleChanged(index, share, cancelled);

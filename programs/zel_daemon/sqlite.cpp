@@ -13,17 +13,6 @@ bool IsText(const std::string& value) {
     return value.find('\0') == std::string::npos && base::IsUtf8(value);
 }
 
-void RollBack(Database& database) {
-    // SQLite has ended it itself after some errors.
-    if (database.InTransaction()) {
-        try {
-            database.Execute("ROLLBACK");
-        } catch (const SqliteError&) {
-            // The file is as it was: the next one who opens it takes back what is not committed.
-        }
-    }
-}
-
 }  // namespace
 
 Database::Database(const std::string& path) {
@@ -119,21 +108,20 @@ std::string Query::Text() {
                : std::string(static_cast<const char*>(bytes), static_cast<size_t>(size));
 }
 
-Transaction::Transaction(Database& database) : database_(database) {
+Transaction::Transaction(Database& database, Kind kind) : database_(database) {
     // As a writer from the start: a reader that becomes one can be turned away half-way.
-    database.Execute("BEGIN IMMEDIATE");
+    database.Execute(kind == Kind::kWrite ? "BEGIN IMMEDIATE" : "BEGIN");
 }
 
 Transaction::~Transaction() {
-    RollBack(database_);
-}
-
-ReadTransaction::ReadTransaction(Database& database) : database_(database) {
-    database.Execute("BEGIN");
-}
-
-ReadTransaction::~ReadTransaction() {
-    RollBack(database_);
+    // SQLite has ended it itself after some errors.
+    if (database_.InTransaction()) {
+        try {
+            database_.Execute("ROLLBACK");
+        } catch (const SqliteError&) {
+            // The file is as it was: the next one who opens it takes back what is not committed.
+        }
+    }
 }
 
 }  // namespace zel_daemon

@@ -120,24 +120,16 @@ private:
 /// Everything until Commit() happens as a whole or, without it, not at all.
 class Transaction {
 public:
-    explicit Transaction(Database& database);
+    enum class Kind {
+        kWrite,
+        kRead  ///< all that is read is of one moment and costs one lock; nobody else can write
+    };
+    explicit Transaction(Database& database, Kind kind = Kind::kWrite);
     ~Transaction();
     Transaction(const Transaction&) = delete;
     Transaction& operator=(const Transaction&) = delete;
 
     void Commit() { database_.Execute("COMMIT"); }
-
-private:
-    Database& database_;
-};
-
-/// All that is read while it lives is of one moment, and costs one lock: nobody else can write.
-class ReadTransaction {
-public:
-    explicit ReadTransaction(Database& database);
-    ~ReadTransaction();
-    ReadTransaction(const ReadTransaction&) = delete;
-    ReadTransaction& operator=(const ReadTransaction&) = delete;
 
 private:
     Database& database_;

@@ -4,11 +4,9 @@
 #include <unordered_set>
 #include <utility>
 
-#include "programs/common/mounts_below.h"
 #include "programs/common/share_path.h"
 #include "programs/common/task_fields.h"
 #include "programs/common/text.h"
-#include "programs/zel_daemon/path_key.h"
 
 namespace zel_daemon {
 
@@ -27,22 +25,12 @@ constexpr int64_t kDayMs = int64_t{24} * 3600 * 1000;
 constexpr int64_t kLongestWaitMs = kDayMs;
 // What failed and changes again is tried so often at most.
 constexpr int64_t kChangedAgainMs = 60000;
-// So many moves of a share are kept until they are stored; what else was moved is sent.
-constexpr size_t kMaxMoves = 1024;
-
 // Whether the path or a folder above it is among `paths`.
 bool IsCovered(std::string path, const std::unordered_set<std::string>& paths) {
     while (path.size() > 1 && paths.count(path) == 0) {
         path = programs::FolderAbove(path);
     }
     return paths.count(path) != 0;
-}
-
-// Whether what is at the path has come there, or a folder above it, by one of these.
-bool WasMovedTo(const std::vector<programs::ShareMove>& moves, const std::string& path) {
-    return std::any_of(moves.begin(), moves.end(), [&path](const programs::ShareMove& move) {
-        return programs::IsAtOrBelow(path, move.to);
-    });
 }
 
 }  // namespace
@@ -193,7 +181,7 @@ void TaskMachine::Restored(bool has_changes, std::optional<RunRecord> last, Ques
 
 // Something may have changed without a word. What is compared whole anyhow need not be searched.
 void TaskMachine::OweSearch(const std::string& share) {
-    untouched_.erase(share);
+    moves_.MayHaveChanged(share);
     if (record_.IsRealtime() && debts_.Has(share) &&
         debts_.StateOf(share) == ShareState::kTracked) {
         to_search_[share] = ++last_search_;
@@ -226,8 +214,7 @@ void TaskMachine::Edited(TaskRecord record) {
     record_ = std::move(record);
     MakePlan();
     debounced_.clear();
-    moved_.clear();
-    untouched_.clear();
+    moves_.DropWaiting();
     first_change_.reset();
     compared_.clear();
     PlanComparison();
@@ -253,36 +240,18 @@ void TaskMachine::PauseSet(TaskRecord record) {
     }
 }
 
-// Something has changed at the path, which may be anything below it.
-void TaskMachine::Touch(const std::string& share, const std::string& path) {
-    const auto found = untouched_.find(share);
-    if (found == untouched_.end()) {
-        return;
-    }
-    std::set<std::string>& places = found->second;
-    const std::string key = KeyOf(path);
-    auto below = places.lower_bound(key);
-    while (below != places.end() && IsWithin(*below, key)) {
-        below = places.erase(below);
-    }
-    for (std::string_view above = key; !above.empty();) {
-        above = ParentOf(above);
-        places.erase(std::string(above));
-    }
-    if (places.empty()) {
-        untouched_.erase(found);
-    }
-}
-
 // Whether the copy has what is at the path, and nothing says otherwise.
 bool TaskMachine::IsInStep(const std::string& share, const std::string& path) {
-    return may_settle_ && debts_.Has(share) && !debts_.Owes(share) &&
-           to_search_.count(share) == 0 && unwatched_.count(share) == 0 &&
-           !debounced_[share].Touches(path);
+    return debts_.Has(share) && !debts_.Owes(share) && to_search_.count(share) == 0 &&
+           unwatched_.count(share) == 0 && !debounced_[share].Touches(path);
 }
 
 void TaskMachine::Changed(const std::string& share, const std::string& path) {
-    Touch(share, path);
+    moves_.Changed(share, path);
+    NoteChange(share, path);
+}
+
+void TaskMachine::NoteChange(const std::string& share, const std::string& path) {
     debounced_[share].Add(path);
     copies_.Changed(share, path);
     last_change_ = clock_.Elapsed();
@@ -291,31 +260,16 @@ void TaskMachine::Changed(const std::string& share, const std::string& path) {
 }
 
 void TaskMachine::Moved(const std::string& share, const std::string& from, const std::string& to) {
-    std::vector<programs::ShareMove>& moves = moved_[share];
     const std::string name = from.substr(0, from.find_last_not_of('/') + 1);
-    const bool goes_on = !moves.empty() && moves.back().to == name;
-    const bool is_untouched =
-        goes_on ? may_settle_ && untouched_[share].count(KeyOf(name)) != 0 : IsInStep(share, name);
-    if (goes_on && moves.back().from == to) {
-        moves.pop_back();
-    } else if (goes_on) {
-        moves.back().to = to;
-        moves.back().is_settled = moves.back().is_settled && may_settle_;
-    } else if (!debounced_[share].Holds(name) || WasMovedTo(moves, name)) {
-        moves.push_back({name, to, {}, may_settle_});
-    }  // else it is new, and not at the server yet
-    if (moves.size() > kMaxMoves) {
-        moves.erase(moves.begin());
-    }
-    Changed(share, from);
-    Changed(share, to);
-    if (is_untouched && untouched_[share].size() < kMaxMoves) {
-        untouched_[share].insert(KeyOf(to));
-    }
+    moves_.Moved(share, name, to, debounced_[share].Holds(name), IsInStep(share, name));
+    NoteChange(share, from);
+    NoteChange(share, to);
 }
 
 void TaskMachine::HeardAll() {
-    may_settle_ = !running_;
+    if (!running_) {
+        moves_.HeardAll();
+    }
 }
 
 void TaskMachine::Lost(const std::string& share, bool lasting) {
@@ -430,25 +384,15 @@ std::map<std::string, std::vector<std::string>> TaskMachine::DebouncedChanges() 
 }
 
 const std::vector<programs::ShareMove>& TaskMachine::DebouncedMoves(const std::string& share) {
-    return moved_[share];
+    return moves_.Waiting(share);
 }
 
 void TaskMachine::ChangesStored() {
     for (const auto& [share, changes] : debounced_) {
         debts_.OweChanges(share);
     }
-    for (const auto& [share, moves] : moved_) {
-        auto& settled = settled_moves_[share];
-        for (const programs::ShareMove& move : moves) {
-            const std::pair ends(move.from, move.to);
-            settled.erase(ends);
-            if (move.is_settled && settled.size() < kMaxMoves) {
-                settled.insert(ends);
-            }
-        }
-    }
+    moves_.Stored();
     debounced_.clear();
-    moved_.clear();
     first_change_.reset();
     store_problem_.clear();
 }
@@ -506,10 +450,7 @@ std::optional<RunPlan> TaskMachine::Begin(const Step& step, const ReadChanges& r
         plan.moves[order.share] = read_moves(order.share);
         for (const StoredMove& stored : plan.moves[order.share]) {
             order.moves.push_back(stored.move);
-            programs::ShareMove& move = order.moves.back();
-            move.is_settled = settled_moves_[order.share].count({move.from, move.to}) != 0;
-            move.is_untouched =
-                move.is_settled && untouched_[order.share].count(KeyOf(move.to)) != 0;
+            moves_.Mark(order.share, order.moves.back());
         }
         order.brake = copies_.Take(order, brake);
         if (const auto consent = consents_.find(order.share); consent != consents_.end()) {
@@ -544,7 +485,7 @@ void TaskMachine::Started(RunPlan plan) {
         poll_at_ = NextPoll();
     }
     running_ = std::move(plan);
-    may_settle_ = false;
+    moves_.RunBegins();
 }
 
 const RunRecord& TaskMachine::Ended(const programs::RunResult& result,
@@ -662,8 +603,7 @@ void TaskMachine::Settle(const RunPlan& plan, const programs::RunResult& result)
     for (const auto& [share, moves] : plan.moves) {
         if (outcomes.count(share) == 0 || result.moved.count(share) != 0) {
             for (const StoredMove& stored : moves) {
-                settled_moves_[share].erase({stored.move.from, stored.move.to});
-                untouched_[share].erase(KeyOf(stored.move.to));
+                moves_.Forget(share, stored.move);
                 end.moved.push_back(stored.id);
             }
         }

@@ -12,6 +12,7 @@
 #include "programs/zel_daemon/change_set.h"
 #include "programs/zel_daemon/copy_ledger.h"
 #include "programs/zel_daemon/daemon_config.h"
+#include "programs/zel_daemon/move_ledger.h"
 #include "programs/zel_daemon/recovery_watch.h"
 #include "programs/zel_daemon/run_plan.h"
 #include "programs/zel_daemon/share_debts.h"
@@ -183,7 +184,7 @@ public:
 private:
     void MakePlan();
     void OweSearch(const std::string& share);
-    void Touch(const std::string& share, const std::string& path);
+    void NoteChange(const std::string& share, const std::string& path);
     bool IsInStep(const std::string& share, const std::string& path);
     std::optional<int64_t> NextRunAt(Step& step);
     void TakeSchedule();
@@ -226,15 +227,8 @@ private:
     std::string store_problem_;
 
     // The watch.
-    std::map<std::string, ChangeSet> debounced_;                     // by share
-    std::map<std::string, std::vector<programs::ShareMove>> moved_;  // by share, meanwhile
-    // Of the stored ones those that are settled (ShareMove::is_settled), as far as this process
-    // knows: by share, from where to where.
-    std::map<std::string, std::set<std::pair<std::string, std::string>>> settled_moves_;
-    // Of what was moved, that in which nothing has changed since the last push: the keys of its
-    // places, see path_key.h, by share.
-    std::map<std::string, std::set<std::string>> untouched_;
-    bool may_settle_ = true;  // what is moved now: no run is under way, nor of its time to be heard
+    std::map<std::string, ChangeSet> debounced_;  // by share
+    MoveLedger moves_;
     std::optional<int64_t> first_change_;  // of these; nothing: there are none
     int64_t last_change_ = 0;
     std::set<std::string> unwatched_;  // shares of which something is not watched
